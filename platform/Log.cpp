@@ -1,0 +1,149 @@
+#include "platform/Log.h"
+
+#include <algorithm>
+#include <condition_variable>
+#include <cstdlib>
+#include <mutex>
+
+#include <spdlog/sinks/base_sink.h>
+#include <spdlog/sinks/dist_sink.h>
+#include <spdlog/sinks/stdout_sinks.h>
+#include <spdlog/sinks/systemd_sink.h>
+
+namespace zerith::log {
+
+namespace {
+
+Level toLevel(spdlog::level::level_enum l) {
+  switch (l) {
+    case spdlog::level::err:
+    case spdlog::level::critical: return Level::Error;
+    case spdlog::level::debug:
+    case spdlog::level::trace: return Level::Debug;
+    default: return Level::Default;
+  }
+}
+
+// The process's sinks. Owned here because spdlog's registry is process-wide
+// by nature; every Logger shares it.
+struct Sinks {
+  std::shared_ptr<spdlog::sinks::dist_sink_mt> dist = std::make_shared<spdlog::sinks::dist_sink_mt>();
+  std::shared_ptr<spdlog::sinks::sink> output;
+  std::mutex mutex;
+  bool debug = false;
+  int captures = 0;
+
+  Sinks() {
+    output = std::make_shared<spdlog::sinks::stderr_sink_mt>();
+    output->set_level(spdlog::level::info);
+    dist->add_sink(output);
+  }
+
+  void applyLevel() {
+    const auto level = (debug || captures > 0) ? spdlog::level::debug : spdlog::level::info;
+    spdlog::apply_all([level](const std::shared_ptr<spdlog::logger>& l) { l->set_level(level); });
+  }
+
+  static Sinks& get() {
+    static Sinks* sinks = new Sinks();  // never destroyed: loggers may log during exit
+    return *sinks;
+  }
+};
+
+}  // namespace
+
+struct LogCapture::Sink : spdlog::sinks::base_sink<std::mutex> {
+  mutable std::mutex linesMutex;
+  mutable std::condition_variable arrived;
+  std::vector<CapturedLine> captured;
+
+ protected:
+  void sink_it_(const spdlog::details::log_msg& msg) override {
+    CapturedLine line{toLevel(msg.level), std::string(msg.logger_name.begin(), msg.logger_name.end()),
+                      std::string(msg.payload.begin(), msg.payload.end())};
+    {
+      std::lock_guard lock(linesMutex);
+      captured.push_back(std::move(line));
+    }
+    arrived.notify_all();
+  }
+  void flush_() override {}
+};
+
+void configure(const Options& options) {
+  auto& s = Sinks::get();
+  std::lock_guard lock(s.mutex);
+  const bool journal = options.journal.value_or(std::getenv("JOURNAL_STREAM") != nullptr);
+  s.dist->remove_sink(s.output);
+  if (journal) {
+    s.output = std::make_shared<spdlog::sinks::systemd_sink_mt>("zerithd");
+  } else {
+    s.output = std::make_shared<spdlog::sinks::stderr_sink_mt>();
+    s.output->set_pattern("%Y-%m-%d %H:%M:%S.%f %n[%l] %v");
+  }
+  s.output->set_level(options.debug ? spdlog::level::debug : spdlog::level::info);
+  s.dist->add_sink(s.output);
+  s.debug = options.debug;
+  s.applyLevel();
+}
+
+Logger::Logger(const std::string& subsystem) {
+  auto& s = Sinks::get();
+  std::lock_guard lock(s.mutex);
+  logger_ = spdlog::get(subsystem);
+  if (!logger_) {
+    logger_ = std::make_shared<spdlog::logger>(subsystem, s.dist);
+    logger_->set_level((s.debug || s.captures > 0) ? spdlog::level::debug : spdlog::level::info);
+    logger_->flush_on(spdlog::level::info);
+    spdlog::register_logger(logger_);
+  }
+}
+
+LogCapture::LogCapture() : sink_(std::make_shared<Sink>()) {
+  auto& s = Sinks::get();
+  std::lock_guard lock(s.mutex);
+  sink_->set_level(spdlog::level::debug);
+  s.dist->add_sink(sink_);
+  ++s.captures;
+  s.applyLevel();
+}
+
+LogCapture::~LogCapture() {
+  auto& s = Sinks::get();
+  std::lock_guard lock(s.mutex);
+  s.dist->remove_sink(sink_);
+  --s.captures;
+  s.applyLevel();
+}
+
+std::vector<CapturedLine> LogCapture::lines() const {
+  std::lock_guard lock(sink_->linesMutex);
+  return sink_->captured;
+}
+
+std::size_t LogCapture::count(std::string_view needle) const {
+  std::lock_guard lock(sink_->linesMutex);
+  return static_cast<std::size_t>(std::count_if(sink_->captured.begin(), sink_->captured.end(),
+                                                [&](const CapturedLine& l) { return l.text.find(needle) != std::string::npos; }));
+}
+
+bool LogCapture::has(Level level, std::string_view text) const {
+  std::lock_guard lock(sink_->linesMutex);
+  return std::any_of(sink_->captured.begin(), sink_->captured.end(),
+                     [&](const CapturedLine& l) { return l.level == level && l.text == text; });
+}
+
+bool LogCapture::waitFor(std::string_view needle, std::chrono::milliseconds timeout) const {
+  std::unique_lock lock(sink_->linesMutex);
+  return sink_->arrived.wait_for(lock, timeout, [&] {
+    return std::any_of(sink_->captured.begin(), sink_->captured.end(),
+                       [&](const CapturedLine& l) { return l.text.find(needle) != std::string::npos; });
+  });
+}
+
+void LogCapture::clear() {
+  std::lock_guard lock(sink_->linesMutex);
+  sink_->captured.clear();
+}
+
+}  // namespace zerith::log

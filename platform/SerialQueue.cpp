@@ -1,0 +1,184 @@
+#include "platform/SerialQueue.h"
+
+#include <algorithm>
+#include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+#include <deque>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include <asio/executor_work_guard.hpp>
+#include <asio/post.hpp>
+#include <asio/steady_timer.hpp>
+
+#include "platform/Executors.h"
+
+namespace zerith {
+
+namespace {
+
+struct ThreadPool {
+  asio::io_context context;
+  asio::executor_work_guard<asio::io_context::executor_type> work{context.get_executor()};
+  std::vector<std::thread> threads;
+
+  explicit ThreadPool(unsigned count) {
+    for (unsigned i = 0; i < count; ++i) {
+      threads.emplace_back([this] { context.run(); });
+      threads.back().detach();
+    }
+  }
+};
+
+thread_local std::vector<const SerialQueue::State*> tCurrentQueues;
+
+struct CurrentScope {
+  explicit CurrentScope(const SerialQueue::State* s) { tCurrentQueues.push_back(s); }
+  ~CurrentScope() { tCurrentQueues.pop_back(); }
+};
+
+}  // namespace
+
+asio::io_context& ioContext(Pool pool) {
+  // Leaked on purpose: detached pool threads may run until the process ends.
+  static ThreadPool* general = new ThreadPool(std::max(8u, 2 * std::thread::hardware_concurrency()));
+  static ThreadPool* transport = new ThreadPool(2);
+  return pool == Pool::Transport ? transport->context : general->context;
+}
+
+struct SerialQueue::State : std::enable_shared_from_this<SerialQueue::State> {
+  struct Ticket {
+    bool granted = false;
+  };
+  struct Item {
+    std::function<void()> block;
+    Ticket* ticket = nullptr;  // a waiting sync caller
+  };
+
+  std::string label;
+  asio::io_context* context = nullptr;
+  std::mutex mutex;
+  std::condition_variable granted;
+  std::deque<Item> items;
+  bool active = false;  // a drainer or a sync caller owns the queue
+
+  void schedule() {
+    asio::post(*context, [self = shared_from_this()] { self->drain(); });
+  }
+
+  void drain() {
+    for (int n = 0;; ++n) {
+      Item item;
+      {
+        std::unique_lock lock(mutex);
+        if (items.empty()) {
+          active = false;
+          return;
+        }
+        item = std::move(items.front());
+        items.pop_front();
+        if (item.ticket) {
+          // Ownership passes to the sync caller, which runs on its own thread.
+          item.ticket->granted = true;
+          granted.notify_all();
+          return;
+        }
+      }
+      {
+        CurrentScope scope(this);
+        item.block();
+      }
+      if (n >= 32) {
+        schedule();  // give other queues a turn; still active
+        return;
+      }
+    }
+  }
+
+  void release() {
+    std::unique_lock lock(mutex);
+    if (items.empty()) {
+      active = false;
+    } else {
+      schedule();
+    }
+  }
+};
+
+struct SerialQueue::Timer::Impl {
+  explicit Impl(asio::io_context& c) : timer(c) {}
+  asio::steady_timer timer;
+};
+
+SerialQueue::SerialQueue(std::string label, Pool pool) : state_(std::make_shared<State>()) {
+  state_->label = std::move(label);
+  state_->context = &ioContext(pool);
+}
+
+const std::string& SerialQueue::label() const { return state_->label; }
+
+void SerialQueue::async(std::function<void()> block) const {
+  std::unique_lock lock(state_->mutex);
+  state_->items.push_back({std::move(block), nullptr});
+  if (!state_->active) {
+    state_->active = true;
+    state_->schedule();
+  }
+}
+
+SerialQueue::Turn::Turn(const SerialQueue& queue) : state_(queue.state_.get()) {
+  if (queue.isCurrent()) {
+    std::fprintf(stderr, "zerith: sync onto queue '%s' from its own block would deadlock\n", state_->label.c_str());
+    std::abort();
+  }
+  std::unique_lock lock(state_->mutex);
+  if (!state_->active && state_->items.empty()) {
+    state_->active = true;
+  } else {
+    State::Ticket ticket;
+    state_->items.push_back({nullptr, &ticket});
+    if (!state_->active) {
+      state_->active = true;
+      state_->schedule();
+    }
+    state_->granted.wait(lock, [&] { return ticket.granted; });
+  }
+  tCurrentQueues.push_back(state_);
+}
+
+SerialQueue::Turn::~Turn() {
+  tCurrentQueues.pop_back();
+  state_->release();
+}
+
+void SerialQueue::Timer::cancel() {
+  if (impl_) {
+    asio::post(impl_->timer.get_executor(), [impl = impl_] { impl->timer.cancel(); });
+  }
+}
+
+SerialQueue::Timer SerialQueue::after(std::chrono::steady_clock::duration delay, std::function<void()> block) const {
+  auto impl = std::make_shared<Timer::Impl>(*state_->context);
+  impl->timer.expires_after(delay);
+  impl->timer.async_wait([impl, queue = *this, block = std::move(block)](const std::error_code& ec) mutable {
+    if (!ec) {
+      queue.async(std::move(block));
+    }
+  });
+  return Timer(impl);
+}
+
+bool SerialQueue::isCurrent() const {
+  return std::find(tCurrentQueues.begin(), tCurrentQueues.end(), state_.get()) != tCurrentQueues.end();
+}
+
+void SerialQueue::assertCurrent() const {
+  if (!isCurrent()) {
+    std::fprintf(stderr, "zerith: expected to run on queue '%s'\n", state_->label.c_str());
+    std::abort();
+  }
+}
+
+}  // namespace zerith

@@ -1,0 +1,153 @@
+#pragma once
+
+// The one value type for every property-list shaped thing in zerithd: session
+// info, user info, payloads, storebags, profiles, records and wire messages.
+//
+// A Value is immutable and cheap to copy (copies share one node, as a "copy"
+// of an immutable collection does). Mutation goes through the explicit
+// builders `Dictionary` and `Array`, which are ordinary value-semantic
+// containers; wrapping one in a Value freezes it. "nil" is the empty Value.
+//
+// Dictionaries keep insertion order, so enumeration order is deterministic.
+
+#include <cstdint>
+#include <initializer_list>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <variant>
+#include <vector>
+
+namespace zerith {
+
+class Value;
+
+using Data = std::vector<std::uint8_t>;
+
+// A point in time, seconds since 1970-01-01 UTC with a fraction.
+struct Date {
+  double secondsSince1970 = 0;
+  static Date now();
+  bool operator==(const Date&) const = default;
+  auto operator<=>(const Date&) const = default;
+};
+
+using Array = std::vector<Value>;
+
+// Insertion-ordered string-keyed dictionary; the mutable builder for
+// dictionary Values. Lookups scan linearly up to a small size and use a hash
+// index beyond it.
+class Dictionary {
+ public:
+  using Entry = std::pair<std::string, Value>;
+
+  Dictionary() = default;
+  Dictionary(std::initializer_list<Entry> entries);
+
+  // nullptr when absent.
+  const Value* find(std::string_view key) const;
+  // nil when absent.
+  Value get(std::string_view key) const;
+  bool contains(std::string_view key) const { return find(key) != nullptr; }
+
+  // Replaces an existing entry in place (keeping its position) or appends.
+  void set(std::string key, Value value);
+  bool erase(std::string_view key);
+  void clear();
+
+  std::size_t size() const { return entries_.size(); }
+  bool empty() const { return entries_.empty(); }
+  auto begin() const { return entries_.begin(); }
+  auto end() const { return entries_.end(); }
+  const std::vector<Entry>& entries() const { return entries_; }
+
+  bool operator==(const Dictionary& other) const;
+
+ private:
+  std::ptrdiff_t indexOf(std::string_view key) const;
+  void rebuildIndex();
+
+  std::vector<Entry> entries_;
+  // Built once the dictionary outgrows a linear scan.
+  std::shared_ptr<std::vector<std::pair<std::size_t, std::size_t>>> index_;  // (hash, position), sorted
+};
+
+class Value {
+ public:
+  enum class Type { Nil, Bool, Int, UInt, Real, String, Data, Date, Array, Dict };
+
+  Value() = default;
+  Value(std::nullptr_t) {}
+  Value(bool v);
+  Value(int v) : Value(static_cast<long long>(v)) {}
+  Value(long v) : Value(static_cast<long long>(v)) {}
+  Value(long long v);
+  Value(unsigned v) : Value(static_cast<unsigned long long>(v)) {}
+  Value(unsigned long v);
+  Value(unsigned long long v);
+  Value(double v);
+  Value(const char* v);
+  Value(std::string v);
+  Value(std::string_view v) : Value(std::string(v)) {}
+  Value(zerith::Data v);
+  Value(zerith::Date v);
+  Value(zerith::Array v);
+  Value(zerith::Dictionary v);
+
+  Type type() const;
+  bool isNil() const { return !node_; }
+  bool isBool() const { return type() == Type::Bool; }
+  bool isNumber() const;  // Int, UInt or Real (a boolean is not a number)
+  bool isString() const { return type() == Type::String; }
+  bool isData() const { return type() == Type::Data; }
+  bool isDate() const { return type() == Type::Date; }
+  bool isArray() const { return type() == Type::Array; }
+  bool isDict() const { return type() == Type::Dict; }
+
+  // Typed access; nullptr when the value is of another type.
+  const std::string* string() const;
+  const zerith::Data* data() const;
+  const zerith::Array* array() const;
+  const zerith::Dictionary* dict() const;
+  std::optional<zerith::Date> date() const;
+
+  // Number conversions in the manner of a boxed number: booleans count as
+  // 0/1, reals truncate, strings parse a leading integer, anything else is 0.
+  std::int64_t intValue() const;
+  std::uint64_t unsignedValue() const;
+  double doubleValue() const;
+  bool boolValue() const;
+
+  // Convenience: the entry of a dictionary (nil when not a dictionary or
+  // absent), the element of an array (nil when out of range or not an array).
+  Value operator[](std::string_view key) const;
+  Value at(std::size_t index) const;
+  // Number of entries or elements; 0 for scalars.
+  std::size_t count() const;
+
+  // Copies of the containers, as builders for a modified copy.
+  zerith::Dictionary dictCopy() const;
+  zerith::Array arrayCopy() const;
+
+  bool operator==(const Value& other) const;
+
+  // A readable one-line rendering for log messages.
+  std::string description() const;
+
+  // Identity of the shared node (two copies of one Value share it).
+  const void* identity() const { return node_.get(); }
+
+  // Bytes the allocator really handed out for this value's own blocks (its
+  // node plus a string's, data's or container's buffer), as reported by
+  // malloc_usable_size; children of containers are not included. 0 for nil.
+  std::size_t allocationSize() const;
+
+ private:
+  using Storage = std::variant<bool, std::int64_t, std::uint64_t, double, std::string, zerith::Data,
+                               zerith::Date, zerith::Array, zerith::Dictionary>;
+  std::shared_ptr<const Storage> node_;
+};
+
+}  // namespace zerith
