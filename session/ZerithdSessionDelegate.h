@@ -1,0 +1,49 @@
+#pragma once
+
+// How a reporting session reaches the agent: storebags, the hierarchy table,
+// shared data, health figures and the keep-alive release. The agent
+// implements it; sessions and connectivity helpers hold it weakly or by
+// reference, never owning the agent.
+//
+// The agent is also a recursive lock (agentLock) for its tables; callers that
+// must hold it across several calls take it themselves.
+
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "platform/Value.h"
+
+namespace zerith {
+
+class ZerithdSession;
+
+class ZerithdSessionDelegate {
+ public:
+  virtual ~ZerithdSessionDelegate() = default;
+
+  virtual std::recursive_mutex& agentLock() = 0;
+
+  // Keep-alive: called by a connectivity helper once its HTTP session has
+  // become invalid.
+  virtual void releaseVeskTransaction() = 0;
+
+  // Storebag cache.
+  virtual Value storebagForSession(ZerithdSession& session) = 0;
+  virtual Value storebagVersionForSession(ZerithdSession& session) = 0;
+
+  // Hierarchy.
+  virtual void updateCorrelatedSessions(ZerithdSession& session) = 0;
+  virtual Value parentSessionIDStringForSession(ZerithdSession& session) = 0;
+  virtual std::shared_ptr<ZerithdSession> parentSessionForChild(ZerithdSession& session) = 0;
+  virtual std::shared_ptr<ZerithdSession> getAncestorWithAggregatorForSession(ZerithdSession& session) = 0;
+  virtual void updateDownstreamSessions(ZerithdSession& session) = 0;
+
+  // Shared data and health.
+  virtual void updateSharedDataForSession(ZerithdSession& session, const Value& sharedData) = 0;
+  virtual void removeObjectFromSharedDataForSession(ZerithdSession& session, const std::string& key) = 0;
+  virtual Value sharedDataForSession(ZerithdSession& session) = 0;
+  virtual void addAgentHealthInfoForSession(ZerithdSession& session, Dictionary& payload) = 0;
+};
+
+}  // namespace zerith

@@ -1,0 +1,55 @@
+#pragma once
+
+// What users of the HTTP transport see: a request, the response, and the two
+// operations of a connectivity helper. The completion runs exactly once per
+// accepted request, on the helper's state queue, with the bytes received (an
+// empty buffer, never absent, when the answer had no body), the response
+// (absent when none arrived) and the error (absent on success). HTTP status
+// codes are not interpreted by the transport.
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/Error.h"
+#include "platform/Value.h"
+
+namespace zerith {
+
+using HTTPHeaders = std::vector<std::pair<std::string, std::string>>;
+
+struct URLRequest {
+  std::string httpMethod = "GET";
+  std::string url;
+  HTTPHeaders headers;
+  Data body;
+  double timeoutSeconds = 0;     // 0: no limit of the request's own
+  bool ignoreLocalCache = false;  // never answer from a local cache
+  bool allowsCellularAccess = true;
+
+  void setValue(std::string value, std::string field);  // replaces a header (case-insensitive name)
+  std::optional<std::string> valueForHTTPHeaderField(std::string_view field) const;
+};
+
+struct HTTPURLResponse {
+  long statusCode = 0;
+  std::string url;
+  HTTPHeaders headers;
+  std::optional<std::string> valueForHTTPHeaderField(std::string_view field) const;  // case-insensitive
+};
+
+using URLCompletion =
+    std::function<void(const Data& data, const std::optional<HTTPURLResponse>& response, const std::optional<Error>& error)>;
+
+class ReportingSessionConnectivityInterface {
+ public:
+  virtual ~ReportingSessionConnectivityInterface() = default;
+  virtual void postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) = 0;
+  virtual void getURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) = 0;
+};
+
+}  // namespace zerith
