@@ -1,0 +1,141 @@
+#include "config/StorebagSigner.h"
+
+#include <openssl/bio.h>
+#include <openssl/err.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/rsa.h>
+#include <openssl/x509.h>
+
+#include <memory>
+
+#include "platform/Crypto.h"
+#include "platform/PropertyList.h"
+
+namespace zerith {
+
+namespace {
+
+struct PkeyFree {
+  void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
+};
+struct BioFree {
+  void operator()(BIO* bio) const { BIO_free(bio); }
+};
+struct MdCtxFree {
+  void operator()(EVP_MD_CTX* ctx) const { EVP_MD_CTX_free(ctx); }
+};
+using PkeyPtr = std::unique_ptr<EVP_PKEY, PkeyFree>;
+using BioPtr = std::unique_ptr<BIO, BioFree>;
+
+// The reason OpenSSL gives for its last failure (clears its queue).
+std::string failure(const char* what) {
+  std::string out = what;
+  if (const unsigned long code = ERR_get_error(); code != 0) {
+    char buf[256];
+    ERR_error_string_n(code, buf, sizeof buf);
+    out += ": ";
+    out += buf;
+  }
+  ERR_clear_error();
+  return out;
+}
+
+bool fail(std::string* error, const char* what) {
+  const std::string why = failure(what);
+  if (error) {
+    *error = why;
+  }
+  return false;
+}
+
+PkeyPtr readPrivateKey(const std::string& pem, std::string* error) {
+  BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+  PkeyPtr key(bio ? PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, nullptr) : nullptr);
+  if (!key) {
+    fail(error, "not a PEM private key");
+    return nullptr;
+  }
+  if (EVP_PKEY_is_a(key.get(), "RSA") != 1) {
+    fail(error, "the private key is not an RSA key");
+    return nullptr;
+  }
+  return key;
+}
+
+std::optional<Data> publicDER(EVP_PKEY* key, std::string* error) {
+  const int length = i2d_PUBKEY(key, nullptr);
+  if (length <= 0) {
+    fail(error, "cannot encode the public key");
+    return std::nullopt;
+  }
+  Data der(static_cast<std::size_t>(length));
+  unsigned char* p = der.data();
+  i2d_PUBKEY(key, &p);
+  return der;
+}
+
+}  // namespace
+
+std::optional<StorebagKeyPair> generateStorebagKeyPair(int bits, std::string* error) {
+  PkeyPtr key(EVP_RSA_gen(static_cast<unsigned>(bits)));
+  if (!key) {
+    fail(error, "RSA key generation failed");
+    return std::nullopt;
+  }
+  BioPtr bio(BIO_new(BIO_s_mem()));
+  if (!bio || PEM_write_bio_PrivateKey(bio.get(), key.get(), nullptr, nullptr, 0, nullptr, nullptr) != 1) {
+    fail(error, "cannot encode the private key");
+    return std::nullopt;
+  }
+  char* pem = nullptr;
+  const long pemLength = BIO_get_mem_data(bio.get(), &pem);
+  auto der = publicDER(key.get(), error);
+  if (!der) {
+    return std::nullopt;
+  }
+  return StorebagKeyPair{std::string(pem, static_cast<std::size_t>(pemLength)), std::move(*der)};
+}
+
+std::optional<Data> storebagPublicKeyFromPrivate(const std::string& privateKeyPEM, std::string* error) {
+  PkeyPtr key = readPrivateKey(privateKeyPEM, error);
+  return key ? publicDER(key.get(), error) : std::nullopt;
+}
+
+std::optional<Data> signStorebagBytes(const std::string& privateKeyPEM, std::span<const std::uint8_t> bag,
+                                      std::string* error) {
+  PkeyPtr key = readPrivateKey(privateKeyPEM, error);
+  if (!key) {
+    return std::nullopt;
+  }
+  std::unique_ptr<EVP_MD_CTX, MdCtxFree> ctx(EVP_MD_CTX_new());
+  EVP_PKEY_CTX* pctx = nullptr;  // owned by ctx
+  std::size_t length = 0;
+  if (!ctx || EVP_DigestSignInit(ctx.get(), &pctx, EVP_sha1(), nullptr, key.get()) != 1 ||
+      EVP_PKEY_CTX_set_rsa_padding(pctx, RSA_PKCS1_PADDING) != 1 ||
+      EVP_DigestSign(ctx.get(), nullptr, &length, bag.data(), bag.size()) != 1) {
+    fail(error, "signing failed");
+    return std::nullopt;
+  }
+  Data signature(length);
+  if (EVP_DigestSign(ctx.get(), signature.data(), &length, bag.data(), bag.size()) != 1) {
+    fail(error, "signing failed");
+    return std::nullopt;
+  }
+  signature.resize(length);
+  return signature;
+}
+
+Value makeStorebagContainer(const Data& signature, const Data& bag) {
+  return Value(Dictionary{{"signature", crypto::base64Encode(signature)}, {"bag", crypto::base64Encode(bag)}});
+}
+
+std::optional<Data> signStorebagContainer(const std::string& privateKeyPEM, const Data& bag, std::string* error) {
+  auto signature = signStorebagBytes(privateKeyPEM, bag, error);
+  if (!signature) {
+    return std::nullopt;
+  }
+  return plist::encodeBinary(makeStorebagContainer(*signature, bag));
+}
+
+}  // namespace zerith

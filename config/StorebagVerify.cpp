@@ -1,0 +1,161 @@
+#include "config/StorebagVerify.h"
+
+#include <openssl/err.h>
+#include <openssl/evp.h>
+#include <openssl/x509.h>
+
+#include <memory>
+
+#include <fmt/format.h>
+
+#include "config/StorebagDiskCache.h"
+#include "platform/Crypto.h"
+#include "platform/FileUtil.h"
+#include "platform/Log.h"
+#include "zerith/ZerithBundle.h"
+
+namespace zerith {
+
+namespace {
+
+const log::Logger& logger() {
+  static const log::Logger l("config");
+  return l;
+}
+
+struct PkeyFree {
+  void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
+};
+struct MdCtxFree {
+  void operator()(EVP_MD_CTX* ctx) const { EVP_MD_CTX_free(ctx); }
+};
+using PkeyPtr = std::unique_ptr<EVP_PKEY, PkeyFree>;
+
+// A DER key file is a few hundred bytes; anything far larger is not one.
+constexpr std::size_t kMaxPublicKeyBytes = 64u << 10;
+
+// An RSA public key from DER: SubjectPublicKeyInfo (what `openssl rsa
+// -pubout` writes) or a bare PKCS#1 RSAPublicKey. The whole input must be
+// the key.
+PkeyPtr rsaPublicKeyFromDER(const Data& der) {
+  if (der.empty() || der.size() > kMaxPublicKeyBytes) {
+    return nullptr;
+  }
+  const long length = static_cast<long>(der.size());
+  const unsigned char* p = der.data();
+  PkeyPtr key(d2i_PUBKEY(nullptr, &p, length));
+  if (!key || p != der.data() + der.size()) {
+    p = der.data();
+    key.reset(d2i_PublicKey(EVP_PKEY_RSA, nullptr, &p, length));
+    if (key && p != der.data() + der.size()) {
+      key.reset();
+    }
+  }
+  ERR_clear_error();  // failed attempts leave entries on this thread's queue
+  if (key && EVP_PKEY_is_a(key.get(), "RSA") != 1) {
+    key.reset();
+  }
+  return key;
+}
+
+// RSA PKCS#1 v1.5 over the SHA-1 digest of `message`.
+bool verifySha1Rsa(EVP_PKEY* key, const Data& signature, const Data& message) {
+  std::unique_ptr<EVP_MD_CTX, MdCtxFree> ctx(EVP_MD_CTX_new());
+  EVP_PKEY_CTX* pctx = nullptr;  // owned by ctx
+  bool ok = ctx && EVP_DigestVerifyInit(ctx.get(), &pctx, EVP_sha1(), nullptr, key) == 1 &&
+            EVP_PKEY_CTX_set_rsa_padding(pctx, RSA_PKCS1_PADDING) == 1 &&
+            EVP_DigestVerify(ctx.get(), signature.data(), signature.size(), message.data(), message.size()) == 1;
+  ERR_clear_error();
+  return ok;
+}
+
+}  // namespace
+
+plist::Limits storebagContainerLimits() {
+  return plist::Limits{kMaxStorebagContainerBytes, 8, 1024};
+}
+
+plist::Limits storebagBagLimits() {
+  // The bag is base64 inside the container: at most three quarters of it.
+  return plist::Limits{kMaxStorebagContainerBytes / 4 * 3, 32, 1u << 18};
+}
+
+StorebagVerification verifyStorebagContainer(std::span<const std::uint8_t> container,
+                                             const std::optional<Data>& publicKeyDER) {
+  StorebagVerification result;
+  const auto parsed = plist::decode(container, storebagContainerLimits(), &result.parseError);
+  if (!parsed) {
+    result.status = StorebagVerifyStatus::NotAPropertyList;
+    return result;
+  }
+  const auto* signatureText = (*parsed)["signature"].string();
+  if (!signatureText) {
+    result.status = StorebagVerifyStatus::SignatureMissing;
+    return result;
+  }
+  PkeyPtr key = publicKeyDER ? rsaPublicKeyFromDER(*publicKeyDER) : nullptr;
+  if (!key) {
+    result.status = StorebagVerifyStatus::BadPublicKey;
+    return result;
+  }
+  result.keyIdentity = key.get();
+  const auto signature = crypto::base64Decode(*signatureText);
+  if (!signature) {
+    result.status = StorebagVerifyStatus::BadSignatureText;
+    return result;
+  }
+  const auto* bagText = (*parsed)["bag"].string();
+  auto bag = bagText ? crypto::base64Decode(*bagText) : std::nullopt;
+  if (!bag) {
+    result.status = StorebagVerifyStatus::BadBagText;
+    return result;
+  }
+  if (!verifySha1Rsa(key.get(), *signature, *bag)) {
+    result.status = StorebagVerifyStatus::SignatureMismatch;
+    return result;
+  }
+  result.status = StorebagVerifyStatus::Verified;
+  result.bagBytes = std::move(*bag);
+  return result;
+}
+
+Value decodeStorebagBag(const Data& bagBytes) {
+  auto bag = plist::decode(plist::bytesOf(bagBytes), storebagBagLimits());
+  if (!bag || !bag->isDict()) {
+    return Value();
+  }
+  return *bag;
+}
+
+Value parseAndVerifyStorebag(const std::string& name, const Data& data, bool save) {
+  const auto keyPath = frameworkPublicKeyPath();
+  const auto verification = verifyStorebagContainer(plist::bytesOf(data), file::readAll(keyPath, kMaxPublicKeyBytes));
+  switch (verification.status) {
+    case StorebagVerifyStatus::NotAPropertyList:
+      logger().error("fetchStorebagWithName: propertyListWithData error {}", verification.parseError);
+      logger().error("fetchStorebagWithName: Signature is missing");
+      return Value();
+    case StorebagVerifyStatus::SignatureMissing:
+      logger().error("fetchStorebagWithName: Signature is missing");
+      return Value();
+    case StorebagVerifyStatus::BadPublicKey:
+      logger().error("fetchStorebagWithName: Could not create an RSA public key from '{}'", keyPath.string());
+      return Value();
+    case StorebagVerifyStatus::BadSignatureText:
+      logger().error("fetchStorebagWithName: Signature can not be decoded");
+      return Value();
+    case StorebagVerifyStatus::BadBagText:
+      logger().error("fetchStorebagWithName: Storebag can not be decoded");
+      return Value();
+    case StorebagVerifyStatus::SignatureMismatch:
+      logger().error("fetchStorebagWithName: Signature can not be verified, {}", fmt::ptr(verification.keyIdentity));
+      return Value();
+    case StorebagVerifyStatus::Verified: break;
+  }
+  if (save && saveStorebagToDisk(name, data)) {
+    logger().info("fetchStorebagWithName: storebag '{}' has been saved to disk cache", name);
+  }
+  return decodeStorebagBag(verification.bagBytes);
+}
+
+}  // namespace zerith

@@ -1,0 +1,150 @@
+#include "daemon/StorebagCache.h"
+
+#include <cmath>
+#include <ctime>
+#include <utility>
+
+#include <fmt/format.h>
+
+#include "config/ClientTypes.h"
+#include "config/Conversions.h"
+#include "config/StorebagDiskCache.h"
+#include "config/StorebagFetch.h"
+#include "platform/Log.h"
+
+namespace zerith {
+
+namespace {
+
+const log::Logger& logger() {
+  static const log::Logger l("daemon");
+  return l;
+}
+
+constexpr const char* kStorebagData = "StorebagData";
+constexpr const char* kStorebagVersion = "StorebagVersion";
+constexpr const char* kStorebagFetchTime = "StorebagFetchTime";
+constexpr const char* kStorebagFetchState = "StorebagFetchState";
+constexpr const char* kStorebagMaxAge = "StorebagMaxAge";
+constexpr const char* kFetchSuccessful = "Fetch Successful";
+constexpr const char* kFetchFailure = "Fetch Failure";
+
+// A failed storebag is not fetched again sooner than this.
+constexpr int kRetryIntervalSeconds = 900;
+
+// A date as the system log shows dates: "2024-05-01 12:00:00 +0000".
+std::string describeDate(const std::optional<Date>& date) {
+  if (!date) {
+    return "(null)";
+  }
+  const auto seconds = static_cast<std::time_t>(std::floor(date->secondsSince1970));
+  std::tm tm{};
+  gmtime_r(&seconds, &tm);
+  return fmt::format("{:04}-{:02}-{:02} {:02}:{:02}:{:02} +0000", tm.tm_year + 1900, tm.tm_mon + 1, tm.tm_mday,
+                     tm.tm_hour, tm.tm_min, tm.tm_sec);
+}
+
+std::optional<std::string> nameForClientType(std::int32_t clientType) {
+  return storebagNameForClientType(static_cast<ZerithClientType>(clientType));
+}
+
+}  // namespace
+
+StorebagCache::StorebagCache()
+    : StorebagCache([] { return Date::now(); },
+                    [](std::int32_t clientType, std::int32_t& maxAge, Value& version, bool& unchanged) {
+                      return fetchStorebagForEnvironmentAndClientType(clientType, maxAge, version, unchanged);
+                    },
+                    [](const std::string& name) { return storebagCacheModificationDate(name); }) {}
+
+StorebagCache::StorebagCache(Clock clock, Fetch fetch, DiskDate diskDate)
+    : clock_(std::move(clock)), fetch_(std::move(fetch)), diskDate_(std::move(diskDate)) {}
+
+Value StorebagCache::storebagForClientType(std::int32_t clientType, std::uint32_t sessionID) {
+  logger().debug("storebagForSession: Retrieving storebag for session {} with client type {}", sessionID, clientType);
+  const auto name = nameForClientType(clientType);
+  if (name) {
+    if (const Value* entry = cachedStorebags_.find(*name)) {
+      const auto fetchTime = (*entry)[kStorebagFetchTime].date();
+      const Date now = clock_();
+      // An entry always has a fetch time once created; treat one without as
+      // infinitely old.
+      const double age = fetchTime ? std::fabs(now.secondsSince1970 - fetchTime->secondsSince1970) : INFINITY;
+      const auto* state = (*entry)[kStorebagFetchState].string();
+      const bool successful = state && *state == kFetchSuccessful;
+      const std::int64_t maxAge = (*entry)[kStorebagMaxAge].intValue();
+      const auto diskDate = diskDate_(*name);
+
+      if (diskDate && fetchTime && *diskDate > *fetchTime) {
+        logger().info(
+            "storebagForSession: Override maxAge as disk cache for storebag '{}' was updated: modification time "
+            "'{}' is greater than last fetch time '{}",
+            *name, describeDate(diskDate), describeDate(fetchTime));
+      } else if (age < static_cast<double>(maxAge) && successful) {
+        logger().debug("storebagForSession: Cached storebag found for client type {}", clientType);
+        return (*entry)[kStorebagData];
+      } else if (age < kRetryIntervalSeconds && !successful) {
+        logger().info("storebagForSession: Not fetching storebag for client type {} - must wait {} seconds between "
+                      "attempts",
+                      clientType, kRetryIntervalSeconds);
+        return (*entry)[kStorebagData];
+      }
+    }
+  }
+  fetchAndCacheStorebag(clientType);
+  if (name) {
+    if (const Value* entry = cachedStorebags_.find(*name)) {
+      return (*entry)[kStorebagData];
+    }
+  }
+  return Value();
+}
+
+Value StorebagCache::storebagVersionForClientType(std::int32_t clientType) const {
+  const auto name = nameForClientType(clientType);
+  if (!name) {
+    return Value();
+  }
+  const Value* entry = cachedStorebags_.find(*name);
+  return entry ? (*entry)[kStorebagVersion] : Value();
+}
+
+void StorebagCache::fetchAndCacheStorebag(std::int32_t clientType) {
+  logger().debug("fetchAndCacheStorebag: Fetching storebag for client type {}", clientType);
+  const auto name = nameForClientType(clientType);
+  if (!name) {
+    logger().error("fetchAndCacheStorebag: clientType {} is invalid", clientType);
+    return;
+  }
+  const Value* existing = cachedStorebags_.find(*name);
+  Dictionary entry = existing ? existing->dictCopy() : Dictionary();
+
+  std::int32_t maxAge = 0;
+  Value version;
+  bool unchanged = false;
+  const Value storebag = fetch_(clientType, maxAge, version, unchanged);
+  logger().debug("fetchAndCacheStorebag: Storebag max age: {} seconds", maxAge);
+
+  if (!storebag.isNil()) {
+    entry.set(kStorebagData, storebag);
+    if (version.isNil()) {
+      entry.erase(kStorebagVersion);
+    } else {
+      entry.set(kStorebagVersion, version);
+    }
+  } else if (!unchanged) {
+    logger().error("fetchAndCacheStorebag: Unable to fetch storebag for client type {}", clientType);
+  }
+  entry.set(kStorebagFetchTime, clock_());
+  entry.set(kStorebagFetchState, (!storebag.isNil() || unchanged) ? kFetchSuccessful : kFetchFailure);
+  entry.set(kStorebagMaxAge, maxAge);
+  cachedStorebags_.set(*name, Value(std::move(entry)));
+}
+
+std::size_t StorebagCache::count() const { return cachedStorebags_.size(); }
+
+std::size_t StorebagCache::estimatedSize() const {
+  return estimatedPlistMemorySize(Value(cachedStorebags_));
+}
+
+}  // namespace zerith
