@@ -1,0 +1,274 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <climits>
+#include <cstdlib>
+#include <cstring>
+#include <optional>
+#include <string>
+
+#include "config/DeviceInfo.h"
+#include "platform/Defaults.h"
+#include "platform/Log.h"
+#include "platform/PropertyList.h"
+#include "tests/support/TempRoot.h"
+
+namespace zerith {
+namespace {
+
+using log::Level;
+
+constexpr char kMachineID[] = "0123456789abcdef0123456789abcdef\n";
+
+class DeviceInfoTest : public ::testing::Test {
+ protected:
+  void writeDeviceFile(Dictionary facts) {
+    root_.write("/etc/zerithd/device.plist", plist::encodeXml(Value(std::move(facts))));
+  }
+  std::optional<std::string> answer(std::string_view key) {
+    const Value v = deviceInformationValue(key);
+    return v.string() ? std::optional<std::string>(*v.string()) : std::nullopt;
+  }
+
+  test::TempRoot root_;
+  log::LogCapture capture_;
+};
+
+TEST_F(DeviceInfoTest, BareRootHasNoAnswersButTheHostName) {
+  EXPECT_TRUE(deviceProductVersion().isNil());
+  EXPECT_TRUE(deviceBuildVersion().isNil());
+  EXPECT_TRUE(deviceProductType().isNil());
+  EXPECT_TRUE(deviceHardwareModel().isNil());
+  EXPECT_TRUE(deviceSerialNumber().isNil());
+  EXPECT_TRUE(deviceInformationValue(kDeviceKeyUniqueDeviceID).isNil());
+  EXPECT_TRUE(deviceInformationValue(kDeviceKeyReleaseType).isNil());
+  char host[HOST_NAME_MAX + 1] = {};
+  ASSERT_EQ(::gethostname(host, sizeof(host) - 1), 0);
+  EXPECT_EQ(answer(kDeviceKeyDeviceName), std::string(host));
+  // A missing device file is the normal case, not an error.
+  EXPECT_EQ(capture_.count("Device facts"), 0u);
+}
+
+TEST_F(DeviceInfoTest, LinuxSourcesAnswerWithTrimmedValues) {
+  root_.write("/etc/os-release",
+              "NAME=\"Debian GNU/Linux\"\n# comment\nVERSION_ID=\"12\"\nBUILD_ID='20240601.1'\n");
+  root_.write("/sys/class/dmi/id/product_name", "Tarvix\n");
+  root_.write("/sys/class/dmi/id/product_serial", "  SN-42 \n");
+  root_.write("/sys/class/dmi/id/board_vendor", "Velmar\n");
+  root_.write("/sys/class/dmi/id/board_name", "B-7\n");
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+  EXPECT_EQ(answer(kDeviceKeyBuildVersion), "20240601.1");
+  EXPECT_EQ(answer(kDeviceKeyProductType), "Tarvix");
+  EXPECT_EQ(answer(kDeviceKeySerialNumber), "SN-42");
+  EXPECT_EQ(answer(kDeviceKeyHardwareModel), "Velmar B-7");
+}
+
+TEST_F(DeviceInfoTest, DeviceTreeAnswersWhereThereIsNoDmi) {
+  root_.write("/proc/device-tree/model", std::string("Velmar Board Rev 2\0", 19));
+  root_.write("/proc/device-tree/compatible", std::string("velmar,b2\0brcm,bcm2711\0", 23));
+  root_.write("/proc/device-tree/serial-number", std::string("00000000abcd\0", 13));
+  root_.write("/usr/lib/os-release", "VERSION_ID=3.19\nIMAGE_VERSION=7\n");
+  EXPECT_EQ(answer(kDeviceKeyProductType), "Velmar Board Rev 2");
+  EXPECT_EQ(answer(kDeviceKeyHardwareModel), "velmar,b2");
+  EXPECT_EQ(answer(kDeviceKeySerialNumber), "00000000abcd");
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "3.19");
+  EXPECT_EQ(answer(kDeviceKeyBuildVersion), "7");
+}
+
+TEST_F(DeviceInfoTest, OperatorFileWinsOverLinuxSourcesAndIsReReadWhenChanged) {
+  root_.write("/etc/os-release", "VERSION_ID=12\n");
+  root_.write("/sys/class/dmi/id/product_name", "Generic\n");
+  writeDeviceFile({{"ProductVersion", "17.2"}, {"DeviceName", "kitchen"}, {"ReleaseType", "Internal"}});
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "17.2");
+  EXPECT_EQ(answer(kDeviceKeyDeviceName), "kitchen");
+  EXPECT_EQ(answer(kDeviceKeyReleaseType), "Internal");
+  EXPECT_EQ(answer(kDeviceKeyProductType), "Generic");  // not in the file: Linux answers
+
+  writeDeviceFile({{"ProductType", "Tarvix"}});
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+  EXPECT_EQ(answer(kDeviceKeyProductType), "Tarvix");
+  EXPECT_EQ(answer(kDeviceKeyReleaseType), std::nullopt);
+}
+
+TEST_F(DeviceInfoTest, NonStringEntryOfTheOperatorFileFallsBackToLinux) {
+  root_.write("/etc/os-release", "VERSION_ID=12\n");
+  writeDeviceFile({{"ProductVersion", Value(17)}});
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+}
+
+TEST_F(DeviceInfoTest, BrokenDeviceFileIsLoggedOnceAndIgnored) {
+  root_.write("/etc/os-release", "VERSION_ID=12\n");
+  root_.write("/etc/zerithd/device.plist", plist::encodeXml(Value(Array{Value("ProductVersion")})));
+  const std::string path = (root_ / "/etc/zerithd/device.plist").string();
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+  EXPECT_TRUE(capture_.has(Level::Error,
+                           "Device facts: ignoring device file " + path + ": the root is not a dictionary"));
+  EXPECT_EQ(capture_.count("Device facts: ignoring device file"), 1u);
+
+  // Garbage of another length is a new version of the file: logged again.
+  root_.write("/etc/zerithd/device.plist", "<plist><dict><key>ProductVersion</key>");
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+  EXPECT_EQ(capture_.count("Device facts: ignoring device file"), 2u);
+}
+
+TEST_F(DeviceInfoTest, UnreadableDeviceFileIsLoggedAndIgnored) {
+  // A folder where the file should be cannot be read, even by the superuser.
+  root_.write("/etc/os-release", "VERSION_ID=12\n");
+  std::filesystem::create_directories(root_ / "/etc/zerithd/device.plist");
+  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+  EXPECT_TRUE(capture_.has(Level::Error, "Device facts: cannot read device file " +
+                                             (root_ / "/etc/zerithd/device.plist").string() +
+                                             "; using the system's own facts"));
+}
+
+TEST_F(DeviceInfoTest, UniqueDeviceIDIsKeyedAndNeverTheRawMachineID) {
+  root_.write("/etc/machine-id", kMachineID);
+  const auto id = answer(kDeviceKeyUniqueDeviceID);
+  ASSERT_TRUE(id);
+  EXPECT_EQ(id->size(), 40u);
+  EXPECT_EQ(id->find_first_not_of("0123456789abcdef"), std::string::npos) << *id;
+  EXPECT_EQ(id->find("0123456789abcdef"), std::string::npos);
+  // Stable, independent of the id's letter case, different for another machine.
+  EXPECT_EQ(device::uniqueDeviceIDFromMachineID("0123456789ABCDEF0123456789ABCDEF"), id);
+  EXPECT_NE(device::uniqueDeviceIDFromMachineID("fedcba9876543210fedcba9876543210"), id);
+}
+
+TEST_F(DeviceInfoTest, UninitialisedMachineIDGivesNoIdentifier) {
+  root_.write("/etc/machine-id", "uninitialized\n");
+  EXPECT_TRUE(deviceInformationValue(kDeviceKeyUniqueDeviceID).isNil());
+  EXPECT_TRUE(capture_.contains("holds no machine id"));
+  EXPECT_EQ(device::uniqueDeviceIDFromMachineID(""), std::nullopt);
+  EXPECT_EQ(device::uniqueDeviceIDFromMachineID("0123456789abcdef0123456789abcdeg"), std::nullopt);
+  // The D-Bus copy stands in when /etc has none.
+  std::filesystem::remove(root_ / "/etc/machine-id");
+  root_.write("/var/lib/dbus/machine-id", kMachineID);
+  EXPECT_EQ(deviceInformationValue(kDeviceKeyUniqueDeviceID),
+            Value(*device::uniqueDeviceIDFromMachineID(kMachineID)));
+}
+
+TEST_F(DeviceInfoTest, CopyUniqueDeviceIDFillsOnlyABufferThatHoldsIt) {
+  root_.write("/etc/machine-id", kMachineID);
+  const std::string id = *device::uniqueDeviceIDFromMachineID(kMachineID);
+
+  char exact[41];
+  std::memset(exact, 'x', sizeof(exact));
+  copyUniqueDeviceID(exact, sizeof(exact));
+  EXPECT_EQ(std::string(exact), id);
+
+  char wide[48];
+  std::memset(wide, 'x', sizeof(wide));
+  copyUniqueDeviceID(wide, sizeof(wide));
+  EXPECT_EQ(std::string(wide), id);
+  EXPECT_EQ(wide[41], 'x');
+  EXPECT_EQ(wide[47], '\0');
+
+  char small[40];
+  std::memset(small, 'x', sizeof(small));
+  copyUniqueDeviceID(small, sizeof(small));
+  EXPECT_EQ(std::string(small, sizeof(small)), std::string(40, 'x'));
+  copyUniqueDeviceID(small, 0);
+  copyUniqueDeviceID(nullptr, 41);
+}
+
+TEST_F(DeviceInfoTest, CopyUniqueDeviceIDWithoutAnAnswerLeavesTheBuffer) {
+  char buffer[41];
+  std::memset(buffer, 'x', sizeof(buffer));
+  copyUniqueDeviceID(buffer, sizeof(buffer));
+  EXPECT_EQ(std::string(buffer, sizeof(buffer)), std::string(41, 'x'));
+}
+
+TEST(DeviceParsersTest, OsReleaseQuotingEscapesAndJunkLines) {
+  const auto fields = device::parseOsRelease(
+      "NAME=\"Debian \\\"GNU\\\"/Linux\"\n"
+      "  PRETTY='single $quoted'\n"
+      "EMPTY=\n"
+      "=novalue\n"
+      "no equals sign\n"
+      "#VERSION_ID=1\n"
+      "VERSION_ID=12   \n"
+      "UNTERMINATED=\"abc");
+  EXPECT_EQ(fields.at("NAME"), "Debian \"GNU\"/Linux");
+  EXPECT_EQ(fields.at("PRETTY"), "single $quoted");
+  EXPECT_EQ(fields.at("EMPTY"), "");
+  EXPECT_EQ(fields.at("VERSION_ID"), "12");
+  EXPECT_EQ(fields.at("UNTERMINATED"), "abc");
+  EXPECT_EQ(fields.size(), 5u);
+}
+
+TEST(DeviceParsersTest, CountryOfLocaleNames) {
+  EXPECT_EQ(device::countryFromLocale("en_GB.UTF-8"), "GB");
+  EXPECT_EQ(device::countryFromLocale("de_DE@euro"), "DE");
+  EXPECT_EQ(device::countryFromLocale("pt_br"), "BR");
+  EXPECT_EQ(device::countryFromLocale("es_419.UTF-8"), "419");
+  EXPECT_EQ(device::countryFromLocale("C"), std::nullopt);
+  EXPECT_EQ(device::countryFromLocale("C.UTF-8"), std::nullopt);
+  EXPECT_EQ(device::countryFromLocale("POSIX"), std::nullopt);
+  EXPECT_EQ(device::countryFromLocale("en_.UTF-8"), std::nullopt);
+  EXPECT_EQ(device::countryFromLocale("en_G/B"), std::nullopt);
+}
+
+TEST(DeviceParsersTest, DeviceFileMustBeADictionary) {
+  std::string why;
+  EXPECT_TRUE(device::parseDeviceFile(plist::bytesOf(plist::encodeXml(Value(Dictionary{}))), &why));
+  EXPECT_FALSE(device::parseDeviceFile(plist::bytesOf(plist::encodeXml(Value("x"))), &why));
+  EXPECT_EQ(why, "the root is not a dictionary");
+  EXPECT_FALSE(device::parseDeviceFile(plist::bytesOf(std::string("bplist00")), &why));
+  EXPECT_FALSE(why.empty());
+}
+
+// Restores an environment variable at the end of a test.
+class ScopedEnv {
+ public:
+  ScopedEnv(const char* name, const char* value) : name_(name) {
+    if (const char* old = std::getenv(name)) {
+      old_ = old;
+    }
+    value ? ::setenv(name, value, 1) : ::unsetenv(name);
+  }
+  ~ScopedEnv() { old_ ? ::setenv(name_, old_->c_str(), 1) : ::unsetenv(name_); }
+
+ private:
+  const char* name_;
+  std::optional<std::string> old_;
+};
+
+TEST_F(DeviceInfoTest, LocaleCountryFollowsTheLocalePrecedence) {
+  ScopedEnv all("LC_ALL", nullptr), messages("LC_MESSAGES", nullptr), lang("LANG", nullptr);
+  EXPECT_EQ(localeCountryCode(), std::nullopt);
+  root_.write("/etc/default/locale", "LANG=\"fr_CA.UTF-8\"\n");
+  EXPECT_EQ(localeCountryCode(), "CA");
+  root_.write("/etc/locale.conf", "LANG=nl_BE.UTF-8\n");
+  EXPECT_EQ(localeCountryCode(), "BE");
+  ::setenv("LANG", "en_GB.UTF-8", 1);
+  EXPECT_EQ(localeCountryCode(), "GB");
+  ::setenv("LC_MESSAGES", "de_AT.UTF-8", 1);
+  EXPECT_EQ(localeCountryCode(), "AT");
+  ::setenv("LC_ALL", "", 1);  // set but empty: skipped
+  EXPECT_EQ(localeCountryCode(), "AT");
+  ::setenv("LC_ALL", "C", 1);
+  EXPECT_EQ(localeCountryCode(), std::nullopt);
+}
+
+TEST(TimeZoneTest, OffsetIsEastPositiveSeconds) {
+  ScopedEnv tz("TZ", "EST5");
+  EXPECT_EQ(timeZoneOffsetSeconds(), -5 * 3600);
+  ::setenv("TZ", "IST-5:30", 1);
+  EXPECT_EQ(timeZoneOffsetSeconds(), 5 * 3600 + 1800);
+  ::setenv("TZ", "UTC0", 1);
+  EXPECT_EQ(timeZoneOffsetSeconds(), 0);
+}
+
+TEST_F(DeviceInfoTest, ConsentIsAbsentUntilGranted) {
+  EXPECT_FALSE(diagnosticsSubmissionAllowed());
+  ASSERT_TRUE(Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(true)));
+  EXPECT_TRUE(diagnosticsSubmissionAllowed());
+  ASSERT_TRUE(Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(false)));
+  EXPECT_FALSE(diagnosticsSubmissionAllowed());
+  // The setting lives in its own domain, not in com.velmar.zerith.
+  ASSERT_TRUE(Defaults("com.velmar.zerith").setObject(kConsentDefaultsKey, Value(true)));
+  EXPECT_FALSE(diagnosticsSubmissionAllowed());
+}
+
+}  // namespace
+}  // namespace zerith
