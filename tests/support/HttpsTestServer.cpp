@@ -1,0 +1,280 @@
+#include "tests/support/HttpsTestServer.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <strings.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <condition_variable>
+#include <map>
+#include <mutex>
+#include <stdexcept>
+#include <thread>
+
+#include <httplib.h>
+#include <openssl/bio.h>
+#include <openssl/pem.h>
+#include <openssl/x509.h>
+
+namespace zerith::test {
+
+namespace {
+
+bool equalsIgnoringCase(std::string_view a, std::string_view b) {
+  return a.size() == b.size() && ::strncasecmp(a.data(), b.data(), a.size()) == 0;
+}
+
+struct PkeyFree {
+  void operator()(EVP_PKEY* p) const { EVP_PKEY_free(p); }
+};
+struct X509Free {
+  void operator()(X509* p) const { X509_free(p); }
+};
+struct BioFree {
+  void operator()(BIO* p) const { BIO_free(p); }
+};
+
+std::unique_ptr<BIO, BioFree> memoryBio(const std::string& pem) {
+  std::unique_ptr<BIO, BioFree> bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+  if (!bio) {
+    throw std::runtime_error("HttpsTestServer: BIO allocation failed");
+  }
+  return bio;
+}
+
+// A loopback socket bound to an ephemeral port; -1 on failure.
+int bindLoopback(int& port) {
+  const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) {
+    return -1;
+  }
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  addr.sin_port = 0;
+  socklen_t len = sizeof(addr);
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 ||
+      ::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  port = ntohs(addr.sin_port);
+  return fd;
+}
+
+}  // namespace
+
+std::optional<std::string> RecordedRequest::header(std::string_view name) const {
+  for (const auto& [k, v] : headers) {
+    if (equalsIgnoringCase(k, name)) {
+      return v;
+    }
+  }
+  return std::nullopt;
+}
+
+std::size_t RecordedRequest::headerCount(std::string_view name) const {
+  return static_cast<std::size_t>(
+      std::count_if(headers.begin(), headers.end(), [&](const auto& h) { return equalsIgnoringCase(h.first, name); }));
+}
+
+struct HttpsTestServer::Impl {
+  std::unique_ptr<X509, X509Free> certificate;
+  std::unique_ptr<EVP_PKEY, PkeyFree> key;
+  std::unique_ptr<httplib::SSLServer> server;
+  std::thread thread;
+  int port = 0;
+
+  mutable std::mutex mutex;
+  mutable std::condition_variable changed;
+  std::map<std::string, RequestHandler> handlers;
+  std::vector<RecordedRequest> recorded;
+  bool held = false;
+  bool stopping = false;
+
+  void handle(const httplib::Request& req, httplib::Response& res) {
+    RecordedRequest r;
+    r.method = req.method;
+    r.path = req.path;
+    r.target = req.target.empty() ? req.path : req.target;
+    for (const auto& [k, v] : req.headers) {
+      // cpp-httplib adds these itself; they were not on the wire.
+      if (k == "REMOTE_ADDR" || k == "REMOTE_PORT" || k == "LOCAL_ADDR" || k == "LOCAL_PORT") {
+        continue;
+      }
+      r.headers.emplace_back(k, v);
+    }
+    r.body = req.body;
+    r.remotePort = req.remote_port;
+
+    RequestHandler handler;
+    {
+      std::lock_guard lock(mutex);
+      recorded.push_back(r);
+      if (auto it = handlers.find(r.path); it != handlers.end()) {
+        handler = it->second;
+      }
+    }
+    changed.notify_all();
+
+    Reply reply = handler ? handler(r) : Reply{404, {}, {}};
+    {
+      std::unique_lock lock(mutex);
+      changed.wait(lock, [&] { return !held || stopping; });
+      if (reply.delay.count() > 0) {
+        changed.wait_for(lock, reply.delay, [&] { return stopping; });
+      }
+    }
+
+    res.status = reply.status;
+    std::string contentType;
+    for (const auto& [k, v] : reply.headers) {
+      if (equalsIgnoringCase(k, "Content-Type")) {
+        contentType = v;
+      }
+      res.set_header(k, v);
+    }
+    if (reply.chunkSize == 0) {
+      res.body = std::move(reply.body);
+      return;
+    }
+    res.headers.erase("Content-Type");
+    auto body = std::make_shared<std::string>(std::move(reply.body));
+    const std::size_t chunk = reply.chunkSize;
+    const auto pause = reply.chunkPause;
+    res.set_chunked_content_provider(contentType, [body, chunk, pause, this](std::size_t offset, httplib::DataSink& sink) {
+      if (offset >= body->size()) {
+        sink.done();
+        return true;
+      }
+      if (offset > 0 && pause.count() > 0) {
+        std::unique_lock lock(mutex);
+        if (changed.wait_for(lock, pause, [&] { return stopping; })) {
+          return false;
+        }
+      }
+      const std::size_t n = std::min(chunk, body->size() - offset);
+      return sink.write(body->data() + offset, n);
+    });
+    if (contentType.empty()) {
+      res.headers.erase("Content-Type");
+    }
+  }
+};
+
+HttpsTestServer::HttpsTestServer(const TestCA& ca) : impl_(std::make_unique<Impl>()) {
+  const IssuedCertificate& issued = ca.serverCertificate();
+  auto certBio = memoryBio(issued.certificatePem);
+  impl_->certificate.reset(PEM_read_bio_X509(certBio.get(), nullptr, nullptr, nullptr));
+  auto keyBio = memoryBio(issued.privateKeyPem);
+  impl_->key.reset(PEM_read_bio_PrivateKey(keyBio.get(), nullptr, nullptr, nullptr));
+  if (!impl_->certificate || !impl_->key) {
+    throw std::runtime_error("HttpsTestServer: unreadable certificate or key");
+  }
+  impl_->server = std::make_unique<httplib::SSLServer>(impl_->certificate.get(), impl_->key.get());
+  if (!impl_->server->is_valid()) {
+    throw std::runtime_error("HttpsTestServer: TLS context could not be set up");
+  }
+  auto& server = *impl_->server;
+  server.new_task_queue = [] { return new httplib::ThreadPool(16); };
+  server.set_keep_alive_max_count(1);
+  Impl* impl = impl_.get();
+  const auto handler = [impl](const httplib::Request& req, httplib::Response& res) { impl->handle(req, res); };
+  server.Get(".*", handler);
+  server.Post(".*", handler);
+  server.Put(".*", handler);
+  server.Patch(".*", handler);
+  server.Delete(".*", handler);
+  server.Options(".*", handler);
+  impl_->port = server.bind_to_any_port("127.0.0.1");
+  if (impl_->port <= 0) {
+    throw std::runtime_error("HttpsTestServer: cannot bind a loopback port");
+  }
+  // The socket already listens: connections made before the thread runs wait
+  // in the backlog.
+  impl_->thread = std::thread([impl] { impl->server->listen_after_bind(); });
+}
+
+HttpsTestServer::~HttpsTestServer() { stop(); }
+
+int HttpsTestServer::port() const { return impl_->port; }
+
+std::string HttpsTestServer::url(std::string_view path) const {
+  return "https://127.0.0.1:" + std::to_string(impl_->port) + std::string(path);
+}
+
+void HttpsTestServer::on(const std::string& path, Reply reply) {
+  on(path, [reply = std::move(reply)](const RecordedRequest&) { return reply; });
+}
+
+void HttpsTestServer::on(const std::string& path, RequestHandler handler) {
+  std::lock_guard lock(impl_->mutex);
+  impl_->handlers[path] = std::move(handler);
+}
+
+void HttpsTestServer::holdAnswers() {
+  std::lock_guard lock(impl_->mutex);
+  impl_->held = true;
+}
+
+void HttpsTestServer::releaseAnswers() {
+  {
+    std::lock_guard lock(impl_->mutex);
+    impl_->held = false;
+  }
+  impl_->changed.notify_all();
+}
+
+std::vector<RecordedRequest> HttpsTestServer::requests() const {
+  std::lock_guard lock(impl_->mutex);
+  return impl_->recorded;
+}
+
+std::size_t HttpsTestServer::requestCount() const {
+  std::lock_guard lock(impl_->mutex);
+  return impl_->recorded.size();
+}
+
+bool HttpsTestServer::waitForRequests(std::size_t count, std::chrono::milliseconds timeout) const {
+  std::unique_lock lock(impl_->mutex);
+  return impl_->changed.wait_for(lock, timeout, [&] { return impl_->recorded.size() >= count; });
+}
+
+void HttpsTestServer::stop() {
+  {
+    std::lock_guard lock(impl_->mutex);
+    impl_->stopping = true;
+  }
+  impl_->changed.notify_all();
+  impl_->server->stop();
+  if (impl_->thread.joinable()) {
+    impl_->thread.join();
+  }
+}
+
+RefusingPort::RefusingPort() {
+  fd_ = bindLoopback(port_);
+  if (fd_ < 0) {
+    throw std::runtime_error("RefusingPort: cannot bind a loopback port");
+  }
+}
+
+RefusingPort::~RefusingPort() { ::close(fd_); }
+
+std::string RefusingPort::url(std::string_view path) const {
+  return "https://127.0.0.1:" + std::to_string(port_) + std::string(path);
+}
+
+int unusedLoopbackPort() {
+  int port = 0;
+  const int fd = bindLoopback(port);
+  if (fd < 0) {
+    throw std::runtime_error("unusedLoopbackPort: cannot bind a loopback port");
+  }
+  ::close(fd);
+  return port;
+}
+
+}  // namespace zerith::test

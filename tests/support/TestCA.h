@@ -1,0 +1,57 @@
+#pragma once
+
+// A certificate authority made at run time for tests: an EC P-256 key and a
+// self-signed CA certificate, and server certificates it issues (for
+// "localhost", 127.0.0.1 and ::1 unless told otherwise). Nothing is read from
+// or written to the system's trust store.
+//
+// `TestCA::shared()` is the one CA of a test process; its certificate and a
+// server certificate and key are also written as PEM files into a folder of
+// its own (removed at exit), for servers run as child processes and for the
+// transport's extra-CA setting.
+
+#include <filesystem>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace zerith::test {
+
+struct IssuedCertificate {
+  std::string certificatePem;
+  std::string privateKeyPem;
+};
+
+class TestCA {
+ public:
+  explicit TestCA(const std::string& commonName = "zerith test CA");
+  ~TestCA();
+  TestCA(const TestCA&) = delete;
+  TestCA& operator=(const TestCA&) = delete;
+
+  // The process's shared CA (created on first use).
+  static TestCA& shared();
+
+  const std::string& certificatePem() const;
+
+  // A new leaf certificate for TLS servers, signed by this CA, valid from an
+  // hour ago for 30 days.
+  IssuedCertificate issueServerCertificate(const std::vector<std::string>& dnsNames = {"localhost"},
+                                           const std::vector<std::string>& ipAddresses = {"127.0.0.1", "::1"}) const;
+
+  // One server certificate for localhost/127.0.0.1/::1, issued on first use
+  // and then reused.
+  const IssuedCertificate& serverCertificate() const;
+
+  // PEM files in the CA's own folder, written on first use.
+  std::filesystem::path caFile() const;
+  std::filesystem::path serverCertificateFile() const;
+  std::filesystem::path serverKeyFile() const;
+
+  struct Impl;
+
+ private:
+  std::unique_ptr<Impl> impl_;
+};
+
+}  // namespace zerith::test

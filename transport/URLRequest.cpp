@@ -1,0 +1,46 @@
+#include <strings.h>
+
+#include <algorithm>
+
+#include "transport/ReportingSessionConnectivityInterface.h"
+
+namespace zerith {
+
+namespace {
+
+bool sameField(std::string_view a, std::string_view b) {
+  return a.size() == b.size() && ::strncasecmp(a.data(), b.data(), a.size()) == 0;
+}
+
+std::optional<std::string> findField(const HTTPHeaders& headers, std::string_view field) {
+  const auto it = std::find_if(headers.begin(), headers.end(), [&](const auto& h) { return sameField(h.first, field); });
+  if (it == headers.end()) {
+    return std::nullopt;
+  }
+  return it->second;
+}
+
+}  // namespace
+
+void URLRequest::setValue(std::string value, std::string field) {
+  const auto it = std::find_if(headers.begin(), headers.end(), [&](const auto& h) { return sameField(h.first, field); });
+  if (it == headers.end()) {
+    headers.emplace_back(std::move(field), std::move(value));
+    return;
+  }
+  // The first occurrence keeps its place; any later duplicates go.
+  it->second = std::move(value);
+  const auto first = it - headers.begin();
+  headers.erase(std::remove_if(headers.begin() + first + 1, headers.end(), [&](const auto& h) { return sameField(h.first, field); }),
+                headers.end());
+}
+
+std::optional<std::string> URLRequest::valueForHTTPHeaderField(std::string_view field) const {
+  return findField(headers, field);
+}
+
+std::optional<std::string> HTTPURLResponse::valueForHTTPHeaderField(std::string_view field) const {
+  return findField(headers, field);
+}
+
+}  // namespace zerith
