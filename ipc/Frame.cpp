@@ -1,0 +1,196 @@
+#include "ipc/Frame.h"
+
+#include <fmt/format.h>
+
+#include <cstring>
+
+namespace zerith::ipc {
+
+namespace {
+
+void setWhy(std::string* why, std::string text) {
+  if (why) {
+    *why = std::move(text);
+  }
+}
+
+// Call and reply numbers: non-negative integers (the binary format stores
+// signed 64-bit integers, so that is how they come back).
+std::optional<std::uint64_t> callNumber(const Value& v) {
+  if (v.type() == Value::Type::Int && v.intValue() >= 0) {
+    return static_cast<std::uint64_t>(v.intValue());
+  }
+  if (v.type() == Value::Type::UInt) {
+    return v.unsignedValue();
+  }
+  return std::nullopt;
+}
+
+// "an array", "a string": for messages about a value of the wrong kind.
+const char* typeName(const Value& v) {
+  switch (v.type()) {
+    case Value::Type::Nil: return "nil";
+    case Value::Type::Bool: return "a boolean";
+    case Value::Type::Int:
+    case Value::Type::UInt: return "an integer";
+    case Value::Type::Real: return "a real";
+    case Value::Type::String: return "a string";
+    case Value::Type::Data: return "data";
+    case Value::Type::Date: return "a date";
+    case Value::Type::Array: return "an array";
+    case Value::Type::Dict: return "a dictionary";
+  }
+  return "a value";
+}
+
+}  // namespace
+
+plist::Limits frameLimits() {
+  // A frame holds one call: generous for payloads, small enough that a
+  // hostile frame costs little.
+  return plist::Limits{kMaxFrameBytes, 32, 1u << 18};
+}
+
+Data encodeFrame(const Value& message) {
+  const Data body = plist::encodeBinary(message);
+  Data frame(kFrameHeaderBytes + body.size());
+  const auto n = static_cast<std::uint32_t>(body.size());
+  frame[0] = static_cast<std::uint8_t>(n >> 24);
+  frame[1] = static_cast<std::uint8_t>(n >> 16);
+  frame[2] = static_cast<std::uint8_t>(n >> 8);
+  frame[3] = static_cast<std::uint8_t>(n);
+  if (!body.empty()) {
+    std::memcpy(frame.data() + kFrameHeaderBytes, body.data(), body.size());
+  }
+  return frame;
+}
+
+Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args) {
+  Dictionary message{{"op", Value(operation)}};
+  if (call) {
+    message.set("call", Value(static_cast<long long>(*call)));
+  }
+  message.set("args", Value(args));
+  return encodeFrame(Value(std::move(message)));
+}
+
+Data encodeReply(std::uint64_t call, const Dictionary& args) {
+  return encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(call))}, {"args", Value(args)}}));
+}
+
+Data encodeErrorReply(std::uint64_t call, const Error& error) {
+  return encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(call))}, {"error", error.toValue()}}));
+}
+
+FrameDecoder::FrameDecoder(std::uint32_t maxFrameBytes) : maxFrameBytes_(maxFrameBytes) {}
+
+void FrameDecoder::append(const std::uint8_t* bytes, std::size_t size) {
+  if (offset_ > 0 && (offset_ == buffer_.size() || offset_ >= buffer_.size() / 2)) {
+    buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(offset_));
+    offset_ = 0;
+  }
+  buffer_.insert(buffer_.end(), bytes, bytes + size);
+}
+
+FrameDecoder::Status FrameDecoder::next(plist::Bytes& body, std::string& why) {
+  if (invalid_) {
+    why = "the stream was already invalid";
+    return Status::Invalid;
+  }
+  const std::size_t available = buffer_.size() - offset_;
+  if (available < kFrameHeaderBytes) {
+    return Status::NeedMore;
+  }
+  const std::uint8_t* p = buffer_.data() + offset_;
+  const std::uint32_t length = (std::uint32_t{p[0]} << 24) | (std::uint32_t{p[1]} << 16) |
+                               (std::uint32_t{p[2]} << 8) | std::uint32_t{p[3]};
+  if (length == 0) {
+    invalid_ = true;
+    why = "empty frame";
+    return Status::Invalid;
+  }
+  if (length > maxFrameBytes_) {
+    invalid_ = true;
+    why = fmt::format("frame of {} bytes exceeds the limit of {}", length, maxFrameBytes_);
+    return Status::Invalid;
+  }
+  if (available - kFrameHeaderBytes < length) {
+    return Status::NeedMore;
+  }
+  body = plist::Bytes(p + kFrameHeaderBytes, length);
+  offset_ += kFrameHeaderBytes + length;
+  return Status::Frame;
+}
+
+std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why) {
+  if (!plist::looksBinary(body)) {
+    setWhy(why, "frame body is not a binary property list");
+    return std::nullopt;
+  }
+  std::string plistError;
+  const auto root = plist::decodeBinary(body, frameLimits(), &plistError);
+  if (!root) {
+    setWhy(why, "frame body does not parse: " + plistError);
+    return std::nullopt;
+  }
+  if (!root->isDict()) {
+    setWhy(why, fmt::format("message is {}, not a dictionary", typeName(*root)));
+    return std::nullopt;
+  }
+  const Value args = (*root)["args"];
+  if (!args.isNil() && !args.isDict()) {
+    setWhy(why, fmt::format("message \"args\" is {}, not a dictionary", typeName(args)));
+    return std::nullopt;
+  }
+  const Value op = (*root)["op"];
+  const Value reply = (*root)["reply"];
+  IncomingMessage message;
+  if (!op.isNil()) {
+    if (!op.isString()) {
+      setWhy(why, fmt::format("message \"op\" is {}, not a string", typeName(op)));
+      return std::nullopt;
+    }
+    if (!reply.isNil()) {
+      setWhy(why, "message has both \"op\" and \"reply\"");
+      return std::nullopt;
+    }
+    message.kind = IncomingMessage::Kind::Call;
+    message.call.operation = *op.string();
+    const Value call = (*root)["call"];
+    if (!call.isNil()) {
+      message.call.call = callNumber(call);
+      if (!message.call.call) {
+        setWhy(why, "message \"call\" is not an unsigned integer");
+        return std::nullopt;
+      }
+    }
+    if (const auto* d = args.dict()) {
+      message.call.args = *d;
+    }
+    return message;
+  }
+  if (reply.isNil()) {
+    setWhy(why, "message has neither \"op\" nor \"reply\"");
+    return std::nullopt;
+  }
+  const auto replyTo = callNumber(reply);
+  if (!replyTo) {
+    setWhy(why, "message \"reply\" is not an unsigned integer");
+    return std::nullopt;
+  }
+  message.kind = IncomingMessage::Kind::Reply;
+  message.replyTo = *replyTo;
+  const Value error = (*root)["error"];
+  if (!error.isNil()) {
+    if (!error.isDict()) {
+      setWhy(why, fmt::format("reply \"error\" is {}, not a dictionary", typeName(error)));
+      return std::nullopt;
+    }
+    message.replyError = Error::fromValue(error);
+  } else if (const auto* d = args.dict()) {
+    message.replyArgs = *d;
+  }
+  return message;
+}
+
+}  // namespace zerith::ipc

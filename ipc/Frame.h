@@ -1,0 +1,77 @@
+#pragma once
+
+// The socket's framing and message shapes.
+//
+// A frame is a 4-byte big-endian body length followed by the body, a binary
+// property list (never XML on the socket). The body must be a dictionary:
+//   call:  {"op": <string>, "call": <unsigned, optional>, "args": <dictionary, optional>}
+//   reply: {"reply": <unsigned>, "args": <dictionary, optional>}
+//          {"reply": <unsigned>, "error": {"domain", "code", "description"}}
+// Anything else is a protocol violation that ends the connection.
+
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "ipc/Connection.h"
+#include "platform/Error.h"
+#include "platform/PropertyList.h"
+#include "platform/Value.h"
+
+namespace zerith::ipc {
+
+// The client framework's error domain (kZerithErrorDomain); the IPC layer
+// cannot link the framework, so it keeps the same text, and the framework's
+// tests hold the two equal.
+inline constexpr const char* kErrorDomain = "com.velmar.zerith.ErrorDomain";
+
+inline constexpr std::size_t kFrameHeaderBytes = 4;
+
+// The structural limits a frame body must pass before libplist parses it.
+plist::Limits frameLimits();
+
+// One frame (header and body) carrying `message`.
+Data encodeFrame(const Value& message);
+Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args);
+Data encodeReply(std::uint64_t call, const Dictionary& args);
+Data encodeErrorReply(std::uint64_t call, const Error& error);
+
+// Splits a byte stream into frame bodies. Bytes go in with append(); next()
+// hands out complete bodies in order. Once it reports Invalid the stream is
+// unusable (the connection closes).
+class FrameDecoder {
+ public:
+  enum class Status { Frame, NeedMore, Invalid };
+
+  explicit FrameDecoder(std::uint32_t maxFrameBytes = kMaxFrameBytes);
+
+  void append(const std::uint8_t* bytes, std::size_t size);
+  // Frame: `body` points into the decoder and stays valid until the next
+  // append() or next(). Invalid: `why` says what was wrong.
+  Status next(plist::Bytes& body, std::string& why);
+  // Bytes received but not yet handed out.
+  std::size_t buffered() const { return buffer_.size() - offset_; }
+
+ private:
+  Data buffer_;
+  std::size_t offset_ = 0;
+  std::uint32_t maxFrameBytes_;
+  bool invalid_ = false;
+};
+
+struct IncomingMessage {
+  enum class Kind { Call, Reply };
+  Kind kind = Kind::Call;
+  Message call;                      // Kind::Call
+  std::uint64_t replyTo = 0;         // Kind::Reply
+  Dictionary replyArgs;              // Kind::Reply without error
+  std::optional<Error> replyError;   // Kind::Reply that failed
+};
+
+// The message in a frame body; nullopt when the body is not a binary
+// property list of one of the shapes above (`why` says what was wrong).
+std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why = nullptr);
+
+}  // namespace zerith::ipc

@@ -1,0 +1,280 @@
+#include "ipc/Listener.h"
+
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+
+#include <asio/local/stream_protocol.hpp>
+#include <cerrno>
+#include <cstring>
+#include <mutex>
+
+#include "ipc/EntitlementPolicy.h"
+#include "ipc/SocketConnection.h"
+#include "platform/Executors.h"
+#include "platform/Log.h"
+
+namespace zerith::ipc {
+
+namespace {
+
+constexpr int kAcceptsPerTurn = 64;
+constexpr auto kAcceptRetryDelay = std::chrono::milliseconds(100);
+
+std::string errnoText(int err) { return std::error_code(err, std::generic_category()).message(); }
+
+bool fillAddress(const std::filesystem::path& path, sockaddr_un& address) {
+  const std::string p = path.string();
+  if (p.empty() || p.size() >= sizeof(address.sun_path)) {
+    return false;
+  }
+  address = sockaddr_un{};
+  address.sun_family = AF_UNIX;
+  std::memcpy(address.sun_path, p.c_str(), p.size() + 1);
+  return true;
+}
+
+// True when a process accepts connections at `address`.
+bool someoneListens(const sockaddr_un& address) {
+  file::UniqueFd probe(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  return probe && ::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)) == 0;
+}
+
+class SocketListener final : public Listener {
+ public:
+  struct State : std::enable_shared_from_this<State> {
+    State(file::UniqueFd listenFd, std::shared_ptr<const EntitlementPolicy> p)
+        : fd(listenFd.get()), acceptor(ioContext()), policy(std::move(p)) {
+      std::error_code ec;
+      acceptor.assign(asio::local::stream_protocol(), listenFd.get(), ec);
+      if (!ec) {
+        listenFd.release();
+      } else {
+        log.error("Listener: cannot use the listening socket: {}", ec.message());
+      }
+    }
+
+    log::Logger log{"ipc"};
+    const int fd;
+    SerialQueue queue{"com.velmar.zerithd.listener"};
+    asio::local::stream_protocol::acceptor acceptor;  // used on `queue`
+    std::shared_ptr<const EntitlementPolicy> policy;
+
+    std::recursive_mutex mutex;  // held while the delegate decides
+    Listener* owner = nullptr;
+    ListenerDelegate* delegate = nullptr;
+    bool resumed = false;
+    bool stopped = false;
+
+    void arm() {
+      if (stopped) {
+        return;
+      }
+      acceptor.async_wait(asio::socket_base::wait_read, [self = shared_from_this()](const std::error_code& ec) {
+        self->queue.async([self, ec] { self->acceptReady(ec); });
+      });
+    }
+
+    void acceptReady(const std::error_code& ec) {
+      if (stopped) {
+        return;
+      }
+      if (ec) {
+        log.error("Listener: waiting for connections failed: {}", ec.message());
+        queue.after(kAcceptRetryDelay, [self = shared_from_this()] { self->arm(); });
+        return;
+      }
+      for (int n = 0; n < kAcceptsPerTurn && !stopped; ++n) {
+        const int client = ::accept4(fd, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+        if (client >= 0) {
+          admit(file::UniqueFd(client));
+          continue;
+        }
+        const int err = errno;
+        if (err == EAGAIN || err == EWOULDBLOCK) {
+          break;
+        }
+        if (err == EINTR || err == ECONNABORTED || err == EPROTO) {
+          continue;
+        }
+        // Out of descriptors or memory: try again a little later instead of
+        // spinning on a socket that stays readable.
+        log.error("Listener: accept failed: {}", errnoText(err));
+        queue.after(kAcceptRetryDelay, [self = shared_from_this()] { self->arm(); });
+        return;
+      }
+      arm();
+    }
+
+    void admit(file::UniqueFd client) {
+      std::string why;
+      auto peer = readPeerCredentials(client.get(), &why);
+      if (!peer) {
+        log.error("Listener: refusing a connection whose peer is unknown: {}", why);
+        return;
+      }
+      Dictionary entitlements = policy ? policy->entitlementsFor(*peer) : Dictionary();
+      auto connection = SocketConnection::adopt(std::move(client), std::move(*peer), std::move(entitlements));
+      bool accepted = false;
+      {
+        std::lock_guard lock(mutex);
+        if (!stopped && delegate) {
+          accepted = delegate->shouldAcceptNewConnection(*owner, connection);
+        }
+      }
+      if (!accepted) {
+        connection->invalidate();
+      }
+    }
+
+    void close() {
+      std::error_code ignored;
+      acceptor.close(ignored);
+    }
+  };
+
+  SocketListener(std::shared_ptr<State> state, std::filesystem::path createdPath, ino_t createdInode)
+      : state_(std::move(state)), createdPath_(std::move(createdPath)), createdInode_(createdInode) {
+    state_->owner = this;
+  }
+
+  ~SocketListener() override { stop(); }
+
+  void setDelegate(ListenerDelegate* delegate) override {
+    std::lock_guard lock(state_->mutex);
+    state_->delegate = delegate;
+  }
+
+  void resume() override {
+    std::lock_guard lock(state_->mutex);
+    if (state_->resumed || state_->stopped) {
+      return;
+    }
+    state_->resumed = true;
+    state_->queue.async([state = state_] { state->arm(); });
+  }
+
+  void stop() override {
+    {
+      std::lock_guard lock(state_->mutex);
+      if (state_->stopped) {
+        return;
+      }
+      state_->stopped = true;
+      state_->delegate = nullptr;
+      state_->owner = nullptr;
+    }
+    if (state_->queue.isCurrent()) {
+      state_->close();
+    } else {
+      state_->queue.async([state = state_] { state->close(); });
+    }
+    // Remove the socket file we made, unless another listener has replaced
+    // it since.
+    struct stat st {};
+    if (!createdPath_.empty() && ::lstat(createdPath_.c_str(), &st) == 0 && st.st_ino == createdInode_) {
+      ::unlink(createdPath_.c_str());
+    }
+  }
+
+ private:
+  std::shared_ptr<State> state_;
+  std::filesystem::path createdPath_;
+  ino_t createdInode_ = 0;
+};
+
+// The listening socket systemd passed in for `socketPath`, if any. With a
+// relocated root the path differs from the unit's; a single passed Unix
+// stream listener is then taken as ours.
+file::UniqueFd activatedSocket(const std::filesystem::path& socketPath, const log::Logger& log) {
+  const int n = sd_listen_fds(0);
+  if (n <= 0) {
+    return file::UniqueFd();
+  }
+  int chosen = -1;
+  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n; ++fd) {
+    if (sd_is_socket_unix(fd, SOCK_STREAM, 1, socketPath.c_str(), 0) > 0) {
+      chosen = fd;
+      break;
+    }
+  }
+  if (chosen < 0 && n == 1 && sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) > 0) {
+    chosen = SD_LISTEN_FDS_START;
+  }
+  if (chosen < 0) {
+    log.error("Listener: the service manager passed {} sockets, none a Unix stream listener for {}", n,
+              socketPath.string());
+    return file::UniqueFd();
+  }
+  const int flags = ::fcntl(chosen, F_GETFL);
+  ::fcntl(chosen, F_SETFL, flags | O_NONBLOCK);
+  ::fcntl(chosen, F_SETFD, FD_CLOEXEC);
+  log.info("Listener: using the socket passed by the service manager (fd {})", chosen);
+  return file::UniqueFd(chosen);
+}
+
+}  // namespace
+
+std::unique_ptr<Listener> Listener::create(const std::filesystem::path& socketPath,
+                                           std::shared_ptr<const EntitlementPolicy> policy) {
+  const log::Logger log("ipc");
+  if (auto fd = activatedSocket(socketPath, log)) {
+    auto state = std::make_shared<SocketListener::State>(std::move(fd), std::move(policy));
+    if (!state->acceptor.is_open()) {
+      return nullptr;
+    }
+    return std::make_unique<SocketListener>(std::move(state), std::filesystem::path(), 0);
+  }
+
+  sockaddr_un address{};
+  if (!fillAddress(socketPath, address)) {
+    log.error("Listener: socket path \"{}\" is empty or longer than {} bytes", socketPath.string(),
+              sizeof(address.sun_path) - 1);
+    return nullptr;
+  }
+  std::error_code ec;
+  std::filesystem::create_directories(socketPath.parent_path(), ec);
+  if (ec) {
+    log.error("Listener: cannot create {}: {}", socketPath.parent_path().string(), ec.message());
+    return nullptr;
+  }
+  struct stat st {};
+  if (::lstat(socketPath.c_str(), &st) == 0) {
+    if (!S_ISSOCK(st.st_mode)) {
+      log.error("Listener: {} exists and is not a socket", socketPath.string());
+      return nullptr;
+    }
+    if (someoneListens(address)) {
+      log.error("Listener: another process already listens on {}", socketPath.string());
+      return nullptr;
+    }
+    ::unlink(socketPath.c_str());  // stale, left by a process that is gone
+  }
+
+  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (!fd) {
+    log.error("Listener: cannot create a socket: {}", errnoText(errno));
+    return nullptr;
+  }
+  if (::bind(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)) != 0) {
+    log.error("Listener: cannot bind {}: {}", socketPath.string(), errnoText(errno));
+    return nullptr;
+  }
+  // Everyone may connect; the entitlements policy decides who stays.
+  if (::chmod(socketPath.c_str(), 0666) != 0 || ::listen(fd.get(), SOMAXCONN) != 0 ||
+      ::lstat(socketPath.c_str(), &st) != 0) {
+    log.error("Listener: cannot listen on {}: {}", socketPath.string(), errnoText(errno));
+    ::unlink(socketPath.c_str());
+    return nullptr;
+  }
+  auto state = std::make_shared<SocketListener::State>(std::move(fd), std::move(policy));
+  if (!state->acceptor.is_open()) {
+    ::unlink(socketPath.c_str());
+    return nullptr;
+  }
+  return std::make_unique<SocketListener>(std::move(state), socketPath, st.st_ino);
+}
+
+}  // namespace zerith::ipc

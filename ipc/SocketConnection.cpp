@@ -1,0 +1,473 @@
+#include "ipc/SocketConnection.h"
+
+#include <sys/socket.h>
+#include <sys/un.h>
+
+#include <asio/error.hpp>
+#include <cerrno>
+#include <cstring>
+
+#include "platform/Executors.h"
+
+namespace zerith::ipc {
+
+namespace {
+
+constexpr std::size_t kReadChunk = 64u << 10;
+
+std::string errnoText(int err) { return std::error_code(err, std::generic_category()).message(); }
+
+// Sends the reply to one call through the connection that delivered it.
+class SocketReply final : public Reply {
+ public:
+  SocketReply(std::weak_ptr<SocketConnection> connection, std::optional<std::uint64_t> call)
+      : connection_(std::move(connection)), call_(call) {}
+
+  void send(Dictionary args) override {
+    if (!call_ || answered_.exchange(true)) {
+      return;
+    }
+    if (auto c = connection_.lock()) {
+      c->writeFrame(encodeReply(*call_, args));
+    }
+  }
+
+  void fail(const Error& error) override {
+    if (!call_ || answered_.exchange(true)) {
+      return;
+    }
+    if (auto c = connection_.lock()) {
+      c->writeFrame(encodeErrorReply(*call_, error));
+    }
+  }
+
+ private:
+  std::weak_ptr<SocketConnection> connection_;
+  std::optional<std::uint64_t> call_;
+  std::atomic<bool> answered_{false};
+};
+
+}  // namespace
+
+std::optional<PeerCredentials> readPeerCredentials(int fd, std::string* why) {
+  ucred cred{};
+  socklen_t len = sizeof(cred);
+  if (::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0 || len != sizeof(cred)) {
+    if (why) {
+      *why = "SO_PEERCRED: " + errnoText(errno);
+    }
+    return std::nullopt;
+  }
+  PeerCredentials peer;
+  peer.pid = cred.pid;
+  peer.uid = cred.uid;
+  peer.gid = cred.gid;
+  std::vector<gid_t> groups(16);
+  for (int attempt = 0; attempt < 4; ++attempt) {
+    socklen_t bytes = static_cast<socklen_t>(groups.size() * sizeof(gid_t));
+    if (::getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, groups.data(), &bytes) == 0) {
+      groups.resize(bytes / sizeof(gid_t));
+      peer.groups = std::move(groups);
+      return peer;
+    }
+    if (errno != ERANGE) {
+      break;
+    }
+    // The kernel says how much room the list needs.
+    groups.resize(std::max<std::size_t>(bytes / sizeof(gid_t), groups.size() * 2));
+  }
+  if (why) {
+    *why = "SO_PEERGROUPS: " + errnoText(errno);
+  }
+  return std::nullopt;
+}
+
+std::shared_ptr<SocketConnection> SocketConnection::adopt(file::UniqueFd fd, PeerCredentials peer,
+                                                          Dictionary entitlements) {
+  return std::make_shared<SocketConnection>(Private{}, std::move(fd), std::move(peer), std::move(entitlements));
+}
+
+std::shared_ptr<SocketConnection> SocketConnection::connect(const std::filesystem::path& path, Error* error) {
+  auto fail = [&](std::string text) -> std::shared_ptr<SocketConnection> {
+    if (error) {
+      *error = Error{kErrorDomain, -1, std::move(text)};
+    }
+    return nullptr;
+  };
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  const std::string p = path.string();
+  if (p.empty() || p.size() >= sizeof(address.sun_path)) {
+    return fail("Socket path \"" + p + "\" is empty or too long");
+  }
+  std::memcpy(address.sun_path, p.c_str(), p.size() + 1);
+  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  if (!fd) {
+    return fail("Cannot create a socket: " + errnoText(errno));
+  }
+  int rc;
+  do {
+    rc = ::connect(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address));
+  } while (rc != 0 && errno == EINTR);
+  if (rc != 0) {
+    return fail("Cannot connect to " + p + ": " + errnoText(errno));
+  }
+  std::string why;
+  auto peer = readPeerCredentials(fd.get(), &why);
+  if (!peer) {
+    return fail("Cannot identify the listener at " + p + ": " + why);
+  }
+  return adopt(std::move(fd), std::move(*peer), Dictionary());
+}
+
+SocketConnection::SocketConnection(Private, file::UniqueFd fd, PeerCredentials peer, Dictionary entitlements)
+    : queue_("com.velmar.zerith.connection"),
+      fd_(fd.get()),
+      peer_(std::move(peer)),
+      entitlements_(std::move(entitlements)),
+      socket_(ioContext()),
+      readBuffer_(kReadChunk) {
+  std::error_code ec;
+  socket_.assign(asio::local::stream_protocol(), fd.get(), ec);
+  if (ec) {
+    // Only a descriptor that is not a socket gets here; it behaves as closed.
+    log_.error("{}: cannot use the socket: {}", description(), ec.message());
+    writeClosed_ = true;
+    return;  // `fd` closes it
+  }
+  fd.release();
+  socketOpen_ = true;
+}
+
+SocketConnection::~SocketConnection() = default;
+
+void SocketConnection::setExportedObject(std::shared_ptr<ExportedObject> object) {
+  std::lock_guard lock(stateMutex_);
+  if (!invalidated_) {
+    exported_ = std::move(object);
+  }
+}
+
+void SocketConnection::setInterruptionHandler(std::function<void()> handler) {
+  std::lock_guard lock(stateMutex_);
+  interruptionHandler_ = std::move(handler);
+}
+
+void SocketConnection::setInvalidationHandler(std::function<void()> handler) {
+  std::lock_guard lock(stateMutex_);
+  if (!invalidated_) {
+    invalidationHandler_ = std::move(handler);
+  }
+}
+
+void SocketConnection::resume() {
+  if (resumed_.exchange(true) || invalidated_) {
+    return;
+  }
+  queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] { self->startRead(); });
+}
+
+void SocketConnection::invalidate() { beginInvalidation(); }
+
+Value SocketConnection::valueForEntitlement(const std::string& entitlement) const {
+  return entitlements_.get(entitlement);
+}
+
+std::string SocketConnection::description() const {
+  return "<connection pid=" + std::to_string(peer_.pid) + " uid=" + std::to_string(peer_.uid) +
+         " fd=" + std::to_string(fd_) + ">";
+}
+
+// ---- reading (on the queue) ---------------------------------------------------
+
+void SocketConnection::startRead() {
+  if (invalidated_) {
+    return;
+  }
+  socket_.async_read_some(asio::buffer(readBuffer_),
+                          [self = std::static_pointer_cast<SocketConnection>(shared_from_this())](
+                              const std::error_code& ec, std::size_t size) { self->onRead(ec, size); });
+}
+
+void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
+  auto self = std::static_pointer_cast<SocketConnection>(shared_from_this());
+  if (ec) {
+    queue_.async([self, ec] { self->readFailed(ec); });
+    return;
+  }
+  // readBuffer_ stays untouched until the queue has consumed it: the next
+  // read starts from there.
+  queue_.async([self, size] {
+    self->processInput(size);
+    self->startRead();
+  });
+}
+
+void SocketConnection::processInput(std::size_t size) {
+  if (invalidated_) {
+    return;
+  }
+  decoder_.append(readBuffer_.data(), size);
+  for (;;) {
+    plist::Bytes body;
+    std::string why;
+    switch (decoder_.next(body, why)) {
+      case FrameDecoder::Status::NeedMore: return;
+      case FrameDecoder::Status::Invalid: protocolError(why); return;
+      case FrameDecoder::Status::Frame: break;
+    }
+    auto message = decodeMessage(body, &why);
+    if (!message) {
+      protocolError(why);
+      return;
+    }
+    deliver(std::move(*message));
+    if (invalidated_) {
+      return;
+    }
+  }
+}
+
+void SocketConnection::deliver(IncomingMessage message) {
+  if (message.kind == IncomingMessage::Kind::Reply) {
+    ReplyHandler handler;
+    {
+      std::lock_guard lock(callsMutex_);
+      const auto it = pending_.find(message.replyTo);
+      if (it != pending_.end()) {
+        handler = std::move(it->second);
+        pending_.erase(it);
+      }
+    }
+    if (!handler) {
+      log_.error("{}: reply to unknown call {}", description(), message.replyTo);
+      return;
+    }
+    if (message.replyError) {
+      handler(std::nullopt, std::move(message.replyError));
+    } else {
+      handler(std::move(message.replyArgs), std::nullopt);
+    }
+    return;
+  }
+  std::shared_ptr<ExportedObject> exported;
+  {
+    std::lock_guard lock(stateMutex_);
+    exported = exported_;
+  }
+  auto reply = std::make_shared<SocketReply>(std::static_pointer_cast<SocketConnection>(shared_from_this()),
+                                             message.call.call);
+  if (!exported) {
+    log_.error("{}: no object is exported for \"{}\"", description(), message.call.operation);
+    reply->fail(Error{kErrorDomain, -1, "No object is exported on this connection"});
+    return;
+  }
+  exported->handleMessage(message.call, std::move(reply));
+}
+
+void SocketConnection::readFailed(const std::error_code& ec) {
+  if (invalidated_) {
+    return;
+  }
+  if (decoder_.buffered() > 0) {
+    log_.error("{}: closing connection: it ended inside a frame ({} bytes unread)", description(), decoder_.buffered());
+  } else if (ec == asio::error::eof || ec == asio::error::connection_reset) {
+    log_.debug("{}: peer closed the connection", description());
+  } else {
+    log_.error("{}: closing connection: read failed: {}", description(), ec.message());
+  }
+  beginInvalidation();
+}
+
+void SocketConnection::protocolError(const std::string& why) {
+  log_.error("{}: closing connection: {}", description(), why);
+  beginInvalidation();
+}
+
+// ---- writing (any thread) -----------------------------------------------------
+
+int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent) {
+  while (sent < size) {
+    const ssize_t n = ::send(fd_, bytes + sent, size - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (n > 0) {
+      sent += static_cast<std::size_t>(n);
+      continue;
+    }
+    if (n < 0 && errno == EINTR) {
+      continue;
+    }
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+      return 0;
+    }
+    return n < 0 ? errno : EPIPE;
+  }
+  return 0;
+}
+
+bool SocketConnection::writeFrame(Data frame) {
+  int err = 0;
+  bool overflow = false;
+  {
+    std::lock_guard lock(writeMutex_);
+    if (writeClosed_) {
+      return false;
+    }
+    if (outbox_.empty()) {
+      std::size_t sent = 0;
+      err = sendSome(frame.data(), frame.size(), sent);
+      if (!err && sent < frame.size()) {
+        outboxBytes_ = frame.size() - sent;
+        outboxOffset_ = sent;
+        outbox_.push_back(std::move(frame));
+        armWritable();
+      }
+    } else {
+      outboxBytes_ += frame.size();
+      outbox_.push_back(std::move(frame));
+      overflow = outboxBytes_ > kMaxOutboxBytes;
+    }
+    if (err || overflow) {
+      writeClosed_ = true;
+    }
+  }
+  if (overflow) {
+    log_.error("{}: closing connection: peer does not read ({} bytes waiting)", description(), kMaxOutboxBytes);
+    beginInvalidation();
+    return false;
+  }
+  if (err) {
+    writeFailed(err);
+    return false;
+  }
+  return true;
+}
+
+// Called with writeMutex_ held.
+void SocketConnection::armWritable() {
+  if (writeArmed_) {
+    return;
+  }
+  writeArmed_ = true;
+  queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] {
+    if (self->invalidated_) {
+      return;
+    }
+    self->socket_.async_wait(asio::socket_base::wait_write,
+                             [self](const std::error_code& ec) { self->onWritable(ec); });
+  });
+}
+
+void SocketConnection::onWritable(const std::error_code& ec) {
+  int err = 0;
+  {
+    std::lock_guard lock(writeMutex_);
+    writeArmed_ = false;
+    if (ec || writeClosed_) {
+      return;
+    }
+    while (!outbox_.empty()) {
+      Data& front = outbox_.front();
+      std::size_t sent = outboxOffset_;
+      err = sendSome(front.data(), front.size(), sent);
+      outboxBytes_ -= sent - outboxOffset_;
+      outboxOffset_ = sent;
+      if (err || sent < front.size()) {
+        break;
+      }
+      outbox_.pop_front();
+      outboxOffset_ = 0;
+    }
+    if (err) {
+      writeClosed_ = true;
+    } else if (!outbox_.empty()) {
+      armWritable();
+    }
+  }
+  if (err) {
+    writeFailed(err);
+  }
+}
+
+void SocketConnection::writeFailed(int err) {
+  if (err == EPIPE || err == ECONNRESET) {
+    log_.debug("{}: peer went away while writing", description());
+  } else {
+    log_.error("{}: closing connection: write failed: {}", description(), errnoText(err));
+  }
+  beginInvalidation();
+}
+
+// ---- calls on the peer --------------------------------------------------------
+
+Error SocketConnection::goneError() { return Error{kErrorDomain, -1, "The connection was invalidated"}; }
+
+void SocketConnection::send(const std::string& operation, Dictionary args) {
+  writeFrame(encodeCall(operation, std::nullopt, args));
+}
+
+void SocketConnection::call(const std::string& operation, Dictionary args, ReplyHandler handler) {
+  std::uint64_t number = 0;
+  {
+    std::lock_guard lock(callsMutex_);
+    if (!callsClosed_) {
+      number = nextCall_++;
+      pending_.emplace(number, std::move(handler));
+    }
+  }
+  if (number == 0) {
+    queue_.async([handler = std::move(handler)] { handler(std::nullopt, goneError()); });
+    return;
+  }
+  // A failed write invalidates the connection, which fails the call.
+  writeFrame(encodeCall(operation, number, args));
+}
+
+// ---- invalidation ---------------------------------------------------------------
+
+void SocketConnection::beginInvalidation() {
+  if (invalidated_.exchange(true)) {
+    return;
+  }
+  {
+    std::lock_guard lock(writeMutex_);
+    writeClosed_ = true;
+    outbox_.clear();
+    outboxBytes_ = 0;
+    // Wakes the outstanding read; the descriptor itself is closed on the
+    // queue, where every other socket operation starts.
+    if (socketOpen_) {
+      ::shutdown(fd_, SHUT_RDWR);
+    }
+  }
+  queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] { self->finishInvalidation(); });
+}
+
+void SocketConnection::finishInvalidation() {
+  std::error_code ignored;
+  socket_.close(ignored);
+  std::unordered_map<std::uint64_t, ReplyHandler> pending;
+  {
+    std::lock_guard lock(callsMutex_);
+    callsClosed_ = true;
+    pending.swap(pending_);
+  }
+  for (auto& [number, handler] : pending) {
+    handler(std::nullopt, goneError());
+  }
+  std::function<void()> handler;
+  std::shared_ptr<ExportedObject> exported;
+  {
+    std::lock_guard lock(stateMutex_);
+    handler = std::move(invalidationHandler_);
+    invalidationHandler_ = nullptr;
+    interruptionHandler_ = nullptr;
+    exported = std::move(exported_);
+    exported_ = nullptr;
+  }
+  if (handler) {
+    handler();
+  }
+  // `exported` (and whatever it holds) goes here, after the handler.
+}
+
+}  // namespace zerith::ipc

@@ -1,0 +1,222 @@
+#pragma once
+
+// Scenario helpers for the IPC tests: a raw peer that speaks bytes to a real
+// connection, a connected pair of real connections, and bounded waits that
+// fail a test instead of hanging it.
+
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <functional>
+#include <future>
+#include <mutex>
+#include <vector>
+
+#include "ipc/Frame.h"
+#include "ipc/SocketConnection.h"
+
+namespace zerith::ipc::test {
+
+using namespace std::chrono_literals;
+inline constexpr auto kWait = 10s;
+
+// Counts events and lets a test wait for a number of them.
+class Counter {
+ public:
+  void hit() {
+    {
+      std::lock_guard lock(mutex_);
+      ++count_;
+    }
+    changed_.notify_all();
+  }
+  bool waitFor(int n, std::chrono::milliseconds timeout = kWait) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, timeout, [&] { return count_ >= n; });
+  }
+  int count() const {
+    std::lock_guard lock(mutex_);
+    return count_;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::condition_variable changed_;
+  int count_ = 0;
+};
+
+// Records the calls an exported object receives and answers them through a
+// test-supplied function (default: echo the arguments back).
+class RecordingObject : public ExportedObject {
+ public:
+  std::function<void(const Message&, std::shared_ptr<Reply>)> answer = [](const Message& m, std::shared_ptr<Reply> r) {
+    r->send(m.args);
+  };
+  std::function<void()> onCall;  // runs after each recorded call
+
+  void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override {
+    {
+      std::lock_guard lock(mutex_);
+      calls_.push_back(message);
+    }
+    answer(message, std::move(reply));
+    if (onCall) {
+      onCall();
+    }
+    received.hit();
+  }
+  std::vector<Message> calls() const {
+    std::lock_guard lock(mutex_);
+    return calls_;
+  }
+
+  Counter received;
+
+ private:
+  mutable std::mutex mutex_;
+  std::vector<Message> calls_;
+};
+
+// One end of a socket pair as a real connection, the other end raw.
+struct RawPeer {
+  std::shared_ptr<SocketConnection> connection;
+  file::UniqueFd raw;
+  std::shared_ptr<RecordingObject> object = std::make_shared<RecordingObject>();
+  Counter invalidated;
+
+  RawPeer() {
+    int fds[2];
+    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+    raw.reset(fds[1]);
+    PeerCredentials peer = *readPeerCredentials(fds[0]);
+    connection = SocketConnection::adopt(file::UniqueFd(fds[0]), peer, Dictionary());
+    connection->setExportedObject(object);
+    connection->setInvalidationHandler([this] { invalidated.hit(); });
+    connection->resume();
+  }
+  ~RawPeer() {
+    if (connection) {
+      connection->invalidate();
+      invalidated.waitFor(1);
+    }
+  }
+
+  void write(const Data& bytes, std::size_t chunk = 0) {
+    std::size_t off = 0;
+    while (off < bytes.size()) {
+      const std::size_t n = chunk ? std::min(chunk, bytes.size() - off) : bytes.size() - off;
+      const ssize_t w = ::send(raw.get(), bytes.data() + off, n, MSG_NOSIGNAL);
+      ASSERT_GT(w, 0) << "peer write failed";
+      off += static_cast<std::size_t>(w);
+    }
+  }
+  void closeWrite() { ::shutdown(raw.get(), SHUT_WR); }
+
+  // Reads until one frame has arrived; nullopt on EOF or time-out.
+  std::optional<IncomingMessage> readMessage(std::chrono::milliseconds timeout = kWait) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+      plist::Bytes body;
+      std::string why;
+      const auto status = decoder.next(body, why);
+      if (status == FrameDecoder::Status::Frame) {
+        return decodeMessage(body, &why);
+      }
+      if (status == FrameDecoder::Status::Invalid) {
+        ADD_FAILURE() << "invalid frame from the connection: " << why;
+        return std::nullopt;
+      }
+      if (!readSome(deadline)) {
+        return std::nullopt;
+      }
+    }
+  }
+  // True when the connection closed its end (EOF) before the time-out.
+  bool seesEof(std::chrono::milliseconds timeout = kWait) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (readSome(deadline)) {
+    }
+    return eof;
+  }
+
+  FrameDecoder decoder{64u << 20};
+  bool eof = false;
+
+ private:
+  bool readSome(std::chrono::steady_clock::time_point deadline) {
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    pollfd p{raw.get(), POLLIN, 0};
+    if (left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
+      return false;
+    }
+    std::uint8_t buffer[65536];
+    const ssize_t n = ::recv(raw.get(), buffer, sizeof(buffer), 0);
+    if (n <= 0) {
+      eof = true;
+      return false;
+    }
+    decoder.append(buffer, static_cast<std::size_t>(n));
+    return true;
+  }
+};
+
+// Two real connections joined by a socket pair.
+struct ConnectedPair {
+  std::shared_ptr<SocketConnection> a;
+  std::shared_ptr<SocketConnection> b;
+
+  ConnectedPair() {
+    int fds[2];
+    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+    const PeerCredentials peer = *readPeerCredentials(fds[0]);
+    a = SocketConnection::adopt(file::UniqueFd(fds[0]), peer, Dictionary());
+    b = SocketConnection::adopt(file::UniqueFd(fds[1]), peer, Dictionary());
+  }
+  ~ConnectedPair() {
+    a->invalidate();
+    b->invalidate();
+  }
+};
+
+// The outcome of one Connection::call, waited for with a time-out.
+struct CallResult {
+  bool arrived = false;
+  std::optional<Dictionary> args;
+  std::optional<Error> error;
+};
+
+inline CallResult callAndWait(Connection& connection, const std::string& op, Dictionary args,
+                              std::chrono::milliseconds timeout = kWait) {
+  auto promise = std::make_shared<std::promise<CallResult>>();
+  auto future = promise->get_future();
+  connection.call(op, std::move(args), [promise](std::optional<Dictionary> a, std::optional<Error> e) {
+    promise->set_value(CallResult{true, std::move(a), std::move(e)});
+  });
+  if (future.wait_for(timeout) != std::future_status::ready) {
+    return CallResult{};
+  }
+  return future.get();
+}
+
+inline Data bytesOfText(const std::string& s) { return Data(s.begin(), s.end()); }
+
+// A frame whose body is exactly `body`.
+inline Data rawFrame(const Data& body) {
+  Data frame{static_cast<std::uint8_t>(body.size() >> 24), static_cast<std::uint8_t>(body.size() >> 16),
+             static_cast<std::uint8_t>(body.size() >> 8), static_cast<std::uint8_t>(body.size())};
+  frame.insert(frame.end(), body.begin(), body.end());
+  return frame;
+}
+
+inline Data concat(std::initializer_list<Data> parts) {
+  Data out;
+  for (const auto& p : parts) {
+    out.insert(out.end(), p.begin(), p.end());
+  }
+  return out;
+}
+
+}  // namespace zerith::ipc::test

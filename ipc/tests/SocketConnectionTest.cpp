@@ -1,0 +1,426 @@
+#include "ipc/SocketConnection.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <thread>
+
+#include "ipc/tests/IpcTestSupport.h"
+#include "platform/Log.h"
+
+namespace zerith::ipc::test {
+namespace {
+
+Data callFrame(const std::string& op, std::optional<std::uint64_t> call, Dictionary args = {}) {
+  return encodeCall(op, call, args);
+}
+
+std::string closingLine(const SocketConnection& c, const std::string& why) {
+  return c.description() + ": closing connection: " + why;
+}
+
+// ---- framing on the wire --------------------------------------------------------
+
+TEST(SocketConnectionFraming, CallSentOneByteAtATimeIsDeliveredWholeAndAnswered) {
+  RawPeer peer;
+  peer.write(callFrame("echo", 7, Dictionary{{"text", "hello"}, {"n", 3}}), 1);
+  const auto reply = peer.readMessage();
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(reply->kind, IncomingMessage::Kind::Reply);
+  EXPECT_EQ(reply->replyTo, 7u);
+  EXPECT_EQ(reply->replyArgs, (Dictionary{{"text", "hello"}, {"n", 3}}));
+  ASSERT_EQ(peer.object->calls().size(), 1u);
+  EXPECT_EQ(peer.object->calls()[0].operation, "echo");
+}
+
+TEST(SocketConnectionFraming, SeveralFramesInOneWriteArriveInOrder) {
+  RawPeer peer;
+  peer.write(concat({callFrame("a", std::nullopt), callFrame("b", 1), callFrame("c", std::nullopt)}));
+  ASSERT_TRUE(peer.object->received.waitFor(3));
+  const auto calls = peer.object->calls();
+  EXPECT_EQ(calls[0].operation, "a");
+  EXPECT_FALSE(calls[0].call);
+  EXPECT_EQ(calls[1].operation, "b");
+  EXPECT_EQ(calls[1].call, 1u);
+  EXPECT_EQ(calls[2].operation, "c");
+}
+
+struct BadInput {
+  const char* name;
+  Data bytes;
+  std::string why;
+};
+
+class SocketConnectionBadFrame : public ::testing::TestWithParam<int> {};
+
+std::vector<BadInput> badInputs() {
+  const Data xml = bytesOfText(plist::encodeXml(Value(Dictionary{{"op", "echo"}})));
+  return {
+      {"oversized length", Data{0x00, 0x40, 0x00, 0x01, 'b', 'p'}, "frame of 4194305 bytes exceeds the limit of 4194304"},
+      {"zero length", Data{0, 0, 0, 0}, "empty frame"},
+      {"not a property list", rawFrame(bytesOfText("hello, daemon")), "frame body is not a binary property list"},
+      {"XML body", rawFrame(xml), "frame body is not a binary property list"},
+      {"array message", rawFrame(plist::encodeBinary(Value(Array{Value("op")}))), "message is an array, not a dictionary"},
+      {"string op missing", rawFrame(plist::encodeBinary(Value(Dictionary{{"call", 1}}))),
+       "message has neither \"op\" nor \"reply\""},
+      {"numeric op", rawFrame(plist::encodeBinary(Value(Dictionary{{"op", 5}}))), "message \"op\" is an integer, not a string"},
+      {"negative call number", rawFrame(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"call", -1}}))),
+       "message \"call\" is not an unsigned integer"},
+      {"args not a dictionary", rawFrame(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"args", Array{}}}))),
+       "message \"args\" is an array, not a dictionary"},
+      {"truncated binary list", rawFrame(Data{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x08}), ""},
+  };
+}
+
+TEST_P(SocketConnectionBadFrame, ClosesThatConnectionWithAnErrorLogAndDeliversNothing) {
+  const BadInput input = badInputs()[static_cast<std::size_t>(GetParam())];
+  SCOPED_TRACE(input.name);
+  log::LogCapture capture;
+  RawPeer peer;
+  RawPeer bystander;
+  peer.write(input.bytes);
+  EXPECT_TRUE(peer.seesEof()) << "the connection stayed open";
+  ASSERT_TRUE(peer.invalidated.waitFor(1));
+  EXPECT_TRUE(peer.object->calls().empty());
+  if (!input.why.empty()) {
+    EXPECT_TRUE(capture.has(log::Level::Error, closingLine(*peer.connection, input.why)))
+        << "expected: " << closingLine(*peer.connection, input.why);
+  } else {
+    EXPECT_TRUE(capture.contains(peer.connection->description() + ": closing connection: frame body does not parse"));
+  }
+  // Another connection goes on.
+  bystander.write(callFrame("still-here", 1));
+  const auto reply = bystander.readMessage();
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(reply->replyTo, 1u);
+  EXPECT_EQ(bystander.invalidated.count(), 0);
+}
+
+INSTANTIATE_TEST_SUITE_P(Inputs, SocketConnectionBadFrame, ::testing::Range(0, 10));
+
+TEST(SocketConnectionFraming, CallsBeforeABadFrameAreDeliveredThoseAfterItAreNot) {
+  log::LogCapture capture;
+  RawPeer peer;
+  peer.write(concat({callFrame("first", 1), Data{0, 0, 0, 0}, callFrame("after", 2)}));
+  EXPECT_TRUE(peer.seesEof());
+  ASSERT_TRUE(peer.invalidated.waitFor(1));
+  const auto calls = peer.object->calls();
+  ASSERT_EQ(calls.size(), 1u);
+  EXPECT_EQ(calls[0].operation, "first");
+}
+
+TEST(SocketConnectionFraming, PeerEndingInsideAFrameIsLoggedAndInvalidatesOnce) {
+  log::LogCapture capture;
+  RawPeer peer;
+  Data frame = callFrame("cut", 1);
+  frame.resize(frame.size() - 3);
+  peer.write(frame);
+  peer.closeWrite();
+  ASSERT_TRUE(peer.invalidated.waitFor(1));
+  EXPECT_TRUE(capture.has(log::Level::Error,
+                          closingLine(*peer.connection, "it ended inside a frame (" + std::to_string(frame.size()) +
+                                                            " bytes unread)")));
+  EXPECT_TRUE(peer.object->calls().empty());
+}
+
+TEST(SocketConnectionFraming, ABodyJustUnderTheLimitPassesAndTheConnectionWritesLargeReplies) {
+  // 3 MiB through a socket whose buffer is far smaller: the reply goes out
+  // through the outbox as the peer reads.
+  RawPeer peer;
+  Dictionary args{{"blob", Value(Data(3u << 20, 0x5a))}};
+  peer.write(callFrame("big", 9, args));
+  const auto reply = peer.readMessage();
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(reply->replyArgs, args);
+}
+
+TEST(SocketConnectionFraming, AReplyWithAnUnknownCallNumberIsLoggedAndTheConnectionGoesOn) {
+  log::LogCapture capture;
+  RawPeer peer;
+  peer.write(encodeReply(4242, Dictionary{}));
+  peer.write(callFrame("after", 1));
+  ASSERT_TRUE(peer.readMessage());
+  EXPECT_TRUE(capture.has(log::Level::Error, peer.connection->description() + ": reply to unknown call 4242"));
+  EXPECT_EQ(peer.invalidated.count(), 0);
+}
+
+TEST(SocketConnectionFraming, ACallWithoutAnExportedObjectGetsAnErrorReply) {
+  log::LogCapture capture;
+  RawPeer peer;
+  peer.connection->setExportedObject(nullptr);
+  peer.write(callFrame("anything", 3));
+  const auto reply = peer.readMessage();
+  ASSERT_TRUE(reply);
+  ASSERT_TRUE(reply->replyError);
+  EXPECT_EQ(*reply->replyError, (Error{kErrorDomain, -1, "No object is exported on this connection"}));
+  EXPECT_TRUE(capture.has(log::Level::Error, peer.connection->description() + ": no object is exported for \"anything\""));
+}
+
+// ---- calls, replies and writers ---------------------------------------------------
+
+TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
+  ConnectedPair pair;
+  // The answering side keeps every reply and sends them back in reverse.
+  auto object = std::make_shared<RecordingObject>();
+  std::mutex held;
+  std::vector<std::pair<Message, std::shared_ptr<Reply>>> waiting;
+  constexpr int kThreads = 8;
+  constexpr int kCalls = 25;
+  object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
+    std::lock_guard lock(held);
+    waiting.emplace_back(m, std::move(r));
+    if (waiting.size() == kThreads * kCalls) {
+      for (auto it = waiting.rbegin(); it != waiting.rend(); ++it) {
+        it->second->send(Dictionary{{"caller", it->first.args.get("caller")}, {"n", it->first.args.get("n")}});
+      }
+    }
+  };
+  pair.b->setExportedObject(object);
+  pair.a->resume();
+  pair.b->resume();
+
+  std::atomic<int> matched{0};
+  std::atomic<int> wrong{0};
+  Counter done;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int n = 0; n < kCalls; ++n) {
+        pair.a->call("work", Dictionary{{"caller", t}, {"n", n}}, [&, t, n](std::optional<Dictionary> args, std::optional<Error>) {
+          if (args && args->get("caller").intValue() == t && args->get("n").intValue() == n) {
+            ++matched;
+          } else {
+            ++wrong;
+          }
+          done.hit();
+        });
+      }
+    });
+  }
+  for (auto& th : threads) {
+    th.join();
+  }
+  ASSERT_TRUE(done.waitFor(kThreads * kCalls));
+  EXPECT_EQ(matched, kThreads * kCalls);
+  EXPECT_EQ(wrong, 0);
+}
+
+TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
+  RawPeer peer;
+  constexpr int kThreads = 6;
+  constexpr int kFrames = 40;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int n = 0; n < kFrames; ++n) {
+        // Sizes vary so that partial writes land mid-frame.
+        peer.connection->send("note", Dictionary{{"t", t}, {"n", n}, {"pad", Value(Data(static_cast<std::size_t>(n * 997 % 20000), 1))}});
+      }
+    });
+  }
+  std::vector<int> next(kThreads, 0);
+  for (int i = 0; i < kThreads * kFrames; ++i) {
+    const auto message = peer.readMessage();
+    ASSERT_TRUE(message) << "frame " << i << " missing or garbled";
+    const auto t = message->call.args.get("t").intValue();
+    ASSERT_GE(t, 0);
+    ASSERT_LT(t, kThreads);
+    EXPECT_EQ(message->call.args.get("n").intValue(), next[static_cast<std::size_t>(t)]++) << "writer " << t << " out of order";
+  }
+  for (auto& th : threads) {
+    th.join();
+  }
+}
+
+TEST(SocketConnectionCalls, PendingCallsFailWhenThePeerGoesAway) {
+  RawPeer peer;
+  auto promise = std::make_shared<std::promise<CallResult>>();
+  auto future = promise->get_future();
+  peer.connection->call("never-answered", Dictionary{}, [promise](std::optional<Dictionary> a, std::optional<Error> e) {
+    promise->set_value(CallResult{true, std::move(a), std::move(e)});
+  });
+  ASSERT_TRUE(peer.readMessage());  // the call went out
+  peer.raw.reset();                 // the peer disconnects mid-call
+  ASSERT_EQ(future.wait_for(kWait), std::future_status::ready);
+  const auto result = future.get();
+  EXPECT_FALSE(result.args);
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(*result.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
+  EXPECT_TRUE(peer.invalidated.waitFor(1));
+}
+
+TEST(SocketConnectionCalls, ACallMadeAfterInvalidationFailsInsteadOfWaitingForever) {
+  RawPeer peer;
+  peer.connection->invalidate();
+  ASSERT_TRUE(peer.invalidated.waitFor(1));
+  const auto result = callAndWait(*peer.connection, "late", Dictionary{});
+  ASSERT_TRUE(result.arrived);
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(result.error->description, "The connection was invalidated");
+}
+
+TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
+  ConnectedPair pair;
+  auto object = std::make_shared<RecordingObject>();
+  object->answer = [](const Message&, std::shared_ptr<Reply> r) {
+    r->fail(Error{"test.domain", 12, "no such thing"});
+    r->send(Dictionary{{"late", true}});  // a second answer is dropped
+  };
+  pair.b->setExportedObject(object);
+  pair.a->resume();
+  pair.b->resume();
+  const auto first = callAndWait(*pair.a, "x", Dictionary{});
+  ASSERT_TRUE(first.error);
+  EXPECT_EQ(*first.error, (Error{"test.domain", 12, "no such thing"}));
+  // The dropped second answer did not turn into a reply for the next call.
+  object->answer = [](const Message&, std::shared_ptr<Reply> r) { r->send(Dictionary{{"ok", true}}); };
+  const auto second = callAndWait(*pair.a, "y", Dictionary{});
+  ASSERT_TRUE(second.args);
+  EXPECT_EQ(*second.args, (Dictionary{{"ok", true}}));
+}
+
+// ---- ordering, queue and invalidation -------------------------------------------
+
+TEST(SocketConnectionDelivery, CallsRunInOrderOnTheConnectionsQueueOneAtATime) {
+  RawPeer peer;
+  std::atomic<int> inside{0};
+  std::atomic<bool> overlapped{false};
+  std::atomic<bool> offQueue{false};
+  peer.object->answer = [&](const Message&, std::shared_ptr<Reply>) {
+    if (++inside > 1) {
+      overlapped = true;
+    }
+    if (!peer.connection->queue().isCurrent()) {
+      offQueue = true;
+    }
+    std::this_thread::yield();
+    --inside;
+  };
+  Data all;
+  for (int n = 0; n < 200; ++n) {
+    const Data f = callFrame("n" + std::to_string(n), std::nullopt);
+    all.insert(all.end(), f.begin(), f.end());
+  }
+  peer.write(all, 333);
+  ASSERT_TRUE(peer.object->received.waitFor(200));
+  const auto calls = peer.object->calls();
+  for (int n = 0; n < 200; ++n) {
+    EXPECT_EQ(calls[static_cast<std::size_t>(n)].operation, "n" + std::to_string(n));
+  }
+  EXPECT_FALSE(overlapped);
+  EXPECT_FALSE(offQueue);
+}
+
+TEST(SocketConnectionDelivery, InvalidationHandlerRunsExactlyOnceWhenEofAndInvalidateRace) {
+  for (int round = 0; round < 20; ++round) {
+    RawPeer peer;
+    std::atomic<bool> onQueue{true};
+    peer.connection->setInvalidationHandler([&] {
+      onQueue = onQueue && peer.connection->queue().isCurrent();
+      peer.invalidated.hit();
+    });
+    std::thread closer([&] { peer.raw.reset(); });
+    std::vector<std::thread> invalidators;
+    for (int i = 0; i < 4; ++i) {
+      invalidators.emplace_back([&] { peer.connection->invalidate(); });
+    }
+    closer.join();
+    for (auto& t : invalidators) {
+      t.join();
+    }
+    ASSERT_TRUE(peer.invalidated.waitFor(1));
+    // Give a wrong second run every chance to show up.
+    peer.connection->queue().sync([] {});
+    EXPECT_EQ(peer.invalidated.count(), 1);
+    EXPECT_TRUE(onQueue);
+    peer.connection.reset();
+  }
+}
+
+TEST(SocketConnectionDelivery, InterruptionHandlerIsNeverCalled) {
+  Counter interrupted;
+  {
+    RawPeer peer;
+    peer.connection->setInterruptionHandler([&] { interrupted.hit(); });
+    peer.write(callFrame("x", 1));
+    ASSERT_TRUE(peer.readMessage());
+    peer.raw.reset();
+    ASSERT_TRUE(peer.invalidated.waitFor(1));
+  }
+  EXPECT_EQ(interrupted.count(), 0);
+}
+
+TEST(SocketConnectionDelivery, NothingIsDeliveredBeforeResume) {
+  int fds[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+  file::UniqueFd raw(fds[1]);
+  auto connection = SocketConnection::adopt(file::UniqueFd(fds[0]), *readPeerCredentials(fds[0]), Dictionary());
+  auto object = std::make_shared<RecordingObject>();
+  connection->setExportedObject(object);
+  const Data frame = callFrame("early", std::nullopt);
+  ASSERT_EQ(::send(raw.get(), frame.data(), frame.size(), 0), static_cast<ssize_t>(frame.size()));
+  EXPECT_FALSE(object->received.waitFor(1, 100ms));
+  connection->resume();
+  EXPECT_TRUE(object->received.waitFor(1));
+  connection->invalidate();
+}
+
+TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHandler) {
+  std::weak_ptr<RecordingObject> weak;
+  Counter handlerSawObject;
+  {
+    RawPeer peer;
+    weak = peer.object;
+    peer.connection->setInvalidationHandler([&] {
+      if (!weak.expired()) {
+        handlerSawObject.hit();
+      }
+      peer.invalidated.hit();
+    });
+    peer.object.reset();
+    peer.raw.reset();
+    ASSERT_TRUE(peer.invalidated.waitFor(1));
+    peer.connection->queue().sync([] {});
+    EXPECT_TRUE(weak.expired()) << "the connection still holds its exported object";
+  }
+  EXPECT_EQ(handlerSawObject.count(), 1);
+}
+
+// ---- identity ---------------------------------------------------------------------
+
+TEST(SocketConnectionIdentity, PeerCredentialsComeFromTheSocket) {
+  int fds[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+  file::UniqueFd a(fds[0]);
+  file::UniqueFd b(fds[1]);
+  const auto peer = readPeerCredentials(a.get());
+  ASSERT_TRUE(peer);
+  EXPECT_EQ(peer->pid, ::getpid());
+  EXPECT_EQ(peer->uid, ::getuid());
+  EXPECT_EQ(peer->gid, ::getgid());
+  std::vector<gid_t> groups(static_cast<std::size_t>(::getgroups(0, nullptr)));
+  groups.resize(static_cast<std::size_t>(::getgroups(static_cast<int>(groups.size()), groups.data())));
+  std::sort(groups.begin(), groups.end());
+  auto got = peer->groups;
+  std::sort(got.begin(), got.end());
+  EXPECT_EQ(got, groups);
+}
+
+TEST(SocketConnectionIdentity, DescriptionNamesPidUidAndDescriptor) {
+  RawPeer peer;
+  const auto& p = peer.connection->peer();
+  const std::string text = peer.connection->description();
+  EXPECT_EQ(text.rfind("<connection pid=" + std::to_string(p.pid) + " uid=" + std::to_string(p.uid) + " fd=", 0), 0u) << text;
+  EXPECT_EQ(text.back(), '>');
+}
+
+TEST(SocketConnectionIdentity, ConnectingToNothingFailsWithAClearError) {
+  Error error;
+  EXPECT_EQ(SocketConnection::connect("/nonexistent-zerith/socket", &error), nullptr);
+  EXPECT_EQ(error.domain, kErrorDomain);
+  EXPECT_EQ(error.description, "Cannot connect to /nonexistent-zerith/socket: No such file or directory");
+}
+
+}  // namespace
+}  // namespace zerith::ipc::test
