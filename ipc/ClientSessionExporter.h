@@ -1,0 +1,39 @@
+#pragma once
+
+// The daemon's side of the client interface: turns incoming calls into
+// ClientSessionInterface calls on a session, after checking every argument's
+// type, and sends the completions back as replies.
+//
+// An unknown operation or an argument of the wrong type is logged at error
+// level and, when the caller asked for a reply, answered with an error reply
+// (kZerithErrorDomain, code -1); the session is not called and the
+// connection goes on. A completion is passed to the session only when the
+// caller asked for a reply (otherwise the session gets an empty one, which
+// it may skip). Operations without a completion answer an empty reply once
+// the session has taken the call, when one was asked for.
+
+#include <memory>
+#include <string>
+
+#include "ipc/ClientSessionInterface.h"
+#include "ipc/Connection.h"
+#include "platform/Log.h"
+
+namespace zerith::ipc {
+
+class ClientSessionExporter final : public ExportedObject {
+ public:
+  // `peer` names the connection in log lines (Connection::description()).
+  explicit ClientSessionExporter(std::shared_ptr<ClientSessionInterface> session, std::string peer = {});
+
+  void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override;
+
+  const std::shared_ptr<ClientSessionInterface>& session() const { return session_; }
+
+ private:
+  std::shared_ptr<ClientSessionInterface> session_;
+  std::string peer_;
+  log::Logger log_{"ipc"};
+};
+
+}  // namespace zerith::ipc

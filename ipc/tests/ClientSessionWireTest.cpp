@@ -1,0 +1,268 @@
+#include <gtest/gtest.h>
+
+#include <future>
+#include <thread>
+
+#include "ipc/ClientSessionExporter.h"
+#include "ipc/ClientSessionProxy.h"
+#include "ipc/ClientSessionReplyExporter.h"
+#include "ipc/ClientSessionReplyProxy.h"
+#include "ipc/ClientSessionWire.h"
+#include "ipc/tests/IpcTestSupport.h"
+#include "ipc/tests/RecordingSession.h"
+#include "platform/Log.h"
+
+namespace zerith::ipc::test {
+namespace {
+
+// A client proxy on one end of a real connection, the exporter and a
+// recording session on the other; the reply direction the other way round.
+struct SessionLink {
+  ConnectedPair pair;
+  std::shared_ptr<RecordingSession> session = std::make_shared<RecordingSession>();
+  std::shared_ptr<RecordingReplyTarget> client = std::make_shared<RecordingReplyTarget>();
+  ClientSessionProxy proxy{pair.a};
+  ClientSessionReplyProxy toClient{pair.b};
+
+  SessionLink() {
+    pair.a->setExportedObject(std::make_shared<ClientSessionReplyExporter>(client));
+    pair.b->setExportedObject(std::make_shared<ClientSessionExporter>(session, pair.b->description()));
+    pair.a->resume();
+    pair.b->resume();
+  }
+};
+
+template <typename T>
+T wait(std::future<T>& f) {
+  EXPECT_EQ(f.wait_for(kWait), std::future_status::ready) << "no completion";
+  return f.get();
+}
+
+TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) {
+  SessionLink link;
+  const Value sessionInfo(Dictionary{{"sessionID", 3}, {"clientType", 7}});
+  const Value userInfo(Dictionary{{"clientName", "mail"}});
+  const Value frameworks(Array{Value("Foo")});
+  const Value message(Dictionary{{"category", 1}, {"type", 2}, {"payload", Dictionary{{"k", "v"}}}});
+  const Value payload(Dictionary{{"p", 1.5}});
+
+  link.proxy.setSessionInfo(sessionInfo, userInfo, frameworks, true);
+
+  std::promise<Value> started, states, url, sent, oneShot;
+  std::promise<std::pair<Value, std::optional<Error>>> flushed;
+  std::promise<bool> uploaded;
+  std::promise<std::pair<bool, std::optional<Error>>> logUploaded;
+  link.proxy.startConfigWithCompletionHandler([&](Value v) { started.set_value(v); });
+  link.proxy.fetchStatesWithUserInfo(userInfo, [&](Value v) { states.set_value(v); });
+  link.proxy.fetchDisplayURL([&](Value v) { url.set_value(v); });
+  link.proxy.sendMessageWithDictionary(message, [&](Value v) { sent.set_value(v); });
+  link.proxy.flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
+  link.proxy.finishSessionGracefully();
+  link.proxy.uploadFileAtPath(Value("file:///tmp/x.log"), Value("token"), [&](bool ok) { uploaded.set_value(ok); });
+  link.proxy.uploadLogData(Value(Array{Value("line")}), [&](bool ok, std::optional<Error> e) { logUploaded.set_value({ok, e}); });
+  link.proxy.sendMessageWithSessionInfo(sessionInfo, userInfo, 65535, 9, payload, [&](Value v) { oneShot.set_value(v); });
+  link.proxy.updateSharedDataWithDictionary(Value(Dictionary{{"shared", 1}}));
+  link.proxy.updateSharedDataForKey(Value("key"), Value(Array{Value(1)}));
+  link.proxy.setDigestKey(Value(Data{1, 2, 3}), -7);
+
+  auto f1 = started.get_future();
+  auto f2 = states.get_future();
+  auto f3 = url.get_future();
+  auto f4 = sent.get_future();
+  auto f5 = flushed.get_future();
+  auto f6 = uploaded.get_future();
+  auto f7 = logUploaded.get_future();
+  auto f8 = oneShot.get_future();
+  EXPECT_EQ(wait(f1), link.session->backends);
+  EXPECT_EQ(wait(f2), link.session->backends);
+  EXPECT_EQ(wait(f3), Value("https://display.example/session"));
+  EXPECT_EQ(wait(f4), Value("sent"));
+  const auto flush = wait(f5);
+  EXPECT_EQ(flush.first, Value("flushed"));
+  EXPECT_FALSE(flush.second);
+  EXPECT_TRUE(wait(f6));
+  const auto logUpload = wait(f7);
+  EXPECT_FALSE(logUpload.first);
+  EXPECT_EQ(logUpload.second, (Error{"com.velmar.zerith.ErrorDomain", -1, "no upload backend"}));
+  EXPECT_EQ(wait(f8), Value("one-shot"));
+
+  ASSERT_TRUE(link.session->log.waitFor(13));
+  const auto calls = link.session->log.calls();
+  const std::vector<std::pair<std::string, Dictionary>> expected = {
+      {"setSessionInfo", {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"frameworksToCheck", frameworks},
+                          {"hasAggregationBlock", true}}},
+      {"startConfig", {}},
+      {"fetchStates", {{"userInfo", userInfo}}},
+      {"fetchDisplayURL", {}},
+      {"sendMessage", {{"message", message}}},
+      {"flushMessages", {}},
+      {"finishSession", {}},
+      {"uploadFile", {{"fileURL", "file:///tmp/x.log"}, {"extensionToken", "token"}}},
+      {"uploadLogData", {{"logData", Array{Value("line")}}}},
+      {"sendMessageWithSessionInfo", {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"category", 65535u},
+                                      {"type", 9u}, {"payload", payload}}},
+      {"updateSharedData", {{"dictionary", Dictionary{{"shared", 1}}}}},
+      {"updateSharedDataForKey", {{"key", "key"}, {"value", Array{Value(1)}}}},
+      {"setDigestKey", {{"digestKey", Data{1, 2, 3}}, {"algorithm", -7}}},
+  };
+  ASSERT_EQ(calls.size(), expected.size());
+  for (std::size_t i = 0; i < expected.size(); ++i) {
+    EXPECT_EQ(calls[i].operation, expected[i].first);
+    EXPECT_EQ(Value(calls[i].args), Value(expected[i].second)) << expected[i].first << ": " << Value(calls[i].args).description();
+  }
+
+  link.toClient.sendMessageToClient(Value(Dictionary{{"m", 1}}), 1234.5, 3, 4, Value(Dictionary{{"x", "y"}}));
+  ASSERT_TRUE(link.client->log.waitFor(1));
+  EXPECT_EQ(Value(link.client->log.calls()[0].args),
+            Value(Dictionary{{"message", Dictionary{{"m", 1}}}, {"timestamp", 1234.5}, {"category", 3u}, {"type", 4u},
+                             {"payload", Dictionary{{"x", "y"}}}}));
+}
+
+TEST(ClientSessionWire, NilArgumentsArriveAsNilAndBooleanDefaultsToFalse) {
+  SessionLink link;
+  link.proxy.setSessionInfo(Value(), Value(), Value(), false);
+  link.proxy.fetchStatesWithUserInfo(Value(), nullptr);
+  ASSERT_TRUE(link.session->log.waitFor(2));
+  const auto calls = link.session->log.calls();
+  EXPECT_EQ(Value(calls[0].args), Value(Dictionary{{"sessionInfo", Value()}, {"userInfo", Value()},
+                                                   {"frameworksToCheck", Value()}, {"hasAggregationBlock", false}}));
+  // No completion asked for: the session gets none and nothing is answered.
+  EXPECT_FALSE(calls[1].hasCompletion);
+}
+
+TEST(ClientSessionWire, FailedCallsCompleteWithNilFalseAndTheError) {
+  SessionLink link;
+  link.session->answer = false;
+  std::promise<Value> url;
+  std::promise<std::pair<Value, std::optional<Error>>> flushed;
+  std::promise<bool> uploaded;
+  link.proxy.fetchDisplayURL([&](Value v) { url.set_value(v); });
+  link.proxy.flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
+  link.proxy.uploadFileAtPath(Value("/x"), Value(), [&](bool ok) { uploaded.set_value(ok); });
+  ASSERT_TRUE(link.session->log.waitFor(3));
+  link.pair.b->invalidate();  // the daemon end goes away mid-call
+  auto f1 = url.get_future();
+  auto f2 = flushed.get_future();
+  auto f3 = uploaded.get_future();
+  EXPECT_EQ(wait(f1), Value());
+  const auto flush = wait(f2);
+  EXPECT_EQ(flush.first, Value());
+  EXPECT_EQ(flush.second, (Error{kErrorDomain, -1, "The connection was invalidated"}));
+  EXPECT_FALSE(wait(f3));
+  // The session answering late, after its client is gone, harms nothing.
+  for (auto& late : link.session->takeHeld()) {
+    late();
+  }
+}
+
+TEST(ClientSessionWire, ACompletionCalledLaterFromAnotherThreadStillReachesTheClient) {
+  SessionLink link;
+  link.session->answer = false;
+  std::promise<Value> url;
+  link.proxy.fetchDisplayURL([&](Value v) { url.set_value(v); });
+  ASSERT_TRUE(link.session->log.waitFor(1));
+  std::thread([&] {
+    for (auto& late : link.session->takeHeld()) {
+      late();
+    }
+  }).join();
+  auto f = url.get_future();
+  EXPECT_EQ(wait(f), Value("https://display.example/session"));
+}
+
+TEST(ClientSessionWire, OperationsWithoutCompletionAnswerAnEmptyReplyOnceTheSessionHasTheCall) {
+  SessionLink link;
+  const auto result = callAndWait(*link.pair.a, wire::kFinishSession, Dictionary{});
+  ASSERT_TRUE(result.args);
+  EXPECT_TRUE(result.args->empty());
+  EXPECT_EQ(link.session->log.size(), 1u);
+}
+
+TEST(ClientSessionWireRefusal, UnknownOperationIsLoggedAnsweredWithAnErrorAndTheConnectionGoesOn) {
+  log::LogCapture capture;
+  SessionLink link;
+  const auto result = callAndWait(*link.pair.a, "bogus:", Dictionary{});
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(*result.error, (Error{"com.velmar.zerith.ErrorDomain", -1, "Unknown operation \"bogus:\""}));
+  EXPECT_TRUE(capture.has(log::Level::Error,
+                          "ClientSessionExporter: Unknown operation \"bogus:\" from " + link.pair.b->description()));
+  // Without a call number there is nothing to answer, but it is still logged.
+  link.pair.a->send("silent:", Dictionary{});
+  std::promise<Value> url;
+  link.proxy.fetchDisplayURL([&](Value v) { url.set_value(v); });
+  auto f = url.get_future();
+  EXPECT_EQ(wait(f), Value("https://display.example/session"));
+  EXPECT_EQ(capture.count("Unknown operation \"silent:\""), 1u);
+  EXPECT_EQ(link.session->log.size(), 1u);
+}
+
+struct WrongArgs {
+  const char* op;
+  Dictionary args;
+  std::string description;
+};
+
+TEST(ClientSessionWireRefusal, WrongArgumentTypesAreRefusedBeforeTheSessionSeesThem) {
+  const std::string oneShot = wire::kSendMessageWithSessionInfo;
+  const std::vector<WrongArgs> cases = {
+      {wire::kSetSessionInfo, {{"sessionInfo", "not a dict"}},
+       "Argument \"sessionInfo\" of setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock: must be a dictionary, not a string"},
+      {wire::kSetSessionInfo, {{"hasAggregationBlock", 1}},
+       "Argument \"hasAggregationBlock\" of setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock: must be a boolean, not 1"},
+      {wire::kSetSessionInfo, {{"frameworksToCheck", Dictionary{}}},
+       "Argument \"frameworksToCheck\" of setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock: must be an array, not a dictionary"},
+      {wire::kSendMessageWithSessionInfo, {{"category", 65536}, {"type", 1}},
+       "Argument \"category\" of " + oneShot + " must be an unsigned 16-bit integer, not 65536"},
+      {wire::kSendMessageWithSessionInfo, {{"category", -1}, {"type", 1}},
+       "Argument \"category\" of " + oneShot + " must be an unsigned 16-bit integer, not -1"},
+      {wire::kSendMessageWithSessionInfo, {{"category", 1}},
+       "Argument \"type\" of " + oneShot + " must be an unsigned 16-bit integer, not nil"},
+      {wire::kSendMessageWithSessionInfo, {{"category", 1.0}, {"type", 1}},
+       "Argument \"category\" of " + oneShot + " must be an unsigned 16-bit integer, not a real"},
+      {wire::kSetDigestKey, {{"digestKey", "secret"}, {"algorithm", 1}},
+       "Argument \"digestKey\" of setDigestKey:algorithm: must be data, not a string"},
+      {wire::kSetDigestKey, {{"algorithm", 2147483648LL}},
+       "Argument \"algorithm\" of setDigestKey:algorithm: must be a signed 32-bit integer, not 2147483648"},
+      {wire::kUploadFile, {}, "Argument \"fileURL\" of uploadFileAtPath:extensionToken:completionHandler: must be a string, not nil"},
+      {wire::kUpdateSharedDataForKey, {{"key", 5}}, "Argument \"key\" of updateSharedDataForKey:value: must be a string, not 5"},
+      {wire::kSendMessage, {{"message", Array{}}}, "Argument \"message\" of sendMessageWithDictionary:reply: must be a dictionary, not an array"},
+  };
+  log::LogCapture capture;
+  SessionLink link;
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.description);
+    const auto result = callAndWait(*link.pair.a, c.op, c.args);
+    ASSERT_TRUE(result.error) << "accepted";
+    EXPECT_EQ(*result.error, (Error{"com.velmar.zerith.ErrorDomain", -1, c.description}));
+    EXPECT_TRUE(capture.has(log::Level::Error, "ClientSessionExporter: " + c.description + " from " + link.pair.b->description()));
+  }
+  EXPECT_EQ(link.session->log.size(), 0u);
+  // Edge values that are right pass.
+  EXPECT_TRUE(callAndWait(*link.pair.a, wire::kSetDigestKey, {{"algorithm", -2147483648LL}}).args);
+  EXPECT_TRUE(callAndWait(*link.pair.a, wire::kSendMessageWithSessionInfo, {{"category", 0}, {"type", 65535}}).args);
+  EXPECT_EQ(link.session->log.size(), 2u);
+}
+
+TEST(ClientSessionWireRefusal, TheClientRefusesMalformedMessagesFromTheDaemon) {
+  log::LogCapture capture;
+  SessionLink link;
+  const auto result = callAndWait(*link.pair.b, wire::kSendMessageToClient, {{"timestamp", 1.0}, {"category", "x"}, {"type", 1}});
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(result.error->description,
+            "Argument \"category\" of sendMessageToClient:timestamp:category:type:payload: must be an unsigned 16-bit integer, not a string");
+  const auto unknown = callAndWait(*link.pair.b, "other:", {});
+  ASSERT_TRUE(unknown.error);
+  EXPECT_TRUE(capture.has(log::Level::Error, "ClientSessionReplyExporter: Unknown operation \"other:\""));
+  EXPECT_EQ(link.client->log.size(), 0u);
+}
+
+TEST(ClientSessionWireTable, ThirteenSessionOperationsEachKnownByName) {
+  EXPECT_EQ(wire::sessionOperations().size(), 13u);
+  for (const auto& op : wire::sessionOperations()) {
+    EXPECT_EQ(wire::sessionOperation(op.name), &op);
+  }
+  EXPECT_EQ(wire::sessionOperation("sendMessageToClient:timestamp:category:type:payload:"), nullptr);
+}
+
+}  // namespace
+}  // namespace zerith::ipc::test
