@@ -1,0 +1,270 @@
+#include "config/StorebagVerify.h"
+
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/rsa.h>
+#include <openssl/x509.h>
+
+#include <memory>
+
+#include "config/tests/StorebagTestFixture.h"
+#include "platform/Crypto.h"
+
+namespace zerith {
+namespace {
+
+using log::Level;
+using test::bytes;
+using test::sampleStorebag;
+using test::signedContainer;
+using test::storebagKeys;
+using test::text;
+
+// The container's fields, to tamper with.
+Value containerFields(const Data& container) { return *plist::decode(plist::bytesOf(container)); }
+Data encode(const Value& container) { return plist::encodeBinary(container); }
+
+struct PkeyFree {
+  void operator()(EVP_PKEY* k) const { EVP_PKEY_free(k); }
+};
+using PkeyPtr = std::unique_ptr<EVP_PKEY, PkeyFree>;
+
+PkeyPtr privateKey(const std::string& pem) {
+  std::unique_ptr<BIO, decltype(&BIO_free)> bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())), BIO_free);
+  return PkeyPtr(PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, nullptr));
+}
+
+// A signature made over a precomputed digest with the low-level signing
+// call, as another signer would make it: `md` names the digest algorithm.
+Data signDigest(const Data& bag, const EVP_MD* md) {
+  auto key = privateKey(storebagKeys().privateKeyPEM);
+  unsigned char digest[EVP_MAX_MD_SIZE];
+  unsigned int digestLength = 0;
+  EVP_Digest(bag.data(), bag.size(), digest, &digestLength, md, nullptr);
+  std::unique_ptr<EVP_PKEY_CTX, decltype(&EVP_PKEY_CTX_free)> ctx(EVP_PKEY_CTX_new(key.get(), nullptr),
+                                                                   EVP_PKEY_CTX_free);
+  EVP_PKEY_sign_init(ctx.get());
+  EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING);
+  EVP_PKEY_CTX_set_signature_md(ctx.get(), md);
+  std::size_t length = 0;
+  EVP_PKEY_sign(ctx.get(), nullptr, &length, digest, digestLength);
+  Data signature(length);
+  EVP_PKEY_sign(ctx.get(), signature.data(), &length, digest, digestLength);
+  signature.resize(length);
+  return signature;
+}
+
+class StorebagVerifyTest : public test::StorebagTest {
+ protected:
+  Value verify(const Data& container, bool save = false) { return parseAndVerifyStorebag("ambrel", container, save); }
+  bool onlyError(const std::string& line) const {
+    std::size_t errors = 0;
+    for (const auto& l : logs_.lines()) {
+      errors += l.level == Level::Error ? 1 : 0;
+    }
+    return errors == 1 && logs_.has(Level::Error, line);
+  }
+};
+
+TEST_F(StorebagVerifyTest, SignedContainerYieldsTheStorebagInBinaryAndXmlForm) {
+  const Data container = signedContainer(sampleStorebag());
+  EXPECT_EQ(verify(container), sampleStorebag());
+  const std::string xml = plist::encodeXml(containerFields(container));
+  EXPECT_EQ(verify(bytes(xml)), sampleStorebag());
+  EXPECT_FALSE(logs_.contains("fetchStorebagWithName"));
+}
+
+TEST_F(StorebagVerifyTest, Base64WithLineBreaksAndForeignCharactersStillVerifies) {
+  const Value fields = containerFields(signedContainer(sampleStorebag()));
+  auto scatter = [](const std::string& b64) {
+    std::string out;
+    for (std::size_t i = 0; i < b64.size(); ++i) {
+      out += b64[i];
+      if (i % 60 == 59) out += "\r\n";
+      if (i % 97 == 13) out += " *\xc3\xa9";
+    }
+    return out;
+  };
+  const Value scattered(Dictionary{{"signature", scatter(*fields["signature"].string())},
+                                   {"bag", scatter(*fields["bag"].string())}});
+  EXPECT_EQ(verify(encode(scattered)), sampleStorebag());
+}
+
+TEST_F(StorebagVerifyTest, SignatureOfAPrecomputedSha1DigestVerifiesAndSha256DoesNot) {
+  const Data bag = plist::encodeBinary(sampleStorebag());
+  EXPECT_EQ(verify(encode(makeStorebagContainer(signDigest(bag, EVP_sha1()), bag))), sampleStorebag());
+  EXPECT_TRUE(verify(encode(makeStorebagContainer(signDigest(bag, EVP_sha256()), bag))).isNil());
+  EXPECT_TRUE(logs_.contains("fetchStorebagWithName: Signature can not be verified, 0x"));
+}
+
+TEST_F(StorebagVerifyTest, WhatIsNotAPropertyListIsRefusedAsMissingSignature) {
+  for (const std::string& junk : {std::string(), std::string("not a property list"), std::string("bplist00\x01\x02", 10)}) {
+    logs_.clear();
+    EXPECT_TRUE(verify(bytes(junk)).isNil());
+    EXPECT_EQ(logs_.count("fetchStorebagWithName: propertyListWithData error "), 1u) << junk;
+    EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagWithName: Signature is missing"));
+  }
+}
+
+TEST_F(StorebagVerifyTest, OversizedOrDeeplyNestedContainerNeverReachesTheParser) {
+  // Five megabytes of text, and a container nested far deeper than any
+  // storebag.
+  const Value fields = containerFields(signedContainer(sampleStorebag()));
+  const Value huge(Dictionary{{"signature", *fields["signature"].string()},
+                              {"bag", *fields["bag"].string()},
+                              {"padding", std::string(5u << 20, 'A')}});
+  std::string nested = "<?xml version=\"1.0\" encoding=\"UTF-8\"?><plist version=\"1.0\">";
+  for (int i = 0; i < 200; ++i) nested += "<array>";
+  for (int i = 0; i < 200; ++i) nested += "</array>";
+  nested += "</plist>";
+  const std::pair<Data, std::string> cases[] = {{encode(huge), "exceeds the limit of 4194304"},
+                                                {bytes(nested), "nesting deeper than 8"}};
+  for (const auto& [container, why] : cases) {
+    logs_.clear();
+    EXPECT_TRUE(verify(container, true).isNil());
+    EXPECT_TRUE(logs_.contains("fetchStorebagWithName: propertyListWithData error ")) << why;
+    EXPECT_TRUE(logs_.contains(why));
+    EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagWithName: Signature is missing"));
+  }
+  EXPECT_FALSE(cached("ambrel"));
+}
+
+TEST_F(StorebagVerifyTest, ContainerWithoutSignatureStringIsRefused) {
+  const Value fields = containerFields(signedContainer(sampleStorebag()));
+  EXPECT_TRUE(verify(encode(test::withoutKey(fields, "signature"))).isNil());
+  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature is missing"));
+  logs_.clear();
+  // A signature as data instead of base64 text is no signature either.
+  EXPECT_TRUE(verify(encode(test::withEntry(fields, "signature", Data{1, 2, 3}))).isNil());
+  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature is missing"));
+  logs_.clear();
+  EXPECT_TRUE(verify(encode(Value(Array{fields}))).isNil());  // root is not a dictionary
+  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature is missing"));
+}
+
+TEST_F(StorebagVerifyTest, ContainerWithoutBagIsRefused) {
+  const Value fields = containerFields(signedContainer(sampleStorebag()));
+  EXPECT_TRUE(verify(encode(test::withoutKey(fields, "bag"))).isNil());
+  EXPECT_TRUE(onlyError("fetchStorebagWithName: Storebag can not be decoded"));
+}
+
+TEST_F(StorebagVerifyTest, SignatureOverOtherBytesIsRefused) {
+  const Value good = containerFields(signedContainer(sampleStorebag("1.0")));
+  const Value other = containerFields(signedContainer(sampleStorebag("6.6.6")));
+  EXPECT_TRUE(verify(encode(test::withEntry(good, "bag", *other["bag"].string()))).isNil());
+  EXPECT_TRUE(logs_.contains("fetchStorebagWithName: Signature can not be verified, 0x"));
+  EXPECT_EQ(logs_.count("fetchStorebagWithName"), 1u);
+}
+
+TEST_F(StorebagVerifyTest, ContainerSignedWithAnotherKeyIsRefused) {
+  EXPECT_TRUE(verify(signedContainer(sampleStorebag(), test::otherStorebagKeys())).isNil());
+  EXPECT_TRUE(logs_.contains("fetchStorebagWithName: Signature can not be verified, 0x"));
+}
+
+TEST_F(StorebagVerifyTest, TruncatedBase64IsRefused) {
+  const Value fields = containerFields(signedContainer(sampleStorebag()));
+  const std::string signature = *fields["signature"].string();
+  const std::string bag = *fields["bag"].string();
+
+  // One stray symbol after the last whole group cannot be decoded at all.
+  EXPECT_TRUE(verify(encode(test::withEntry(fields, "signature", signature.substr(0, 341)))).isNil());
+  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature can not be decoded"));
+  logs_.clear();
+  const std::string cutBag = bag.substr(0, (bag.size() / 4) * 4 - 4) + "Q";
+  EXPECT_TRUE(verify(encode(test::withEntry(fields, "bag", cutBag))).isNil());
+  EXPECT_TRUE(onlyError("fetchStorebagWithName: Storebag can not be decoded"));
+  logs_.clear();
+  // Cut at a group boundary the text decodes, to bytes the signature does
+  // not cover.
+  EXPECT_TRUE(verify(encode(test::withEntry(fields, "bag", bag.substr(0, bag.size() - 8)))).isNil());
+  EXPECT_TRUE(logs_.contains("fetchStorebagWithName: Signature can not be verified, 0x"));
+  logs_.clear();
+  EXPECT_TRUE(verify(encode(test::withEntry(fields, "signature", signature.substr(0, 300)))).isNil());
+  EXPECT_TRUE(logs_.contains("fetchStorebagWithName: Signature can not be verified, 0x"));
+}
+
+TEST_F(StorebagVerifyTest, SignedBagThatIsNotADictionaryGivesNothing) {
+  const Data array = plist::encodeBinary(Value(Array{Value("release")}));
+  EXPECT_TRUE(verify(*signStorebagContainer(storebagKeys().privateKeyPEM, array)).isNil());
+  const Data notAList = bytes("release = yes");
+  EXPECT_TRUE(verify(*signStorebagContainer(storebagKeys().privateKeyPEM, notAList)).isNil());
+  EXPECT_FALSE(logs_.contains("Signature"));
+}
+
+TEST_F(StorebagVerifyTest, PublicKeyIsReadAfreshAtEveryVerification) {
+  const Data signedByFirst = signedContainer(sampleStorebag());
+  const Data signedBySecond = signedContainer(sampleStorebag(), test::otherStorebagKeys());
+  EXPECT_FALSE(verify(signedByFirst).isNil());
+  installPublicKey(test::otherStorebagKeys().publicKeyDER);
+  EXPECT_TRUE(verify(signedByFirst).isNil());
+  EXPECT_FALSE(verify(signedBySecond).isNil());
+}
+
+TEST_F(StorebagVerifyTest, PublicKeyInPkcs1FormIsAccepted) {
+  const auto& der = storebagKeys().publicKeyDER;
+  const unsigned char* p = der.data();
+  PkeyPtr key(d2i_PUBKEY(nullptr, &p, static_cast<long>(der.size())));
+  ASSERT_TRUE(key);
+  unsigned char* out = nullptr;
+  const int length = i2d_PublicKey(key.get(), &out);  // RSAPublicKey for an RSA key
+  ASSERT_GT(length, 0);
+  installPublicKey(Data(out, out + length));
+  OPENSSL_free(out);
+  EXPECT_EQ(verify(signedContainer(sampleStorebag())), sampleStorebag());
+}
+
+TEST_F(StorebagVerifyTest, MissingCorruptOrNonRsaPublicKeyRefusesEverything) {
+  const Data container = signedContainer(sampleStorebag());
+  const std::string expected =
+      "fetchStorebagWithName: Could not create an RSA public key from '" + frameworkPublicKeyPath().string() + "'";
+
+  std::filesystem::remove(frameworkPublicKeyPath());
+  EXPECT_TRUE(verify(container, true).isNil());
+  EXPECT_TRUE(onlyError(expected));
+
+  Data truncated = storebagKeys().publicKeyDER;
+  truncated.resize(truncated.size() - 1);
+  installPublicKey(truncated);
+  logs_.clear();
+  EXPECT_TRUE(verify(container).isNil());
+  EXPECT_TRUE(onlyError(expected));
+
+  PkeyPtr ec(EVP_EC_gen("P-256"));
+  unsigned char* out = nullptr;
+  const int length = i2d_PUBKEY(ec.get(), &out);
+  installPublicKey(Data(out, out + length));
+  OPENSSL_free(out);
+  logs_.clear();
+  EXPECT_TRUE(verify(container).isNil());
+  EXPECT_TRUE(onlyError(expected));
+  EXPECT_FALSE(cached("ambrel"));
+}
+
+TEST_F(StorebagVerifyTest, SavingKeepsTheWholeContainerAndARefusedOneChangesNothing) {
+  const Data container = signedContainer(sampleStorebag("1.0"));
+  EXPECT_FALSE(verify(container, true).isNil());
+  EXPECT_TRUE(logs_.has(Level::Default, "fetchStorebagWithName: storebag 'ambrel' has been saved to disk cache"));
+  EXPECT_EQ(cached("ambrel"), container);
+
+  // Not saved unless asked.
+  EXPECT_FALSE(parseAndVerifyStorebag("bostin", container, false).isNil());
+  EXPECT_FALSE(cached("bostin"));
+
+  const Data forged = signedContainer(sampleStorebag("9.9"), test::otherStorebagKeys());
+  EXPECT_TRUE(verify(forged, true).isNil());
+  EXPECT_EQ(cached("ambrel"), container);
+}
+
+TEST_F(StorebagVerifyTest, VerificationNeedsNoFilesOfItsOwn) {
+  const Data container = signedContainer(sampleStorebag());
+  const auto ok = verifyStorebagContainer(plist::bytesOf(container), storebagKeys().publicKeyDER);
+  EXPECT_EQ(ok.status, StorebagVerifyStatus::Verified);
+  EXPECT_EQ(decodeStorebagBag(ok.bagBytes), sampleStorebag());
+  EXPECT_EQ(verifyStorebagContainer(plist::bytesOf(container), std::nullopt).status,
+            StorebagVerifyStatus::BadPublicKey);
+  EXPECT_EQ(verifyStorebagContainer(plist::bytesOf(container), test::otherStorebagKeys().publicKeyDER).status,
+            StorebagVerifyStatus::SignatureMismatch);
+}
+
+}  // namespace
+}  // namespace zerith
