@@ -1,0 +1,70 @@
+#pragma once
+
+// A real nginx serving a folder over HTTPS on 127.0.0.1, for tests that need
+// a real static file server's "Last-Modified", "If-Modified-Since" and 304
+// handling.
+//
+// The listening socket is opened here on port 0 and handed to nginx as an
+// inherited socket, so there is no race for a free port and no wait for
+// readiness: connections queue in the socket's backlog until nginx accepts
+// them. nginx runs in the foreground (`-g 'daemon off;'`, one worker) with
+// its prefix, configuration, pid file, temporary folders and logs in a
+// folder of the test; its certificate comes from a TestCA.
+//
+//   test::NginxServer nginx({.workDir = root / "/nginx", .documentRoot = root / "/www"});
+//   if (!NginxServer::available()) GTEST_SKIP();
+//   ASSERT_TRUE(nginx.started()) << nginx.error();
+//   ... fetch nginx.url("/bags/dravon") ...
+
+#include <sys/types.h>
+
+#include <filesystem>
+#include <string>
+#include <string_view>
+
+#include "tests/support/TestCA.h"
+
+namespace zerith::test {
+
+class NginxServer {
+ public:
+  struct Options {
+    std::filesystem::path workDir;       // prefix, config, pid, temp and logs (created)
+    std::filesystem::path documentRoot;  // served at "/" (created)
+    // Extra directives inside the server block, e.g.
+    // "add_header Cache-Control \"max-age=600\";".
+    std::string serverDirectives;
+  };
+
+  // nginx is installed (/usr/sbin/nginx).
+  static bool available();
+
+  explicit NginxServer(Options options, const TestCA& ca = TestCA::shared());
+  ~NginxServer();
+  NginxServer(const NginxServer&) = delete;
+  NginxServer& operator=(const NginxServer&) = delete;
+
+  bool started() const { return pid_ > 0; }
+  // Why it did not start (with nginx's own messages).
+  const std::string& error() const { return error_; }
+
+  int port() const { return port_; }
+  // "https://127.0.0.1:<port><path>"
+  std::string url(std::string_view path = "/") const;
+
+  // nginx's error log so far, for failure messages.
+  std::string errorLog() const;
+
+  // Stops nginx (SIGTERM, then SIGKILL after five seconds) and reaps it.
+  void stop();
+
+ private:
+  bool start(const TestCA& ca);
+
+  Options options_;
+  int port_ = 0;
+  pid_t pid_ = -1;
+  std::string error_;
+};
+
+}  // namespace zerith::test
