@@ -5,5 +5,6 @@
 
 #include "config/ClientTypes.h"
 #include "config/Conversions.h"
+#include "config/CreateBackends.h"
 #include "config/DeviceInfo.h"
 #include "config/Identifiers.h"

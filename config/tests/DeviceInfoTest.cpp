@@ -11,6 +11,7 @@
 #include "platform/Defaults.h"
 #include "platform/Log.h"
 #include "platform/PropertyList.h"
+#include "config/tests/ScopedEnv.h"
 #include "tests/support/TempRoot.h"
 
 namespace zerith {
@@ -217,21 +218,7 @@ TEST(DeviceParsersTest, DeviceFileMustBeADictionary) {
   EXPECT_FALSE(why.empty());
 }
 
-// Restores an environment variable at the end of a test.
-class ScopedEnv {
- public:
-  ScopedEnv(const char* name, const char* value) : name_(name) {
-    if (const char* old = std::getenv(name)) {
-      old_ = old;
-    }
-    value ? ::setenv(name, value, 1) : ::unsetenv(name);
-  }
-  ~ScopedEnv() { old_ ? ::setenv(name_, old_->c_str(), 1) : ::unsetenv(name_); }
-
- private:
-  const char* name_;
-  std::optional<std::string> old_;
-};
+using test::ScopedEnv;
 
 TEST_F(DeviceInfoTest, LocaleCountryFollowsTheLocalePrecedence) {
   ScopedEnv all("LC_ALL", nullptr), messages("LC_MESSAGES", nullptr), lang("LANG", nullptr);

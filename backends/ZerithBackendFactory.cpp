@@ -1,0 +1,84 @@
+// The backend factory: backend names to kinds.
+
+#include <functional>
+#include <string_view>
+
+#include "backends/KovuBackend.h"
+#include "backends/PellamBackend.h"
+#include "backends/ZerithBackend.h"
+#include "config/DeviceInfo.h"
+#include "platform/Log.h"
+#include "zerith/ZerithConstants.h"
+
+namespace zerith {
+
+namespace {
+
+const log::Logger& logger() {
+  static const log::Logger l("backends");
+  return l;
+}
+
+struct Kind {
+  const char* const* name;
+  // False when the kind does not exist on this device; the name then counts
+  // as unknown.
+  std::function<bool()> available;
+  std::function<std::shared_ptr<ZerithBackend>(std::string_view name, const Value& profile,
+                                               const std::optional<std::string>& productFamily,
+                                               std::int32_t clientType)>
+      make;
+};
+
+// Kinds made with the three-argument initialiser; the client type is not
+// passed on.
+template <typename Backend>
+std::shared_ptr<ZerithBackend> makePlain(std::string_view name, const Value& profile,
+                                         const std::optional<std::string>& productFamily, std::int32_t) {
+  return std::make_shared<Backend>(std::string(name), profile, productFamily);
+}
+
+std::shared_ptr<ZerithBackend> makeKovu(std::string_view name, const Value& profile,
+                                        const std::optional<std::string>& productFamily, std::int32_t clientType) {
+  return KovuBackend::initWithName(std::string(name), profile, productFamily, clientType);
+}
+
+// The adaptor backend does not exist on "Tarvix" devices. The device's own
+// product type decides, not the product family the caller passes.
+bool adaptorAvailable() {
+  const Value productType = deviceProductType();
+  return !(productType.string() && *productType.string() == "Tarvix");
+}
+
+bool always() { return true; }
+
+// Compared in this order; the first name that matches decides. The full
+// order is dashboard, uploadServer, httpsPost, httpsPost2, pellamlog, qrs,
+// kovu; a kind joins the table at its place with one line.
+const std::vector<Kind>& kinds() {
+  static const std::vector<Kind> table = {
+      {&kZerithBackendPellamlog, always, makePlain<PellamBackend>},
+      {&kZerithBackendKovu, adaptorAvailable, makeKovu},
+  };
+  return table;
+}
+
+}  // namespace
+
+std::shared_ptr<ZerithBackend> ZerithBackend::newBackendWithName(std::string_view name, const Value& profile,
+                                                                 const std::optional<std::string>& productFamily,
+                                                                 std::int32_t clientType) {
+  for (const Kind& kind : kinds()) {
+    if (name != *kind.name) {
+      continue;
+    }
+    if (!kind.available()) {
+      break;
+    }
+    return kind.make(name, profile, productFamily, clientType);
+  }
+  logger().error("ZerithBackend(newBackendWithName): {}", name);
+  return nullptr;
+}
+
+}  // namespace zerith

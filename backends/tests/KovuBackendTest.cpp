@@ -1,0 +1,132 @@
+#include <gtest/gtest.h>
+
+#include <dlfcn.h>
+#include <zlib.h>
+
+#include <nlohmann/json.hpp>
+
+#include "backends/KovuBackend.h"
+#include "backends/tests/BackendTestSupport.h"
+#include "config/tests/ScopedEnv.h"
+#include "platform/Log.h"
+#include "tests/support/TempRoot.h"
+#include "zerith/ZerithConstants.h"
+
+namespace zerith {
+namespace {
+
+using log::Level;
+
+constexpr char kNotForwarded[] =
+    "KovuBackend(sendMessage): Kovu adaptor <NoForwardingAdaptor> does not respond to forwarding selector "
+    "sendMessageWithMethod:respCode:dict:";
+
+class KovuBackendTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<KovuBackend> make(std::int32_t clientType = 13) {
+    return KovuBackend::initWithName(kZerithBackendKovu, Value(Dictionary{}), "family", clientType);
+  }
+  std::vector<nlohmann::json> received() {
+    std::vector<nlohmann::json> lines;
+    for (const auto& line : test::readLines(output_)) {
+      lines.push_back(nlohmann::json::parse(line));
+    }
+    return lines;
+  }
+
+  test::TempRoot root_;
+  log::LogCapture capture_;
+  const std::filesystem::path output_ = root_ / "/adaptor-output.jsonl";
+  test::ScopedEnv outputEnv_{"KOVU_EXAMPLE_OUTPUT", output_.c_str()};
+  const timeval now_{1700000000, 250000};
+};
+
+TEST_F(KovuBackendTest, OnlyClientTypes7And11And13AreAllowed) {
+  for (std::int32_t type : {7, 11, 13}) {
+    EXPECT_TRUE(KovuBackend::isClientTypeAllowed(type)) << type;
+  }
+  for (std::int32_t type : {0, 5, 8, 12, 14, 20, -7}) {
+    EXPECT_FALSE(KovuBackend::isClientTypeAllowed(type)) << type;
+  }
+}
+
+TEST_F(KovuBackendTest, RefusedClientTypeLogsLoadingThenNoBundle) {
+  test::installAdaptorPlugin(ZERITH_KOVU_EXAMPLE_PLUGIN);
+  EXPECT_EQ(make(8), nullptr);
+  EXPECT_TRUE(capture_.has(Level::Default, "KovuBackend(initWithName): Loading Kovu adaptor class for client type 8"));
+  EXPECT_TRUE(capture_.has(Level::Error, "KovuBackend(initWithName): No matching bundle found for client type 8"));
+  // The three-argument initialiser means client type 0: never allowed.
+  EXPECT_EQ(KovuBackend::initWithName(kZerithBackendKovu, Value(), "family"), nullptr);
+  EXPECT_TRUE(capture_.has(Level::Error, "KovuBackend(initWithName): No matching bundle found for client type 0"));
+}
+
+TEST_F(KovuBackendTest, AdaptorReceivesMethodRespCodeAndDictionaryOnly) {
+  test::installAdaptorPlugin(ZERITH_KOVU_EXAMPLE_PLUGIN);
+  auto backend = make(13);
+  ASSERT_NE(backend, nullptr);
+  const Value event(Dictionary{{"rssi", Value(-61)}, {"ssid", "lab"}, {"nested", Value(Dictionary{{"x", 1.5}})}});
+  // The session's path: the numbering send dispatching to the six-argument one.
+  EXPECT_EQ(backend->sendMessage(event, now_, 12, 3, 1), std::nullopt);
+  EXPECT_EQ(backend->sendMessage(Value(Dictionary{}), now_, 65535, 0, 2), std::nullopt);
+
+  const auto lines = received();
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_EQ(lines[0].dump(), R"({"dict":{"nested":{"x":1.5},"rssi":-61,"ssid":"lab"},"method":12,"respCode":3})");
+  EXPECT_EQ(lines[1].dump(), R"({"dict":{},"method":65535,"respCode":0})");
+  EXPECT_EQ(capture_.count("does not respond"), 0u);
+}
+
+TEST_F(KovuBackendTest, AdaptorWithoutTheOperationIsReportedOnEveryEvent) {
+  test::installAdaptorPlugin(ZERITH_KOVU_NO_FORWARDING_PLUGIN);
+  auto backend = make(7);
+  ASSERT_NE(backend, nullptr);
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_EQ(backend->sendMessage(Value(Dictionary{{"a", 1}}), now_, 1, 1, 0), std::nullopt);
+  }
+  EXPECT_TRUE(capture_.has(Level::Error, kNotForwarded));
+  EXPECT_EQ(capture_.count(kNotForwarded), 3u);
+  EXPECT_FALSE(std::filesystem::exists(output_));
+}
+
+TEST_F(KovuBackendTest, MissingPluginStillMakesABackendThatReportsEachEvent) {
+  auto backend = make(11);
+  ASSERT_NE(backend, nullptr);
+  EXPECT_TRUE(capture_.contains("KovuBackend(initWithName): Could not load adaptor plugin " +
+                                paths::adaptorPluginPath().string()));
+  backend->sendMessage(Value(Dictionary{{"a", 1}}), now_, 1, 1, 0);
+  backend->sendMessage(Value(Dictionary{{"a", 1}}), now_, 1, 1, 0);
+  EXPECT_EQ(capture_.count("KovuBackend(sendMessage): Kovu adaptor (null) does not respond to forwarding selector "
+                           "sendMessageWithMethod:respCode:dict:"),
+            2u);
+}
+
+TEST_F(KovuBackendTest, SharedObjectWithoutFactoryIsReportedAndIgnored) {
+  // zlib loads fine but has no "KovuAdaptor".
+  Dl_info info{};
+  ASSERT_NE(::dladdr(reinterpret_cast<void*>(&::deflate), &info), 0);
+  const std::filesystem::path target = paths::adaptorPluginPath();
+  std::filesystem::create_directories(target.parent_path());
+  std::filesystem::copy_file(info.dli_fname, target);
+
+  auto backend = make(13);
+  ASSERT_NE(backend, nullptr);
+  EXPECT_TRUE(capture_.has(Level::Error, "KovuBackend(initWithName): Adaptor plugin " + target.string() +
+                                             " has no KovuAdaptor"));
+  backend->sendMessage(Value(Dictionary{{"a", 1}}), now_, 1, 1, 0);
+  EXPECT_EQ(capture_.count("Kovu adaptor (null) does not respond"), 1u);
+}
+
+TEST_F(KovuBackendTest, ReleasingOneBackendKeepsTheOthersPluginLoaded) {
+  test::installAdaptorPlugin(ZERITH_KOVU_EXAMPLE_PLUGIN);
+  auto first = make(13);
+  auto second = make(13);
+  ASSERT_TRUE(first && second);
+  first.reset();
+  second->sendMessage(Value(Dictionary{{"after", true}}), now_, 4, 5, 0);
+  const auto lines = received();
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_EQ(lines[0]["method"], 4);
+}
+
+}  // namespace
+}  // namespace zerith

@@ -1,0 +1,222 @@
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <semaphore>
+#include <vector>
+
+#include "backends/ZerithBackend.h"
+
+namespace zerith {
+namespace {
+
+// A backend that records the event numbers reaching the dispatching send and
+// opens up the fields concrete backends use.
+class ProbeBackend : public ZerithBackend {
+ public:
+  ProbeBackend() : ZerithBackend("probe", Value(Dictionary{{"k", "v"}}), std::string("family")) {}
+
+  using ZerithBackend::sendMessage;
+  std::optional<std::string> sendMessage(const Value&, const timeval&, std::uint16_t, std::uint16_t,
+                                         std::uint16_t eventID, std::int32_t flag) override {
+    seen.push_back(eventID);
+    lastFlag = flag;
+    return std::nullopt;
+  }
+
+  using ZerithBackend::eventID;
+  using ZerithBackend::profile;
+  using ZerithBackend::selfVersionMajor;
+  using ZerithBackend::selfVersionMiddle;
+  using ZerithBackend::selfVersionMinor;
+  using ZerithBackend::setEventBlacklist;
+  using ZerithBackend::setEventWhitelist;
+  using ZerithBackend::startTimeStamp;
+  using ZerithBackend::stateQueue;
+
+  std::vector<std::uint16_t> seen;
+  std::int32_t lastFlag = 0;
+};
+
+struct Version {
+  int major, middle, minor;
+  bool operator==(const Version&) const = default;
+};
+
+Version selfVersionOf(std::string_view text) {
+  ProbeBackend b;
+  b.setSelfVersion(text);
+  return {b.selfVersionMajor(), b.selfVersionMiddle(), b.selfVersionMinor()};
+}
+
+TEST(ZerithBackendTest, SelfVersionSplitsIntoThreeTruncatedBytes) {
+  EXPECT_EQ(selfVersionOf("3"), (Version{3, 0, 0}));
+  EXPECT_EQ(selfVersionOf("3.1"), (Version{3, 1, 0}));
+  EXPECT_EQ(selfVersionOf("3.1.4.1"), (Version{3, 1, 4}));
+  EXPECT_EQ(selfVersionOf("300.1"), (Version{44, 1, 0}));
+  EXPECT_EQ(selfVersionOf("8.1.0"), (Version{8, 1, 0}));
+  EXPECT_EQ(selfVersionOf(""), (Version{0, 0, 0}));
+  EXPECT_EQ(selfVersionOf("2.x.7b"), (Version{2, 0, 7}));
+  EXPECT_EQ(selfVersionOf("-1.256.257"), (Version{255, 0, 1}));
+}
+
+TEST(ZerithBackendTest, FirstEventIsNumberOneAndTheNumberWrapsAt16Bits) {
+  auto b = std::make_shared<ProbeBackend>();
+  const timeval now{1, 0};
+  b->sendMessage(Value(), now, 1, 2, 9);
+  ASSERT_EQ(b->seen, std::vector<std::uint16_t>{1});
+  EXPECT_EQ(b->lastFlag, 9);
+  for (int i = 1; i < 65536; ++i) {
+    b->sendMessage(Value(), now, 1, 2, 0);
+  }
+  ASSERT_EQ(b->seen.size(), 65536u);
+  EXPECT_EQ(b->seen[65534], 65535);
+  EXPECT_EQ(b->seen[65535], 0);  // 65536 calls: back at the start value
+  EXPECT_EQ(b->eventID(), 0);
+  b->sendMessage(Value(), now, 1, 2, 0);
+  EXPECT_EQ(b->seen.back(), 1);
+}
+
+TEST(ZerithBackendTest, SamplingDrawIsInTenThousandthsBetweenZeroAnd9999) {
+  double lowest = 1, highest = 0;
+  for (int i = 0; i < 2000; ++i) {
+    const double f = ProbeBackend().samplingFactor();
+    ASSERT_GE(f, 0.0);
+    ASSERT_LE(f, 0.9999);
+    const double steps = f * 10000.0;
+    ASSERT_NEAR(steps, std::round(steps), 1e-6) << f;
+    lowest = std::min(lowest, f);
+    highest = std::max(highest, f);
+  }
+  // 2000 uniform draws all above 0.1 (or all below 0.9) would be 0.9^2000.
+  EXPECT_LT(lowest, 0.1);
+  EXPECT_GT(highest, 0.9);
+}
+
+TEST(ZerithBackendTest, Sha256HashesAsManyBytesAsUtf16Units) {
+  EXPECT_EQ(ZerithBackend::convertIntoSHA256("abc"),
+            "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad");
+  // One two-byte character is one UTF-16 unit: only its first byte is hashed.
+  EXPECT_EQ(ZerithBackend::convertIntoSHA256("\xC3\xA9"),
+            "ae3f4619b0413d70d3004b9131c3752153074e45725be13b9a148978895e359e");
+  EXPECT_EQ(ZerithBackend::convertIntoSHA256("a\xC3\xA9"),
+            "7217e62bfcb0766e8cf1925411011bf777f48d9809bd30a7d7d4287a6daf9f78");
+  // A character beyond the basic plane is two units: two of its four bytes.
+  EXPECT_EQ(ZerithBackend::convertIntoSHA256("\xF0\x9F\x98\x80"),
+            "3c1c36c746e9b9106e77cfc2ede3374d38a883e23fbcd3b20023e326008c5434");
+  EXPECT_EQ(ZerithBackend::convertIntoSHA256(""),
+            "e3b0c44298fc1c149afbf4c8996fb92427ae41e4649b934ca495991b7852b855");
+}
+
+TEST(ZerithBackendTest, WhitelistAbsentAdmitsAllEmptyAdmitsNone) {
+  ProbeBackend b;
+  EXPECT_TRUE(b.isWhitelistedEvent(0));
+  EXPECT_TRUE(b.isWhitelistedEvent(65535));
+  b.setEventWhitelist(Value(Array{}));
+  EXPECT_FALSE(b.isWhitelistedEvent(0));
+  EXPECT_FALSE(b.isWhitelistedEvent(7));
+  b.setEventWhitelist(Value(Array{Value(7), Value("9"), Value(65536 + 5)}));
+  EXPECT_TRUE(b.isWhitelistedEvent(7));
+  EXPECT_TRUE(b.isWhitelistedEvent(9));
+  EXPECT_FALSE(b.isWhitelistedEvent(5));  // no 16-bit wrap of list entries
+  EXPECT_FALSE(b.isWhitelistedEvent(8));
+}
+
+TEST(ZerithBackendTest, BlacklistAbsentOrEmptyRefusesNothing) {
+  ProbeBackend b;
+  EXPECT_FALSE(b.isBlacklistedEvent(7));
+  b.setEventBlacklist(Value(Array{}));
+  EXPECT_FALSE(b.isBlacklistedEvent(7));
+  b.setEventBlacklist(Value(Array{Value(7)}));
+  EXPECT_TRUE(b.isBlacklistedEvent(7));
+  EXPECT_FALSE(b.isBlacklistedEvent(8));
+}
+
+TEST(ZerithBackendTest, StateWriteIsSeenByTheNextReadAndUpdateEnables) {
+  auto b = std::make_shared<ProbeBackend>();
+  EXPECT_EQ(b->state(), kBackendStateUndecided);
+  b->setState(kBackendStateDisabled);
+  EXPECT_EQ(b->state(), kBackendStateDisabled);
+  b->updateState();
+  EXPECT_EQ(b->state(), kBackendStateEnabled);
+
+  // Not owned by a shared pointer: the write happens in turn right away.
+  ProbeBackend onStack;
+  onStack.setState(kBackendStateSampledOut);
+  EXPECT_EQ(onStack.state(), kBackendStateSampledOut);
+}
+
+TEST(ZerithBackendTest, QueuedStateWriteOutlivingItsBackendIsDropped) {
+  auto b = std::make_shared<ProbeBackend>();
+  const SerialQueue queue = b->stateQueue();
+  std::binary_semaphore gate(0);
+  queue.async([&] { gate.acquire(); });
+  b->setState(kBackendStateDisabled);
+  b.reset();  // the write is still queued behind the gate
+  gate.release();
+  queue.sync([] {});  // the write ran against a gone backend: no use after free
+}
+
+TEST(ZerithBackendDeathTest, ReadingTheStateFromItsOwnQueueAborts) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(
+      {
+        auto b = std::make_shared<ProbeBackend>();
+        b->stateQueue().sync([&] { (void)b->state(); });
+      },
+      "would deadlock");
+}
+
+TEST(ZerithBackendTest, NoOpDefaultsAnswerNilAndNo) {
+  ZerithBackend b("base", Value(), std::nullopt);
+  const timeval now{5, 0};
+  EXPECT_EQ(b.sendMessage(Value(Dictionary{{"a", 1}}), now, 1, 2, 3, 0), std::nullopt);
+  EXPECT_EQ(b.sendMessage(Value(Dictionary{{"a", 1}}), now, 1, 2, 0), std::nullopt);
+  EXPECT_EQ(b.flushMessagesWithCompletion(nullptr), std::nullopt);
+  EXPECT_FALSE(b.uploadFileAtPath("/tmp/x", "token"));
+  EXPECT_FALSE(b.uploadLogData(Data{1, 2}));
+  EXPECT_EQ(b.batchedEventsSize(), 0u);
+  b.cleanup();
+}
+
+TEST(ZerithBackendTest, FlushCallsTheCompletionOnceWithNilAndNoError) {
+  ZerithBackend b("base", Value(), std::nullopt);
+  int calls = 0;
+  EXPECT_EQ(b.flushMessagesWithCompletion([&](const Value& result, const std::optional<Error>& error) {
+    ++calls;
+    EXPECT_TRUE(result.isNil());
+    EXPECT_FALSE(error.has_value());
+  }),
+            std::nullopt);
+  EXPECT_EQ(calls, 1);
+}
+
+TEST(ZerithBackendTest, IdentityFieldsAsTheSessionSetsThem) {
+  ProbeBackend b;
+  EXPECT_EQ(b.name(), "probe");
+  EXPECT_EQ(b.profile()["k"], Value("v"));
+  EXPECT_EQ(b.productFamily(), "family");
+  EXPECT_FALSE(b.combinedSessionIDString());
+  b.setCorrelatedSessionID("parent.child");
+  EXPECT_EQ(b.combinedSessionIDString(), "parent.child");
+  b.setStartTimestamp(timeval{1000, 500000});
+  EXPECT_DOUBLE_EQ(b.startTimeStamp(), 1000.5);
+  const char udid[] = "0123";
+  b.setUdid(udid);
+  EXPECT_EQ(b.udid(), udid);
+}
+
+TEST(ZerithBackendTest, TransportReferenceIsWeak) {
+  struct Transport : ReportingSessionConnectivityInterface {
+    void postURLRequestWithCompletionHandler(const URLRequest&, URLCompletion) override {}
+    void getURLRequestWithCompletionHandler(const URLRequest&, URLCompletion) override {}
+  };
+  ProbeBackend b;
+  auto transport = std::make_shared<Transport>();
+  b.setReportingSessionConnectivityDelegate(transport);
+  EXPECT_EQ(b.reportingSessionConnectivityDelegate(), transport);
+  transport.reset();
+  EXPECT_EQ(b.reportingSessionConnectivityDelegate(), nullptr);
+}
+
+}  // namespace
+}  // namespace zerith
