@@ -1,0 +1,212 @@
+#include "zerith/Zerith.h"
+
+#include <gtest/gtest.h>
+
+#include <future>
+#include <regex>
+
+#include "client/tests/TestDaemon.h"
+#include "ipc/Frame.h"
+#include "platform/Defaults.h"
+
+namespace zerith::test {
+namespace {
+
+using namespace std::chrono_literals;
+using ipc::test::Counter;
+
+struct ZerithFixture : ::testing::Test {
+  TempRoot root;
+  std::unique_ptr<TestDaemon> daemon;
+
+  void SetUp() override {
+    grantEntitlement(root);
+    daemon = std::make_unique<TestDaemon>();
+  }
+  std::unique_ptr<Zerith> open() {
+    Error error;
+    auto z = Zerith::connect({}, &error);
+    EXPECT_TRUE(z) << error.description;
+    return z;
+  }
+};
+
+TEST_F(ZerithFixture, DefaultSocketIsTheOneUnderTheProcessRoot) {
+  EXPECT_EQ(Zerith::defaultSocketPath(), root / "/run/zerithd/com.velmar.zerithd");
+  auto z = open();
+  ASSERT_TRUE(z);
+  EXPECT_TRUE(z->isValid());
+}
+
+TEST_F(ZerithFixture, BlockingCallsReturnTheCompletionsArguments) {
+  auto z = open();
+  const Value info(Dictionary{{kZerithSessionInfoSessionID, 5}, {kZerithSessionInfoClientType, 7}});
+  const auto set = z->setSessionInfo(info, Value(), Value(), false, 5s);
+  ASSERT_TRUE(set) << set.error->description;
+  // The blocking form returns only once the daemon has taken the call.
+  auto client = daemon->waitForClient();
+  ASSERT_EQ(client.session->log.size(), 1u);
+
+  const auto started = z->startConfig(5s);
+  ASSERT_TRUE(started);
+  EXPECT_EQ(started["backends"], client.session->backends);
+  EXPECT_EQ(z->fetchDisplayURL(5s)["url"], Value("https://display.example/session"));
+  const auto sent = z->sendMessage(Value(Dictionary{{"category", 1}, {"type", 2}}), 5s);
+  EXPECT_EQ(sent["result"], Value("sent"));
+  const auto upload = z->uploadLogData(Value(Array{}), 5s);
+  EXPECT_EQ(upload["success"], Value(false));
+  EXPECT_EQ(upload["error"], (Error{kZerithErrorDomain, -1, "no upload backend"}.toValue()));
+  EXPECT_TRUE(z->finishSession(5s));
+  EXPECT_EQ(client.session->log.calls().back().operation, "finishSession");
+}
+
+TEST_F(ZerithFixture, AsynchronousCompletionsRunOnceWithTheAnswer) {
+  auto z = open();
+  std::promise<std::pair<Value, std::optional<Error>>> flushed;
+  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
+  auto f = flushed.get_future();
+  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
+  EXPECT_EQ(f.get().first, Value("flushed"));
+}
+
+TEST_F(ZerithFixture, ABlockingCallTimesOutWithAClearError) {
+  daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
+  auto z = open();
+  const auto reply = z->fetchDisplayURL(50ms);
+  ASSERT_TRUE(reply.error);
+  EXPECT_EQ(*reply.error, (Error{kZerithErrorDomain, -1, "No answer to fetchDisplayURL: within 50 ms"}));
+  // The session's late answer goes nowhere and the session goes on.
+  auto client = daemon->waitForClient();
+  for (auto& late : client.session->takeHeld()) {
+    late();
+  }
+  EXPECT_TRUE(z->finishSession(5s));
+}
+
+TEST_F(ZerithFixture, ABlockingCallInsideACallbackFailsInsteadOfDeadlocking) {
+  auto z = open();
+  std::promise<ZerithReply> inner;
+  z->fetchDisplayURL([&](Value) { inner.set_value(z->startConfig(5s)); });
+  auto f = inner.get_future();
+  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
+  const auto reply = f.get();
+  ASSERT_TRUE(reply.error);
+  EXPECT_EQ(reply.error->description, "startConfigWithCompletionHandler: cannot wait inside a callback of its own session");
+}
+
+TEST_F(ZerithFixture, TheDaemonsMessagesReachTheMessageHandler) {
+  auto z = open();
+  std::promise<std::tuple<Value, double, std::uint16_t, std::uint16_t, Value>> got;
+  z->setMessageHandler([&](const Value& m, double t, std::uint16_t c, std::uint16_t ty, const Value& p) {
+    got.set_value({m, t, c, ty, p});
+  });
+  ASSERT_TRUE(z->finishSession(5s));  // the daemon knows the client by now
+  daemon->waitForClient().toClient->sendMessageToClient(Value(Dictionary{{"a", 1}}), 99.25, 12, 34,
+                                                        Value(Dictionary{{"b", "c"}}));
+  auto f = got.get_future();
+  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
+  const auto [m, t, c, ty, p] = f.get();
+  EXPECT_EQ(m, Value(Dictionary{{"a", 1}}));
+  EXPECT_EQ(t, 99.25);
+  EXPECT_EQ(c, 12);
+  EXPECT_EQ(ty, 34);
+  EXPECT_EQ(p, Value(Dictionary{{"b", "c"}}));
+}
+
+TEST_F(ZerithFixture, DaemonClosingTheSessionRunsTheInvalidationHandlerOnceAndFailsPendingCalls) {
+  daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
+  auto z = open();
+  Counter invalidated;
+  z->setInvalidationHandler([&] { invalidated.hit(); });
+  std::promise<Value> url;
+  z->fetchDisplayURL([&](Value v) { url.set_value(v); });
+  auto client = daemon->waitForClient();
+  ASSERT_TRUE(client.session->log.waitFor(1));
+  client.connection->invalidate();
+  auto f = url.get_future();
+  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
+  EXPECT_EQ(f.get(), Value());
+  ASSERT_TRUE(invalidated.waitFor(1));
+  EXPECT_FALSE(z->isValid());
+  const auto after = z->fetchDisplayURL(5s);
+  ASSERT_TRUE(after.error);
+  EXPECT_EQ(after.error->description, "The connection was invalidated");
+  EXPECT_EQ(invalidated.count(), 1);
+}
+
+TEST_F(ZerithFixture, ClientGoingAwayMidCallEndsItsDaemonSideAndNoHandlerRunsAfterDestruction) {
+  daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
+  Counter invalidated;
+  {
+    auto z = open();
+    z->setInvalidationHandler([&] { invalidated.hit(); });
+    z->fetchDisplayURL([](Value) {});
+    ASSERT_TRUE(daemon->waitForClient().session->log.waitFor(1));
+  }
+  ASSERT_TRUE(daemon->gone.waitFor(1));
+  for (auto& late : daemon->waitForClient().session->takeHeld()) {
+    late();  // answering a client that left
+  }
+  EXPECT_EQ(invalidated.count(), 0);
+}
+
+TEST_F(ZerithFixture, ARefusedClientLearnsOnItsFirstCall) {
+  grantEntitlement(root, "<false/>");
+  auto z = open();
+  Counter invalidated;
+  z->setInvalidationHandler([&] { invalidated.hit(); });
+  const auto reply = z->startConfig(5s);
+  ASSERT_TRUE(reply.error);
+  EXPECT_EQ(reply.error->description, "The connection was invalidated");
+  EXPECT_TRUE(invalidated.waitFor(1));
+  EXPECT_TRUE(daemon->clients().empty());
+}
+
+TEST(ZerithConnect, NothingListeningGivesNullAndTheReason) {
+  TempRoot root;
+  Error error;
+  EXPECT_EQ(Zerith::connect({}, &error), nullptr);
+  EXPECT_EQ(error.domain, kZerithErrorDomain);
+  EXPECT_EQ(error.description,
+            "Cannot connect to " + (root / "/run/zerithd/com.velmar.zerithd").string() + ": No such file or directory");
+}
+
+TEST(ZerithVocabulary, TheIpcLayersErrorDomainIsTheFrameworks) {
+  EXPECT_STREQ(ipc::kErrorDomain, kZerithErrorDomain);
+}
+
+TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaults) {
+  TempRoot root;
+  const std::string yes = Zerith::getPersistentIdentifierForDNU(true);
+  const std::string no = Zerith::getPersistentIdentifierForDNU(false);
+  const std::regex uuid("^[0-9A-F]{8}-[0-9A-F]{4}-[0-9A-F]{4}-[0-9A-F]{4}-[0-9A-F]{12}$");
+  EXPECT_TRUE(std::regex_match(yes, uuid)) << yes;
+  EXPECT_TRUE(std::regex_match(no, uuid)) << no;
+  EXPECT_NE(yes, no);
+  EXPECT_EQ(Zerith::getPersistentIdentifierForDNU(true), yes);
+  EXPECT_EQ(Zerith::getPersistentIdentifierForDNU(false), no);
+  const Defaults defaults("com.velmar.zerith");
+  EXPECT_EQ(defaults.objectForKey("PersistentIdentifierForDNU"), Value(yes));
+  EXPECT_EQ(defaults.objectForKey("PersistentIdentifier"), Value(no));
+}
+
+TEST(ZerithPersistentIdentifier, AStoredValueThatIsNotAStringIsReplaced) {
+  TempRoot root;
+  const Defaults defaults("com.velmar.zerith");
+  ASSERT_TRUE(defaults.setObject(kZerithPersistentIdentifierKey, Value(42)));
+  const std::string id = Zerith::getPersistentIdentifierForDNU(false);
+  EXPECT_EQ(id.size(), 36u);
+  EXPECT_EQ(defaults.objectForKey(kZerithPersistentIdentifierKey), Value(id));
+}
+
+TEST(ZerithBundle, VersionComesFromTheBundleOrFallsBackTo80) {
+  TempRoot root;
+  EXPECT_EQ(Zerith::frameworkVersion(), "8.0");
+  root.write("/usr/share/zerith/Info.plist",
+             "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>BundleVersion</key><string>9.4.1</string></dict></plist>");
+  EXPECT_EQ(Zerith::frameworkVersion(), "9.4.1");
+  EXPECT_EQ(Zerith::publicKeyPath(), root / "/usr/share/zerith/publicKey.der");
+}
+
+}  // namespace
+}  // namespace zerith::test
