@@ -7,6 +7,7 @@
 #include <signal.h>
 #include <spawn.h>
 #include <sys/syscall.h>
+#include <sys/inotify.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -106,6 +107,33 @@ std::string NginxServer::url(std::string_view path) const {
 
 std::string NginxServer::errorLog() const { return readText(options_.workDir / "error.log"); }
 
+std::string NginxServer::accessLog() const { return readText(options_.workDir / "access.log"); }
+
+bool NginxServer::waitForAccessLog(std::string_view needle, std::chrono::milliseconds timeout) const {
+  // Woken by every change in the work folder instead of polling on a timer.
+  file::UniqueFd watch(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+  if (!watch || ::inotify_add_watch(watch.get(), options_.workDir.c_str(), IN_MODIFY | IN_CREATE) < 0) {
+    return false;
+  }
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  for (;;) {
+    if (accessLog().find(needle) != std::string::npos) {
+      return true;
+    }
+    const auto left =
+        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
+    if (left <= 0) {
+      return false;
+    }
+    pollfd p{watch.get(), POLLIN, 0};
+    if (::poll(&p, 1, static_cast<int>(left)) > 0) {
+      char events[4096];
+      while (::read(watch.get(), events, sizeof events) > 0) {
+      }
+    }
+  }
+}
+
 bool NginxServer::start(const TestCA& ca) {
   if (!available()) {
     error_ = "nginx is not installed";
@@ -142,7 +170,8 @@ bool NginxServer::start(const TestCA& ca) {
                       << "worker_processes 1;\n"
                       << "events { worker_connections 64; }\n"
                       << "http {\n"
-                      << "  access_log " << (dir / "access.log").string() << ";\n"
+                      << "  log_format zerith '$request_method $request_uri $status ims=\"$http_if_modified_since\"';\n"
+                      << "  access_log " << (dir / "access.log").string() << " zerith;\n"
                       << "  client_body_temp_path " << (dir / "tmp/body").string() << ";\n"
                       << "  proxy_temp_path " << (dir / "tmp/proxy").string() << ";\n"
                       << "  fastcgi_temp_path " << (dir / "tmp/fastcgi").string() << ";\n"

@@ -18,6 +18,7 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <filesystem>
 #include <string>
 #include <string_view>
@@ -54,6 +55,13 @@ class NginxServer {
 
   // nginx's error log so far, for failure messages.
   std::string errorLog() const;
+  // The access log so far, one line per answered request:
+  //   GET /bags/dravon?version=8.0 304 ims="Tue, 14 Nov 2023 22:13:20 GMT"
+  std::string accessLog() const;
+  // Waits until the access log holds `needle` (nginx writes the line after
+  // the answer, so a client may see the answer first); false on time-out.
+  bool waitForAccessLog(std::string_view needle,
+                        std::chrono::milliseconds timeout = std::chrono::seconds(10)) const;
 
   // Stops nginx (SIGTERM, then SIGKILL after five seconds) and reaps it.
   void stop();
