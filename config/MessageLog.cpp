@@ -1,0 +1,214 @@
+#include "config/MessageLog.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <charconv>
+#include <cmath>
+#include <cstring>
+#include <ctime>
+#include <system_error>
+#include <vector>
+
+#include "platform/FileUtil.h"
+#include "platform/Log.h"
+#include "platform/Paths.h"
+#include "platform/Value.h"
+
+namespace zerith {
+
+namespace {
+
+namespace fs = std::filesystem;
+
+const log::Logger& logger() {
+  static const log::Logger l("config");
+  return l;
+}
+
+constexpr std::string_view kPrefix = "zerithd";
+constexpr std::string_view kSuffix = "messageLog.diag";
+
+std::string describe(std::optional<double> date) { return date ? dateDescription(*date) : std::string("(null)"); }
+
+struct Current {
+  fs::path path;
+  std::optional<double> date;
+};
+
+// Steps 1 and 2: lists the folder (creating it when missing), removes
+// expired and superseded log files and answers the newest one left.
+std::optional<Current> rotate(const fs::path& folder, double now, const MessageLog::Options& options) {
+  std::vector<std::string> names;
+  std::error_code ec;
+  fs::directory_iterator it(folder, ec);
+  if (ec == std::errc::no_such_file_or_directory) {
+    logger().info("writeToLogFile: Creating zerithd log directory at {}", folder.string());
+    std::error_code createError;
+    fs::create_directories(folder, createError);
+  } else if (ec) {
+    logger().error("writeToLogFile: Error reading from log directory: {}", ec.message());
+  } else {
+    for (; it != fs::directory_iterator(); it.increment(ec)) {
+      names.push_back(it->path().filename().string());
+    }
+  }
+  // Listing order is the file system's; sort for a deterministic tie-break.
+  std::sort(names.begin(), names.end());
+
+  std::optional<Current> current;
+  for (const std::string& name : names) {
+    if (!isMessageLogFileName(name)) {
+      continue;
+    }
+    const fs::path path = folder / name;
+    const std::optional<double> date =
+        options.creationDate ? options.creationDate(path, name) : logFileCreationDate(path, name);
+    if (date && now - *date > kMessageLogExpirySeconds) {
+      deleteExpiredLogFile(path, date);
+    } else if (current) {
+      // A file without a date counts as older than any dated one.
+      if (date && (!current->date || *date > *current->date)) {
+        deleteExpiredLogFile(current->path, current->date);
+        current = Current{path, date};
+      } else {
+        deleteExpiredLogFile(path, date);
+      }
+    } else {
+      current = Current{path, date};
+    }
+  }
+  return current;
+}
+
+// Step 3: a new empty file named with the current time.
+std::optional<fs::path> startNewFile(const fs::path& folder, double now) {
+  const fs::path path = folder / messageLogFileName(static_cast<std::int64_t>(now));
+  file::UniqueFd fd(::open(path.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
+  if (::access(path.c_str(), F_OK) != 0) {
+    logger().error("writeToLogFile: Failed to create new zerithd log file {}", path.string());
+    return std::nullopt;
+  }
+  logger().info("writeToLogFile: Created new zerithd log file {} ({})", path.string(), dateDescription(now));
+  return path;
+}
+
+enum class AppendResult { Written, Vanished, Failed };
+
+AppendResult appendLine(const fs::path& path, std::string_view line) {
+  file::UniqueFd fd(::open(path.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC));
+  if (!fd) {
+    if (errno == ENOENT) {
+      return AppendResult::Vanished;
+    }
+    logger().error("writeToLogFile: Failed to write log message to {}: {}", path.string(), std::strerror(errno));
+    return AppendResult::Failed;
+  }
+  // One write carries the whole line; a short write (a full disk, a signal)
+  // is completed rather than lost.
+  while (!line.empty()) {
+    const ssize_t n = ::write(fd.get(), line.data(), line.size());
+    if (n < 0 && errno == EINTR) {
+      continue;
+    }
+    if (n <= 0) {
+      logger().error("writeToLogFile: Failed to write log message to {}: {}", path.string(),
+                     n < 0 ? std::strerror(errno) : "nothing written");
+      return AppendResult::Failed;
+    }
+    line.remove_prefix(static_cast<std::size_t>(n));
+  }
+  return AppendResult::Written;
+}
+
+}  // namespace
+
+void MessageLog::write(std::string_view message) const {
+  const fs::path folder = options_.folder.empty() ? paths::messageLogDir() : options_.folder;
+  // A concurrent writer may remove the file this one chose (it found a newer
+  // one); the choice is then made again, a bounded number of times.
+  for (int attempt = 0; attempt < 3; ++attempt) {
+    const double now = options_.now ? options_.now() : Date::now().secondsSince1970;
+    fs::path path;
+    if (auto current = rotate(folder, now, options_)) {
+      path = current->path;
+    } else if (auto created = startNewFile(folder, now)) {
+      path = *created;
+    } else {
+      return;
+    }
+    std::string line;
+    line.reserve(message.size() + 40);
+    line.append("(").append(dateDescription(now)).append(") ").append(message).append("\n");
+    switch (appendLine(path, line)) {
+      case AppendResult::Written:
+        logger().info("writeToLogFile: Saved log message to {}", path.string());
+        return;
+      case AppendResult::Failed:
+        return;
+      case AppendResult::Vanished:
+        continue;
+    }
+  }
+  logger().error("writeToLogFile: Gave up writing log message: the log file kept disappearing");
+}
+
+void deleteExpiredLogFile(const fs::path& path, std::optional<double> creationDate) {
+  std::error_code ignored;
+  fs::remove(path, ignored);
+  logger().info("writeToLogFile: Deleted expired zerithd log file {} ({})", path.string(), describe(creationDate));
+}
+
+bool isMessageLogFileName(std::string_view name) {
+  const auto first = name.find('_');
+  if (first == std::string_view::npos) {
+    return false;
+  }
+  const auto second = name.find('_', first + 1);
+  if (second == std::string_view::npos || name.find('_', second + 1) != std::string_view::npos) {
+    return false;
+  }
+  return name.substr(0, first) == kPrefix && name.substr(second + 1) == kSuffix;
+}
+
+std::string messageLogFileName(std::int64_t creationSeconds) {
+  return fmt::format("{}_{}_{}", kPrefix, creationSeconds, kSuffix);
+}
+
+std::optional<double> creationDateFromLogFileName(std::string_view name) {
+  if (!isMessageLogFileName(name)) {
+    return std::nullopt;
+  }
+  const auto first = name.find('_');
+  const std::string_view middle = name.substr(first + 1, name.find('_', first + 1) - first - 1);
+  std::int64_t seconds = 0;
+  const auto [end, ec] = std::from_chars(middle.data(), middle.data() + middle.size(), seconds);
+  if (ec != std::errc() || end != middle.data() + middle.size() || middle.empty()) {
+    return std::nullopt;
+  }
+  return static_cast<double>(seconds);
+}
+
+std::optional<double> logFileCreationDate(const fs::path& path, std::string_view name) {
+  struct statx stx {};
+  if (::statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BTIME, &stx) == 0 && (stx.stx_mask & STATX_BTIME)) {
+    return static_cast<double>(stx.stx_btime.tv_sec) + stx.stx_btime.tv_nsec / 1e9;
+  }
+  return creationDateFromLogFileName(name);
+}
+
+std::string dateDescription(double secondsSince1970) {
+  const auto seconds = static_cast<std::time_t>(std::floor(secondsSince1970));
+  std::tm utc{};
+  if (::gmtime_r(&seconds, &utc) == nullptr) {
+    return "(invalid date)";
+  }
+  char text[64];
+  const std::size_t n = std::strftime(text, sizeof(text), "%Y-%m-%d %H:%M:%S +0000", &utc);
+  return std::string(text, n);
+}
+
+}  // namespace zerith

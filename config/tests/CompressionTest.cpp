@@ -1,0 +1,102 @@
+#include <gtest/gtest.h>
+#include <zlib.h>
+
+#include <string>
+
+#include "config/Compression.h"
+#include "platform/Crypto.h"
+#include "platform/Log.h"
+
+namespace zerith {
+namespace {
+
+using log::Level;
+
+// zlib's own inflate; windowBits 31 reads gzip only, 15 zlib only.
+std::optional<Data> inflateWith(int windowBits, const Data& compressed) {
+  z_stream s{};
+  if (inflateInit2(&s, windowBits) != Z_OK) {
+    return std::nullopt;
+  }
+  Data out;
+  std::uint8_t chunk[16384];
+  s.next_in = const_cast<Bytef*>(compressed.data());
+  s.avail_in = static_cast<uInt>(compressed.size());
+  int rc = Z_OK;
+  while (rc == Z_OK) {
+    s.next_out = chunk;
+    s.avail_out = sizeof(chunk);
+    rc = inflate(&s, Z_NO_FLUSH);
+    out.insert(out.end(), chunk, chunk + (sizeof(chunk) - s.avail_out));
+  }
+  const bool complete = rc == Z_STREAM_END && s.avail_in == 0;
+  inflateEnd(&s);
+  return complete ? std::optional<Data>(out) : std::nullopt;
+}
+
+Data bytes(const std::string& s) { return Data(s.begin(), s.end()); }
+
+TEST(CompressionTest, EmptyBufferGivesNilAndItsError) {
+  log::LogCapture capture;
+  EXPECT_EQ(compressDataWithZlibOrGzip(true, Data{}), std::nullopt);
+  EXPECT_EQ(compressDataWithZlibOrGzip(false, Data{}), std::nullopt);
+  EXPECT_EQ(gzipDeflate(Data{}), std::nullopt);
+  EXPECT_TRUE(capture.has(Level::Error, "compressDataWithZlibOrGzip: Cannot compress empty QFData"));
+}
+
+TEST(CompressionTest, GzipAndZlibHeadersAndRoundTrips) {
+  Data random(100000);
+  crypto::randomBytes(random);
+  std::string text;
+  for (int i = 0; i < 2000; ++i) {
+    text += R"({"_sender":"YJ","_method":12,"_status":3,"eventTime":1700000000.25},)";
+  }
+  for (const Data& input : {bytes(text), random, bytes("a")}) {
+    const auto gz = compressDataWithZlibOrGzip(true, input);
+    ASSERT_TRUE(gz);
+    ASSERT_GE(gz->size(), 10u);
+    EXPECT_EQ((*gz)[0], 0x1f);
+    EXPECT_EQ((*gz)[1], 0x8b);
+    EXPECT_EQ((*gz)[2], 8);  // deflate
+    EXPECT_EQ(inflateWith(31, *gz), input);
+    EXPECT_EQ(inflateWith(15, *gz), std::nullopt);  // not a zlib stream
+
+    const auto z = compressDataWithZlibOrGzip(false, input);
+    ASSERT_TRUE(z);
+    EXPECT_EQ((*z)[0], 0x78);
+    EXPECT_EQ((*z)[1], 0x9c);  // default level
+    EXPECT_EQ(inflateWith(15, *z), input);
+    EXPECT_EQ(inflateWith(31, *z), std::nullopt);
+  }
+  // Text this repetitive must shrink a lot.
+  EXPECT_LT(compressDataWithZlibOrGzip(true, bytes(text))->size(), text.size() / 20);
+}
+
+TEST(CompressionTest, OneByteGrowsAndTheDebugLineReportsBothSizes) {
+  log::LogCapture capture;
+  const auto gz = gzipDeflate(bytes("x"));
+  ASSERT_TRUE(gz);
+  EXPECT_GT(gz->size(), 1u);
+  EXPECT_TRUE(capture.has(Level::Debug, "compressDataWithZlibOrGzip: Compressed file from 1 to " +
+                                            std::to_string(gz->size())));
+  EXPECT_EQ(gzipDeflate(bytes("x")), compressDataWithZlibOrGzip(true, bytes("x")));
+}
+
+TEST(CompressionTest, InitAndDeflateTablesDifferWhereTheyMust) {
+  EXPECT_STREQ(compression::initErrorMessage(Z_BUF_ERROR), "Unknown error code.");
+  EXPECT_STREQ(compression::deflateErrorMessage(Z_BUF_ERROR), "Ran out of output buffer for writing compressed bytes.");
+  EXPECT_STREQ(compression::initErrorMessage(Z_MEM_ERROR), "Insufficient memory.");
+  EXPECT_STREQ(compression::deflateErrorMessage(Z_MEM_ERROR), "Memory could not be allocated for processing.");
+  EXPECT_STREQ(compression::initErrorMessage(Z_STREAM_ERROR), "Invalid parameter passed in to function.");
+  EXPECT_STREQ(compression::deflateErrorMessage(Z_STREAM_ERROR),
+               "The stream state was inconsistent (e.g., next_in or next_out was NULL).");
+  EXPECT_STREQ(compression::initErrorMessage(Z_DATA_ERROR), "Unknown error code.");
+  EXPECT_STREQ(compression::deflateErrorMessage(Z_DATA_ERROR), "The deflate data was invalid or incomplete.");
+  EXPECT_STREQ(compression::initErrorMessage(Z_ERRNO), "Unknown error code.");
+  EXPECT_STREQ(compression::deflateErrorMessage(Z_ERRNO), "Error occured while reading file.");
+  EXPECT_STREQ(compression::initErrorMessage(Z_VERSION_ERROR), compression::deflateErrorMessage(Z_VERSION_ERROR));
+  EXPECT_STREQ(compression::deflateErrorMessage(42), "Unknown error code.");
+}
+
+}  // namespace
+}  // namespace zerith

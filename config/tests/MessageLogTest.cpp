@@ -1,0 +1,227 @@
+#include <gtest/gtest.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <fstream>
+#include <regex>
+#include <set>
+#include <thread>
+#include <vector>
+
+#include "config/MessageLog.h"
+#include "platform/Log.h"
+#include "platform/Paths.h"
+#include "platform/Value.h"
+#include "tests/support/TempRoot.h"
+
+namespace zerith {
+namespace {
+
+namespace fs = std::filesystem;
+using log::Level;
+
+constexpr double kNow = 1700000000;  // 2023-11-14 22:13:20 UTC
+constexpr double kHour = 3600;
+
+std::vector<std::string> linesOf(const fs::path& path) {
+  std::vector<std::string> lines;
+  std::ifstream in(path);
+  for (std::string line; std::getline(in, line);) {
+    lines.push_back(line);
+  }
+  return lines;
+}
+
+std::set<std::string> namesIn(const fs::path& folder) {
+  std::set<std::string> names;
+  for (const auto& entry : fs::directory_iterator(folder)) {
+    names.insert(entry.path().filename().string());
+  }
+  return names;
+}
+
+class MessageLogTest : public ::testing::Test {
+ protected:
+  // Ages come from the names here: birth times of files made by a test are
+  // all "now".
+  MessageLog byName() const {
+    return MessageLog({{}, [] { return kNow; }, [](const fs::path&, std::string_view name) {
+                         return creationDateFromLogFileName(name);
+                       }});
+  }
+  std::string fileAged(double hours) const {
+    const std::string name = messageLogFileName(static_cast<std::int64_t>(kNow - hours * kHour));
+    root_.write("/var/log/faultkeep/retired/" + name, "old line\n");
+    return name;
+  }
+  fs::path folder() const { return paths::messageLogDir(); }
+
+  test::TempRoot root_;
+  log::LogCapture capture_;
+  const std::string newName_ = messageLogFileName(static_cast<std::int64_t>(kNow));
+};
+
+TEST_F(MessageLogTest, MissingFolderIsCreatedAndANewFileStarted) {
+  byName().write("hello");
+  const fs::path file = folder() / newName_;
+  EXPECT_EQ(linesOf(file), std::vector<std::string>{"(2023-11-14 22:13:20 +0000) hello"});
+  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Creating zerithd log directory at " + folder().string()));
+  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Created new zerithd log file " + file.string() +
+                                               " (2023-11-14 22:13:20 +0000)"));
+  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Saved log message to " + file.string()));
+}
+
+TEST_F(MessageLogTest, OfTwoCurrentFilesTheOlderIsDeletedAndTheNewerWritten) {
+  const std::string older = fileAged(20);
+  const std::string newer = fileAged(10);
+  byName().write("line");
+  EXPECT_EQ(namesIn(folder()), std::set<std::string>{newer});
+  EXPECT_EQ(linesOf(folder() / newer),
+            (std::vector<std::string>{"old line", "(2023-11-14 22:13:20 +0000) line"}));
+  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
+                                               (folder() / older).string() + " (2023-11-14 02:13:20 +0000)"));
+  EXPECT_EQ(capture_.count("Created new zerithd log file"), 0u);
+}
+
+TEST_F(MessageLogTest, FileOlderThanADayIsDeletedAndANewOneStarted) {
+  const std::string expired = fileAged(25);
+  byName().write("fresh");
+  EXPECT_EQ(namesIn(folder()), std::set<std::string>{newName_});
+  EXPECT_EQ(linesOf(folder() / newName_), std::vector<std::string>{"(2023-11-14 22:13:20 +0000) fresh"});
+  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
+                                               (folder() / expired).string() + " (2023-11-13 21:13:20 +0000)"));
+}
+
+TEST_F(MessageLogTest, ExactlyOneDayOldIsNotYetExpired) {
+  const std::string day = fileAged(24);
+  byName().write("still");
+  EXPECT_EQ(namesIn(folder()), std::set<std::string>{day});
+}
+
+TEST_F(MessageLogTest, ForeignNamesAreLeftAlone) {
+  const std::set<std::string> foreign = {"zerithd_messageLog.diag", "other_1_messageLog.diag",
+                                         "zerithd_1_2_messageLog.diag", "zerithd_1_messageLog.diag.bak",
+                                         "Zerithd_1_messageLog.diag"};
+  for (const auto& name : foreign) {
+    root_.write("/var/log/faultkeep/retired/" + name, "x\n");
+  }
+  byName().write("mine");
+  std::set<std::string> expected = foreign;
+  expected.insert(newName_);
+  EXPECT_EQ(namesIn(folder()), expected);
+  EXPECT_EQ(capture_.count("Deleted expired"), 0u);
+}
+
+TEST_F(MessageLogTest, FileWithoutCreationDateIsNeverExpiredButLosesToADatedOne) {
+  root_.write("/var/log/faultkeep/retired/zerithd_undated_messageLog.diag", "");
+  byName().write("one");
+  EXPECT_EQ(linesOf(folder() / "zerithd_undated_messageLog.diag"),
+            std::vector<std::string>{"(2023-11-14 22:13:20 +0000) one"});
+
+  const std::string dated = fileAged(23);
+  byName().write("two");
+  EXPECT_EQ(namesIn(folder()), std::set<std::string>{dated});
+  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
+                                               (folder() / "zerithd_undated_messageLog.diag").string() + " ((null))"));
+}
+
+TEST_F(MessageLogTest, BirthTimeWinsOverTheTimeInTheName) {
+  // With the real clock and creation dates: a file whose name says 25 hours
+  // but which was born just now is current, not expired.
+  const std::string name = messageLogFileName(static_cast<std::int64_t>(Date::now().secondsSince1970 - 25 * kHour));
+  root_.write("/var/log/faultkeep/retired/" + name, "");
+  struct statx stx {};
+  ASSERT_EQ(::statx(AT_FDCWD, (folder() / name).c_str(), 0, STATX_BTIME, &stx), 0);
+  if (!(stx.stx_mask & STATX_BTIME)) {
+    GTEST_SKIP() << "this file system records no birth times";
+  }
+  writeToLogFile("[{} -> sendMessageWithDictionary] {}", "httpsPost", "sent");
+  EXPECT_EQ(namesIn(folder()), std::set<std::string>{name});
+  const auto lines = linesOf(folder() / name);
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_TRUE(std::regex_match(
+      lines[0], std::regex(R"(\(\d{4}-\d\d-\d\d \d\d:\d\d:\d\d \+0000\) \[httpsPost -> sendMessageWithDictionary\] sent)")))
+      << lines[0];
+}
+
+TEST_F(MessageLogTest, UnlistableFolderIsReportedAndNothingCrashes) {
+  root_.write("/var/log/faultkeep/retired", "a file where the folder should be");
+  byName().write("lost");
+  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Error reading from log directory: Not a directory"));
+  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Failed to create new zerithd log file " +
+                                             (folder() / newName_).string()));
+  EXPECT_EQ(capture_.count("Saved log message"), 0u);
+}
+
+TEST_F(MessageLogTest, FolderThatCannotBeCreatedStopsTheWrite) {
+  // The folder's name is a dangling link: the folder does not exist, and
+  // making it fails because the name is taken.
+  fs::create_directories(folder().parent_path());
+  fs::create_symlink(root_ / "/missing/retired", folder());
+  byName().write("lost");
+  EXPECT_TRUE(capture_.contains("writeToLogFile: Creating zerithd log directory at"));
+  EXPECT_TRUE(capture_.contains("writeToLogFile: Failed to create new zerithd log file"));
+  EXPECT_EQ(capture_.count("Saved log message"), 0u);
+}
+
+TEST_F(MessageLogTest, UnwritableCurrentFileIsReportedNotSaved) {
+  // A folder under a log file's name cannot be opened for writing.
+  fs::create_directories(folder() / newName_);
+  byName().write("lost");
+  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Failed to write log message to " +
+                                             (folder() / newName_).string() + ": Is a directory"));
+  EXPECT_EQ(capture_.count("Saved log message"), 0u);
+}
+
+TEST_F(MessageLogTest, ConcurrentAppendsNeverInterleaveInsideALine) {
+  byName().write("start");
+  constexpr int kThreads = 8;
+  constexpr int kLines = 150;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      const MessageLog log = byName();
+      for (int i = 0; i < kLines; ++i) {
+        // Lengths up to 12 KB: far beyond any single page.
+        const std::size_t length = static_cast<std::size_t>((t * 7919 + i * 104729) % 12000);
+        log.write("T" + std::to_string(t) + "-" + std::to_string(i) + "-" + std::to_string(length) + ":" +
+                  std::string(length, static_cast<char>('a' + t)));
+      }
+    });
+  }
+  for (auto& th : threads) {
+    th.join();
+  }
+  const auto lines = linesOf(folder() / newName_);
+  ASSERT_EQ(lines.size(), static_cast<std::size_t>(1 + kThreads * kLines));
+  const std::regex shape(R"(\(2023-11-14 22:13:20 \+0000\) T(\d)-(\d+)-(\d+):([a-h]*))");
+  std::set<std::string> seen;
+  for (std::size_t i = 1; i < lines.size(); ++i) {
+    std::smatch m;
+    ASSERT_TRUE(std::regex_match(lines[i], m, shape)) << lines[i].substr(0, 80);
+    const int t = std::stoi(m[1]);
+    EXPECT_EQ(m[4].length(), std::stol(m[3]));
+    EXPECT_EQ(m[4].str().find_first_not_of(static_cast<char>('a' + t)), std::string::npos);
+    seen.insert(m[1].str() + "-" + m[2].str());
+  }
+  EXPECT_EQ(seen.size(), static_cast<std::size_t>(kThreads * kLines));
+}
+
+TEST(MessageLogNamesTest, ThreePartNamesAndTheirDates) {
+  EXPECT_TRUE(isMessageLogFileName("zerithd_1700000000_messageLog.diag"));
+  EXPECT_TRUE(isMessageLogFileName("zerithd__messageLog.diag"));  // three parts, the middle empty
+  EXPECT_FALSE(isMessageLogFileName("zerithd_messageLog.diag"));
+  EXPECT_FALSE(isMessageLogFileName("zerithd_1_2_messageLog.diag"));
+  EXPECT_FALSE(isMessageLogFileName("other_1_messageLog.diag"));
+  EXPECT_FALSE(isMessageLogFileName("zerithd_1_messageLog.diag.gz"));
+  EXPECT_EQ(messageLogFileName(1700000000), "zerithd_1700000000_messageLog.diag");
+  EXPECT_EQ(creationDateFromLogFileName("zerithd_1700000000_messageLog.diag"), 1700000000.0);
+  EXPECT_EQ(creationDateFromLogFileName("zerithd__messageLog.diag"), std::nullopt);
+  EXPECT_EQ(creationDateFromLogFileName("zerithd_12abc_messageLog.diag"), std::nullopt);
+  EXPECT_EQ(creationDateFromLogFileName("zerithd_99999999999999999999_messageLog.diag"), std::nullopt);
+  EXPECT_EQ(dateDescription(0), "1970-01-01 00:00:00 +0000");
+  EXPECT_EQ(dateDescription(1700000000.75), "2023-11-14 22:13:20 +0000");
+}
+
+}  // namespace
+}  // namespace zerith
