@@ -1,0 +1,393 @@
+#include "tools/zerith/ZerithCli.h"
+
+#include <CLI/CLI.hpp>
+
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/Crypto.h"
+#include "platform/Json.h"
+#include "platform/Log.h"
+#include "platform/Paths.h"
+#include "zerith/Zerith.h"
+
+namespace zerith::cli {
+
+namespace {
+
+constexpr const char* kStepsHelp = R"(Steps run in the order given, on one connection (the session lives as long as it):
+  set-info               setSessionInfo from the session options
+  start                  startConfig                 -> {"step":"start","backends":[...]}
+  states[=USERINFO]      fetchStates with USERINFO (JSON) or --user-info
+  display-url            fetchDisplayURL             -> {"step":"display-url","url":"..."}
+  send[=MESSAGE]         sendMessageWithDictionary; MESSAGE is a JSON dictionary
+                         {"category":C,"type":T,"payload":{...}}, default built from
+                         --category/--type/--payload  -> {"step":"send","result":...}
+  flush                  flushMessages               -> {"step":"flush","result":...,"error":...}
+  one-shot[=MESSAGE]     sendMessageWithSessionInfo with the session options and
+                         MESSAGE's category, type and payload
+  upload-file=PATH       uploadFileAtPath (--extension-token for the token)
+  upload-log=ARRAY       uploadLogData with a JSON array
+  shared-data=DICT       updateSharedDataWithDictionary with a JSON dictionary
+  shared-key=KEY=VALUE   updateSharedDataForKey; VALUE is JSON, null removes the key
+  digest-key=BASE64[:N]  setDigestKey with the key bytes and algorithm N (default 0)
+  wait=MS                wait MS milliseconds (the daemon's messages print meanwhile)
+  finish                 finishSessionGracefully
+Messages the daemon sends print as {"event":"message",...} lines whenever they arrive.
+
+Example:
+  zerith session --client-type 7 --session-id 1 \
+      --step set-info --step start --step display-url \
+      --category 1 --type 2 --payload '{"k":"v"}' --step send --step flush --step finish)";
+
+struct Step {
+  std::string name;
+  std::optional<std::string> argument;
+};
+
+struct SessionOptions {
+  std::uint32_t clientType = 0;
+  std::uint32_t sessionID = 0;
+  std::optional<std::string> userInfo;
+  std::optional<std::string> sessionInfo;
+  std::optional<std::string> frameworks;
+  bool requireUserInfo = false;
+  bool aggregation = false;
+  bool batchEvent = false;
+  std::optional<std::int64_t> clientVersion;
+  std::optional<std::string> hierarchyToken;
+  std::uint32_t hierarchyLevel = 0;
+  std::uint32_t category = 0;
+  std::uint32_t type = 0;
+  std::string payload = "{}";
+  std::optional<std::string> extensionToken;
+  std::vector<std::string> steps;
+};
+
+const std::vector<std::string> kStepNames = {"set-info",   "start",       "states",     "display-url", "send",
+                                             "flush",      "one-shot",    "upload-file", "upload-log",  "shared-data",
+                                             "shared-key", "digest-key",  "wait",        "finish"};
+
+class Failure : public std::runtime_error {
+ public:
+  Failure(int code, const std::string& what) : std::runtime_error(what), code(code) {}
+  int code;
+};
+
+Value parseJson(const std::string& text, const std::string& what) {
+  auto parsed = nlohmann::ordered_json::parse(text, nullptr, false);
+  if (parsed.is_discarded()) {
+    throw Failure(kExitUsage, what + " is not valid JSON: " + text);
+  }
+  return json::fromJson(parsed);
+}
+
+Value parseDictionary(const std::optional<std::string>& text, const std::string& what) {
+  if (!text) {
+    return Value();
+  }
+  Value v = parseJson(*text, what);
+  if (!v.isDict()) {
+    throw Failure(kExitUsage, what + " must be a JSON dictionary");
+  }
+  return v;
+}
+
+class Runner {
+ public:
+  Runner(std::ostream& out, SessionOptions options, std::chrono::milliseconds timeout)
+      : out_(out), o_(std::move(options)), timeout_(timeout) {}
+
+  int run(const std::filesystem::path& socket) {
+    std::vector<Step> steps;
+    for (const auto& text : o_.steps) {
+      const auto eq = text.find('=');
+      Step step{text.substr(0, eq), eq == std::string::npos ? std::nullopt : std::optional(text.substr(eq + 1))};
+      if (std::find(kStepNames.begin(), kStepNames.end(), step.name) == kStepNames.end()) {
+        throw Failure(kExitUsage, "unknown step \"" + step.name + "\" (see zerith session --help)");
+      }
+      steps.push_back(std::move(step));
+    }
+    sessionInfo_ = buildSessionInfo();
+    userInfo_ = parseDictionary(o_.userInfo, "--user-info");
+    std::vector<Action> actions;
+    for (const auto& step : steps) {
+      actions.push_back(compile(step));
+    }
+
+    Error error;
+    session_ = Zerith::connect(socket, &error);
+    if (!session_) {
+      throw Failure(kExitUnreachable, "the daemon is unreachable: " + error.description);
+    }
+    session_->setMessageHandler([this](const Value& m, double t, std::uint16_t c, std::uint16_t ty, const Value& p) {
+      print(Value(Dictionary{{"event", "message"}, {"message", m}, {"timestamp", t}, {"category", unsigned{c}},
+                             {"type", unsigned{ty}}, {"payload", p}}));
+    });
+    for (std::size_t i = 0; i < steps.size(); ++i) {
+      runStep(steps[i].name, actions[i]);
+    }
+    session_.reset();
+    return 0;
+  }
+
+ private:
+  Value buildSessionInfo() {
+    Dictionary info{{kZerithSessionInfoSessionID, Value(unsigned{o_.sessionID})},
+                    {kZerithSessionInfoClientType, Value(unsigned{o_.clientType})}};
+    if (o_.requireUserInfo) {
+      info.set(kZerithSessionInfoRequireUserInfo, true);
+    }
+    if (o_.batchEvent) {
+      info.set(kZerithSessionInfoBatchEvent, true);
+    }
+    if (o_.clientVersion) {
+      info.set(kZerithSessionInfoClientVersion, Value(static_cast<long long>(*o_.clientVersion)));
+    }
+    if (o_.hierarchyToken) {
+      info.set(kZerithSessionInfoHierarchyToken,
+               Dictionary{{kZerithHierarchyTokenTokenID, *o_.hierarchyToken},
+                          {kZerithHierarchyTokenLevel, Value(unsigned{o_.hierarchyLevel})}});
+    }
+    // --session-info entries win over the ones built from options.
+    if (const auto* extra = parseDictionary(o_.sessionInfo, "--session-info").dict()) {
+      for (const auto& [key, value] : *extra) {
+        info.set(key, value);
+      }
+    }
+    return Value(std::move(info));
+  }
+
+  Value message(const Step& step) {
+    if (step.argument) {
+      return parseDictionary(step.argument, step.name + " message");
+    }
+    return Value(Dictionary{{kZerithMessageParametersCategory, Value(unsigned{o_.category})},
+                            {kZerithMessageParametersType, Value(unsigned{o_.type})},
+                            {kZerithMessageParametersPayload, parseDictionary(o_.payload, "--payload")}});
+  }
+
+  const std::string& need(const Step& step) {
+    if (!step.argument) {
+      throw Failure(kExitUsage, "step " + step.name + " needs an argument (" + step.name + "=...)");
+    }
+    return *step.argument;
+  }
+
+  using Action = std::function<ZerithReply()>;
+
+  // Turns a step into the call it makes; every argument is checked here,
+  // before the session is opened.
+  Action compile(const Step& step) {
+    const auto& n = step.name;
+    if (n == "set-info") {
+      Value frameworks = o_.frameworks ? parseJson(*o_.frameworks, "--frameworks") : Value();
+      if (!frameworks.isNil() && !frameworks.isArray()) {
+        throw Failure(kExitUsage, "--frameworks must be a JSON array");
+      }
+      return [this, frameworks] {
+        return session_->setSessionInfo(sessionInfo_, userInfo_, frameworks, o_.aggregation, timeout_);
+      };
+    }
+    if (n == "start") {
+      return [this] { return session_->startConfig(timeout_); };
+    }
+    if (n == "states") {
+      const Value user = step.argument ? parseDictionary(step.argument, "states user info") : userInfo_;
+      return [this, user] { return session_->fetchStates(user, timeout_); };
+    }
+    if (n == "display-url") {
+      return [this] { return session_->fetchDisplayURL(timeout_); };
+    }
+    if (n == "send") {
+      const Value m = message(step);
+      return [this, m] { return session_->sendMessage(m, timeout_); };
+    }
+    if (n == "flush") {
+      return [this] { return session_->flushMessages(timeout_); };
+    }
+    if (n == "one-shot") {
+      const Value m = message(step);
+      const auto field = [&](const char* key) {
+        const Value v = m[key];
+        if (!v.isNumber() || v.intValue() < 0 || v.intValue() > 65535) {
+          throw Failure(kExitUsage, std::string("one-shot ") + key + " must be a number from 0 to 65535");
+        }
+        return static_cast<std::uint16_t>(v.intValue());
+      };
+      const auto category = field(kZerithMessageParametersCategory);
+      const auto type = field(kZerithMessageParametersType);
+      const Value payload = m[kZerithMessageParametersPayload];
+      return [this, category, type, payload] {
+        return session_->sendMessageWithSessionInfo(sessionInfo_, userInfo_, category, type, payload, timeout_);
+      };
+    }
+    if (n == "upload-file") {
+      const Value file(need(step));
+      const Value token = o_.extensionToken ? Value(*o_.extensionToken) : Value();
+      return [this, file, token] { return session_->uploadFile(file, token, timeout_); };
+    }
+    if (n == "upload-log") {
+      const Value data = parseJson(need(step), "upload-log data");
+      if (!data.isArray()) {
+        throw Failure(kExitUsage, "upload-log data must be a JSON array");
+      }
+      return [this, data] { return session_->uploadLogData(data, timeout_); };
+    }
+    if (n == "shared-data") {
+      const Value d = parseDictionary(need(step), "shared-data");
+      return [this, d] { return session_->updateSharedData(d, timeout_); };
+    }
+    if (n == "shared-key") {
+      const std::string& arg = need(step);
+      const auto eq = arg.find('=');
+      if (eq == std::string::npos || eq == 0) {
+        throw Failure(kExitUsage, "shared-key needs KEY=VALUE");
+      }
+      const Value key(arg.substr(0, eq));
+      const Value value = parseJson(arg.substr(eq + 1), "shared-key value");
+      return [this, key, value] { return session_->updateSharedDataForKey(key, value, timeout_); };
+    }
+    if (n == "digest-key") {
+      const std::string& arg = need(step);
+      const auto colon = arg.find(':');
+      const auto key = crypto::base64Decode(arg.substr(0, colon));
+      if (!key) {
+        throw Failure(kExitUsage, "digest-key must be base64");
+      }
+      std::int32_t algorithm = 0;
+      try {
+        algorithm = colon == std::string::npos ? 0 : std::stoi(arg.substr(colon + 1));
+      } catch (const std::exception&) {
+        throw Failure(kExitUsage, "digest-key algorithm must be a number");
+      }
+      const Value k(*key);
+      return [this, k, algorithm] { return session_->setDigestKey(k, algorithm, timeout_); };
+    }
+    if (n == "wait") {
+      long ms = 0;
+      try {
+        ms = std::stol(need(step));
+      } catch (const std::exception&) {
+        throw Failure(kExitUsage, "wait needs a number of milliseconds");
+      }
+      return [ms] {
+        std::this_thread::sleep_for(std::chrono::milliseconds(ms));
+        return ZerithReply{};
+      };
+    }
+    return [this] { return session_->finishSession(timeout_); };  // "finish"
+  }
+
+  void runStep(const std::string& n, const Action& action) {
+    const ZerithReply reply = action();
+    Dictionary line{{"step", n}};
+    if (reply.error) {
+      line.set("failure", reply.error->description);
+      print(Value(std::move(line)));
+      // A connection that ended before anything was answered: the daemon
+      // turned the client away.
+      if (!session_->isValid() && !answered_) {
+        throw Failure(kExitRefused, "the daemon closed the session during " + n +
+                                        " (is this user granted com.velmar.private.zerithd?)");
+      }
+      throw Failure(kExitStepFailed, n + ": " + reply.error->description);
+    }
+    answered_ = true;
+    for (const auto& [key, value] : reply.arguments) {
+      line.set(key, value);
+    }
+    print(Value(std::move(line)));
+  }
+
+  void print(const Value& line) {
+    std::lock_guard lock(outMutex_);
+    out_ << json::serialize(line) << '\n' << std::flush;
+  }
+
+  std::ostream& out_;
+  SessionOptions o_;
+  std::chrono::milliseconds timeout_;
+  std::unique_ptr<Zerith> session_;
+  Value sessionInfo_;
+  Value userInfo_;
+  bool answered_ = false;
+  std::mutex outMutex_;
+};
+
+}  // namespace
+
+int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err) {
+  CLI::App app{"zerith: talk to the zerithd reporting daemon from the shell.\n"
+               "Run `zerith session --help` for scripted sessions."};
+  app.name("zerith");
+  std::optional<std::string> root;
+  std::optional<std::string> socket;
+  long timeoutMs = 30000;
+  bool debug = false;
+  app.add_option("--root", root, "Root folder of the daemon's files (default: ZERITHD_ROOT, / for root, else ~/.local/share/zerithd/root)");
+  app.add_option("--socket", socket, "The daemon's socket (default: <root>/run/zerithd/com.velmar.zerithd)");
+  app.add_option("--timeout", timeoutMs, "Milliseconds to wait for each answer")->capture_default_str()->check(CLI::PositiveNumber);
+  app.add_flag("--debug", debug, "Log debug lines to standard error");
+  app.require_subcommand(1);
+
+  SessionOptions o;
+  auto* session = app.add_subcommand("session", "Run one reporting session as a sequence of steps");
+  session->footer(kStepsHelp);
+  session->add_option("--client-type", o.clientType, "Client type (session info clientType)")->required();
+  session->add_option("--session-id", o.sessionID, "Session number (session info sessionID)")->required();
+  session->add_option("--user-info", o.userInfo, "User info, a JSON dictionary");
+  session->add_option("--session-info", o.sessionInfo, "Extra session info entries, a JSON dictionary");
+  session->add_flag("--require-user-info", o.requireUserInfo, "Session info requireUserInfo = true");
+  session->add_flag("--batch-event", o.batchEvent, "Session info batchEvent = true");
+  session->add_option("--client-version", o.clientVersion, "Session info clientVersion");
+  session->add_option("--hierarchy-token", o.hierarchyToken, "Hierarchy token ID shared by related sessions");
+  session->add_option("--hierarchy-level", o.hierarchyLevel, "Level in the hierarchy (0 = root)");
+  session->add_option("--frameworks", o.frameworks, "frameworksToCheck, a JSON array");
+  session->add_flag("--aggregation", o.aggregation, "Declare an aggregation block");
+  session->add_option("--category", o.category, "Category of send/one-shot steps without a MESSAGE")->check(CLI::Range(0, 65535));
+  session->add_option("--type", o.type, "Type of send/one-shot steps without a MESSAGE")->check(CLI::Range(0, 65535));
+  session->add_option("--payload", o.payload, "Payload of send/one-shot steps without a MESSAGE (JSON dictionary)");
+  session->add_option("--extension-token", o.extensionToken, "Sandbox extension token for upload-file");
+  session->add_option("--step", o.steps, "A step (repeat; see below)")->required();
+
+  bool dnu = false;
+  auto* identifier = app.add_subcommand("identifier", "Print this device's persistent identifier");
+  identifier->add_flag("--dnu", dnu, "The identifier kept for DNU reporting");
+  auto* version = app.add_subcommand("version", "Print the framework version and public-key location");
+
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    const int code = app.exit(e, out, err);
+    return code == 0 ? 0 : kExitUsage;
+  }
+
+  log::configure(log::Options{debug, std::nullopt});
+  if (root) {
+    paths::setRoot(*root);
+  }
+  try {
+    if (*identifier) {
+      out << json::serialize(Value(Dictionary{{"identifier", Zerith::getPersistentIdentifierForDNU(dnu)}, {"dnu", dnu}}))
+          << '\n';
+      return 0;
+    }
+    if (*version) {
+      out << json::serialize(Value(Dictionary{{"version", Zerith::frameworkVersion()},
+                                              {"publicKey", Zerith::publicKeyPath().string()}}))
+          << '\n';
+      return 0;
+    }
+    Runner runner(out, std::move(o), std::chrono::milliseconds(timeoutMs));
+    return runner.run(socket ? std::filesystem::path(*socket) : Zerith::defaultSocketPath());
+  } catch (const Failure& f) {
+    err << "zerith: " << f.what() << '\n';
+    return f.code;
+  }
+}
+
+}  // namespace zerith::cli
