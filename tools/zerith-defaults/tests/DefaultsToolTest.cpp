@@ -1,0 +1,123 @@
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+
+#include <cstdio>
+#include <fstream>
+#include <sstream>
+
+#include "platform/Defaults.h"
+#include "platform/PropertyList.h"
+#include "tests/support/TempRoot.h"
+#include "tools/zerith-defaults/DefaultsTool.h"
+
+namespace zerith {
+namespace {
+
+struct Result {
+  int status;
+  std::string out;
+  std::string err;
+};
+
+class DefaultsToolTest : public ::testing::Test {
+ protected:
+  Result run(std::vector<std::string> words) {
+    std::ostringstream out, err;
+    const int status = tool::runDefaultsCommand(words, out, err);
+    return {status, out.str(), err.str()};
+  }
+
+  // The real executable, as an operator runs it.
+  Result runTool(const std::string& arguments) {
+    const auto errFile = root_ / "/stderr.txt";
+    const std::string command = std::string(ZERITH_DEFAULTS_TOOL) + " --root '" + root_.path().string() + "' " +
+                                arguments + " 2>'" + errFile.string() + "'";
+    Result r{-1, {}, {}};
+    FILE* pipe = ::popen(command.c_str(), "r");
+    if (pipe == nullptr) {
+      return r;
+    }
+    char buffer[4096];
+    for (std::size_t n; (n = std::fread(buffer, 1, sizeof(buffer), pipe)) > 0;) {
+      r.out.append(buffer, n);
+    }
+    const int status = ::pclose(pipe);
+    r.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    std::ifstream in(errFile);
+    r.err.assign(std::istreambuf_iterator<char>(in), {});
+    return r;
+  }
+
+  test::TempRoot root_;
+  const Defaults domain_{"com.velmar.zerith"};
+};
+
+TEST_F(DefaultsToolTest, TypedWritesAsTheExecutableParsesThem) {
+  EXPECT_EQ(runTool("write com.velmar.zerith environmentType -int -1").status, 0);
+  EXPECT_EQ(runTool("write com.velmar.zerith forceEventLogging -bool YES").status, 0);
+  EXPECT_EQ(runTool("write com.velmar.zerith ratio -real 0.25").status, 0);
+  EXPECT_EQ(runTool("write com.velmar.zerith httpsPostURL https://127.0.0.1:8443/post").status, 0);
+  EXPECT_EQ(runTool("write com.velmar.zerith label -string -int").status, 0);
+  EXPECT_EQ(domain_.objectForKey("environmentType"), Value(-1));
+  EXPECT_EQ(domain_.objectForKey("forceEventLogging"), Value(true));
+  EXPECT_EQ(domain_.objectForKey("ratio"), Value(0.25));
+  EXPECT_EQ(domain_.objectForKey("httpsPostURL"), Value("https://127.0.0.1:8443/post"));
+  EXPECT_EQ(domain_.objectForKey("label"), Value("-int"));
+
+  const Result read = runTool("read com.velmar.zerith environmentType");
+  EXPECT_EQ(read.status, 0);
+  EXPECT_EQ(read.out, "-1\n");
+}
+
+TEST_F(DefaultsToolTest, ReadPrintsPlainScalarsAndXmlOtherwise) {
+  ASSERT_TRUE(domain_.setObject("flag", Value(false)));
+  ASSERT_TRUE(domain_.setObject("list", Value(Array{Value(1), Value("two")})));
+  ASSERT_TRUE(domain_.setObject("when", Value(Date{1700000000})));
+  EXPECT_EQ(run({"read", "com.velmar.zerith", "flag"}).out, "0\n");
+  EXPECT_EQ(run({"read", "com.velmar.zerith", "when"}).out, "2023-11-14 22:13:20 +0000\n");
+  const Result list = run({"read", "com.velmar.zerith", "list"});
+  EXPECT_EQ(plist::decodeXml(plist::bytesOf(list.out)), Value(Array{Value(1), Value("two")}));
+  const Result whole = run({"read", "com.velmar.zerith"});
+  EXPECT_EQ(whole.status, 0);
+  EXPECT_EQ(plist::decodeXml(plist::bytesOf(whole.out)), domain_.dictionary());
+}
+
+TEST_F(DefaultsToolTest, MissingDomainOrKeyIsStatusOneWithAMessage) {
+  Result r = run({"read", "com.velmar.nothing"});
+  EXPECT_EQ(r.status, tool::kNotFound);
+  EXPECT_EQ(r.err, "zerith-defaults: domain com.velmar.nothing does not exist\n");
+  ASSERT_TRUE(domain_.setObject("a", Value(1)));
+  r = run({"read", "com.velmar.zerith", "b"});
+  EXPECT_EQ(r.status, tool::kNotFound);
+  EXPECT_EQ(r.err, "zerith-defaults: domain com.velmar.zerith has no key b\n");
+  EXPECT_EQ(run({"delete", "com.velmar.zerith", "b"}).status, tool::kNotFound);
+}
+
+TEST_F(DefaultsToolTest, BadValuesAndBadCommandLinesChangeNothing) {
+  ASSERT_TRUE(domain_.setObject("environmentType", Value(2)));
+  Result r = run({"write", "com.velmar.zerith", "environmentType", "-int", "4x"});
+  EXPECT_EQ(r.status, tool::kUsage);
+  EXPECT_EQ(r.err, "zerith-defaults: '4x' is not an integer\n");
+  EXPECT_EQ(run({"write", "com.velmar.zerith", "f", "-bool", "maybe"}).status, tool::kUsage);
+  EXPECT_EQ(run({"write", "com.velmar.zerith", "r", "-real", "inf"}).status, tool::kUsage);
+  EXPECT_EQ(run({"write", "com.velmar.zerith", "r", "-date", "now"}).status, tool::kUsage);
+  EXPECT_EQ(run({"write", "../../etc/passwd", "k", "v"}).status, tool::kUsage);
+  EXPECT_EQ(run({"frobnicate"}).status, tool::kUsage);
+  EXPECT_EQ(run({}).status, tool::kUsage);
+  EXPECT_EQ(domain_.objectForKey("environmentType"), Value(2));
+  EXPECT_EQ(domain_.dictionary().count(), 1u);
+}
+
+TEST_F(DefaultsToolTest, DeleteRemovesAKeyOrTheWholeDomain) {
+  ASSERT_TRUE(domain_.setObject("a", Value(1)));
+  ASSERT_TRUE(domain_.setObject("b", Value(2)));
+  EXPECT_EQ(run({"delete", "com.velmar.zerith", "a"}).status, 0);
+  EXPECT_TRUE(domain_.objectForKey("a").isNil());
+  EXPECT_EQ(domain_.objectForKey("b"), Value(2));
+  EXPECT_EQ(runTool("delete com.velmar.zerith").status, 0);
+  EXPECT_FALSE(std::filesystem::exists(domain_.path()));
+  EXPECT_EQ(run({"delete", "com.velmar.zerith"}).status, tool::kNotFound);
+}
+
+}  // namespace
+}  // namespace zerith
