@@ -57,10 +57,12 @@ class Dictionary {
   bool erase(std::string_view key);
   void clear();
 
-  std::size_t size() const { return entries_.size(); }
-  bool empty() const { return entries_.empty(); }
-  auto begin() const { return entries_.begin(); }
-  auto end() const { return entries_.end(); }
+  // Defined below Value: until Value is complete, clang cannot instantiate
+  // the entries' members.
+  std::size_t size() const;
+  bool empty() const;
+  std::vector<Entry>::const_iterator begin() const;
+  std::vector<Entry>::const_iterator end() const;
   const std::vector<Entry>& entries() const { return entries_; }
 
   bool operator==(const Dictionary& other) const;
@@ -149,5 +151,10 @@ class Value {
                                zerith::Date, zerith::Array, zerith::Dictionary>;
   std::shared_ptr<const Storage> node_;
 };
+
+inline std::size_t Dictionary::size() const { return entries_.size(); }
+inline bool Dictionary::empty() const { return entries_.empty(); }
+inline std::vector<Dictionary::Entry>::const_iterator Dictionary::begin() const { return entries_.begin(); }
+inline std::vector<Dictionary::Entry>::const_iterator Dictionary::end() const { return entries_.end(); }
 
 }  // namespace zerith
