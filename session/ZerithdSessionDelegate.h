@@ -24,6 +24,9 @@ class ZerithdSessionDelegate {
 
   virtual std::recursive_mutex& agentLock() = 0;
 
+  // For logs.
+  virtual std::string description() const { return "<ZerithdSessionDelegate>"; }
+
   // Keep-alive: called by a connectivity helper once its HTTP session has
   // become invalid.
   virtual void releaseVeskTransaction() = 0;

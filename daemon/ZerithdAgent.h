@@ -1,0 +1,116 @@
+#pragma once
+
+// The agent: decides which connecting processes may use the service, creates
+// one ZerithdSession per accepted connection and keeps the list of live
+// sessions, holds the keep-alive transaction while any session (or its
+// transport) is alive, and answers the sessions' questions about storebags,
+// their hierarchy, shared data and health figures.
+//
+// One recursive lock (agentLock) guards the session list, the hierarchy
+// table, the shared data, the storebag cache and the keep-alive count;
+// sessions take the same lock when they call in. The agent is owned by a
+// shared_ptr: sessions and connectivity helpers hold it weakly.
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "daemon/KeepAliveTransaction.h"
+#include "daemon/StorebagCache.h"
+#include "ipc/Listener.h"
+#include "platform/SerialQueue.h"
+#include "platform/Value.h"
+#include "session/ZerithdSessionDelegate.h"
+
+namespace zerith {
+
+class ZerithdSession;
+
+class ZerithdAgent final : public ZerithdSessionDelegate,
+                           public ipc::ListenerDelegate,
+                           public std::enable_shared_from_this<ZerithdAgent> {
+ public:
+  static std::shared_ptr<ZerithdAgent> create(std::shared_ptr<KeepAliveTransaction> transaction,
+                                              std::unique_ptr<StorebagCache> storebags);
+  ~ZerithdAgent() override;
+
+  ZerithdAgent(const ZerithdAgent&) = delete;
+  ZerithdAgent& operator=(const ZerithdAgent&) = delete;
+
+  // Listener delegate.
+  bool shouldAcceptNewConnection(ipc::Listener& listener, std::shared_ptr<ipc::Connection> connection) override;
+
+  // The new session, or nullptr when it could not be made. The session list
+  // holds the only reference the agent keeps.
+  std::shared_ptr<ZerithdSession> createReportingSessionWithDelegate(std::weak_ptr<ZerithdSessionDelegate> delegate,
+                                                                     std::shared_ptr<ipc::Connection> connection);
+  void invalidateReportingSession(const std::shared_ptr<ZerithdSession>& session);
+
+  // ZerithdSessionDelegate.
+  std::recursive_mutex& agentLock() override { return lock_; }
+  void releaseVeskTransaction() override;
+
+  Value storebagForSession(ZerithdSession& session) override;
+  Value storebagVersionForSession(ZerithdSession& session) override;
+
+  void updateCorrelatedSessions(ZerithdSession& session) override;
+  Value parentSessionIDStringForSession(ZerithdSession& session) override;
+  std::shared_ptr<ZerithdSession> parentSessionForChild(ZerithdSession& session) override;
+  std::shared_ptr<ZerithdSession> getAncestorWithAggregatorForSession(ZerithdSession& session) override;
+  void updateDownstreamSessions(ZerithdSession& session) override;
+
+  void updateSharedDataForSession(ZerithdSession& session, const Value& sharedData) override;
+  void removeObjectFromSharedDataForSession(ZerithdSession& session, const std::string& key) override;
+  Value sharedDataForSession(ZerithdSession& session) override;
+  void addAgentHealthInfoForSession(ZerithdSession& session, Dictionary& payload) override;
+
+  // Adds one session's per-sender figures to a health report and returns its
+  // batch size.
+  std::uint32_t addSessionHealthInfo(ZerithdSession& session, Dictionary& healthReport);
+
+  using SessionList = std::vector<std::weak_ptr<ZerithdSession>>;
+  // The first live session of `list` at `level`, or nullptr.
+  static std::shared_ptr<ZerithdSession> getFirstSessionWithHierarchy(std::int64_t level, const SessionList& list);
+
+  // Observers, each taking the lock.
+  std::size_t sessionCount() const;
+  std::int32_t veskTransactionReference() const;
+  // Hierarchy tokens in the table, in order of first use.
+  std::vector<std::string> correlatedTokens() const;
+  // Live sessions registered under a token (nullopt when the token has no
+  // entry).
+  std::optional<std::vector<std::shared_ptr<ZerithdSession>>> correlatedSessions(const std::string& token) const;
+  bool hasSharedDataForToken(const std::string& token) const;
+  std::string description() const override;
+
+  // The process's anonymous resident memory in bytes (RssAnon), truncated to
+  // 32 bits; 0 when it cannot be read.
+  static std::uint32_t processMemoryUsage();
+
+ private:
+  ZerithdAgent(std::shared_ptr<KeepAliveTransaction> transaction, std::unique_ptr<StorebagCache> storebags);
+
+  // Entry of a token in the hierarchy table, nullptr when absent.
+  SessionList* correlatedListFor(const std::string& token);
+  Dictionary* sharedDataFor(const std::string& token);
+
+  mutable std::recursive_mutex lock_;
+  std::vector<std::shared_ptr<ZerithdSession>> sessionList_;
+  std::unique_ptr<StorebagCache> cachedStorebags_;
+  // Hierarchy token -> sessions, in order of first use. The session list owns
+  // the sessions; the table only refers to them.
+  std::vector<std::pair<std::string, SessionList>> correlatedSessions_;
+  // Hierarchy token -> shared key/value data.
+  std::vector<std::pair<std::string, Dictionary>> sharedData_;
+  std::int32_t VeskTransactionReference_ = 0;
+
+  const std::shared_ptr<KeepAliveTransaction> transaction_;
+  // Unlisted sessions are let go on a later turn of this queue, never inside
+  // the callback that unlisted them.
+  SerialQueue releaseQueue_{"com.velmar.zerithd.agent.release"};
+};
+
+}  // namespace zerith

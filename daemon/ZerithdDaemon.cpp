@@ -1,0 +1,115 @@
+#include "daemon/ZerithdDaemon.h"
+
+#include <signal.h>
+#include <sys/resource.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <system_error>
+
+#include <systemd/sd-daemon.h>
+
+#include "daemon/KeepAliveTransaction.h"
+#include "daemon/StorebagCache.h"
+#include "daemon/ZerithdAgent.h"
+#include "ipc/EntitlementPolicy.h"
+#include "ipc/Listener.h"
+#include "platform/Log.h"
+#include "platform/Paths.h"
+#include "transport/ReportingSessionConnectivityHelper.h"
+#include "transport/URLSession.h"
+
+namespace zerith {
+
+namespace {
+
+const log::Logger& logger() {
+  static const log::Logger l("daemon");
+  return l;
+}
+
+// From linux/ioprio.h, which older kernels' headers lack.
+constexpr int kIoprioClassShift = 13;
+constexpr int kIoprioClassBestEffort = 2;
+constexpr int kIoprioWhoProcess = 1;
+
+sigset_t stopSignals() {
+  sigset_t set;
+  sigemptyset(&set);
+  sigaddset(&set, SIGTERM);
+  sigaddset(&set, SIGINT);
+  return set;
+}
+
+}  // namespace
+
+ZerithdDaemon::ZerithdDaemon(DaemonOptions options) : options_(std::move(options)) {}
+
+void ZerithdDaemon::blockStopSignals() {
+  const sigset_t set = stopSignals();
+  pthread_sigmask(SIG_BLOCK, &set, nullptr);
+}
+
+void ZerithdDaemon::setUtilityQualityOfService() {
+  // Linux keeps the nice value per thread; threads started later inherit it.
+  if (setpriority(PRIO_PROCESS, 0, 10) != 0) {
+    logger().debug("main: Unable to lower the scheduling priority: {}", std::strerror(errno));
+  }
+  const int ioprio = (kIoprioClassBestEffort << kIoprioClassShift) | 7;
+  if (syscall(SYS_ioprio_set, kIoprioWhoProcess, 0, ioprio) != 0) {
+    logger().debug("main: Unable to lower the I/O priority: {}", std::strerror(errno));
+  }
+}
+
+int ZerithdDaemon::run() {
+  setUtilityQualityOfService();
+  logger().info("startLogging: Daemon starts logging...");
+
+  std::error_code ec;
+  std::filesystem::create_directories(paths::socketPath().parent_path(), ec);
+  if (ec) {
+    logger().error("main: Unable to create the runtime folder {}: {}", paths::socketPath().parent_path().string(),
+                   ec.message());
+    return 1;
+  }
+  if (options_.caFile && !URLSession::setExtraCAFile(options_.caFile->string())) {
+    logger().error("main: Unable to load CA certificates from {}", options_.caFile->string());
+    return 1;
+  }
+  ReportingSessionConnectivityHelper::cleanupStorageRootFolder();
+
+  auto listener = ipc::Listener::create(paths::socketPath(), std::make_shared<const ipc::EntitlementPolicy>());
+  if (!listener) {
+    logger().error("main: Unable to listen on {}", paths::socketPath().string());
+    return 1;
+  }
+  const auto transaction = std::make_shared<KeepAliveTransaction>();
+  const auto agent = ZerithdAgent::create(transaction, std::make_unique<StorebagCache>());
+  listener->setDelegate(agent.get());
+  listener->resume();
+  logger().info("main: Listener resumes with sandbox, start loop.");
+  sd_notify(0, "READY=1\nSTATUS=Listening");
+
+  const sigset_t set = stopSignals();
+  int signal = 0;
+  while ((signal = sigwaitinfo(&set, nullptr)) < 0 && errno == EINTR) {
+  }
+  listener->stop();
+  logger().info("main: Received signal {}, no longer accepting connections", signal);
+  sd_notify(0, "STOPPING=1");
+  if (transaction->isOpen()) {
+    logger().info("main: Waiting up to {} ms for the keep-alive transaction to end", options_.stopTimeout.count());
+    sd_notify(0, "STATUS=Draining sessions");
+    if (transaction->waitUntilClosed(std::chrono::steady_clock::now() + options_.stopTimeout)) {
+      logger().info("main: Keep-alive transaction ended, exiting");
+    } else {
+      logger().error("main: Stop time-out passed with the keep-alive transaction still open, exiting");
+    }
+  }
+  listener.reset();
+  return 0;
+}
+
+}  // namespace zerith

@@ -1,0 +1,46 @@
+#pragma once
+
+// The process entry of zerithd, apart from option parsing: lowers the
+// process's priority to utility, removes stale upload bodies, listens under
+// "com.velmar.zerithd" with one agent as the listener's delegate, reports
+// readiness, and runs until SIGTERM or SIGINT.
+//
+// Stopping: the listener stops accepting at once. With no keep-alive
+// transaction open the process exits at once; otherwise it waits until the
+// transaction ends (every session's transport has closed) or the stop
+// time-out passes.
+
+#include <chrono>
+#include <filesystem>
+#include <memory>
+#include <optional>
+
+namespace zerith {
+
+struct DaemonOptions {
+  std::filesystem::path root;
+  bool debug = false;
+  std::optional<std::filesystem::path> caFile;
+  std::chrono::milliseconds stopTimeout{std::chrono::seconds(30)};
+};
+
+class ZerithdDaemon {
+ public:
+  explicit ZerithdDaemon(DaemonOptions options);
+
+  // Blocks SIGTERM and SIGINT in the calling thread, so that every thread
+  // started later inherits the mask and only run() receives them. Call
+  // first thing in main.
+  static void blockStopSignals();
+
+  // The exit status.
+  int run();
+
+  // Nice 10 and best-effort I/O priority 7; failures are logged and ignored.
+  static void setUtilityQualityOfService();
+
+ private:
+  DaemonOptions options_;
+};
+
+}  // namespace zerith

@@ -1,0 +1,52 @@
+// zerithd: the on-device reporting service. Parses its options and runs.
+
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <string>
+
+#include <CLI/CLI.hpp>
+
+#include "daemon/ZerithdDaemon.h"
+#include "platform/Log.h"
+#include "platform/Paths.h"
+
+int main(int argc, char** argv) {
+  // Before any thread exists, so that only the main loop takes the signals.
+  zerith::ZerithdDaemon::blockStopSignals();
+
+  zerith::DaemonOptions options;
+  std::string root = zerith::paths::defaultRoot().string();
+  std::string caFile;
+  double stopTimeoutSeconds = 30;
+  if (const char* env = std::getenv("ZERITHD_CA_FILE"); env && *env) {
+    caFile = env;
+  }
+
+  CLI::App app{"zerithd: the on-device reporting service"};
+  app.add_option("--root", root, "Folder that every zerithd path is relocated under (env ZERITHD_ROOT)")
+      ->capture_default_str();
+  app.add_flag("--debug", options.debug, "Write debug messages to the log");
+  app.add_option("--ca-file", caFile, "Extra CA certificates (PEM) trusted for HTTPS (env ZERITHD_CA_FILE)");
+  app.add_option("--stop-timeout", stopTimeoutSeconds,
+                 "Seconds to wait on SIGTERM for open sessions' transports to close")
+      ->check(CLI::NonNegativeNumber)
+      ->capture_default_str();
+  CLI11_PARSE(app, argc, argv);
+
+  zerith::log::configure({.debug = options.debug, .journal = std::nullopt});
+
+  std::error_code ec;
+  std::filesystem::create_directories(root, ec);
+  if (ec) {
+    std::fprintf(stderr, "zerithd: cannot create the root folder %s: %s\n", root.c_str(), ec.message().c_str());
+    return 1;
+  }
+  zerith::paths::setRoot(root);
+  options.root = root;
+  if (!caFile.empty()) {
+    options.caFile = caFile;
+  }
+  options.stopTimeout = std::chrono::milliseconds(static_cast<long long>(stopTimeoutSeconds * 1000));
+  return zerith::ZerithdDaemon(std::move(options)).run();
+}

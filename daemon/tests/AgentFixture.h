@@ -1,0 +1,105 @@
+#pragma once
+
+// Scenario helpers shared by the agent's and the session's tests: one agent
+// in a temporary root with a storebag cache whose fetch the test controls,
+// and sessions made the way the agent makes them, on fake connections.
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "daemon/KeepAliveTransaction.h"
+#include "daemon/StorebagCache.h"
+#include "daemon/ZerithdAgent.h"
+#include "platform/Log.h"
+#include "session/ZerithdSession.h"
+#include "session/tests/FakeConnection.h"
+#include "tests/support/TempRoot.h"
+#include "zerith/ZerithConstants.h"
+
+namespace zerith {
+// Readable values in test failures.
+inline void PrintTo(const Value& v, std::ostream* os) { *os << v.description(); }
+inline void PrintTo(const Dictionary& d, std::ostream* os) { *os << Value(d).description(); }
+}  // namespace zerith
+
+namespace zerith::test {
+
+class AgentFixture : public ::testing::Test {
+ protected:
+  AgentFixture() {
+    // A device identifier for the sessions.
+    root.write("/etc/machine-id", "0123456789abcdef0123456789abcdef\n");
+    agent = ZerithdAgent::create(
+        transaction, std::make_unique<StorebagCache>(
+                         [] { return Date::now(); },
+                         [this](std::int32_t clientType, std::int32_t& maxAge, Value& version, bool& /*unchanged*/) {
+                           fetchedClientTypes.push_back(clientType);
+                           maxAge = 3600;
+                           version = storebagVersion;
+                           return storebag;
+                         },
+                         [](const std::string&) { return std::optional<Date>(); }));
+  }
+
+  static Value sessionInfo(std::uint32_t sessionID, std::int64_t clientType = 7) {
+    return Value(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)},
+                            {kZerithSessionInfoClientType, Value(static_cast<long long>(clientType))}});
+  }
+  static Value hierarchyInfo(std::uint32_t sessionID, const std::string& token, std::int64_t level,
+                             std::int64_t clientType = 7) {
+    Dictionary info = sessionInfo(sessionID, clientType).dictCopy();
+    info.set(kZerithSessionInfoHierarchyToken,
+             Value(Dictionary{{kZerithHierarchyTokenTokenID, Value(token)},
+                              {kZerithHierarchyTokenLevel, Value(static_cast<long long>(level))}}));
+    return Value(std::move(info));
+  }
+
+  struct Client {
+    std::shared_ptr<FakeConnection> connection;
+    std::shared_ptr<ZerithdSession> session;
+  };
+
+  // A listed session on its own connection, configured with `info`.
+  Client newSession(const Value& info = Value(), bool aggregator = false, const Value& userInfo = Value()) {
+    Client c{FakeConnection::entitled(), nullptr};
+    c.session = agent->createReportingSessionWithDelegate(agent, c.connection);
+    EXPECT_NE(c.session, nullptr);
+    if (c.session && !info.isNil()) {
+      c.session->setSessionInfo(info, userInfo, Value(), aggregator);
+    }
+    return c;
+  }
+
+  // Messages the daemon sent to a client's aggregator.
+  static std::vector<Dictionary> aggregated(const FakeConnection& connection) {
+    std::vector<Dictionary> out;
+    for (const auto& s : connection.sent()) {
+      if (s.operation == "sendMessageToClient:timestamp:category:type:payload:") {
+        out.push_back(s.args);
+      }
+    }
+    return out;
+  }
+
+  std::size_t countExact(log::Level level, std::string_view text) const {
+    std::size_t n = 0;
+    for (const auto& line : logs.lines()) {
+      n += (line.level == level && line.text == text) ? 1 : 0;
+    }
+    return n;
+  }
+
+  TempRoot root;
+  log::LogCapture logs;
+  std::shared_ptr<KeepAliveTransaction> transaction = std::make_shared<KeepAliveTransaction>();
+  Value storebag;
+  Value storebagVersion;
+  std::vector<std::int32_t> fetchedClientTypes;
+  std::shared_ptr<ZerithdAgent> agent;
+};
+
+}  // namespace zerith::test

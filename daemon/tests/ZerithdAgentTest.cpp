@@ -1,0 +1,377 @@
+#include "daemon/ZerithdAgent.h"
+
+#include <gtest/gtest.h>
+
+#include <sys/mman.h>
+
+#include <cstring>
+
+#include "daemon/SenderCodes.h"
+#include "daemon/tests/AgentFixture.h"
+#include "ipc/Listener.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+
+// The listener is not used by the agent's decision; any object will do.
+class NoListener final : public ipc::Listener {
+ public:
+  void setDelegate(ipc::ListenerDelegate*) override {}
+  void resume() override {}
+  void stop() override {}
+};
+
+class ZerithdAgentTest : public AgentFixture {
+ protected:
+  bool accept(const std::shared_ptr<FakeConnection>& connection) {
+    NoListener listener;
+    return agent->shouldAcceptNewConnection(listener, connection);
+  }
+};
+
+// --- Acceptance --------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, RefusesEveryEntitlementThatIsNotExactlyTrue) {
+  const std::vector<Dictionary> grants = {
+      {},                                                       // missing
+      {{"com.velmar.private.zerithd", Value(false)}},           // false
+      {{"com.velmar.private.zerithd", Value("true")}},          // a string
+      {{"com.velmar.private.zerithd", Value(1)}},               // a number
+      {{"com.velmar.private.zerithdx", Value(true)}},           // another entitlement
+  };
+  for (const auto& grant : grants) {
+    auto connection = std::make_shared<FakeConnection>(grant);
+    EXPECT_FALSE(accept(connection));
+    EXPECT_TRUE(logs.has(Level::Debug, "listener: new Vesk connection " + connection->description() +
+                                           " does not have required zerith entitlement. Closing connection..."));
+    EXPECT_EQ(connection->exported(), nullptr);
+    EXPECT_EQ(connection->resumed(), 0);
+    EXPECT_FALSE(connection->hasInvalidationHandler());
+  }
+  EXPECT_EQ(agent->sessionCount(), 0u);
+  EXPECT_EQ(agent->veskTransactionReference(), 0);
+  EXPECT_EQ(transaction->beginCount(), 0u);
+  EXPECT_FALSE(logs.contains("createReportingSessionWithDelegate"));
+}
+
+TEST_F(ZerithdAgentTest, AcceptedConnectionsAreSetUpListedAndCounted) {
+  auto first = FakeConnection::entitled();
+  auto second = FakeConnection::entitled();
+  ASSERT_TRUE(accept(first));
+  ASSERT_TRUE(accept(second));
+
+  // The counts in the acceptance message are read before the session exists.
+  EXPECT_TRUE(logs.has(Level::Debug, "listener: Accepting new Vesk connection " + first->description() +
+                                         " as it has proper entitlement, 0(0) connections."));
+  EXPECT_TRUE(logs.has(Level::Debug, "listener: Accepting new Vesk connection " + second->description() +
+                                         " as it has proper entitlement, 1(0) connections."));
+  for (const auto& c : {first, second}) {
+    EXPECT_NE(c->exported(), nullptr);
+    EXPECT_EQ(c->resumed(), 1);
+    EXPECT_TRUE(c->hasInvalidationHandler());
+    EXPECT_TRUE(c->hasInterruptionHandler());
+  }
+  EXPECT_EQ(agent->sessionCount(), 2u);
+  EXPECT_EQ(agent->veskTransactionReference(), 2);
+  EXPECT_TRUE(logs.has(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 1"));
+  EXPECT_TRUE(logs.has(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 2"));
+  // Only the first session, arriving at an empty list, begins a transaction.
+  EXPECT_EQ(transaction->beginCount(), 1u);
+  EXPECT_EQ(logs.count("createReportingSessionWithDelegate: Vesk transaction started with session <ZerithdSession: "),
+            1u);
+}
+
+TEST_F(ZerithdAgentTest, InterruptionNeverEndsTheSession) {
+  auto connection = FakeConnection::entitled();
+  ASSERT_TRUE(accept(connection));
+  connection->interrupt();
+  EXPECT_TRUE(logs.contains("listener: Vesk connection to <ZerithdSession: "));
+  EXPECT_TRUE(logs.contains(" was interrupted"));
+  EXPECT_EQ(agent->sessionCount(), 1u);
+  EXPECT_FALSE(logs.contains("was invalidated"));
+}
+
+// --- Keep-alive ----------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, TransactionEndsOnceAfterBothTransportsHaveClosed) {
+  auto first = FakeConnection::entitled();
+  auto second = FakeConnection::entitled();
+  ASSERT_TRUE(accept(first));
+  ASSERT_TRUE(accept(second));
+
+  first->invalidate();
+  EXPECT_EQ(agent->sessionCount(), 1u);
+  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ref count is 1"));
+  EXPECT_TRUE(transaction->isOpen());
+  EXPECT_EQ(transaction->endCount(), 0u);
+
+  second->invalidate();
+  EXPECT_EQ(agent->sessionCount(), 0u);
+  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
+  EXPECT_TRUE(logs.has(Level::Default, "releaseVeskTransaction: Vesk transaction ref count is 0"));
+  EXPECT_EQ(agent->veskTransactionReference(), 0);
+  EXPECT_FALSE(transaction->isOpen());
+  EXPECT_EQ(transaction->beginCount(), 1u);
+  EXPECT_EQ(transaction->endCount(), 1u);
+  EXPECT_EQ(logs.count("releaseVeskTransaction: Vesk transaction ended"), 1u);
+  EXPECT_TRUE(logs.contains("listener: Vesk connection to <ZerithdSession: "));
+  EXPECT_EQ(logs.count("invalidateReportingSession: ZerithdSession <ZerithdSession: "), 2u);
+}
+
+TEST_F(ZerithdAgentTest, SessionArrivingBeforeThePreviousTransportClosedBeginsASecondTransaction) {
+  auto a = newSession();
+  agent->invalidateReportingSession(a.session);  // the list is empty; a's transport is still open
+  EXPECT_EQ(agent->sessionCount(), 0u);
+  EXPECT_EQ(agent->veskTransactionReference(), 1);
+
+  auto b = newSession();
+  EXPECT_EQ(transaction->beginCount(), 2u);
+  EXPECT_EQ(agent->veskTransactionReference(), 2);
+
+  a.session.reset();  // a's transport closes
+  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ref count is 1"));
+  EXPECT_EQ(transaction->endCount(), 0u);
+
+  agent->invalidateReportingSession(b.session);
+  b.session.reset();
+  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
+  EXPECT_EQ(agent->veskTransactionReference(), 0);
+  EXPECT_EQ(transaction->endCount(), 1u);
+}
+
+// --- Hierarchy -----------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, ParentIdentifierJoinsAncestorsRootFirst) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0));
+  auto mid = newSession(hierarchyInfo(2, "call", 1));
+  auto leaf = newSession(hierarchyInfo(3, "call", 2));
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*leaf.session),
+            Value(root0.session->sessionIDString() + "." + mid.session->sessionIDString()));
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*mid.session), Value(root0.session->sessionIDString()));
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*root0.session).isNil());
+  EXPECT_EQ(agent->parentSessionForChild(*leaf.session), mid.session);
+  EXPECT_TRUE(logs.has(Level::Debug, "updateCorrelatedSessions: Adding session 3 to list for hierarchyToken call with "
+                                     "hierarchyLevel 2"));
+}
+
+TEST_F(ZerithdAgentTest, MissingParentLevelGivesNilParentIdentifier) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0));
+  auto orphan = newSession(hierarchyInfo(2, "call", 2));  // level 1 never connected
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*orphan.session).isNil());
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete "
+                       "parentSessionID is '(null)'"));
+
+  // Levels 0 and 1 present, 2 missing: the walk stops at level 2.
+  auto zero = newSession(hierarchyInfo(3, "media", 0));
+  auto one = newSession(hierarchyInfo(4, "media", 1));
+  auto three = newSession(hierarchyInfo(5, "media", 3));
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*three.session).isNil());
+
+  EXPECT_EQ(agent->parentSessionForChild(*three.session), nullptr);
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "parentSessionForChild: Unable to find session with hierarchy of 2 for hierarchyToken 'media'"));
+}
+
+TEST_F(ZerithdAgentTest, GapNearTheRootKeepsTheIdentifierBuiltSoFar) {
+  auto one = newSession(hierarchyInfo(1, "call", 1));  // the root never connected
+  auto two = newSession(hierarchyInfo(2, "call", 2));
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*two.session), Value(one.session->sessionIDString()));
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete "
+                       "parentSessionID is '" + one.session->sessionIDString() + "'"));
+}
+
+TEST_F(ZerithdAgentTest, FirstSessionAddedAtALevelIsTheParentOfTheNext) {
+  auto first = newSession(hierarchyInfo(1, "call", 0));
+  auto second = newSession(hierarchyInfo(2, "call", 0));
+  auto child = newSession(hierarchyInfo(3, "call", 1));
+  EXPECT_EQ(agent->parentSessionForChild(*child.session), first.session);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*child.session), Value(first.session->sessionIDString()));
+}
+
+TEST_F(ZerithdAgentTest, UnlistedSessionFindsNoParent) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0));
+  auto child = newSession(hierarchyInfo(2, "call", 1));
+  agent->invalidateReportingSession(child.session);  // the test still holds the session
+  EXPECT_EQ(agent->parentSessionForChild(*child.session), nullptr);
+  EXPECT_TRUE(logs.has(Level::Error, "parentSessionForChild: ERROR: Session 2 not found for hierarchyToken call"));
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*child.session).isNil());
+  EXPECT_TRUE(logs.has(Level::Default, "parentSessionIDStringForSession: Session 2 not found for hierarchyToken call"));
+
+  agent->invalidateReportingSession(root0.session);  // the token's list is now empty
+  EXPECT_EQ(agent->parentSessionForChild(*child.session), nullptr);
+  EXPECT_TRUE(logs.has(Level::Error, "parentSessionForChild: ERROR: No sessions found for hierarchyToken call"));
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*child.session).isNil());
+  EXPECT_TRUE(
+      logs.has(Level::Error, "parentSessionIDStringForSession: ERROR: No sessions found for hierarchyToken call"));
+}
+
+TEST_F(ZerithdAgentTest, ReRegisteringUnderANewTokenLeavesTheOldListEmptyButPresent) {
+  auto s = newSession(hierarchyInfo(1, "old", 0));
+  s.session->setSessionInfo(hierarchyInfo(1, "new", 0), Value(), Value(), false);
+  ASSERT_TRUE(agent->correlatedSessions("old").has_value());
+  EXPECT_TRUE(agent->correlatedSessions("old")->empty());
+  ASSERT_TRUE(agent->correlatedSessions("new").has_value());
+  EXPECT_EQ(agent->correlatedSessions("new")->front(), s.session);
+}
+
+TEST_F(ZerithdAgentTest, StandaloneSessionIsNotCorrelated) {
+  auto s = newSession(sessionInfo(5));
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "updateCorrelatedSessions: Session 5 has no correlated sessions as it is a standalone session"));
+  EXPECT_TRUE(agent->correlatedTokens().empty());
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*s.session).isNil());
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*s.session), nullptr);
+}
+
+TEST_F(ZerithdAgentTest, AncestorWithAggregatorNearestTheRootWins) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  auto mid = newSession(hierarchyInfo(2, "call", 1), /*aggregator=*/true);
+  auto leaf = newSession(hierarchyInfo(3, "call", 2));
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*root0.session), nullptr);  // level 0 never has one
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*leaf.session), root0.session);
+
+  auto other0 = newSession(hierarchyInfo(4, "media", 0));
+  auto other1 = newSession(hierarchyInfo(5, "media", 1), /*aggregator=*/true);
+  auto other2 = newSession(hierarchyInfo(6, "media", 2));
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*other2.session), other1.session);
+}
+
+TEST_F(ZerithdAgentTest, AggregatingAncestorShutsDownItsDescendantsAggregation) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  // The child's own update already finds the aggregating root and ends its own aggregation.
+  auto child = newSession(hierarchyInfo(2, "call", 1), /*aggregator=*/true);
+  child.session->fetchStatesWithUserInfo(Value(Dictionary{{kZerithUserInfoClientName, Value("mail")}}), nullptr);
+  EXPECT_FALSE(child.session->hasAggregator());
+  ASSERT_EQ(aggregated(*child.connection).size(), 1u);
+  EXPECT_EQ(aggregated(*child.connection)[0],
+            (Dictionary{{"message", Value()}, {"timestamp", Value(0.0)}, {"category", Value(0u)}, {"type", Value(0u)},
+                        {"payload", Value()}}));
+
+  // A later descendant with an aggregator is shut down when the root updates.
+  auto grandchild = newSession(hierarchyInfo(3, "call", 2), /*aggregator=*/true);
+  root0.session->fetchStatesWithUserInfo(Value(Dictionary{{kZerithUserInfoClientName, Value("mail")}}), nullptr);
+  EXPECT_TRUE(logs.has(Level::Debug,
+                       "updateDownstreamSessions: Updating combined session ID and syncing reporting states for "
+                       "session 3"));
+  EXPECT_FALSE(grandchild.session->hasAggregator());
+  EXPECT_EQ(aggregated(*grandchild.connection).size(), 1u);
+  EXPECT_TRUE(root0.session->hasAggregator());
+  EXPECT_TRUE(aggregated(*root0.connection).empty());
+}
+
+TEST_F(ZerithdAgentTest, LastSessionOfATokenLeavesItsEmptyListAndSharedDataInPlace) {
+  auto a = newSession(hierarchyInfo(1, "call", 0));
+  a.session->updateSharedDataForKey(Value("k"), Value("v"));
+  agent->invalidateReportingSession(a.session);
+  ASSERT_TRUE(agent->correlatedSessions("call").has_value());
+  EXPECT_TRUE(agent->correlatedSessions("call")->empty());
+  EXPECT_TRUE(agent->hasSharedDataForToken("call"));
+  EXPECT_TRUE(logs.contains("invalidateReportingSession: ZerithdSession <ZerithdSession: "));
+}
+
+// --- Shared data -----------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, SharedDataIsSeenAtOnceByEverySessionOfTheHierarchy) {
+  auto a = newSession(hierarchyInfo(1, "call", 0));
+  auto b = newSession(hierarchyInfo(2, "call", 1));
+  auto loner = newSession(sessionInfo(3));
+
+  a.session->updateSharedDataWithDictionary(Value(Dictionary{{"codec", Value("opus")}, {"rate", Value(48000)}}));
+  EXPECT_EQ(agent->sharedDataForSession(*b.session),
+            Value(Dictionary{{"codec", Value("opus")}, {"rate", Value(48000)}}));
+  b.session->updateSharedDataForKey(Value("codec"), Value("aac"));  // overwrites in place
+  EXPECT_EQ(agent->sharedDataForSession(*a.session), Value(Dictionary{{"codec", Value("aac")}, {"rate", Value(48000)}}));
+  b.session->updateSharedDataForKey(Value("rate"), Value());  // nil removes the key
+  EXPECT_EQ(agent->sharedDataForSession(*a.session), Value(Dictionary{{"codec", Value("aac")}}));
+
+  loner.session->updateSharedDataWithDictionary(Value(Dictionary{{"x", Value(1)}}));
+  EXPECT_TRUE(agent->sharedDataForSession(*loner.session).isNil());
+  EXPECT_FALSE(agent->hasSharedDataForToken(""));
+}
+
+TEST_F(ZerithdAgentTest, TokenWithoutDataHasNilSharedData) {
+  auto a = newSession(hierarchyInfo(1, "call", 0));
+  EXPECT_TRUE(agent->sharedDataForSession(*a.session).isNil());
+  agent->removeObjectFromSharedDataForSession(*a.session, "absent");
+  EXPECT_TRUE(agent->sharedDataForSession(*a.session).isNil());
+}
+
+// --- Health ------------------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, HealthFiguresCountListedSessionsPlusTheEndingOnePerSender) {
+  storebag = Value(Dictionary{{"httpPost", Value(Dictionary{{"enabled", Value(true)}})}});
+  storebagVersion = Value("17");
+  auto a = newSession(sessionInfo(1, 7));
+  auto a2 = newSession(sessionInfo(4, 7));
+  auto b = newSession(sessionInfo(2, 7));
+  auto c = newSession(sessionInfo(3, 2));
+  ASSERT_FALSE(agent->storebagForSession(*a.session).isNil());
+
+  agent->invalidateReportingSession(b.session);  // b ends
+  Dictionary payload;
+  {
+    std::lock_guard lock(agent->agentLock());
+    agent->addAgentHealthInfoForSession(*b.session, payload);
+  }
+  EXPECT_EQ(payload.get("SessionsCount_YJ"), Value(3ull));
+  EXPECT_EQ(payload.get("SessionsCount_Unknown"), Value(1ull));
+  EXPECT_EQ(payload.get("BatchSize_YJ"), Value(0u));
+  EXPECT_EQ(payload.get("BatchSize_Unknown"), Value(0u));
+  EXPECT_EQ(payload.get("StorebagsCount"), Value(1ull));
+  const auto storebagsSize = payload.get("StorebagsSize").unsignedValue();
+  EXPECT_GT(storebagsSize, 0u);
+  EXPECT_EQ(payload.get("CalculatedMemoryUsage"), Value(static_cast<unsigned long long>(storebagsSize)));
+  EXPECT_GT(payload.get("ProcessMemoryUsage").unsignedValue(), 0u);
+  EXPECT_EQ(payload.size(), 8u);
+}
+
+TEST_F(ZerithdAgentTest, ProcessMemoryUsageIsAnonymousResidentBytes) {
+  const std::uint32_t before = ZerithdAgent::processMemoryUsage();
+  constexpr std::size_t kSize = 64u << 20;
+  void* block = mmap(nullptr, kSize, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  ASSERT_NE(block, MAP_FAILED);
+  std::memset(block, 1, kSize);  // resident now
+  const std::uint32_t after = ZerithdAgent::processMemoryUsage();
+  munmap(block, kSize);
+  // Bytes, not kilobytes: the 64 MiB touched show up (give or take what
+  // other threads allocate or free meanwhile).
+  EXPECT_GT(static_cast<std::int64_t>(after) - static_cast<std::int64_t>(before), static_cast<std::int64_t>(kSize / 2));
+  EXPECT_LT(static_cast<std::int64_t>(after) - static_cast<std::int64_t>(before), static_cast<std::int64_t>(kSize * 2));
+}
+
+TEST(SenderCodes, HealthUsesTheTableOnlyForClientTypesFiveToTwentyThree) {
+  EXPECT_EQ(healthSenderCode(0), "Unknown");
+  EXPECT_EQ(healthSenderCode(4), "Unknown");
+  EXPECT_EQ(healthSenderCode(5), "YF");
+  EXPECT_EQ(healthSenderCode(14), "YH-QOB");
+  EXPECT_EQ(healthSenderCode(23), "WB");
+  EXPECT_EQ(healthSenderCode(24), "Unknown");
+  EXPECT_EQ(healthSenderCode(-1), "Unknown");
+  EXPECT_EQ(senderCode(0), "ZP");
+  EXPECT_EQ(senderCode(16), "XMORDAL");
+}
+
+// --- Storebags ---------------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, StorebagIsFetchedForTheSessionsClientTypeAndThenServedFromTheCache) {
+  storebag = Value(Dictionary{{"httpPost", Value(Dictionary{})}});
+  storebagVersion = Value("42");
+  auto a = newSession(sessionInfo(1, 7));
+  auto b = newSession(sessionInfo(2, 11));  // the same storebag name as type 7
+  EXPECT_EQ(agent->storebagForSession(*a.session), storebag);
+  EXPECT_EQ(agent->storebagForSession(*b.session), storebag);
+  EXPECT_EQ(fetchedClientTypes, std::vector<std::int32_t>{7});
+  EXPECT_EQ(agent->storebagVersionForSession(*b.session), Value("42"));
+
+  auto invalid = newSession(sessionInfo(3, 2));
+  EXPECT_TRUE(agent->storebagForSession(*invalid.session).isNil());
+  EXPECT_TRUE(logs.has(Level::Error, "fetchAndCacheStorebag: clientType 2 is invalid"));
+  EXPECT_TRUE(agent->storebagVersionForSession(*invalid.session).isNil());
+}
+
+}  // namespace
+}  // namespace zerith::test

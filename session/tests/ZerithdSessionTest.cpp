@@ -1,0 +1,377 @@
+#include "session/ZerithdSession.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+
+#include "daemon/tests/AgentFixture.h"
+#include "platform/Crypto.h"
+#include "platform/Defaults.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+
+class ZerithdSessionTest : public AgentFixture {
+ protected:
+  ZerithdSessionTest() {
+    storebag = Value(Dictionary{{"httpPost", Value(Dictionary{})}});
+    storebagVersion = Value("42");
+  }
+
+  // Unlists the only session and waits until it is gone: its transport,
+  // closed last, has released the keep-alive count.
+  void endSession(Client& c) {
+    agent->invalidateReportingSession(c.session);
+    c.session.reset();
+    ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
+  }
+
+  static Value user(const std::string& client, const std::string& service = "sync") {
+    return Value(Dictionary{{kZerithUserInfoClientName, Value(client)}, {kZerithUserInfoServiceName, Value(service)}});
+  }
+};
+
+// --- Birth ------------------------------------------------------------------------
+
+TEST_F(ZerithdSessionTest, EverySessionGetsItsOwnBase64UUIDAndTheDeviceIdentifier) {
+  auto a = newSession();
+  auto b = newSession();
+  const auto& id = a.session->sessionIDString();
+  ASSERT_EQ(id.size(), 24u);
+  const auto bytes = crypto::base64Decode(id);
+  ASSERT_TRUE(bytes.has_value());
+  ASSERT_EQ(bytes->size(), 16u);
+  EXPECT_EQ((*bytes)[6] >> 4, 4);  // a random (version 4) UUID
+  EXPECT_NE(id, b.session->sessionIDString());
+
+  const std::string device = a.session->deviceID();
+  EXPECT_EQ(device.size(), 40u);
+  EXPECT_EQ(device.find_first_not_of("0123456789abcdef"), std::string::npos);
+  EXPECT_TRUE(logs.has(Level::Debug, "initWithSessionDelegate: Initialized session with UUID " + id));
+  EXPECT_TRUE(logs.has(Level::Debug, "initWithSessionDelegate: ZerithdSession initWithSessionDelegate:" +
+                                         agent->description()));
+}
+
+// --- Configuration -------------------------------------------------------------------
+
+TEST_F(ZerithdSessionTest, HierarchyTokenThatIsNotADictionaryMakesAStandaloneSession) {
+  Dictionary info = sessionInfo(5).dictCopy();
+  info.set(kZerithSessionInfoHierarchyToken, Value("call"));
+  auto s = newSession(Value(info));
+  EXPECT_EQ(s.session->sessionID(), 5u);
+  EXPECT_TRUE(s.session->hierarchyToken().isNil());
+  EXPECT_EQ(s.session->hierarchyLevel(), 0u);
+  EXPECT_TRUE(logs.has(Level::Debug, "setSessionInfo: Configuring session 5"));
+}
+
+TEST_F(ZerithdSessionTest, UserInfoGivenWithoutBeingRequiredIsLoggedAndKept) {
+  auto s = newSession(sessionInfo(5), false, user("mail"));
+  EXPECT_TRUE(logs.has(Level::Error, "setSessionInfo: Configure session: user info provided without requiring it"));
+  EXPECT_EQ(s.session->userInfo(), user("mail"));
+
+  Dictionary required = sessionInfo(6).dictCopy();
+  required.set(kZerithSessionInfoRequireUserInfo, Value(true));
+  logs.clear();
+  s.session->setSessionInfo(Value(required), user("mail"), Value(), false);
+  EXPECT_FALSE(logs.contains("user info provided without requiring it"));
+  EXPECT_EQ(s.session->sessionID(), 6u);  // a second call overwrites
+}
+
+TEST_F(ZerithdSessionTest, OnlyANameChangeInUserInfoRerunsTheStateUpdate) {
+  auto s = newSession(sessionInfo(5));
+  const std::string changed = "receivedUserInfo: Received new user info for session 5";
+
+  s.session->receivedUserInfo(Value());  // none before, none now: ignored
+  EXPECT_EQ(logs.count(changed), 0u);
+  s.session->receivedUserInfo(user("mail"));  // the first counts as changed
+  EXPECT_EQ(logs.count(changed), 1u);
+  Dictionary sameNames = user("mail").dictCopy();
+  sameNames.set("extra", Value(1));
+  s.session->receivedUserInfo(Value(sameNames));  // stored, but the names are the same
+  EXPECT_EQ(logs.count(changed), 1u);
+  EXPECT_EQ(s.session->userInfo(), Value(sameNames));
+  s.session->receivedUserInfo(user("mail", "push"));
+  EXPECT_EQ(logs.count(changed), 2u);
+}
+
+TEST_F(ZerithdSessionTest, NilUserInfoIsIgnoredWhileUserInfoIsRequired) {
+  Dictionary required = sessionInfo(5).dictCopy();
+  required.set(kZerithSessionInfoRequireUserInfo, Value(true));
+  auto s = newSession(Value(required), false, user("mail"));
+  s.session->receivedUserInfo(Value());
+  EXPECT_EQ(s.session->userInfo(), user("mail"));
+
+  auto optional = newSession(sessionInfo(6), false, user("mail"));
+  optional.session->receivedUserInfo(Value());  // not required: the names changed to none
+  EXPECT_TRUE(optional.session->userInfo().isNil());
+  EXPECT_TRUE(logs.has(Level::Debug, "receivedUserInfo: Received new user info for session 6"));
+}
+
+TEST_F(ZerithdSessionTest, NoStorebagCompletesTheStartWithNil) {
+  storebag = Value();
+  auto s = newSession(sessionInfo(5));
+  std::optional<Value> result;
+  s.session->startConfigWithCompletionHandler([&](Value v) { result = v; });
+  ASSERT_TRUE(result.has_value());
+  EXPECT_TRUE(result->isNil());
+  EXPECT_TRUE(s.session->storebagVersion().isNil());
+  EXPECT_TRUE(logs.has(Level::Debug, "startConfigWithCompletionHandler: Starting configuration for session 5"));
+  EXPECT_FALSE(logs.contains("createBackendsWithStorebag"));
+  s.session->startConfigWithCompletionHandler(nullptr);  // a nil completion is allowed
+}
+
+TEST_F(ZerithdSessionTest, StorebagConfiguresTheSessionWithNoEnabledBackend) {
+  auto s = newSession(sessionInfo(5));
+  std::optional<Value> result;
+  s.session->startConfigWithCompletionHandler([&](Value v) { result = v; });
+  ASSERT_TRUE(result.has_value());
+  EXPECT_EQ(*result, Value(Array{}));
+  EXPECT_EQ(s.session->storebagVersion(), Value("42"));
+  EXPECT_TRUE(logs.has(Level::Debug, "createBackendsWithStorebag: Creating backends for session 5"));
+  EXPECT_TRUE(logs.has(Level::Debug, "internalSendMessage: Sent internal message (method:0 respCode:0)"));
+
+  std::optional<Value> states;
+  s.session->fetchStatesWithUserInfo(Value(), [&](Value v) { states = v; });
+  ASSERT_TRUE(states.has_value());
+  EXPECT_EQ(*states, Value(Array{}));
+  EXPECT_TRUE(logs.has(Level::Debug, "fetchStatesWithUserInfo: Fetching states for session 5"));
+}
+
+TEST_F(ZerithdSessionTest, StartMessageCarriesLocaleAndAutomaticTimeOnCustomerBuilds) {
+  ::setenv("LC_ALL", "de_DE.UTF-8", 1);
+  Defaults("com.velmar.timed").setObject("AutomaticTimeZoneEnabled", Value(false));
+  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+  s.session->startConfigWithCompletionHandler(nullptr);
+  ::unsetenv("LC_ALL");
+
+  const auto sent = aggregated(*s.connection);
+  ASSERT_EQ(sent.size(), 1u);
+  EXPECT_EQ(sent[0].get("message"), sessionInfo(5));
+  EXPECT_EQ(sent[0].get("category"), Value(0u));
+  EXPECT_EQ(sent[0].get("type"), Value(0u));
+  EXPECT_EQ(sent[0].get("payload"), Value(Dictionary{{"AutomaticTimeSet", Value(false)}, {"Locale", Value("DE")}}));
+}
+
+TEST_F(ZerithdSessionTest, AutomaticTimeIsAssumedWhenTheSettingIsAbsent) {
+  ::setenv("LC_ALL", "C", 1);
+  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+  s.session->startConfigWithCompletionHandler(nullptr);
+  ::unsetenv("LC_ALL");
+  const auto sent = aggregated(*s.connection);
+  ASSERT_EQ(sent.size(), 1u);
+  EXPECT_EQ(sent[0].get("payload"), Value(Dictionary{{"AutomaticTimeSet", Value(true)}, {"Locale", Value("Unknown")}}));
+}
+
+// --- Client operations without backends ---------------------------------------------
+
+TEST_F(ZerithdSessionTest, DisplayURLIsNotAvailableWithoutBackends) {
+  auto s = newSession(sessionInfo(5));
+  std::optional<Value> url;
+  s.session->fetchDisplayURL([&](Value v) { url = v; });
+  EXPECT_EQ(url, Value("URL not available"));
+  EXPECT_TRUE(logs.has(Level::Debug, "fetchDisplayURL: Fetching display URL for session 5"));
+}
+
+TEST_F(ZerithdSessionTest, FlushBeforeConfigurationFailsWithTheNoBackendsError) {
+  auto s = newSession(sessionInfo(5));
+  int calls = 0;
+  s.session->flushMessagesWithCompletion([&](Value text, std::optional<Error> error) {
+    ++calls;
+    EXPECT_TRUE(text.isNil());
+    ASSERT_TRUE(error.has_value());
+    EXPECT_EQ(*error, (Error{kZerithErrorDomain, -1, "No backends available to send message"}));
+  });
+  EXPECT_EQ(calls, 1);
+  EXPECT_TRUE(logs.has(Level::Debug, "flushMessagesWithCompletion: Flushing messages for session 5"));
+  EXPECT_TRUE(logs.has(Level::Debug, "internalFlushMessagesWithCompletion: No backends available to send message"));
+
+  // Configured with an empty backend set the flush completes at once, without an error.
+  s.session->startConfigWithCompletionHandler(nullptr);
+  s.session->flushMessagesWithCompletion([&](Value text, std::optional<Error> error) {
+    ++calls;
+    EXPECT_TRUE(text.isNil());
+    EXPECT_FALSE(error.has_value());
+  });
+  EXPECT_EQ(calls, 2);
+}
+
+TEST_F(ZerithdSessionTest, MessagesAreCheckedForCategoryFirstThenType) {
+  auto s = newSession(sessionInfo(5));
+  std::vector<Value> replies;
+  auto reply = [&](Value v) { replies.push_back(v); };
+
+  s.session->sendMessageWithDictionary(Value(Dictionary{}), reply);
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: No backends available to send message"));
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Sending message for session 5"));
+
+  s.session->startConfigWithCompletionHandler(nullptr);
+  logs.clear();
+  s.session->sendMessageWithDictionary(Value(Dictionary{}), reply);
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'category'"));
+  EXPECT_FALSE(logs.contains("Missing mandatory parameter 'type'"));
+  s.session->sendMessageWithDictionary(Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}}), reply);
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'type'"));
+  s.session->sendMessageWithDictionary(
+      Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}, {kZerithMessageParametersType, Value(4)}}), reply);
+  ASSERT_EQ(replies.size(), 4u);
+  for (const auto& r : replies) {
+    EXPECT_TRUE(r.isNil());
+  }
+}
+
+TEST_F(ZerithdSessionTest, UploadsAreRefusedWithoutAnUploadBackend) {
+  auto s = newSession(sessionInfo(5));
+  std::optional<bool> uploaded;
+  s.session->uploadFileAtPath(Value("file:///var/tmp/report.log"), Value(), [&](bool ok) { uploaded = ok; });
+  EXPECT_EQ(uploaded, false);
+  EXPECT_TRUE(logs.has(Level::Debug, "uploadFileAtPath: Uploading file for session 5"));
+  EXPECT_TRUE(logs.has(Level::Error, "uploadFileWithURL: File upload failed for /var/tmp/report.log"));
+
+  std::optional<std::pair<bool, std::optional<Error>>> logData;
+  s.session->uploadLogData(Value(Array{Value("line")}), [&](bool ok, std::optional<Error> e) { logData = {ok, e}; });
+  ASSERT_TRUE(logData.has_value());
+  EXPECT_FALSE(logData->first);
+  EXPECT_FALSE(logData->second.has_value());
+  EXPECT_TRUE(logs.has(Level::Error, "uploadLogData: Log data array upload failed"));
+}
+
+TEST_F(ZerithdSessionTest, FinishingGracefullyIsReportedAtTheEnd) {
+  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+  s.session->startConfigWithCompletionHandler(nullptr);
+  s.session->finishSessionGracefully();
+  EXPECT_TRUE(logs.has(Level::Debug, "finishSessionGracefully: Session 5 has been finished gracefully"));
+  auto connection = s.connection;
+  endSession(s);
+
+  // The start message, the end message with the health figures, then the end of aggregation.
+  const auto sent = aggregated(*connection);
+  ASSERT_EQ(sent.size(), 3u);
+  EXPECT_EQ(sent[1].get("category"), Value(0u));
+  EXPECT_EQ(sent[1].get("type"), Value(1u));
+  const Value payload = sent[1].get("payload");
+  EXPECT_EQ(payload["StorebagVersion"], Value("42"));
+  EXPECT_EQ(payload["GracefulTermination"], Value(true));
+  EXPECT_EQ(payload["SessionsCount_YJ"], Value(1ull));
+  EXPECT_EQ(payload["StorebagsCount"], Value(1ull));
+  EXPECT_FALSE(payload["ProcessMemoryUsage"].isNil());
+  EXPECT_EQ(sent[2].get("payload"), Value());
+  EXPECT_EQ(sent[2].get("category"), Value(0u));
+  EXPECT_TRUE(logs.has(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 5"));
+}
+
+TEST_F(ZerithdSessionTest, SessionEndedWithoutFinishingReportsNoGracefulTermination) {
+  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+  s.session->startConfigWithCompletionHandler(nullptr);
+  auto connection = s.connection;
+  endSession(s);
+  const auto sent = aggregated(*connection);
+  ASSERT_EQ(sent.size(), 3u);
+  EXPECT_EQ(sent[1].get("payload")["GracefulTermination"], Value(false));
+}
+
+TEST_F(ZerithdSessionTest, SessionWithoutStorebagSendsNoEndMessage) {
+  storebag = Value();
+  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+  s.session->startConfigWithCompletionHandler(nullptr);
+  auto connection = s.connection;
+  endSession(s);
+  // Only the end of aggregation.
+  const auto sent = aggregated(*connection);
+  ASSERT_EQ(sent.size(), 1u);
+  EXPECT_EQ(sent[0].get("payload"), Value());
+  EXPECT_FALSE(logs.contains("internalSendMessage"));
+}
+
+// --- Aggregation -------------------------------------------------------------------------
+
+TEST_F(ZerithdSessionTest, UserInfoEntriesReplacePayloadEntriesOnTheWayToTheAggregator) {
+  auto s = newSession(sessionInfo(5), /*aggregator=*/true, Value(Dictionary{{"a", Value(2)}}));
+  s.session->startConfigWithCompletionHandler(nullptr);
+  s.session->sendMessageWithDictionary(
+      Value(Dictionary{{kZerithMessageParametersCategory, Value(3)},
+                       {kZerithMessageParametersType, Value(70000)},  // narrowed to 16 bits
+                       {kZerithMessageParametersPayload, Value(Dictionary{{"a", Value(1)}, {"b", Value(1)}})}}),
+      nullptr);
+  s.session->sendMessageWithDictionary(
+      Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}, {kZerithMessageParametersType, Value(4)}}),
+      nullptr);
+  const auto sent = aggregated(*s.connection);
+  ASSERT_EQ(sent.size(), 3u);  // the start message and the two events
+  EXPECT_EQ(sent[1].get("payload"), Value(Dictionary{{"a", Value(2)}, {"b", Value(1)}}));
+  EXPECT_EQ(sent[1].get("category"), Value(3u));
+  EXPECT_EQ(sent[1].get("type"), Value(70000u & 0xffffu));
+  EXPECT_TRUE(sent[2].get("payload").isNil());  // a nil payload stays nil
+}
+
+TEST_F(ZerithdSessionTest, EventsOfADescendantGoOnlyToTheAggregatingAncestor) {
+  auto parent = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  auto child = newSession(hierarchyInfo(2, "call", 1));
+  child.session->startConfigWithCompletionHandler(nullptr);
+  child.session->sendMessageWithDictionary(
+      Value(Dictionary{{kZerithMessageParametersCategory, Value(9)}, {kZerithMessageParametersType, Value(1)}}),
+      nullptr);
+  const auto atParent = aggregated(*parent.connection);
+  ASSERT_EQ(atParent.size(), 2u);  // the child's start message and its event
+  EXPECT_EQ(atParent[1].get("message"), hierarchyInfo(2, "call", 1));
+  EXPECT_EQ(atParent[1].get("category"), Value(9u));
+  EXPECT_TRUE(aggregated(*child.connection).empty());
+}
+
+TEST_F(ZerithdSessionTest, EndingAggregationWithoutAnAggregatorSendsNothing) {
+  auto s = newSession(sessionInfo(5));
+  s.session->shutdownSessionAggregation();
+  EXPECT_TRUE(aggregated(*s.connection).empty());
+}
+
+// --- One-shot messages -------------------------------------------------------------------
+
+TEST_F(ZerithdSessionTest, OneShotWithoutIdentifiersIsRefusedBeforeAnyStorebagLookup) {
+  auto s = newSession();
+  std::vector<Value> replies;
+  s.session->sendMessageWithSessionInfo(Value(Dictionary{{kZerithSessionInfoClientType, Value(7)}}), Value(), 1, 2,
+                                        Value(), [&](Value v) { replies.push_back(v); });
+  s.session->sendMessageWithSessionInfo(Value(Dictionary{{kZerithSessionInfoSessionID, Value(7)}}), Value(), 1, 2,
+                                        Value(), [&](Value v) { replies.push_back(v); });
+  ASSERT_EQ(replies.size(), 2u);
+  EXPECT_EQ(replies[0], Value("Could not retrieve identifiers from sessionInfo"));
+  EXPECT_EQ(replies[1], Value("Could not retrieve identifiers from sessionInfo"));
+  EXPECT_EQ(countExact(Level::Error, "sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo"),
+            2u);
+  EXPECT_TRUE(fetchedClientTypes.empty());
+  EXPECT_EQ(s.session->sessionID(), 0u);
+}
+
+TEST_F(ZerithdSessionTest, OneShotConfiguresTheSessionAndAnswersByStorebag) {
+  auto s = newSession();
+  std::vector<Value> replies;
+  s.session->sendMessageWithSessionInfo(hierarchyInfo(8, "call", 0), user("mail"), 1, 2, Value(),
+                                        [&](Value v) { replies.push_back(v); });
+  EXPECT_EQ(s.session->sessionID(), 8u);
+  EXPECT_EQ(s.session->hierarchyToken(), Value("call"));
+  EXPECT_EQ(s.session->userInfo(), user("mail"));
+  EXPECT_EQ(agent->correlatedSessions("call")->size(), 1u);
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithSessionInfo: Sending message with session info for session 8"));
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithSessionInfo: Sending single message with sessionID 8"));
+  EXPECT_TRUE(logs.has(Level::Error, "sendMessageWithSessionInfo: No backends available to send single message"));
+
+  storebag = Value();
+  auto other = newSession();
+  other.session->sendMessageWithSessionInfo(sessionInfo(9, 2), Value(), 1, 2, Value(),
+                                            [&](Value v) { replies.push_back(v); });
+  ASSERT_EQ(replies.size(), 2u);
+  EXPECT_EQ(replies[0], Value("finished"));
+  EXPECT_EQ(replies[1], Value("storebag not available"));
+}
+
+TEST_F(ZerithdSessionTest, DigestKeyIsCopiedAndReplaced) {
+  auto s = newSession(sessionInfo(5));
+  s.session->setDigestKey(Value(Data{1, 2, 3}), 1);
+  EXPECT_EQ(s.session->digestKey(), Value(Data{1, 2, 3}));
+  s.session->setDigestKey(Value(Data{9}), 2);
+  EXPECT_EQ(s.session->digestKey(), Value(Data{9}));
+}
+
+}  // namespace
+}  // namespace zerith::test

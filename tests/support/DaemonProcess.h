@@ -1,0 +1,103 @@
+#pragma once
+
+// Runs the real zerithd binary for end-to-end tests: started in a TempRoot
+// with --debug, its standard error captured line by line, readiness taken
+// from its own sd_notify("READY=1") through a notify socket of ours, and
+// stopped with SIGTERM (or killed when the test ends first). Every wait is
+// bounded, so a daemon that hangs fails the test instead of hanging it.
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <filesystem>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "platform/FileUtil.h"
+#include "platform/Log.h"
+
+namespace zerith::test {
+
+class TempRoot;
+
+class DaemonProcess {
+ public:
+  struct Options {
+    std::vector<std::string> arguments;                        // after --root and --debug
+    std::vector<std::pair<std::string, std::string>> environment;  // added to ours
+    bool debug = true;
+    std::chrono::milliseconds readyTimeout{15000};
+  };
+
+  // Starts <build>/daemon/zerithd (or $ZERITHD_BINARY) and waits for its
+  // readiness; ready() tells whether it came.
+  explicit DaemonProcess(const TempRoot& root);
+  DaemonProcess(const TempRoot& root, Options options);
+  ~DaemonProcess();
+  DaemonProcess(const DaemonProcess&) = delete;
+  DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+  static std::filesystem::path binary();
+
+  bool ready() const;
+  pid_t pid() const { return pid_; }
+  bool running();
+
+  // The captured standard error so far.
+  std::string output() const;
+  // Lines whose message text contains `needle`.
+  std::size_t count(std::string_view needle) const;
+  // A line whose message is exactly `text` at `level`.
+  bool has(log::Level level, std::string_view text) const;
+  std::size_t countExact(log::Level level, std::string_view text) const;
+  // Waits until `occurrences` lines contain `needle`; false on time-out.
+  bool waitFor(std::string_view needle, std::size_t occurrences = 1,
+               std::chrono::milliseconds timeout = std::chrono::milliseconds(10000)) const;
+  bool waitForExact(log::Level level, std::string_view text, std::size_t occurrences = 1,
+                    std::chrono::milliseconds timeout = std::chrono::milliseconds(10000)) const;
+  // The messages received on the notify socket ("READY=1", "STATUS=...").
+  std::vector<std::string> notifications() const;
+
+  void signal(int signal);
+  // The exit status (the code, or 128 + signal), nullopt when it did not
+  // exit in time.
+  std::optional<int> waitForExit(std::chrono::milliseconds timeout);
+  // SIGTERM, then waitForExit.
+  std::optional<int> stop(std::chrono::milliseconds timeout = std::chrono::milliseconds(10000));
+
+ private:
+  struct Line {
+    log::Level level;
+    std::string text;
+  };
+
+  void start(const TempRoot& root, const Options& options);
+  void readLoop();
+  void consumeOutput(std::string_view bytes);
+
+  pid_t pid_ = -1;
+  std::optional<int> exitStatus_;
+  file::UniqueFd stderrRead_;
+  file::UniqueFd notifySocket_;
+  file::UniqueFd pidFd_;
+  file::UniqueFd wakeRead_;
+  file::UniqueFd wakeWrite_;
+  std::filesystem::path notifyPath_;
+  std::thread reader_;
+
+  mutable std::mutex mutex_;
+  mutable std::condition_variable changed_;
+  std::string output_;
+  std::string partial_;
+  std::vector<Line> lines_;
+  std::vector<std::string> notifications_;
+  bool ready_ = false;
+};
+
+}  // namespace zerith::test
