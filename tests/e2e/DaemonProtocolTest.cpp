@@ -1,0 +1,202 @@
+// The real daemon against raw sockets: admission by entitlement, hostile and
+// broken frames, clients that vanish mid-call, and the stop signal.
+
+#include <signal.h>
+
+#include "tests/e2e/E2eFixture.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+
+constexpr const char* kDisplayURL = "fetchDisplayURL:";
+
+// A session that answers proves the daemon is alive and serving.
+void expectServing(RawClient& client, std::uint64_t number) {
+  ASSERT_TRUE(client.call(kDisplayURL, number));
+  const auto reply = client.replyTo(number);
+  ASSERT_TRUE(reply.has_value());
+  EXPECT_EQ((*reply)["args"]["url"], Value("URL not available"));
+}
+
+Data frameWithBody(const Data& body) {
+  Data frame(4 + body.size());
+  for (int i = 0; i < 4; ++i) {
+    frame[static_cast<std::size_t>(i)] = static_cast<std::uint8_t>(body.size() >> (24 - 8 * i));
+  }
+  std::copy(body.begin(), body.end(), frame.begin() + 4);
+  return frame;
+}
+
+// --- Admission ----------------------------------------------------------------
+
+TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
+  for (const Value& entitlement : {Value(), Value(false), Value("yes")}) {
+    grant(entitlement);  // the policy is read afresh for every connection
+    if (!daemon) {
+      startDaemon();
+    }
+    auto client = RawClient::connect();
+    ASSERT_TRUE(client.has_value());
+    client->call(kDisplayURL, 1);  // may already find the socket closed
+    EXPECT_TRUE(client->waitClosed());
+  }
+  EXPECT_EQ(daemon->count("does not have required zerith entitlement. Closing connection..."), 3u);
+  EXPECT_EQ(daemon->count("Accepting new Vesk connection"), 0u);
+  EXPECT_EQ(daemon->count("createReportingSessionWithDelegate"), 0u);
+
+  grant(Value(true));
+  auto client = RawClient::connect();
+  ASSERT_TRUE(client.has_value());
+  expectServing(*client, 1);
+  EXPECT_TRUE(daemon->waitFor("as it has proper entitlement, 0(0) connections."));
+}
+
+// --- Hostile and broken input ------------------------------------------------------
+
+TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnection) {
+  grant(Value(true));
+  startDaemon();
+  auto bystander = RawClient::connect();
+  ASSERT_TRUE(bystander.has_value());
+  expectServing(*bystander, 1);
+
+  const std::vector<std::pair<std::string, Data>> attacks = {
+      {"garbage body", frameWithBody(Data(64, 0xAB))},
+      {"oversized length", Data{0x7F, 0xFF, 0xFF, 0xFF, 1, 2, 3}},
+      {"XML instead of binary", frameWithBody([] {
+         const std::string xml = plist::encodeXml(Value(Dictionary{{"op", Value(kDisplayURL)}}));
+         return Data(xml.begin(), xml.end());
+       }())},
+      {"array root", frameWithBody(plist::encodeBinary(Value(Array{Value(1)})))},
+      {"truncated plist", [] {
+         Data body = plist::encodeBinary(Value(Dictionary{{"op", Value(kDisplayURL)}, {"call", Value(1)}}));
+         body.resize(body.size() / 2);
+         return frameWithBody(body);
+       }()},
+  };
+  std::uint64_t n = 2;
+  for (const auto& [name, bytes] : attacks) {
+    SCOPED_TRACE(name);
+    auto attacker = RawClient::connect();
+    ASSERT_TRUE(attacker.has_value());
+    ASSERT_TRUE(attacker->write(bytes));
+    EXPECT_TRUE(attacker->waitClosed());
+    expectServing(*bystander, n++);
+  }
+  EXPECT_TRUE(daemon->running());
+}
+
+TEST_F(E2eTest, WrongCallsAreAnsweredWithErrorsAndTheConnectionGoesOn) {
+  grant(Value(true));
+  startDaemon();
+  auto client = RawClient::connect();
+  ASSERT_TRUE(client.has_value());
+
+  ASSERT_TRUE(client->call("noSuchOperation:", 1));
+  auto reply = client->replyTo(1);
+  ASSERT_TRUE(reply.has_value());
+  EXPECT_EQ((*reply)["error"]["code"], Value(-1));
+
+  // A session info that is not a dictionary never reaches the session.
+  ASSERT_TRUE(client->call("setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock:", 2,
+                           Dictionary{{"sessionInfo", Value("not a dictionary")}}));
+  reply = client->replyTo(2);
+  ASSERT_TRUE(reply.has_value());
+  EXPECT_FALSE((*reply)["error"].isNil());
+  EXPECT_EQ(daemon->count("setSessionInfo: Configuring session"), 0u);
+
+  expectServing(*client, 3);
+}
+
+TEST_F(E2eTest, ClientVanishingMidCallEndsItsSessionAndTheTransaction) {
+  grant(Value(true));
+  startDaemon();
+  {
+    auto client = RawClient::connect();
+    ASSERT_TRUE(client.has_value());
+    ASSERT_TRUE(client->call("setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock:", 1,
+                             Dictionary{{"sessionInfo", Value(Dictionary{{"sessionID", Value(77)}})}}));
+    // Half of the next frame, then gone.
+    Data frame = ipc::encodeCall(kDisplayURL, 2, {});
+    frame.resize(frame.size() - 3);
+    ASSERT_TRUE(client->write(frame));
+  }
+  ASSERT_TRUE(daemon->waitFor("was invalidated"));
+  ASSERT_TRUE(daemon->waitForExact(Level::Default, kTransactionEnded));
+  EXPECT_TRUE(daemon->has(Level::Default, "releaseVeskTransaction: Vesk transaction ref count is 0"));
+
+  auto next = RawClient::connect();
+  ASSERT_TRUE(next.has_value());
+  expectServing(*next, 1);
+}
+
+// --- Stopping --------------------------------------------------------------------------
+
+TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
+  grant(Value(true));
+  startDaemon();
+  EXPECT_EQ(daemon->stop(5s), 0) << daemon->output();
+  EXPECT_FALSE(daemon->output().empty());
+  EXPECT_EQ(daemon->count("Waiting up to"), 0u);
+  const auto notes = daemon->notifications();
+  EXPECT_NE(std::find(notes.begin(), notes.end(), "READY=1"), notes.end());
+  EXPECT_NE(std::find(notes.begin(), notes.end(), "STOPPING=1"), notes.end());
+}
+
+TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
+  grant(Value(true));
+  startDaemon();
+  auto client = RawClient::connect();
+  ASSERT_TRUE(client.has_value());
+  expectServing(*client, 1);
+
+  daemon->signal(SIGTERM);
+  ASSERT_TRUE(daemon->waitFor("main: Waiting up to"));
+  EXPECT_TRUE(daemon->running());
+  expectServing(*client, 2);  // the open session goes on while draining
+
+  // A newcomer is not served.
+  auto late = RawClient::connect();
+  if (late) {
+    late->call(kDisplayURL, 1);
+  }
+  client->close();
+  EXPECT_EQ(daemon->waitForExit(10s), 0) << daemon->output();
+  EXPECT_TRUE(daemon->has(Level::Default, kTransactionEnded));
+  EXPECT_TRUE(daemon->has(Level::Default, "main: Keep-alive transaction ended, exiting"));
+  if (late) {
+    EXPECT_FALSE(late->replyTo(1, 5s).has_value());
+  }
+  EXPECT_EQ(daemon->count("Accepting new Vesk connection"), 1u);
+}
+
+TEST_F(E2eTest, StopTimeOutEndsTheDrainOfASessionThatStaysOpen) {
+  grant(Value(true));
+  DaemonProcess::Options options;
+  options.arguments = {"--stop-timeout", "0.5"};
+  startDaemon(options);
+  auto client = RawClient::connect();
+  ASSERT_TRUE(client.has_value());
+  expectServing(*client, 1);
+  EXPECT_EQ(daemon->stop(10s), 0) << daemon->output();
+  EXPECT_TRUE(daemon->has(Level::Error,
+                          "main: Stop time-out passed with the keep-alive transaction still open, exiting"));
+}
+
+TEST_F(E2eTest, SocketThatCannotBeCreatedFailsTheStartWithAClearMessage) {
+  // The runtime folder is a file: nothing can listen there.
+  root.write("/run/zerithd", "not a folder");
+  DaemonProcess::Options options;
+  options.readyTimeout = 5s;
+  DaemonProcess failed(root, options);
+  EXPECT_FALSE(failed.ready());
+  EXPECT_EQ(failed.waitForExit(10s), 1);
+  EXPECT_TRUE(failed.count("main: Unable to create the runtime folder") > 0 ||
+              failed.count("main: Unable to listen on") > 0)
+      << failed.output();
+}
+
+}  // namespace
+}  // namespace zerith::test

@@ -1,0 +1,158 @@
+#pragma once
+
+// Scenario helpers of the end-to-end tests: a temporary root with an
+// entitlements policy for the test's own user, the real zerithd started in
+// it, and raw socket clients that speak the frame protocol byte by byte.
+
+#include <gtest/gtest.h>
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "ipc/Frame.h"
+#include "platform/Defaults.h"
+#include "platform/FileUtil.h"
+#include "platform/Paths.h"
+#include "platform/PropertyList.h"
+#include "tests/support/DaemonProcess.h"
+#include "tests/support/TempRoot.h"
+
+namespace zerith::test {
+
+using namespace std::chrono_literals;
+
+// A client socket that writes bytes and reads frames with a deadline.
+class RawClient {
+ public:
+  static std::optional<RawClient> connect() {
+    file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    const std::string path = paths::socketPath().string();
+    std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+    if (!fd || ::connect(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+      return std::nullopt;
+    }
+    return RawClient(std::move(fd));
+  }
+
+  bool write(const Data& bytes) {
+    std::size_t done = 0;
+    while (done < bytes.size()) {
+      const ssize_t n = ::send(fd_.get(), bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
+      if (n <= 0) {
+        return false;
+      }
+      done += static_cast<std::size_t>(n);
+    }
+    return true;
+  }
+  bool call(std::string_view operation, std::uint64_t number, const Dictionary& args = {}) {
+    return write(ipc::encodeCall(operation, number, args));
+  }
+
+  // The next message, or nullopt when the daemon closed the connection or
+  // nothing came before the deadline (closed() tells which).
+  std::optional<Value> read(std::chrono::milliseconds timeout = 10s) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+      plist::Bytes body;
+      std::string why;
+      switch (decoder_.next(body, why)) {
+        case ipc::FrameDecoder::Status::Frame:
+          return plist::decodeBinary(body);
+        case ipc::FrameDecoder::Status::Invalid:
+          return std::nullopt;
+        case ipc::FrameDecoder::Status::NeedMore:
+          break;
+      }
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+      pollfd p{fd_.get(), POLLIN, 0};
+      if (left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
+        return std::nullopt;
+      }
+      std::uint8_t buf[65536];
+      const ssize_t n = ::recv(fd_.get(), buf, sizeof buf, 0);
+      if (n <= 0) {
+        closed_ = true;
+        return std::nullopt;
+      }
+      decoder_.append(buf, static_cast<std::size_t>(n));
+    }
+  }
+  // The reply to call `number` (other messages are skipped).
+  std::optional<Value> replyTo(std::uint64_t number, std::chrono::milliseconds timeout = 10s) {
+    for (;;) {
+      auto m = read(timeout);
+      if (!m || (*m)["reply"].unsignedValue() == number) {
+        return m;
+      }
+    }
+  }
+  // True when the daemon closes the connection before the deadline.
+  bool waitClosed(std::chrono::milliseconds timeout = 10s) {
+    while (!closed_) {
+      if (!read(timeout) && !closed_) {
+        return false;
+      }
+    }
+    return true;
+  }
+  bool closed() const { return closed_; }
+  void close() { fd_.reset(); }
+
+ private:
+  explicit RawClient(file::UniqueFd fd) : fd_(std::move(fd)) {}
+  file::UniqueFd fd_;
+  ipc::FrameDecoder decoder_;
+  bool closed_ = false;
+};
+
+class E2eTest : public ::testing::Test {
+ protected:
+  E2eTest() {
+    // No storebag server: a refused port fails every fetch at once.
+    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value("https://127.0.0.1:1/zerith"));
+  }
+
+  // The test's own user may (or may not) report.
+  void grant(const Value& entitlement) {
+    Dictionary entitlements;
+    if (!entitlement.isNil()) {
+      entitlements.set("com.velmar.private.zerithd", entitlement);
+    }
+    const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
+                                  {"entitlements", Value(std::move(entitlements))}});
+    root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
+  }
+
+  DaemonProcess& startDaemon(DaemonProcess::Options options = {}) {
+    daemon = std::make_unique<DaemonProcess>(root, std::move(options));
+    EXPECT_TRUE(daemon->ready()) << daemon->output();
+    return *daemon;
+  }
+
+  void TearDown() override {
+    if (daemon && daemon->running()) {
+      EXPECT_EQ(daemon->stop(), 0) << daemon->output();
+    }
+    if (daemon) {
+      EXPECT_EQ(daemon->output().find("Sanitizer"), std::string::npos) << daemon->output();
+    }
+  }
+
+  static constexpr const char* kTransactionEnded = "releaseVeskTransaction: Vesk transaction ended";
+
+  TempRoot root;
+  std::unique_ptr<DaemonProcess> daemon;
+};
+
+}  // namespace zerith::test
