@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <mutex>
 #include <system_error>
 
 #include <systemd/sd-daemon.h>
@@ -103,6 +104,9 @@ int ZerithdDaemon::run() {
     logger().info("main: Waiting up to {} ms for the keep-alive transaction to end", options_.stopTimeout.count());
     sd_notify(0, "STATUS=Draining sessions");
     if (transaction->waitUntilClosed(std::chrono::steady_clock::now() + options_.stopTimeout)) {
+      // The agent ends the transaction under its lock; taking it lets that
+      // call finish (and log) before the process goes.
+      { std::lock_guard lock(agent->agentLock()); }
       logger().info("main: Keep-alive transaction ended, exiting");
     } else {
       logger().error("main: Stop time-out passed with the keep-alive transaction still open, exiting");
