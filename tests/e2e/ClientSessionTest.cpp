@@ -51,7 +51,7 @@ TEST_F(ClientSessionTest, LifecycleOperationsAnswerAsASessionWithoutBackends) {
   const auto started = client->startConfig(20s);
   ASSERT_TRUE(started) << started.error->description;
   EXPECT_TRUE(started["backends"].isNil());
-  EXPECT_TRUE(daemon->has(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 7"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 7"));
 
   const auto states =
       client->fetchStates(Value(Dictionary{{kZerithUserInfoClientName, Value("mail")}}), 10s);
@@ -101,8 +101,10 @@ TEST_F(ClientSessionTest, KeepAliveCountFollowsBothTransportsAndEndsOnce) {
   ASSERT_TRUE(first && second);
   ASSERT_TRUE(first->fetchDisplayURL(10s));
   ASSERT_TRUE(second->fetchDisplayURL(10s));
-  EXPECT_TRUE(daemon->has(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 1"));
-  EXPECT_TRUE(daemon->has(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 2"));
+  EXPECT_TRUE(
+      daemon->waitForExact(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 1"));
+  EXPECT_TRUE(
+      daemon->waitForExact(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 2"));
   EXPECT_TRUE(daemon->waitFor("as it has proper entitlement, 1(0) connections."));
   EXPECT_EQ(daemon->count("createReportingSessionWithDelegate: Vesk transaction started with session"), 1u);
 
@@ -195,8 +197,10 @@ TEST_F(ClientSessionTest, AggregatingRootEndsItsChildsAggregationOverTheChildsCo
                                       {"category", Value(0u)},
                                       {"type", Value(0u)},
                                       {"payload", Value()}}));
-  EXPECT_TRUE(daemon->has(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 2"));
-  EXPECT_TRUE(daemon->has(Level::Debug, "updateCorrelatedSessions: Adding session 2 to list for hierarchyToken "
+  // The daemon's log arrives through a pipe of its own, maybe after the message.
+  EXPECT_TRUE(
+      daemon->waitForExact(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 2"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "updateCorrelatedSessions: Adding session 2 to list for hierarchyToken "
                                         "call-1 with hierarchyLevel 1"));
 }
 

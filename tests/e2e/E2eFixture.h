@@ -135,6 +135,9 @@ class E2eTest : public ::testing::Test {
   }
 
   DaemonProcess& startDaemon(DaemonProcess::Options options = {}) {
+    if (options.arguments.empty()) {
+      options.arguments = {"--stop-timeout", "5"};
+    }
     daemon = std::make_unique<DaemonProcess>(root, std::move(options));
     EXPECT_TRUE(daemon->ready()) << daemon->output();
     return *daemon;
@@ -142,7 +145,9 @@ class E2eTest : public ::testing::Test {
 
   void TearDown() override {
     if (daemon && daemon->running()) {
-      EXPECT_EQ(daemon->stop(), 0) << daemon->output();
+      const auto status = daemon->stop();
+      EXPECT_EQ(status, 0) << (status ? std::to_string(*status) : std::string("still running")) << "\n"
+                           << daemon->output();
     }
     if (daemon) {
       EXPECT_EQ(daemon->output().find("Sanitizer"), std::string::npos) << daemon->output();

@@ -309,6 +309,9 @@ std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout)
     return std::nullopt;
   }
   exitStatus_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  // Everything the process wrote is read before the caller looks at it.
+  std::unique_lock lock(mutex_);
+  changed_.wait_until(lock, std::max(deadline, Clock::now() + std::chrono::seconds(5)), [this] { return !stderrRead_; });
   return exitStatus_;
 }
 

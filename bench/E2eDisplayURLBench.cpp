@@ -1,0 +1,156 @@
+// One client connection calling fetchDisplayURL: as fast as it can against
+// the real zerithd (started in a temporary root, debug log off), beside a
+// bare Unix-socket echo that moves frames of the same sizes between two
+// threads. The difference is what the daemon and the framework add to the
+// kernel's round trip: decoding, the connection's queue, the session's
+// answer, the reply's encoding and the client's wake-up.
+
+#include <benchmark/benchmark.h>
+
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdlib>
+#include <memory>
+#include <thread>
+#include <vector>
+
+#include "ipc/Frame.h"
+#include "platform/FileUtil.h"
+#include "platform/PropertyList.h"
+#include "tests/support/DaemonProcess.h"
+#include "tests/support/TempRoot.h"
+#include "zerith/Zerith.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using namespace zerith;
+
+void reportLatencies(benchmark::State& state, std::vector<double>& micros) {
+  if (micros.empty()) {
+    return;
+  }
+  std::sort(micros.begin(), micros.end());
+  auto at = [&](double q) { return micros[std::min(micros.size() - 1, static_cast<std::size_t>(q * micros.size()))]; };
+  state.counters["p50_us"] = at(0.50);
+  state.counters["p99_us"] = at(0.99);
+  state.counters["round_trips"] =
+      benchmark::Counter(static_cast<double>(micros.size()), benchmark::Counter::kIsRate);
+}
+
+// The frames one fetchDisplayURL: round trip moves.
+Data requestFrame() { return ipc::encodeCall("fetchDisplayURL:", 1, {}); }
+Data replyFrame() { return ipc::encodeReply(1, Dictionary{{"url", Value("URL not available")}}); }
+
+bool writeAll(int fd, const Data& bytes) {
+  std::size_t done = 0;
+  while (done < bytes.size()) {
+    const ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
+    if (n <= 0) return false;
+    done += static_cast<std::size_t>(n);
+  }
+  return true;
+}
+
+bool readExactly(int fd, std::uint8_t* out, std::size_t size) {
+  std::size_t done = 0;
+  while (done < size) {
+    const ssize_t n = ::read(fd, out + done, size - done);
+    if (n <= 0) return false;
+    done += static_cast<std::size_t>(n);
+  }
+  return true;
+}
+
+// Reads one length-prefixed frame.
+bool readFrame(int fd, std::vector<std::uint8_t>& body) {
+  std::uint8_t header[4];
+  if (!readExactly(fd, header, 4)) return false;
+  const std::uint32_t size = (std::uint32_t{header[0]} << 24) | (std::uint32_t{header[1]} << 16) |
+                             (std::uint32_t{header[2]} << 8) | header[3];
+  body.resize(size);
+  return readExactly(fd, body.data(), size);
+}
+
+void BM_UnixSocketEcho(benchmark::State& state) {
+  int fds[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
+    state.SkipWithError("socketpair failed");
+    return;
+  }
+  file::UniqueFd client(fds[0]);
+  file::UniqueFd server(fds[1]);
+  const Data request = requestFrame();
+  const Data reply = replyFrame();
+  std::thread echo([fd = server.get(), &reply] {
+    std::vector<std::uint8_t> body;
+    while (readFrame(fd, body) && writeAll(fd, reply)) {
+    }
+  });
+  std::vector<double> micros;
+  std::vector<std::uint8_t> body;
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    if (!writeAll(client.get(), request) || !readFrame(client.get(), body)) {
+      state.SkipWithError("echo failed");
+      break;
+    }
+    micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+  }
+  ::shutdown(client.get(), SHUT_RDWR);
+  echo.join();
+  state.counters["request_bytes"] = static_cast<double>(request.size());
+  state.counters["reply_bytes"] = static_cast<double>(reply.size());
+  reportLatencies(state, micros);
+}
+BENCHMARK(BM_UnixSocketEcho)->UseRealTime()->MinTime(2.0);
+
+// The daemon, started once for the run.
+struct Daemon {
+  test::TempRoot root;
+  std::unique_ptr<test::DaemonProcess> process;
+  std::unique_ptr<Zerith> client;
+
+  Daemon() {
+    if (!std::getenv("ZERITHD_BINARY")) {
+      ::setenv("ZERITHD_BINARY", ZERITHD_BUILT_BINARY, 1);
+    }
+    const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
+                                  {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", Value(true)}})}});
+    root.write("/etc/zerithd/entitlements.d/bench.plist", plist::encodeXml(policy));
+    test::DaemonProcess::Options options;
+    options.debug = false;
+    options.arguments = {"--stop-timeout", "5"};
+    process = std::make_unique<test::DaemonProcess>(root, options);
+    if (process->ready()) {
+      client = Zerith::connect();
+    }
+  }
+};
+
+void BM_DaemonFetchDisplayURL(benchmark::State& state) {
+  static Daemon daemon;
+  if (!daemon.client) {
+    state.SkipWithError("the daemon did not start");
+    return;
+  }
+  std::vector<double> micros;
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    const auto reply = daemon.client->fetchDisplayURL(std::chrono::seconds(10));
+    if (!reply) {
+      state.SkipWithError("fetchDisplayURL failed");
+      break;
+    }
+    micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+  }
+  reportLatencies(state, micros);
+}
+BENCHMARK(BM_DaemonFetchDisplayURL)->UseRealTime()->MinTime(2.0);
+
+}  // namespace
+
+BENCHMARK_MAIN();
