@@ -195,6 +195,14 @@ HttpsTestServer::HttpsTestServer(const TestCA& ca) : impl_(std::make_unique<Impl
   // The socket already listens: connections made before the thread runs wait
   // in the backlog.
   impl_->thread = std::thread([impl] { impl->server->listen_after_bind(); });
+  // stop() only ends a server that already runs its accept loop.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  while (!server.is_running()) {
+    if (std::chrono::steady_clock::now() > deadline) {
+      throw std::runtime_error("HttpsTestServer: the server did not start");
+    }
+    std::this_thread::sleep_for(std::chrono::microseconds(200));
+  }
 }
 
 HttpsTestServer::~HttpsTestServer() { stop(); }
@@ -240,6 +248,13 @@ std::size_t HttpsTestServer::requestCount() const {
 bool HttpsTestServer::waitForRequests(std::size_t count, std::chrono::milliseconds timeout) const {
   std::unique_lock lock(impl_->mutex);
   return impl_->changed.wait_for(lock, timeout, [&] { return impl_->recorded.size() >= count; });
+}
+
+bool HttpsTestServer::waitForRequestTo(const std::string& path, std::chrono::milliseconds timeout) const {
+  std::unique_lock lock(impl_->mutex);
+  return impl_->changed.wait_for(lock, timeout, [&] {
+    return std::any_of(impl_->recorded.begin(), impl_->recorded.end(), [&](const RecordedRequest& r) { return r.path == path; });
+  });
 }
 
 void HttpsTestServer::stop() {

@@ -46,10 +46,12 @@ struct RecordedRequest {
   std::size_t headerCount(std::string_view name) const;
 };
 
+// Every member has a default, so designated initializers may name any subset
+// ({.status = 204}, {.body = "x", .chunkSize = 100}).
 struct Reply {
   int status = 200;
-  std::vector<std::pair<std::string, std::string>> headers;
-  std::string body;
+  std::vector<std::pair<std::string, std::string>> headers{};
+  std::string body{};
   // Waits this long before answering.
   std::chrono::milliseconds delay{0};
   // > 0: the body goes out with chunked transfer encoding in pieces of this
@@ -84,6 +86,9 @@ class HttpsTestServer {
   std::size_t requestCount() const;
   // Waits until at least `count` requests have arrived; false on time-out.
   bool waitForRequests(std::size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(10)) const;
+
+  // Waits until a request for `path` has arrived; false on time-out.
+  bool waitForRequestTo(const std::string& path, std::chrono::milliseconds timeout = std::chrono::seconds(10)) const;
 
   // Stops listening and ends held answers; also done by the destructor.
   void stop();

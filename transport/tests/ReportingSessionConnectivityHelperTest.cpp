@@ -1,0 +1,415 @@
+// The connectivity helper against a real HTTPS server on loopback.
+
+#include "transport/ReportingSessionConnectivityHelper.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+
+#include "platform/Paths.h"
+#include "transport/tests/TransportTestSupport.h"
+
+namespace zerith::test {
+namespace {
+
+namespace fs = std::filesystem;
+using Helper = ReportingSessionConnectivityHelper;
+using log::Level;
+
+class ConnectivityHelperTest : public TransportTest {};
+
+std::size_t filesIn(const fs::path& folder) {
+  std::error_code ec;
+  std::size_t n = 0;
+  for (fs::recursive_directory_iterator it(folder, ec), end; !ec && it != end; it.increment(ec)) {
+    ++n;
+  }
+  return n;
+}
+
+TEST(ConnectivityHelperTaskNumbering, FirstTaskOfTheProcessIsTask00000001) {
+  // A fresh process (the death-test child re-runs only this test) starts the
+  // shared counter: incremented before use, eight lower-case hex digits.
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(
+      {
+        auto helper = Helper::initWithDelegate({}, Helper::GETRequestMode());
+        auto session = URLSession::sessionWithConfiguration(URLSessionConfiguration::defaultSessionConfiguration(), {},
+                                                            mainOperationQueue());
+        auto first = session->dataTaskWithRequest(URLRequest{});
+        auto second = session->dataTaskWithRequest(URLRequest{});
+        helper->createHelperForTask(*first, nullptr);
+        helper->createHelperForTask(*second, nullptr);
+        std::_Exit(first->taskDescription() == "Task_00000001" && second->taskDescription() == "Task_00000002" ? 0 : 1);
+      },
+      ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(ConnectivityHelperTest, TwoHelpersNumberTheirTasksFromOneSequence) {
+  server.on("/n", Reply{});
+  auto first = Helper::initWithDelegate({}, Helper::GETRequestMode());
+  auto second = Helper::initWithDelegate({}, 8);
+  auto done = Completions::make();
+  first->getURLRequestWithCompletionHandler(get(server.url("/n")), done->handler());
+  second->getURLRequestWithCompletionHandler(get(server.url("/n")), done->handler());
+  first->getURLRequestWithCompletionHandler(get(server.url("/n")), done->handler());
+  ASSERT_TRUE(done->waitFor(3));
+
+  const auto names = taskDescriptionsAfter(logs, "createHelperForTask: created helperTask for task <");
+  ASSERT_EQ(names.size(), 3u);
+  const std::regex format("^Task_[0-9a-f]{8}$");
+  const auto number = [](const std::string& n) { return std::stoul(n.substr(5), nullptr, 16); };
+  for (const auto& n : names) {
+    EXPECT_TRUE(std::regex_match(n, format)) << n;
+  }
+  EXPECT_EQ(number(names[1]), number(names[0]) + 1);
+  EXPECT_EQ(number(names[2]), number(names[0]) + 2);
+}
+
+TEST_F(ConnectivityHelperTest, AnswerWithoutBodyCompletesExactlyOnceWithAnEmptyBuffer) {
+  server.on("/empty", Reply{.status = 204});
+  auto helper = Helper::initWithDelegate({}, 4);
+  const std::string session = helper->sessionDescription();
+  EXPECT_TRUE(isUUIDString(session)) << session;
+  EXPECT_TRUE(logs.has(Level::Debug, "QFURLSession created with ID <" + session + ">, delegate 1"));
+
+  auto done = Completions::make();
+  helper->postURLRequestWithCompletionHandler(post(server.url("/empty"), "x"), done->handler());
+  ASSERT_TRUE(done->waitFor(1));
+  const auto task = taskDescriptionsAfter(logs, "createHelperForTask: created helperTask for task <").at(0);
+  // The record is released after its completion ran: nothing can follow.
+  ASSERT_TRUE(logs.waitFor("ConnectivityHelperTask with ID <" + task + "> dealloced"));
+
+  ASSERT_EQ(done->count(), 1u);
+  const auto call = done->calls()[0];
+  EXPECT_TRUE(call.data.empty());
+  ASSERT_TRUE(call.response.has_value());
+  EXPECT_EQ(call.response->statusCode, 204);
+  EXPECT_EQ(call.response->url, server.url("/empty"));
+  EXPECT_FALSE(call.error.has_value());
+
+  EXPECT_TRUE(logs.has(Level::Debug, "ConnectivityHelperTask with ID <" + task + "> created"));
+  EXPECT_TRUE(logs.has(Level::Debug, "didReceiveResponse: for <session>:<task> <" + session + ">:<" + task + ">"));
+  EXPECT_TRUE(logs.has(Level::Debug, "didSendBodyData: for <session>:<task> <" + session + ">:<" + task + ">: Sent 1 out of 1"));
+  EXPECT_EQ(logs.count("didReceiveData:"), 0u);
+  EXPECT_TRUE(logs.has(Level::Debug, "didCompleteWithError: for <session>:<task> <" + session + ">:<" + task +
+                                         "> with response <HTTPURLResponse URL: " + server.url("/empty") +
+                                         " Status Code: 204>, error (null)"));
+}
+
+TEST_F(ConnectivityHelperTest, LargeChunkedBodyArrivesWholeAndInOrder) {
+  const std::string body = patternBody(3 * 1024 * 1024 + 17);
+  server.on("/big", Reply{.status = 200, .body = body, .chunkSize = 7001});
+  auto helper = Helper::initWithDelegate({}, Helper::GETRequestMode());
+  auto done = Completions::make();
+  helper->getURLRequestWithCompletionHandler(get(server.url("/big")), done->handler());
+  ASSERT_TRUE(done->waitFor(1));
+  const auto call = done->calls()[0];
+  EXPECT_FALSE(call.error.has_value());
+  EXPECT_EQ(call.data.size(), body.size());
+  EXPECT_TRUE(text(call.data) == body) << "the chunks were not joined in order";
+  EXPECT_GE(logs.count("didReceiveData: received "), 2u) << "expected the body in several deliveries";
+}
+
+TEST_F(ConnectivityHelperTest, WrongModeRequestsAreLoggedAndNeverComplete) {
+  auto done = Completions::make();
+  auto postHelper = Helper::initWithDelegate({}, Helper::POSTRequestMode());
+  auto getHelper = Helper::initWithDelegate({}, Helper::GETRequestMode());
+  auto dataPost = Helper::initWithDelegate({}, 4);
+  auto dataGet = Helper::initWithDelegate({}, 8);
+  postHelper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
+  getHelper->postURLRequestWithCompletionHandler(post(server.url("/"), "b"), done->handler());
+  dataPost->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
+  dataGet->postURLRequestWithCompletionHandler(post(server.url("/"), "b"), done->handler());
+
+  EXPECT_TRUE(logs.has(Level::Error, "getURLRequestWithCompletionHandler: wrong mode for GET operation detected 1"));
+  EXPECT_TRUE(logs.has(Level::Error, "postURLRequestWithCompletionHandler: wrong mode for POST operation detected 2"));
+  EXPECT_TRUE(logs.has(Level::Error, "getURLRequestWithCompletionHandler: wrong mode for GET operation detected 4"));
+  EXPECT_TRUE(logs.has(Level::Error, "postURLRequestWithCompletionHandler: wrong mode for POST operation detected 8"));
+  // Completions come only from registered tasks, and none was registered.
+  EXPECT_EQ(logs.count("createHelperForTask:"), 0u);
+  EXPECT_EQ(server.requestCount(), 0u);
+  EXPECT_EQ(done->count(), 0u);
+  EXPECT_EQ(filesIn(Helper::storageRootFolder()), 0u);
+}
+
+TEST_F(ConnectivityHelperTest, HelpersOfUnknownModesHaveNoSessionAndCarryNothing) {
+  auto events = std::make_shared<EventLog>();
+  auto agent = std::make_shared<ReleaseCountingAgent>(events);
+  auto done = Completions::make();
+  for (const std::uint32_t mode : {0u, 3u}) {
+    EXPECT_FALSE(Helper::privateURLSessionConfigWithMode(mode).has_value());
+    auto helper = Helper::initWithDelegate(agent, mode);
+    EXPECT_TRUE(isUUIDString(helper->sessionDescription()));
+    EXPECT_TRUE(logs.has(Level::Debug, "QFURLSession created with ID <" + helper->sessionDescription() + ">, delegate 0"));
+    helper->postURLRequestWithCompletionHandler(post(server.url("/"), "b"), done->handler());
+    helper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
+    const std::string m = std::to_string(mode);
+    EXPECT_TRUE(logs.has(Level::Error, "postURLRequestWithCompletionHandler: wrong mode for POST operation detected " + m));
+    EXPECT_TRUE(logs.has(Level::Error, "getURLRequestWithCompletionHandler: wrong mode for GET operation detected " + m));
+    helper->invalidate();
+    EXPECT_TRUE(logs.has(Level::Debug, "ReportingSessionConnectivityHelper:invalidate: QFURLSession with ID <" +
+                                           helper->sessionDescription() + ">"));
+  }
+  EXPECT_EQ(logs.count("createHelperForTask:"), 0u);
+  EXPECT_EQ(server.requestCount(), 0u);
+  EXPECT_EQ(done->count(), 0u);
+}
+
+TEST_F(ConnectivityHelperTest, ModesGetTheirConfigurations) {
+  const auto m1 = Helper::privateURLSessionConfigWithMode(1);
+  const auto m2 = Helper::privateURLSessionConfigWithMode(2);
+  const auto m4 = Helper::privateURLSessionConfigWithMode(4);
+  const auto m8 = Helper::privateURLSessionConfigWithMode(8);
+  ASSERT_TRUE(m1 && m2 && m4 && m8);
+  EXPECT_TRUE(m1->background && m1->discretionary && m1->requiresPowerPluggedIn);
+  EXPECT_EQ(m1->networkServiceType, NetworkServiceType::Background);
+  EXPECT_TRUE(m2->background && m2->discretionary && !m2->requiresPowerPluggedIn);
+  EXPECT_EQ(m2->networkServiceType, NetworkServiceType::Default);
+  EXPECT_TRUE(isUUIDString(m1->identifier));
+  EXPECT_NE(m1->identifier, Helper::privateURLSessionConfigWithMode(1)->identifier);
+  for (const auto* c : {&*m4, &*m8}) {
+    EXPECT_FALSE(c->background || c->discretionary || c->requiresPowerPluggedIn);
+  }
+  for (const auto* c : {&*m1, &*m2, &*m4, &*m8}) {
+    EXPECT_TRUE(c->waitsForConnectivity);
+    EXPECT_EQ(c->sourceApplicationBundleIdentifier, "com.velmar.system.diagnostics");
+  }
+  // Background helpers are known by their configuration's identifier.
+  auto background = Helper::initWithDelegate({}, Helper::POSTRequestMode());
+  auto other = Helper::initWithDelegate({}, Helper::POSTRequestMode());
+  EXPECT_TRUE(isUUIDString(background->sessionDescription()));
+  EXPECT_NE(background->sessionDescription(), other->sessionDescription());
+}
+
+TEST_F(ConnectivityHelperTest, UploadPostSendsTheExactBodyAndLeavesNoBodyFile) {
+  std::string body;
+  for (int i = 0; i < 256; ++i) {
+    body.push_back(static_cast<char>(i));
+  }
+  body += patternBody(200 * 1024);
+  server.on("/upload", Reply{.status = 200, .body = "thanks"});
+  auto helper = Helper::initWithDelegate({}, Helper::POSTRequestMode());
+  auto done = Completions::make();
+  URLRequest request = post(server.url("/upload?x=1"), body);
+  request.setValue("application/octet-stream", "Content-Type");
+  helper->postURLRequestWithCompletionHandler(request, done->handler());
+  // Deleted at once: the open descriptor carries the upload.
+  EXPECT_EQ(filesIn(Helper::storageRootFolder()), 0u);
+
+  ASSERT_TRUE(done->waitFor(1));
+  const auto call = done->calls()[0];
+  EXPECT_FALSE(call.error.has_value());
+  EXPECT_EQ(text(call.data), "thanks");
+  ASSERT_EQ(server.requestCount(), 1u);
+  const auto r = server.requests()[0];
+  EXPECT_EQ(r.method, "POST");
+  EXPECT_EQ(r.target, "/upload?x=1");
+  EXPECT_TRUE(r.body == body) << "upload body differs (" << r.body.size() << " of " << body.size() << " bytes)";
+  EXPECT_EQ(r.header("Content-Length"), std::to_string(body.size()));
+  EXPECT_EQ(r.header("Content-Type"), "application/octet-stream");
+  EXPECT_EQ(r.header("X-ZTH-Source-Application"), "com.velmar.system.diagnostics");
+  EXPECT_EQ(filesIn(Helper::storageRootFolder()), 0u);
+  const std::string total = std::to_string(body.size());
+  EXPECT_EQ(logs.count("Sent " + total + " out of " + total), 1u);
+}
+
+TEST_F(ConnectivityHelperTest, UploadPostWhoseBodyCannotBeWrittenIsDropped) {
+  // The storage root is a file: no body file can be made under it.
+  root.write("/tmp/zthstorage", "not a folder");
+  auto helper = Helper::initWithDelegate({}, Helper::POSTRequestMode());
+  auto done = Completions::make();
+  helper->postURLRequestWithCompletionHandler(post(server.url("/upload"), "body"), done->handler());
+  EXPECT_EQ(logs.count("createHelperForTask:"), 0u);
+  EXPECT_EQ(logs.count("postURLRequestWithCompletionHandler"), 0u);
+  EXPECT_EQ(server.requestCount(), 0u);
+  EXPECT_EQ(done->count(), 0u);
+}
+
+TEST_F(ConnectivityHelperTest, RefusedConnectionCompletesWithAnErrorAtOnce) {
+  RefusingPort refusing;
+  auto done = Completions::make();
+  auto poster = Helper::initWithDelegate({}, Helper::POSTRequestMode());
+  auto getter = Helper::initWithDelegate({}, Helper::GETRequestMode());
+  poster->postURLRequestWithCompletionHandler(post(refusing.url("/"), "b"), done->handler());
+  getter->getURLRequestWithCompletionHandler(get(refusing.url("/")), done->handler());
+  ASSERT_TRUE(done->waitFor(2));
+  for (const auto& call : done->calls()) {
+    ASSERT_TRUE(call.error.has_value());
+    EXPECT_EQ(call.error->domain, kURLErrorDomain);
+    EXPECT_EQ(call.error->code, 7);  // CURLE_COULDNT_CONNECT
+    EXPECT_FALSE(call.error->description.empty());
+    EXPECT_FALSE(call.response.has_value());
+    EXPECT_TRUE(call.data.empty());
+  }
+  // Waiting for connectivity is not waiting for a refusing server.
+  EXPECT_EQ(logs.count("next attempt"), 0u);
+  EXPECT_EQ(filesIn(Helper::storageRootFolder()), 0u);
+}
+
+TEST_F(ConnectivityHelperTest, ServerTrustedOnlyThroughTheExtraCA) {
+  TestCA stranger("stranger CA");
+  HttpsTestServer untrusted(stranger);
+  untrusted.on("/", Reply{.body = "secret"});
+  server.on("/", Reply{.body = "ok"});
+  auto helper = Helper::initWithDelegate({}, 8);
+  auto done = Completions::make();
+
+  helper->getURLRequestWithCompletionHandler(get(untrusted.url("/")), done->handler());
+  ASSERT_TRUE(done->waitFor(1));
+  ASSERT_TRUE(done->calls()[0].error.has_value());
+  EXPECT_EQ(done->calls()[0].error->code, 60);  // CURLE_PEER_FAILED_VERIFICATION
+  EXPECT_TRUE(done->calls()[0].data.empty());
+
+  ASSERT_TRUE(URLSession::setExtraCAFile(""));
+  helper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
+  ASSERT_TRUE(done->waitFor(2));
+  ASSERT_TRUE(done->calls()[1].error.has_value());
+  EXPECT_EQ(done->calls()[1].error->code, 60);
+
+  // A bad file is refused and leaves the setting alone.
+  EXPECT_FALSE(URLSession::setExtraCAFile((root.path() / "missing.pem").string()));
+  root.write("/no-cert.pem", "-----BEGIN NOTHING-----\n");
+  EXPECT_FALSE(URLSession::setExtraCAFile((root / "/no-cert.pem").string()));
+  EXPECT_EQ(URLSession::extraCAFile(), "");
+  EXPECT_TRUE(logs.contains("holds no certificate"));
+
+  ASSERT_TRUE(URLSession::setExtraCAFile(TestCA::shared().caFile().string()));
+  EXPECT_EQ(URLSession::extraCAFile(), TestCA::shared().caFile().string());
+  helper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
+  ASSERT_TRUE(done->waitFor(3));
+  EXPECT_FALSE(done->calls()[2].error.has_value());
+  EXPECT_EQ(text(done->calls()[2].data), "ok");
+  EXPECT_EQ(untrusted.requestCount(), 0u);
+}
+
+TEST_F(ConnectivityHelperTest, InvalidateLetsTheRunningTaskFinishThenReleasesOnce) {
+  auto events = std::make_shared<EventLog>();
+  auto agent = std::make_shared<ReleaseCountingAgent>(events);
+  server.on("/slow", Reply{.body = "late"});
+  server.holdAnswers();
+  auto helper = Helper::initWithDelegate(agent, Helper::POSTRequestMode());
+  const std::string session = helper->sessionDescription();
+  auto done = Completions::make();
+  helper->postURLRequestWithCompletionHandler(post(server.url("/slow"), "b"),
+                                              done->handler([events](const Completions::Call&) { events->add("completion"); }));
+  ASSERT_TRUE(server.waitForRequests(1));
+  helper->invalidate();
+  helper->invalidate();
+  EXPECT_TRUE(logs.has(Level::Debug, "ReportingSessionConnectivityHelper:invalidate: QFURLSession with ID <" + session + ">"));
+
+  // No new work once invalidated: answered at once, never sent.
+  auto late = Completions::make();
+  helper->postURLRequestWithCompletionHandler(post(server.url("/slow"), "late"), late->handler());
+  ASSERT_TRUE(late->waitFor(1));
+  ASSERT_TRUE(late->calls()[0].error.has_value());
+  EXPECT_EQ(late->calls()[0].error->code, kURLErrorSessionInvalidated);
+
+  helper.reset();  // the owner lets go while the task still runs
+  server.releaseAnswers();
+  ASSERT_TRUE(events->waitFor("releaseVeskTransaction"));
+  ASSERT_TRUE(logs.waitFor("QFURLSession dealloced with ID <" + session + ">"));
+  EXPECT_EQ(events->events(), (std::vector<std::string>{"completion", "releaseVeskTransaction"}));
+  EXPECT_EQ(text(done->calls().at(0).data), "late");
+  EXPECT_TRUE(logs.has(Level::Debug, "didBecomeInvalidWithError: session <" + session + "> invalidated with error (null)"));
+  EXPECT_EQ(server.requestCount(), 1u);
+}
+
+TEST_F(ConnectivityHelperTest, InvalidationWithoutAgentOrWithoutTasksStillCompletes) {
+  auto events = std::make_shared<EventLog>();
+  auto agent = std::make_shared<ReleaseCountingAgent>(events);
+  auto idle = Helper::initWithDelegate(agent, 8);
+  const std::string idleSession = idle->sessionDescription();
+  idle->invalidate();
+  ASSERT_TRUE(events->waitFor("releaseVeskTransaction"));
+
+  // The agent is gone by the time the session becomes invalid: nothing to release.
+  auto orphanAgent = std::make_shared<ReleaseCountingAgent>(events);
+  auto orphan = Helper::initWithDelegate(orphanAgent, 8);
+  const std::string orphanSession = orphan->sessionDescription();
+  orphanAgent.reset();
+  orphan->invalidate();
+  ASSERT_TRUE(logs.waitFor("didBecomeInvalidWithError: session <" + orphanSession + ">"));
+  EXPECT_EQ(events->events(), std::vector<std::string>{"releaseVeskTransaction"});
+}
+
+TEST_F(ConnectivityHelperTest, HelperDroppedWhileTasksRunCompletesEveryTask) {
+  server.on("/a", Reply{.body = "A"});
+  server.holdAnswers();
+  auto helper = Helper::initWithDelegate({}, 4);
+  const std::string session = helper->sessionDescription();
+  auto done = Completions::make();
+  for (int i = 0; i < 3; ++i) {
+    helper->postURLRequestWithCompletionHandler(post(server.url("/a"), std::to_string(i)), done->handler());
+  }
+  ASSERT_TRUE(server.waitForRequests(3));
+  helper.reset();
+  EXPECT_FALSE(logs.contains("QFURLSession dealloced"));
+  server.releaseAnswers();
+  ASSERT_TRUE(done->waitFor(3));
+  ASSERT_TRUE(logs.waitFor("QFURLSession dealloced with ID <" + session + ">"));
+  for (const auto& call : done->calls()) {
+    EXPECT_EQ(text(call.data), "A");
+  }
+  EXPECT_EQ(done->count(), 3u);
+  EXPECT_EQ(logs.count("didBecomeInvalidWithError"), 0u);
+}
+
+TEST_F(ConnectivityHelperTest, CompletionMaySendTheNextRequest) {
+  server.on("/first", Reply{.body = "1"});
+  server.on("/second", Reply{.body = "2"});
+  auto helper = Helper::initWithDelegate({}, 8);
+  auto done = Completions::make();
+  std::weak_ptr<Helper> weak = helper;
+  auto next = done->handler();
+  helper->getURLRequestWithCompletionHandler(get(server.url("/first")),
+                                             done->handler([weak, next, url = server.url("/second")](const Completions::Call&) {
+                                               if (auto h = weak.lock()) {
+                                                 h->getURLRequestWithCompletionHandler(get(url), next);
+                                               }
+                                             }));
+  ASSERT_TRUE(done->waitFor(2));
+  EXPECT_EQ(text(done->calls()[0].data), "1");
+  EXPECT_EQ(text(done->calls()[1].data), "2");
+}
+
+TEST_F(ConnectivityHelperTest, CleanupRemovesStaleBodyFilesOfAnyCaseAndKeepsOthers) {
+  const std::string dir = "/tmp/zthstorage/";
+  for (const char* name : {"A.zthdiag", "b.ZTHDIAG", "c.ZthDiag", "sub/d.zthdiag", "sub/deeper/e.zthdiag", "f.zthdiag/inner.txt"}) {
+    root.write(dir + name, "stale");
+  }
+  for (const char* name : {"keep.txt", "zthdiag", "x.zthdiag.bak", "xzthdiag", "sub/keep.log", "sub/deeper/keep"}) {
+    root.write(dir + name, "keep");
+  }
+  Helper::cleanupStorageRootFolder();
+  std::vector<std::string> left;
+  for (fs::recursive_directory_iterator it(Helper::storageRootFolder()), end; it != end; ++it) {
+    left.push_back(it->path().lexically_relative(Helper::storageRootFolder()).generic_string());
+  }
+  std::sort(left.begin(), left.end());
+  EXPECT_EQ(left, (std::vector<std::string>{"keep.txt", "sub", "sub/deeper", "sub/deeper/keep", "sub/keep.log", "x.zthdiag.bak",
+                                            "xzthdiag", "zthdiag"}));
+}
+
+TEST_F(ConnectivityHelperTest, CleanupMakesTheStorageFolderAndBodyFilesLandInIt) {
+  EXPECT_FALSE(fs::exists(Helper::storageRootFolder()));
+  Helper::cleanupStorageRootFolder();
+  EXPECT_TRUE(fs::is_directory(Helper::storageRootFolder()));
+  EXPECT_EQ(Helper::storageRootFolder(), root / "/tmp/zthstorage");
+
+  const fs::path a = Helper::composeUniqueContainerURL();
+  const fs::path b = Helper::composeUniqueContainerURL();
+  EXPECT_NE(a, b);
+  EXPECT_EQ(a.parent_path(), Helper::storageRootFolder());
+  EXPECT_EQ(a.extension(), ".zthdiag");
+  EXPECT_TRUE(isUUIDString(a.stem().string())) << a;
+  std::ofstream(a) << "x";
+  Helper::deleteContainerAtURL(a);
+  Helper::deleteContainerAtURL(a);  // already gone: ignored
+  EXPECT_FALSE(fs::exists(a));
+}
+
+}  // namespace
+}  // namespace zerith::test

@@ -1,0 +1,200 @@
+#pragma once
+
+// Scenario helpers shared by the transport tests: a recorder for helper
+// completions, a recording URLSession delegate, an agent that counts
+// keep-alive releases, and a fixture with a temporary root, a log capture,
+// the shared test CA trusted and a loopback HTTPS server.
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <chrono>
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <regex>
+#include <string>
+#include <thread>
+#include <vector>
+#include <functional>
+
+#include "platform/Log.h"
+#include "session/ZerithdSessionDelegate.h"
+#include "tests/support/HttpsTestServer.h"
+#include "tests/support/TempRoot.h"
+#include "tests/support/TestCA.h"
+#include "transport/ReportingSessionConnectivityInterface.h"
+#include "transport/URLSession.h"
+
+namespace zerith::test {
+
+inline constexpr auto kWait = std::chrono::seconds(10);
+
+inline Data bytes(const std::string& s) { return Data(s.begin(), s.end()); }
+inline std::string text(const Data& d) { return std::string(d.begin(), d.end()); }
+
+// A body whose every position differs from its neighbours, so that a lost,
+// repeated or reordered piece shows.
+inline std::string patternBody(std::size_t size) {
+  std::string body(size, '\0');
+  for (std::size_t i = 0; i < size; ++i) {
+    body[i] = static_cast<char>((i * 131 + i / 256 + i / 65536) & 0xff);
+  }
+  return body;
+}
+
+// Every completion call, in order; shared so that a late call never touches
+// a finished test's stack.
+class Completions : public std::enable_shared_from_this<Completions> {
+ public:
+  struct Call {
+    Data data;
+    std::optional<HTTPURLResponse> response;
+    std::optional<Error> error;
+  };
+
+  static std::shared_ptr<Completions> make() { return std::make_shared<Completions>(); }
+
+  URLCompletion handler(std::function<void(const Call&)> also = nullptr) {
+    return [self = shared_from_this(), also](const Data& data, const std::optional<HTTPURLResponse>& response,
+                                             const std::optional<Error>& error) {
+      Call call{data, response, error};
+      if (also) {
+        also(call);
+      }
+      {
+        std::lock_guard lock(self->mutex_);
+        self->calls_.push_back(std::move(call));
+      }
+      self->changed_.notify_all();
+    };
+  }
+
+  bool waitFor(std::size_t count, std::chrono::milliseconds timeout = kWait) const {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, timeout, [&] { return calls_.size() >= count; });
+  }
+  std::vector<Call> calls() const {
+    std::lock_guard lock(mutex_);
+    return calls_;
+  }
+  std::size_t count() const {
+    std::lock_guard lock(mutex_);
+    return calls_.size();
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  mutable std::condition_variable changed_;
+  std::vector<Call> calls_;
+};
+
+// An ordered list of events that tests append to from several threads.
+class EventLog {
+ public:
+  void add(std::string event) {
+    {
+      std::lock_guard lock(mutex_);
+      events_.push_back(std::move(event));
+    }
+    changed_.notify_all();
+  }
+  std::vector<std::string> events() const {
+    std::lock_guard lock(mutex_);
+    return events_;
+  }
+  bool waitFor(const std::string& event, std::chrono::milliseconds timeout = kWait) const { return waitForCount(event, 1, timeout); }
+  bool waitForCount(const std::string& event, std::size_t count, std::chrono::milliseconds timeout = kWait) const {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, timeout, [&] {
+      return static_cast<std::size_t>(std::count(events_.begin(), events_.end(), event)) >= count;
+    });
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  mutable std::condition_variable changed_;
+  std::vector<std::string> events_;
+};
+
+// The agent as a connectivity helper sees it: only the keep-alive release
+// matters here.
+class ReleaseCountingAgent : public ZerithdSessionDelegate {
+ public:
+  explicit ReleaseCountingAgent(std::shared_ptr<EventLog> log) : log_(std::move(log)) {}
+
+  std::recursive_mutex& agentLock() override { return lock_; }
+  void releaseVeskTransaction() override { log_->add("releaseVeskTransaction"); }
+  Value storebagForSession(ZerithdSession&) override { return {}; }
+  Value storebagVersionForSession(ZerithdSession&) override { return {}; }
+  void updateCorrelatedSessions(ZerithdSession&) override {}
+  Value parentSessionIDStringForSession(ZerithdSession&) override { return {}; }
+  std::shared_ptr<ZerithdSession> parentSessionForChild(ZerithdSession&) override { return nullptr; }
+  std::shared_ptr<ZerithdSession> getAncestorWithAggregatorForSession(ZerithdSession&) override { return nullptr; }
+  void updateDownstreamSessions(ZerithdSession&) override {}
+  void updateSharedDataForSession(ZerithdSession&, const Value&) override {}
+  void removeObjectFromSharedDataForSession(ZerithdSession&, const std::string&) override {}
+  Value sharedDataForSession(ZerithdSession&) override { return {}; }
+  void addAgentHealthInfoForSession(ZerithdSession&, Dictionary&) override {}
+
+ private:
+  std::recursive_mutex lock_;
+  std::shared_ptr<EventLog> log_;
+};
+
+// Task descriptions named in the captured log lines that start with `prefix`
+// ("createHelperForTask: created helperTask for task <" -> "Task_0000002a").
+inline std::vector<std::string> taskDescriptionsAfter(const log::LogCapture& logs, const std::string& prefix) {
+  std::vector<std::string> found;
+  for (const auto& line : logs.lines()) {
+    if (line.text.rfind(prefix, 0) == 0) {
+      const auto end = line.text.find('>', prefix.size());
+      found.push_back(line.text.substr(prefix.size(), end - prefix.size()));
+    }
+  }
+  return found;
+}
+
+// Waits (bounded) until the capture holds `count` lines containing `needle`.
+inline bool waitForLogCount(const log::LogCapture& logs, const std::string& needle, std::size_t count,
+                            std::chrono::milliseconds timeout = kWait) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (logs.count(needle) < count) {
+    if (std::chrono::steady_clock::now() > deadline) {
+      return false;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  return true;
+}
+
+inline bool isUUIDString(const std::string& s) {
+  static const std::regex uuid("^[0-9A-F]{8}-[0-9A-F]{4}-[0-9A-F]{4}-[0-9A-F]{4}-[0-9A-F]{12}$");
+  return std::regex_match(s, uuid);
+}
+
+class TransportTest : public ::testing::Test {
+ protected:
+  void SetUp() override { ASSERT_TRUE(URLSession::setExtraCAFile(TestCA::shared().caFile().string())); }
+  void TearDown() override { server.stop(); }
+
+  static URLRequest get(const std::string& url) {
+    URLRequest r;
+    r.url = url;
+    return r;
+  }
+  static URLRequest post(const std::string& url, const std::string& body) {
+    URLRequest r;
+    r.httpMethod = "POST";
+    r.url = url;
+    r.body = bytes(body);
+    return r;
+  }
+
+  TempRoot root;
+  log::LogCapture logs;
+  HttpsTestServer server;
+};
+
+}  // namespace zerith::test

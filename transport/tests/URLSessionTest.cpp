@@ -1,0 +1,352 @@
+// The HTTP session service under the helper: what goes on the wire, the
+// waits of background configurations, the order of delegate callbacks.
+
+#include "transport/URLSession.h"
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+
+#include "transport/tests/TransportTestSupport.h"
+
+namespace zerith::test {
+namespace {
+
+namespace fs = std::filesystem;
+
+// Writes every callback as a line: "response 200", "data 5", "sent 3/3",
+// "complete" or "complete 7", "invalid".
+class RecordingDelegate : public URLSessionDelegate {
+ public:
+  explicit RecordingDelegate(std::shared_ptr<EventLog> log) : log_(std::move(log)) {}
+
+  void didBecomeInvalidWithError(URLSession&, const std::optional<Error>& error) override {
+    log_->add(error ? "invalid " + std::to_string(error->code) : "invalid");
+  }
+  void didSendBodyData(URLSession&, URLSessionTask&, std::int64_t, std::int64_t total, std::int64_t expected) override {
+    log_->add("sent " + std::to_string(total) + "/" + std::to_string(expected));
+  }
+  void didReceiveResponse(URLSession&, URLSessionTask&, const HTTPURLResponse& response,
+                          const std::function<void(ResponseDisposition)>& handler) override {
+    log_->add("response " + std::to_string(response.statusCode));
+    handler(disposition);
+  }
+  void didReceiveData(URLSession&, URLSessionTask&, const Data& data) override {
+    std::lock_guard lock(mutex_);
+    received_.insert(received_.end(), data.begin(), data.end());
+  }
+  void didCompleteWithError(URLSession&, URLSessionTask&, const std::optional<Error>& error) override {
+    {
+      std::lock_guard lock(mutex_);
+      lastError_ = error;
+    }
+    log_->add(error ? "complete " + std::to_string(error->code) : "complete");
+  }
+
+  Data received() const {
+    std::lock_guard lock(mutex_);
+    return received_;
+  }
+  std::optional<Error> lastError() const {
+    std::lock_guard lock(mutex_);
+    return lastError_;
+  }
+
+  ResponseDisposition disposition = ResponseDisposition::Allow;
+
+ private:
+  std::shared_ptr<EventLog> log_;
+  mutable std::mutex mutex_;
+  Data received_;
+  std::optional<Error> lastError_;
+};
+
+class URLSessionTest : public TransportTest {
+ protected:
+  std::shared_ptr<URLSession> makeSession(const URLSessionConfiguration& configuration) {
+    delegate = std::make_shared<RecordingDelegate>(events);
+    return URLSession::sessionWithConfiguration(configuration, delegate, mainOperationQueue());
+  }
+  static URLSessionConfiguration waitingConfiguration() {
+    auto c = URLSessionConfiguration::defaultSessionConfiguration();
+    c.waitsForConnectivity = true;
+    c.connectivityRetryInterval = std::chrono::milliseconds(10);
+    c.connectivityRetryMaxInterval = std::chrono::milliseconds(20);
+    return c;
+  }
+  void writePowerSupply(const std::string& name, const std::string& type, const std::string& key, const std::string& value) {
+    root.write("/sys/class/power_supply/" + name + "/type", type + "\n");
+    root.write("/sys/class/power_supply/" + name + "/" + key, value + "\n");
+  }
+
+  std::shared_ptr<EventLog> events = std::make_shared<EventLog>();
+  std::shared_ptr<RecordingDelegate> delegate;
+};
+
+TEST_F(URLSessionTest, CallbacksArriveInWireOrderAndInvalidationComesLast) {
+  server.on("/echo", Reply{.status = 201, .headers = {{"X-Reply", "yes"}}, .body = "hello"});
+  auto session = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+  auto task = session->dataTaskWithRequest(post(server.url("/echo"), "abc"));
+  ASSERT_TRUE(task);
+  EXPECT_EQ(task->state(), URLSessionTask::State::Suspended);
+  task->resume();
+  session->finishTasksAndInvalidate();
+  EXPECT_EQ(session->dataTaskWithRequest(get(server.url("/echo"))), nullptr);
+  ASSERT_TRUE(events->waitFor("invalid"));
+  EXPECT_EQ(events->events(), (std::vector<std::string>{"sent 3/3", "response 201", "complete", "invalid"}));
+  EXPECT_EQ(text(delegate->received()), "hello");
+  EXPECT_EQ(task->state(), URLSessionTask::State::Completed);
+  ASSERT_TRUE(task->response());
+  EXPECT_EQ(task->response()->valueForHTTPHeaderField("x-reply"), "yes");
+  EXPECT_FALSE(session->hasDelegate());  // released once invalid
+}
+
+TEST_F(URLSessionTest, RequestHeadersOnTheWireAreExactlyTheCallersPlusTheSessionsOwn) {
+  server.on("/h", Reply{});
+  auto configuration = URLSessionConfiguration::defaultSessionConfiguration();
+  configuration.sourceApplicationBundleIdentifier = "com.velmar.system.diagnostics";
+  auto session = makeSession(configuration);
+
+  URLRequest plain = post(server.url("/h"), std::string("\0\x01zz", 4));
+  plain.ignoreLocalCache = true;
+  plain.setValue("1\r\nInjected: yes", "X-Name");
+  URLRequest own = post(server.url("/h"), "{}");
+  own.ignoreLocalCache = true;
+  own.setValue("application/json", "Content-Type");
+  own.setValue("max-age=0", "Cache-Control");
+  own.setValue("other.app", "X-ZTH-Source-Application");
+  for (const auto& request : {plain, own}) {
+    session->dataTaskWithRequest(request)->resume();
+  }
+  ASSERT_TRUE(server.waitForRequests(2));
+  ASSERT_TRUE(events->waitForCount("complete", 2));
+
+  auto requests = server.requests();
+  std::sort(requests.begin(), requests.end(), [](const auto& a, const auto& b) { return a.body.size() > b.body.size(); });
+  const auto& p = requests[0];
+  EXPECT_EQ(p.body, std::string("\0\x01zz", 4));
+  EXPECT_EQ(p.header("Content-Length"), "4");
+  EXPECT_EQ(p.header("Cache-Control"), "no-cache");
+  EXPECT_EQ(p.header("Pragma"), "no-cache");
+  EXPECT_EQ(p.header("X-ZTH-Source-Application"), "com.velmar.system.diagnostics");
+  EXPECT_EQ(p.header("X-Name"), "1  Injected: yes");
+  EXPECT_EQ(p.headerCount("Injected"), 0u);
+  EXPECT_EQ(p.headerCount("Content-Type"), 0u) << "no form type the caller did not ask for";
+  EXPECT_EQ(p.headerCount("Expect"), 0u);
+
+  const auto& o = requests[1];
+  EXPECT_EQ(o.header("Content-Type"), "application/json");
+  EXPECT_EQ(o.headerCount("Cache-Control"), 1u);
+  EXPECT_EQ(o.header("Cache-Control"), "max-age=0");
+  EXPECT_EQ(o.header("X-ZTH-Source-Application"), "other.app");
+  EXPECT_EQ(o.headerCount("X-ZTH-Source-Application"), 1u);
+}
+
+TEST_F(URLSessionTest, OnlyWebRequestsAreMadeAndBadOnesCompleteWithAnError) {
+  root.write("/secret.txt", "do not read");
+  URLRequest badMethod = get(server.url("/"));
+  badMethod.httpMethod = "GET / HTTP/1.1\r\nX:";
+  const std::vector<std::pair<URLRequest, std::int64_t>> cases = {
+      {get("file://" + (root / "/secret.txt").string()), 1},  // CURLE_UNSUPPORTED_PROTOCOL
+      {get(""), 3},                                            // CURLE_URL_MALFORMAT
+      {badMethod, 43},                                         // CURLE_BAD_FUNCTION_ARGUMENT
+  };
+  for (const auto& [request, code] : cases) {
+    events = std::make_shared<EventLog>();
+    auto s = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+    s->dataTaskWithRequest(request)->resume();
+    s->finishTasksAndInvalidate();
+    ASSERT_TRUE(events->waitFor("invalid"));
+    EXPECT_EQ(events->events(), (std::vector<std::string>{"complete " + std::to_string(code), "invalid"})) << request.url;
+    EXPECT_TRUE(delegate->received().empty());
+  }
+  EXPECT_EQ(server.requestCount(), 0u);
+}
+
+TEST_F(URLSessionTest, RedirectIsFollowedAndTheUploadBodySentAgain) {
+  server.on("/old", Reply{.status = 307, .headers = {{"Location", "/new"}}});
+  server.on("/new", Reply{.body = "moved"});
+  const std::string body = patternBody(70000);
+  const fs::path file = root / "/body";
+  root.write("/body", body);
+  file::UniqueFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
+  fs::remove(file);
+
+  auto session = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+  auto task = session->uploadTaskWithRequest(post(server.url("/old"), "ignored"), std::move(fd));
+  ASSERT_TRUE(task);
+  task->resume();
+  ASSERT_TRUE(events->waitFor("complete"));
+  ASSERT_EQ(server.requestCount(), 2u);
+  EXPECT_EQ(server.requests()[0].body, body);
+  EXPECT_EQ(server.requests()[1].path, "/new");
+  EXPECT_TRUE(server.requests()[1].body == body) << "the body was not rewound for the redirect";
+  ASSERT_TRUE(task->response());
+  EXPECT_EQ(task->response()->statusCode, 200);
+  EXPECT_EQ(task->response()->url, server.url("/new"));
+  EXPECT_EQ(text(delegate->received()), "moved");
+
+  // Only regular files carry uploads.
+  EXPECT_EQ(session->uploadTaskWithRequest(post(server.url("/"), ""), file::UniqueFd()), nullptr);
+  EXPECT_EQ(session->uploadTaskWithRequest(post(server.url("/"), ""), file::UniqueFd(::open("/", O_RDONLY | O_CLOEXEC))), nullptr);
+}
+
+TEST_F(URLSessionTest, RequestTimeoutEndsASlowAnswerAndCancelEndsATaskOnce) {
+  server.on("/slow", Reply{.body = "late", .delay = std::chrono::seconds(5)});
+  auto session = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+  URLRequest request = get(server.url("/slow"));
+  request.timeoutSeconds = 0.2;
+  session->dataTaskWithRequest(request)->resume();
+  ASSERT_TRUE(events->waitFor("complete 28"));  // CURLE_OPERATION_TIMEDOUT
+  EXPECT_EQ(events->events(), std::vector<std::string>{"complete 28"});
+
+  server.holdAnswers();
+  auto held = session->dataTaskWithRequest(get(server.url("/held")));
+  held->resume();
+  ASSERT_TRUE(server.waitForRequestTo("/held"));
+  held->cancel();
+  held->cancel();
+  ASSERT_TRUE(events->waitFor("complete " + std::to_string(kURLErrorCancelled)));
+  server.releaseAnswers();
+  // A suspended task that is cancelled completes the same way.
+  auto never = session->dataTaskWithRequest(get(server.url("/never")));
+  never->cancel();
+  session->finishTasksAndInvalidate();
+  ASSERT_TRUE(events->waitFor("invalid"));
+  EXPECT_EQ(events->events(), (std::vector<std::string>{"complete 28", "complete -999", "complete -999", "invalid"}));
+  for (const auto& r : server.requests()) {
+    EXPECT_NE(r.path, "/never");
+  }
+}
+
+TEST_F(URLSessionTest, CancellingAtTheResponseStopsTheBody) {
+  server.on("/big", Reply{.body = patternBody(4 << 20), .chunkSize = 65536, .chunkPause = std::chrono::milliseconds(5)});
+  auto session = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+  delegate->disposition = ResponseDisposition::Cancel;
+  session->dataTaskWithRequest(get(server.url("/big")))->resume();
+  ASSERT_TRUE(events->waitFor("complete -999"));
+  EXPECT_EQ(events->events(), (std::vector<std::string>{"response 200", "complete -999"}));
+  EXPECT_LT(delegate->received().size(), std::size_t{4 << 20});
+}
+
+TEST_F(URLSessionTest, WithoutARouteTheRequestWaitsUntilItsOwnTimeout) {
+  // TCP to a multicast address fails in the kernel with ENETUNREACH: a
+  // missing route, without a packet leaving the machine.
+  auto session = makeSession(waitingConfiguration());
+  URLRequest request = get("https://224.0.0.1:9/");
+  request.timeoutSeconds = 0.3;
+  auto task = session->dataTaskWithRequest(request);
+  task->setTaskDescription("waiting");
+  task->resume();
+  ASSERT_TRUE(events->waitFor("complete 28"));
+  EXPECT_EQ(delegate->lastError()->description, "Timeout was reached while waiting for connectivity");
+  EXPECT_GE(logs.count("URLSession: task <waiting> has no route to its server"), 2u);
+
+  // Without waiting, the same request fails at once.
+  auto plain = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+  plain->dataTaskWithRequest(get("https://224.0.0.1:9/"))->resume();
+  ASSERT_TRUE(events->waitFor("complete 7"));
+}
+
+TEST_F(URLSessionTest, RefusedConnectionFailsAtOnceEvenWhenWaitingForConnectivity) {
+  RefusingPort refusing;
+  auto session = makeSession(waitingConfiguration());
+  session->dataTaskWithRequest(get(refusing.url("/")))->resume();
+  ASSERT_TRUE(events->waitFor("complete 7"));
+  EXPECT_EQ(logs.count("has no route to its server"), 0u);
+}
+
+TEST_F(URLSessionTest, TransfersRequiringExternalPowerWaitWhileOnBattery) {
+  server.on("/p", Reply{.body = "powered"});
+  writePowerSupply("BAT0", "Battery", "status", "Discharging");
+  writePowerSupply("AC", "Mains", "online", "0");
+  auto configuration = URLSessionConfiguration::backgroundSessionConfigurationWithIdentifier("power");
+  configuration.discretionary = true;
+  configuration.requiresPowerPluggedIn = true;
+  configuration.powerCheckInterval = std::chrono::milliseconds(10);
+  configuration.discretionaryMaxDelay = std::chrono::milliseconds(0);  // not enough without external power
+  auto session = makeSession(configuration);
+  auto task = session->dataTaskWithRequest(get(server.url("/p")));
+  task->setTaskDescription("power");
+  task->resume();
+  const std::string waiting = "URLSession: task <power> waits while the device runs on battery";
+  ASSERT_TRUE(waitForLogCount(logs, waiting, 3));  // each look at the battery logs again
+  EXPECT_EQ(server.requestCount(), 0u);
+
+  writePowerSupply("AC", "Mains", "online", "1");
+  ASSERT_TRUE(events->waitFor("complete"));
+  EXPECT_EQ(text(delegate->received()), "powered");
+  EXPECT_EQ(server.requestCount(), 1u);
+}
+
+TEST_F(URLSessionTest, DiscretionaryTransfersOnBatteryGoAfterTheirMaximumDelayOrTimeOut) {
+  server.on("/d", Reply{.body = "eventually"});
+  writePowerSupply("BAT0", "Battery", "status", "Discharging");
+  auto configuration = URLSessionConfiguration::backgroundSessionConfigurationWithIdentifier("discretionary");
+  configuration.discretionary = true;
+  configuration.powerCheckInterval = std::chrono::hours(1);
+  configuration.discretionaryMaxDelay = std::chrono::milliseconds(50);
+  auto session = makeSession(configuration);
+  session->dataTaskWithRequest(get(server.url("/d")))->resume();
+  ASSERT_TRUE(events->waitFor("complete"));
+  EXPECT_EQ(text(delegate->received()), "eventually");
+  EXPECT_EQ(logs.count("waits while the device runs on battery"), 1u);
+
+  configuration.requiresPowerPluggedIn = true;
+  auto strict = makeSession(configuration);
+  URLRequest request = get(server.url("/d"));
+  request.timeoutSeconds = 0.1;
+  strict->dataTaskWithRequest(request)->resume();
+  ASSERT_TRUE(events->waitFor("complete 28"));
+  EXPECT_EQ(delegate->lastError()->description, "Timeout was reached while waiting for external power");
+  EXPECT_EQ(server.requestCount(), 1u);
+}
+
+// The socket of this process connected from `localPort` to `remotePort`.
+int clientSocket(int localPort, int remotePort) {
+  for (const auto& entry : fs::directory_iterator("/proc/self/fd")) {
+    const int fd = std::stoi(entry.path().filename().string());
+    sockaddr_in local{}, peer{};
+    socklen_t n = sizeof(local), m = sizeof(peer);
+    if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &n) == 0 && local.sin_family == AF_INET &&
+        ::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &m) == 0 && ntohs(local.sin_port) == localPort &&
+        ntohs(peer.sin_port) == remotePort) {
+      return fd;
+    }
+  }
+  return -1;
+}
+
+TEST_F(URLSessionTest, BackgroundServiceTypeLowersTheSocketPriority) {
+  server.holdAnswers();
+  auto configuration = URLSessionConfiguration::backgroundSessionConfigurationWithIdentifier("bg");
+  configuration.networkServiceType = NetworkServiceType::Background;
+  auto background = makeSession(configuration);
+  auto ordinary = URLSession::sessionWithConfiguration(URLSessionConfiguration::defaultSessionConfiguration(), delegate,
+                                                       mainOperationQueue());
+  background->dataTaskWithRequest(get(server.url("/bg")))->resume();
+  ASSERT_TRUE(server.waitForRequests(1));
+  ordinary->dataTaskWithRequest(get(server.url("/default")))->resume();
+  ASSERT_TRUE(server.waitForRequests(2));
+
+  int priorities[2] = {-1, -1};
+  for (const auto& r : server.requests()) {
+    const int fd = clientSocket(r.remotePort, server.port());
+    ASSERT_GE(fd, 0) << r.path;
+    socklen_t len = sizeof(int);
+    ::getsockopt(fd, SOL_SOCKET, SO_PRIORITY, &priorities[r.path == "/bg" ? 0 : 1], &len);
+  }
+  EXPECT_EQ(priorities[0], 2);
+  EXPECT_EQ(priorities[1], 0);
+  server.releaseAnswers();
+  ASSERT_TRUE(events->waitForCount("complete", 2));
+}
+
+}  // namespace
+}  // namespace zerith::test
