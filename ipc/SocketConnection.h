@@ -13,13 +13,15 @@
 // peer reads. An outbox over kMaxOutboxBytes means the peer has stopped
 // reading; the connection is then closed.
 
-#include <asio/local/stream_protocol.hpp>
-
+// A standard header first: asio decides between aligned_alloc and operator
+// new by a libstdc++ macro, and every translation unit must decide alike.
 #include <atomic>
 #include <deque>
 #include <filesystem>
 #include <mutex>
 #include <unordered_map>
+
+#include <asio/local/stream_protocol.hpp>
 
 #include "ipc/Connection.h"
 #include "ipc/Frame.h"

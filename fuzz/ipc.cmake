@@ -1,0 +1,5 @@
+# The socket's parsers: the frame and message decoder on raw bytes, and a
+# real connection with the daemon's exporter fed through a socket pair.
+# (With ZERITH_FUZZ off, ipc/CMakeLists.txt replays both corpora as tests.)
+zerith_fuzz(NAME frame_decoder_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/FrameDecoderFuzz.cpp DEPS zerith_ipc)
+zerith_fuzz(NAME connection_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/ConnectionFuzz.cpp DEPS zerith_ipc)

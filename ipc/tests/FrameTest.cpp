@@ -1,0 +1,122 @@
+#include "ipc/Frame.h"
+
+#include <gtest/gtest.h>
+
+#include <random>
+
+namespace zerith::ipc {
+namespace {
+
+std::vector<Data> drain(FrameDecoder& decoder) {
+  std::vector<Data> bodies;
+  for (;;) {
+    plist::Bytes body;
+    std::string why;
+    const auto status = decoder.next(body, why);
+    if (status != FrameDecoder::Status::Frame) {
+      EXPECT_NE(status, FrameDecoder::Status::Invalid) << why;
+      return bodies;
+    }
+    bodies.emplace_back(body.begin(), body.end());
+  }
+}
+
+TEST(FrameCodec, AFrameIsABigEndianLengthAndABinaryPropertyList) {
+  const Data frame = encodeCall("fetchDisplayURL:", 3, Dictionary{});
+  ASSERT_GT(frame.size(), 12u);
+  const std::size_t length = (std::size_t{frame[0]} << 24) | (std::size_t{frame[1]} << 16) | (std::size_t{frame[2]} << 8) | frame[3];
+  EXPECT_EQ(length, frame.size() - 4);
+  EXPECT_EQ(std::string(frame.begin() + 4, frame.begin() + 12), "bplist00");
+  const auto decoded = plist::decodeBinary(plist::Bytes(frame.data() + 4, length));
+  ASSERT_TRUE(decoded);
+  EXPECT_EQ(*decoded, Value(Dictionary{{"op", "fetchDisplayURL:"}, {"call", 3}, {"args", Dictionary{}}}));
+}
+
+TEST(FrameCodec, CallsAndRepliesSurviveTheRoundTrip) {
+  FrameDecoder decoder;
+  const Dictionary args{{"payload", Dictionary{{"d", Data{0, 255}}, {"r", -2.5}, {"big", 1LL << 62}}}};
+  for (const Data& f : {encodeCall("op:", std::nullopt, args), encodeCall("op:", 1ull << 40, args), encodeReply(9, args),
+                        encodeErrorReply(10, Error{"dom", -3, "why"})}) {
+    decoder.append(f.data(), f.size());
+  }
+  const auto bodies = drain(decoder);
+  ASSERT_EQ(bodies.size(), 4u);
+  auto m0 = decodeMessage(plist::bytesOf(bodies[0]));
+  auto m1 = decodeMessage(plist::bytesOf(bodies[1]));
+  auto m2 = decodeMessage(plist::bytesOf(bodies[2]));
+  auto m3 = decodeMessage(plist::bytesOf(bodies[3]));
+  ASSERT_TRUE(m0 && m1 && m2 && m3);
+  EXPECT_FALSE(m0->call.call);
+  EXPECT_EQ(m0->call.args, args);
+  EXPECT_EQ(m1->call.call, 1ull << 40);
+  EXPECT_EQ(m2->kind, IncomingMessage::Kind::Reply);
+  EXPECT_EQ(m2->replyTo, 9u);
+  EXPECT_EQ(m2->replyArgs, args);
+  EXPECT_FALSE(m2->replyError);
+  EXPECT_EQ(m3->replyError, (Error{"dom", -3, "why"}));
+}
+
+TEST(FrameDecoderTest, FramesCutAtEveryPossiblePlaceComeOutWholeAndInOrder) {
+  // Many frames of varied sizes, appended in random cuts (including cuts
+  // inside the length header), so the buffer compacts while frames are
+  // half-read.
+  std::mt19937 random(7);
+  Data stream;
+  std::vector<Data> expected;
+  for (int i = 0; i < 300; ++i) {
+    const Data f = encodeCall("n", static_cast<std::uint64_t>(i), Dictionary{{"pad", Value(Data(random() % 3000, 1))}});
+    expected.emplace_back(f.begin() + 4, f.end());
+    stream.insert(stream.end(), f.begin(), f.end());
+  }
+  FrameDecoder decoder;
+  std::vector<Data> got;
+  for (std::size_t off = 0; off < stream.size();) {
+    const std::size_t n = std::min<std::size_t>(1 + random() % 5000, stream.size() - off);
+    decoder.append(stream.data() + off, n);
+    off += n;
+    for (auto& b : drain(decoder)) {
+      got.push_back(std::move(b));
+    }
+  }
+  EXPECT_EQ(got, expected);
+  EXPECT_EQ(decoder.buffered(), 0u);
+}
+
+TEST(FrameDecoderTest, LengthOverTheLimitIsRefusedFromTheHeaderAloneAndStaysRefused) {
+  FrameDecoder decoder(100);
+  const Data header{0, 0, 0, 101};
+  decoder.append(header.data(), header.size());
+  plist::Bytes body;
+  std::string why;
+  EXPECT_EQ(decoder.next(body, why), FrameDecoder::Status::Invalid);
+  EXPECT_EQ(why, "frame of 101 bytes exceeds the limit of 100");
+  const Data ok = encodeCall("x", std::nullopt, {});
+  decoder.append(ok.data(), ok.size());
+  EXPECT_EQ(decoder.next(body, why), FrameDecoder::Status::Invalid);
+}
+
+TEST(FrameDecoderTest, ExactlyTheLimitPasses) {
+  FrameDecoder decoder(10);
+  const Data frame{0, 0, 0, 10, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10};
+  decoder.append(frame.data(), frame.size());
+  plist::Bytes body;
+  std::string why;
+  ASSERT_EQ(decoder.next(body, why), FrameDecoder::Status::Frame);
+  EXPECT_EQ(body.size(), 10u);
+}
+
+TEST(MessageShape, RepliesAndCallsThatBreakTheShapeAreRefusedWithTheReason) {
+  auto why = [](const Value& v) {
+    std::string w;
+    EXPECT_FALSE(decodeMessage(plist::bytesOf(plist::encodeBinary(v)), &w)) << v.description();
+    return w;
+  };
+  EXPECT_EQ(why(Value(Dictionary{{"op", "x"}, {"reply", 1}})), "message has both \"op\" and \"reply\"");
+  EXPECT_EQ(why(Value(Dictionary{{"reply", "1"}})), "message \"reply\" is not an unsigned integer");
+  EXPECT_EQ(why(Value(Dictionary{{"reply", 1}, {"error", "bad"}})), "reply \"error\" is a string, not a dictionary");
+  EXPECT_EQ(why(Value(Dictionary{{"op", "x"}, {"call", 1.5}})), "message \"call\" is not an unsigned integer");
+  EXPECT_EQ(why(Value("just a string")), "message is a string, not a dictionary");
+}
+
+}  // namespace
+}  // namespace zerith::ipc
