@@ -2,6 +2,7 @@
 
 #include <plist/plist.h>
 
+#include <algorithm>
 #include <cstring>
 #include <memory>
 #include <string_view>
@@ -166,6 +167,18 @@ class BinaryChecker {
           return e;
         }
         if (auto e = fits(pos, length, type == 0x6 ? 2 : 1)) return e;
+        // libplist asserts that a string has no NUL inside (and aborts the
+        // process when it has): such strings are refused here.
+        if (type == 0x5 && std::find(b_.begin() + pos, b_.begin() + pos + length, 0) != b_.begin() + pos + length) {
+          return std::string("string holds a NUL character");
+        }
+        if (type == 0x6) {
+          for (std::uint64_t i = 0; i < length; ++i) {
+            if (b_[pos + 2 * i] == 0 && b_[pos + 2 * i + 1] == 0) {
+              return std::string("string holds a NUL character");
+            }
+          }
+        }
         break;
       }
       case 0xA:
