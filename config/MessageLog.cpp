@@ -1,5 +1,6 @@
 #include "config/MessageLog.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -10,6 +11,7 @@
 #include <cmath>
 #include <cstring>
 #include <ctime>
+#include <memory>
 #include <system_error>
 #include <vector>
 
@@ -42,18 +44,24 @@ struct Current {
 // Steps 1 and 2: lists the folder (creating it when missing), removes
 // expired and superseded log files and answers the newest one left.
 std::optional<Current> rotate(const fs::path& folder, double now, const MessageLog::Options& options) {
+  // readdir rather than directory_iterator: the iterator builds and parses
+  // a full path per entry, which made listing a folder of 100 files cost
+  // more than all the system calls of an append together.
   std::vector<std::string> names;
-  std::error_code ec;
-  fs::directory_iterator it(folder, ec);
-  if (ec == std::errc::no_such_file_or_directory) {
+  std::unique_ptr<DIR, int (*)(DIR*)> dir(::opendir(folder.c_str()), ::closedir);
+  if (!dir && errno == ENOENT) {
     logger().info("writeToLogFile: Creating zerithd log directory at {}", folder.string());
     std::error_code createError;
     fs::create_directories(folder, createError);
-  } else if (ec) {
-    logger().error("writeToLogFile: Error reading from log directory: {}", ec.message());
+  } else if (!dir) {
+    logger().error("writeToLogFile: Error reading from log directory: {}",
+                   std::error_code(errno, std::generic_category()).message());
   } else {
-    for (; it != fs::directory_iterator(); it.increment(ec)) {
-      names.push_back(it->path().filename().string());
+    while (const dirent* entry = ::readdir(dir.get())) {
+      const std::string_view name = entry->d_name;
+      if (name != "." && name != "..") {
+        names.emplace_back(name);
+      }
     }
   }
   // Listing order is the file system's; sort for a deterministic tie-break.
