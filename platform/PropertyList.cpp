@@ -3,6 +3,7 @@
 #include <plist/plist.h>
 
 #include <algorithm>
+#include <cmath>
 #include <cstring>
 #include <memory>
 #include <string_view>
@@ -336,7 +337,10 @@ plist_t toNode(const Value& v) {
     case Value::Type::Data:
       return plist_new_data(reinterpret_cast<const char*>(v.data()->data()), v.data()->size());
     case Value::Type::Date: {
-      const double rel = v.date()->secondsSince1970 - kEpochOffset;
+      // libplist 2.2 keeps dates as 32-bit seconds: dates beyond that range
+      // (a client can send any) are clamped instead of overflowing the cast.
+      double rel = v.date()->secondsSince1970 - kEpochOffset;
+      rel = std::isnan(rel) ? 0.0 : std::clamp(rel, -2147483648.0, 2147483647.0);
       auto sec = static_cast<std::int32_t>(rel);
       auto usec = static_cast<std::int32_t>((rel - sec) * 1e6);
       return plist_new_date(sec, usec);
