@@ -43,6 +43,67 @@ const char* typeName(const Value& v) {
   return "a value";
 }
 
+// Strict UTF-8: no overlong forms, no surrogates, nothing above U+10FFFF.
+bool validUtf8(std::string_view s) {
+  const auto* p = reinterpret_cast<const unsigned char*>(s.data());
+  const auto* end = p + s.size();
+  while (p < end) {
+    const unsigned c = *p;
+    std::size_t extra = 0;
+    std::uint32_t min = 0;
+    std::uint32_t code = 0;
+    if (c < 0x80) {
+      ++p;
+      continue;
+    } else if ((c & 0xe0) == 0xc0) {
+      extra = 1, min = 0x80, code = c & 0x1f;
+    } else if ((c & 0xf0) == 0xe0) {
+      extra = 2, min = 0x800, code = c & 0x0f;
+    } else if ((c & 0xf8) == 0xf0) {
+      extra = 3, min = 0x10000, code = c & 0x07;
+    } else {
+      return false;
+    }
+    if (static_cast<std::size_t>(end - p) <= extra) {
+      return false;
+    }
+    for (std::size_t i = 1; i <= extra; ++i) {
+      if ((p[i] & 0xc0) != 0x80) {
+        return false;
+      }
+      code = (code << 6) | (p[i] & 0x3f);
+    }
+    if (code < min || code > 0x10ffff || (code >= 0xd800 && code <= 0xdfff)) {
+      return false;
+    }
+    p += extra + 1;
+  }
+  return true;
+}
+
+// Every string and key of a decoded message. libplist re-encodes a string
+// that is not UTF-8 cut short at the first bad byte, so such a string would
+// silently change on its way on; it is refused at the door instead.
+bool allTextValid(const Value& v) {
+  if (const auto* s = v.string()) {
+    return validUtf8(*s);
+  }
+  if (const auto* d = v.dict()) {
+    for (const auto& [key, value] : *d) {
+      if (!validUtf8(key) || !allTextValid(value)) {
+        return false;
+      }
+    }
+  } else if (const auto* a = v.array()) {
+    for (const auto& element : *a) {
+      if (!allTextValid(element)) {
+        return false;
+      }
+    }
+  }
+  return true;
+}
+
 }  // namespace
 
 plist::Limits frameLimits() {
@@ -135,6 +196,10 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
   }
   if (!root->isDict()) {
     setWhy(why, fmt::format("message is {}, not a dictionary", typeName(*root)));
+    return std::nullopt;
+  }
+  if (!allTextValid(*root)) {
+    setWhy(why, "message holds text that is not valid UTF-8");
     return std::nullopt;
   }
   const Value args = (*root)["args"];

@@ -56,6 +56,15 @@ TEST(FrameCodec, CallsAndRepliesSurviveTheRoundTrip) {
   EXPECT_EQ(m3->replyError, (Error{"dom", -3, "why"}));
 }
 
+TEST(FrameCodec, DatesBeyondThirtyTwoBitSecondsAreClampedNotOverflowed) {
+  // A client can send any date; answering with it must not overflow.
+  const Data frame = encodeReply(1, Dictionary{{"late", Value(Date{1e15})}, {"early", Value(Date{-1e15})}});
+  const auto message = decodeMessage(plist::Bytes(frame.data() + 4, frame.size() - 4));
+  ASSERT_TRUE(message);
+  EXPECT_EQ(message->replyArgs.get("late").date()->secondsSince1970, 2147483647.0 + 978307200.0);
+  EXPECT_EQ(message->replyArgs.get("early").date()->secondsSince1970, -2147483648.0 + 978307200.0);
+}
+
 TEST(FrameDecoderTest, FramesCutAtEveryPossiblePlaceComeOutWholeAndInOrder) {
   // Many frames of varied sizes, appended in random cuts (including cuts
   // inside the length header), so the buffer compacts while frames are

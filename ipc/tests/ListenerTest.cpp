@@ -1,7 +1,9 @@
 #include "ipc/Listener.h"
 
 #include <gtest/gtest.h>
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 
 #include <fstream>
 
@@ -185,6 +187,64 @@ TEST_F(ListenerFixture, ManyClientsAtOnceAreAllServed) {
   for (auto& c : clients) {
     c->invalidate();
   }
+}
+
+// Socket activation: the parent binds a listening socket and starts this
+// test binary again as the "service" with the socket as fd 3 and
+// LISTEN_FDS/LISTEN_PID set (through sh, whose `exec` keeps the pid that
+// LISTEN_PID names). The child serves one call on the passed socket.
+TEST(ListenerActivation, ServesTheSocketTheServiceManagerPassesIn) {
+  if (std::getenv("ZERITH_ACTIVATION_CHILD")) {
+    log::LogCapture capture;
+    zerith::test::TempRoot root;
+    TestDelegate delegate;
+    auto listener = Listener::create(paths::socketPath(), nullptr);
+    ASSERT_TRUE(listener);
+    EXPECT_TRUE(capture.has(log::Level::Default, "Listener: using the socket passed by the service manager (fd 3)"));
+    EXPECT_FALSE(std::filesystem::exists(paths::socketPath())) << "made a socket of its own";
+    listener->setDelegate(&delegate);
+    listener->resume();
+    EXPECT_TRUE(delegate.object->received.waitFor(1));
+    return;
+  }
+  zerith::test::TempRoot root;
+  const auto path = root / "/activated.sock";
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strcpy(address.sun_path, path.c_str());
+  file::UniqueFd listening(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  ASSERT_EQ(::bind(listening.get(), reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
+  ASSERT_EQ(::listen(listening.get(), 4), 0);
+
+  const std::string self = std::filesystem::read_symlink("/proc/self/exe").string();
+  const std::string filter = "--gtest_filter=ListenerActivation.ServesTheSocketTheServiceManagerPassesIn";
+  const char* argv[] = {"sh", "-c", "LISTEN_PID=$$ exec \"$0\" \"$1\"", self.c_str(), filter.c_str(), nullptr};
+  const char* envp[] = {"LISTEN_FDS=1", "ZERITH_ACTIVATION_CHILD=1", "PATH=/usr/bin:/bin", nullptr};
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    // The socket must reach the service as fd 3, open across exec (dup2
+    // onto itself would keep close-on-exec).
+    if (listening.get() == 3) {
+      ::fcntl(3, F_SETFD, 0);
+    } else {
+      ::dup2(listening.get(), 3);
+    }
+    ::execve("/bin/sh", const_cast<char* const*>(argv), const_cast<char* const*>(envp));
+    ::_exit(127);
+  }
+  // Connecting works as soon as the socket listens; the call is answered
+  // once the child has taken the socket over.
+  auto client = SocketConnection::connect(path);
+  ASSERT_TRUE(client);
+  client->resume();
+  const auto result = callAndWait(*client, "via-activation", Dictionary{{"n", 1}}, 30s);
+  ASSERT_TRUE(result.args) << "the activated listener did not answer";
+  EXPECT_EQ(*result.args, (Dictionary{{"n", 1}}));
+  client->invalidate();
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "child status " << status;
 }
 
 TEST(ListenerCreate, AnOverlongPathFailsWithALog) {

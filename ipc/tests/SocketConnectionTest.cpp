@@ -46,6 +46,27 @@ TEST(SocketConnectionFraming, SeveralFramesInOneWriteArriveInOrder) {
   EXPECT_EQ(calls[2].operation, "c");
 }
 
+// A binary property list {key: value} with both as 8-bit "ASCII" strings,
+// written by hand because libplist's writer would repair the bytes.
+Data oneEntryBinaryDictionary(const std::string& key, const std::string& value) {
+  Data d{'b', 'p', 'l', 'i', 's', 't', '0', '0'};
+  const std::uint8_t dictAt = static_cast<std::uint8_t>(d.size());
+  d.insert(d.end(), {0xd1, 0x01, 0x02});
+  const std::uint8_t keyAt = static_cast<std::uint8_t>(d.size());
+  d.push_back(static_cast<std::uint8_t>(0x50 | key.size()));
+  d.insert(d.end(), key.begin(), key.end());
+  const std::uint8_t valueAt = static_cast<std::uint8_t>(d.size());
+  d.push_back(static_cast<std::uint8_t>(0x50 | value.size()));
+  d.insert(d.end(), value.begin(), value.end());
+  const std::uint8_t tableAt = static_cast<std::uint8_t>(d.size());
+  d.insert(d.end(), {dictAt, keyAt, valueAt});
+  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 1, 1});  // offset and reference sizes
+  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 0, 3});  // objects
+  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 0, 0});  // top object
+  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 0, tableAt});
+  return d;
+}
+
 struct BadInput {
   const char* name;
   Data bytes;
@@ -70,6 +91,11 @@ std::vector<BadInput> badInputs() {
       {"args not a dictionary", rawFrame(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"args", Array{}}}))),
        "message \"args\" is an array, not a dictionary"},
       {"truncated binary list", rawFrame(Data{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x08}), ""},
+      // libplist would pass such text on cut short at the bad byte.
+      {"operation not UTF-8", rawFrame(oneEntryBinaryDictionary("op", "se\xffSession:")),
+       "message holds text that is not valid UTF-8"},
+      {"key not UTF-8 (overlong form)", rawFrame(oneEntryBinaryDictionary("o\xc0\xafp", "x")),
+       "message holds text that is not valid UTF-8"},
   };
 }
 
@@ -97,7 +123,7 @@ TEST_P(SocketConnectionBadFrame, ClosesThatConnectionWithAnErrorLogAndDeliversNo
   EXPECT_EQ(bystander.invalidated.count(), 0);
 }
 
-INSTANTIATE_TEST_SUITE_P(Inputs, SocketConnectionBadFrame, ::testing::Range(0, 10));
+INSTANTIATE_TEST_SUITE_P(Inputs, SocketConnectionBadFrame, ::testing::Range(0, 12));
 
 TEST(SocketConnectionFraming, CallsBeforeABadFrameAreDeliveredThoseAfterItAreNot) {
   log::LogCapture capture;
