@@ -3,7 +3,6 @@
 #include <sys/stat.h>
 
 #include <fstream>
-#include <thread>
 
 #include "config/tests/StorebagTestFixture.h"
 #include "platform/Defaults.h"
@@ -151,22 +150,6 @@ TEST_F(StorebagDiskCacheTest, UnwritableCacheIsALoggedSaveFailureThatKeepsTheOld
   EXPECT_TRUE(logs_.has(Level::Error, "saveStorebagToDisk: could not save storebag 'bostin' to file '" + path +
                                           "'. Error is 'Is a directory'"));
   EXPECT_EQ(loadStorebagFromDisk("ambrel"), bytes("old"));
-}
-
-TEST_F(StorebagDiskCacheTest, LockIsRecursiveAndSharedAcrossThreads) {
-  std::unique_lock outer(ZerithdUtil::lock());
-  // Cache functions take the lock themselves: called while holding it they
-  // must not deadlock.
-  EXPECT_TRUE(saveStorebagToDisk("ambrel", bytes("a")));
-  bool otherGotIt = true;
-  std::thread([&] { otherGotIt = ZerithdUtil::lock().try_lock(); }).join();
-  EXPECT_FALSE(otherGotIt);
-  outer.unlock();
-  std::thread([&] {
-    otherGotIt = ZerithdUtil::lock().try_lock();
-    if (otherGotIt) ZerithdUtil::lock().unlock();
-  }).join();
-  EXPECT_TRUE(otherGotIt);
 }
 
 }  // namespace

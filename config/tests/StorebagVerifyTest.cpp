@@ -255,16 +255,5 @@ TEST_F(StorebagVerifyTest, SavingKeepsTheWholeContainerAndARefusedOneChangesNoth
   EXPECT_EQ(cached("ambrel"), container);
 }
 
-TEST_F(StorebagVerifyTest, VerificationNeedsNoFilesOfItsOwn) {
-  const Data container = signedContainer(sampleStorebag());
-  const auto ok = verifyStorebagContainer(plist::bytesOf(container), storebagKeys().publicKeyDER);
-  EXPECT_EQ(ok.status, StorebagVerifyStatus::Verified);
-  EXPECT_EQ(decodeStorebagBag(ok.bagBytes), sampleStorebag());
-  EXPECT_EQ(verifyStorebagContainer(plist::bytesOf(container), std::nullopt).status,
-            StorebagVerifyStatus::BadPublicKey);
-  EXPECT_EQ(verifyStorebagContainer(plist::bytesOf(container), test::otherStorebagKeys().publicKeyDER).status,
-            StorebagVerifyStatus::SignatureMismatch);
-}
-
 }  // namespace
 }  // namespace zerith

@@ -176,9 +176,10 @@ TEST_F(StorebagCacheTest, StorebagWithoutVersionClearsTheOlderVersion) {
   EXPECT_TRUE(cache_.storebagVersionForClientType(5).isNil());
 }
 
-TEST_F(StorebagCacheTest, FetchAndCacheLogsItsStepsAndRecordsTheEntry) {
+TEST_F(StorebagCacheTest, FetchLogsItsStepsAndRecordsTheEntry) {
   results_ = {FetchResult{section("a"), 1234, "3.1"}};
-  cache_.fetchAndCacheStorebag(8);
+  cache_.storebagForClientType(8, 4000000000u);
+  EXPECT_TRUE(logs_.has(Level::Debug, "storebagForSession: Retrieving storebag for session 4000000000 with client type 8"));
   EXPECT_TRUE(logs_.has(Level::Debug, "fetchAndCacheStorebag: Fetching storebag for client type 8"));
   EXPECT_TRUE(logs_.has(Level::Debug, "fetchAndCacheStorebag: Storebag max age: 1234 seconds"));
   const Value e = entry("elquin");
@@ -197,12 +198,6 @@ TEST_F(StorebagCacheTest, EstimatedSizeGrowsWithTheCachedStorebags) {
   EXPECT_LT(empty, one);
   EXPECT_LT(one, cache_.estimatedSize());
   EXPECT_EQ(cache_.count(), 2u);
-}
-
-TEST_F(StorebagCacheTest, RetrievalIsLoggedWithSessionAndClientType) {
-  results_ = {FetchResult{section("a"), 60, "1"}};
-  cache_.storebagForClientType(5, 4000000000u);
-  EXPECT_TRUE(logs_.has(Level::Debug, "storebagForSession: Retrieving storebag for session 4000000000 with client type 5"));
 }
 
 }  // namespace

@@ -1,0 +1,137 @@
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "platform/Crypto.h"
+#include "platform/FileUtil.h"
+#include "platform/PropertyList.h"
+#include "tests/support/TempRoot.h"
+
+namespace zerith {
+namespace {
+
+namespace fs = std::filesystem;
+
+struct ToolRun {
+  int status = -1;
+  std::string output;  // stdout and stderr together
+};
+
+class ZerithStorebagToolTest : public ::testing::Test {
+ protected:
+  ToolRun run(const std::string& arguments) const {
+    const std::string command =
+        "cd '" + root_.path().string() + "' && " + std::string(ZERITH_STOREBAG_TOOL) + " " + arguments + " 2>&1";
+    ToolRun r;
+    FILE* pipe = ::popen(command.c_str(), "r");
+    if (!pipe) return r;
+    char buf[4096];
+    std::size_t n;
+    while ((n = std::fread(buf, 1, sizeof buf, pipe)) > 0) r.output.append(buf, n);
+    const int status = ::pclose(pipe);
+    r.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    return r;
+  }
+  fs::path at(const std::string& name) const { return root_.path() / name; }
+  Data read(const std::string& name) const { return *file::readAll(at(name), 64u << 20); }
+  void write(const std::string& name, const std::string& contents) const {
+    std::ofstream(at(name), std::ios::binary) << contents;
+  }
+
+  // Key pair and an XML bag, as an operator starts.
+  void prepare() {
+    ASSERT_EQ(run("keygen --private key.pem --public publicKey.der").status, 0);
+    write("bag.plist", plist::encodeXml(bag_));
+  }
+
+  test::TempRoot root_;
+  const Value bag_ = Value(Dictionary{{"release", Value(Dictionary{{"kovu", Value(Dictionary{{"active", true}})}})},
+                                      {"version", "3.0.1"}});
+};
+
+TEST_F(ZerithStorebagToolTest, SignedContainerVerifiesAndShowsTheBag) {
+  prepare();
+  EXPECT_EQ(fs::status(at("key.pem")).permissions() & fs::perms::group_read, fs::perms::none);
+  const ToolRun signing = run("sign --key key.pem --in bag.plist --out container");
+  ASSERT_EQ(signing.status, 0) << signing.output;
+
+  const Data container = read("container");
+  EXPECT_TRUE(plist::looksBinary(plist::bytesOf(container)));
+  // The signed bytes are the bag file exactly as given.
+  const Value fields = *plist::decode(plist::bytesOf(container));
+  EXPECT_EQ(crypto::base64Decode(*fields["bag"].string()), read("bag.plist"));
+
+  const ToolRun verify = run("verify --public publicKey.der --in container");
+  EXPECT_EQ(verify.status, 0);
+  EXPECT_EQ(verify.output, "verified: " + std::to_string(read("bag.plist").size()) + " bag bytes, version 3.0.1\n");
+
+  const ToolRun show = run("show --public publicKey.der --in container");
+  EXPECT_EQ(show.status, 0);
+  EXPECT_EQ(show.output, plist::encodeXml(bag_));
+}
+
+TEST_F(ZerithStorebagToolTest, XmlContainerHoldsTheTwoBase64Strings) {
+  prepare();
+  ASSERT_EQ(run("sign --key key.pem --in bag.plist --out container.xml --format xml").status, 0);
+  const Data xml = read("container.xml");
+  EXPECT_FALSE(plist::looksBinary(plist::bytesOf(xml)));
+  const Value fields = *plist::decode(plist::bytesOf(xml));
+  ASSERT_EQ(fields.count(), 2u);
+  EXPECT_EQ(crypto::base64Decode(*fields["bag"].string()), read("bag.plist"));
+  EXPECT_EQ(crypto::base64Decode(*fields["signature"].string())->size(), 256u);  // RSA 2048
+  EXPECT_EQ(run("verify --public publicKey.der --in container.xml").status, 0);
+}
+
+TEST_F(ZerithStorebagToolTest, SignatureIsPlainRsaSha1AsOpenSslMakesIt) {
+  if (std::system("openssl version >/dev/null 2>&1") != 0) GTEST_SKIP() << "no openssl command";
+  prepare();
+  ASSERT_EQ(run("sign --key key.pem --in bag.plist --out container").status, 0);
+  const Value fields = *plist::decode(plist::bytesOf(read("container")));
+  const Data signature = *crypto::base64Decode(*fields["signature"].string());
+  std::ofstream(at("sig"), std::ios::binary).write(reinterpret_cast<const char*>(signature.data()),
+                                                    static_cast<std::streamsize>(signature.size()));
+  const std::string command = "cd '" + root_.path().string() +
+                              "' && openssl pkey -pubin -inform DER -in publicKey.der -out pub.pem && "
+                              "openssl dgst -sha1 -verify pub.pem -signature sig bag.plist >/dev/null";
+  EXPECT_EQ(std::system(command.c_str()), 0);
+}
+
+TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
+  prepare();
+  ASSERT_EQ(run("sign --key key.pem --in bag.plist --out container").status, 0);
+  ASSERT_EQ(run("keygen --private other.pem --public other.der").status, 0);
+
+  struct Case {
+    std::string arguments;
+    std::string message;
+  };
+  write("array.plist", plist::encodeXml(Value(Array{Value(1)})));
+  write("junk", "not a property list");
+  const Case cases[] = {
+      {"verify --public other.der --in container",
+       "zerith-storebag: 'container' refused: the signature does not match the bag under this public key\n"},
+      {"verify --public publicKey.der --in bag.plist",
+       "zerith-storebag: 'bag.plist' refused: the container has no \"signature\" string\n"},
+      {"show --public key.pem --in container",
+       "zerith-storebag: 'container' refused: the public key is not an RSA public key in DER form\n"},
+      {"verify --public publicKey.der --in missing", "zerith-storebag: cannot read 'missing': no such file\n"},
+      {"sign --key key.pem --in array.plist --out x", "zerith-storebag: 'array.plist' is not a property list dictionary\n"},
+      {"sign --key publicKey.der --in bag.plist --out x", "zerith-storebag: cannot sign with 'publicKey.der': "},
+      {"sign --key key.pem --in junk --out x", "zerith-storebag: 'junk' is not a property list: "},
+  };
+  for (const auto& c : cases) {
+    const ToolRun r = run(c.arguments);
+    EXPECT_EQ(r.status, 1) << c.arguments;
+    EXPECT_EQ(r.output.substr(0, c.message.size()), c.message) << c.arguments;
+  }
+  EXPECT_FALSE(fs::exists(at("x")));
+  EXPECT_NE(run("sign --key key.pem --in bag.plist").status, 0);  // --out is required
+  EXPECT_NE(run("").status, 0);
+}
+
+}  // namespace
+}  // namespace zerith
