@@ -21,5 +21,8 @@ function(zerith_tests)
   add_executable(${Z_NAME} ${sources})
   target_link_libraries(${Z_NAME} PRIVATE ${Z_DEPS} zerith_testsupport GTest::gtest GTest::gmock GTest::gtest_main)
   gtest_discover_tests(${Z_NAME} DISCOVERY_TIMEOUT 60
-    PROPERTIES TIMEOUT 120 ENVIRONMENT "ZERITH_BUILD_DIR=${CMAKE_BINARY_DIR};ZERITH_SOURCE_DIR=${CMAKE_SOURCE_DIR}")
+    # One variable per property: gtest_discover_tests splits a list value at
+    # its ';' however it is escaped, and the second variable would be lost.
+    PROPERTIES TIMEOUT 120 ENVIRONMENT "ZERITH_BUILD_DIR=${CMAKE_BINARY_DIR}"
+    ENVIRONMENT_MODIFICATION "ZERITH_SOURCE_DIR=set:${CMAKE_SOURCE_DIR}")
 endfunction()
