@@ -93,6 +93,12 @@ TEST_F(EnvironmentTest, NumericStringIsReadAsItsIntegerValue) {
   EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentRelease);
 }
 
+TEST_F(EnvironmentTest, CorruptDefaultsFileCountsAsAbsent) {
+  root_.write("/var/lib/zerithd/defaults/com.velmar.zerith.plist", "<plist><dict><key>environmentType</key>");
+  EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentSeed);
+  EXPECT_TRUE(capture_.contains("ignoring corrupt defaults file"));
+}
+
 // The internal-build flag is computed once per process, so the internal
 // cases run in a child process of their own.
 class InternalBuildDeathTest : public ::testing::Test {
