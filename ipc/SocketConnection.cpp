@@ -190,16 +190,18 @@ void SocketConnection::startRead() {
 }
 
 void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
-  auto self = std::static_pointer_cast<SocketConnection>(shared_from_this());
-  if (ec) {
-    queue_.async([self, ec] { self->readFailed(ec); });
-    return;
-  }
-  // readBuffer_ stays untouched until the queue has consumed it: the next
-  // read starts from there.
-  queue_.async([self, size] {
-    self->processInput(size);
-    self->startRead();
+  // The chunk is handled right here on the reading thread, as a turn of the
+  // connection's queue (waiting for it when a block of the queue is
+  // running): no hand-off to another thread on the way to the exported
+  // object. readBuffer_ stays untouched until then, since the next read
+  // starts from inside that turn.
+  queue_.sync([&] {
+    if (ec) {
+      readFailed(ec);
+      return;
+    }
+    processInput(size);
+    startRead();
   });
 }
 

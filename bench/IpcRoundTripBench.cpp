@@ -1,0 +1,183 @@
+// Request/reply round trips over zerith_ipc (a real SocketConnection pair:
+// the caller's call() -> frame -> the answering connection's queue -> an
+// exported object that replies with the same arguments -> frame -> the
+// caller's reply handler) beside a bare Unix-socket echo of frames of the
+// same size (write length + bytes, read them back), in the same run.
+//
+// Reported per size: round trips per second (items_per_second) and the
+// p50/p99 latency in microseconds. Frame sizes are the encoded call frames
+// of a payload of 64 B, 1 KiB and 16 KiB. BM_FrameEncodeDecode gives the
+// codec's share (a round trip encodes and decodes two frames).
+
+#include <benchmark/benchmark.h>
+#include <sys/socket.h>
+
+#include <algorithm>
+#include <condition_variable>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "ipc/Frame.h"
+#include "ipc/SocketConnection.h"
+
+using namespace zerith;
+using namespace zerith::ipc;
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+Dictionary argsOfSize(std::size_t payload) { return Dictionary{{"payload", Value(Data(payload, 0x42))}}; }
+
+void reportLatencies(benchmark::State& state, std::vector<double>& micros, std::size_t frameBytes) {
+  if (micros.empty()) {
+    return;
+  }
+  std::sort(micros.begin(), micros.end());
+  state.counters["p50_us"] = micros[micros.size() / 2];
+  state.counters["p99_us"] = micros[std::min(micros.size() - 1, micros.size() * 99 / 100)];
+  state.counters["frame_bytes"] = static_cast<double>(frameBytes);
+  state.SetItemsProcessed(static_cast<std::int64_t>(micros.size()));
+}
+
+class Echo : public ExportedObject {
+ public:
+  void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override { reply->send(message.args); }
+};
+
+void BM_IpcRoundTrip(benchmark::State& state) {
+  int fds[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
+    state.SkipWithError("socketpair failed");
+    return;
+  }
+  const PeerCredentials peer = *readPeerCredentials(fds[0]);
+  auto caller = SocketConnection::adopt(file::UniqueFd(fds[0]), peer, Dictionary());
+  auto answerer = SocketConnection::adopt(file::UniqueFd(fds[1]), peer, Dictionary());
+  answerer->setExportedObject(std::make_shared<Echo>());
+  caller->resume();
+  answerer->resume();
+
+  const Dictionary args = argsOfSize(static_cast<std::size_t>(state.range(0)));
+  const std::size_t frameBytes = encodeCall("echo", 1, args).size();
+  std::mutex mutex;
+  std::condition_variable arrived;
+  bool done = false;
+  bool failed = false;
+  std::vector<double> micros;
+  micros.reserve(1 << 16);
+
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    {
+      std::lock_guard lock(mutex);
+      done = false;
+    }
+    caller->call("echo", args, [&](std::optional<Dictionary> reply, std::optional<Error>) {
+      {
+        std::lock_guard lock(mutex);
+        done = true;
+        failed = !reply;
+      }
+      arrived.notify_one();
+    });
+    std::unique_lock lock(mutex);
+    arrived.wait(lock, [&] { return done; });
+    if (failed) {
+      state.SkipWithError("call failed");
+      break;
+    }
+    micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+  }
+  reportLatencies(state, micros, frameBytes);
+  caller->invalidate();
+  answerer->invalidate();
+}
+
+bool writeAll(int fd, const std::uint8_t* p, std::size_t n) {
+  while (n > 0) {
+    const ssize_t w = ::send(fd, p, n, MSG_NOSIGNAL);
+    if (w <= 0) {
+      return false;
+    }
+    p += w;
+    n -= static_cast<std::size_t>(w);
+  }
+  return true;
+}
+
+bool readAll(int fd, std::uint8_t* p, std::size_t n) {
+  while (n > 0) {
+    const ssize_t r = ::recv(fd, p, n, 0);
+    if (r <= 0) {
+      return false;
+    }
+    p += r;
+    n -= static_cast<std::size_t>(r);
+  }
+  return true;
+}
+
+// Reads one length-prefixed frame into `buffer`; false at the end.
+bool readFrame(int fd, std::vector<std::uint8_t>& buffer) {
+  std::uint8_t header[4];
+  if (!readAll(fd, header, 4)) {
+    return false;
+  }
+  const std::size_t n = (std::size_t{header[0]} << 24) | (std::size_t{header[1]} << 16) | (std::size_t{header[2]} << 8) | header[3];
+  buffer.resize(4 + n);
+  std::copy(header, header + 4, buffer.begin());
+  return readAll(fd, buffer.data() + 4, n);
+}
+
+void BM_BareUnixEcho(benchmark::State& state) {
+  int fds[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
+    state.SkipWithError("socketpair failed");
+    return;
+  }
+  file::UniqueFd near(fds[0]);
+  file::UniqueFd far(fds[1]);
+  std::thread echo([fd = far.get()] {
+    std::vector<std::uint8_t> buffer;
+    while (readFrame(fd, buffer) && writeAll(fd, buffer.data(), buffer.size())) {
+    }
+  });
+  // The very frame the IPC benchmark sends, so both move the same bytes.
+  const Data frame = encodeCall("echo", 1, argsOfSize(static_cast<std::size_t>(state.range(0))));
+  std::vector<std::uint8_t> back;
+  std::vector<double> micros;
+  micros.reserve(1 << 16);
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    if (!writeAll(near.get(), frame.data(), frame.size()) || !readFrame(near.get(), back)) {
+      state.SkipWithError("echo failed");
+      break;
+    }
+    micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+  }
+  reportLatencies(state, micros, frame.size());
+  ::shutdown(near.get(), SHUT_RDWR);
+  echo.join();
+}
+
+// The codec's share of a round trip: one call frame encoded and decoded
+// (structural check, libplist, conversion to Value), on one thread.
+void BM_FrameEncodeDecode(benchmark::State& state) {
+  const Dictionary args = argsOfSize(static_cast<std::size_t>(state.range(0)));
+  for (auto _ : state) {
+    const Data frame = encodeCall("echo", 1, args);
+    auto message = decodeMessage(plist::Bytes(frame.data() + kFrameHeaderBytes, frame.size() - kFrameHeaderBytes));
+    benchmark::DoNotOptimize(message);
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
+}  // namespace
+
+BENCHMARK(BM_FrameEncodeDecode)->Arg(64)->Arg(1024)->Arg(16384)->Unit(benchmark::kMicrosecond);
+BENCHMARK(BM_IpcRoundTrip)->Arg(64)->Arg(1024)->Arg(16384)->UseRealTime()->Unit(benchmark::kMicrosecond);
+BENCHMARK(BM_BareUnixEcho)->Arg(64)->Arg(1024)->Arg(16384)->UseRealTime()->Unit(benchmark::kMicrosecond);
+
+BENCHMARK_MAIN();
