@@ -3,7 +3,13 @@
 // Removes stale files below a folder by a pattern over their relative paths.
 
 #include <filesystem>
+
+// GCC 12 reports false "may be used uninitialized" warnings inside <regex>
+// when optimising with the sanitizers on.
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wmaybe-uninitialized"
 #include <regex>
+#pragma GCC diagnostic pop
 
 namespace zerith {
 

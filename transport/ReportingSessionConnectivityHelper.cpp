@@ -5,7 +5,6 @@
 
 #include <atomic>
 #include <cerrno>
-#include <regex>
 #include <system_error>
 
 #include <fmt/format.h>

@@ -164,7 +164,9 @@ struct HttpsTestServer::Impl {
   }
 };
 
-HttpsTestServer::HttpsTestServer(const TestCA& ca) : impl_(std::make_unique<Impl>()) {
+HttpsTestServer::HttpsTestServer(const TestCA& ca) : HttpsTestServer(ca, Options{}) {}
+
+HttpsTestServer::HttpsTestServer(const TestCA& ca, Options options) : impl_(std::make_unique<Impl>()) {
   const IssuedCertificate& issued = ca.serverCertificate();
   auto certBio = memoryBio(issued.certificatePem);
   impl_->certificate.reset(PEM_read_bio_X509(certBio.get(), nullptr, nullptr, nullptr));
@@ -178,8 +180,15 @@ HttpsTestServer::HttpsTestServer(const TestCA& ca) : impl_(std::make_unique<Impl
     throw std::runtime_error("HttpsTestServer: TLS context could not be set up");
   }
   auto& server = *impl_->server;
-  server.new_task_queue = [] { return new httplib::ThreadPool(16); };
-  server.set_keep_alive_max_count(1);
+  // A kept-alive connection holds a server thread while it stays open.
+  const std::size_t threads = options.keepAlive ? 128 : 16;
+  server.new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
+  if (options.keepAlive) {
+    server.set_keep_alive_max_count(1000);
+    server.set_keep_alive_timeout(1);
+  } else {
+    server.set_keep_alive_max_count(1);
+  }
   Impl* impl = impl_.get();
   const auto handler = [impl](const httplib::Request& req, httplib::Response& res) { impl->handle(req, res); };
   server.Get(".*", handler);

@@ -12,8 +12,8 @@
 //   ASSERT_TRUE(server.waitForRequests(1));
 //   EXPECT_EQ(server.requests()[0].header("If-Modified-Since"), "...");
 //
-// The server closes each connection after one answer, so that stopping it
-// never waits for idle keep-alive connections. Paths without a handler answer
+// By default the server closes each connection after one answer, so that
+// stopping it never waits for idle keep-alive connections. Paths without a handler answer
 // 404 with an empty body. The server adds "Content-Length" (or chunked
 // framing) itself: replies should not carry those headers.
 
@@ -64,7 +64,14 @@ using RequestHandler = std::function<Reply(const RecordedRequest&)>;
 
 class HttpsTestServer {
  public:
+  struct Options {
+    // Keep connections open for further requests (benchmarks); stopping then
+    // waits up to a second for idle connections.
+    bool keepAlive = false;
+  };
+
   explicit HttpsTestServer(const TestCA& ca = TestCA::shared());
+  HttpsTestServer(const TestCA& ca, Options options);
   ~HttpsTestServer();
   HttpsTestServer(const HttpsTestServer&) = delete;
   HttpsTestServer& operator=(const HttpsTestServer&) = delete;

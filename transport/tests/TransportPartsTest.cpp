@@ -3,9 +3,15 @@
 
 #include <gtest/gtest.h>
 
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+
 #include "tests/support/TempRoot.h"
 #include "transport/DeviceConditions.h"
 #include "transport/ResponseHead.h"
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size);
 
 namespace zerith::test {
 namespace {
@@ -40,6 +46,18 @@ TEST(ResponseHead, LinesThatAreNoFieldsAreIgnoredAndLineBreaksNeverReachAValue) 
   EXPECT_EQ(parseResponseHeadLine(std::string_view("X: a\rb\0c\r\n", 10), fields), ResponseHeadLine::Field);
   EXPECT_EQ(parseResponseHeadLine("X-Url: https://a:1/b?c=d\r\n", fields), ResponseHeadLine::Field);
   EXPECT_EQ(fields, (HTTPHeaders{{"X", "a b c"}, {"X-Url", "https://a:1/b?c=d"}}));
+}
+
+TEST(ResponseHead, KeptFuzzInputsStillPass) {
+  const auto corpus = sourceDir() / "fuzz/corpus/response_head_fuzz";
+  std::size_t replayed = 0;
+  for (const auto& entry : std::filesystem::directory_iterator(corpus)) {
+    std::ifstream in(entry.path(), std::ios::binary);
+    const std::string input((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    LLVMFuzzerTestOneInput(reinterpret_cast<const std::uint8_t*>(input.data()), input.size());  // aborts on a broken rule
+    ++replayed;
+  }
+  EXPECT_GE(replayed, 5u);
 }
 
 TEST(DeviceConditions, BatteryPowerOnlyWhenASystemBatteryDischargesWithoutExternalSupply) {

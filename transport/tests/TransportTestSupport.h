@@ -13,12 +13,12 @@
 #include <memory>
 #include <mutex>
 #include <optional>
-#include <regex>
 #include <string>
 #include <thread>
 #include <vector>
 #include <functional>
 
+#include "config/RemoveFiles.h"  // <regex>, included the way GCC 12 with sanitizers wants it
 #include "platform/Log.h"
 #include "session/ZerithdSessionDelegate.h"
 #include "tests/support/HttpsTestServer.h"
