@@ -13,7 +13,7 @@ namespace {
 // opens up the fields concrete backends use.
 class ProbeBackend : public ZerithBackend {
  public:
-  ProbeBackend() : ZerithBackend("probe", Value(Dictionary{{"k", "v"}}), std::string("family")) {}
+  ProbeBackend() : ZerithBackend("probe", Value(), std::nullopt) {}
 
   using ZerithBackend::sendMessage;
   std::optional<std::string> sendMessage(const Value&, const timeval&, std::uint16_t, std::uint16_t,
@@ -24,13 +24,11 @@ class ProbeBackend : public ZerithBackend {
   }
 
   using ZerithBackend::eventID;
-  using ZerithBackend::profile;
   using ZerithBackend::selfVersionMajor;
   using ZerithBackend::selfVersionMiddle;
   using ZerithBackend::selfVersionMinor;
   using ZerithBackend::setEventBlacklist;
   using ZerithBackend::setEventWhitelist;
-  using ZerithBackend::startTimeStamp;
   using ZerithBackend::stateQueue;
 
   std::vector<std::uint16_t> seen;
@@ -188,21 +186,6 @@ TEST(ZerithBackendTest, FlushCallsTheCompletionOnceWithNilAndNoError) {
   }),
             std::nullopt);
   EXPECT_EQ(calls, 1);
-}
-
-TEST(ZerithBackendTest, IdentityFieldsAsTheSessionSetsThem) {
-  ProbeBackend b;
-  EXPECT_EQ(b.name(), "probe");
-  EXPECT_EQ(b.profile()["k"], Value("v"));
-  EXPECT_EQ(b.productFamily(), "family");
-  EXPECT_FALSE(b.combinedSessionIDString());
-  b.setCorrelatedSessionID("parent.child");
-  EXPECT_EQ(b.combinedSessionIDString(), "parent.child");
-  b.setStartTimestamp(timeval{1000, 500000});
-  EXPECT_DOUBLE_EQ(b.startTimeStamp(), 1000.5);
-  const char udid[] = "0123";
-  b.setUdid(udid);
-  EXPECT_EQ(b.udid(), udid);
 }
 
 TEST(ZerithBackendTest, TransportReferenceIsWeak) {
