@@ -5,7 +5,9 @@
 #include <fmt/format.h>
 
 #include "config/ClientTypes.h"
+#include "config/Conversions.h"
 #include "config/DeviceInfo.h"
+#include "config/MessageLog.h"
 #include "ipc/ClientSessionReplyProxy.h"
 #include "ipc/Connection.h"
 #include "platform/Crypto.h"
@@ -32,10 +34,6 @@ double secondsNow() {
   timeval tv{};
   gettimeofday(&tv, nullptr);
   return static_cast<double>(tv.tv_sec) + static_cast<double>(tv.tv_usec) / 1000000.0;
-}
-
-Error zerithError(std::string description, std::int64_t code) {
-  return Error{kZerithErrorDomain, code, std::move(description)};
 }
 
 }  // namespace
@@ -465,7 +463,7 @@ void ZerithdSession::internalFlushMessagesWithCompletion(ValueErrorCompletion co
   if (!hasBackendSet()) {
     logger().debug("internalFlushMessagesWithCompletion: {}", kNoBackends);
     if (completion) {
-      completion(Value(), zerithError(kNoBackends, -1));
+      completion(Value(), makeZerithError(kNoBackends, -1));
     }
     return;
   }
@@ -610,8 +608,10 @@ void ZerithdSession::uploadFileWithURL(const Value& fileURL, const Value& /*exte
                                        BoolCompletion completionHandler) {
   const std::string url = fileURL.string() ? *fileURL.string() : std::string();
   const std::string path = url.starts_with("file://") ? url.substr(7) : url;
+  const std::string absoluteURL = url.starts_with("file://") ? url : "file://" + path;
   // Only an upload backend takes files; none exists in the set yet.
   logger().error("uploadFileWithURL: File upload failed for {}", path);
+  writeToLogFile("[uploadFileWithURL] Upload {} for file {}", "failed", absoluteURL);
   if (completionHandler) {
     completionHandler(false);
   }
