@@ -3,13 +3,22 @@
 // The certificate authorities trusted beside the system store, for every
 // TLS connection of the process (URLSession::setExtraCAFile). Process-wide by
 // design: the daemon sets it once from its command line.
+//
+// libcurl keeps one verification store per CA bundle path and reuses it
+// across connections (loading the system bundle costs about 25 ms, far more
+// than a handshake). So the extra authorities are not added to a store
+// libcurl hands out; instead they go into a bundle of their own: the system
+// bundle followed by the extra certificates, in an in-memory file whose path
+// is new whenever the setting or the system bundle changes.
 
-#include <memory>
+#include <sys/types.h>
+
+#include <ctime>
 #include <mutex>
 #include <string>
 #include <vector>
 
-#include <openssl/x509.h>
+#include "platform/FileUtil.h"
 
 namespace zerith {
 
@@ -21,13 +30,12 @@ class ExtraTrust {
   // previous set kept) when the file cannot be read or holds none.
   bool setFile(const std::string& path);
   std::string file() const;
-  bool empty() const;
-  // Adds the certificates to a connection's verification store.
-  void addTo(X509_STORE* store) const;
 
-  struct X509Free {
-    void operator()(X509* x) const { X509_free(x); }
-  };
+  // The CA bundle a connection should verify against: "" when there are no
+  // extra authorities (libcurl's system bundle applies), else the combined
+  // bundle's path. "" with `failed` set when the combined bundle cannot be
+  // made.
+  std::string bundlePath(bool& failed);
 
  private:
   ExtraTrust();
@@ -35,7 +43,15 @@ class ExtraTrust {
 
   mutable std::mutex mutex_;
   std::string path_;
-  std::vector<std::unique_ptr<X509, X509Free>> certificates_;
+  std::string extraPem_;  // the extra certificates, re-encoded
+  std::string systemBundle_;
+
+  std::string bundle_;  // current combined bundle ("" when none made yet)
+  struct timespec systemModified_ {};
+  off_t systemSize_ = -1;
+  // Every bundle handed out stays open: a path must never name other
+  // contents later, or libcurl's cached store for it would be wrong.
+  std::vector<file::UniqueFd> bundles_;
 };
 
 }  // namespace zerith

@@ -1,6 +1,5 @@
 #include "transport/TransferEngine.h"
 
-#include <openssl/ssl.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -346,11 +345,17 @@ struct TransferEngine::Impl {
     if (config.networkServiceType == NetworkServiceType::Background) {
       curl_easy_setopt(e, CURLOPT_SOCKOPTFUNCTION, &Impl::onSocket);
     }
-    if (!ExtraTrust::instance().empty()) {
-      // A store of this connection's own (not libcurl's shared cached one)
-      // gets the extra authorities beside the system bundle.
-      curl_easy_setopt(e, CURLOPT_CA_CACHE_TIMEOUT, 0L);
-      curl_easy_setopt(e, CURLOPT_SSL_CTX_FUNCTION, &Impl::onSslContext);
+    // Verification uses one CA bundle file, so that libcurl's cache of the
+    // loaded store applies (a CA folder beside it would disable the cache).
+    curl_easy_setopt(e, CURLOPT_CAPATH, nullptr);
+    bool failed = false;
+    const std::string bundle = ExtraTrust::instance().bundlePath(failed);
+    if (failed) {
+      complete(task, Error{kURLErrorDomain, CURLE_SSL_CACERT_BADFILE, "The CA bundle with the extra authorities cannot be made"});
+      return false;
+    }
+    if (!bundle.empty()) {
+      curl_easy_setopt(e, CURLOPT_CAINFO, bundle.c_str());
     }
     return true;
   }
@@ -517,11 +522,6 @@ struct TransferEngine::Impl {
       ::setsockopt(fd, SOL_SOCKET, SO_PRIORITY, &priority, sizeof(priority));
     }
     return CURL_SOCKOPT_OK;
-  }
-
-  static CURLcode onSslContext(CURL*, void* sslContext, void*) {
-    ExtraTrust::instance().addTo(SSL_CTX_get_cert_store(static_cast<SSL_CTX*>(sslContext)));
-    return CURLE_OK;
   }
 };
 

@@ -6,8 +6,9 @@
 //
 // Built against libcurl 7.88 (Debian bookworm) with OpenSSL. Relied upon:
 // curl_multi_poll / curl_multi_wakeup (7.66 / 7.68), CURLOPT_PROTOCOLS_STR
-// and CURLOPT_REDIR_PROTOCOLS_STR (7.85), CURLOPT_CA_CACHE_TIMEOUT (7.87),
-// CURLOPT_SSL_CTX_FUNCTION (OpenSSL back end), CURLOPT_SOCKOPTFUNCTION,
+// and CURLOPT_REDIR_PROTOCOLS_STR (7.85), the OpenSSL back end's cache of the
+// loaded CA store per bundle path (7.87; only without a CA folder, hence
+// CURLOPT_CAPATH is cleared), CURLOPT_SOCKOPTFUNCTION,
 // CURLOPT_XFERINFOFUNCTION, CURLOPT_SEEKFUNCTION, CURLINFO_OS_ERRNO, and the
 // "threadsafe" feature for curl_global_init. The engine checks the version
 // and the SSL feature at start and logs an error when they are missing.

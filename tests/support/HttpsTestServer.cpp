@@ -183,6 +183,9 @@ HttpsTestServer::HttpsTestServer(const TestCA& ca, Options options) : impl_(std:
   // A kept-alive connection holds a server thread while it stays open.
   const std::size_t threads = options.keepAlive ? 128 : 16;
   server.new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
+  // Headers and body leave in separate writes; without this a kept-alive
+  // connection waits for the client's delayed acknowledgement each time.
+  server.set_tcp_nodelay(true);
   if (options.keepAlive) {
     server.set_keep_alive_max_count(1000);
     server.set_keep_alive_timeout(1);
@@ -197,9 +200,19 @@ HttpsTestServer::HttpsTestServer(const TestCA& ca, Options options) : impl_(std:
   server.Patch(".*", handler);
   server.Delete(".*", handler);
   server.Options(".*", handler);
+  int listening = -1;
+  server.set_socket_options([&listening](int fd) {
+    httplib::default_socket_options(fd);
+    listening = fd;
+  });
   impl_->port = server.bind_to_any_port("127.0.0.1");
   if (impl_->port <= 0) {
     throw std::runtime_error("HttpsTestServer: cannot bind a loopback port");
+  }
+  // cpp-httplib listens with a backlog of 5: many clients connecting at once
+  // would wait a second for a SYN retransmission. Listening again widens it.
+  if (listening >= 0) {
+    ::listen(listening, 1024);
   }
   // The socket already listens: connections made before the thread runs wait
   // in the backlog.

@@ -282,6 +282,13 @@ TEST_F(ConnectivityHelperTest, ServerTrustedOnlyThroughTheExtraCA) {
   ASSERT_TRUE(done->waitFor(3));
   EXPECT_FALSE(done->calls()[2].error.has_value());
   EXPECT_EQ(text(done->calls()[2].data), "ok");
+
+  // Trust that was added once does not linger in a cached store.
+  ASSERT_TRUE(URLSession::setExtraCAFile(""));
+  helper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
+  ASSERT_TRUE(done->waitFor(4));
+  ASSERT_TRUE(done->calls()[3].error.has_value());
+  EXPECT_EQ(done->calls()[3].error->code, 60);
   EXPECT_EQ(untrusted.requestCount(), 0u);
 }
 

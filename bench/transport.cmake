@@ -1,0 +1,5 @@
+# The connectivity helper against the in-process HTTPS server on loopback:
+# request round trips (fresh and kept-alive connections, data and upload
+# POSTs), many requests in flight, and a large answer.
+zerith_bench(NAME transport_bench SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/TransportBench.cpp
+  DEPS zerith_transport zerith_testsupport)
