@@ -1,0 +1,102 @@
+// A session's start against a real storebag server: a signed storebag over
+// HTTPS, trusted through the daemon's --ca-file, starts the session and
+// sends its start message to the client's aggregator.
+
+#include <future>
+
+#include "config/StorebagSigner.h"
+#include "tests/e2e/E2eFixture.h"
+#include "tests/support/HttpsTestServer.h"
+#include "tests/support/TestCA.h"
+#include "zerith/Zerith.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+
+class StorebagStartTest : public E2eTest {
+ protected:
+  void SetUp() override {
+    grant(Value(true));
+    const auto keys = generateStorebagKeyPair(2048);
+    ASSERT_TRUE(keys.has_value());
+    root.write("/usr/share/zerith/publicKey.der", std::string(keys->publicKeyDER.begin(), keys->publicKeyDER.end()));
+    const Value bag(Dictionary{{"version", Value("5.2.0")},
+                               {"seed", Value(Dictionary{{"kovu", Value(Dictionary{{"active", Value(true)}})}})}});
+    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
+    ASSERT_TRUE(container.has_value());
+    server.on("/zerith/dravon", {.status = 200,
+                                 .headers = {{"Cache-Control", "max-age=600"}},
+                                 .body = std::string(container->begin(), container->end())});
+    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
+  }
+
+  DaemonProcess& start(bool trustTestCA) {
+    DaemonProcess::Options options;
+    options.arguments = {"--stop-timeout", "5"};
+    if (trustTestCA) {
+      options.arguments.push_back("--ca-file");
+      options.arguments.push_back(TestCA::shared().caFile().string());
+    }
+    options.environment = {{"LC_ALL", "fr_FR.UTF-8"}};
+    return startDaemon(options);
+  }
+
+  static Value info() {
+    return Value(Dictionary{{kZerithSessionInfoSessionID, Value(31)}, {kZerithSessionInfoClientType, Value(7)}});
+  }
+
+  HttpsTestServer server;
+};
+
+TEST_F(StorebagStartTest, SignedStorebagStartsTheSessionAndItsStartMessageReachesTheAggregator) {
+  start(/*trustTestCA=*/true);
+  auto client = Zerith::connect();
+  ASSERT_TRUE(client);
+  std::promise<Dictionary> startMessage;
+  std::atomic<int> messages{0};
+  client->setMessageHandler([&](const Value& message, double, std::uint16_t category, std::uint16_t type,
+                                const Value& payload) {
+    if (messages++ == 0) {
+      startMessage.set_value(Dictionary{{"message", message},
+                                        {"category", Value(unsigned{category})},
+                                        {"type", Value(unsigned{type})},
+                                        {"payload", payload}});
+    }
+  });
+  ASSERT_TRUE(client->setSessionInfo(info(), Value(), Value(), /*hasAggregationBlock=*/true, 10s));
+  const auto started = client->startConfig(20s);
+  ASSERT_TRUE(started) << started.error->description;
+  EXPECT_EQ(started["backends"], Value(Array{})) << daemon->output();
+
+  ASSERT_TRUE(server.waitForRequests(1));
+  EXPECT_EQ(server.requests()[0].path, "/zerith/dravon");
+  auto future = startMessage.get_future();
+  ASSERT_EQ(future.wait_for(10s), std::future_status::ready);
+  EXPECT_EQ(future.get(), (Dictionary{{"message", info()},
+                                      {"category", Value(0u)},
+                                      {"type", Value(0u)},
+                                      {"payload", Value(Dictionary{{"AutomaticTimeSet", Value(true)},
+                                                                   {"Locale", Value("FR")}})}}));
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "createBackendsWithStorebag: Creating backends for session 31"));
+
+  // A second start is answered from the agent's cache.
+  ASSERT_TRUE(client->startConfig(20s));
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "storebagForSession: Cached storebag found for client type 7"));
+  EXPECT_EQ(server.requestCount(), 1u);
+}
+
+TEST_F(StorebagStartTest, StorebagServerOutsideTheTrustedAuthoritiesLeavesTheSessionUnstarted) {
+  start(/*trustTestCA=*/false);
+  auto client = Zerith::connect();
+  ASSERT_TRUE(client);
+  ASSERT_TRUE(client->setSessionInfo(info(), Value(), Value(), false, 10s));
+  const auto started = client->startConfig(20s);
+  ASSERT_TRUE(started);
+  EXPECT_TRUE(started["backends"].isNil());
+  EXPECT_TRUE(daemon->waitForExact(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 7"));
+}
+
+}  // namespace
+}  // namespace zerith::test
