@@ -6,10 +6,14 @@
 
 // GCC 12 reports false "may be used uninitialized" warnings inside <regex>
 // when optimising with the sanitizers on.
+#if defined(__GNUC__) && !defined(__clang__)
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wmaybe-uninitialized"
 #include <regex>
 #pragma GCC diagnostic pop
+#else
+#include <regex>
+#endif
 
 namespace zerith {
 
