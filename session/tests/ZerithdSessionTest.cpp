@@ -375,13 +375,5 @@ TEST_F(ZerithdSessionTest, OneShotConfiguresTheSessionAndAnswersByStorebag) {
   EXPECT_EQ(replies[1], Value("storebag not available"));
 }
 
-TEST_F(ZerithdSessionTest, DigestKeyIsCopiedAndReplaced) {
-  auto s = newSession(sessionInfo(5));
-  s.session->setDigestKey(Value(Data{1, 2, 3}), 1);
-  EXPECT_EQ(s.session->digestKey(), Value(Data{1, 2, 3}));
-  s.session->setDigestKey(Value(Data{9}), 2);
-  EXPECT_EQ(s.session->digestKey(), Value(Data{9}));
-}
-
 }  // namespace
 }  // namespace zerith::test
