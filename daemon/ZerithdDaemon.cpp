@@ -6,11 +6,17 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <mutex>
 #include <system_error>
 
 #include <systemd/sd-daemon.h>
+
+#if defined(__SANITIZE_ADDRESS__)
+#include <sanitizer/lsan_interface.h>
+#endif
 
 #include "daemon/KeepAliveTransaction.h"
 #include "daemon/StorebagCache.h"
@@ -104,16 +110,26 @@ int ZerithdDaemon::run() {
     logger().info("main: Waiting up to {} ms for the keep-alive transaction to end", options_.stopTimeout.count());
     sd_notify(0, "STATUS=Draining sessions");
     if (transaction->waitUntilClosed(std::chrono::steady_clock::now() + options_.stopTimeout)) {
-      // The agent ends the transaction under its lock; taking it lets that
-      // call finish (and log) before the process goes.
-      { std::lock_guard lock(agent->agentLock()); }
       logger().info("main: Keep-alive transaction ended, exiting");
     } else {
       logger().error("main: Stop time-out passed with the keep-alive transaction still open, exiting");
     }
   }
   listener.reset();
+  // The agent ends a transaction under its lock; taking it lets a release
+  // that is under way finish (and log) before the process goes.
+  { std::lock_guard lock(agent->agentLock()); }
   return 0;
+}
+
+void ZerithdDaemon::exitProcess(int status) {
+  spdlog::apply_all([](const std::shared_ptr<spdlog::logger>& l) { l->flush(); });
+  std::fflush(stdout);
+  std::fflush(stderr);
+#if defined(__SANITIZE_ADDRESS__)
+  __lsan_do_leak_check();
+#endif
+  std::_Exit(status);
 }
 
 }  // namespace zerith

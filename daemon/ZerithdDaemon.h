@@ -36,6 +36,12 @@ class ZerithdDaemon {
   // The exit status.
   int run();
 
+  // Ends the process once run() has returned: flushes the log and exits
+  // without static destructors, which would race the thread pools and the
+  // HTTP transport thread that live until the process ends. Sanitizer builds
+  // check for leaks first.
+  [[noreturn]] static void exitProcess(int status);
+
   // Nice 10 and best-effort I/O priority 7; failures are logged and ignored.
   static void setUtilityQualityOfService();
 

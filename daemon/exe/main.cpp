@@ -48,5 +48,6 @@ int main(int argc, char** argv) {
     options.caFile = caFile;
   }
   options.stopTimeout = std::chrono::milliseconds(static_cast<long long>(stopTimeoutSeconds * 1000));
-  return zerith::ZerithdDaemon(std::move(options)).run();
+  const int status = zerith::ZerithdDaemon(std::move(options)).run();
+  zerith::ZerithdDaemon::exitProcess(status);
 }
