@@ -148,7 +148,24 @@ SerialQueue::Turn::Turn(const SerialQueue& queue) : state_(queue.state_.get()) {
   tCurrentQueues.push_back(state_);
 }
 
+SerialQueue::Turn::Turn(const SerialQueue& queue, std::try_to_lock_t) : state_(nullptr) {
+  if (queue.isCurrent()) {
+    return;
+  }
+  State* state = queue.state_.get();
+  std::unique_lock lock(state->mutex);
+  if (state->active || !state->items.empty()) {
+    return;
+  }
+  state->active = true;
+  state_ = state;
+  tCurrentQueues.push_back(state_);
+}
+
 SerialQueue::Turn::~Turn() {
+  if (!state_) {
+    return;
+  }
   tCurrentQueues.pop_back();
   state_->release();
 }

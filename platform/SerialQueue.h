@@ -14,6 +14,7 @@
 #include <chrono>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <type_traits>
 #include <utility>
@@ -37,6 +38,21 @@ class SerialQueue {
   auto sync(F&& block) const -> std::invoke_result_t<F> {
     Turn turn(*this);
     return std::forward<F>(block)();
+  }
+
+  // Runs `block` on the calling thread, as sync does, when the queue is free
+  // at this moment, and returns true; returns false without running it when
+  // a block of the queue is running or waiting (or the caller is inside
+  // one). Never waits, so threads of the pool that the queue's own blocks
+  // need can use it without starving them.
+  template <typename F>
+  bool runIfFree(F&& block) const {
+    Turn turn(*this, std::try_to_lock);
+    if (!turn.owns()) {
+      return false;
+    }
+    std::forward<F>(block)();
+    return true;
   }
 
   class Timer {
@@ -65,7 +81,10 @@ class SerialQueue {
   class Turn {
    public:
     explicit Turn(const SerialQueue& queue);
+    // Takes the queue only if it is free now; owns() tells.
+    Turn(const SerialQueue& queue, std::try_to_lock_t);
     ~Turn();
+    bool owns() const { return state_ != nullptr; }
     Turn(const Turn&) = delete;
     Turn& operator=(const Turn&) = delete;
 

@@ -74,5 +74,28 @@ TEST(SerialQueueTest, NestedSyncOntoAnotherQueueAndCancelledTimers) {
   EXPECT_EQ(fired.load(), 0);
 }
 
+TEST(SerialQueueTest, RunIfFreeRunsInlineOnlyWhenNothingElseHoldsOrWaitsForTheQueue) {
+  SerialQueue q("test.tryrun");
+  bool ranInline = false;
+  EXPECT_TRUE(q.runIfFree([&] { ranInline = q.isCurrent(); }));
+  EXPECT_TRUE(ranInline);
+  // Inside its own block the queue is not free (and it must not deadlock).
+  EXPECT_FALSE(q.sync([&] { return q.runIfFree([] {}); }));
+  // Busy with a running block: refused at once, not waited for.
+  std::promise<void> release;
+  std::promise<void> started;
+  q.async([&] {
+    started.set_value();
+    release.get_future().wait();
+  });
+  started.get_future().wait();
+  bool ran = false;
+  EXPECT_FALSE(q.runIfFree([&] { ran = true; }));
+  EXPECT_FALSE(ran);
+  release.set_value();
+  q.sync([] {});
+  EXPECT_TRUE(q.runIfFree([] {}));
+}
+
 }  // namespace
 }  // namespace zerith
