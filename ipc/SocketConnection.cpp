@@ -190,19 +190,23 @@ void SocketConnection::startRead() {
 }
 
 void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
-  // The chunk is handled right here on the reading thread, as a turn of the
-  // connection's queue (waiting for it when a block of the queue is
-  // running): no hand-off to another thread on the way to the exported
-  // object. readBuffer_ stays untouched until then, since the next read
-  // starts from inside that turn.
-  queue_.sync([&] {
+  // The chunk is handled as a turn of the connection's queue: right here on
+  // the reading thread when the queue is free (no hand-off on the way to the
+  // exported object), else queued behind what the queue is doing. Never by
+  // waiting for the queue: a reading thread that waited could hold the very
+  // pool thread the queue needs. readBuffer_ stays untouched until then,
+  // since the next read starts from inside that turn.
+  auto handle = [this, ec, size] {
     if (ec) {
       readFailed(ec);
       return;
     }
     processInput(size);
     startRead();
-  });
+  };
+  if (!queue_.runIfFree(handle)) {
+    queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this()), handle] { handle(); });
+  }
 }
 
 void SocketConnection::processInput(std::size_t size) {

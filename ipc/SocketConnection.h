@@ -3,9 +3,9 @@
 // The Connection over a Unix-domain stream socket.
 //
 // Reading: one read is outstanding at a time; each chunk is decoded and its
-// messages delivered in a turn of the connection's serial queue taken on the
-// thread that read it (no hand-off), and the next read starts only once that
-// is done, so a peer that floods the socket waits for its earlier calls to be
+// messages delivered in a turn of the connection's serial queue (on the
+// thread that read it when the queue is free, so without a hand-off), and the
+// next read starts only once that is done, so a peer that floods the socket waits for its earlier calls to be
 // handled instead of filling memory.
 //
 // Writing: whole frames, from any thread, in the order the calls were made.

@@ -256,13 +256,5 @@ TEST(ClientSessionWireRefusal, TheClientRefusesMalformedMessagesFromTheDaemon) {
   EXPECT_EQ(link.client->log.size(), 0u);
 }
 
-TEST(ClientSessionWireTable, ThirteenSessionOperationsEachKnownByName) {
-  EXPECT_EQ(wire::sessionOperations().size(), 13u);
-  for (const auto& op : wire::sessionOperations()) {
-    EXPECT_EQ(wire::sessionOperation(op.name), &op);
-  }
-  EXPECT_EQ(wire::sessionOperation("sendMessageToClient:timestamp:category:type:payload:"), nullptr);
-}
-
 }  // namespace
 }  // namespace zerith::ipc::test

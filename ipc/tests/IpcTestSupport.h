@@ -26,11 +26,11 @@ inline constexpr auto kWait = 10s;
 // Counts events and lets a test wait for a number of them.
 class Counter {
  public:
+  // Notifies under the lock: a waiter may destroy the counter as soon as it
+  // sees the count.
   void hit() {
-    {
-      std::lock_guard lock(mutex_);
-      ++count_;
-    }
+    std::lock_guard lock(mutex_);
+    ++count_;
     changed_.notify_all();
   }
   bool waitFor(int n, std::chrono::milliseconds timeout = kWait) {

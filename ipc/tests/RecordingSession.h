@@ -24,10 +24,8 @@ struct RecordedCall {
 class CallLog {
  public:
   void add(RecordedCall call) {
-    {
-      std::lock_guard lock(mutex_);
-      calls_.push_back(std::move(call));
-    }
+    std::lock_guard lock(mutex_);
+    calls_.push_back(std::move(call));
     changed_.notify_all();
   }
   std::vector<RecordedCall> calls() const {

@@ -194,12 +194,16 @@ TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
   constexpr int kThreads = 8;
   constexpr int kCalls = 25;
   object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
-    std::lock_guard lock(held);
-    waiting.emplace_back(m, std::move(r));
-    if (waiting.size() == kThreads * kCalls) {
-      for (auto it = waiting.rbegin(); it != waiting.rend(); ++it) {
-        it->second->send(Dictionary{{"caller", it->first.args.get("caller")}, {"n", it->first.args.get("n")}});
+    std::vector<std::pair<Message, std::shared_ptr<Reply>>> all;
+    {
+      std::lock_guard lock(held);
+      waiting.emplace_back(m, std::move(r));
+      if (waiting.size() == kThreads * kCalls) {
+        all.swap(waiting);
       }
+    }
+    for (auto it = all.rbegin(); it != all.rend(); ++it) {
+      it->second->send(Dictionary{{"caller", it->first.args.get("caller")}, {"n", it->first.args.get("n")}});
     }
   };
   pair.b->setExportedObject(object);
@@ -230,6 +234,7 @@ TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
   ASSERT_TRUE(done.waitFor(kThreads * kCalls));
   EXPECT_EQ(matched, kThreads * kCalls);
   EXPECT_EQ(wrong, 0);
+  pair.b->queue().sync([] {});  // the answering turn has finished with the locals
 }
 
 TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
@@ -336,6 +341,41 @@ TEST(SocketConnectionDelivery, CallsRunInOrderOnTheConnectionsQueueOneAtATime) {
   }
   EXPECT_FALSE(overlapped);
   EXPECT_FALSE(offQueue);
+}
+
+// Holds the queues of peers[i..] (nested syncs need no pool thread) while
+// `whileHeld` runs.
+void holdQueues(std::vector<std::unique_ptr<RawPeer>>& peers, std::size_t i, const std::function<void()>& whileHeld) {
+  if (i == peers.size()) {
+    whileHeld();
+    return;
+  }
+  peers[i]->connection->queue().sync([&] { holdQueues(peers, i + 1, whileHeld); });
+}
+
+TEST(SocketConnectionDelivery, ReadsArrivingWhileManyQueuesAreBusyDoNotStarveThePool) {
+  // More busy connections than the pool has threads: a reading thread that
+  // waited for its busy queue would hold a pool thread, and enough of them
+  // would leave none to run the queues' own work.
+  constexpr std::size_t kPeers = 48;
+  std::vector<std::unique_ptr<RawPeer>> peers;
+  for (std::size_t i = 0; i < kPeers; ++i) {
+    peers.push_back(std::make_unique<RawPeer>());
+  }
+  bool poolAlive = false;
+  holdQueues(peers, 0, [&] {
+    for (auto& p : peers) {
+      p->write(callFrame("while-busy", std::nullopt));
+    }
+    std::this_thread::sleep_for(200ms);  // the reads complete meanwhile
+    std::promise<void> ran;
+    SerialQueue("probe").async([&] { ran.set_value(); });
+    poolAlive = ran.get_future().wait_for(5s) == std::future_status::ready;
+  });
+  EXPECT_TRUE(poolAlive) << "no pool thread was free while the queues were busy";
+  for (auto& p : peers) {
+    EXPECT_TRUE(p->object->received.waitFor(1));
+  }
 }
 
 TEST(SocketConnectionDelivery, InvalidationHandlerRunsExactlyOnceWhenEofAndInvalidateRace) {

@@ -32,7 +32,8 @@ typedef struct zerith_session zerith_session;
 
 typedef enum zerith_format {
   ZERITH_FORMAT_JSON = 0,
-  ZERITH_FORMAT_PLIST_XML = 1
+  ZERITH_FORMAT_PLIST_XML = 1,
+  ZERITH_FORMAT_FORCE_INT = 0x7fffffff /* keeps the type int-sized; not a format */
 } zerith_format;
 
 typedef void (*zerith_reply_callback)(void* context, const char* reply, const char* error);
