@@ -8,6 +8,7 @@
 // - one 16 MB GET answer (bytes/s).
 
 #include <benchmark/benchmark.h>
+#include <curl/curl.h>
 
 #include <atomic>
 #include <cstdio>
@@ -66,6 +67,38 @@ void roundTrips(benchmark::State& state, std::uint32_t mode) {
 void BM_DataPostRoundTrip(benchmark::State& state) { roundTrips(state, 4); }
 void BM_UploadPostRoundTrip(benchmark::State& state) { roundTrips(state, ReportingSessionConnectivityHelper::POSTRequestMode()); }
 
+// The reference in the same run: libcurl's easy interface on the calling
+// thread, the same 1 KB POST to the same server, one handle reused (so the
+// connection is kept alive when the server keeps it) — no transport thread,
+// no queues, no task records. BM_DataPostRoundTrip divided by this is what
+// the helper's hand-offs and bookkeeping cost.
+void BM_ReferenceCurlEasyPost(benchmark::State& state) {
+  Setup setup(state.range(0) != 0);
+  const std::string url = setup.server.url("/post");
+  const std::string body(1024, 'b');
+  const std::string caFile = test::TestCA::shared().caFile().string();
+  std::unique_ptr<CURL, decltype(&curl_easy_cleanup)> easy(curl_easy_init(), &curl_easy_cleanup);
+  curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
+  curl_easy_setopt(easy.get(), CURLOPT_URL, url.c_str());
+  curl_easy_setopt(easy.get(), CURLOPT_CAINFO, caFile.c_str());
+  curl_easy_setopt(easy.get(), CURLOPT_HTTPHEADER, headers);
+  curl_easy_setopt(easy.get(), CURLOPT_POSTFIELDS, body.data());
+  curl_easy_setopt(easy.get(), CURLOPT_POSTFIELDSIZE, static_cast<long>(body.size()));
+  curl_easy_setopt(easy.get(), CURLOPT_WRITEFUNCTION, +[](char*, size_t size, size_t n, void*) { return size * n; });
+  if (state.range(0) == 0) {
+    curl_easy_setopt(easy.get(), CURLOPT_FORBID_REUSE, 1L);
+  }
+  bool failed = false;
+  for (auto _ : state) {
+    failed = failed || curl_easy_perform(easy.get()) != CURLE_OK;
+  }
+  curl_slist_free_all(headers);
+  if (failed) {
+    state.SkipWithError("a request failed");
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
 void BM_PostsInFlight(benchmark::State& state) {
   Setup setup(true);
   auto helper = ReportingSessionConnectivityHelper::initWithDelegate({}, 4);
@@ -112,6 +145,7 @@ void BM_LargeGet(benchmark::State& state) {
 }
 
 BENCHMARK(BM_DataPostRoundTrip)->ArgName("keepAlive")->Arg(0)->Arg(1)->UseRealTime();
+BENCHMARK(BM_ReferenceCurlEasyPost)->ArgName("keepAlive")->Arg(0)->Arg(1)->UseRealTime();
 BENCHMARK(BM_UploadPostRoundTrip)->ArgName("keepAlive")->Arg(0)->Arg(1)->UseRealTime();
 BENCHMARK(BM_PostsInFlight)->Arg(64)->UseRealTime();
 BENCHMARK(BM_LargeGet)->UseRealTime();
