@@ -1,3 +1,4 @@
+#include "platform/OpenSSLHandles.h"
 #include "config/StorebagSigner.h"
 
 #include <openssl/bio.h>
@@ -16,17 +17,6 @@ namespace zerith {
 
 namespace {
 
-struct PkeyFree {
-  void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
-};
-struct BioFree {
-  void operator()(BIO* bio) const { BIO_free(bio); }
-};
-struct MdCtxFree {
-  void operator()(EVP_MD_CTX* ctx) const { EVP_MD_CTX_free(ctx); }
-};
-using PkeyPtr = std::unique_ptr<EVP_PKEY, PkeyFree>;
-using BioPtr = std::unique_ptr<BIO, BioFree>;
 
 // The reason OpenSSL gives for its last failure (clears its queue).
 std::string failure(const char* what) {
@@ -49,9 +39,9 @@ bool fail(std::string* error, const char* what) {
   return false;
 }
 
-PkeyPtr readPrivateKey(const std::string& pem, std::string* error) {
-  BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
-  PkeyPtr key(bio ? PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, nullptr) : nullptr);
+ossl::PkeyPtr readPrivateKey(const std::string& pem, std::string* error) {
+  ossl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+  ossl::PkeyPtr key(bio ? PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, nullptr) : nullptr);
   if (!key) {
     fail(error, "not a PEM private key");
     return nullptr;
@@ -78,12 +68,12 @@ std::optional<Data> publicDER(EVP_PKEY* key, std::string* error) {
 }  // namespace
 
 std::optional<StorebagKeyPair> generateStorebagKeyPair(int bits, std::string* error) {
-  PkeyPtr key(EVP_RSA_gen(static_cast<unsigned>(bits)));
+  ossl::PkeyPtr key(EVP_RSA_gen(static_cast<unsigned>(bits)));
   if (!key) {
     fail(error, "RSA key generation failed");
     return std::nullopt;
   }
-  BioPtr bio(BIO_new(BIO_s_mem()));
+  ossl::BioPtr bio(BIO_new(BIO_s_mem()));
   if (!bio || PEM_write_bio_PrivateKey(bio.get(), key.get(), nullptr, nullptr, 0, nullptr, nullptr) != 1) {
     fail(error, "cannot encode the private key");
     return std::nullopt;
@@ -98,17 +88,17 @@ std::optional<StorebagKeyPair> generateStorebagKeyPair(int bits, std::string* er
 }
 
 std::optional<Data> storebagPublicKeyFromPrivate(const std::string& privateKeyPEM, std::string* error) {
-  PkeyPtr key = readPrivateKey(privateKeyPEM, error);
+  ossl::PkeyPtr key = readPrivateKey(privateKeyPEM, error);
   return key ? publicDER(key.get(), error) : std::nullopt;
 }
 
 std::optional<Data> signStorebagBytes(const std::string& privateKeyPEM, std::span<const std::uint8_t> bag,
                                       std::string* error) {
-  PkeyPtr key = readPrivateKey(privateKeyPEM, error);
+  ossl::PkeyPtr key = readPrivateKey(privateKeyPEM, error);
   if (!key) {
     return std::nullopt;
   }
-  std::unique_ptr<EVP_MD_CTX, MdCtxFree> ctx(EVP_MD_CTX_new());
+  ossl::MdCtxPtr ctx(EVP_MD_CTX_new());
   EVP_PKEY_CTX* pctx = nullptr;  // owned by ctx
   std::size_t length = 0;
   if (!ctx || EVP_DigestSignInit(ctx.get(), &pctx, EVP_sha1(), nullptr, key.get()) != 1 ||

@@ -1,3 +1,4 @@
+#include "platform/OpenSSLHandles.h"
 #include "config/StorebagVerify.h"
 
 #include <openssl/err.h>
@@ -23,13 +24,6 @@ const log::Logger& logger() {
   return l;
 }
 
-struct PkeyFree {
-  void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
-};
-struct MdCtxFree {
-  void operator()(EVP_MD_CTX* ctx) const { EVP_MD_CTX_free(ctx); }
-};
-using PkeyPtr = std::unique_ptr<EVP_PKEY, PkeyFree>;
 
 // A DER key file is a few hundred bytes; anything far larger is not one.
 constexpr std::size_t kMaxPublicKeyBytes = 64u << 10;
@@ -37,13 +31,13 @@ constexpr std::size_t kMaxPublicKeyBytes = 64u << 10;
 // An RSA public key from DER: SubjectPublicKeyInfo (what `openssl rsa
 // -pubout` writes) or a bare PKCS#1 RSAPublicKey. The whole input must be
 // the key.
-PkeyPtr rsaPublicKeyFromDER(const Data& der) {
+ossl::PkeyPtr rsaPublicKeyFromDER(const Data& der) {
   if (der.empty() || der.size() > kMaxPublicKeyBytes) {
     return nullptr;
   }
   const long length = static_cast<long>(der.size());
   const unsigned char* p = der.data();
-  PkeyPtr key(d2i_PUBKEY(nullptr, &p, length));
+  ossl::PkeyPtr key(d2i_PUBKEY(nullptr, &p, length));
   if (!key || p != der.data() + der.size()) {
     p = der.data();
     key.reset(d2i_PublicKey(EVP_PKEY_RSA, nullptr, &p, length));
@@ -60,7 +54,7 @@ PkeyPtr rsaPublicKeyFromDER(const Data& der) {
 
 // RSA PKCS#1 v1.5 over the SHA-1 digest of `message`.
 bool verifySha1Rsa(EVP_PKEY* key, const Data& signature, const Data& message) {
-  std::unique_ptr<EVP_MD_CTX, MdCtxFree> ctx(EVP_MD_CTX_new());
+  ossl::MdCtxPtr ctx(EVP_MD_CTX_new());
   EVP_PKEY_CTX* pctx = nullptr;  // owned by ctx
   bool ok = ctx && EVP_DigestVerifyInit(ctx.get(), &pctx, EVP_sha1(), nullptr, key) == 1 &&
             EVP_PKEY_CTX_set_rsa_padding(pctx, RSA_PKCS1_PADDING) == 1 &&
@@ -93,7 +87,7 @@ StorebagVerification verifyStorebagContainer(std::span<const std::uint8_t> conta
     result.status = StorebagVerifyStatus::SignatureMissing;
     return result;
   }
-  PkeyPtr key = publicKeyDER ? rsaPublicKeyFromDER(*publicKeyDER) : nullptr;
+  ossl::PkeyPtr key = publicKeyDER ? rsaPublicKeyFromDER(*publicKeyDER) : nullptr;
   if (!key) {
     result.status = StorebagVerifyStatus::BadPublicKey;
     return result;

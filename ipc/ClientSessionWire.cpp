@@ -51,22 +51,6 @@ const std::array<OperationSpec, 13> kSessionOperations = {{
 
 const OperationSpec kSendMessageToClientOperation = {kSendMessageToClient, kSendMessageToClientArgs, false};
 
-const char* kindOf(const Value& v) {
-  switch (v.type()) {
-    case Value::Type::Nil: return "nil";
-    case Value::Type::Bool: return "a boolean";
-    case Value::Type::Int:
-    case Value::Type::UInt: return "an integer";
-    case Value::Type::Real: return "a real";
-    case Value::Type::String: return "a string";
-    case Value::Type::Data: return "data";
-    case Value::Type::Date: return "a date";
-    case Value::Type::Array: return "an array";
-    case Value::Type::Dict: return "a dictionary";
-  }
-  return "a value";
-}
-
 bool isInteger(const Value& v) { return v.type() == Value::Type::Int || v.type() == Value::Type::UInt; }
 
 bool inRange(const Value& v, long long low, long long high) {
@@ -120,7 +104,7 @@ std::optional<std::string> checkArguments(const OperationSpec& op, const Diction
       // An integer out of range names its value: "must be ..., not 70000".
       const std::string got = v.type() == Value::Type::UInt ? std::to_string(v.unsignedValue())
                               : v.type() == Value::Type::Int ? std::to_string(v.intValue())
-                                                             : std::string(kindOf(v));
+                                                             : std::string(v.kindName());
       return fmt::format("Argument \"{}\" of {} must be {}, not {}", spec.name, op.name, expected, got);
     }
   }

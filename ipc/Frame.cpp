@@ -26,23 +26,6 @@ std::optional<std::uint64_t> callNumber(const Value& v) {
   return std::nullopt;
 }
 
-// "an array", "a string": for messages about a value of the wrong kind.
-const char* typeName(const Value& v) {
-  switch (v.type()) {
-    case Value::Type::Nil: return "nil";
-    case Value::Type::Bool: return "a boolean";
-    case Value::Type::Int:
-    case Value::Type::UInt: return "an integer";
-    case Value::Type::Real: return "a real";
-    case Value::Type::String: return "a string";
-    case Value::Type::Data: return "data";
-    case Value::Type::Date: return "a date";
-    case Value::Type::Array: return "an array";
-    case Value::Type::Dict: return "a dictionary";
-  }
-  return "a value";
-}
-
 // Strict UTF-8: no overlong forms, no surrogates, nothing above U+10FFFF.
 bool validUtf8(std::string_view s) {
   const auto* p = reinterpret_cast<const unsigned char*>(s.data());
@@ -195,7 +178,7 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
     return std::nullopt;
   }
   if (!root->isDict()) {
-    setWhy(why, fmt::format("message is {}, not a dictionary", typeName(*root)));
+    setWhy(why, fmt::format("message is {}, not a dictionary", root->kindName()));
     return std::nullopt;
   }
   if (!allTextValid(*root)) {
@@ -204,7 +187,7 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
   }
   const Value args = (*root)["args"];
   if (!args.isNil() && !args.isDict()) {
-    setWhy(why, fmt::format("message \"args\" is {}, not a dictionary", typeName(args)));
+    setWhy(why, fmt::format("message \"args\" is {}, not a dictionary", args.kindName()));
     return std::nullopt;
   }
   const Value op = (*root)["op"];
@@ -212,7 +195,7 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
   IncomingMessage message;
   if (!op.isNil()) {
     if (!op.isString()) {
-      setWhy(why, fmt::format("message \"op\" is {}, not a string", typeName(op)));
+      setWhy(why, fmt::format("message \"op\" is {}, not a string", op.kindName()));
       return std::nullopt;
     }
     if (!reply.isNil()) {
@@ -248,7 +231,7 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
   const Value error = (*root)["error"];
   if (!error.isNil()) {
     if (!error.isDict()) {
-      setWhy(why, fmt::format("reply \"error\" is {}, not a dictionary", typeName(error)));
+      setWhy(why, fmt::format("reply \"error\" is {}, not a dictionary", error.kindName()));
       return std::nullopt;
     }
     message.replyError = Error::fromValue(error);

@@ -358,6 +358,22 @@ std::size_t bufferSize(const Container& c) {
 }
 }  // namespace
 
+const char* Value::kindName() const {
+  switch (type()) {
+    case Type::Nil: return "nil";
+    case Type::Bool: return "a boolean";
+    case Type::Int:
+    case Type::UInt: return "an integer";
+    case Type::Real: return "a real";
+    case Type::String: return "a string";
+    case Type::Data: return "data";
+    case Type::Date: return "a date";
+    case Type::Array: return "an array";
+    case Type::Dict: return "a dictionary";
+  }
+  return "a value";
+}
+
 std::string Value::description() const {
   std::string out;
   describe(*this, out);

@@ -135,6 +135,10 @@ class Value {
 
   bool operator==(const Value& other) const;
 
+  // "a dictionary", "an integer", "nil": for messages about a value of the
+  // wrong kind.
+  const char* kindName() const;
+
   // A readable one-line rendering for log messages.
   std::string description() const;
 

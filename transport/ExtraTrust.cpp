@@ -1,3 +1,4 @@
+#include "platform/OpenSSLHandles.h"
 #include "transport/ExtraTrust.h"
 
 #include <curl/curl.h>
@@ -25,12 +26,6 @@ const log::Logger& logger() {
   return *l;
 }
 
-struct BioFree {
-  void operator()(BIO* b) const { BIO_free(b); }
-};
-struct X509Free {
-  void operator()(X509* x) const { X509_free(x); }
-};
 
 bool writeAll(int fd, const std::string& bytes) {
   std::size_t done = 0;
@@ -75,15 +70,15 @@ bool ExtraTrust::setFileLocked(const std::string& path) {
     bundle_.clear();
     return true;
   }
-  std::unique_ptr<BIO, BioFree> in(BIO_new_file(path.c_str(), "r"));
+  ossl::BioPtr in(BIO_new_file(path.c_str(), "r"));
   if (!in) {
     ERR_clear_error();
     logger().error("URLSession: cannot read the extra CA file {}", path);
     return false;
   }
-  std::unique_ptr<BIO, BioFree> out(BIO_new(BIO_s_mem()));
+  ossl::BioPtr out(BIO_new(BIO_s_mem()));
   std::size_t count = 0;
-  while (std::unique_ptr<X509, X509Free> cert{PEM_read_bio_X509(in.get(), nullptr, nullptr, nullptr)}) {
+  while (ossl::X509Ptr cert{PEM_read_bio_X509(in.get(), nullptr, nullptr, nullptr)}) {
     PEM_write_bio_X509(out.get(), cert.get());
     ++count;
   }

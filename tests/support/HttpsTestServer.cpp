@@ -1,3 +1,4 @@
+#include "platform/OpenSSLHandles.h"
 #include "tests/support/HttpsTestServer.h"
 
 #include <arpa/inet.h>
@@ -26,18 +27,9 @@ bool equalsIgnoringCase(std::string_view a, std::string_view b) {
   return a.size() == b.size() && ::strncasecmp(a.data(), b.data(), a.size()) == 0;
 }
 
-struct PkeyFree {
-  void operator()(EVP_PKEY* p) const { EVP_PKEY_free(p); }
-};
-struct X509Free {
-  void operator()(X509* p) const { X509_free(p); }
-};
-struct BioFree {
-  void operator()(BIO* p) const { BIO_free(p); }
-};
 
-std::unique_ptr<BIO, BioFree> memoryBio(const std::string& pem) {
-  std::unique_ptr<BIO, BioFree> bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+ossl::BioPtr memoryBio(const std::string& pem) {
+  ossl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
   if (!bio) {
     throw std::runtime_error("HttpsTestServer: BIO allocation failed");
   }
@@ -81,8 +73,8 @@ std::size_t RecordedRequest::headerCount(std::string_view name) const {
 }
 
 struct HttpsTestServer::Impl {
-  std::unique_ptr<X509, X509Free> certificate;
-  std::unique_ptr<EVP_PKEY, PkeyFree> key;
+  ossl::X509Ptr certificate;
+  ossl::PkeyPtr key;
   std::unique_ptr<httplib::SSLServer> server;
   std::thread thread;
   int port = 0;

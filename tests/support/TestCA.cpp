@@ -1,3 +1,4 @@
+#include "platform/OpenSSLHandles.h"
 #include "tests/support/TestCA.h"
 
 #include <openssl/bio.h>
@@ -18,29 +19,11 @@ namespace zerith::test {
 
 namespace {
 
-struct PkeyFree {
-  void operator()(EVP_PKEY* p) const { EVP_PKEY_free(p); }
-};
-struct X509Free {
-  void operator()(X509* p) const { X509_free(p); }
-};
-struct BioFree {
-  void operator()(BIO* p) const { BIO_free(p); }
-};
-struct ExtFree {
-  void operator()(X509_EXTENSION* p) const { X509_EXTENSION_free(p); }
-};
-struct BnFree {
-  void operator()(BIGNUM* p) const { BN_free(p); }
-};
-using PkeyPtr = std::unique_ptr<EVP_PKEY, PkeyFree>;
-using X509Ptr = std::unique_ptr<X509, X509Free>;
-using BioPtr = std::unique_ptr<BIO, BioFree>;
 
 [[noreturn]] void fail(const char* what) { throw std::runtime_error(std::string("TestCA: ") + what); }
 
-PkeyPtr newKey() {
-  PkeyPtr key(EVP_EC_gen("P-256"));
+ossl::PkeyPtr newKey() {
+  ossl::PkeyPtr key(EVP_EC_gen("P-256"));
   if (!key) {
     fail("key generation failed");
   }
@@ -51,18 +34,18 @@ void addExtension(X509* cert, X509* issuer, int nid, const std::string& value) {
   X509V3_CTX ctx;
   X509V3_set_ctx_nodb(&ctx);
   X509V3_set_ctx(&ctx, issuer, cert, nullptr, nullptr, 0);
-  std::unique_ptr<X509_EXTENSION, ExtFree> ext(X509V3_EXT_conf_nid(nullptr, &ctx, nid, value.c_str()));
+  ossl::X509ExtensionPtr ext(X509V3_EXT_conf_nid(nullptr, &ctx, nid, value.c_str()));
   if (!ext || X509_add_ext(cert, ext.get(), -1) != 1) {
     fail("extension rejected");
   }
 }
 
-X509Ptr newCertificate(EVP_PKEY* subjectKey, const std::string& commonName) {
-  X509Ptr cert(X509_new());
+ossl::X509Ptr newCertificate(EVP_PKEY* subjectKey, const std::string& commonName) {
+  ossl::X509Ptr cert(X509_new());
   if (!cert || X509_set_version(cert.get(), X509_VERSION_3) != 1) {
     fail("certificate allocation failed");
   }
-  std::unique_ptr<BIGNUM, BnFree> serial(BN_new());
+  ossl::BignumPtr serial(BN_new());
   if (!serial || BN_rand(serial.get(), 63, BN_RAND_TOP_ANY, BN_RAND_BOTTOM_ANY) != 1 ||
       !BN_to_ASN1_INTEGER(serial.get(), X509_get_serialNumber(cert.get()))) {
     fail("serial number failed");
@@ -79,7 +62,7 @@ X509Ptr newCertificate(EVP_PKEY* subjectKey, const std::string& commonName) {
 }
 
 std::string pemOf(X509* cert) {
-  BioPtr bio(BIO_new(BIO_s_mem()));
+  ossl::BioPtr bio(BIO_new(BIO_s_mem()));
   if (!bio || PEM_write_bio_X509(bio.get(), cert) != 1) {
     fail("PEM encoding failed");
   }
@@ -89,7 +72,7 @@ std::string pemOf(X509* cert) {
 }
 
 std::string pemOf(EVP_PKEY* key) {
-  BioPtr bio(BIO_new(BIO_s_mem()));
+  ossl::BioPtr bio(BIO_new(BIO_s_mem()));
   if (!bio || PEM_write_bio_PrivateKey(bio.get(), key, nullptr, nullptr, 0, nullptr, nullptr) != 1) {
     fail("PEM encoding failed");
   }
@@ -109,8 +92,8 @@ void writeFile(const std::filesystem::path& path, const std::string& contents) {
 }  // namespace
 
 struct TestCA::Impl {
-  PkeyPtr key;
-  X509Ptr certificate;
+  ossl::PkeyPtr key;
+  ossl::X509Ptr certificate;
   std::string pem;
 
   std::mutex mutex;
@@ -172,9 +155,9 @@ const std::string& TestCA::certificatePem() const { return impl_->pem; }
 
 IssuedCertificate TestCA::issueServerCertificate(const std::vector<std::string>& dnsNames,
                                                  const std::vector<std::string>& ipAddresses) const {
-  PkeyPtr key = newKey();
+  ossl::PkeyPtr key = newKey();
   const std::string cn = dnsNames.empty() ? (ipAddresses.empty() ? "server" : ipAddresses.front()) : dnsNames.front();
-  X509Ptr cert = newCertificate(key.get(), cn);
+  ossl::X509Ptr cert = newCertificate(key.get(), cn);
   X509_set_issuer_name(cert.get(), X509_get_subject_name(impl_->certificate.get()));
   std::string san;
   for (const auto& d : dnsNames) {
