@@ -7,16 +7,11 @@
 
 #include "config/DeviceInfo.h"
 #include "platform/Defaults.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 // Indexed by client type; nullptr where a type has no storebag. Several
 // types share one bag: the storebag is per product area, not per client.
@@ -60,12 +55,12 @@ ZerithEnvironmentType userDefaultsEnvironment() {
     // Read as an integer and taken as unsigned: -1 is 4294967295.
     type = static_cast<ZerithEnvironmentType>(stored.intValue());
     if (type > kEnvironmentRelease) {
-      logger().error("userDefaultsEnvironment: Invalid environment type {}", type);
+      configLogger().error("userDefaultsEnvironment: Invalid environment type {}", type);
       type = kEnvironmentInternal;
     }
   }
   gEnvironmentType.store(type, std::memory_order_relaxed);
-  logger().info("userDefaultsEnvironment: Environment type {}", type);
+  configLogger().info("userDefaultsEnvironment: Environment type {}", type);
   return type;
 }
 

@@ -4,16 +4,11 @@
 
 #include <limits>
 
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 // The stream is initialised with the version text "1.2.11". zlib only
 // compares the first character with its own version, so Debian's 1.2.13
@@ -70,11 +65,11 @@ const char* deflateErrorMessage(int code) {
 
 std::optional<Data> compressDataWithZlibOrGzip(bool gzip, std::span<const std::uint8_t> data) {
   if (data.empty()) {
-    logger().error("compressDataWithZlibOrGzip: Cannot compress empty QFData");
+    configLogger().error("compressDataWithZlibOrGzip: Cannot compress empty QFData");
     return std::nullopt;
   }
   if (data.size() > std::numeric_limits<uInt>::max()) {
-    logger().error("compressDataWithZlibOrGzip: Cannot compress {} bytes in one pass", data.size());
+    configLogger().error("compressDataWithZlibOrGzip: Cannot compress {} bytes in one pass", data.size());
     return std::nullopt;
   }
 
@@ -84,7 +79,7 @@ std::optional<Data> compressDataWithZlibOrGzip(bool gzip, std::span<const std::u
   const int init = ::deflateInit2_(&stream, Z_DEFAULT_COMPRESSION, Z_DEFLATED, gzip ? 31 : 15, 8,
                                    Z_DEFAULT_STRATEGY, kZlibVersionText, static_cast<int>(sizeof(z_stream)));
   if (init != Z_OK) {
-    logger().error("compressDataWithZlibOrGzip: deflateInit2() Error: \"{}\" Message: \"{}\"",
+    configLogger().error("compressDataWithZlibOrGzip: deflateInit2() Error: \"{}\" Message: \"{}\"",
                    compression::initErrorMessage(init), streamMessage(stream));
     return std::nullopt;
   }
@@ -102,12 +97,12 @@ std::optional<Data> compressDataWithZlibOrGzip(bool gzip, std::span<const std::u
     if (rc == Z_STREAM_END) {
       break;
     }
-    logger().error("compressDataWithZlibOrGzip: zlib error while attempting compression: \"{}\" Message: \"{}\"",
+    configLogger().error("compressDataWithZlibOrGzip: zlib error while attempting compression: \"{}\" Message: \"{}\"",
                    compression::deflateErrorMessage(rc), streamMessage(stream));
     return std::nullopt;
   }
   out.resize(stream.total_out);
-  logger().debug("compressDataWithZlibOrGzip: Compressed file from {} to {}", data.size(), out.size());
+  configLogger().debug("compressDataWithZlibOrGzip: Compressed file from {} to {}", data.size(), out.size());
   return out;
 }
 

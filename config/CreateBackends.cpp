@@ -4,18 +4,13 @@
 
 #include "config/ClientTypes.h"
 #include "config/DeviceInfo.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 #include "zerith/ZerithBundle.h"
 #include "zerith/ZerithConstants.h"
 
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 std::optional<std::string> stringOf(const Value& v) {
   return v.string() ? std::optional<std::string>(*v.string()) : std::nullopt;
@@ -26,11 +21,11 @@ std::optional<std::string> stringOf(const Value& v) {
 std::optional<BackendDictionary> createBackends(const Value& storebagSection, const Value& sessionInfo,
                                                 const Value& userInfo, const char* udid) {
   if (storebagSection.isNil()) {
-    logger().error("createBackends: Attempted to create backends with nil storebag");
+    configLogger().error("createBackends: Attempted to create backends with nil storebag");
     return std::nullopt;
   }
   if (sessionInfo.isNil()) {
-    logger().error("createBackends: Attempted to create backends with nil session info");
+    configLogger().error("createBackends: Attempted to create backends with nil session info");
     return std::nullopt;
   }
 

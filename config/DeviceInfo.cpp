@@ -14,7 +14,7 @@
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
 
@@ -23,11 +23,6 @@ namespace zerith {
 namespace {
 
 namespace fs = std::filesystem;
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 // Fixed key of this application: device identifiers of zerithd cannot be
 // correlated with the machine id or with other applications' derivations.
@@ -123,13 +118,13 @@ Value parseDeviceFileAt(const fs::path& path, bool exists) {
   }
   auto bytes = file::readAll(path, kDeviceFileLimits.maxBytes);
   if (!bytes) {
-    logger().error("Device facts: cannot read device file {}; using the system's own facts", path.string());
+    configLogger().error("Device facts: cannot read device file {}; using the system's own facts", path.string());
     return Value();
   }
   std::string why;
   auto facts = device::parseDeviceFile(plist::bytesOf(*bytes), &why);
   if (!facts) {
-    logger().error("Device facts: ignoring device file {}: {}", path.string(), why);
+    configLogger().error("Device facts: ignoring device file {}: {}", path.string(), why);
     return Value();
   }
   return *facts;
@@ -184,7 +179,7 @@ std::optional<std::string> uniqueDeviceID() {
         auto text = readSmallFile(path);
         auto id = text ? device::uniqueDeviceIDFromMachineID(*text) : std::nullopt;
         if (!id) {
-          logger().error("Device facts: {} holds no machine id; the device has no UniqueDeviceID", path.string());
+          configLogger().error("Device facts: {} holds no machine id; the device has no UniqueDeviceID", path.string());
         }
         return id;
       });
@@ -276,7 +271,7 @@ Value deviceInformationValue(std::string_view key) {
     if (answer.isString()) {
       return answer;
     }
-    logger().debug("Device facts: {} of the device file is not a string; ignored", key);
+    configLogger().debug("Device facts: {} of the device file is not a string; ignored", key);
   }
   if (auto fact = linuxFact(key)) {
     return Value(std::move(*fact));

@@ -9,17 +9,12 @@
 #include "config/ClientTypes.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 #include "zerith/ZerithConstants.h"
 
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 std::string lowercased(std::string s) {
   std::transform(s.begin(), s.end(), s.begin(),
@@ -44,7 +39,7 @@ std::string getPersistentIdentifierForCustomClientIDSuffix(const std::optional<s
     value = crypto::newUUIDString();
     defaults.setObject(key, Value(value));
   }
-  logger().info("getPersistentIdentifierForCustomClientIDSuffix: The value for {}: {}", key, value);
+  configLogger().info("getPersistentIdentifierForCustomClientIDSuffix: The value for {}: {}", key, value);
   return value;
 }
 

@@ -16,7 +16,7 @@
 #include <vector>
 
 #include "platform/FileUtil.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 #include "platform/Paths.h"
 #include "platform/Value.h"
 
@@ -25,11 +25,6 @@ namespace zerith {
 namespace {
 
 namespace fs = std::filesystem;
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 constexpr std::string_view kPrefix = "zerithd";
 constexpr std::string_view kSuffix = "messageLog.diag";
@@ -50,11 +45,11 @@ std::optional<Current> rotate(const fs::path& folder, double now, const MessageL
   std::vector<std::string> names;
   std::unique_ptr<DIR, int (*)(DIR*)> dir(::opendir(folder.c_str()), ::closedir);
   if (!dir && errno == ENOENT) {
-    logger().info("writeToLogFile: Creating zerithd log directory at {}", folder.string());
+    configLogger().info("writeToLogFile: Creating zerithd log directory at {}", folder.string());
     std::error_code createError;
     fs::create_directories(folder, createError);
   } else if (!dir) {
-    logger().error("writeToLogFile: Error reading from log directory: {}",
+    configLogger().error("writeToLogFile: Error reading from log directory: {}",
                    std::error_code(errno, std::generic_category()).message());
   } else {
     while (const dirent* entry = ::readdir(dir.get())) {
@@ -97,10 +92,10 @@ std::optional<fs::path> startNewFile(const fs::path& folder, double now) {
   const fs::path path = folder / messageLogFileName(static_cast<std::int64_t>(now));
   file::UniqueFd fd(::open(path.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
   if (::access(path.c_str(), F_OK) != 0) {
-    logger().error("writeToLogFile: Failed to create new zerithd log file {}", path.string());
+    configLogger().error("writeToLogFile: Failed to create new zerithd log file {}", path.string());
     return std::nullopt;
   }
-  logger().info("writeToLogFile: Created new zerithd log file {} ({})", path.string(), dateDescription(now));
+  configLogger().info("writeToLogFile: Created new zerithd log file {} ({})", path.string(), dateDescription(now));
   return path;
 }
 
@@ -112,7 +107,7 @@ AppendResult appendLine(const fs::path& path, std::string_view line) {
     if (errno == ENOENT) {
       return AppendResult::Vanished;
     }
-    logger().error("writeToLogFile: Failed to write log message to {}: {}", path.string(), std::strerror(errno));
+    configLogger().error("writeToLogFile: Failed to write log message to {}: {}", path.string(), std::strerror(errno));
     return AppendResult::Failed;
   }
   // One write carries the whole line; a short write (a full disk, a signal)
@@ -123,7 +118,7 @@ AppendResult appendLine(const fs::path& path, std::string_view line) {
       continue;
     }
     if (n <= 0) {
-      logger().error("writeToLogFile: Failed to write log message to {}: {}", path.string(),
+      configLogger().error("writeToLogFile: Failed to write log message to {}: {}", path.string(),
                      n < 0 ? std::strerror(errno) : "nothing written");
       return AppendResult::Failed;
     }
@@ -153,7 +148,7 @@ void MessageLog::write(std::string_view message) const {
     line.append("(").append(dateDescription(now)).append(") ").append(message).append("\n");
     switch (appendLine(path, line)) {
       case AppendResult::Written:
-        logger().info("writeToLogFile: Saved log message to {}", path.string());
+        configLogger().info("writeToLogFile: Saved log message to {}", path.string());
         return;
       case AppendResult::Failed:
         return;
@@ -161,13 +156,13 @@ void MessageLog::write(std::string_view message) const {
         continue;
     }
   }
-  logger().error("writeToLogFile: Gave up writing log message: the log file kept disappearing");
+  configLogger().error("writeToLogFile: Gave up writing log message: the log file kept disappearing");
 }
 
 void deleteExpiredLogFile(const fs::path& path, std::optional<double> creationDate) {
   std::error_code ignored;
   fs::remove(path, ignored);
-  logger().info("writeToLogFile: Deleted expired zerithd log file {} ({})", path.string(), describe(creationDate));
+  configLogger().info("writeToLogFile: Deleted expired zerithd log file {} ({})", path.string(), describe(creationDate));
 }
 
 bool isMessageLogFileName(std::string_view name) {

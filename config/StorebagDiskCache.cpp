@@ -13,17 +13,12 @@
 
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 #include "platform/Paths.h"
 
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 constexpr std::int32_t kDefaultMaxAge = 86400;
 
@@ -72,7 +67,7 @@ bool saveStorebagToDisk(const std::string& name, const Data& data) {
     return true;
   }
   const int err = errno;
-  logger().error("saveStorebagToDisk: could not save storebag '{}' to file '{}'. Error is '{}'", name, path.string(),
+  configLogger().error("saveStorebagToDisk: could not save storebag '{}' to file '{}'. Error is '{}'", name, path.string(),
                  err ? std::strerror(err) : "write failed");
   return false;
 }
@@ -95,7 +90,7 @@ std::optional<Data> loadStorebagFromDisk(const std::string& name) {
     }
     why = errno ? std::strerror(errno) : "read failed";
   }
-  logger().error("loadStorebagFromDisk: could not load storebag '{}' from file '{}'. Error is '{}'", name,
+  configLogger().error("loadStorebagFromDisk: could not load storebag '{}' from file '{}'. Error is '{}'", name,
                  path.string(), why);
   return std::nullopt;
 }
@@ -106,17 +101,17 @@ void getLastLoadedStorebagMetricsWithName(const std::string& name, std::int32_t*
   if (maxAgeOut) {
     const std::int64_t stored = defaultsObjectForKey(storebagMetricsKey(name, "max-age")).intValue();
     *maxAgeOut = static_cast<std::int32_t>(std::clamp<std::int64_t>(stored, INT32_MIN, INT32_MAX));
-    logger().debug("getLastLoadedStorebagMetricsWithName: maxAge is {} for storebag {}", *maxAgeOut, name);
+    configLogger().debug("getLastLoadedStorebagMetricsWithName: maxAge is {} for storebag {}", *maxAgeOut, name);
   }
   if (lastModifiedInOut) {
     const Value stored = defaultsObjectForKey(storebagMetricsKey(name, "Last-Modified"));
     if (const auto* s = stored.string()) {
       if (*lastModifiedInOut != *s) {
         *lastModifiedInOut = *s;
-        logger().debug("getLastLoadedStorebagMetricsWithName: 'Last-Modified' has changed to '{}' for storebag '{}'",
+        configLogger().debug("getLastLoadedStorebagMetricsWithName: 'Last-Modified' has changed to '{}' for storebag '{}'",
                        *s, name);
       } else {
-        logger().debug("getLastLoadedStorebagMetricsWithName: 'Last-Modified' has not changed for storebag '{}': '{}'",
+        configLogger().debug("getLastLoadedStorebagMetricsWithName: 'Last-Modified' has not changed for storebag '{}': '{}'",
                        name, *s);
         if (unchangedOut) {
           *unchangedOut = true;
@@ -160,7 +155,7 @@ void saveLastLoadedStorebagMetricsWithName(const std::string& name, const HTTPUR
   const auto lastModified = response.valueForHTTPHeaderField("Last-Modified");
   setDefaultsObjectForKey(storebagMetricsKey(name, "max-age"), Value(maxAge));
   setDefaultsObjectForKey(storebagMetricsKey(name, "Last-Modified"), lastModified ? Value(*lastModified) : Value());
-  logger().debug("saveLastLoadedStorebagMetricsWithName: New storebag '{}' received: maxAge {}, Last-Modified '{}'",
+  configLogger().debug("saveLastLoadedStorebagMetricsWithName: New storebag '{}' received: maxAge {}, Last-Modified '{}'",
                  name, maxAge, describe(lastModified));
 }
 

@@ -11,7 +11,7 @@
 #include "config/StorebagDiskCache.h"
 #include "config/StorebagServers.h"
 #include "config/StorebagVerify.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 #include "platform/PropertyList.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 #include "zerith/ZerithBundle.h"
@@ -19,11 +19,6 @@
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 constexpr std::int32_t kMaxRefreshCycle = 86400;
 constexpr double kStorebagRequestTimeout = 15;
@@ -78,7 +73,7 @@ Data buildFallbackStorebag() {
 std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchronous,
                                          const std::optional<std::string>& lastModified) {
   const std::string url = storebagRequestURL(name);
-  logger().debug("fetchNetworkStorebag: Storebag Server URL: {}", url);
+  configLogger().debug("fetchNetworkStorebag: Storebag Server URL: {}", url);
 
   URLRequest request;
   request.httpMethod = "GET";
@@ -86,7 +81,7 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
   request.ignoreLocalCache = true;
   request.timeoutSeconds = kStorebagRequestTimeout;
   if (lastModified) {
-    logger().debug("fetchNetworkStorebag: Adding 'Last-Modified: {}' to the header", *lastModified);
+    configLogger().debug("fetchNetworkStorebag: Adding 'Last-Modified: {}' to the header", *lastModified);
     request.setValue(*lastModified, "If-Modified-Since");
   }
 
@@ -104,11 +99,11 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
           if (!body.empty()) {
             parseAndVerifyStorebag(name, body, true);  // saves a verified copy; the caller reads it from disk
           } else {
-            logger().debug("fetchNetworkStorebag: received zero-length storebag for '{}\u2018, treat as unchanged",
+            configLogger().debug("fetchNetworkStorebag: received zero-length storebag for '{}\u2018, treat as unchanged",
                            name);
           }
         } else {
-          logger().debug(
+          configLogger().debug(
               "fetchNetworkStorebag: storebag '{}' does not need update as its content has not changed on the server",
               name);
         }
@@ -127,10 +122,10 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
   // ZerithdUtil's lock, which the caller does not hold here.
   wait->done.acquire();
   if (wait->error || wait->statusCode != 200) {
-    logger().info("fetchNetworkStorebag: Error resolving with lookup server {}, sendSynchronousRequest error {}", url,
+    configLogger().info("fetchNetworkStorebag: Error resolving with lookup server {}, sendSynchronousRequest error {}", url,
                   wait->error ? wait->error->description : std::string("(null)"));
     if (name == kFallbackStorebagName) {
-      logger().info("fetchNetworkStorebag: Loading default storebag '{}'", name);
+      configLogger().info("fetchNetworkStorebag: Loading default storebag '{}'", name);
       return buildFallbackStorebag();
     }
     return std::nullopt;
@@ -154,7 +149,7 @@ Value fetchStorebagWithName(const std::string& name, std::int32_t& maxAgeOut, bo
     const double age =
         modified ? std::fabs(Date::now().secondsSince1970 - modified->secondsSince1970) : static_cast<double>(INFINITY);
     const bool expired = age > static_cast<double>(maxAgeOut);
-    logger().info("fetchStorebagWithName: storebag '{}' loaded from disk cache. Disk cache {} refreshed", name,
+    configLogger().info("fetchStorebagWithName: storebag '{}' loaded from disk cache. Disk cache {} refreshed", name,
                   expired ? "expired and will be" : "is valid and will not be");
     lock.unlock();
     if (expired) {
@@ -176,14 +171,14 @@ Value fetchStorebagForEnvironmentAndClientType(std::int32_t clientType, std::int
                                                bool& unchangedOut) {
   const auto name = storebagNameForClientType(static_cast<ZerithClientType>(clientType));
   if (!name) {
-    logger().error("fetchStorebagForEnvironmentAndClientType: Could not find storebag name for client type {}",
+    configLogger().error("fetchStorebagForEnvironmentAndClientType: Could not find storebag name for client type {}",
                    clientType);
     return Value();
   }
   const Value storebag = fetchStorebagWithName(*name, maxAgeOut, unchangedOut);
   if (storebag.isNil()) {
     if (!unchangedOut) {
-      logger().error("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type {}",
+      configLogger().error("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type {}",
                      clientType);
     }
     return Value();
@@ -195,14 +190,14 @@ Value fetchStorebagForEnvironmentAndClientType(std::int32_t clientType, std::int
   if (!section.isDict()) {
     section = Value();
     if (environment == kEnvironmentSeed) {
-      logger().error("fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag.");
+      configLogger().error("fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag.");
       sectionName = "release";
       if (Value release = storebag["release"]; release.isDict()) {
         section = release;
       }
     }
     if (section.isNil()) {
-      logger().error("fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type {} with {} "
+      configLogger().error("fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type {} with {} "
                      "environment",
                      clientType, sectionName.value_or("(null)"));
       return Value();
@@ -216,7 +211,7 @@ Value fetchStorebagForEnvironmentAndClientType(std::int32_t clientType, std::int
     const std::int64_t cycle = refreshCycle.intValue();
     maxAgeOut = cycle < kMaxRefreshCycle ? static_cast<std::int32_t>(std::max<std::int64_t>(cycle, INT32_MIN))
                                          : kMaxRefreshCycle;
-    logger().info("fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge={}", maxAgeOut);
+    configLogger().info("fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge={}", maxAgeOut);
   }
   return section;
 }

@@ -12,17 +12,12 @@
 #include "config/StorebagDiskCache.h"
 #include "platform/Crypto.h"
 #include "platform/FileUtil.h"
-#include "platform/Log.h"
+#include "config/ConfigLog.h"
 #include "zerith/ZerithBundle.h"
 
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("config");
-  return l;
-}
 
 
 // A DER key file is a few hundred bytes; anything far larger is not one.
@@ -126,28 +121,28 @@ Value parseAndVerifyStorebag(const std::string& name, const Data& data, bool sav
   const auto verification = verifyStorebagContainer(plist::bytesOf(data), file::readAll(keyPath, kMaxPublicKeyBytes));
   switch (verification.status) {
     case StorebagVerifyStatus::NotAPropertyList:
-      logger().error("fetchStorebagWithName: propertyListWithData error {}", verification.parseError);
-      logger().error("fetchStorebagWithName: Signature is missing");
+      configLogger().error("fetchStorebagWithName: propertyListWithData error {}", verification.parseError);
+      configLogger().error("fetchStorebagWithName: Signature is missing");
       return Value();
     case StorebagVerifyStatus::SignatureMissing:
-      logger().error("fetchStorebagWithName: Signature is missing");
+      configLogger().error("fetchStorebagWithName: Signature is missing");
       return Value();
     case StorebagVerifyStatus::BadPublicKey:
-      logger().error("fetchStorebagWithName: Could not create an RSA public key from '{}'", keyPath.string());
+      configLogger().error("fetchStorebagWithName: Could not create an RSA public key from '{}'", keyPath.string());
       return Value();
     case StorebagVerifyStatus::BadSignatureText:
-      logger().error("fetchStorebagWithName: Signature can not be decoded");
+      configLogger().error("fetchStorebagWithName: Signature can not be decoded");
       return Value();
     case StorebagVerifyStatus::BadBagText:
-      logger().error("fetchStorebagWithName: Storebag can not be decoded");
+      configLogger().error("fetchStorebagWithName: Storebag can not be decoded");
       return Value();
     case StorebagVerifyStatus::SignatureMismatch:
-      logger().error("fetchStorebagWithName: Signature can not be verified, {}", fmt::ptr(verification.keyIdentity));
+      configLogger().error("fetchStorebagWithName: Signature can not be verified, {}", fmt::ptr(verification.keyIdentity));
       return Value();
     case StorebagVerifyStatus::Verified: break;
   }
   if (save && saveStorebagToDisk(name, data)) {
-    logger().info("fetchStorebagWithName: storebag '{}' has been saved to disk cache", name);
+    configLogger().info("fetchStorebagWithName: storebag '{}' has been saved to disk cache", name);
   }
   return decodeStorebagBag(verification.bagBytes);
 }
