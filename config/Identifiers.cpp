@@ -44,21 +44,7 @@ std::string getPersistentIdentifierForCustomClientIDSuffix(const std::optional<s
 }
 
 std::optional<std::string> defaultsStringForKey(std::string_view key) {
-  const Value stored = Defaults(kZerithDefaultsDomain).objectForKey(key);
-  switch (stored.type()) {
-    case Value::Type::String:
-      return *stored.string();
-    case Value::Type::Bool:
-      return stored.boolValue() ? "1" : "0";
-    case Value::Type::Int:
-      return std::to_string(stored.intValue());
-    case Value::Type::UInt:
-      return std::to_string(stored.unsignedValue());
-    case Value::Type::Real:
-      return fmt::format("{}", stored.doubleValue());
-    default:
-      return std::nullopt;
-  }
+  return Defaults(kZerithDefaultsDomain).objectForKey(key).scalarText();
 }
 
 std::string clientServiceKey(const Value& userInfo) {

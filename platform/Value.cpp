@@ -358,6 +358,17 @@ std::size_t bufferSize(const Container& c) {
 }
 }  // namespace
 
+std::optional<std::string> Value::scalarText() const {
+  switch (type()) {
+    case Type::String: return *string();
+    case Type::Bool: return boolValue() ? "1" : "0";
+    case Type::Int: return fmt::format("{}", intValue());
+    case Type::UInt: return fmt::format("{}", unsignedValue());
+    case Type::Real: return fmt::format("{}", doubleValue());
+    default: return std::nullopt;
+  }
+}
+
 const char* Value::kindName() const {
   switch (type()) {
     case Type::Nil: return "nil";

@@ -139,6 +139,10 @@ class Value {
   // wrong kind.
   const char* kindName() const;
 
+  // The text of a scalar as settings are read: a string as it is, a boolean
+  // as "1" or "0", numbers in decimal; nullopt for anything else.
+  std::optional<std::string> scalarText() const;
+
   // A readable one-line rendering for log messages.
   std::string description() const;
 

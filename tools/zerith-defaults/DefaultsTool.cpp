@@ -63,17 +63,10 @@ std::optional<Value> parseTyped(const std::string& type, const std::string& text
 }
 
 std::string plainText(const Value& v) {
+  if (auto text = v.scalarText()) {
+    return *text;
+  }
   switch (v.type()) {
-    case Value::Type::String:
-      return *v.string();
-    case Value::Type::Bool:
-      return v.boolValue() ? "1" : "0";
-    case Value::Type::Int:
-      return std::to_string(v.intValue());
-    case Value::Type::UInt:
-      return std::to_string(v.unsignedValue());
-    case Value::Type::Real:
-      return fmt::format("{}", v.doubleValue());
     case Value::Type::Date:
       return dateDescription(v.date()->secondsSince1970);
     default:
