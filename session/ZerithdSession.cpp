@@ -238,6 +238,13 @@ void ZerithdSession::setSessionInfo(const Value& sessionInfo, const Value& userI
     const Value hierarchy = sessionInfo[kZerithSessionInfoHierarchyToken];
     fields_.hierarchyDictionary = hierarchy.isDict() ? hierarchy : Value();
   }
+  // The level is read as unsigned: a negative one lands far above every
+  // other level and finds no parent.
+  if (const std::int64_t level = sessionInfo[kZerithSessionInfoHierarchyToken][kZerithHierarchyTokenLevel].intValue();
+      level < 0) {
+    logger().error("setSessionInfo: Session {} has the negative hierarchy level {}, taken as {}", id, level,
+                   static_cast<std::uint32_t>(level));
+  }
   if (const auto d = delegate()) {
     d->updateCorrelatedSessions(*this);
   }
@@ -544,6 +551,11 @@ Value ZerithdSession::sendMessageWithDictionary(const Value& message) {
   const auto category = static_cast<std::uint16_t>(categoryValue.unsignedValue());
   const auto type = static_cast<std::uint16_t>(typeValue.unsignedValue());
   const Value payload = message[kZerithMessageParametersPayload];
+  if (!payload.isNil() && !payload.isDict()) {
+    logger().error("sendMessageWithDictionary: Dropping event with category {} as its payload is not a dictionary",
+                   category);
+    return {};
+  }
   const auto flag = static_cast<std::int32_t>(static_cast<std::uint32_t>(message[kZerithMessageParametersFlag].unsignedValue()));
   timeval now{};
   gettimeofday(&now, nullptr);
@@ -823,6 +835,11 @@ void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const 
 // --- Shared data -------------------------------------------------------------------
 
 void ZerithdSession::updateSharedDataWithDictionary(const Value& dictionary) {
+  if (!dictionary.isDict()) {
+    logger().error("updateSharedDataWithDictionary: Ignoring shared data of session {} as it is not a dictionary",
+                   sessionID());
+    return;
+  }
   if (const auto d = delegate()) {
     std::lock_guard lock(d->agentLock());
     d->updateSharedDataForSession(*this, dictionary);

@@ -207,6 +207,67 @@ TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutO
   EXPECT_NE(log.find(") [dashboard -> sendMessageWithDictionary] dash#2\n"), std::string::npos) << log;
 }
 
+TEST_F(SessionBackendsTest, PayloadThatIsNotADictionaryIsRefusedAndTheSessionGoesOn) {
+  useStorebag({{"recA", Value(Dictionary{})}});
+  auto c = started(sessionInfo(5));
+  EXPECT_TRUE(send(c, event(3, 1, Value("text"))).isNil());
+  EXPECT_TRUE(send(c, event(3, 1, Value(Array{Value(1)}))).isNil());
+  EXPECT_EQ(countExact(Level::Error,
+                       "sendMessageWithDictionary: Dropping event with category 3 as its payload is not a dictionary"),
+            2u);
+  send(c, event(3, 2, Value(Dictionary{{"ok", Value(true)}})));
+  const auto events = rec(c, "recA")->events();
+  ASSERT_EQ(events.size(), 2u);  // the start message and the good event
+  EXPECT_EQ(events[1].respCode, 2u);
+}
+
+TEST_F(SessionBackendsTest, SharedDataIsPerTokenAndBadOrOversizedUpdatesChangeNothing) {
+  useStorebag({{"recA", Value(Dictionary{})}});
+  auto a = started(hierarchyInfo(1, "call", 0));
+  auto b = started(hierarchyInfo(2, "call", 1));
+  auto other = started(hierarchyInfo(3, "meeting", 0));
+  auto alone = started(sessionInfo(4));
+  a.session->updateSharedDataForKey(Value("room"), Value("blue"));
+  alone.session->updateSharedDataForKey(Value("room"), Value("red"));  // no token: nothing happens
+  b.session->updateSharedDataWithDictionary(Value("not a dictionary"));
+  EXPECT_TRUE(logs.has(Level::Error,
+                       "updateSharedDataWithDictionary: Ignoring shared data of session 2 as it is not a dictionary"));
+  a.session->updateSharedDataForKey(Value("blob"), Value(Data(kSharedDataSizeLimit, 0x41)));
+  EXPECT_TRUE(logs.contains("updateSharedDataForSession: Refusing shared data of session 1 for hierarchyToken call"));
+  a.session->updateSharedDataForKey(Value(7), Value("x"));  // a key that is not a string
+  EXPECT_TRUE(logs.has(Level::Error, "updateSharedDataForKey: Ignoring shared data without a string key for session 1"));
+
+  for (auto* c : {&a, &b, &other, &alone}) {
+    send(*c, event(9, 9));
+  }
+  const Value shared(Dictionary{{"room", Value("blue")}});
+  EXPECT_EQ(rec(a, "recA")->events().back().message, Value(Dictionary{{"SharedData", shared}}));
+  EXPECT_EQ(rec(b, "recA")->events().back().message, Value(Dictionary{{"SharedData", shared}}));
+  EXPECT_EQ(rec(other, "recA")->events().back().message, Value(Dictionary{}));
+  EXPECT_EQ(rec(alone, "recA")->events().back().message, Value(Dictionary{}));
+}
+
+TEST_F(SessionBackendsTest, LevelsFarAboveTheOthersOrNegativeFindTheAggregatorWithoutWalkingEveryLevel) {
+  useStorebag({{"recA", Value(Dictionary{})}});
+  auto root = started(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  auto far = started(hierarchyInfo(2, "call", 4'000'000'000ll));
+  auto negative = started(hierarchyInfo(3, "call", -1));
+  EXPECT_TRUE(logs.has(Level::Error, "setSessionInfo: Session 3 has the negative hierarchy level -1, taken as 4294967295"));
+  EXPECT_EQ(negative.session->hierarchyLevel(), 4294967295u);
+  send(far, event(5, 1));
+  send(negative, event(6, 1));
+  std::vector<unsigned> atRoot;
+  for (const auto& m : aggregated(*root.connection)) {
+    atRoot.push_back(static_cast<unsigned>(m.get("category").unsignedValue()));
+  }
+  // Both start messages and both events reach the root's aggregator.
+  EXPECT_EQ(std::count(atRoot.begin(), atRoot.end(), 5u), 1);
+  EXPECT_EQ(std::count(atRoot.begin(), atRoot.end(), 6u), 1);
+  // Neither has a parent one level up: a gap, so no combined identifier.
+  EXPECT_EQ(rec(far, "recA")->combinedSessionIDString(), far.session->sessionIDString());
+  EXPECT_TRUE(logs.contains("parentSessionIDStringForSession: Found a gap in hierarchy"));
+}
+
 // --- Flush --------------------------------------------------------------------------------
 
 TEST_F(SessionBackendsTest, FlushCompletesOnceAtTheFirstErrorOrAfterTheLastBackend) {
