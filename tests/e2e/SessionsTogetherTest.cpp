@@ -9,6 +9,7 @@
 #include <fstream>
 #include <future>
 #include <regex>
+#include <sstream>
 #include <thread>
 
 #include "config/StorebagSigner.h"
@@ -17,6 +18,7 @@
 #include "tests/e2e/E2eFixture.h"
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/TestCA.h"
+#include "tools/zerith/ZerithCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -374,6 +376,64 @@ TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWo
   EXPECT_EQ(adaptorLinesOf(71, 4).size(), 1u);
   EXPECT_EQ(adaptorLinesOf(70, 1).size(), 0u);
   ASSERT_TRUE(child->flushMessages(10s));
+}
+
+TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
+  root.write("/var/tmp/script.jsonl", R"(# a call with one stream, a shared room, and a one-shot report
+{"session":"call","step":"open","clientType":7,"sessionID":81,"hierarchyToken":"cli","hierarchyLevel":0,"aggregation":true}
+{"session":"call","step":"start"}
+{"session":"call","step":"shared-data","dictionary":{"room":"green"}}
+{"session":"stream","step":"open","clientType":7,"sessionID":82,"hierarchyToken":"cli","hierarchyLevel":1}
+{"session":"stream","step":"start"}
+{"session":"stream","step":"send","category":90,"type":1,"payload":{"jitter":4}}
+{"session":"stream","step":"flush"}
+{"session":"solo","step":"open","clientType":7,"sessionID":83,"setInfo":false}
+{"session":"solo","step":"one-shot","category":91,"type":1,"payload":{"once":1}}
+{"session":"stream","step":"close"}
+{"session":"call","step":"finish"}
+)");
+  const std::string script = (root / "/var/tmp/script.jsonl").string();
+  const std::string rootPath = root.path().string();
+  const char* argv[] = {"zerith", "--root", rootPath.c_str(), "sessions", "--script", script.c_str()};
+  std::ostringstream out;
+  std::ostringstream err;
+  ASSERT_EQ(cli::run(6, argv, out, err), 0) << err.str() << out.str();
+
+  std::vector<nlohmann::json> lines;
+  std::istringstream in(out.str());
+  for (std::string l; std::getline(in, l);) {
+    lines.push_back(nlohmann::json::parse(l));
+  }
+  auto stepLine = [&](const std::string& session, const std::string& step) {
+    for (const auto& l : lines) {
+      if (l.value("session", "") == session && l.value("step", "") == step) {
+        return l;
+      }
+    }
+    return nlohmann::json();
+  };
+  EXPECT_EQ(stepLine("call", "start")["backends"], nlohmann::json::parse(R"(["kovu","pellamlog"])"));
+  EXPECT_EQ(stepLine("stream", "flush").count("failure"), 0u) << out.str();
+  EXPECT_EQ(stepLine("solo", "one-shot")["result"], "finished");
+  // The stream's event reached the call's aggregation block.
+  bool aggregated = false;
+  for (const auto& l : lines) {
+    aggregated |= l.value("session", "") == "call" && l.value("event", "") == "message" && l["category"] == 90;
+  }
+  EXPECT_TRUE(aggregated) << out.str();
+  ASSERT_EQ(adaptorLinesOf(90, 1).size(), 1u);
+  EXPECT_EQ(adaptorLinesOf(90, 1)[0]["dict"],
+            nlohmann::json::parse(R"({"SharedData":{"room":"green"},"ClientData":{"jitter":4}})"));
+  EXPECT_EQ(adaptorLinesOf(91, 1)[0]["dict"], nlohmann::json::parse(R"({"once":1})"));
+
+  // A line that cannot run ends the script with status 2 and says which.
+  root.write("/var/tmp/bad.jsonl", "{\"session\":\"x\",\"step\":\"send\",\"category\":1,\"type\":1}\n");
+  const std::string bad = (root / "/var/tmp/bad.jsonl").string();
+  const char* badArgv[] = {"zerith", "--root", rootPath.c_str(), "sessions", "--script", bad.c_str()};
+  std::ostringstream badOut;
+  std::ostringstream badErr;
+  EXPECT_EQ(cli::run(6, badArgv, badOut, badErr), 2);
+  EXPECT_NE(badErr.str().find("line 1: no open session \"x\""), std::string::npos) << badErr.str();
 }
 
 }  // namespace

@@ -1,5 +1,8 @@
 #include "tools/zerith/ZerithCli.h"
 
+#include <fstream>
+#include <iostream>
+
 #include <CLI/CLI.hpp>
 
 #include <algorithm>
@@ -14,6 +17,7 @@
 #include "platform/Json.h"
 #include "platform/Log.h"
 #include "platform/Paths.h"
+#include "tools/zerith/ZerithSessions.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::cli {
@@ -502,6 +506,12 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
   session->add_option("--extension-token", o.extensionToken, "Sandbox extension token for upload-file");
   session->add_option("--step", o.steps, "A step (repeat; see below; at least one)");
 
+  std::optional<std::string> script;
+  auto* sessions = app.add_subcommand(
+      "sessions", "Run several sessions from JSON lines, one command per line (see tools/zerith/ZerithSessions.h)");
+  sessions->allow_extras();
+  sessions->add_option("--script", script, "File of JSON lines (default: standard input, run as lines arrive)");
+
   bool dnu = false;
   auto* identifier = app.add_subcommand("identifier", "Print this device's persistent identifier");
   identifier->allow_extras();
@@ -520,7 +530,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return code == 0 ? 0 : kExitUsage;
   }
   CLI::App* chosen = nullptr;
-  for (auto* sub : {session, identifier, version}) {
+  for (auto* sub : {session, sessions, identifier, version}) {
     if (*sub) {
       chosen = sub;
     }
@@ -529,7 +539,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return usage(*problem);
   }
   if (!chosen) {
-    return usage("a command is required: session, identifier or version");
+    return usage("a command is required: session, sessions, identifier or version");
   }
   if (timeoutMs < 1) {
     return usage("--timeout must be at least 1 millisecond, not " + std::to_string(timeoutMs));
@@ -559,6 +569,17 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
                                               {"publicKey", Zerith::publicKeyPath().string()}}))
           << '\n';
       return 0;
+    }
+    if (chosen == sessions) {
+      const auto path = socket ? std::filesystem::path(*socket) : Zerith::defaultSocketPath();
+      if (!script) {
+        return runSessions(std::cin, path, std::chrono::milliseconds(timeoutMs), out, err);
+      }
+      std::ifstream file(*script);
+      if (!file) {
+        return usage("cannot read the script " + *script);
+      }
+      return runSessions(file, path, std::chrono::milliseconds(timeoutMs), out, err);
     }
     Runner runner(out, std::move(o), std::chrono::milliseconds(timeoutMs));
     return runner.run(socket ? std::filesystem::path(*socket) : Zerith::defaultSocketPath());
