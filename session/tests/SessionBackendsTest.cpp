@@ -347,12 +347,17 @@ TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSaf
   useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(true)}})}});
   auto c = started(sessionInfo(5));
   const auto a = rec(c, "recA");
+  const std::string device = c.session->deviceID();
+  ASSERT_EQ(device.size(), 40u);
   int calls = 0;
   c.session->flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++calls; });
   agent->invalidateReportingSession(c.session);
   c.session.reset();
   ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
   EXPECT_EQ(a->cleanups(), 1);
+  // The backend outlives its session: the device identifier it points at
+  // must too.
+  EXPECT_EQ(std::string(a->udid()), device);
   // The client's flush and the end-of-session flush both still wait.
   EXPECT_TRUE(a->completeFlush());
   EXPECT_EQ(calls, 1);
