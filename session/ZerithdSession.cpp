@@ -661,11 +661,12 @@ void ZerithdSession::internalFlushMessagesWithCompletion(ValueErrorCompletion co
   join->pending = set->size();
   join->completion = std::move(completion);
   for (const auto& [name, backend] : *set) {
-    // The block holds the backend: a session that ends mid-flush does not
-    // take a backend away from under its own completion.
+    // The block holds the join and the backend's name, not the backend: a
+    // backend keeps its pending completions, and a completion that held its
+    // backend would keep both alive for ever if it never ran.
     backend->flushMessagesWithCompletion(
-        [join, backend = backend, name = name](const Value& text, const std::optional<Error>& error) {
-          logger().debug("internalFlushMessagesWithCompletion: {}", backend->name());
+        [join, name = name](const Value& text, const std::optional<Error>& error) {
+          logger().debug("internalFlushMessagesWithCompletion: {}", name);
           if (const auto* s = text.string()) {
             writeToLogFile("[{} -> flushMessages] {}", name, *s);
           } else if (!text.isNil()) {
