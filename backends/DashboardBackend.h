@@ -75,7 +75,9 @@ class DashboardBackend : public ZerithBackend {
 
   using ZerithBackend::sendMessage;
   // Builds one datagram, hands it to the network queue and returns its local
-  // log line; nil when no buffer can be had.
+  // log line; nil when no buffer can be had. Pass the event number as a
+  // 16-bit value: with an int the base class's numbering send (whose last
+  // argument is the flag) is the better match.
   std::optional<std::string> sendMessage(const Value& message, const timeval& timestamp, std::uint16_t method,
                                          std::uint16_t respCode, std::uint16_t eventID);
 

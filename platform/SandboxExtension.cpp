@@ -156,7 +156,7 @@ std::shared_ptr<GrantedFile> GrantedFile::open(std::string_view path, const Iden
 
   struct stat before {};
   if (::fstatat(file->directory_, file->name_.c_str(), &before, AT_SYMLINK_NOFOLLOW) != 0) {
-    return fail(fmt::format("the file cannot be found ({})", std::strerror(errno)));
+    return fail(fmt::format("the file cannot be reached ({})", std::strerror(errno)));
   }
   if (!S_ISREG(before.st_mode)) {
     return fail(fmt::format("the file is {}", kindOf(before.st_mode)));
