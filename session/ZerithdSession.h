@@ -20,6 +20,7 @@
 #include <string>
 #include <vector>
 
+#include "backends/ZerithBackend.h"
 #include "ipc/ClientSessionInterface.h"
 #include "platform/Value.h"
 #include "session/ZerithdSessionDelegate.h"
@@ -123,6 +124,9 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
 
   std::shared_ptr<ZerithdSessionDelegate> delegate() const { return sessionDelegate_.lock(); }
   bool hasBackendSet() const;
+  // A copy of the session's backend set, for operations that call out to
+  // every backend without holding the session's lock.
+  BackendDictionary backendsSnapshot() const;
 
   // Fields other threads read while the agent lock is held.
   struct Fields {
