@@ -73,7 +73,13 @@ std::string textOf(const std::vector<std::uint8_t>& b) { return std::string(b.be
 // and whether the sources are gone; tests wait on it.
 class QueueWatch {
  public:
-  explicit QueueWatch(DashboardBackend& backend) {
+  // The backend outlives the test while its timer drains the queue: the
+  // observer is taken away again before the watch goes.
+  ~QueueWatch() { backend_.setQueueObserver(nullptr); }
+  QueueWatch(const QueueWatch&) = delete;
+  QueueWatch& operator=(const QueueWatch&) = delete;
+
+  explicit QueueWatch(DashboardBackend& backend) : backend_(backend) {
     backend.setQueueObserver([this](std::size_t count, bool cancelled) {
       {
         std::lock_guard lock(mutex_);
@@ -94,6 +100,7 @@ class QueueWatch {
   }
 
  private:
+  DashboardBackend& backend_;
   std::mutex mutex_;
   std::condition_variable changed_;
   std::size_t count_ = 0;

@@ -152,6 +152,7 @@ TEST(ZerithDashboardToolTest, ReliableBackendsDatagramsArePrintedAndAcknowledged
     std::unique_lock lock(mutex);
     EXPECT_TRUE(changed.wait_for(lock, 10s, [&] { return !counts.empty() && counts.back() == 0; }));
   }
+  backend->setQueueObserver(nullptr);  // the observer's locals end with the test
   backend->cleanup();
 }
 
