@@ -178,7 +178,7 @@ std::optional<std::string> ZerithBackend::flushMessagesWithCompletion(FlushCompl
 
 bool ZerithBackend::uploadFileAtPath(const std::string&, const char*) { return false; }
 
-bool ZerithBackend::uploadLogData(const Data&) { return false; }
+bool ZerithBackend::uploadLogData(const Value&) { return false; }
 
 void ZerithBackend::setCorrelatedSessionID(std::optional<std::string> sessionID) {
   setCombinedSessionIDString(std::move(sessionID));

@@ -105,7 +105,8 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   // Calls `completion` (when given) with nil and no error; returns nil.
   virtual std::optional<std::string> flushMessagesWithCompletion(FlushCompletion completion);
   virtual bool uploadFileAtPath(const std::string& path, const char* extensionToken);
-  virtual bool uploadLogData(const Data& logData);
+  // `logData` is the client's array of property-list values.
+  virtual bool uploadLogData(const Value& logData);
   virtual void setCorrelatedSessionID(std::optional<std::string> sessionID);
 
   // No whitelist: every category passes. An empty whitelist admits nothing,

@@ -6,8 +6,10 @@
 #include <vector>
 #include <string_view>
 
+#include "backends/DashboardBackend.h"
 #include "backends/KovuBackend.h"
 #include "backends/PellamBackend.h"
+#include "backends/UploadBackend.h"
 #include "backends/ZerithBackend.h"
 #include "config/DeviceInfo.h"
 #include "platform/Log.h"
@@ -41,6 +43,13 @@ std::shared_ptr<ZerithBackend> makePlain(std::string_view name, const Value& pro
   return std::make_shared<Backend>(std::string(name), profile, productFamily);
 }
 
+// Kinds whose initialiser may refuse the profile (nullptr).
+template <typename Backend>
+std::shared_ptr<ZerithBackend> makeChecked(std::string_view name, const Value& profile,
+                                           const std::optional<std::string>& productFamily, std::int32_t) {
+  return Backend::initWithName(std::string(name), profile, productFamily);
+}
+
 std::shared_ptr<ZerithBackend> makeKovu(std::string_view name, const Value& profile,
                                         const std::optional<std::string>& productFamily, std::int32_t clientType) {
   return KovuBackend::initWithName(std::string(name), profile, productFamily, clientType);
@@ -60,6 +69,8 @@ bool always() { return true; }
 // kovu; a kind joins the table at its place with one line.
 const std::vector<Kind>& kinds() {
   static const std::vector<Kind> table = {
+      {&kZerithBackendDashboard, always, makeChecked<DashboardBackend>},
+      {&kZerithBackendUploadServer, always, makeChecked<UploadBackend>},
       {&kZerithBackendPellamlog, always, makePlain<PellamBackend>},
       {&kZerithBackendKovu, adaptorAvailable, makeKovu},
   };

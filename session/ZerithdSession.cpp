@@ -16,6 +16,7 @@
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
 #include "platform/Log.h"
+#include "platform/SandboxExtension.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 #include "zerith/ZerithBundle.h"
 #include "zerith/ZerithConstants.h"
@@ -32,6 +33,35 @@ const log::Logger& logger() {
 constexpr char kNoBackends[] = "No backends available to send message";
 
 Value textOrUnknown(const Value& v) { return v.string() ? v : Value("Unknown"); }
+
+// The file-system path of a file URL ("file:///a%20b" -> "/a b", an
+// optional "localhost" host); anything that is not a file URL is taken as
+// a path as it stands.
+std::string filePathOfURL(const std::string& url) {
+  if (!url.starts_with("file://")) {
+    return url;
+  }
+  std::string rest = url.substr(7);
+  if (rest.starts_with("localhost/")) {
+    rest = rest.substr(9);
+  }
+  std::string path;
+  for (std::size_t i = 0; i < rest.size(); ++i) {
+    const auto hex = [](char c) -> int {
+      if (c >= '0' && c <= '9') return c - '0';
+      if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+      if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+      return -1;
+    };
+    if (rest[i] == '%' && i + 2 < rest.size() && hex(rest[i + 1]) >= 0 && hex(rest[i + 2]) >= 0) {
+      path.push_back(static_cast<char>(hex(rest[i + 1]) * 16 + hex(rest[i + 2])));
+      i += 2;
+    } else {
+      path.push_back(rest[i]);
+    }
+  }
+  return path;
+}
 
 double secondsNow() {
   timeval tv{};
@@ -889,22 +919,64 @@ void ZerithdSession::uploadFileAtPath(const Value& fileURL, const Value& extensi
 void ZerithdSession::uploadFileWithURL(const Value& fileURL, const Value& /*extensionToken*/,
                                        BoolCompletion completionHandler) {
   const std::string url = fileURL.string() ? *fileURL.string() : std::string();
-  const std::string path = url.starts_with("file://") ? url.substr(7) : url;
+  const std::string path = filePathOfURL(url);
   const std::string absoluteURL = url.starts_with("file://") ? url : "file://" + path;
-  // Only an upload backend takes files; none exists in the set yet.
-  logger().error("uploadFileWithURL: File upload failed for {}", path);
-  writeToLogFile("[uploadFileWithURL] Upload {} for file {}", "failed", absoluteURL);
+
+  // Linux has no sandbox extensions: the token the client sent proves
+  // nothing. The daemon opens the file itself for the client's identity, as
+  // the socket reported it at connect time, and hands its backends a token
+  // of its own that stands for that opening; they read and delete only
+  // through it.
+  bool uploaded = false;
+  std::string why;
+  std::shared_ptr<sandbox::GrantedFile> file;
+  if (const auto connection = connection_.lock()) {
+    const ipc::PeerCredentials& peer = connection->peer();
+    file = sandbox::GrantedFile::open(path, sandbox::Identity{peer.uid, peer.gid}, &why);
+  } else {
+    why = "the client has gone";
+  }
+  if (file) {
+    const std::string token = sandbox::issueExtension(file);
+    for (const auto& [name, backend] : backendsSnapshot()) {
+      // Every backend is asked, also after one has taken the file.
+      uploaded = backend->uploadFileAtPath(path, token.c_str()) || uploaded;
+    }
+    sandbox::revokeExtension(token);
+  } else {
+    logger().error("uploadFileWithURL: Refusing to upload {}: {}", path, why);
+  }
+
+  if (uploaded) {
+    logger().debug("uploadFileWithURL: File upload successful for {}", path);
+  } else {
+    logger().error("uploadFileWithURL: File upload failed for {}", path);
+  }
+  writeToLogFile("[uploadFileWithURL] Upload {} for file {}", uploaded ? "succeeded" : "failed", absoluteURL);
   if (completionHandler) {
-    completionHandler(false);
+    completionHandler(uploaded);
   }
 }
 
-void ZerithdSession::uploadLogData(const Value& /*logData*/, BoolErrorCompletion completionHandler) {
-  // Only a datagram backend takes log data; none exists in the set yet.
-  logger().error("uploadLogData: Log data array upload failed");
-  if (completionHandler) {
-    completionHandler(false, std::nullopt);
+void ZerithdSession::uploadLogData(const Value& logData, BoolErrorCompletion completionHandler) {
+  bool uploaded = false;
+  for (const auto& [name, backend] : backendsSnapshot()) {
+    uploaded = backend->uploadLogData(logData) || uploaded;
   }
+  if (uploaded) {
+    logger().debug("uploadLogData: Log data array upload successful");
+  } else {
+    logger().error("uploadLogData: Log data array upload failed");
+  }
+  // No error object is ever passed: the reasons stay in the backends' logs.
+  if (completionHandler) {
+    completionHandler(uploaded, std::nullopt);
+  }
+}
+
+BackendDictionary ZerithdSession::backendsSnapshot() const {
+  // The session holds no backend objects yet; the backend set replaces this.
+  return {};
 }
 
 }  // namespace zerith

@@ -171,7 +171,7 @@ TEST(ZerithBackendTest, NoOpDefaultsAnswerNilAndNo) {
   EXPECT_EQ(b.sendMessage(Value(Dictionary{{"a", 1}}), now, 1, 2, 0), std::nullopt);
   EXPECT_EQ(b.flushMessagesWithCompletion(nullptr), std::nullopt);
   EXPECT_FALSE(b.uploadFileAtPath("/tmp/x", "token"));
-  EXPECT_FALSE(b.uploadLogData(Data{1, 2}));
+  EXPECT_FALSE(b.uploadLogData(Value(Array{Value("line")})));
   EXPECT_EQ(b.batchedEventsSize(), 0u);
   b.cleanup();
 }
