@@ -938,9 +938,11 @@ void ZerithdSession::uploadFileWithURL(const Value& fileURL, const Value& /*exte
   }
   if (file) {
     const std::string token = sandbox::issueExtension(file);
-    for (const auto& [name, backend] : backendsSnapshot()) {
-      // Every backend is asked, also after one has taken the file.
-      uploaded = backend->uploadFileAtPath(path, token.c_str()) || uploaded;
+    if (const auto set = backends()) {
+      for (const auto& [name, backend] : *set) {
+        // Every backend is asked, also after one has taken the file.
+        uploaded = backend->uploadFileAtPath(path, token.c_str()) || uploaded;
+      }
     }
     sandbox::revokeExtension(token);
   } else {
@@ -960,8 +962,10 @@ void ZerithdSession::uploadFileWithURL(const Value& fileURL, const Value& /*exte
 
 void ZerithdSession::uploadLogData(const Value& logData, BoolErrorCompletion completionHandler) {
   bool uploaded = false;
-  for (const auto& [name, backend] : backendsSnapshot()) {
-    uploaded = backend->uploadLogData(logData) || uploaded;
+  if (const auto set = backends()) {
+    for (const auto& [name, backend] : *set) {
+      uploaded = backend->uploadLogData(logData) || uploaded;
+    }
   }
   if (uploaded) {
     logger().debug("uploadLogData: Log data array upload successful");
@@ -972,11 +976,6 @@ void ZerithdSession::uploadLogData(const Value& logData, BoolErrorCompletion com
   if (completionHandler) {
     completionHandler(uploaded, std::nullopt);
   }
-}
-
-BackendDictionary ZerithdSession::backendsSnapshot() const {
-  // The session holds no backend objects yet; the backend set replaces this.
-  return {};
 }
 
 }  // namespace zerith

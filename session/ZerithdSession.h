@@ -136,9 +136,6 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
 
   std::shared_ptr<ZerithdSessionDelegate> delegate() const { return sessionDelegate_.lock(); }
   bool hasBackendSet() const;
-  // A copy of the session's backend set, for operations that call out to
-  // every backend without holding the session's lock.
-  BackendDictionary backendsSnapshot() const;
 
   // The class-wide lock: flush joins of every session and the one-shot
   // transport. A leaf: nothing else is taken while it is held.
