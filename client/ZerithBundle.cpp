@@ -15,8 +15,9 @@ std::optional<std::string> frameworkBundleVersion() {
   if (!info) {
     return std::nullopt;
   }
-  if (const auto* version = (*info)["BundleVersion"].string()) {
-    return *version;
+  const Value version = (*info)["BundleVersion"];
+  if (const auto* text = version.string()) {
+    return *text;
   }
   return std::nullopt;
 }

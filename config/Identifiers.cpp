@@ -49,7 +49,8 @@ std::optional<std::string> defaultsStringForKey(std::string_view key) {
 
 std::string clientServiceKey(const Value& userInfo) {
   const auto field = [&](const char* key) {
-    const std::string* s = userInfo[key].string();
+    const Value value = userInfo[key];
+    const std::string* s = value.string();
     return s ? lowercased(*s) : std::string();
   };
   return fmt::format("{}:{}", field(kZerithUserInfoClientName), field(kZerithUserInfoServiceName));

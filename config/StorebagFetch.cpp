@@ -49,7 +49,8 @@ struct SynchronousFetch {
 }  // namespace
 
 std::string storebagServerURL() {
-  if (const auto* url = defaultsObjectForKey("zerith_storebag_url").string()) {
+  const Value configured = defaultsObjectForKey("zerith_storebag_url");
+  if (const auto* url = configured.string()) {
     return *url;
   }
   return isInternalBuild() ? kZerithInternalStorebagURL : kZerithDefaultStorebagURL;
@@ -90,6 +91,9 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
   helper->getURLRequestWithCompletionHandler(
       request, [name, wait](const Data& body, const std::optional<HTTPURLResponse>& response,
                             const std::optional<Error>& error) {
+        // This runs on the helper's queue: what the verification below notes
+        // belongs to no caller.
+        clearStorebagFailure();
         const long statusCode = response ? response->statusCode : 0;
         if (!error && statusCode == 200) {
           {
@@ -122,10 +126,15 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
   // ZerithdUtil's lock, which the caller does not hold here.
   wait->done.acquire();
   if (wait->error || wait->statusCode != 200) {
+    // An answer other than 200 has no error of its own: its status is the cause.
+    const std::string cause =
+        wait->error ? wait->error->description : fmt::format("HTTP status {}", wait->statusCode);
     configLogger().info("fetchNetworkStorebag: Error resolving with lookup server {}, sendSynchronousRequest error {}", url,
-                  wait->error ? wait->error->description : std::string("(null)"));
+                        cause);
+    noteStorebagFailure(cause + " from " + url);
     if (name == kFallbackStorebagName) {
       configLogger().info("fetchNetworkStorebag: Loading default storebag '{}'", name);
+      noteStorebagFailure("the built-in fallback storebag was loaded");
       return buildFallbackStorebag();
     }
     return std::nullopt;
@@ -169,6 +178,7 @@ Value fetchStorebagWithName(const std::string& name, std::int32_t& maxAgeOut, bo
 
 Value fetchStorebagForEnvironmentAndClientType(std::int32_t clientType, std::int32_t& maxAgeOut, Value& versionOut,
                                                bool& unchangedOut) {
+  clearStorebagFailure();
   const auto name = storebagNameForClientType(static_cast<ZerithClientType>(clientType));
   if (!name) {
     configLogger().error("fetchStorebagForEnvironmentAndClientType: Could not find storebag name for client type {}",
@@ -178,8 +188,9 @@ Value fetchStorebagForEnvironmentAndClientType(std::int32_t clientType, std::int
   const Value storebag = fetchStorebagWithName(*name, maxAgeOut, unchangedOut);
   if (storebag.isNil()) {
     if (!unchangedOut) {
-      configLogger().error("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type {}",
-                     clientType);
+      const std::string& why = lastStorebagFailure();
+      configLogger().error("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type {}{}",
+                           clientType, why.empty() ? "" : ": " + why);
     }
     return Value();
   }

@@ -47,18 +47,40 @@ ossl::PkeyPtr rsaPublicKeyFromDER(const Data& der) {
   return key;
 }
 
-// RSA PKCS#1 v1.5 over the SHA-1 digest of `message`.
-bool verifySha1Rsa(EVP_PKEY* key, const Data& signature, const Data& message) {
+// RSA PKCS#1 v1.5 over the SHA-1 digest of `message`. On failure `reason`
+// gets OpenSSL's reason ("bad signature", "wrong signature length", ...).
+bool verifySha1Rsa(EVP_PKEY* key, const Data& signature, const Data& message, std::string& reason) {
+  ERR_clear_error();
   ossl::MdCtxPtr ctx(EVP_MD_CTX_new());
   EVP_PKEY_CTX* pctx = nullptr;  // owned by ctx
   bool ok = ctx && EVP_DigestVerifyInit(ctx.get(), &pctx, EVP_sha1(), nullptr, key) == 1 &&
             EVP_PKEY_CTX_set_rsa_padding(pctx, RSA_PKCS1_PADDING) == 1 &&
             EVP_DigestVerify(ctx.get(), signature.data(), signature.size(), message.data(), message.size()) == 1;
+  if (!ok) {
+    // The first entry names the cause; later ones only say where it passed.
+    const unsigned long code = ERR_peek_error();
+    const char* text = code != 0 ? ERR_reason_error_string(code) : nullptr;
+    reason = text ? text : "the signature does not match the storebag for this public key";
+  }
   ERR_clear_error();
   return ok;
 }
 
+thread_local std::string tLastFailure;
+
 }  // namespace
+
+const std::string& lastStorebagFailure() { return tLastFailure; }
+
+void clearStorebagFailure() { tLastFailure.clear(); }
+
+void noteStorebagFailure(const std::string& cause) {
+  // A thread that never clears (a transport queue) keeps no more than this.
+  constexpr std::size_t kMaxFailureText = 2048;
+  if (tLastFailure.size() + cause.size() < kMaxFailureText) {
+    tLastFailure += (tLastFailure.empty() ? "" : "; ") + cause;
+  }
+}
 
 plist::Limits storebagContainerLimits() {
   return plist::Limits{kMaxStorebagContainerBytes, 8, 1024};
@@ -77,7 +99,8 @@ StorebagVerification verifyStorebagContainer(std::span<const std::uint8_t> conta
     result.status = StorebagVerifyStatus::NotAPropertyList;
     return result;
   }
-  const auto* signatureText = (*parsed)["signature"].string();
+  const Value signatureValue = (*parsed)["signature"];
+  const auto* signatureText = signatureValue.string();
   if (!signatureText) {
     result.status = StorebagVerifyStatus::SignatureMissing;
     return result;
@@ -87,19 +110,19 @@ StorebagVerification verifyStorebagContainer(std::span<const std::uint8_t> conta
     result.status = StorebagVerifyStatus::BadPublicKey;
     return result;
   }
-  result.keyIdentity = key.get();
   const auto signature = crypto::base64Decode(*signatureText);
   if (!signature) {
     result.status = StorebagVerifyStatus::BadSignatureText;
     return result;
   }
-  const auto* bagText = (*parsed)["bag"].string();
+  const Value bagValue = (*parsed)["bag"];
+  const auto* bagText = bagValue.string();
   auto bag = bagText ? crypto::base64Decode(*bagText) : std::nullopt;
   if (!bag) {
     result.status = StorebagVerifyStatus::BadBagText;
     return result;
   }
-  if (!verifySha1Rsa(key.get(), *signature, *bag)) {
+  if (!verifySha1Rsa(key.get(), *signature, *bag, result.verifyError)) {
     result.status = StorebagVerifyStatus::SignatureMismatch;
     return result;
   }
@@ -123,21 +146,31 @@ Value parseAndVerifyStorebag(const std::string& name, const Data& data, bool sav
     case StorebagVerifyStatus::NotAPropertyList:
       configLogger().error("fetchStorebagWithName: propertyListWithData error {}", verification.parseError);
       configLogger().error("fetchStorebagWithName: Signature is missing");
+      noteStorebagFailure("the storebag is not a property list (" + verification.parseError + ")");
       return Value();
     case StorebagVerifyStatus::SignatureMissing:
       configLogger().error("fetchStorebagWithName: Signature is missing");
+      noteStorebagFailure("the storebag's signature is missing");
       return Value();
     case StorebagVerifyStatus::BadPublicKey:
       configLogger().error("fetchStorebagWithName: Could not create an RSA public key from '{}'", keyPath.string());
+      noteStorebagFailure("no RSA public key in '" + keyPath.string() + "'");
       return Value();
     case StorebagVerifyStatus::BadSignatureText:
       configLogger().error("fetchStorebagWithName: Signature can not be decoded");
+      noteStorebagFailure("the storebag's signature can not be decoded");
       return Value();
     case StorebagVerifyStatus::BadBagText:
       configLogger().error("fetchStorebagWithName: Storebag can not be decoded");
+      noteStorebagFailure("the storebag's bag can not be decoded");
       return Value();
     case StorebagVerifyStatus::SignatureMismatch:
-      configLogger().error("fetchStorebagWithName: Signature can not be verified, {}", fmt::ptr(verification.keyIdentity));
+      // The key and the storebag do not belong together (a replaced key,
+      // another signer, altered bytes): the reason is OpenSSL's.
+      configLogger().error("fetchStorebagWithName: Signature can not be verified, {} (public key '{}')",
+                           verification.verifyError, keyPath.string());
+      noteStorebagFailure("signature can not be verified, " + verification.verifyError + " (public key '" +
+                          keyPath.string() + "')");
       return Value();
     case StorebagVerifyStatus::Verified: break;
   }

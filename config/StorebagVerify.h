@@ -37,7 +37,7 @@ enum class StorebagVerifyStatus {
 struct StorebagVerification {
   StorebagVerifyStatus status = StorebagVerifyStatus::NotAPropertyList;
   std::string parseError;  // the parser's reason when NotAPropertyList
-  const void* keyIdentity = nullptr;  // the key object used, for the mismatch log
+  std::string verifyError;  // OpenSSL's reason when SignatureMismatch
   Data bagBytes;           // the signed bytes when Verified
 };
 
@@ -49,6 +49,16 @@ StorebagVerification verifyStorebagContainer(std::span<const std::uint8_t> conta
 
 // The decoded storebag proper of verified bag bytes: a dictionary, or nil.
 Value decodeStorebagBag(const Data& bagBytes);
+
+// Why the latest storebag fetch of this thread came back empty ("HTTP
+// status 404", the TLS error, "signature can not be verified, bad
+// signature"), for the error lines that only say that it did; empty when
+// nothing failed. fetchStorebagForEnvironmentAndClientType starts afresh.
+const std::string& lastStorebagFailure();
+void clearStorebagFailure();
+// Adds a cause ("; " between several: a failed download, then the unsigned
+// fallback refused).
+void noteStorebagFailure(const std::string& cause);
 
 // Parses and verifies a container with the framework's public key; when
 // `save` is set, a verified container is saved to the disk cache under

@@ -10,6 +10,7 @@
 #include "config/Conversions.h"
 #include "config/StorebagDiskCache.h"
 #include "config/StorebagFetch.h"
+#include "config/StorebagVerify.h"
 #include "platform/Log.h"
 
 namespace zerith {
@@ -70,8 +71,7 @@ Value StorebagCache::storebagForClientType(std::int32_t clientType, std::uint32_
       // An entry always has a fetch time once created; treat one without as
       // infinitely old.
       const double age = fetchTime ? std::fabs(now.secondsSince1970 - fetchTime->secondsSince1970) : INFINITY;
-      const auto* state = (*entry)[kStorebagFetchState].string();
-      const bool successful = state && *state == kFetchSuccessful;
+      const bool successful = (*entry)[kStorebagFetchState] == Value(kFetchSuccessful);
       const std::int64_t maxAge = (*entry)[kStorebagMaxAge].intValue();
       const auto diskDate = diskDate_(*name);
 
@@ -122,6 +122,7 @@ void StorebagCache::fetchAndCacheStorebag(std::int32_t clientType) {
   std::int32_t maxAge = 0;
   Value version;
   bool unchanged = false;
+  clearStorebagFailure();
   const Value storebag = fetch_(clientType, maxAge, version, unchanged);
   logger().debug("fetchAndCacheStorebag: Storebag max age: {} seconds", maxAge);
 
@@ -133,12 +134,21 @@ void StorebagCache::fetchAndCacheStorebag(std::int32_t clientType) {
       entry.set(kStorebagVersion, version);
     }
   } else if (!unchanged) {
-    logger().error("fetchAndCacheStorebag: Unable to fetch storebag for client type {}", clientType);
+    // The fetch notes why on this thread; the operator reads it here.
+    const std::string& why = lastStorebagFailure();
+    logger().error("fetchAndCacheStorebag: Unable to fetch storebag for client type {}{}", clientType,
+                   why.empty() ? "" : ": " + why);
   }
   entry.set(kStorebagFetchTime, clock_());
   entry.set(kStorebagFetchState, (!storebag.isNil() || unchanged) ? kFetchSuccessful : kFetchFailure);
   entry.set(kStorebagMaxAge, maxAge);
   cachedStorebags_.set(*name, Value(std::move(entry)));
+}
+
+std::size_t StorebagCache::drop() {
+  const std::size_t dropped = cachedStorebags_.size();
+  cachedStorebags_ = Dictionary();
+  return dropped;
 }
 
 std::size_t StorebagCache::count() const { return cachedStorebags_.size(); }

@@ -37,6 +37,12 @@ class StorebagCache {
   Value storebagVersionForClientType(std::int32_t clientType) const;
   void fetchAndCacheStorebag(std::int32_t clientType);
 
+  // Forgets every entry: the in-memory storebags and the wait after a failed
+  // fetch. The next session fetches again, and the disk cache, its metrics,
+  // the public key and the server URL decide what that fetch does. Returns
+  // how many entries there were.
+  std::size_t drop();
+
   // For health reports: entries, and the estimated memory of the whole cache.
   std::size_t count() const;
   std::size_t estimatedSize() const;

@@ -188,6 +188,11 @@ Value ZerithdAgent::storebagVersionForSession(ZerithdSession& session) {
   return cachedStorebags_->storebagVersionForClientType(clientType);
 }
 
+std::size_t ZerithdAgent::dropCachedStorebags() {
+  std::lock_guard lock(lock_);
+  return cachedStorebags_->drop();
+}
+
 // --- Hierarchy -----------------------------------------------------------------
 
 ZerithdAgent::SessionList* ZerithdAgent::correlatedListFor(const std::string& token) {

@@ -59,6 +59,9 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
 
   Value storebagForSession(ZerithdSession& session) override;
   Value storebagVersionForSession(ZerithdSession& session) override;
+  // Forgets the cached storebags and the waits after failed fetches (the
+  // operator's SIGHUP); sessions already started keep their backends.
+  std::size_t dropCachedStorebags();
 
   void updateCorrelatedSessions(ZerithdSession& session) override;
   Value parentSessionIDStringForSession(ZerithdSession& session) override;

@@ -42,11 +42,13 @@ constexpr int kIoprioClassShift = 13;
 constexpr int kIoprioClassBestEffort = 2;
 constexpr int kIoprioWhoProcess = 1;
 
+// SIGTERM and SIGINT stop the daemon; SIGHUP drops the cached storebags.
 sigset_t stopSignals() {
   sigset_t set;
   sigemptyset(&set);
   sigaddset(&set, SIGTERM);
   sigaddset(&set, SIGINT);
+  sigaddset(&set, SIGHUP);
   return set;
 }
 
@@ -101,7 +103,21 @@ int ZerithdDaemon::run() {
 
   const sigset_t set = stopSignals();
   int signal = 0;
-  while ((signal = sigwaitinfo(&set, nullptr)) < 0 && errno == EINTR) {
+  for (;;) {
+    signal = sigwaitinfo(&set, nullptr);
+    if (signal < 0 && errno == EINTR) {
+      continue;
+    }
+    if (signal != SIGHUP) {
+      break;
+    }
+    // The operator changed the storebag server, the public key or the disk
+    // cache: without this the in-memory copies stay until their max age and a
+    // failed fetch is not retried for 900 seconds.
+    const std::size_t dropped = agent->dropCachedStorebags();
+    logger().info("main: Received SIGHUP, dropped {} cached storebag(s) and their waits; the next session fetches again",
+                  dropped);
+    sd_notify(0, "STATUS=Listening (cached storebags dropped)");
   }
   listener->stop();
   logger().info("main: Received signal {}, no longer accepting connections", signal);

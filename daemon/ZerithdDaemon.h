@@ -28,7 +28,7 @@ class ZerithdDaemon {
  public:
   explicit ZerithdDaemon(DaemonOptions options);
 
-  // Blocks SIGTERM and SIGINT in the calling thread, so that every thread
+  // Blocks SIGTERM, SIGINT and SIGHUP in the calling thread, so that every thread
   // started later inherits the mask and only run() receives them. Call
   // first thing in main.
   static void blockStopSignals();

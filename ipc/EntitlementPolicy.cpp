@@ -136,7 +136,8 @@ Dictionary EntitlementPolicy::entitlementsFor(const PeerCredentials& peer) const
       reject("not a dictionary");
       continue;
     }
-    const auto* entitlements = (*policy)["entitlements"].dict();
+    const Value fileEntitlements = (*policy)["entitlements"];
+    const auto* entitlements = fileEntitlements.dict();
     if (!entitlements) {
       reject("\"entitlements\" is missing or not a dictionary");
       continue;

@@ -18,6 +18,15 @@
 #include <string_view>
 #include <utility>
 #include <variant>
+
+// Marks an accessor whose result points into `*this`: clang then reports a
+// pointer or reference kept past the life of a temporary it came from
+// (`for (auto& e : *parse(text).dict())`) as -Wdangling. g++ has no such check.
+#if defined(__clang__)
+#define ZERITH_LIFETIMEBOUND [[clang::lifetimebound]]
+#else
+#define ZERITH_LIFETIMEBOUND
+#endif
 #include <vector>
 
 namespace zerith {
@@ -47,7 +56,7 @@ class Dictionary {
   Dictionary(std::initializer_list<Entry> entries);
 
   // nullptr when absent.
-  const Value* find(std::string_view key) const;
+  const Value* find(std::string_view key) const ZERITH_LIFETIMEBOUND;
   // nil when absent.
   Value get(std::string_view key) const;
   bool contains(std::string_view key) const { return find(key) != nullptr; }
@@ -109,10 +118,11 @@ class Value {
   bool isDict() const { return type() == Type::Dict; }
 
   // Typed access; nullptr when the value is of another type.
-  const std::string* string() const;
-  const zerith::Data* data() const;
-  const zerith::Array* array() const;
-  const zerith::Dictionary* dict() const;
+  // Clang reports a pointer kept past a temporary Value's life.
+  const std::string* string() const ZERITH_LIFETIMEBOUND;
+  const zerith::Data* data() const ZERITH_LIFETIMEBOUND;
+  const zerith::Array* array() const ZERITH_LIFETIMEBOUND;
+  const zerith::Dictionary* dict() const ZERITH_LIFETIMEBOUND;
   std::optional<zerith::Date> date() const;
 
   // Number conversions in the manner of a boxed number: booleans count as

@@ -25,6 +25,9 @@ using test::withEntry;
 using test::withoutKey;
 namespace fs = std::filesystem;
 
+// OpenSSL's reason for a signature that does not match the bag.
+constexpr const char* kBadSignature = "bad signature";
+
 // The release section of sampleStorebag().
 Value releaseSection() { return sampleStorebag()["release"]; }
 
@@ -73,7 +76,17 @@ TEST_F(StorebagFetchTest, FirstFetchWithoutCacheOrServerFailsAndSavesNothing) {
   EXPECT_FALSE(r.unchanged);
   EXPECT_TRUE(logs_.contains("fetchNetworkStorebag: Error resolving with lookup server " +
                              refusing.url("/bags/ambrel?version=8.0") + ", sendSynchronousRequest error "));
-  EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type 5"));
+  // The error line ends with the connection's failure and the URL.
+  const std::string prefix = "fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type 5: ";
+  const std::string suffix = " from " + refusing.url("/bags/ambrel?version=8.0");
+  std::size_t withCause = 0;
+  for (const auto& line : logs_.lines()) {
+    if (line.level == Level::Error && line.text.starts_with(prefix) && line.text.ends_with(suffix) &&
+        line.text.size() > prefix.size() + suffix.size()) {
+      ++withCause;
+    }
+  }
+  EXPECT_EQ(withCause, 1u);
   EXPECT_FALSE(logs_.contains("Loading default storebag"));
   EXPECT_FALSE(logs_.contains("Signature is missing"));
   EXPECT_FALSE(cached("ambrel"));
@@ -95,7 +108,9 @@ TEST_F(StorebagFetchTest, UnreachableServerForDravonLoadsTheUnsignedFallbackWhic
   ASSERT_EQ(sequence.size(), 4u);
   EXPECT_EQ(sequence[1], "fetchNetworkStorebag: Loading default storebag 'dravon'");
   EXPECT_EQ(sequence[2], "fetchStorebagWithName: Signature is missing");
-  EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type 11"));
+  EXPECT_TRUE(logs_.contains("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type 11: "));
+  EXPECT_TRUE(logs_.contains(" from " + refusing.url("/bags/dravon?version=8.0") +
+                             "; the built-in fallback storebag was loaded; the storebag's signature is missing"));
   EXPECT_FALSE(cached("dravon"));
 }
 
@@ -208,8 +223,9 @@ TEST_F(StorebagFetchTest, TamperedCacheFileIsRefusedEveryTime) {
   for (int i = 0; i < 2; ++i) {
     EXPECT_TRUE(fetch(5).section.isNil());
   }
-  EXPECT_EQ(logs_.count("fetchStorebagWithName: Signature can not be verified, 0x"), 2u);
-  EXPECT_EQ(logs_.count("Could not fetch storebag for client type 5"), 2u);
+  const std::string reason = std::string(kBadSignature) + " (public key '" + frameworkPublicKeyPath().string() + "')";
+  EXPECT_EQ(logs_.count("fetchStorebagWithName: Signature can not be verified, " + reason), 2u);
+  EXPECT_EQ(logs_.count("Could not fetch storebag for client type 5: signature can not be verified, " + reason), 2u);
 
   cache("ambrel", test::bytes("garbage where a container was"), 86400);
   logs_.clear();
@@ -224,6 +240,21 @@ class StorebagServerTest : public StorebagFetchTest {
   StorebagServerTest() { setServer(server_.url("/bags")); }
   test::HttpsTestServer server_;
 };
+
+TEST_F(StorebagServerTest, AnAnswerOtherThan200NamesItsStatusAsTheCause) {
+  for (const int status : {404, 503}) {
+    logs_.clear();
+    server_.on("/bags/ambrel", test::Reply{.status = status, .headers = {}, .body = "no storebag here"});
+    EXPECT_TRUE(fetch(5).section.isNil());
+    const std::string url = server_.url("/bags/ambrel?version=8.0");
+    EXPECT_TRUE(logs_.has(Level::Default, "fetchNetworkStorebag: Error resolving with lookup server " + url +
+                                              ", sendSynchronousRequest error HTTP status " + std::to_string(status)))
+        << status;
+    EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client "
+                                        "type 5: HTTP status " + std::to_string(status) + " from " + url));
+    EXPECT_FALSE(logs_.contains("sendSynchronousRequest error (null)"));
+  }
+}
 
 TEST_F(StorebagServerTest, FirstFetchIsAPlainGetOfTheVersionedURL) {
   setFrameworkVersion("8.1.0");

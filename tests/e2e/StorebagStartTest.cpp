@@ -2,6 +2,8 @@
 // HTTPS, trusted through the daemon's --ca-file, starts the session and
 // sends its start message to the client's aggregator.
 
+#include <signal.h>
+
 #include <future>
 
 #include "config/StorebagSigner.h"
@@ -21,7 +23,7 @@ class StorebagStartTest : public E2eTest {
     grant(Value(true));
     const auto keys = generateStorebagKeyPair(2048);
     ASSERT_TRUE(keys.has_value());
-    root.write("/usr/share/zerith/publicKey.der", std::string(keys->publicKeyDER.begin(), keys->publicKeyDER.end()));
+    installPublicKey(keys->publicKeyDER);
     const Value bag(Dictionary{{"version", Value("5.2.0")},
                                {"seed", Value(Dictionary{{"kovu", Value(Dictionary{{"active", Value(true)}})}})}});
     const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
@@ -41,6 +43,23 @@ class StorebagStartTest : public E2eTest {
     }
     options.environment = {{"LC_ALL", "fr_FR.UTF-8"}};
     return startDaemon(options);
+  }
+
+  void installPublicKey(const Data& der) {
+    root.write("/usr/share/zerith/publicKey.der", std::string(der.begin(), der.end()));
+  }
+
+  // One session's start: its backends, nil when the daemon has no storebag.
+  Value startSession() {
+    auto client = Zerith::connect();
+    EXPECT_TRUE(client);
+    if (!client) {
+      return Value();
+    }
+    EXPECT_TRUE(client->setSessionInfo(info(), Value(), Value(), false, 10s));
+    const auto started = client->startConfig(20s);
+    EXPECT_TRUE(started);
+    return started["backends"];
   }
 
   static Value info() {
@@ -97,7 +116,55 @@ TEST_F(StorebagStartTest, StorebagServerOutsideTheTrustedAuthoritiesLeavesTheSes
   const auto started = client->startConfig(20s);
   ASSERT_TRUE(started);
   EXPECT_TRUE(started["backends"].isNil());
-  EXPECT_TRUE(daemon->waitForExact(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 7"));
+  // The error line carries the TLS cause, not only the info line before it.
+  const std::string cause = "SSL certificate problem: unable to get local issuer certificate from " +
+                            server.url("/zerith/dravon?version=8.0");
+  EXPECT_TRUE(daemon->waitForExact(Level::Default, "fetchNetworkStorebag: Error resolving with lookup server " +
+                                                    server.url("/zerith/dravon?version=8.0") +
+                                                    ", sendSynchronousRequest error SSL certificate problem: unable to "
+                                                    "get local issuer certificate"))
+      << daemon->output();
+  EXPECT_TRUE(daemon->waitForExact(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 7: " +
+                                                     cause +
+                                                     "; the built-in fallback storebag was loaded; the storebag's "
+                                                     "signature is missing"))
+      << daemon->output();
+}
+
+// The operator's way out of the in-memory cache: SIGHUP drops the cached
+// storebags and the 900-second wait after a failure, so that a new server
+// URL or a replaced public key takes effect without a restart.
+TEST_F(StorebagStartTest, SighupDropsTheCachedStorebagsAndTheWaitAfterAFailure) {
+  RefusingPort refusing;
+  Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(refusing.url("/zerith")));
+  start(/*trustTestCA=*/true);
+  EXPECT_TRUE(startSession().isNil());
+  ASSERT_TRUE(daemon->waitFor("fetchAndCacheStorebag: Unable to fetch storebag for client type 7: "));
+
+  // A corrected URL alone waits out the 900 seconds.
+  Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
+  EXPECT_TRUE(startSession().isNil());
+  EXPECT_TRUE(daemon->waitForExact(
+      Level::Default, "storebagForSession: Not fetching storebag for client type 7 - must wait 900 seconds between attempts"));
+  EXPECT_EQ(server.requestCount(), 0u);
+
+  daemon->signal(SIGHUP);
+  ASSERT_TRUE(daemon->waitForExact(
+      Level::Default, "main: Received SIGHUP, dropped 1 cached storebag(s) and their waits; the next session fetches again"));
+  EXPECT_EQ(startSession(), Value(Array{})) << daemon->output();
+  EXPECT_EQ(server.requestCount(), 1u);
+
+  // A replaced public key: the fresh in-memory copy still serves, until the
+  // operator drops it; then the copy on disk is checked with the new key.
+  const auto other = generateStorebagKeyPair(2048);
+  ASSERT_TRUE(other.has_value());
+  installPublicKey(other->publicKeyDER);
+  EXPECT_EQ(startSession(), Value(Array{}));
+  daemon->signal(SIGHUP);
+  ASSERT_TRUE(daemon->waitFor("main: Received SIGHUP, dropped 1 cached storebag(s)", 2));
+  EXPECT_TRUE(startSession().isNil());
+  EXPECT_TRUE(daemon->waitFor("fetchStorebagWithName: Signature can not be verified, "));
+  EXPECT_TRUE(daemon->running());
 }
 
 }  // namespace

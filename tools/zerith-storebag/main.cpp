@@ -55,7 +55,8 @@ bool writeOutput(const std::string& path, const Data& bytes, fs::perms perms, st
   return true;
 }
 
-std::string describe(zerith::StorebagVerifyStatus status, const std::string& parseError) {
+std::string describe(zerith::StorebagVerifyStatus status, const std::string& parseError,
+                     const std::string& verifyError) {
   using S = zerith::StorebagVerifyStatus;
   switch (status) {
     case S::Verified: return "verified";
@@ -64,7 +65,7 @@ std::string describe(zerith::StorebagVerifyStatus status, const std::string& par
     case S::BadPublicKey: return "the public key is not an RSA public key in DER form";
     case S::BadSignatureText: return "\"signature\" is not valid base64";
     case S::BadBagText: return "\"bag\" is missing or not valid base64";
-    case S::SignatureMismatch: return "the signature does not match the bag under this public key";
+    case S::SignatureMismatch: return "the signature does not match the bag under this public key (" + verifyError + ")";
   }
   return "unknown failure";
 }
@@ -134,7 +135,7 @@ int check(const std::string& publicPath, const std::string& inPath, bool show) {
   }
   const auto result = zerith::verifyStorebagContainer(zerith::plist::bytesOf(*container), key);
   if (result.status != zerith::StorebagVerifyStatus::Verified) {
-    return failWith("'" + inPath + "' refused: " + describe(result.status, result.parseError));
+    return failWith("'" + inPath + "' refused: " + describe(result.status, result.parseError, result.verifyError));
   }
   const auto bag = zerith::decodeStorebagBag(result.bagBytes);
   if (bag.isNil()) {
@@ -143,7 +144,8 @@ int check(const std::string& publicPath, const std::string& inPath, bool show) {
   if (show) {
     std::cout << zerith::plist::encodeXml(bag);
   } else {
-    const auto* version = bag["version"].string();
+    const zerith::Value versionValue = bag["version"];
+    const auto* version = versionValue.string();
     std::cout << "verified: " << result.bagBytes.size() << " bag bytes, version " << (version ? *version : "(none)")
               << "\n";
   }

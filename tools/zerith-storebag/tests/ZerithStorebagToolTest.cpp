@@ -113,7 +113,7 @@ TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
   write("junk", "not a property list");
   const Case cases[] = {
       {"verify --public other.der --in container",
-       "zerith-storebag: 'container' refused: the signature does not match the bag under this public key\n"},
+       "zerith-storebag: 'container' refused: the signature does not match the bag under this public key (invalid padding)\n"},
       {"verify --public publicKey.der --in bag.plist",
        "zerith-storebag: 'bag.plist' refused: the container has no \"signature\" string\n"},
       {"show --public key.pem --in container",
