@@ -3,6 +3,7 @@
 #include <functional>
 #include <string_view>
 
+#include "backends/HTTPSPostBackend.h"
 #include "backends/KovuBackend.h"
 #include "backends/PellamBackend.h"
 #include "backends/ZerithBackend.h"
@@ -38,6 +39,11 @@ std::shared_ptr<ZerithBackend> makePlain(std::string_view name, const Value& pro
   return std::make_shared<Backend>(std::string(name), profile, productFamily);
 }
 
+std::shared_ptr<ZerithBackend> makeHTTPSPost(std::string_view name, const Value& profile,
+                                            const std::optional<std::string>& productFamily, std::int32_t) {
+  return HTTPSPostBackend::initWithName(std::string(name), profile, productFamily);
+}
+
 std::shared_ptr<ZerithBackend> makeKovu(std::string_view name, const Value& profile,
                                         const std::optional<std::string>& productFamily, std::int32_t clientType) {
   return KovuBackend::initWithName(std::string(name), profile, productFamily, clientType);
@@ -57,7 +63,10 @@ bool always() { return true; }
 // kovu; a kind joins the table at its place with one line.
 const std::vector<Kind>& kinds() {
   static const std::vector<Kind> table = {
+      {&kZerithBackendHTTPPost, always, makeHTTPSPost},
+      {&kZerithBackendHTTPPost2, always, makeHTTPSPost},
       {&kZerithBackendPellamlog, always, makePlain<PellamBackend>},
+      {&kZerithBackendQRS, always, makeHTTPSPost},
       {&kZerithBackendKovu, adaptorAvailable, makeKovu},
   };
   return table;
