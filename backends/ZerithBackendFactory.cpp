@@ -1,6 +1,9 @@
 // The backend factory: backend names to kinds.
 
 #include <functional>
+#include <mutex>
+#include <utility>
+#include <vector>
 #include <string_view>
 
 #include "backends/HTTPSPostBackend.h"
@@ -72,11 +75,42 @@ const std::vector<Kind>& kinds() {
   return table;
 }
 
+struct Registered {
+  std::mutex mutex;
+  std::vector<std::pair<std::string, ZerithBackend::Maker>> kinds;
+};
+
+Registered& registered() {
+  static Registered r;
+  return r;
+}
+
 }  // namespace
+
+void ZerithBackend::registerBackendKind(std::string name, Maker make) {
+  auto& r = registered();
+  std::lock_guard lock(r.mutex);
+  std::erase_if(r.kinds, [&](const auto& k) { return k.first == name; });
+  r.kinds.emplace_back(std::move(name), std::move(make));
+}
 
 std::shared_ptr<ZerithBackend> ZerithBackend::newBackendWithName(std::string_view name, const Value& profile,
                                                                  const std::optional<std::string>& productFamily,
                                                                  std::int32_t clientType) {
+  Maker extra;
+  {
+    auto& r = registered();
+    std::lock_guard lock(r.mutex);
+    for (const auto& [n, make] : r.kinds) {
+      if (n == name) {
+        extra = make;
+        break;
+      }
+    }
+  }
+  if (extra) {
+    return extra(name, profile, productFamily, clientType);
+  }
   for (const Kind& kind : kinds()) {
     if (name != *kind.name) {
       continue;
