@@ -23,6 +23,7 @@
 #include "config/DeviceInfo.h"
 #include "platform/FileUtil.h"
 #include "platform/Log.h"
+#include "tests/support/CollectorProcess.h"
 #include "tests/support/TempRoot.h"
 #include "tools/zerith-collector/CollectorBody.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
@@ -105,91 +106,6 @@ TEST(CollectorBodyCorpus, EveryCorpusInputDecodesWithoutCrashing) {
   EXPECT_GT(inputs, 0u);
 }
 
-// The collector executable with its standard output on a pipe.
-class CollectorProcess {
- public:
-  explicit CollectorProcess(std::vector<std::string> args) {
-    int out[2];
-    int err[2];
-    EXPECT_EQ(::pipe2(out, O_CLOEXEC), 0);
-    EXPECT_EQ(::pipe2(err, O_CLOEXEC), 0);
-    pid_ = ::fork();
-    if (pid_ == 0) {
-      ::dup2(out[1], 1);
-      ::dup2(err[1], 2);
-      std::vector<char*> argv;
-      args.insert(args.begin(), ZERITH_COLLECTOR_TOOL);
-      for (auto& a : args) {
-        argv.push_back(a.data());
-      }
-      argv.push_back(nullptr);
-      ::execv(argv[0], argv.data());
-      ::_exit(127);
-    }
-    ::close(out[1]);
-    ::close(err[1]);
-    out_ = out[0];
-    err_ = err[0];
-    // Ready once it says where it listens.
-    std::string said;
-    while (said.find("listening on ") == std::string::npos || said.back() != '\n') {
-      if (!readSome(err_, said)) {
-        break;
-      }
-    }
-    const auto at = said.rfind(':');
-    port_ = at == std::string::npos ? 0 : std::atoi(said.c_str() + at + 1);
-  }
-  ~CollectorProcess() {
-    if (pid_ > 0) {
-      ::kill(pid_, SIGTERM);
-      int status = 0;
-      ::waitpid(pid_, &status, 0);
-    }
-    ::close(out_);
-    ::close(err_);
-  }
-
-  int port() const { return port_; }
-  std::string url(const std::string& path) const { return "https://127.0.0.1:" + std::to_string(port_) + path; }
-
-  // The next JSON line, or nullopt after ten seconds.
-  std::optional<Json> nextLine() {
-    while (true) {
-      const auto newline = pending_.find('\n');
-      if (newline != std::string::npos) {
-        const std::string line = pending_.substr(0, newline);
-        pending_.erase(0, newline + 1);
-        return Json::parse(line);
-      }
-      if (!readSome(out_, pending_)) {
-        return std::nullopt;
-      }
-    }
-  }
-
- private:
-  static bool readSome(int fd, std::string& into) {
-    pollfd p{fd, POLLIN, 0};
-    if (::poll(&p, 1, 10000) <= 0) {
-      return false;
-    }
-    char buffer[65536];
-    const ssize_t n = ::read(fd, buffer, sizeof(buffer));
-    if (n <= 0) {
-      return false;
-    }
-    into.append(buffer, static_cast<std::size_t>(n));
-    return true;
-  }
-
-  pid_t pid_ = -1;
-  int out_ = -1;
-  int err_ = -1;
-  int port_ = 0;
-  std::string pending_;
-};
-
 class CollectorToolTest : public ::testing::Test {
  protected:
   void SetUp() override { certs = root.path() / "certs"; }
@@ -220,7 +136,7 @@ class CollectorToolTest : public ::testing::Test {
 TEST_F(CollectorToolTest, BackendRecordsArriveOneLinePerRecordWithSenderSessionAndCheckedDigest) {
   auto args = baseArgs();
   args.insert(args.end(), {"--digest-key", "secret"});
-  CollectorProcess collector(args);
+  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
   ASSERT_GT(collector.port(), 0);
   auto b = backendFor(collector.url("/post"));
   b->setDigestKey(Data{'s', 'e', 'c', 'r', 'e', 't'});
@@ -254,7 +170,7 @@ TEST_F(CollectorToolTest, BackendRecordsArriveOneLinePerRecordWithSenderSessionA
 TEST_F(CollectorToolTest, ChosenServerErrorDisablesTheBackend) {
   auto args = baseArgs();
   args.insert(args.end(), {"--status", "503"});
-  CollectorProcess collector(args);
+  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
   auto b = backendFor(collector.url("/post"));
   timeval now{};
   gettimeofday(&now, nullptr);
@@ -301,7 +217,7 @@ TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLoc
   const fs::path store = root.path() / "store";
   auto args = baseArgs();
   args.insert(args.end(), {"--store", store.string(), "--log-data-path", "/logs"});
-  CollectorProcess collector(args);
+  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
   const std::string file = "diagnostic log\n" + std::string(5000, 'z');
   const auto upload = curlPost(collector.url("/upload?uuid=abc&sequence=3&filename=x.log.gz&raw=true"), certs / "ca.pem",
                                gzipOf(file), {"Content-Type: application/octet-stream", "Content-Encoding: gzip"});
@@ -328,7 +244,7 @@ TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLoc
 TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
   auto args = baseArgs();
   args.insert(args.end(), {"--max-body", "100000", "--max-inflated", "200000"});
-  CollectorProcess collector(args);
+  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
   const auto bomb = curlPost(collector.url("/post"), certs / "ca.pem", gzipOf(std::string(4 << 20, 'a')),
                              {"Content-Encoding: gzip"});
   EXPECT_EQ(bomb.status, 413);
@@ -356,7 +272,7 @@ TEST_F(CollectorToolTest, ServesStaticFilesWithLastModifiedAndNothingOutsideItsF
   std::ofstream(root.path() / "secret") << "no";
   auto args = baseArgs();
   args.insert(args.end(), {"--serve", www.string()});
-  CollectorProcess collector(args);
+  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
   const auto get = [&](const std::string& path, const std::vector<std::string>& headers) {
     CURL* curl = curl_easy_init();
     CurlAnswer answer;
