@@ -90,6 +90,26 @@ double nowSeconds() {
   return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
 }
 
+// A line with the keys a reader looks for first; the request's headers last.
+std::string render(const Json& line) {
+  static const char* const order[] = {"time",       "kind",     "status",   "method",  "path",   "query",
+                                      "digest",     "_sender",  "_sessionID", "record", "clientId", "postTime",
+                                      "events",     "gzip",     "bodySize", "size",    "sha256", "stored",
+                                      "storeError", "error"};
+  Json out = Json::object();
+  for (const char* key : order) {
+    if (line.contains(key)) {
+      out[key] = line[key];
+    }
+  }
+  for (const auto& [key, value] : line.items()) {
+    if (!out.contains(key)) {
+      out[key] = value;
+    }
+  }
+  return out.dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
 // Only names that cannot leave the folder: no empty, "." or ".." piece.
 std::optional<fs::path> servedFile(const fs::path& folder, const std::string& path) {
   if (folder.empty() || path.empty() || path[0] != '/') {
@@ -326,7 +346,7 @@ void CollectorServer::handle(Connection& connection) {
     while ((headerEnd = connection.buffer.find("\r\n\r\n")) == std::string::npos) {
       if (connection.buffer.size() > kMaxHeaderBytes) {
         connection.writeAll("HTTP/1.1 431 Request Header Fields Too Large\r\nContent-Length: 0\r\nConnection: close\r\n\r\n");
-        writer_(Json{{"time", nowSeconds()}, {"kind", "refused"}, {"error", "header block too large"}}.dump());
+        writer_(render(Json{{"time", nowSeconds()}, {"kind", "refused"}, {"error", "header block too large"}}));
         return;
       }
       if (!connection.readMore()) {
@@ -350,7 +370,7 @@ void CollectorServer::handle(Connection& connection) {
       line["kind"] = "refused";
       line["status"] = status;
       line["error"] = why;
-      writer_(line.dump(-1, ' ', false, Json::error_handler_t::replace));
+      writer_(render(line));
       connection.writeAll("HTTP/1.1 " + std::to_string(status) + " " + reasonPhrase(status) +
                           "\r\nContent-Length: 0\r\nConnection: close\r\n\r\n");
       connection.drain();
@@ -438,7 +458,7 @@ void CollectorServer::handle(Connection& connection) {
       const auto file = servedFile(options_.serveFolder, path);
       if (!file) {
         line["status"] = 404;
-        writer_(line.dump(-1, ' ', false, Json::error_handler_t::replace));
+        writer_(render(line));
         if (!answer(404, "") || !keepAlive) {
           return;
         }
@@ -450,7 +470,7 @@ void CollectorServer::handle(Connection& connection) {
       const auto since = parseHttpDate(ifModifiedSince);
       if (since && st.st_mtime <= *since) {
         line["status"] = 304;
-        writer_(line.dump(-1, ' ', false, Json::error_handler_t::replace));
+        writer_(render(line));
         if (!connection.writeAll("HTTP/1.1 304 Not Modified\r\n" + lastModified + (keepAlive ? "" : "Connection: close\r\n") + "\r\n") ||
             !keepAlive) {
           return;
@@ -461,7 +481,7 @@ void CollectorServer::handle(Connection& connection) {
       std::string contents((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
       line["status"] = 200;
       line["size"] = contents.size();
-      writer_(line.dump(-1, ' ', false, Json::error_handler_t::replace));
+      writer_(render(line));
       const std::string sent = method == "HEAD" ? std::string() : contents;
       if (!connection.writeAll("HTTP/1.1 200 OK\r\nContent-Type: application/octet-stream\r\nContent-Length: " +
                                std::to_string(contents.size()) + "\r\n" + lastModified +
@@ -503,7 +523,7 @@ void CollectorServer::handle(Connection& connection) {
       if (events.empty()) {
         common["kind"] = "envelope";
         common["events"] = 0;
-        writer_(common.dump(-1, ' ', false, Json::error_handler_t::replace));
+        writer_(render(common));
       }
       for (const Json& record : events) {
         Json out = common;
@@ -511,7 +531,7 @@ void CollectorServer::handle(Connection& connection) {
         out["_sender"] = record.is_object() && record.contains("_sender") ? record["_sender"] : Json(nullptr);
         out["_sessionID"] = record.is_object() && record.contains("_sessionID") ? record["_sessionID"] : Json(nullptr);
         out["record"] = record;
-        writer_(out.dump(-1, ' ', false, Json::error_handler_t::replace));
+        writer_(render(out));
       }
     } else {
       const bool logData = path == options_.logDataPath;
@@ -532,7 +552,7 @@ void CollectorServer::handle(Connection& connection) {
           line["storeError"] = "cannot write " + file.string();
         }
       }
-      writer_(line.dump(-1, ' ', false, Json::error_handler_t::replace));
+      writer_(render(line));
       answerText = logData ? stored : options_.answerText;
     }
     if (!answer(options_.status, answerText) || !keepAlive) {
