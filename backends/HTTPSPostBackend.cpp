@@ -219,19 +219,6 @@ void HTTPSPostBackend::setImmutable() {
   fields_.immutable = true;
 }
 
-void HTTPSPostBackend::asyncOnStateQueue(std::function<void(HTTPSPostBackend&)> block) {
-  std::weak_ptr<ZerithBackend> weak = weak_from_this();
-  if (weak.expired()) {
-    stateQueue().sync([&] { block(*this); });
-    return;
-  }
-  stateQueue().async([weak = std::move(weak), block = std::move(block)] {
-    if (auto self = weak.lock()) {
-      block(static_cast<HTTPSPostBackend&>(*self));
-    }
-  });
-}
-
 // ---------------------------------------------------------------------------
 // Records, batch and envelope
 
@@ -306,14 +293,19 @@ std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
     return std::int64_t{0};
   });
   std::optional<std::string> result;
-  if (count > fields().eventThreshold) {
+  if (count > eventThreshold()) {
     logger().debug("HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method {}",
                    method);
     result = flushMessagesWithCompletion(nullptr);
     count = 0;
   }
-  asyncOnStateQueue([event = std::move(event), method, count](HTTPSPostBackend& self) mutable {
-    Batch& batch = self.batch_;
+  // The append takes its own turn on the state queue after the forced
+  // flush, so the record that forced it is never part of what it flushed.
+  // The turn runs on this thread: waking a pool thread for every record cost
+  // more than the append itself, and a later read on the queue sees the
+  // record either way.
+  stateQueue().sync([&] {
+    Batch& batch = batch_;
     if (!batch.batchedEvents) {
       batch.batchedEvents.emplace();
     }
@@ -1018,9 +1010,18 @@ void HTTPSPostBackend::setPostURL(std::optional<std::string> url) {
   fields_.postURL = std::move(url);
 }
 std::optional<std::string> HTTPSPostBackend::realtimePostURL() const { return fields().realtimePostURL; }
-std::int32_t HTTPSPostBackend::eventThreshold() const { return fields().eventThreshold; }
-std::int32_t HTTPSPostBackend::dnuType() const { return fields().dnuType; }
-bool HTTPSPostBackend::isImmutable() const { return fields().immutable; }
+std::int32_t HTTPSPostBackend::eventThreshold() const {
+  std::lock_guard lock(fieldsMutex_);
+  return fields_.eventThreshold;
+}
+std::int32_t HTTPSPostBackend::dnuType() const {
+  std::lock_guard lock(fieldsMutex_);
+  return fields_.dnuType;
+}
+bool HTTPSPostBackend::isImmutable() const {
+  std::lock_guard lock(fieldsMutex_);
+  return fields_.immutable;
+}
 Value HTTPSPostBackend::overrideSampling() const { return fields().overrideSampling; }
 std::vector<HTTPSPostBackend::Filter> HTTPSPostBackend::filters() const { return *fields().filters; }
 std::int32_t HTTPSPostBackend::numberOfFilters() const { return fields().numberOfFilters; }

@@ -148,9 +148,6 @@ class HTTPSPostBackend : public ZerithBackend {
     std::vector<std::pair<std::uint16_t, std::int64_t>> eventMethodCounts;
   };
   std::optional<std::string> flushOnStateQueue(FlushCompletion completion);
-  // Runs `block` on the state queue later (now, in turn, when the backend is
-  // not owned by a shared pointer).
-  void asyncOnStateQueue(std::function<void(HTTPSPostBackend&)> block);
 
   mutable std::mutex fieldsMutex_;
   Fields fields_;
