@@ -40,7 +40,9 @@ std::string lowered(std::string_view s) {
 }
 
 bool equalsIgnoringCase(std::string_view a, std::string_view b) {
-  return a.size() == b.size() && lowered(a) == lowered(b);
+  return a.size() == b.size() && std::equal(a.begin(), a.end(), b.begin(), [](unsigned char x, unsigned char y) {
+           return std::tolower(x) == std::tolower(y);
+         });
 }
 
 bool containsIgnoringCase(std::string_view haystack, std::string_view needle) {
