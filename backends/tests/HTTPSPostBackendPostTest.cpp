@@ -259,6 +259,35 @@ TEST_F(HTTPSPostTest, ClientErrorsRedirectsAndHugeAnswersLeaveTheBackendEnabled)
   }
 }
 
+TEST_F(HTTPSPostTest, SlowCollectorNeverHoldsUpTheSender) {
+  server.on("/post", Reply{});
+  server.holdAnswers();
+  auto b = immediate(server.url("/post"));
+  auto results = ResultLog::make();
+  b->postJSONMessage("{\"a\":1}", 0, std::nullopt, std::nullopt, results->handler());
+  ASSERT_TRUE(server.waitForRequests(1));
+  // The answer is held; sending and batching go on meanwhile.
+  b->sendMessage(event(2), at(1001), 1, 0, 1);
+  b->setBatchEvents(true);
+  b->sendMessage(event(3), at(1001), 1, 0, 0);
+  EXPECT_EQ(b->batchedEventCount(), 1u);
+  EXPECT_TRUE(results->errors().empty());
+  server.releaseAnswers();
+  ASSERT_TRUE(results->waitFor(1));
+  EXPECT_FALSE(results->errors()[0]);
+}
+
+TEST_F(HTTPSPostTest, URLsThatDoNotParseFailInTheCompletion) {
+  for (const char* url : {"https://[::1/post", "https://exa mple.invalid/post", "://nothing", ""}) {
+    auto b = immediate(url);
+    auto results = ResultLog::make();
+    b->postJSONMessage("{\"a\":1}", 0, std::nullopt, std::nullopt, results->handler());
+    ASSERT_TRUE(results->waitFor(1)) << url;
+    EXPECT_TRUE(results->errors()[0]) << url;
+    EXPECT_EQ(b->state(), kBackendStateEnabled) << url;
+  }
+}
+
 TEST_F(HTTPSPostTest, ClosedConnectionIsLoggedAsAPostError) {
   RefusingPort refusing;
   auto b = immediate(refusing.url("/post"));
