@@ -589,28 +589,37 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
 }
 
 std::optional<std::string> HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
-  return stateQueue().sync([&] { return flushOnStateQueue(std::move(completion)); });
+  // The batch is taken in one turn on the state queue; the post and every
+  // completion run after it, so a completion may read the state.
+  FlushOutcome outcome = stateQueue().sync([&] { return takeBatchOnStateQueue(); });
+  if (outcome.error) {
+    if (completion) {
+      completion(Value(), makeZerithError(outcome.error, -1));
+    }
+    return std::nullopt;
+  }
+  postJSONMessage(*outcome.body, 0, std::nullopt, std::nullopt, std::move(completion));
+  if (outcome.pretty) {
+    setImmutable();
+  }
+  return outcome.pretty;
 }
 
-std::optional<std::string> HTTPSPostBackend::flushOnStateQueue(FlushCompletion completion) {
-  const auto fail = [&](const char* text) {
-    if (completion) {
-      completion(Value(), makeZerithError(text, -1));
-    }
-  };
+HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
+  FlushOutcome outcome;
   if (!batch_.batchedEvents) {
-    fail("Nothing to flush");
-    return std::nullopt;
+    outcome.error = "Nothing to flush";
+    return outcome;
   }
   if (stateOnQueue() != kBackendStateEnabled) {
     batch_ = Batch{};
-    fail("Nothing to flush");
-    return std::nullopt;
+    outcome.error = "Nothing to flush";
+    return outcome;
   }
   Dictionary userInfo = userInfoDict().isDict() ? userInfoDict().dictCopy() : Dictionary();
   if (requireUserInfo() && userInfo.empty()) {
-    fail("Can not flush: userInfo is required");
-    return std::nullopt;
+    outcome.error = "Can not flush: userInfo is required";
+    return outcome;
   }
   logger().debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
   filterEvent(userInfo);
@@ -633,17 +642,11 @@ std::optional<std::string> HTTPSPostBackend::flushOnStateQueue(FlushCompletion c
     kept.push_back(std::move(event));
   }
   batch_ = Batch{};
-  std::optional<std::string> pretty;
-  const auto body = kept.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(kept), &pretty);
-  if (!body) {
-    fail("Nothing to flush: batched events were completely filtered out");
-    return std::nullopt;
+  outcome.body = kept.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(kept), &outcome.pretty);
+  if (!outcome.body) {
+    outcome.error = "Nothing to flush: batched events were completely filtered out";
   }
-  postJSONMessage(*body, 0, std::nullopt, std::nullopt, std::move(completion));
-  if (pretty) {
-    setImmutable();
-  }
-  return pretty;
+  return outcome;
 }
 
 void HTTPSPostBackend::setCorrelatedSessionID(std::optional<std::string> sessionID) {

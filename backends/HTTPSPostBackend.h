@@ -147,7 +147,14 @@ class HTTPSPostBackend : public ZerithBackend {
     std::optional<std::vector<Dictionary>> batchedEvents;
     std::vector<std::pair<std::uint16_t, std::int64_t>> eventMethodCounts;
   };
-  std::optional<std::string> flushOnStateQueue(FlushCompletion completion);
+  // What a flush took from the batch: the envelope and its printable copy,
+  // or why there is nothing to post.
+  struct FlushOutcome {
+    const char* error = nullptr;
+    std::optional<std::string> body;
+    std::optional<std::string> pretty;
+  };
+  FlushOutcome takeBatchOnStateQueue();
 
   mutable std::mutex fieldsMutex_;
   Fields fields_;
