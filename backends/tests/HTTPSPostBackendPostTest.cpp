@@ -249,7 +249,7 @@ TEST_F(HTTPSPostTest, ServerErrorDisablesTheBackendAndLaterEventsStopAtOnce) {
 TEST_F(HTTPSPostTest, ClientErrorsRedirectsAndHugeAnswersLeaveTheBackendEnabled) {
   server.on("/404", Reply{.status = 404});
   server.on("/302", Reply{.status = 302, .headers = {{"Location", "/gone"}}});
-  server.on("/huge", Reply{.body = std::string(8 << 20, 'x')});
+  server.on("/huge", Reply{.body = std::string(2 << 20, 'x')});
   for (const char* path : {"/404", "/302", "/huge"}) {
     auto b = immediate(server.url(path));
     auto results = ResultLog::make();

@@ -119,7 +119,7 @@ class ResultLog : public std::enable_shared_from_this<ResultLog> {
   }
   bool waitFor(std::size_t count) const {
     std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, std::chrono::seconds(10), [&] { return errors_.size() >= count; });
+    return changed_.wait_for(lock, std::chrono::seconds(30), [&] { return errors_.size() >= count; });
   }
   std::vector<std::optional<Error>> errors() const {
     std::lock_guard lock(mutex_);
