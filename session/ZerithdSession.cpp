@@ -2,6 +2,8 @@
 
 #include <sys/time.h>
 
+#include <set>
+
 #include <fmt/format.h>
 
 #include "backends/CreateBackends.h"
@@ -39,6 +41,18 @@ double secondsNow() {
 
 // The reporting states: 2 enabled, 3 sampled out but kept by an override.
 bool isReporting(std::int32_t state) { return state == kBackendStateEnabled || state == kBackendStateSampledOut; }
+
+// Backends keep the device identifier as a pointer they do not own, and a
+// backend may outlive its session (a flush completion holds it; a one-shot
+// backend may still be posting). Every backend therefore gets a copy that
+// lives as long as the process; there is one per distinct identifier, in
+// practice one.
+const char* processLifetimeDeviceID(const char* deviceID) {
+  static std::mutex mutex;
+  static auto* interned = new std::set<std::string>();
+  std::lock_guard lock(mutex);
+  return interned->insert(deviceID).first->c_str();
+}
 
 // The join of one flush over a session's backends.
 struct FlushJoin {
@@ -372,7 +386,7 @@ void ZerithdSession::finishSessionGracefully() {
 
 void ZerithdSession::createBackendsWithStorebag(const Value& storebag) {
   logger().debug("createBackendsWithStorebag: Creating backends for session {}", sessionID());
-  auto made = createBackends(storebag, sessionInfo(), userInfo(), deviceid_.data());
+  auto made = createBackends(storebag, sessionInfo(), userInfo(), processLifetimeDeviceID(deviceid_.data()));
   std::shared_ptr<const BackendDictionary> set;
   if (made) {
     for (const auto& [name, backend] : *made) {
@@ -647,11 +661,12 @@ void ZerithdSession::internalFlushMessagesWithCompletion(ValueErrorCompletion co
   join->pending = set->size();
   join->completion = std::move(completion);
   for (const auto& [name, backend] : *set) {
-    // The block holds the backend: a session that ends mid-flush does not
-    // take a backend away from under its own completion.
+    // The block holds the join and the backend's name, not the backend: a
+    // backend keeps its pending completions, and a completion that held its
+    // backend would keep both alive for ever if it never ran.
     backend->flushMessagesWithCompletion(
-        [join, backend = backend, name = name](const Value& text, const std::optional<Error>& error) {
-          logger().debug("internalFlushMessagesWithCompletion: {}", backend->name());
+        [join, name = name](const Value& text, const std::optional<Error>& error) {
+          logger().debug("internalFlushMessagesWithCompletion: {}", name);
           if (const auto* s = text.string()) {
             writeToLogFile("[{} -> flushMessages] {}", name, *s);
           } else if (!text.isNil()) {
@@ -779,7 +794,7 @@ void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const 
   }
   std::array<char, 41> udid{};
   copyUniqueDeviceID(udid.data(), udid.size());
-  auto backends = createBackends(storebag, sessionInfo, userInfo, udid.data());
+  auto backends = createBackends(storebag, sessionInfo, userInfo, processLifetimeDeviceID(udid.data()));
   if (!backends) {
     logger().error("sendMessageWithSessionInfo: No backends available to send single message");
     return;

@@ -347,12 +347,17 @@ TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSaf
   useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(true)}})}});
   auto c = started(sessionInfo(5));
   const auto a = rec(c, "recA");
+  const std::string device = c.session->deviceID();
+  ASSERT_EQ(device.size(), 40u);
   int calls = 0;
   c.session->flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++calls; });
   agent->invalidateReportingSession(c.session);
   c.session.reset();
   ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
   EXPECT_EQ(a->cleanups(), 1);
+  // The backend outlives its session: the device identifier it points at
+  // must too.
+  EXPECT_EQ(std::string(a->udid()), device);
   // The client's flush and the end-of-session flush both still wait.
   EXPECT_TRUE(a->completeFlush());
   EXPECT_EQ(calls, 1);
@@ -434,6 +439,48 @@ TEST_F(SessionBackendsTest, DisplayURLComesFromTheFirstHttpsBackendThatHasOneThe
   auto d = started(sessionInfo(6, 8));
   d.session->fetchDisplayURL([&](Value v) { url = v; });
   EXPECT_EQ(url, Value("https://dash/1"));
+}
+
+TEST_F(SessionBackendsTest, DispatchFlushesAndHierarchyChangesFromManyThreadsFinishTogether) {
+  // Every lock of the event's road taken at once from several threads: a
+  // child dispatching and flushing while its root changes user info (which
+  // walks the hierarchy under the agent lock and reads the child's backend
+  // states), shares data, and a third session joins and leaves the token.
+  useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(false)}})}, {"recB", Value(Dictionary{})}});
+  auto root = started(hierarchyInfo(1, "busy", 0), /*aggregator=*/true);
+  auto child = started(hierarchyInfo(2, "busy", 1));
+  constexpr int kRounds = 300;
+  std::atomic<int> flushed{0};
+  std::thread sender([&] {
+    for (int i = 0; i < kRounds; ++i) {
+      child.session->sendMessageWithDictionary(event(5, static_cast<unsigned>(i)), nullptr);
+      child.session->flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++flushed; });
+    }
+  });
+  std::thread changer([&] {
+    for (int i = 0; i < kRounds; ++i) {
+      root.session->fetchStatesWithUserInfo(
+          Value(Dictionary{{kZerithUserInfoClientName, Value("n" + std::to_string(i))}}), nullptr);
+      root.session->updateSharedDataForKey(Value("round"), Value(i));
+    }
+  });
+  std::thread joiner([&] {
+    for (int i = 0; i < kRounds / 10; ++i) {
+      auto passing = started(hierarchyInfo(static_cast<std::uint32_t>(100 + i), "busy", 2, 8));
+      passing.session->sendMessageWithDictionary(event(6, 1), nullptr);
+      agent->invalidateReportingSession(passing.session);
+    }
+  });
+  sender.join();
+  changer.join();
+  joiner.join();
+  EXPECT_EQ(flushed, kRounds);
+  EXPECT_EQ(rec(child, "recA")->count(), static_cast<std::size_t>(kRounds) + 1);  // and the start message
+  std::size_t atRoot = 0;
+  for (const auto& m : aggregated(*root.connection)) {
+    atRoot += m.get("category") == Value(5u) ? 1 : 0;
+  }
+  EXPECT_EQ(atRoot, static_cast<std::size_t>(kRounds));
 }
 
 // --- Health and the end of a session -------------------------------------------------------------
