@@ -7,6 +7,7 @@
 #include <string_view>
 
 #include "backends/DashboardBackend.h"
+#include "backends/HTTPSPostBackend.h"
 #include "backends/KovuBackend.h"
 #include "backends/PellamBackend.h"
 #include "backends/UploadBackend.h"
@@ -71,7 +72,10 @@ const std::vector<Kind>& kinds() {
   static const std::vector<Kind> table = {
       {&kZerithBackendDashboard, always, makeChecked<DashboardBackend>},
       {&kZerithBackendUploadServer, always, makeChecked<UploadBackend>},
+      {&kZerithBackendHTTPPost, always, makeChecked<HTTPSPostBackend>},
+      {&kZerithBackendHTTPPost2, always, makeChecked<HTTPSPostBackend>},
       {&kZerithBackendPellamlog, always, makePlain<PellamBackend>},
+      {&kZerithBackendQRS, always, makeChecked<HTTPSPostBackend>},
       {&kZerithBackendKovu, adaptorAvailable, makeKovu},
   };
   return table;

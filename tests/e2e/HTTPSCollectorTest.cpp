@@ -1,0 +1,134 @@
+// Events from a real client session through the real daemon to a real
+// collector: the storebag (signed, served by the collector over HTTPS)
+// enables the HTTPS backend for the client type, and the collector sees one
+// record per event with the sender code and the session ID; a collector
+// that answers 503 disables the backend.
+
+#include <filesystem>
+
+#include "backends/ZerithBackend.h"
+#include "config/StorebagSigner.h"
+#include "tests/e2e/E2eFixture.h"
+#include "tests/support/CollectorProcess.h"
+#include "zerith/Zerith.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+namespace fs = std::filesystem;
+
+class HTTPSCollectorTest : public E2eTest {
+ protected:
+  // The collector (answering `status`), the signed storebag it serves, and
+  // the daemon trusting its CA.
+  void startAll(int status) {
+    grant(Value(true));
+    const auto keys = generateStorebagKeyPair(2048);
+    ASSERT_TRUE(keys.has_value());
+    root.write("/usr/share/zerith/publicKey.der", std::string(keys->publicKeyDER.begin(), keys->publicKeyDER.end()));
+    const fs::path certs = root.path() / "collector/certs";
+    const fs::path www = root.path() / "collector/www";
+    collector = std::make_unique<CollectorProcess>(
+        ZERITH_COLLECTOR_TOOL, std::vector<std::string>{"--generate-cert", certs.string(), "--serve", www.string(),
+                                                        "--status", std::to_string(status)});
+    ASSERT_GT(collector->port(), 0) << collector->said();
+
+    const Value client(Dictionary{{"client", "demo"},
+                                  {"service", "cli"},
+                                  {"override_dnu", 1},
+                                  {"locale_whitelist", Array{Value("GB")}},
+                                  {"filters", Array{Value(Dictionary{{"key", "udid"}, {"action", "sha256"}})}},
+                                  {"sampling_threshold", 1.0},
+                                  {"post_url", collector->url("/post")}});
+    const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{client}}}}});
+    const Value bag(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
+    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
+    ASSERT_TRUE(container.has_value());
+    fs::create_directories(www / "zerith");
+    file::writeAtomically(www / "zerith/dravon", *container, fs::perms(0644));
+    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(collector->url("/zerith")));
+
+    DaemonProcess::Options options;
+    options.arguments = {"--stop-timeout", "5", "--ca-file", (certs / "ca.pem").string()};
+    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
+    startDaemon(options);
+  }
+
+  std::unique_ptr<Zerith> startSession(std::uint32_t sessionID) {
+    auto client = Zerith::connect();
+    EXPECT_TRUE(client);
+    if (!client) {
+      return nullptr;
+    }
+    // User info required: the whole storebag check runs (consent, locale,
+    // filters, sampling).
+    const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)},
+                                {kZerithSessionInfoClientType, Value(7)},
+                                {kZerithSessionInfoRequireUserInfo, Value(true)}});
+    const Value user(Dictionary{{kZerithUserInfoClientName, "demo"}, {kZerithUserInfoServiceName, "cli"}});
+    EXPECT_TRUE(client->setSessionInfo(info, user, Value(), false, 10s));
+    const auto started = client->startConfig(20s);
+    EXPECT_TRUE(started);
+    EXPECT_EQ(started["backends"], Value(Array{Value("httpsPost")})) << daemon->output();
+    return client;
+  }
+
+  static Value event(int category, int type, Dictionary payload) {
+    return Value(Dictionary{{kZerithMessageParametersCategory, Value(category)},
+                            {kZerithMessageParametersType, Value(type)},
+                            {kZerithMessageParametersPayload, Value(std::move(payload))}});
+  }
+
+  std::unique_ptr<CollectorProcess> collector;
+};
+
+TEST_F(HTTPSCollectorTest, ClientEventsArriveAsRecordsWithSenderCodeAndSessionID) {
+  startAll(200);
+  auto client = startSession(4242);
+  ASSERT_TRUE(client);
+  ASSERT_TRUE(client->sendMessage(event(3, 4, {{"bytes", 1200}, {"udid", "device-7"}}), 10s));
+  ASSERT_TRUE(client->sendMessage(event(3, 5, {{"bytes", 1300}}), 10s));
+
+  // The session's own start message may come first; find ours by method.
+  std::vector<nlohmann::ordered_json> ours;
+  while (ours.size() < 2) {
+    const auto line = collector->nextLine("record");
+    ASSERT_TRUE(line) << daemon->output();
+    if ((*line)["record"]["_method"] == 3) {
+      ours.push_back(*line);
+    }
+  }
+  for (const auto& line : ours) {
+    EXPECT_EQ(line["_sender"], "YJ");
+    EXPECT_EQ(line["_sessionID"], 4242);
+    EXPECT_EQ(line["record"]["clientName"], "demo");
+    EXPECT_EQ(line["path"], "/post");
+  }
+  EXPECT_EQ(ours[0]["record"]["_status"], 4);
+  EXPECT_EQ(ours[0]["record"]["bytes"], 1200);
+  EXPECT_EQ(ours[0]["record"]["udid"], ZerithBackend::convertIntoSHA256("device-7"));
+  EXPECT_EQ(ours[1]["record"]["_status"], 5);
+  client->finishSession(10s);
+}
+
+TEST_F(HTTPSCollectorTest, ServerErrorFromTheCollectorDisablesTheBackend) {
+  startAll(503);
+  auto client = startSession(77);
+  ASSERT_TRUE(client);
+  ASSERT_TRUE(client->sendMessage(event(3, 4, {{"n", 1}}), 10s));
+  ASSERT_TRUE(daemon->waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"))
+      << daemon->output();
+  ASSERT_TRUE(client->sendMessage(event(3, 4, {{"n", 2}}), 10s));
+  ASSERT_TRUE(client->flushMessages(10s));
+  // Everything the collector received: nothing after the refusal.
+  std::size_t records = 0;
+  for (const auto& line : collector->stopAndReadRest("record")) {
+    records += line["record"]["_method"] == 3;
+    EXPECT_NE(line["record"].value("n", 0), 2);
+  }
+  EXPECT_LE(records, 1u);
+}
+
+}  // namespace
+}  // namespace zerith::test

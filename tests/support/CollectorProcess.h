@@ -1,0 +1,136 @@
+#pragma once
+
+// The zerith-collector executable as a child process of a test, its JSON
+// lines read from a pipe: ready once it says where it listens, each line
+// waited for with a deadline, and the rest read to the end once it stops.
+//
+//   test::CollectorProcess collector(ZERITH_COLLECTOR_TOOL, {"--generate-cert", dir, "--status", "503"});
+//   auto line = collector.nextLine("record");
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+namespace zerith::test {
+
+class CollectorProcess {
+ public:
+  CollectorProcess(const std::string& tool, std::vector<std::string> args) {
+    int out[2];
+    int err[2];
+    if (::pipe2(out, O_CLOEXEC) != 0 || ::pipe2(err, O_CLOEXEC) != 0) {
+      return;
+    }
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      ::dup2(out[1], 1);
+      ::dup2(err[1], 2);
+      args.insert(args.begin(), tool);
+      std::vector<char*> argv;
+      for (auto& a : args) {
+        argv.push_back(a.data());
+      }
+      argv.push_back(nullptr);
+      ::execv(argv[0], argv.data());
+      ::_exit(127);
+    }
+    ::close(out[1]);
+    ::close(err[1]);
+    out_ = out[0];
+    err_ = err[0];
+    // Ready once it says where it listens.
+    while (said_.find("listening on ") == std::string::npos || said_.back() != '\n') {
+      if (!readSome(err_, said_)) {
+        break;
+      }
+    }
+    const auto at = said_.rfind(':');
+    port_ = at == std::string::npos ? 0 : std::atoi(said_.c_str() + at + 1);
+  }
+  ~CollectorProcess() {
+    stop();
+    ::close(out_);
+    ::close(err_);
+  }
+  CollectorProcess(const CollectorProcess&) = delete;
+  CollectorProcess& operator=(const CollectorProcess&) = delete;
+
+  int port() const { return port_; }
+  // What it wrote to standard error so far (for failure messages).
+  const std::string& said() const { return said_; }
+  std::string url(const std::string& path) const { return "https://127.0.0.1:" + std::to_string(port_) + path; }
+
+  // The next JSON line (of this "kind" when given; others are skipped), or
+  // nullopt after `timeout` or at the end of its output.
+  std::optional<nlohmann::ordered_json> nextLine(const std::string& kind = {},
+                                                 std::chrono::milliseconds timeout = std::chrono::seconds(10)) {
+    while (true) {
+      const auto newline = pending_.find('\n');
+      if (newline != std::string::npos) {
+        const std::string line = pending_.substr(0, newline);
+        pending_.erase(0, newline + 1);
+        auto json = nlohmann::ordered_json::parse(line, nullptr, false);
+        if (kind.empty() || (json.is_object() && json.value("kind", "") == kind)) {
+          return json;
+        }
+        continue;
+      }
+      if (!readSome(out_, pending_, timeout)) {
+        return std::nullopt;
+      }
+    }
+  }
+
+  // Stops it (SIGTERM) and returns every line it had not been asked for.
+  std::vector<nlohmann::ordered_json> stopAndReadRest(const std::string& kind = {}) {
+    stop();
+    std::vector<nlohmann::ordered_json> rest;
+    while (auto line = nextLine(kind)) {
+      rest.push_back(std::move(*line));
+    }
+    return rest;
+  }
+
+  void stop() {
+    if (pid_ > 0) {
+      ::kill(pid_, SIGTERM);
+      int status = 0;
+      ::waitpid(pid_, &status, 0);
+      pid_ = -1;
+    }
+  }
+
+ private:
+  static bool readSome(int fd, std::string& into, std::chrono::milliseconds timeout = std::chrono::seconds(10)) {
+    pollfd p{fd, POLLIN, 0};
+    if (fd < 0 || ::poll(&p, 1, static_cast<int>(timeout.count())) <= 0) {
+      return false;
+    }
+    char buffer[65536];
+    const ssize_t n = ::read(fd, buffer, sizeof(buffer));
+    if (n <= 0) {
+      return false;
+    }
+    into.append(buffer, static_cast<std::size_t>(n));
+    return true;
+  }
+
+  pid_t pid_ = -1;
+  int out_ = -1;
+  int err_ = -1;
+  int port_ = 0;
+  std::string said_;
+  std::string pending_;
+};
+
+}  // namespace zerith::test
