@@ -33,12 +33,26 @@ std::atomic<std::size_t> gPauseReadingAt{QueueLimits{}.pauseReadingAt};
 std::atomic<std::size_t> gResumeReadingAt{QueueLimits{}.resumeReadingAt};
 std::atomic<std::size_t> gPerConnection{QueueLimits{}.perConnection};
 std::atomic<std::size_t> gAllConnections{QueueLimits{}.allConnections};
+std::atomic<std::size_t> gCallsInFlight{QueueLimits{}.callsInFlight};
 
 // Sends the reply to one call through the connection that delivered it.
 class SocketReply final : public Reply {
  public:
-  SocketReply(std::weak_ptr<SocketConnection> connection, std::optional<std::uint64_t> call)
-      : connection_(std::move(connection)), call_(call) {}
+  // Counts as a call waiting for its answer on `connection` until it is
+  // answered or dropped.
+  SocketReply(const std::shared_ptr<SocketConnection>& connection, std::optional<std::uint64_t> call)
+      : connection_(connection), call_(call) {
+    if (call_) {
+      connection->callTaken();
+    }
+  }
+  ~SocketReply() override {
+    if (call_ && !answered_.exchange(true)) {
+      if (auto c = connection_.lock()) {
+        c->callAnswered();
+      }
+    }
+  }
 
   void send(Dictionary args) override {
     if (!call_ || answered_.exchange(true)) {
@@ -46,6 +60,7 @@ class SocketReply final : public Reply {
     }
     if (auto c = connection_.lock()) {
       c->writeFrame(encodeReply(*call_, args));
+      c->callAnswered();
     }
   }
 
@@ -55,6 +70,7 @@ class SocketReply final : public Reply {
     }
     if (auto c = connection_.lock()) {
       c->writeFrame(encodeErrorReply(*call_, error));
+      c->callAnswered();
     }
   }
 
@@ -148,7 +164,8 @@ struct QueueRegistry {
 };
 
 QueueLimits queueLimits() {
-  return QueueLimits{gPauseReadingAt.load(), gResumeReadingAt.load(), gPerConnection.load(), gAllConnections.load()};
+  return QueueLimits{gPauseReadingAt.load(), gResumeReadingAt.load(), gPerConnection.load(), gAllConnections.load(),
+                     gCallsInFlight.load()};
 }
 
 void setQueueLimits(const QueueLimits& limits) {
@@ -156,6 +173,7 @@ void setQueueLimits(const QueueLimits& limits) {
   gResumeReadingAt = std::min(limits.resumeReadingAt, limits.pauseReadingAt);
   gPerConnection = limits.perConnection;
   gAllConnections = limits.allConnections;
+  gCallsInFlight = std::max<std::size_t>(limits.callsInFlight, 1);
 }
 
 std::size_t queuedBytesOfAllConnections() { return QueueRegistry::get().total.load(); }
@@ -345,23 +363,32 @@ void SocketConnection::continueReading() {
       case InputState::Paused: break;
     }
     std::size_t waiting = 0;
+    std::size_t unanswered = 0;
+    bool hold = false;
     {
       std::lock_guard lock(writeMutex_);
       if (writeClosed_) {
         return;
       }
       waiting = outboxBytes_;
-      if (waiting >= gPauseReadingAt.load()) {
-        // onWritable reads on once the outbox has drained.
+      unanswered = callsInFlight_.load();
+      hold = waiting >= gPauseReadingAt.load() || unanswered >= gCallsInFlight.load();
+      if (hold) {
+        // onWritable or callAnswered reads on once the peer has caught up.
         readPaused_ = true;
+        readPausedFlag_ = true;
         QueueRegistry::get().giveBackArmed = true;
       }
     }
-    if (waiting >= gPauseReadingAt.load()) {
-      log_.debug("{}: peer does not read its replies ({} bytes waiting); reading paused", description(), waiting);
+    if (hold) {
+      if (waiting >= gPauseReadingAt.load()) {
+        log_.debug("{}: peer does not read its replies ({} bytes waiting); reading paused", description(), waiting);
+      } else {
+        log_.debug("{}: {} calls wait for their answers; reading paused", description(), unanswered);
+      }
       return;
     }
-    // The outbox drained between the check and the lock: deliver on.
+    // The peer caught up between the check and the lock: deliver on.
   }
 }
 
@@ -370,7 +397,7 @@ SocketConnection::InputState SocketConnection::processInput() {
     if (invalidated_) {
       return InputState::Closed;
     }
-    if (queued_.load() >= gPauseReadingAt.load()) {
+    if (queued_.load() >= gPauseReadingAt.load() || callsInFlight_.load() >= gCallsInFlight.load()) {
       return InputState::Paused;
     }
     plist::Bytes body;
@@ -585,10 +612,7 @@ void SocketConnection::onWritable(const std::error_code& ec) {
       if (!outbox_.empty()) {
         armWritable();
       }
-      if (readPaused_ && outboxBytes_ < gResumeReadingAt.load()) {
-        readPaused_ = false;
-        readOn = true;
-      }
+      readOn = mayReadOn();
     }
   }
   if (err) {
@@ -596,14 +620,46 @@ void SocketConnection::onWritable(const std::error_code& ec) {
     return;
   }
   if (readOn) {
-    log_.debug("{}: peer reads again; reading resumed", description());
-    queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] {
-      if (!self->invalidated_) {
-        self->continueReading();
-      }
-    });
+    readOnLater();
   }
   QueueRegistry::get().giveBackIfDrained(log_);
+}
+
+// Called with writeMutex_ held: ends a pause once the peer has caught up.
+bool SocketConnection::mayReadOn() {
+  if (!readPaused_ || writeClosed_ || outboxBytes_ >= gResumeReadingAt.load() ||
+      callsInFlight_.load() >= std::max<std::size_t>(gCallsInFlight.load() / 2, 1)) {
+    return false;
+  }
+  readPaused_ = false;
+  readPausedFlag_ = false;
+  return true;
+}
+
+void SocketConnection::readOnLater() {
+  log_.debug("{}: peer caught up; reading resumed", description());
+  queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] {
+    if (!self->invalidated_) {
+      self->continueReading();
+    }
+  });
+}
+
+void SocketConnection::callTaken() { ++callsInFlight_; }
+
+void SocketConnection::callAnswered() {
+  --callsInFlight_;
+  if (!readPausedFlag_.load()) {
+    return;
+  }
+  bool readOn = false;
+  {
+    std::lock_guard lock(writeMutex_);
+    readOn = mayReadOn();
+  }
+  if (readOn) {
+    readOnLater();
+  }
 }
 
 void SocketConnection::writeFailed(int err) {
@@ -650,6 +706,7 @@ void SocketConnection::beginInvalidation() {
     std::lock_guard lock(writeMutex_);
     writeClosed_ = true;
     readPaused_ = false;
+    readPausedFlag_ = false;
     setOutboxBytes(0);
     std::deque<Data>().swap(outbox_);
     // Wakes the outstanding read; the descriptor itself is closed on the

@@ -17,7 +17,9 @@
 // the replies is throttled, not buffered. Once its outbox holds
 // pauseReadingAt bytes the connection delivers no further call and stops
 // reading its socket (the peer's writes then block in the kernel) until the
-// outbox has drained below resumeReadingAt. An outbox over perConnection
+// outbox has drained below resumeReadingAt. Calls that are taken but not
+// answered yet count too: at callsInFlight of them the connection takes no
+// further call until half are answered. An outbox over perConnection
 // (kMaxOutboxBytes) still means the peer has stopped reading; the connection
 // is then closed. The outboxes of all connections together are held under
 // allConnections: past it the connection whose peer has gone longest without
@@ -50,6 +52,9 @@ struct QueueLimits {
   std::size_t resumeReadingAt = 256u << 10;
   std::size_t perConnection = kMaxOutboxBytes;
   std::size_t allConnections = kMaxQueuedBytesAllConnections;
+  // Calls taken from one connection and not answered yet: at this many the
+  // connection takes no further call until half of them are answered.
+  std::size_t callsInFlight = 1024;
 };
 
 // The process's limits; tests lower them to reach them with little traffic.
@@ -101,6 +106,11 @@ class SocketConnection final : public Connection {
   std::size_t queuedBytes() const { return queued_.load(); }
   // True while reading is held back because the peer does not read.
   bool readingPaused() const;
+  // Calls delivered from the peer that are not answered yet (the reply
+  // paths count them).
+  std::size_t callsInFlight() const { return callsInFlight_.load(); }
+  void callTaken();
+  void callAnswered();
 
  private:
   friend struct QueueRegistry;
@@ -124,6 +134,8 @@ class SocketConnection final : public Connection {
   // Called with writeMutex_ held: the outbox now holds `bytes`.
   void setOutboxBytes(std::size_t bytes);
   void closeOverGlobalLimit(std::size_t total, std::size_t limit);
+  bool mayReadOn();
+  void readOnLater();
 
   void beginInvalidation();
   void finishInvalidation();
@@ -158,7 +170,9 @@ class SocketConnection final : public Connection {
   bool readPaused_ = false;
   // Mirrors for the process-wide limit, read without writeMutex_.
   std::atomic<std::size_t> queued_{0};
-  std::atomic<std::int64_t> waitingSince_{0};  // steady-clock ns since the outbox was last empty; 0 when empty
+  std::atomic<std::int64_t> waitingSince_{0};
+  std::atomic<bool> readPausedFlag_{false};  // readPaused_, for callAnswered's quick check
+  std::atomic<std::size_t> callsInFlight_{0};  // steady-clock ns since the outbox was last empty; 0 when empty
 
   std::mutex callsMutex_;
   std::uint64_t nextCall_ = 1;

@@ -10,7 +10,9 @@
 
 #include <cerrno>
 #include <cstring>
+#include <atomic>
 #include <memory>
+#include <mutex>
 #include <vector>
 
 #include "ipc/SocketConnection.h"
@@ -93,7 +95,7 @@ TEST_F(Flood, APeerThatDoesNotReadIsThrottledAndServedInFullOnceItReads) {
     ASSERT_EQ(reply->replyTo, static_cast<std::uint64_t>(i));
   }
   EXPECT_EQ(flooder.object->calls().size(), static_cast<std::size_t>(written));
-  EXPECT_TRUE(capture.contains(flooder.connection->description() + ": peer reads again; reading resumed"));
+  EXPECT_TRUE(capture.contains(flooder.connection->description() + ": peer caught up; reading resumed"));
   EXPECT_FALSE(flooder.connection->readingPaused());
   EXPECT_EQ(flooder.connection->queuedBytes(), 0u);
   EXPECT_TRUE(capture.waitFor("memory given back"));
@@ -164,6 +166,67 @@ TEST_F(Flood, APeerThatReadsSlowlyIsChosenOverOneThatJustStarted) {
   ASSERT_TRUE(older.invalidated.waitFor(1));
   EXPECT_EQ(newer.invalidated.count(), 0);
   EXPECT_TRUE(capture.contains(older.connection->description() + ": closing connection: replies waiting"));
+}
+
+TEST_F(Flood, CallsLeftUnansweredHoldBackFurtherCallsUntilHalfAreAnswered) {
+  // An object that answers later (as a flush does) keeps its replies; the
+  // peer reads everything, so only the unanswered calls can hold it back.
+  setQueueLimits({.pauseReadingAt = 1u << 20, .resumeReadingAt = 256u << 10, .perConnection = 64u << 20,
+                  .allConnections = 1u << 30, .callsInFlight = 64});
+  log::LogCapture capture;
+  RawPeer peer;
+  std::mutex held;
+  std::vector<std::shared_ptr<Reply>> unanswered;
+  std::atomic<bool> answerAtOnce{false};
+  peer.object->answer = [&](const Message&, std::shared_ptr<Reply> r) {
+    if (answerAtOnce) {
+      r->send(Dictionary{});
+      return;
+    }
+    std::lock_guard lock(held);
+    unanswered.push_back(std::move(r));
+  };
+  Data calls;
+  for (std::uint64_t n = 1; n <= 200; ++n) {
+    const Data frame = paddedCall(n, 10);
+    calls.insert(calls.end(), frame.begin(), frame.end());
+  }
+  peer.write(calls);
+  ASSERT_TRUE(capture.waitFor(peer.connection->description() + ": 64 calls wait for their answers; reading paused"));
+  EXPECT_EQ(peer.object->calls().size(), 64u);
+  EXPECT_EQ(peer.connection->callsInFlight(), 64u);
+
+  // Answering 32 is not yet enough; the 33rd is.
+  auto answer = [&](std::size_t count) {
+    std::vector<std::shared_ptr<Reply>> now;
+    {
+      std::lock_guard lock(held);
+      now.assign(unanswered.begin(), unanswered.begin() + static_cast<std::ptrdiff_t>(count));
+      unanswered.erase(unanswered.begin(), unanswered.begin() + static_cast<std::ptrdiff_t>(count));
+    }
+    for (auto& r : now) {
+      r->send(Dictionary{});
+    }
+  };
+  answer(32);
+  for (int i = 0; i < 32; ++i) {
+    ASSERT_TRUE(peer.readMessage());
+  }
+  EXPECT_TRUE(peer.connection->readingPaused());
+  EXPECT_EQ(peer.object->calls().size(), 64u);
+  answer(1);
+  // 31 remain unanswered: 33 more calls come in before the next pause.
+  ASSERT_TRUE(peer.object->received.waitFor(64 + 33));
+  ASSERT_TRUE(capture.waitFor(": 64 calls wait for their answers; reading paused"));
+  EXPECT_EQ(peer.object->calls().size(), 97u);
+  // Replies dropped unanswered count as answered too.
+  answerAtOnce = true;
+  {
+    std::lock_guard lock(held);
+    unanswered.clear();
+  }
+  ASSERT_TRUE(peer.object->received.waitFor(200));
+  EXPECT_EQ(peer.object->calls().back().call, 200u);
 }
 
 TEST_F(Flood, MessagesTheDaemonSendsToAPeerThatNeverReadsCloseItAtTheConnectionLimit) {
