@@ -2,11 +2,21 @@
 // units as systemd-analyze sees them, the sysusers and tmpfiles snippets
 // applied by systemd's own tools to that tree, and the installed daemon.
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <signal.h>
 #include <stdlib.h>
+#include <sys/inotify.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <chrono>
+#include <cstring>
 
 #include <cstdio>
 #include <filesystem>
@@ -18,7 +28,11 @@
 #include <string>
 #include <vector>
 
+#include "ipc/Frame.h"
+#include "platform/FileUtil.h"
 #include "platform/Paths.h"
+#include "platform/PropertyList.h"
+#include "tests/support/TempRoot.h"
 
 namespace zerith::packaging::test {
 namespace {
@@ -257,6 +271,120 @@ TEST_F(InstalledTree, TheInstalledDaemonRunsWithTheInstalledFramework) {
   const Outcome help = run("env LD_LIBRARY_PATH=" + quote(lib) + " " + quote(at("/usr/sbin/zerithd").string()) + " --help");
   EXPECT_EQ(help.status, 0) << help.output;
   EXPECT_NE(help.output.find("--stop-timeout"), std::string::npos) << help.output;
+}
+
+// Waits for `name` to appear in the folder `inotify` watches.
+bool waitForCreation(int inotify, const fs::path& file, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!fs::exists(file)) {
+    const auto left =
+        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
+    pollfd p{inotify, POLLIN, 0};
+    if (left <= 0 || ::poll(&p, 1, static_cast<int>(left)) <= 0) {
+      return fs::exists(file);
+    }
+    char events[4096];
+    (void)!::read(inotify, events, sizeof(events));
+  }
+  return true;
+}
+
+// The first frame the socket delivers, or nullopt on time-out or close.
+std::optional<Value> readMessage(int fd, std::chrono::milliseconds timeout) {
+  ipc::FrameDecoder decoder;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  std::uint8_t buffer[4096];
+  for (;;) {
+    plist::Bytes body;
+    std::string why;
+    if (decoder.next(body, why) == ipc::FrameDecoder::Status::Frame) {
+      return plist::decodeBinary(body);
+    }
+    const auto left =
+        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
+    pollfd p{fd, POLLIN, 0};
+    if (left <= 0 || ::poll(&p, 1, static_cast<int>(left)) <= 0) {
+      return std::nullopt;
+    }
+    const ssize_t n = ::recv(fd, buffer, sizeof(buffer), 0);
+    if (n <= 0) {
+      return std::nullopt;
+    }
+    decoder.append(buffer, static_cast<std::size_t>(n));
+  }
+}
+
+TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPassesIn) {
+  // As zerithd.socket does: something else listens, the daemon starts on
+  // the first connection and takes the listening socket over.
+  if (!onPath("systemd-socket-activate")) {
+    GTEST_SKIP() << "systemd-socket-activate is not installed here; socket activation was not tried";
+  }
+  zerith::test::TempRoot root;
+  const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
+                                {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", Value(true)}})}});
+  root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
+  const fs::path socketPath = paths::socketPath();
+  fs::create_directories(socketPath.parent_path());
+  file::UniqueFd inotify(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+  ASSERT_TRUE(inotify);
+  ASSERT_GE(::inotify_add_watch(inotify.get(), socketPath.parent_path().c_str(), IN_CREATE), 0);
+
+  const fs::path log = root.path() / "daemon.log";
+  const std::string lib = fs::exists(at("/usr/lib/x86_64-linux-gnu/libzerith.so.8"))
+                              ? at("/usr/lib/x86_64-linux-gnu").string()
+                              : at("/usr/lib").string();
+  const std::vector<std::string> argv{"systemd-socket-activate", "-l", socketPath.string(),
+                                      "-E", "LD_LIBRARY_PATH=" + lib,
+                                      at("/usr/sbin/zerithd").string(), "--root", root.path().string(),
+                                      "--stop-timeout", "5"};
+  const pid_t pid = ::fork();
+  ASSERT_GE(pid, 0);
+  if (pid == 0) {
+    const int out = ::open(log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    ::dup2(out, STDOUT_FILENO);
+    ::dup2(out, STDERR_FILENO);
+    std::vector<char*> args;
+    for (const auto& a : argv) {
+      args.push_back(const_cast<char*>(a.c_str()));
+    }
+    args.push_back(nullptr);
+    ::execvp(args[0], args.data());
+    ::_exit(127);
+  }
+  const auto stopDaemon = [&] {
+    file::UniqueFd exited(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+    ::kill(pid, SIGTERM);
+    pollfd p{exited.get(), POLLIN, 0};
+    int status = 0;
+    if (!exited || ::poll(&p, 1, 10000) <= 0) {
+      ::kill(pid, SIGKILL);
+      ::waitpid(pid, &status, 0);
+      return -1;
+    }
+    ::waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  };
+  ASSERT_TRUE(waitForCreation(inotify.get(), socketPath, std::chrono::seconds(10))) << (stopDaemon(), readFile(log));
+
+  file::UniqueFd client(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, socketPath.c_str(), sizeof(address.sun_path) - 1);
+  ASSERT_EQ(::connect(client.get(), reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
+  const Data call = ipc::encodeCall("fetchDisplayURL:", 1, {});
+  ASSERT_EQ(::send(client.get(), call.data(), call.size(), MSG_NOSIGNAL), static_cast<ssize_t>(call.size()));
+  const auto reply = readMessage(client.get(), std::chrono::seconds(15));
+  client.reset();
+  const int status = stopDaemon();
+  const std::string output = readFile(log);
+  ASSERT_TRUE(reply.has_value()) << output;
+  EXPECT_EQ((*reply)["reply"], Value(1));
+  EXPECT_EQ((*reply)["args"]["url"], Value("URL not available"));
+  EXPECT_NE(output.find("Listener: using the socket passed by the service manager (fd 3)"), std::string::npos)
+      << output;
+  EXPECT_EQ(status, 0) << output;
+  EXPECT_NE(output.find("main: Received signal 15, no longer accepting connections"), std::string::npos) << output;
 }
 
 TEST(InstallScript, RefusesAnUnknownOptionAndAnInstallWithoutRootOrStagingFolder) {
