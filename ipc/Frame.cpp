@@ -136,6 +136,14 @@ void FrameDecoder::append(const std::uint8_t* bytes, std::size_t size) {
   buffer_.insert(buffer_.end(), bytes, bytes + size);
 }
 
+void FrameDecoder::releaseSpare() {
+  constexpr std::size_t kKeep = 128u << 10;
+  if (offset_ == buffer_.size() && buffer_.capacity() > kKeep) {
+    Data().swap(buffer_);
+    offset_ = 0;
+  }
+}
+
 FrameDecoder::Status FrameDecoder::next(plist::Bytes& body, std::string& why) {
   if (invalid_) {
     why = "the stream was already invalid";

@@ -53,6 +53,9 @@ class FrameDecoder {
   Status next(plist::Bytes& body, std::string& why);
   // Bytes received but not yet handed out.
   std::size_t buffered() const { return buffer_.size() - offset_; }
+  // Gives back the storage a large frame left behind once nothing is
+  // buffered.
+  void releaseSpare();
 
  private:
   Data buffer_;

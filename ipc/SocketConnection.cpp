@@ -3,9 +3,16 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 
+#if defined(__GLIBC__)
+#include <malloc.h>
+#endif
+
+#include <algorithm>
 #include <asio/error.hpp>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
+#include <limits>
 
 #include "platform/Executors.h"
 
@@ -17,11 +24,35 @@ constexpr std::size_t kReadChunk = 64u << 10;
 
 std::string errnoText(int err) { return std::error_code(err, std::generic_category()).message(); }
 
+std::int64_t steadyNanos() {
+  return std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now().time_since_epoch())
+      .count();
+}
+
+std::atomic<std::size_t> gPauseReadingAt{QueueLimits{}.pauseReadingAt};
+std::atomic<std::size_t> gResumeReadingAt{QueueLimits{}.resumeReadingAt};
+std::atomic<std::size_t> gPerConnection{QueueLimits{}.perConnection};
+std::atomic<std::size_t> gAllConnections{QueueLimits{}.allConnections};
+std::atomic<std::size_t> gCallsInFlight{QueueLimits{}.callsInFlight};
+
 // Sends the reply to one call through the connection that delivered it.
 class SocketReply final : public Reply {
  public:
-  SocketReply(std::weak_ptr<SocketConnection> connection, std::optional<std::uint64_t> call)
-      : connection_(std::move(connection)), call_(call) {}
+  // Counts as a call waiting for its answer on `connection` until it is
+  // answered or dropped.
+  SocketReply(const std::shared_ptr<SocketConnection>& connection, std::optional<std::uint64_t> call)
+      : connection_(connection), call_(call) {
+    if (call_) {
+      connection->callTaken();
+    }
+  }
+  ~SocketReply() override {
+    if (call_ && !answered_.exchange(true)) {
+      if (auto c = connection_.lock()) {
+        c->callAnswered();
+      }
+    }
+  }
 
   void send(Dictionary args) override {
     if (!call_ || answered_.exchange(true)) {
@@ -29,6 +60,7 @@ class SocketReply final : public Reply {
     }
     if (auto c = connection_.lock()) {
       c->writeFrame(encodeReply(*call_, args));
+      c->callAnswered();
     }
   }
 
@@ -38,6 +70,7 @@ class SocketReply final : public Reply {
     }
     if (auto c = connection_.lock()) {
       c->writeFrame(encodeErrorReply(*call_, error));
+      c->callAnswered();
     }
   }
 
@@ -48,6 +81,102 @@ class SocketReply final : public Reply {
 };
 
 }  // namespace
+
+// Every connection of the process, for the limit on the bytes their outboxes
+// hold together.
+struct QueueRegistry {
+  std::mutex mutex;
+  std::vector<SocketConnection*> connections;
+  std::atomic<std::size_t> total{0};
+  // Set once bytes have waited for a peer that did not read; the memory they
+  // took is given back when the outboxes have drained again.
+  std::atomic<bool> giveBackArmed{false};
+  std::mutex enforcing;  // one closer at a time
+
+  static QueueRegistry& get() {
+    static auto* registry = new QueueRegistry();  // never destroyed: connections may outlive statics
+    return *registry;
+  }
+
+  void add(SocketConnection* c) {
+    std::lock_guard lock(mutex);
+    connections.push_back(c);
+  }
+  void remove(SocketConnection* c) {
+    std::lock_guard lock(mutex);
+    connections.erase(std::remove(connections.begin(), connections.end(), c), connections.end());
+  }
+
+  // Closes the slowest readers until the total is back under the limit. The
+  // slowest is the connection whose outbox has been waiting the longest
+  // (never emptied since); of equals the one holding more.
+  void enforce() {
+    std::lock_guard one(enforcing);
+    std::vector<const SocketConnection*> closed;
+    for (;;) {
+      const std::size_t limit = gAllConnections.load();
+      const std::size_t now = total.load();
+      if (now <= limit) {
+        return;
+      }
+      std::vector<std::shared_ptr<Connection>> keep;  // released after the registry's lock
+      std::shared_ptr<SocketConnection> victim;
+      {
+        std::lock_guard lock(mutex);
+        std::int64_t oldest = std::numeric_limits<std::int64_t>::max();
+        std::size_t most = 0;
+        for (SocketConnection* c : connections) {
+          const std::int64_t since = c->waitingSince_.load();
+          const std::size_t bytes = c->queued_.load();
+          if (since == 0 || bytes == 0 || since > oldest || (since == oldest && bytes <= most) ||
+              std::find(closed.begin(), closed.end(), c) != closed.end()) {
+            continue;
+          }
+          auto alive = c->weak_from_this().lock();
+          if (!alive) {
+            continue;  // being destroyed; its bytes go with it
+          }
+          keep.push_back(alive);
+          victim = std::static_pointer_cast<SocketConnection>(alive);
+          oldest = since;
+          most = bytes;
+        }
+      }
+      if (!victim) {
+        return;
+      }
+      closed.push_back(victim.get());
+      victim->closeOverGlobalLimit(now, limit);
+    }
+  }
+
+  // After the outboxes have drained: returns the memory a flood took.
+  void giveBackIfDrained(const log::Logger& log) {
+    if (!giveBackArmed.load() || total.load() >= gResumeReadingAt.load() || !giveBackArmed.exchange(false)) {
+      return;
+    }
+#if defined(__GLIBC__)
+    ::malloc_trim(0);
+#endif
+    log.debug("Replies that waited for slow readers are gone; memory given back ({} bytes still waiting)",
+              total.load());
+  }
+};
+
+QueueLimits queueLimits() {
+  return QueueLimits{gPauseReadingAt.load(), gResumeReadingAt.load(), gPerConnection.load(), gAllConnections.load(),
+                     gCallsInFlight.load()};
+}
+
+void setQueueLimits(const QueueLimits& limits) {
+  gPauseReadingAt = limits.pauseReadingAt;
+  gResumeReadingAt = std::min(limits.resumeReadingAt, limits.pauseReadingAt);
+  gPerConnection = limits.perConnection;
+  gAllConnections = limits.allConnections;
+  gCallsInFlight = std::max<std::size_t>(limits.callsInFlight, 1);
+}
+
+std::size_t queuedBytesOfAllConnections() { return QueueRegistry::get().total.load(); }
 
 std::optional<PeerCredentials> readPeerCredentials(int fd, std::string* why) {
   ucred cred{};
@@ -137,9 +266,20 @@ SocketConnection::SocketConnection(Private, file::UniqueFd fd, PeerCredentials p
   }
   fd.release();
   socketOpen_ = true;
+  QueueRegistry::get().add(this);
 }
 
-SocketConnection::~SocketConnection() = default;
+SocketConnection::~SocketConnection() {
+  if (socketOpen_) {
+    QueueRegistry::get().remove(this);
+  }
+  QueueRegistry::get().total -= queued_.load();
+}
+
+bool SocketConnection::readingPaused() const {
+  std::lock_guard lock(writeMutex_);
+  return readPaused_;
+}
 
 void SocketConnection::setExportedObject(std::shared_ptr<ExportedObject> object) {
   std::lock_guard lock(stateMutex_);
@@ -201,36 +341,78 @@ void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
       readFailed(ec);
       return;
     }
-    processInput(size);
-    startRead();
+    if (invalidated_) {
+      return;
+    }
+    decoder_.append(readBuffer_.data(), size);
+    continueReading();
   };
   if (!queue_.runIfFree(handle)) {
     queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this()), handle] { handle(); });
   }
 }
 
-void SocketConnection::processInput(std::size_t size) {
-  if (invalidated_) {
-    return;
-  }
-  decoder_.append(readBuffer_.data(), size);
+void SocketConnection::continueReading() {
   for (;;) {
+    switch (processInput()) {
+      case InputState::Closed: return;
+      case InputState::NeedMore:
+        decoder_.releaseSpare();
+        startRead();
+        return;
+      case InputState::Paused: break;
+    }
+    std::size_t waiting = 0;
+    std::size_t unanswered = 0;
+    bool hold = false;
+    {
+      std::lock_guard lock(writeMutex_);
+      if (writeClosed_) {
+        return;
+      }
+      waiting = outboxBytes_;
+      unanswered = callsInFlight_.load();
+      hold = waiting >= gPauseReadingAt.load() || unanswered >= gCallsInFlight.load();
+      if (hold) {
+        // onWritable or callAnswered reads on once the peer has caught up.
+        readPaused_ = true;
+        readPausedFlag_ = true;
+        QueueRegistry::get().giveBackArmed = true;
+      }
+    }
+    if (hold) {
+      if (waiting >= gPauseReadingAt.load()) {
+        log_.debug("{}: peer does not read its replies ({} bytes waiting); reading paused", description(), waiting);
+      } else {
+        log_.debug("{}: {} calls wait for their answers; reading paused", description(), unanswered);
+      }
+      return;
+    }
+    // The peer caught up between the check and the lock: deliver on.
+  }
+}
+
+SocketConnection::InputState SocketConnection::processInput() {
+  for (;;) {
+    if (invalidated_) {
+      return InputState::Closed;
+    }
+    if (queued_.load() >= gPauseReadingAt.load() || callsInFlight_.load() >= gCallsInFlight.load()) {
+      return InputState::Paused;
+    }
     plist::Bytes body;
     std::string why;
     switch (decoder_.next(body, why)) {
-      case FrameDecoder::Status::NeedMore: return;
-      case FrameDecoder::Status::Invalid: protocolError(why); return;
+      case FrameDecoder::Status::NeedMore: return InputState::NeedMore;
+      case FrameDecoder::Status::Invalid: protocolError(why); return InputState::Closed;
       case FrameDecoder::Status::Frame: break;
     }
     auto message = decodeMessage(body, &why);
     if (!message) {
       protocolError(why);
-      return;
+      return InputState::Closed;
     }
     deliver(std::move(*message));
-    if (invalidated_) {
-      return;
-    }
   }
 }
 
@@ -313,6 +495,7 @@ int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std:
 bool SocketConnection::writeFrame(Data frame) {
   int err = 0;
   bool overflow = false;
+  std::size_t limit = 0;
   {
     std::lock_guard lock(writeMutex_);
     if (writeClosed_) {
@@ -322,22 +505,23 @@ bool SocketConnection::writeFrame(Data frame) {
       std::size_t sent = 0;
       err = sendSome(frame.data(), frame.size(), sent);
       if (!err && sent < frame.size()) {
-        outboxBytes_ = frame.size() - sent;
         outboxOffset_ = sent;
+        setOutboxBytes(frame.size() - sent);
         outbox_.push_back(std::move(frame));
         armWritable();
       }
     } else {
-      outboxBytes_ += frame.size();
+      setOutboxBytes(outboxBytes_ + frame.size());
       outbox_.push_back(std::move(frame));
-      overflow = outboxBytes_ > kMaxOutboxBytes;
+      limit = gPerConnection.load();
+      overflow = outboxBytes_ > limit;
     }
     if (err || overflow) {
       writeClosed_ = true;
     }
   }
   if (overflow) {
-    log_.error("{}: closing connection: peer does not read ({} bytes waiting)", description(), kMaxOutboxBytes);
+    log_.error("{}: closing connection: peer does not read ({} bytes waiting)", description(), limit);
     beginInvalidation();
     return false;
   }
@@ -345,7 +529,39 @@ bool SocketConnection::writeFrame(Data frame) {
     writeFailed(err);
     return false;
   }
-  return true;
+  if (QueueRegistry::get().total.load() > gAllConnections.load()) {
+    QueueRegistry::get().enforce();
+  }
+  return !isInvalidated();
+}
+
+void SocketConnection::setOutboxBytes(std::size_t bytes) {
+  auto& registry = QueueRegistry::get();
+  if (bytes >= outboxBytes_) {
+    registry.total += bytes - outboxBytes_;
+  } else {
+    registry.total -= outboxBytes_ - bytes;
+  }
+  if (outboxBytes_ == 0 && bytes > 0) {
+    waitingSince_ = steadyNanos();
+  } else if (bytes == 0) {
+    waitingSince_ = 0;
+  }
+  if (bytes >= gPauseReadingAt.load()) {
+    outboxWasLarge_ = true;
+  }
+  outboxBytes_ = bytes;
+  queued_ = bytes;
+}
+
+void SocketConnection::closeOverGlobalLimit(std::size_t total, std::size_t limit) {
+  if (!invalidated_) {
+    log_.error(
+        "{}: closing connection: replies waiting for all connections ({} bytes) exceed the limit of {}; this peer "
+        "reads slowest ({} bytes waiting)",
+        description(), total, limit, queued_.load());
+  }
+  beginInvalidation();
 }
 
 // Called with writeMutex_ held.
@@ -365,17 +581,19 @@ void SocketConnection::armWritable() {
 
 void SocketConnection::onWritable(const std::error_code& ec) {
   int err = 0;
+  bool readOn = false;
   {
     std::lock_guard lock(writeMutex_);
     writeArmed_ = false;
     if (ec || writeClosed_) {
       return;
     }
+    std::size_t bytes = outboxBytes_;
     while (!outbox_.empty()) {
       Data& front = outbox_.front();
       std::size_t sent = outboxOffset_;
       err = sendSome(front.data(), front.size(), sent);
-      outboxBytes_ -= sent - outboxOffset_;
+      bytes -= sent - outboxOffset_;
       outboxOffset_ = sent;
       if (err || sent < front.size()) {
         break;
@@ -383,14 +601,64 @@ void SocketConnection::onWritable(const std::error_code& ec) {
       outbox_.pop_front();
       outboxOffset_ = 0;
     }
+    setOutboxBytes(bytes);
+    if (outbox_.empty() && outboxWasLarge_) {
+      std::deque<Data>().swap(outbox_);
+      outboxWasLarge_ = false;
+    }
     if (err) {
       writeClosed_ = true;
-    } else if (!outbox_.empty()) {
-      armWritable();
+    } else {
+      if (!outbox_.empty()) {
+        armWritable();
+      }
+      readOn = mayReadOn();
     }
   }
   if (err) {
     writeFailed(err);
+    return;
+  }
+  if (readOn) {
+    readOnLater();
+  }
+  QueueRegistry::get().giveBackIfDrained(log_);
+}
+
+// Called with writeMutex_ held: ends a pause once the peer has caught up.
+bool SocketConnection::mayReadOn() {
+  if (!readPaused_ || writeClosed_ || outboxBytes_ >= gResumeReadingAt.load() ||
+      callsInFlight_.load() >= std::max<std::size_t>(gCallsInFlight.load() / 2, 1)) {
+    return false;
+  }
+  readPaused_ = false;
+  readPausedFlag_ = false;
+  return true;
+}
+
+void SocketConnection::readOnLater() {
+  log_.debug("{}: peer caught up; reading resumed", description());
+  queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] {
+    if (!self->invalidated_) {
+      self->continueReading();
+    }
+  });
+}
+
+void SocketConnection::callTaken() { ++callsInFlight_; }
+
+void SocketConnection::callAnswered() {
+  --callsInFlight_;
+  if (!readPausedFlag_.load()) {
+    return;
+  }
+  bool readOn = false;
+  {
+    std::lock_guard lock(writeMutex_);
+    readOn = mayReadOn();
+  }
+  if (readOn) {
+    readOnLater();
   }
 }
 
@@ -437,14 +705,17 @@ void SocketConnection::beginInvalidation() {
   {
     std::lock_guard lock(writeMutex_);
     writeClosed_ = true;
-    outbox_.clear();
-    outboxBytes_ = 0;
+    readPaused_ = false;
+    readPausedFlag_ = false;
+    setOutboxBytes(0);
+    std::deque<Data>().swap(outbox_);
     // Wakes the outstanding read; the descriptor itself is closed on the
     // queue, where every other socket operation starts.
     if (socketOpen_) {
       ::shutdown(fd_, SHUT_RDWR);
     }
   }
+  QueueRegistry::get().giveBackIfDrained(log_);
   queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] { self->finishInvalidation(); });
 }
 

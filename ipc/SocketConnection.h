@@ -5,14 +5,27 @@
 // Reading: one read is outstanding at a time; each chunk is decoded and its
 // messages delivered in a turn of the connection's serial queue (on the
 // thread that read it when the queue is free, so without a hand-off), and the
-// next read starts only once that is done, so a peer that floods the socket waits for its earlier calls to be
-// handled instead of filling memory.
+// next read starts only once that is done, so a peer that floods the socket
+// waits for its earlier calls to be handled instead of filling memory.
 //
 // Writing: whole frames, from any thread, in the order the calls were made.
 // A frame is written straight from the calling thread when the socket takes
 // it; what the socket does not take waits in an outbox that drains as the
-// peer reads. An outbox over kMaxOutboxBytes means the peer has stopped
-// reading; the connection is then closed.
+// peer reads.
+//
+// Memory under a flood (QueueLimits): a peer that sends calls without reading
+// the replies is throttled, not buffered. Once its outbox holds
+// pauseReadingAt bytes the connection delivers no further call and stops
+// reading its socket (the peer's writes then block in the kernel) until the
+// outbox has drained below resumeReadingAt. Calls that are taken but not
+// answered yet count too: at callsInFlight of them the connection takes no
+// further call until half are answered. An outbox over perConnection
+// (kMaxOutboxBytes) still means the peer has stopped reading; the connection
+// is then closed. The outboxes of all connections together are held under
+// allConnections: past it the connection whose peer has gone longest without
+// catching up is closed first, then the next, until the total is back under
+// the limit. Once the bytes that waited are written or dropped, the memory
+// they took is given back to the system.
 
 // A standard header first: asio decides between aligned_alloc and operator
 // new by a libstdc++ macro, and every translation unit must decide alike.
@@ -32,6 +45,23 @@
 namespace zerith::ipc {
 
 inline constexpr std::size_t kMaxOutboxBytes = 64u << 20;
+inline constexpr std::size_t kMaxQueuedBytesAllConnections = 128u << 20;
+
+struct QueueLimits {
+  std::size_t pauseReadingAt = 1u << 20;
+  std::size_t resumeReadingAt = 256u << 10;
+  std::size_t perConnection = kMaxOutboxBytes;
+  std::size_t allConnections = kMaxQueuedBytesAllConnections;
+  // Calls taken from one connection and not answered yet: at this many the
+  // connection takes no further call until half of them are answered.
+  std::size_t callsInFlight = 1024;
+};
+
+// The process's limits; tests lower them to reach them with little traffic.
+QueueLimits queueLimits();
+void setQueueLimits(const QueueLimits& limits);
+// Bytes waiting in the outboxes of all connections of the process.
+std::size_t queuedBytesOfAllConnections();
 
 // The peer of a connected Unix socket as the kernel recorded it when the
 // connection was made (SO_PEERCRED, SO_PEERGROUPS). nullopt, with `why`, when
@@ -72,11 +102,26 @@ class SocketConnection final : public Connection {
   // Queues one encoded frame (reply paths use it). False when the connection
   // no longer writes.
   bool writeFrame(Data frame);
+  // Bytes waiting to be written to the peer.
+  std::size_t queuedBytes() const { return queued_.load(); }
+  // True while reading is held back because the peer does not read.
+  bool readingPaused() const;
+  // Calls delivered from the peer that are not answered yet (the reply
+  // paths count them).
+  std::size_t callsInFlight() const { return callsInFlight_.load(); }
+  void callTaken();
+  void callAnswered();
 
  private:
+  friend struct QueueRegistry;
+  enum class InputState { NeedMore, Paused, Closed };
+
   void startRead();
   void onRead(const std::error_code& ec, std::size_t size);
-  void processInput(std::size_t size);
+  // Delivers buffered frames and reads on, unless the outbox holds the
+  // reading back.
+  void continueReading();
+  InputState processInput();
   void deliver(IncomingMessage message);
   void readFailed(const std::error_code& ec);
   void protocolError(const std::string& why);
@@ -86,6 +131,11 @@ class SocketConnection final : public Connection {
   void armWritable();
   void onWritable(const std::error_code& ec);
   void writeFailed(int err);
+  // Called with writeMutex_ held: the outbox now holds `bytes`.
+  void setOutboxBytes(std::size_t bytes);
+  void closeOverGlobalLimit(std::size_t total, std::size_t limit);
+  bool mayReadOn();
+  void readOnLater();
 
   void beginInvalidation();
   void finishInvalidation();
@@ -110,12 +160,19 @@ class SocketConnection final : public Connection {
   std::vector<std::uint8_t> readBuffer_;
   FrameDecoder decoder_;
 
-  std::mutex writeMutex_;
+  mutable std::mutex writeMutex_;
   std::deque<Data> outbox_;
   std::size_t outboxOffset_ = 0;  // of the front frame
   std::size_t outboxBytes_ = 0;
+  bool outboxWasLarge_ = false;  // its storage is let go once it drains
   bool writeArmed_ = false;
   bool writeClosed_ = false;
+  bool readPaused_ = false;
+  // Mirrors for the process-wide limit, read without writeMutex_.
+  std::atomic<std::size_t> queued_{0};
+  std::atomic<std::int64_t> waitingSince_{0};
+  std::atomic<bool> readPausedFlag_{false};  // readPaused_, for callAnswered's quick check
+  std::atomic<std::size_t> callsInFlight_{0};  // steady-clock ns since the outbox was last empty; 0 when empty
 
   std::mutex callsMutex_;
   std::uint64_t nextCall_ = 1;

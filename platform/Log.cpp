@@ -5,10 +5,16 @@
 #include <cstdlib>
 #include <mutex>
 
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <string>
+
 #include <spdlog/sinks/base_sink.h>
 #include <spdlog/sinks/dist_sink.h>
 #include <spdlog/sinks/stdout_sinks.h>
-#include <spdlog/sinks/systemd_sink.h>
 
 namespace zerith::log {
 
@@ -22,6 +28,64 @@ Level toLevel(spdlog::level::level_enum l) {
     case spdlog::level::trace: return Level::Debug;
     default: return Level::Default;
   }
+}
+
+// Standard error when the service manager connected it to the journal: one
+// line per message, led by the syslog priority in angle brackets, which the
+// journal takes as the entry's priority and strips. The journal adds its own
+// time stamp and the unit's identifier. A message of several lines repeats
+// the priority on each, so that no part of it is logged at another level.
+class JournalStreamSink final : public spdlog::sinks::base_sink<std::mutex> {
+ protected:
+  void sink_it_(const spdlog::details::log_msg& msg) override {
+    const std::string prefix =
+        "<" + std::to_string(journalPriority(toLevel(msg.level))) + ">" +
+        std::string(msg.logger_name.begin(), msg.logger_name.end()) + ": ";
+    std::string out;
+    out.reserve(prefix.size() + msg.payload.size() + 1);
+    out += prefix;
+    for (const char c : msg.payload) {
+      out += c;
+      if (c == '\n') {
+        out += prefix;
+      }
+    }
+    out += '\n';
+    // One write per message keeps lines of different threads apart.
+    std::size_t done = 0;
+    while (done < out.size()) {
+      const ssize_t n = ::write(STDERR_FILENO, out.data() + done, out.size() - done);
+      if (n < 0 && errno == EINTR) {
+        continue;
+      }
+      if (n <= 0) {
+        return;
+      }
+      done += static_cast<std::size_t>(n);
+    }
+  }
+  void flush_() override {}
+};
+
+// True when JOURNAL_STREAM ("<device>:<inode>") names the file behind our
+// standard error. A child that inherited the variable but writes elsewhere
+// does not match.
+bool stderrIsJournal() {
+  const char* env = std::getenv("JOURNAL_STREAM");
+  if (!env || !*env) {
+    return false;
+  }
+  unsigned long long device = 0;
+  unsigned long long inode = 0;
+  char tail = 0;
+  if (std::sscanf(env, "%llu:%llu%c", &device, &inode, &tail) != 2) {
+    return false;
+  }
+  struct stat st {};
+  if (::fstat(STDERR_FILENO, &st) != 0) {
+    return false;
+  }
+  return static_cast<unsigned long long>(st.st_dev) == device && static_cast<unsigned long long>(st.st_ino) == inode;
 }
 
 // The process's sinks. Owned here because spdlog's registry is process-wide
@@ -52,6 +116,15 @@ struct Sinks {
 
 }  // namespace
 
+int journalPriority(Level level) {
+  switch (level) {
+    case Level::Error: return 3;  // LOG_ERR
+    case Level::Debug: return 7;  // LOG_DEBUG
+    case Level::Default: break;
+  }
+  return 6;  // LOG_INFO
+}
+
 struct LogCapture::Sink : spdlog::sinks::base_sink<std::mutex> {
   mutable std::mutex linesMutex;
   mutable std::condition_variable arrived;
@@ -73,10 +146,10 @@ struct LogCapture::Sink : spdlog::sinks::base_sink<std::mutex> {
 void configure(const Options& options) {
   auto& s = Sinks::get();
   std::lock_guard lock(s.mutex);
-  const bool journal = options.journal.value_or(std::getenv("JOURNAL_STREAM") != nullptr);
+  const bool journal = options.journal.value_or(stderrIsJournal());
   s.dist->remove_sink(s.output);
   if (journal) {
-    s.output = std::make_shared<spdlog::sinks::systemd_sink_mt>("zerithd");
+    s.output = std::make_shared<JournalStreamSink>();
   } else {
     s.output = std::make_shared<spdlog::sinks::stderr_sink_mt>();
     s.output->set_pattern("%Y-%m-%d %H:%M:%S.%f %n[%l] %v");

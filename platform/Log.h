@@ -1,8 +1,10 @@
 #pragma once
 
 // The system log. Three levels: error, default (spdlog's info) and debug.
-// Under systemd (JOURNAL_STREAM set) lines go to the journal, otherwise to
-// standard error; debug is off unless asked for. One named Logger per
+// Under systemd (JOURNAL_STREAM names the file behind standard error) lines
+// go to the journal as "<priority>subsystem: text", error, default and debug
+// at the journal priorities err (3), info (6) and debug (7); otherwise to
+// standard error with a time stamp. Debug is off unless asked for. One named Logger per
 // subsystem; every Logger shares the process's sinks.
 //
 // Tests read the log through a LogCapture, an in-memory sink that is active
@@ -29,6 +31,9 @@ struct Options {
 
 // Called once by each executable's main; safe to skip (defaults apply).
 void configure(const Options& options);
+
+// The journal (syslog) priority a level is logged at.
+int journalPriority(Level level);
 
 class Logger {
  public:

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cstdlib>
+#include <cstring>
 #include <mutex>
 #include <string>
 
@@ -58,7 +59,15 @@ fs::path socketPath() { return resolve("/run/zerithd/com.velmar.zerithd"); }
 fs::path defaultsDir() { return resolve("/var/lib/zerithd/defaults"); }
 fs::path storebagCacheDir() {
   // Relocated: a folder of the root stands for the service user's home.
-  return relocated() ? resolve("/var/cache/zerithd/storebags") : homeFolder() / ".cache/zerithd/storebags";
+  if (relocated()) {
+    return resolve("/var/cache/zerithd/storebags");
+  }
+  // The packaged service: systemd's CacheDirectory= (/var/cache/zerithd).
+  if (const char* cache = std::getenv("CACHE_DIRECTORY"); cache && *cache == '/') {
+    const std::string first(cache, std::strcspn(cache, ":"));
+    return fs::path(first) / "storebags";
+  }
+  return homeFolder() / ".cache/zerithd/storebags";
 }
 fs::path messageLogDir() { return resolve("/var/log/faultkeep/retired"); }
 fs::path uploadStorageDir() { return resolve("/tmp/zthstorage"); }
