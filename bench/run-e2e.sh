@@ -26,7 +26,7 @@ run() {
 echo "# e2e pipeline benchmark, $(date -u '+%Y-%m-%d %H:%M UTC'), load average: $(cut -d' ' -f1-3 /proc/loadavg)"
 run --clients 1 --events $((200000 / scale))
 run --clients 8 --events $((200000 / scale))
-run --clients 8 --events $((3000 / scale * 10 / 10)) --rate 100 --memory-sample 0
+run --clients 8 --events $((3000 / scale)) --rate 100 --memory-sample 0
 run --clients 8 --events $((30000 / scale)) --rate 1000 --memory-sample 0
 run --clients 8 --events $((1000000 / scale)) --memory-sample 10000
 run --clients 1 --events 1000 --memory-sample 0 --idle-seconds "$idle" --idle-sessions 10
