@@ -52,6 +52,15 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
                                                            const std::optional<std::string>& productFamily,
                                                            std::int32_t clientType);
 
+  // An extra kind for the factory, consulted before the built-in table, so
+  // that it may stand in for any name; registering a name again replaces the
+  // earlier maker. The daemon registers none: this is for backends that live
+  // outside this library, such as the recording backend of the tests.
+  using Maker = std::function<std::shared_ptr<ZerithBackend>(std::string_view name, const Value& profile,
+                                                             const std::optional<std::string>& productFamily,
+                                                             std::int32_t clientType)>;
+  static void registerBackendKind(std::string name, Maker make);
+
   // Lower-case hex SHA-256 of the first N UTF-8 bytes of `text`, N being its
   // length in UTF-16 code units: the server hashes the same way, so text
   // beyond ASCII is deliberately hashed short.

@@ -1,8 +1,12 @@
 // The backend factory: backend names to kinds.
 
 #include <functional>
+#include <mutex>
+#include <utility>
+#include <vector>
 #include <string_view>
 
+#include "backends/HTTPSPostBackend.h"
 #include "backends/KovuBackend.h"
 #include "backends/PellamBackend.h"
 #include "backends/ZerithBackend.h"
@@ -38,6 +42,11 @@ std::shared_ptr<ZerithBackend> makePlain(std::string_view name, const Value& pro
   return std::make_shared<Backend>(std::string(name), profile, productFamily);
 }
 
+std::shared_ptr<ZerithBackend> makeHTTPSPost(std::string_view name, const Value& profile,
+                                            const std::optional<std::string>& productFamily, std::int32_t) {
+  return HTTPSPostBackend::initWithName(std::string(name), profile, productFamily);
+}
+
 std::shared_ptr<ZerithBackend> makeKovu(std::string_view name, const Value& profile,
                                         const std::optional<std::string>& productFamily, std::int32_t clientType) {
   return KovuBackend::initWithName(std::string(name), profile, productFamily, clientType);
@@ -57,17 +66,51 @@ bool always() { return true; }
 // kovu; a kind joins the table at its place with one line.
 const std::vector<Kind>& kinds() {
   static const std::vector<Kind> table = {
+      {&kZerithBackendHTTPPost, always, makeHTTPSPost},
+      {&kZerithBackendHTTPPost2, always, makeHTTPSPost},
       {&kZerithBackendPellamlog, always, makePlain<PellamBackend>},
+      {&kZerithBackendQRS, always, makeHTTPSPost},
       {&kZerithBackendKovu, adaptorAvailable, makeKovu},
   };
   return table;
 }
 
+struct Registered {
+  std::mutex mutex;
+  std::vector<std::pair<std::string, ZerithBackend::Maker>> kinds;
+};
+
+Registered& registered() {
+  static Registered r;
+  return r;
+}
+
 }  // namespace
+
+void ZerithBackend::registerBackendKind(std::string name, Maker make) {
+  auto& r = registered();
+  std::lock_guard lock(r.mutex);
+  std::erase_if(r.kinds, [&](const auto& k) { return k.first == name; });
+  r.kinds.emplace_back(std::move(name), std::move(make));
+}
 
 std::shared_ptr<ZerithBackend> ZerithBackend::newBackendWithName(std::string_view name, const Value& profile,
                                                                  const std::optional<std::string>& productFamily,
                                                                  std::int32_t clientType) {
+  Maker extra;
+  {
+    auto& r = registered();
+    std::lock_guard lock(r.mutex);
+    for (const auto& [n, make] : r.kinds) {
+      if (n == name) {
+        extra = make;
+        break;
+      }
+    }
+  }
+  if (extra) {
+    return extra(name, profile, productFamily, clientType);
+  }
   for (const Kind& kind : kinds()) {
     if (name != *kind.name) {
       continue;

@@ -7,6 +7,7 @@
 
 #include <fmt/format.h>
 
+#include "config/Conversions.h"
 #include "daemon/SenderCodes.h"
 #include "ipc/ClientSessionExporter.h"
 #include "ipc/Connection.h"
@@ -302,8 +303,21 @@ std::shared_ptr<ZerithdSession> ZerithdAgent::getAncestorWithAggregatorForSessio
   if (!list) {
     return nullptr;
   }
-  // From the root down: the ancestor nearest the root wins.
-  for (std::int64_t l = 0; l < level; ++l) {
+  // From the root down: the ancestor nearest the root wins. Only the first
+  // session of a level counts. Levels nobody holds give nothing, so the walk
+  // goes over the levels present in the list, not over every number below
+  // the session's level (a client may claim a level in the billions).
+  std::vector<std::int64_t> levels;
+  for (const auto& w : *list) {
+    if (const auto s = w.lock()) {
+      if (const std::int64_t l = s->hierarchyLevel(); l < level) {
+        levels.push_back(l);
+      }
+    }
+  }
+  std::sort(levels.begin(), levels.end());
+  levels.erase(std::unique(levels.begin(), levels.end()), levels.end());
+  for (const std::int64_t l : levels) {
     if (auto ancestor = getFirstSessionWithHierarchy(l, *list); ancestor && ancestor->hasAggregator()) {
       return ancestor;
     }
@@ -354,17 +368,31 @@ void ZerithdAgent::updateSharedDataForSession(ZerithdSession& session, const Val
   if (!token.string()) {
     return;
   }
+  const auto* entries = sharedData.dict();
+  if (!entries) {
+    logger().error("updateSharedDataForSession: Ignoring shared data of session {} as it is not a dictionary",
+                   session.sessionID());
+    return;
+  }
   std::lock_guard lock(lock_);
   auto* data = sharedDataFor(*token.string());
+  Dictionary merged = data ? *data : Dictionary{};
+  for (const auto& [key, value] : *entries) {
+    merged.set(key, value);
+  }
+  // Every event of the hierarchy carries a copy: the data stays small.
+  if (const std::size_t size = estimatedPlistMemorySize(Value(merged)); size > kSharedDataSizeLimit) {
+    logger().error(
+        "updateSharedDataForSession: Refusing shared data of session {} for hierarchyToken {}: {} bytes exceed the "
+        "limit of {}",
+        session.sessionID(), *token.string(), size, kSharedDataSizeLimit);
+    return;
+  }
   if (!data) {
     sharedData_.emplace_back(*token.string(), Dictionary{});
     data = &sharedData_.back().second;
   }
-  if (const auto* entries = sharedData.dict()) {
-    for (const auto& [key, value] : *entries) {
-      data->set(key, value);
-    }
-  }
+  *data = std::move(merged);
 }
 
 void ZerithdAgent::removeObjectFromSharedDataForSession(ZerithdSession& session, const std::string& key) {

@@ -29,6 +29,10 @@ namespace zerith {
 
 class ZerithdSession;
 
+// The most shared data one hierarchy token may hold, by the property-list
+// memory estimate; an update that would pass it is refused whole.
+inline constexpr std::size_t kSharedDataSizeLimit = 64 * 1024;
+
 class ZerithdAgent final : public ZerithdSessionDelegate,
                            public ipc::ListenerDelegate,
                            public std::enable_shared_from_this<ZerithdAgent> {

@@ -4,6 +4,7 @@
 
 #include <fmt/format.h>
 
+#include "backends/CreateBackends.h"
 #include "config/ClientTypes.h"
 #include "config/Conversions.h"
 #include "config/DeviceInfo.h"
@@ -33,8 +34,17 @@ Value textOrUnknown(const Value& v) { return v.string() ? v : Value("Unknown"); 
 double secondsNow() {
   timeval tv{};
   gettimeofday(&tv, nullptr);
-  return static_cast<double>(tv.tv_sec) + static_cast<double>(tv.tv_usec) / 1000000.0;
+  return timevalToSeconds(tv);
 }
+
+// The reporting states: 2 enabled, 3 sampled out but kept by an override.
+bool isReporting(std::int32_t state) { return state == kBackendStateEnabled || state == kBackendStateSampledOut; }
+
+// The join of one flush over a session's backends.
+struct FlushJoin {
+  std::size_t pending = 0;
+  ClientSessionInterface::ValueErrorCompletion completion;
+};
 
 }  // namespace
 
@@ -88,15 +98,23 @@ ZerithdSession::~ZerithdSession() {
   }
   shutdownSessionAggregation();
 
+  std::shared_ptr<const BackendDictionary> backends;
   {
     std::lock_guard lock(fieldsMutex_);
+    backends = std::move(fields_.backends);
     fields_.sessionInfo = Value();
     fields_.userInfo = Value();
     fields_.frameworks = Value();
-    fields_.backendNames.reset();
     fields_.hierarchyDictionary = Value();
     fields_.storebagVersion = Value();
     fields_.digestKey.clear();
+  }
+  if (backends) {
+    for (const auto& [name, backend] : *backends) {
+      backend->cleanup();
+    }
+    // A backend still flushing is held by its completion until it is done.
+    backends.reset();
   }
   periodicServices_.clear();
 
@@ -181,9 +199,27 @@ std::string ZerithdSession::description() const {
   return fmt::format("<ZerithdSession: {} sessionID={}>", sessionIDString_, sessionID());
 }
 
-bool ZerithdSession::hasBackendSet() const {
+bool ZerithdSession::hasBackendSet() const { return backends() != nullptr; }
+
+std::shared_ptr<const BackendDictionary> ZerithdSession::backends() const {
   std::lock_guard lock(fieldsMutex_);
-  return fields_.backendNames.has_value();
+  return fields_.backends;
+}
+
+std::shared_ptr<ZerithBackend> ZerithdSession::backendNamed(std::string_view name) const {
+  if (const auto set = backends()) {
+    for (const auto& [n, backend] : *set) {
+      if (n == name) {
+        return backend;
+      }
+    }
+  }
+  return nullptr;
+}
+
+std::mutex& ZerithdSession::classLock() {
+  static std::mutex lock;
+  return lock;
 }
 
 // --- Configuration -----------------------------------------------------------
@@ -201,6 +237,13 @@ void ZerithdSession::setSessionInfo(const Value& sessionInfo, const Value& userI
     fields_.sessionInfo = sessionInfo;
     const Value hierarchy = sessionInfo[kZerithSessionInfoHierarchyToken];
     fields_.hierarchyDictionary = hierarchy.isDict() ? hierarchy : Value();
+  }
+  // The level is read as unsigned: a negative one lands far above every
+  // other level and finds no parent.
+  if (const std::int64_t level = sessionInfo[kZerithSessionInfoHierarchyToken][kZerithHierarchyTokenLevel].intValue();
+      level < 0) {
+    logger().error("setSessionInfo: Session {} has the negative hierarchy level {}, taken as {}", id, level,
+                   static_cast<std::uint32_t>(level));
   }
   if (const auto d = delegate()) {
     d->updateCorrelatedSessions(*this);
@@ -300,10 +343,20 @@ void ZerithdSession::sendStartMessage() {
 
 void ZerithdSession::fetchDisplayURL(ValueCompletion completion) {
   logger().debug("fetchDisplayURL: Fetching display URL for session {}", sessionID());
-  // The HTTPS backends' display URL first, then the dashboard's; no backend
-  // kind exists yet that has one.
+  // The HTTPS backends' display URL first, then the dashboard's.
+  std::optional<std::string> url;
+  for (const char* name : {kZerithBackendHTTPPost, kZerithBackendHTTPPost2}) {
+    if (const auto backend = backendNamed(name); backend && (url = backend->displayURL())) {
+      break;
+    }
+  }
+  if (!url) {
+    if (const auto dashboard = backendNamed(kZerithBackendDashboard)) {
+      url = dashboard->displayURL();
+    }
+  }
   if (completion) {
-    completion(Value("URL not available"));
+    completion(Value(url.value_or("URL not available")));
   }
 }
 
@@ -317,24 +370,59 @@ void ZerithdSession::finishSessionGracefully() {
 
 // --- Backend set ---------------------------------------------------------------
 
-void ZerithdSession::createBackendsWithStorebag(const Value& /*storebag*/) {
+void ZerithdSession::createBackendsWithStorebag(const Value& storebag) {
   logger().debug("createBackendsWithStorebag: Creating backends for session {}", sessionID());
-  // Seam: the backend kinds and their factory do not exist yet, so a storebag
-  // yields an empty backend set. The session is then configured (a start
-  // message and an end message are dispatched, flushes complete) but reports
-  // no enabled backend. Once the factory lands, this builds the set from the
-  // storebag's environment section and gives every backend the session's
-  // connectivity helper and session ID string.
-  std::lock_guard lock(fieldsMutex_);
-  fields_.backendNames.emplace();
+  auto made = createBackends(storebag, sessionInfo(), userInfo(), deviceid_.data());
+  std::shared_ptr<const BackendDictionary> set;
+  if (made) {
+    for (const auto& [name, backend] : *made) {
+      backend->setReportingSessionConnectivityDelegate(connectivityHelper_);
+      backend->setCombinedSessionIDString(sessionIDString_);
+    }
+    set = std::make_shared<const BackendDictionary>(std::move(*made));
+  }
+  std::shared_ptr<const BackendDictionary> previous;
+  {
+    std::lock_guard lock(fieldsMutex_);
+    previous = std::exchange(fields_.backends, std::move(set));
+  }
+  // A second configuration replaces the set; the old one finishes its work.
+  if (previous) {
+    for (const auto& [name, backend] : *previous) {
+      backend->cleanup();
+    }
+  }
 }
 
 void ZerithdSession::updateUserInfoForBackends() {
-  // Every backend receives the user info; the digest backend also the key.
+  const auto set = backends();
+  if (!set) {
+    return;
+  }
+  Value user;
+  Data key;
+  std::int32_t algorithm = 0;
+  {
+    std::lock_guard lock(fieldsMutex_);
+    user = fields_.userInfo;
+    key = fields_.digestKey;
+    algorithm = fields_.digestAlgorithm;
+  }
+  for (const auto& [name, backend] : *set) {
+    backend->setUserInfoDict(user);
+    if (name == kZerithBackendQRS) {
+      backend->setDigestKey(key.empty() ? std::nullopt : std::optional<Data>(key));
+      backend->setDigestAlgorithm(algorithm);
+    }
+  }
 }
 
 void ZerithdSession::updateReportingStates() {
-  // Every backend decides its state from the storebag.
+  if (const auto set = backends()) {
+    for (const auto& [name, backend] : *set) {
+      backend->updateState();
+    }
+  }
 }
 
 void ZerithdSession::syncReportingStates() {
@@ -344,29 +432,49 @@ void ZerithdSession::syncReportingStates() {
   }
   std::lock_guard agentLock(d->agentLock());
   const auto parent = d->parentSessionForChild(*this);
-  std::vector<std::string> names;
-  {
-    std::lock_guard lock(fieldsMutex_);
-    if (fields_.backendNames) {
-      names = *fields_.backendNames;
-    }
+  const auto set = backends();
+  if (!set) {
+    return;
   }
   const std::uint32_t level = hierarchyLevel();
-  for (const auto& name : names) {
-    if (!parent && level != 0) {
-      logger().info("syncReportingStates: child session {} (backend {}) with hierarchy {} is missing its parent",
-                    sessionID(), name, level);
+  for (const auto& [name, backend] : *set) {
+    if (!parent) {
+      if (level != 0) {
+        logger().info("syncReportingStates: child session {} (backend {}) with hierarchy {} is missing its parent",
+                      sessionID(), name, level);
+      }
+      continue;
     }
+    // A backend kept by its override threshold keeps its own decision.
+    if (backend->state() == kBackendStateSampledOut) {
+      continue;
+    }
+    const auto parentBackend = parent->backendNamed(name);
+    if (!parentBackend) {
+      backend->setState(kBackendStateDisabled);
+      continue;
+    }
+    const std::int32_t state = parentBackend->state();
+    const Value threshold = parentBackend->samplingThreshold();
+    backend->setState(state);
+    backend->setSamplingThreshold(threshold);
+    logger().debug("HTTPSPostBackend(syncReportingStates): {}: state and sampling rate updated to {}, {:.02f}%", name,
+                   state, threshold.doubleValue());
   }
 }
 
 Value ZerithdSession::fetchReportingStates() const {
-  std::lock_guard lock(fieldsMutex_);
-  if (!fields_.backendNames) {
+  const auto set = backends();
+  if (!set) {
     return {};
   }
-  // Names of the backends in state 2 or 3.
-  return Value(Array{});
+  Array names;
+  for (const auto& [name, backend] : *set) {
+    if (isReporting(backend->state())) {
+      names.emplace_back(name);
+    }
+  }
+  return Value(std::move(names));
 }
 
 void ZerithdSession::updateCombinedSessionID() {
@@ -381,15 +489,34 @@ void ZerithdSession::updateCombinedSessionID() {
   const std::string combined = fmt::format("{}.{}", *parentID.string(), sessionIDString_);
   logger().debug("updateCombinedSessionID: Updating combined session ID '{}' for session {} backends", combined,
                  sessionID());
-  // Every backend takes the combined identifier (setCorrelatedSessionID:).
+  if (const auto set = backends()) {
+    for (const auto& [name, backend] : *set) {
+      backend->setCorrelatedSessionID(combined);
+    }
+  }
 }
 
-std::uint32_t ZerithdSession::batchedEventsSize() const { return 0; }
+std::uint32_t ZerithdSession::batchedEventsSize() const {
+  std::uint32_t size = 0;
+  if (const auto set = backends()) {
+    for (const auto& [name, backend] : *set) {
+      size += backend->batchedEventsSize();
+    }
+  }
+  return size;
+}
 
-void ZerithdSession::setDigestKey(const Value& digestKey, std::int32_t /*algorithm*/) {
-  std::lock_guard lock(fieldsMutex_);
-  fields_.digestKey = digestKey.data() ? *digestKey.data() : Data{};
-  // The algorithm goes to the digest backend only; it is not kept here.
+void ZerithdSession::setDigestKey(const Value& digestKey, std::int32_t algorithm) {
+  const Data key = digestKey.data() ? *digestKey.data() : Data{};
+  {
+    std::lock_guard lock(fieldsMutex_);
+    fields_.digestKey = key;
+    // The algorithm goes to the digest backend only; it is not kept here.
+  }
+  if (const auto qrs = backendNamed(kZerithBackendQRS)) {
+    qrs->setDigestKey(key.empty() ? std::nullopt : std::optional<Data>(key));
+    qrs->setDigestAlgorithm(algorithm);
+  }
 }
 
 // --- Dispatch ------------------------------------------------------------------
@@ -402,25 +529,38 @@ void ZerithdSession::sendMessageWithDictionary(const Value& message, ValueComple
   }
 }
 
+// The road of one event, all on the caller's thread: the checks, the
+// aggregator, then every backend's send in the set's order. Nothing here
+// waits for another thread; a backend that posts does so on its own queues.
 Value ZerithdSession::sendMessageWithDictionary(const Value& message) {
-  if (!hasBackendSet()) {
+  const auto set = backends();
+  if (!set) {
     logger().debug("sendMessageWithDictionary: No backends available to send message");
     return {};
   }
-  if (message[kZerithMessageParametersCategory].isNil()) {
+  const Value categoryValue = message[kZerithMessageParametersCategory];
+  if (categoryValue.isNil()) {
     logger().debug("sendMessageWithDictionary: Missing mandatory parameter 'category'");
     return {};
   }
-  if (message[kZerithMessageParametersType].isNil()) {
+  const Value typeValue = message[kZerithMessageParametersType];
+  if (typeValue.isNil()) {
     logger().debug("sendMessageWithDictionary: Missing mandatory parameter 'type'");
     return {};
   }
-  const auto category = static_cast<std::uint16_t>(message[kZerithMessageParametersCategory].unsignedValue());
-  const auto type = static_cast<std::uint16_t>(message[kZerithMessageParametersType].unsignedValue());
+  const auto category = static_cast<std::uint16_t>(categoryValue.unsignedValue());
+  const auto type = static_cast<std::uint16_t>(typeValue.unsignedValue());
   const Value payload = message[kZerithMessageParametersPayload];
-  const double now = secondsNow();
+  if (!payload.isNil() && !payload.isDict()) {
+    logger().error("sendMessageWithDictionary: Dropping event with category {} as its payload is not a dictionary",
+                   category);
+    return {};
+  }
+  const auto flag = static_cast<std::int32_t>(static_cast<std::uint32_t>(message[kZerithMessageParametersFlag].unsignedValue()));
+  timeval now{};
+  gettimeofday(&now, nullptr);
 
-  aggregateMessage(sessionInfo(), now, category, type, payload);
+  aggregateMessage(sessionInfo(), timevalToSeconds(now), category, type, payload);
 
   Dictionary method;
   if (const auto d = delegate()) {
@@ -432,9 +572,37 @@ Value ZerithdSession::sendMessageWithDictionary(const Value& message) {
   if (!payload.isNil()) {
     method.set("ClientData", payload);
   }
-  // Every backend of the set that passes its lists receives the event; the
-  // set is empty until the backend kinds exist.
-  return {};
+  if (set->empty()) {
+    return {};
+  }
+  const Value methodDictionary(std::move(method));
+
+  std::optional<std::string> chosen;
+  for (const auto& [name, backend] : *set) {
+    if (!backend->isWhitelistedEvent(category)) {
+      logger().debug("sendMessageWithDictionary: Dropping event with category {} as it is not whitelisted for backend {}",
+                     category, backend->name());
+      continue;
+    }
+    if (backend->isBlacklistedEvent(category)) {
+      logger().debug("sendMessageWithDictionary: Dropping event with category {} as it is blacklisted for backend {}",
+                     category, backend->name());
+      continue;
+    }
+    auto result = backend->sendMessage(methodDictionary, now, category, type, flag);
+    if (!result) {
+      continue;
+    }
+    writeToLogFile("[{} -> sendMessageWithDictionary] {}", name, *result);
+    // The last HTTPS result wins; the dashboard's shows only when no HTTPS
+    // backend gave one before it; the others are never returned.
+    if (name == kZerithBackendHTTPPost2 || name == kZerithBackendHTTPPost) {
+      chosen = std::move(result);
+    } else if (name == kZerithBackendDashboard && !chosen) {
+      chosen = std::move(result);
+    }
+  }
+  return chosen ? Value(std::move(*chosen)) : Value();
 }
 
 void ZerithdSession::internalSendMessage(const Value& payload, double /*timestamp*/, std::uint16_t method,
@@ -460,18 +628,51 @@ void ZerithdSession::flushMessagesWithCompletion(ValueErrorCompletion completion
 }
 
 void ZerithdSession::internalFlushMessagesWithCompletion(ValueErrorCompletion completion) {
-  if (!hasBackendSet()) {
+  const auto set = backends();
+  if (!set) {
     logger().debug("internalFlushMessagesWithCompletion: {}", kNoBackends);
     if (completion) {
       completion(Value(), makeZerithError(kNoBackends, -1));
     }
     return;
   }
-  // The join over the backends' flushes completes at the first error or at
-  // the last backend. An empty set has no last backend: it completes at once
-  // rather than never.
-  if (completion) {
-    completion(Value(), std::nullopt);
+  if (set->empty()) {
+    // No backend will ever answer: the join is complete at once.
+    if (completion) {
+      completion(Value(), std::nullopt);
+    }
+    return;
+  }
+  auto join = std::make_shared<FlushJoin>();
+  join->pending = set->size();
+  join->completion = std::move(completion);
+  for (const auto& [name, backend] : *set) {
+    // The block holds the backend: a session that ends mid-flush does not
+    // take a backend away from under its own completion.
+    backend->flushMessagesWithCompletion(
+        [join, backend = backend, name = name](const Value& text, const std::optional<Error>& error) {
+          logger().debug("internalFlushMessagesWithCompletion: {}", backend->name());
+          if (const auto* s = text.string()) {
+            writeToLogFile("[{} -> flushMessages] {}", name, *s);
+          } else if (!text.isNil()) {
+            writeToLogFile("[{} -> flushMessages] {}", name, text.description());
+          }
+          ValueErrorCompletion done;
+          {
+            // The join is decided under the class-wide lock; the caller's
+            // completion runs after it is left, so a completion that flushes
+            // again cannot deadlock on it.
+            std::lock_guard lock(classLock());
+            --join->pending;
+            if (join->completion && (error || join->pending == 0)) {
+              done = std::move(join->completion);
+              join->completion = nullptr;
+            }
+          }
+          if (done) {
+            done(text, error);
+          }
+        });
   }
 }
 
@@ -556,23 +757,89 @@ void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const 
   }
 }
 
-void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const Value& /*userInfo*/,
-                                                const Value& storebag, std::uint16_t /*category*/,
-                                                std::uint16_t /*type*/, const Value& /*payload*/) {
+std::shared_ptr<ReportingSessionConnectivityHelper> ZerithdSession::oneShotConnectivityHelper() {
+  std::lock_guard lock(classLock());
+  return oneShotHelperLocked();
+}
+
+// Kept for the life of the daemon: one-shot backends may still post through
+// it after the sender has returned.
+std::shared_ptr<ReportingSessionConnectivityHelper>& ZerithdSession::oneShotHelperLocked() {
+  static auto* helper = new std::shared_ptr<ReportingSessionConnectivityHelper>();
+  return *helper;
+}
+
+void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const Value& userInfo, const Value& storebag,
+                                                std::uint16_t category, std::uint16_t type, const Value& payload) {
   logger().debug("sendMessageWithSessionInfo: Sending single message with sessionID {}",
                  sessionInfo[kZerithSessionInfoSessionID].intValue());
   if (sessionInfo.isNil() || storebag.isNil()) {
     logger().error("RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters");
     return;
   }
-  // The throw-away backend set comes from the backend factory, which does
-  // not exist yet: nothing can carry the event.
-  logger().error("sendMessageWithSessionInfo: No backends available to send single message");
+  std::array<char, 41> udid{};
+  copyUniqueDeviceID(udid.data(), udid.size());
+  auto backends = createBackends(storebag, sessionInfo, userInfo, udid.data());
+  if (!backends) {
+    logger().error("sendMessageWithSessionInfo: No backends available to send single message");
+    return;
+  }
+  if (!userInfo.isNil() && !sessionInfo[kZerithSessionInfoRequireUserInfo].boolValue()) {
+    logger().error("sendMessageWithSessionInfo: user info provided without requiring it.");
+  }
+  std::shared_ptr<ReportingSessionConnectivityHelper> helper;
+  {
+    std::lock_guard lock(classLock());
+    auto& shared = oneShotHelperLocked();
+    if (!shared) {
+      shared = ReportingSessionConnectivityHelper::initWithDelegate(
+          std::weak_ptr<ZerithdSessionDelegate>(), ReportingSessionConnectivityHelper::POSTRequestMode());
+    }
+    helper = shared;
+  }
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  const bool internal = isInternalBuild();
+  for (const auto& [name, backend] : *backends) {
+    backend->updateState();
+    backend->setReportingSessionConnectivityDelegate(helper);
+    if (!backend->isWhitelistedEvent(category)) {
+      logger().debug("sendMessageWithSessionInfo: Dropping event with category {} as it is not whitelisted for backend {}",
+                     category, backend->name());
+      continue;
+    }
+    if (backend->isBlacklistedEvent(category)) {
+      logger().debug("sendMessageWithSessionInfo: Dropping event with category {} as it is blacklisted for backend {}",
+                     category, backend->name());
+      continue;
+    }
+    // A copy of the client's payload itself (no "ClientData" wrapping); a
+    // missing payload stays missing.
+    Value event;
+    if (payload.isDict()) {
+      Dictionary copy = payload.dictCopy();
+      if (internal) {
+        copy.set("SerialNum", textOrUnknown(deviceSerialNumber()));
+      }
+      event = Value(std::move(copy));
+    }
+    if (auto result = backend->sendMessage(event, now, category, type, 0)) {
+      writeToLogFile("[{} -> sendMessageWithSessionInfo] {}", name, *result);
+    }
+  }
+  for (const auto& [name, backend] : *backends) {
+    backend->cleanup();
+  }
 }
 
 // --- Shared data -------------------------------------------------------------------
 
 void ZerithdSession::updateSharedDataWithDictionary(const Value& dictionary) {
+  if (!dictionary.isDict()) {
+    logger().error("updateSharedDataWithDictionary: Ignoring shared data of session {} as it is not a dictionary",
+                   sessionID());
+    return;
+  }
   if (const auto d = delegate()) {
     std::lock_guard lock(d->agentLock());
     d->updateSharedDataForSession(*this, dictionary);

@@ -18,8 +18,10 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
+#include "backends/ZerithBackend.h"
 #include "ipc/ClientSessionInterface.h"
 #include "platform/Value.h"
 #include "session/ZerithdSessionDelegate.h"
@@ -118,11 +120,27 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
   // The session's transport (for its backends).
   std::shared_ptr<ReportingSessionConnectivityHelper> connectivityHelper() const { return connectivityHelper_; }
 
+  // The backend set, nullptr until a storebag built it. The set itself never
+  // changes once made: a new storebag replaces it whole, so a dispatch that
+  // took it goes on with the set it took.
+  std::shared_ptr<const BackendDictionary> backends() const;
+  // The backend of that name in the set, nullptr when there is none.
+  std::shared_ptr<ZerithBackend> backendNamed(std::string_view name) const;
+
+  // The one-shot sender's daemon-wide transport, made on first use under the
+  // class-wide lock; nullptr before the first one-shot message.
+  static std::shared_ptr<ReportingSessionConnectivityHelper> oneShotConnectivityHelper();
+
  private:
   ZerithdSession(std::weak_ptr<ZerithdSessionDelegate> delegate, std::shared_ptr<ipc::Connection> connection);
 
   std::shared_ptr<ZerithdSessionDelegate> delegate() const { return sessionDelegate_.lock(); }
   bool hasBackendSet() const;
+
+  // The class-wide lock: flush joins of every session and the one-shot
+  // transport. A leaf: nothing else is taken while it is held.
+  static std::mutex& classLock();
+  static std::shared_ptr<ReportingSessionConnectivityHelper>& oneShotHelperLocked();
 
   // Fields other threads read while the agent lock is held.
   struct Fields {
@@ -136,9 +154,8 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
     bool hasFinishedGracefully = false;
     Data digestKey;
     std::int32_t digestAlgorithm = 0;
-    // nullopt until a storebag built the set; the set is empty until the
-    // backend kinds exist (see createBackendsWithStorebag).
-    std::optional<std::vector<std::string>> backendNames;
+    // nullptr until a storebag built the set.
+    std::shared_ptr<const BackendDictionary> backends;
   };
 
   mutable std::mutex fieldsMutex_;

@@ -13,14 +13,15 @@
 #include <string>
 
 #include "platform/Value.h"
+#include "transport/ConnectivityHelperDelegate.h"
 
 namespace zerith {
 
 class ZerithdSession;
 
-class ZerithdSessionDelegate {
+class ZerithdSessionDelegate : public ConnectivityHelperDelegate {
  public:
-  virtual ~ZerithdSessionDelegate() = default;
+  ~ZerithdSessionDelegate() override = default;
 
   virtual std::recursive_mutex& agentLock() = 0;
 
@@ -29,7 +30,7 @@ class ZerithdSessionDelegate {
 
   // Keep-alive: called by a connectivity helper once its HTTP session has
   // become invalid.
-  virtual void releaseVeskTransaction() = 0;
+  void releaseVeskTransaction() override = 0;
 
   // Storebag cache.
   virtual Value storebagForSession(ZerithdSession& session) = 0;

@@ -9,7 +9,7 @@
 
 #include <fmt/format.h>
 
-#include "config/RemoveFiles.h"
+#include "platform/RemoveFiles.h"
 #include "platform/Crypto.h"
 #include "platform/FileUtil.h"
 #include "platform/Log.h"
@@ -76,7 +76,7 @@ file::UniqueFd writeBodyFile(const fs::path& path, const Data& body) {
 }  // namespace
 
 std::shared_ptr<ReportingSessionConnectivityHelper> ReportingSessionConnectivityHelper::initWithDelegate(
-    std::weak_ptr<ZerithdSessionDelegate> delegate, std::uint32_t mode) {
+    std::weak_ptr<ConnectivityHelperDelegate> delegate, std::uint32_t mode) {
   auto helper = std::make_shared<ReportingSessionConnectivityHelper>(Token{}, std::move(delegate), mode);
   const auto configuration = privateURLSessionConfigWithMode(mode);
   if (configuration) {
@@ -94,7 +94,7 @@ std::shared_ptr<ReportingSessionConnectivityHelper> ReportingSessionConnectivity
   return helper;
 }
 
-ReportingSessionConnectivityHelper::ReportingSessionConnectivityHelper(Token, std::weak_ptr<ZerithdSessionDelegate> delegate,
+ReportingSessionConnectivityHelper::ReportingSessionConnectivityHelper(Token, std::weak_ptr<ConnectivityHelperDelegate> delegate,
                                                                        std::uint32_t mode)
     : zerithdSessionDelegate_(std::move(delegate)),
       mode_(mode),

@@ -29,7 +29,7 @@
 #include <unordered_map>
 
 #include "platform/SerialQueue.h"
-#include "session/ZerithdSessionDelegate.h"
+#include "transport/ConnectivityHelperDelegate.h"
 #include "transport/ConnectivityHelperTask.h"
 #include "transport/ReportingSessionConnectivityInterface.h"
 #include "transport/URLSession.h"
@@ -47,9 +47,9 @@ class ReportingSessionConnectivityHelper final : public ReportingSessionConnecti
   };
 
   // initWithDelegate:mode:. Never nullptr.
-  static std::shared_ptr<ReportingSessionConnectivityHelper> initWithDelegate(std::weak_ptr<ZerithdSessionDelegate> delegate,
+  static std::shared_ptr<ReportingSessionConnectivityHelper> initWithDelegate(std::weak_ptr<ConnectivityHelperDelegate> delegate,
                                                                               std::uint32_t mode);
-  ReportingSessionConnectivityHelper(Token, std::weak_ptr<ZerithdSessionDelegate> delegate, std::uint32_t mode);
+  ReportingSessionConnectivityHelper(Token, std::weak_ptr<ConnectivityHelperDelegate> delegate, std::uint32_t mode);
   ~ReportingSessionConnectivityHelper() override;
   ReportingSessionConnectivityHelper(const ReportingSessionConnectivityHelper&) = delete;
   ReportingSessionConnectivityHelper& operator=(const ReportingSessionConnectivityHelper&) = delete;
@@ -96,7 +96,7 @@ class ReportingSessionConnectivityHelper final : public ReportingSessionConnecti
   void startTask(const std::shared_ptr<URLSessionTask>& task, const char* operation, URLCompletion completion);
 
   std::shared_ptr<URLSession> privateURLSession_;
-  std::weak_ptr<ZerithdSessionDelegate> zerithdSessionDelegate_;
+  std::weak_ptr<ConnectivityHelperDelegate> zerithdSessionDelegate_;
   std::unordered_map<std::string, std::unique_ptr<ConnectivityHelperTask>> tasks_;  // state queue only
   const std::uint32_t mode_;
   const SerialQueue stateQueue_;

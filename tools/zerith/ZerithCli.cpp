@@ -2,12 +2,14 @@
 
 #include <CLI/CLI.hpp>
 
+#include <algorithm>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "config/ClientTypes.h"
 #include "platform/Crypto.h"
 #include "platform/Json.h"
 #include "platform/Log.h"
@@ -19,13 +21,15 @@ namespace zerith::cli {
 namespace {
 
 constexpr const char* kStepsHelp = R"(Steps run in the order given, on one connection (the session lives as long as it):
-  set-info               setSessionInfo from the session options
+  set-info               setSessionInfo from the session options; runs first by
+                         itself when no step names it and a step needs it
   start                  startConfig                 -> {"step":"start","backends":[...]}
   states[=USERINFO]      fetchStates with USERINFO (JSON) or --user-info
   display-url            fetchDisplayURL             -> {"step":"display-url","url":"..."}
   send[=MESSAGE]         sendMessageWithDictionary; MESSAGE is a JSON dictionary
                          {"category":C,"type":T,"payload":{...}}, default built from
-                         --category/--type/--payload  -> {"step":"send","result":...}
+                         --category/--type/--payload (category and type are
+                         numbers from 0 to 65535)  -> {"step":"send","result":...}
   flush                  flushMessages               -> {"step":"flush","result":...,"error":...}
   one-shot[=MESSAGE]     sendMessageWithSessionInfo with the session options and
                          MESSAGE's category, type and payload
@@ -37,6 +41,9 @@ constexpr const char* kStepsHelp = R"(Steps run in the order given, on one conne
   wait=MS                wait MS milliseconds (the daemon's messages print meanwhile)
   finish                 finishSessionGracefully
 Messages the daemon sends print as {"event":"message",...} lines whenever they arrive.
+A step that fails prints {"step":...,"failure":...} and ends the script: a start
+without a storebag, a flush that answers an error, an upload that answers
+success false, a call the daemon does not answer in time.
 
 Example:
   zerith session --client-type 7 --session-id 1 \
@@ -111,7 +118,19 @@ class Runner {
       }
       steps.push_back(std::move(step));
     }
+    // Without set-info the daemon's session has no session info, so it runs
+    // as client type 0 whatever --client-type says: configure it first.
+    const auto named = [&](const char* name) {
+      return std::any_of(steps.begin(), steps.end(), [&](const Step& s) { return s.name == name; });
+    };
+    const bool needsInfo = std::any_of(steps.begin(), steps.end(), [](const Step& s) {
+      return s.name != "one-shot" && s.name != "wait" && s.name != "finish";
+    });
+    if (needsInfo && !named("set-info")) {
+      steps.insert(steps.begin(), Step{"set-info", std::nullopt});
+    }
     sessionInfo_ = buildSessionInfo();
+    checkClientType();
     userInfo_ = parseDictionary(o_.userInfo, "--user-info");
     std::vector<Action> actions;
     for (const auto& step : steps) {
@@ -152,22 +171,61 @@ class Runner {
                Dictionary{{kZerithHierarchyTokenTokenID, *o_.hierarchyToken},
                           {kZerithHierarchyTokenLevel, Value(unsigned{o_.hierarchyLevel})}});
     }
-    // --session-info entries win over the ones built from options.
-    if (const auto* extra = parseDictionary(o_.sessionInfo, "--session-info").dict()) {
-      for (const auto& [key, value] : *extra) {
+    // --session-info entries win over the ones built from options. The
+    // parsed value must outlive the loop over its dictionary.
+    const Value extra = parseDictionary(o_.sessionInfo, "--session-info");
+    if (const auto* entries = extra.dict()) {
+      for (const auto& [key, value] : *entries) {
         info.set(key, value);
       }
     }
     return Value(std::move(info));
   }
 
-  Value message(const Step& step) {
-    if (step.argument) {
-      return parseDictionary(step.argument, step.name + " message");
+  // The message of a send or one-shot step: the step's JSON dictionary or
+  // the one built from --category/--type/--payload. The daemon only checks
+  // that category and type are present; a text there would go out as 0.
+  // The daemon logs a client type without a storebag as invalid and goes on
+  // without backends; say so here, before a session is opened.
+  void checkClientType() {
+    const Value type = sessionInfo_[kZerithSessionInfoClientType];
+    if (type.isNumber() && type.intValue() >= 0 && type.doubleValue() == static_cast<double>(type.intValue()) &&
+        type.intValue() <= std::numeric_limits<ZerithClientType>::max() &&
+        storebagNameForClientType(static_cast<ZerithClientType>(type.intValue()))) {
+      return;
     }
-    return Value(Dictionary{{kZerithMessageParametersCategory, Value(unsigned{o_.category})},
-                            {kZerithMessageParametersType, Value(unsigned{o_.type})},
-                            {kZerithMessageParametersPayload, parseDictionary(o_.payload, "--payload")}});
+    std::optional<ZerithClientType> first, last;
+    for (ZerithClientType t = 0; t < 256; ++t) {
+      if (storebagNameForClientType(t)) {
+        first = first.value_or(t);
+        last = t;
+      }
+    }
+    throw Failure(kExitUsage, "client type " + json::serialize(type) + " has no storebag (client types " +
+                                  std::to_string(first.value_or(0)) + " to " + std::to_string(last.value_or(0)) +
+                                  " have one)");
+  }
+
+  Value message(const Step& step) {
+    const Value m = step.argument
+                        ? parseDictionary(step.argument, step.name + " message")
+                        : Value(Dictionary{{kZerithMessageParametersCategory, Value(unsigned{o_.category})},
+                                           {kZerithMessageParametersType, Value(unsigned{o_.type})},
+                                           {kZerithMessageParametersPayload, parseDictionary(o_.payload, "--payload")}});
+    for (const char* key : {kZerithMessageParametersCategory, kZerithMessageParametersType}) {
+      const Value v = m[key];
+      if (!v.isNumber() || v.doubleValue() != static_cast<double>(v.intValue()) || v.intValue() < 0 ||
+          v.intValue() > 65535) {
+        throw Failure(kExitUsage, step.name + " message: \"" + key + "\" must be a number from 0 to 65535, not " +
+                                      (v.isNil() ? std::string("missing") : json::serialize(v)));
+      }
+    }
+    const Value payload = m[kZerithMessageParametersPayload];
+    if (!payload.isNil() && !payload.isDict()) {
+      throw Failure(kExitUsage, step.name + " message: \"" + kZerithMessageParametersPayload +
+                                    "\" must be a JSON dictionary");
+    }
+    return m;
   }
 
   const std::string& need(const Step& step) {
@@ -211,15 +269,8 @@ class Runner {
     }
     if (n == "one-shot") {
       const Value m = message(step);
-      const auto field = [&](const char* key) {
-        const Value v = m[key];
-        if (!v.isNumber() || v.intValue() < 0 || v.intValue() > 65535) {
-          throw Failure(kExitUsage, std::string("one-shot ") + key + " must be a number from 0 to 65535");
-        }
-        return static_cast<std::uint16_t>(v.intValue());
-      };
-      const auto category = field(kZerithMessageParametersCategory);
-      const auto type = field(kZerithMessageParametersType);
+      const auto category = static_cast<std::uint16_t>(m[kZerithMessageParametersCategory].intValue());
+      const auto type = static_cast<std::uint16_t>(m[kZerithMessageParametersType].intValue());
       const Value payload = m[kZerithMessageParametersPayload];
       return [this, category, type, payload] {
         return session_->sendMessageWithSessionInfo(sessionInfo_, userInfo_, category, type, payload, timeout_);
@@ -297,10 +348,29 @@ class Runner {
       throw Failure(kExitStepFailed, n + ": " + reply.error->description);
     }
     answered_ = true;
+    if (n == "start" && reply["backends"].isNil()) {
+      // The daemon answers a start without a storebag with nothing.
+      const Value type = sessionInfo_[kZerithSessionInfoClientType];
+      const auto name = storebagNameForClientType(static_cast<ZerithClientType>(type.intValue()));
+      const std::string why = "the daemon has no storebag \"" + name.value_or("") + "\" for client type " +
+                              json::serialize(type) +
+                              "; its log says why (no storebag server set, server unreachable, signature refused)";
+      line.set("failure", why);
+      print(Value(std::move(line)));
+      throw Failure(kExitStepFailed, "start: " + why);
+    }
     for (const auto& [key, value] : reply.arguments) {
       line.set(key, value);
     }
     print(Value(std::move(line)));
+    // Flush and upload answer their failures as arguments.
+    const Value error = reply["error"];
+    if (!error.isNil() || reply["success"] == Value(false)) {
+      const Value description = error["description"];
+      throw Failure(kExitStepFailed, n + ": " + (description.string() ? *description.string()
+                                                 : error.isNil()          ? std::string("the daemon answered success false")
+                                                                          : json::serialize(error)));
+    }
   }
 
   void print(const Value& line) {
@@ -318,6 +388,77 @@ class Runner {
   std::mutex outMutex_;
 };
 
+// Edit distance, for "did you mean" hints on misspelt words.
+std::size_t distance(const std::string& a, const std::string& b) {
+  std::vector<std::size_t> row(b.size() + 1);
+  for (std::size_t j = 0; j <= b.size(); ++j) {
+    row[j] = j;
+  }
+  for (std::size_t i = 1; i <= a.size(); ++i) {
+    std::size_t diagonal = row[0];
+    row[0] = i;
+    for (std::size_t j = 1; j <= b.size(); ++j) {
+      const std::size_t above = row[j];
+      row[j] = std::min({row[j] + 1, row[j - 1] + 1, diagonal + (a[i - 1] == b[j - 1] ? 0 : 1)});
+      diagonal = above;
+    }
+  }
+  return row[b.size()];
+}
+
+std::string suggestion(const std::string& word, const std::vector<std::string>& known) {
+  const std::string* best = nullptr;
+  std::size_t bestDistance = 3;  // at most two edits away
+  for (const auto& candidate : known) {
+    if (const auto d = distance(word, candidate); d < bestDistance) {
+      best = &candidate;
+      bestDistance = d;
+    }
+  }
+  return best ? " (did you mean " + *best + "?)" : "";
+}
+
+std::vector<std::string> longNames(const CLI::App& app) {
+  std::vector<std::string> names;
+  for (const auto* option : app.get_options()) {
+    for (const auto& name : option->get_lnames()) {
+      names.push_back("--" + name);
+    }
+  }
+  return names;
+}
+
+// The first word of the command line that no option or command took.
+std::optional<std::string> unexpectedArgument(const CLI::App& app, const CLI::App* chosen) {
+  const auto explain = [](const std::string& left, const CLI::App& where, const CLI::App* command,
+                          std::vector<std::string> known) {
+    const std::string word = left.substr(0, left.find('='));
+    if (word.starts_with("-")) {
+      return "unknown option " + word + (command ? " for " + command->get_name() : "") + suggestion(word, known);
+    }
+    if (!command) {
+      std::vector<std::string> commands;
+      for (const auto* sub : where.get_subcommands([](const CLI::App*) { return true; })) {
+        commands.push_back(sub->get_name());
+      }
+      return "unknown command \"" + word + "\"" + suggestion(word, commands);
+    }
+    return "unexpected argument \"" + word + "\"";
+  };
+  if (const auto left = app.remaining(); !left.empty()) {
+    return explain(left.front(), app, nullptr, longNames(app));
+  }
+  if (chosen) {
+    if (const auto left = chosen->remaining(); !left.empty()) {
+      auto known = longNames(*chosen);
+      const auto global = longNames(app);
+      known.insert(known.end(), global.begin(), global.end());
+      return explain(left.front(), app, chosen, known);
+    }
+  }
+  return std::nullopt;
+}
+
 }  // namespace
 
 int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err) {
@@ -328,17 +469,24 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
   std::optional<std::string> socket;
   long timeoutMs = 30000;
   bool debug = false;
-  app.add_option("--root", root, "Root folder of the daemon's files (default: ZERITHD_ROOT, / for root, else ~/.local/share/zerithd/root)");
+  app.add_option("--root", root,
+                 "Root folder of the daemon's files (default: ZERITHD_ROOT, / for the superuser, else "
+                 "~/.local/share/zerithd/root, as zerithd)");
   app.add_option("--socket", socket, "The daemon's socket (default: <root>/run/zerithd/com.velmar.zerithd)");
-  app.add_option("--timeout", timeoutMs, "Milliseconds to wait for each answer")->capture_default_str()->check(CLI::PositiveNumber);
+  app.add_option("--timeout", timeoutMs, "Milliseconds to wait for each answer (at least 1)")->capture_default_str();
   app.add_flag("--debug", debug, "Log debug lines to standard error");
-  app.require_subcommand(1);
+  // Required options and the subcommand are checked after the parse, so
+  // that a misspelt word is reported as such rather than as what is missing.
+  app.allow_extras();
 
   SessionOptions o;
+  std::optional<std::uint32_t> clientType;
+  std::optional<std::uint32_t> sessionID;
   auto* session = app.add_subcommand("session", "Run one reporting session as a sequence of steps");
+  session->allow_extras();
   session->footer(kStepsHelp);
-  session->add_option("--client-type", o.clientType, "Client type (session info clientType)")->required();
-  session->add_option("--session-id", o.sessionID, "Session number (session info sessionID)")->required();
+  session->add_option("--client-type", clientType, "Client type (session info clientType; required)");
+  session->add_option("--session-id", sessionID, "Session number (session info sessionID; required)");
   session->add_option("--user-info", o.userInfo, "User info, a JSON dictionary");
   session->add_option("--session-info", o.sessionInfo, "Extra session info entries, a JSON dictionary");
   session->add_flag("--require-user-info", o.requireUserInfo, "Session info requireUserInfo = true");
@@ -352,31 +500,61 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
   session->add_option("--type", o.type, "Type of send/one-shot steps without a MESSAGE")->check(CLI::Range(0, 65535));
   session->add_option("--payload", o.payload, "Payload of send/one-shot steps without a MESSAGE (JSON dictionary)");
   session->add_option("--extension-token", o.extensionToken, "Sandbox extension token for upload-file");
-  session->add_option("--step", o.steps, "A step (repeat; see below)")->required();
+  session->add_option("--step", o.steps, "A step (repeat; see below; at least one)");
 
   bool dnu = false;
   auto* identifier = app.add_subcommand("identifier", "Print this device's persistent identifier");
+  identifier->allow_extras();
   identifier->add_flag("--dnu", dnu, "The identifier kept for DNU reporting");
   auto* version = app.add_subcommand("version", "Print the framework version and public-key location");
+  version->allow_extras();
 
+  const auto usage = [&](const std::string& what) {
+    err << "zerith: " << what << "\nRun with --help for more information.\n";
+    return kExitUsage;
+  };
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
     const int code = app.exit(e, out, err);
     return code == 0 ? 0 : kExitUsage;
   }
+  CLI::App* chosen = nullptr;
+  for (auto* sub : {session, identifier, version}) {
+    if (*sub) {
+      chosen = sub;
+    }
+  }
+  if (const auto problem = unexpectedArgument(app, chosen)) {
+    return usage(*problem);
+  }
+  if (!chosen) {
+    return usage("a command is required: session, identifier or version");
+  }
+  if (timeoutMs < 1) {
+    return usage("--timeout must be at least 1 millisecond, not " + std::to_string(timeoutMs));
+  }
+  if (chosen == session) {
+    for (const auto& [name, given] : {std::pair{"--client-type", clientType.has_value()},
+                                      std::pair{"--session-id", sessionID.has_value()},
+                                      std::pair{"--step", !o.steps.empty()}}) {
+      if (!given) {
+        return usage(std::string("session needs ") + name);
+      }
+    }
+    o.clientType = *clientType;
+    o.sessionID = *sessionID;
+  }
 
   log::configure(log::Options{debug, std::nullopt});
-  if (root) {
-    paths::setRoot(*root);
-  }
+  paths::setRoot(root ? std::filesystem::path(*root) : paths::defaultRoot());
   try {
-    if (*identifier) {
+    if (chosen == identifier) {
       out << json::serialize(Value(Dictionary{{"identifier", Zerith::getPersistentIdentifierForDNU(dnu)}, {"dnu", dnu}}))
           << '\n';
       return 0;
     }
-    if (*version) {
+    if (chosen == version) {
       out << json::serialize(Value(Dictionary{{"version", Zerith::frameworkVersion()},
                                               {"publicKey", Zerith::publicKeyPath().string()}}))
           << '\n';

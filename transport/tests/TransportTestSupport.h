@@ -18,9 +18,9 @@
 #include <vector>
 #include <functional>
 
-#include "config/RemoveFiles.h"  // <regex>, included the way GCC 12 with sanitizers wants it
+#include "platform/RemoveFiles.h"  // <regex>, included the way GCC 12 with sanitizers wants it
 #include "platform/Log.h"
-#include "session/ZerithdSessionDelegate.h"
+#include "transport/ConnectivityHelperDelegate.h"
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/TempRoot.h"
 #include "tests/support/TestCA.h"
@@ -120,26 +120,13 @@ class EventLog {
 
 // The agent as a connectivity helper sees it: only the keep-alive release
 // matters here.
-class ReleaseCountingAgent : public ZerithdSessionDelegate {
+class ReleaseCountingAgent : public ConnectivityHelperDelegate {
  public:
   explicit ReleaseCountingAgent(std::shared_ptr<EventLog> log) : log_(std::move(log)) {}
 
-  std::recursive_mutex& agentLock() override { return lock_; }
   void releaseVeskTransaction() override { log_->add("releaseVeskTransaction"); }
-  Value storebagForSession(ZerithdSession&) override { return {}; }
-  Value storebagVersionForSession(ZerithdSession&) override { return {}; }
-  void updateCorrelatedSessions(ZerithdSession&) override {}
-  Value parentSessionIDStringForSession(ZerithdSession&) override { return {}; }
-  std::shared_ptr<ZerithdSession> parentSessionForChild(ZerithdSession&) override { return nullptr; }
-  std::shared_ptr<ZerithdSession> getAncestorWithAggregatorForSession(ZerithdSession&) override { return nullptr; }
-  void updateDownstreamSessions(ZerithdSession&) override {}
-  void updateSharedDataForSession(ZerithdSession&, const Value&) override {}
-  void removeObjectFromSharedDataForSession(ZerithdSession&, const std::string&) override {}
-  Value sharedDataForSession(ZerithdSession&) override { return {}; }
-  void addAgentHealthInfoForSession(ZerithdSession&, Dictionary&) override {}
 
  private:
-  std::recursive_mutex lock_;
   std::shared_ptr<EventLog> log_;
 };
 

@@ -67,21 +67,88 @@ TEST_F(CliFixture, StepArgumentsReachTheSession) {
   const auto r = runCli(session({"--step", R"(send={"category":3,"type":4,"payload":{}})", "--step",
                                  R"(one-shot={"category":5,"type":6,"payload":{"x":1}})", "--step", "shared-key=k=[1]",
                                  "--step", "shared-key=gone=null", "--step", "digest-key=AAH/:3", "--step",
-                                 R"(upload-log=["a"])", "--step", "upload-file=/tmp/f.log"}));
+                                 "upload-file=/tmp/f.log"}));
   EXPECT_EQ(r.status, 0) << r.err;
   const auto calls = daemon->waitForClient().session->log.calls();
   ASSERT_EQ(calls.size(), 7u);
-  EXPECT_EQ(calls[1].args.get("category"), Value(5u));
-  EXPECT_EQ(calls[1].args.get("payload"), Value(Dictionary{{"x", 1}}));
-  EXPECT_EQ(Value(calls[2].args), Value(Dictionary{{"key", "k"}, {"value", Array{Value(1)}}}));
-  EXPECT_EQ(Value(calls[3].args), Value(Dictionary{{"key", "gone"}, {"value", Value()}}));
-  EXPECT_EQ(Value(calls[4].args), Value(Dictionary{{"digestKey", Data{0, 1, 255}}, {"algorithm", 3}}));
+  EXPECT_EQ(calls[0].operation, "setSessionInfo");  // implied: the steps need the session's info
+  EXPECT_EQ(calls[2].args.get("category"), Value(5u));
+  EXPECT_EQ(calls[2].args.get("payload"), Value(Dictionary{{"x", 1}}));
+  EXPECT_EQ(Value(calls[3].args), Value(Dictionary{{"key", "k"}, {"value", Array{Value(1)}}}));
+  EXPECT_EQ(Value(calls[4].args), Value(Dictionary{{"key", "gone"}, {"value", Value()}}));
+  EXPECT_EQ(Value(calls[5].args), Value(Dictionary{{"digestKey", Data{0, 1, 255}}, {"algorithm", 3}}));
+}
+
+TEST_F(CliFixture, SessionInfoEntriesOverrideTheOptions) {
+  // The extra entries are copied out of a parsed JSON value; the sanitizer
+  // build catches a loop over a dictionary that is already gone.
+  const auto r = runCli(session({"--client-version", "3", "--session-info",
+                                 R"({"clientVersion":4,"batchEvent":true,"note":"a longer text than any small string"})",
+                                 "--step", "set-info"}));
+  EXPECT_EQ(r.status, 0) << r.err;
+  const auto calls = daemon->waitForClient().session->log.calls();
+  ASSERT_EQ(calls.size(), 1u);
+  EXPECT_EQ(calls[0].args.get("sessionInfo"),
+            Value(Dictionary{{"sessionID", 1u}, {"clientType", 7u}, {"clientVersion", 4}, {"batchEvent", true},
+                             {"note", "a longer text than any small string"}}));
+  EXPECT_EQ(runCli(session({"--session-info", "{}", "--step", "set-info"})).status, 0);
+}
+
+TEST_F(CliFixture, SetInfoRunsFirstUnlessTheScriptPlacesIt) {
+  auto r = runCli(session({"--step", "display-url"}));
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_EQ(r.out, "{\"step\":\"set-info\"}\n{\"step\":\"display-url\",\"url\":\"https://display.example/session\"}\n");
+  auto calls = daemon->waitForClient().session->log.calls();
+  ASSERT_EQ(calls.size(), 2u);
+  EXPECT_EQ(calls[0].args.get("sessionInfo")["clientType"], Value(7u));
+
+  // Placed by the script: exactly where it stands. Nothing needs it: none.
+  r = runCli(session({"--step", "start", "--step", "set-info", "--step", "finish"}));
+  EXPECT_EQ(r.status, 0) << r.err;
+  auto second = daemon->waitForClient(2).session;
+  ASSERT_TRUE(second->log.waitFor(3));
+  calls = second->log.calls();
+  ASSERT_EQ(calls.size(), 3u);
+  EXPECT_EQ(calls[0].operation, "startConfig");
+  r = runCli(session({"--step", R"(one-shot={"category":1,"type":2})", "--step", "finish"}));
+  EXPECT_EQ(r.status, 0) << r.err;
+  auto third = daemon->waitForClient(3).session;
+  ASSERT_TRUE(third->log.waitFor(2));
+  calls = third->log.calls();
+  ASSERT_EQ(calls.size(), 2u);
+  EXPECT_EQ(calls[0].operation, "sendMessageWithSessionInfo");
+}
+
+TEST_F(CliFixture, AnswersThatMeanFailureEndTheScriptWithStatus5) {
+  daemon->prepare = [](ipc::test::RecordingSession& s) {
+    s.backends = Value();  // a start without a storebag answers nothing
+  };
+  auto r = runCli(session({"--step", "start", "--step", "finish"}));
+  EXPECT_EQ(r.status, cli::kExitStepFailed);
+  const std::string why = R"(the daemon has no storebag \"dravon\" for client type 7; its log says why (no storebag server set, server unreachable, signature refused))";
+  EXPECT_EQ(r.out, "{\"step\":\"set-info\"}\n{\"step\":\"start\",\"failure\":\"" + why + "\"}\n");
+  EXPECT_EQ(r.err, "zerith: start: the daemon has no storebag \"dravon\" for client type 7; its log says why (no storebag "
+                   "server set, server unreachable, signature refused)\n");
+  EXPECT_EQ(daemon->waitForClient().session->log.calls().size(), 2u);  // finish never ran
+
+  daemon->prepare = [](ipc::test::RecordingSession& s) {
+    s.flushError = Error{"com.velmar.zerith.ErrorDomain", 7, "backend httpsPost: HTTP status 503"};
+  };
+  r = runCli(session({"--step", "flush", "--step", "finish"}));
+  EXPECT_EQ(r.status, cli::kExitStepFailed);
+  EXPECT_EQ(r.err, "zerith: flush: backend httpsPost: HTTP status 503\n");
+  daemon->waitForClient(2);
+
+  daemon->prepare = [](ipc::test::RecordingSession&) {};
+  r = runCli(session({"--step", R"(upload-log=["a"])", "--step", "finish"}));
+  EXPECT_EQ(r.status, cli::kExitStepFailed);
   EXPECT_NE(r.out.find("{\"step\":\"upload-log\",\"success\":false,\"error\":{\"domain\":\"com.velmar.zerith.ErrorDomain\",\"code\":-1,\"description\":\"no upload backend\"}}\n"),
             std::string::npos) << r.out;
+  EXPECT_EQ(r.err, "zerith: upload-log: no upload backend\n");
 }
 
 TEST_F(CliFixture, UnreachableDaemonExitsWithAClearMessage) {
-  const auto r = runCli({"--socket", (root / "/nowhere/sock").string(), "session", "--client-type", "1", "--session-id", "1",
+  const auto r = runCli({"--socket", (root / "/nowhere/sock").string(), "session", "--client-type", "7", "--session-id", "1",
                          "--step", "start"});
   EXPECT_EQ(r.status, cli::kExitUnreachable);
   EXPECT_EQ(r.err, "zerith: the daemon is unreachable: Cannot connect to " + (root / "/nowhere/sock").string() +
@@ -111,8 +178,43 @@ TEST_F(CliFixture, BadCommandLinesAreRefusedBeforeConnecting) {
   EXPECT_EQ(runCli(session({"--step", "launch"})).err, "zerith: unknown step \"launch\" (see zerith session --help)\n");
   EXPECT_EQ(runCli(session({"--step", "send={oops"})).err, "zerith: send message is not valid JSON: {oops\n");
   EXPECT_EQ(runCli(session({"--step", "upload-log={}"})).status, cli::kExitUsage);
-  EXPECT_EQ(runCli({"session", "--step", "start"}).status, cli::kExitUsage);  // no client type
   EXPECT_EQ(runCli({"--help"}).status, 0);
+
+  const std::string more = "\nRun with --help for more information.\n";
+  EXPECT_EQ(runCli({"session", "--session-id", "1", "--step", "start"}).err, "zerith: session needs --client-type" + more);
+  EXPECT_EQ(runCli({"session", "--client-type", "7", "--step", "start"}).err, "zerith: session needs --session-id" + more);
+  EXPECT_EQ(runCli({"session", "--client-type", "7", "--session-id", "1"}).err, "zerith: session needs --step" + more);
+  EXPECT_EQ(runCli({}).err, "zerith: a command is required: session, identifier or version" + more);
+
+  // Misspelt words are named, with the nearest known one.
+  EXPECT_EQ(runCli(session({"--stepp", "start"})).err,
+            "zerith: unknown option --stepp for session (did you mean --step?)" + more);
+  EXPECT_EQ(runCli({"sesion", "--client-type", "7", "--session-id", "1", "--step", "start"}).err,
+            "zerith: unknown command \"sesion\" (did you mean session?)" + more);
+  EXPECT_EQ(runCli({"--tmeout=5", "version"}).err, "zerith: unknown option --tmeout (did you mean --timeout?)" + more);
+  EXPECT_EQ(runCli({"session", "--frobnicate", "--client-type", "7"}).err, "zerith: unknown option --frobnicate for session" + more);
+  EXPECT_EQ(runCli({"version", "now"}).err, "zerith: unexpected argument \"now\"" + more);
+  EXPECT_EQ(runCli({"--timeout", "0", "version"}).err, "zerith: --timeout must be at least 1 millisecond, not 0" + more);
+  EXPECT_EQ(runCli({"--timeout", "-5", "version"}).status, cli::kExitUsage);
+
+  // Client types without a storebag run as nothing on the daemon's side.
+  for (const char* type : {"0", "4", "24", "99"}) {
+    const auto r = runCli({"--root", root.path().string(), "session", "--client-type", type, "--session-id", "1", "--step", "start"});
+    EXPECT_EQ(r.status, cli::kExitUsage) << type;
+    EXPECT_EQ(r.err, std::string("zerith: client type ") + type + " has no storebag (client types 5 to 23 have one)\n");
+  }
+  EXPECT_EQ(runCli(session({"--session-info", R"({"clientType":"7"})", "--step", "start"})).err,
+            "zerith: client type \"7\" has no storebag (client types 5 to 23 have one)\n");
+
+  // Messages: category and type are 16-bit numbers, the payload a dictionary.
+  EXPECT_EQ(runCli(session({"--step", R"(send={"category":"x","type":1})"})).err,
+            "zerith: send message: \"category\" must be a number from 0 to 65535, not \"x\"\n");
+  EXPECT_EQ(runCli(session({"--step", R"(send={"category":1})"})).err,
+            "zerith: send message: \"type\" must be a number from 0 to 65535, not missing\n");
+  EXPECT_EQ(runCli(session({"--step", R"(one-shot={"category":1.5,"type":1})"})).status, cli::kExitUsage);
+  EXPECT_EQ(runCli(session({"--step", R"(send={"category":65536,"type":1})"})).status, cli::kExitUsage);
+  EXPECT_EQ(runCli(session({"--step", R"(send={"category":1,"type":2,"payload":[1]})"})).err,
+            "zerith: send message: \"payload\" must be a JSON dictionary\n");
   EXPECT_EQ(daemon->accepted.count(), 0);
 }
 
@@ -129,6 +231,14 @@ TEST_F(CliFixture, TheDaemonsMessagesPrintAsEventLines) {
   EXPECT_EQ(r.status, 0);
   EXPECT_NE(r.out.find("{\"event\":\"message\",\"message\":null,\"timestamp\":2.5,\"category\":1,\"type\":2,\"payload\":{\"a\":1}}\n"),
             std::string::npos) << r.out;
+}
+
+TEST(Cli, WithoutRootTheDaemonsDefaultRootIsUsed) {
+  TempRoot root;
+  ASSERT_EQ(setenv("ZERITHD_ROOT", root.path().c_str(), 1), 0);
+  const auto v = runCli({"version"});
+  unsetenv("ZERITHD_ROOT");
+  EXPECT_EQ(v.out, "{\"version\":\"8.0\",\"publicKey\":\"" + (root / "/usr/share/zerith/publicKey.der").string() + "\"}\n");
 }
 
 TEST(Cli, IdentifierAndVersion) {

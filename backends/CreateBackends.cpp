@@ -1,16 +1,21 @@
-#include "config/CreateBackends.h"
+#include "backends/CreateBackends.h"
 
 #include <sys/time.h>
 
 #include "config/ClientTypes.h"
 #include "config/DeviceInfo.h"
-#include "config/ConfigLog.h"
+#include "platform/Log.h"
 #include "zerith/ZerithBundle.h"
 #include "zerith/ZerithConstants.h"
 
 namespace zerith {
 
 namespace {
+
+const log::Logger& logger() {
+  static const log::Logger l("backends");
+  return l;
+}
 
 std::optional<std::string> stringOf(const Value& v) {
   return v.string() ? std::optional<std::string>(*v.string()) : std::nullopt;
@@ -21,11 +26,11 @@ std::optional<std::string> stringOf(const Value& v) {
 std::optional<BackendDictionary> createBackends(const Value& storebagSection, const Value& sessionInfo,
                                                 const Value& userInfo, const char* udid) {
   if (storebagSection.isNil()) {
-    configLogger().error("createBackends: Attempted to create backends with nil storebag");
+    logger().error("createBackends: Attempted to create backends with nil storebag");
     return std::nullopt;
   }
   if (sessionInfo.isNil()) {
-    configLogger().error("createBackends: Attempted to create backends with nil session info");
+    logger().error("createBackends: Attempted to create backends with nil session info");
     return std::nullopt;
   }
 

@@ -1,4 +1,4 @@
-#include "config/RemoveFiles.h"
+#include "platform/RemoveFiles.h"
 
 #include <string>
 #include <system_error>

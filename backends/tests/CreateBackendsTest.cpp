@@ -5,7 +5,7 @@
 #include "backends/PellamBackend.h"
 #include "config/ClientTypes.h"
 #include "config/Conversions.h"
-#include "config/CreateBackends.h"
+#include "backends/CreateBackends.h"
 #include "platform/Log.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"

@@ -1,0 +1,1029 @@
+#include "backends/HTTPSPostBackend.h"
+
+#include <algorithm>
+#include <cctype>
+#include <cmath>
+#include <cstdio>
+
+#include <fmt/format.h>
+#include <nlohmann/json.hpp>
+
+#include "config/ClientTypes.h"
+#include "config/Compression.h"
+#include "config/Conversions.h"
+#include "config/DeviceInfo.h"
+#include "config/Identifiers.h"
+#include "daemon/SenderCodes.h"
+#include "platform/Crypto.h"
+#include "platform/Defaults.h"
+#include "platform/Log.h"
+#include "zerith/Zerith.h"
+#include "zerith/ZerithConstants.h"
+
+namespace zerith {
+
+namespace {
+
+const log::Logger& logger() {
+  static const log::Logger l("backends");
+  return l;
+}
+
+// Posts that get no answer within this time fail instead of holding their
+// connection for ever.
+constexpr double kPostTimeoutSeconds = 60;
+
+std::string lowered(std::string_view s) {
+  std::string out(s);
+  std::transform(out.begin(), out.end(), out.begin(), [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+  return out;
+}
+
+bool equalsIgnoringCase(std::string_view a, std::string_view b) {
+  return a.size() == b.size() && lowered(a) == lowered(b);
+}
+
+bool containsIgnoringCase(std::string_view haystack, std::string_view needle) {
+  return lowered(haystack).find(lowered(needle)) != std::string::npos;
+}
+
+std::vector<std::string> split(std::string_view text, char separator) {
+  std::vector<std::string> pieces;
+  while (true) {
+    const auto at = text.find(separator);
+    pieces.emplace_back(text.substr(0, at));
+    if (at == std::string_view::npos) {
+      return pieces;
+    }
+    text.remove_prefix(at + 1);
+  }
+}
+
+std::optional<std::string> stringOf(const Value& v) {
+  if (const std::string* s = v.string()) {
+    return *s;
+  }
+  return std::nullopt;
+}
+
+// "%@" of an optional object: nil prints as "(null)".
+std::string orNull(const std::optional<std::string>& s) { return s ? *s : "(null)"; }
+
+// A comma-separated name list of a client entry as a list Value.
+Value nameList(const Value& client, std::string_view key) {
+  const Value names = client[key];
+  if (names.isNil()) {
+    return {};
+  }
+  Array list;
+  if (const std::string* s = names.string()) {
+    for (auto& piece : split(*s, ',')) {
+      list.emplace_back(std::move(piece));
+    }
+  } else {
+    logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a string of names", key,
+                   names.kindName());
+    list.emplace_back(std::string());  // matches no name: the entry is not ours
+  }
+  return Value(std::move(list));
+}
+
+// A number-valued profile key; a value of another kind is logged and read
+// as absent.
+Value numberOf(const Value& client, std::string_view key) {
+  const Value v = client[key];
+  if (v.isNil() || v.isNumber() || v.isBool()) {
+    return v;
+  }
+  logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a number; ignored", key, v.kindName());
+  return {};
+}
+
+// A list-valued profile key; another kind is logged and read as absent.
+Value listOf(const Value& client, std::string_view key) {
+  const Value v = client[key];
+  if (v.isNil() || v.isArray()) {
+    return v;
+  }
+  logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a list; ignored", key, v.kindName());
+  return {};
+}
+
+std::optional<std::string> stringKey(const Value& client, std::string_view key) {
+  const Value v = client[key];
+  if (v.isNil()) {
+    return std::nullopt;
+  }
+  if (!v.isString()) {
+    logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a string; ignored", key, v.kindName());
+    return std::nullopt;
+  }
+  return *v.string();
+}
+
+// An integer key clamped into 32 bits.
+std::int32_t int32Of(const Value& v) {
+  const std::int64_t i = v.intValue();
+  return static_cast<std::int32_t>(std::clamp<std::int64_t>(i, INT32_MIN, INT32_MAX));
+}
+
+std::optional<std::int64_t> recordInteger(const Dictionary& record, std::string_view key) {
+  if (const Value* v = record.find(key)) {
+    return v->intValue();
+  }
+  return std::nullopt;
+}
+
+// The text a filter hashes for a value: strings as they are, scalars in
+// their text form, anything else in its one-line description.
+std::string hashableText(const Value& v) {
+  if (const std::string* s = v.string()) {
+    return *s;
+  }
+  if (auto text = v.scalarText()) {
+    return *text;
+  }
+  return v.description();
+}
+
+// The value of a record entry on the wire, or nullopt when JSON cannot carry
+// it (logged). Dates become seconds since 1970.
+std::optional<nlohmann::ordered_json> wireValue(const std::string& key, const Value& v) {
+  switch (v.type()) {
+    case Value::Type::Bool: return nlohmann::ordered_json(v.boolValue());
+    case Value::Type::Int: return nlohmann::ordered_json(v.intValue());
+    case Value::Type::UInt: return nlohmann::ordered_json(v.unsignedValue());
+    case Value::Type::Real:
+      if (std::isfinite(v.doubleValue())) {
+        return nlohmann::ordered_json(v.doubleValue());
+      }
+      break;
+    case Value::Type::String: return nlohmann::ordered_json(*v.string());
+    case Value::Type::Date: return nlohmann::ordered_json(sanitizeDouble(v.date()->secondsSince1970));
+    default: break;
+  }
+  logger().error("HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable to handle key: {}, value: {}",
+                 key, v.description());
+  return std::nullopt;
+}
+
+}  // namespace
+
+std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(std::string name, const Value& profile,
+                                                                 const std::optional<std::string>& productFamily) {
+  if (profile.isNil() || !productFamily) {
+    return nullptr;
+  }
+  if (profile["clients"].isNil()) {
+    logger().error("HTTPSPostBackend(initWithName): can't find the client list.");
+    return nullptr;
+  }
+  return std::make_shared<HTTPSPostBackend>(Token{}, std::move(name), profile, productFamily);
+}
+
+HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::optional<std::string> productFamily)
+    : ZerithBackend(std::move(name), std::move(profile), std::move(productFamily)) {
+  Fields f;
+  if (auto url = defaultsStringForKey("httpsPostURL")) {
+    f.postURL = *url;
+    logger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for postURL", *url);
+  }
+  f.useDefaultPostURL = f.postURL.has_value();
+  if (auto url = defaultsStringForKey("httpsRealtimePostURL")) {
+    f.realtimePostURL = *url;
+    logger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for realtimePostURL", *url);
+  }
+  f.useDefaultRealtimePostURL = f.realtimePostURL.has_value();
+  if (auto display = stringOf(this->profile()["display_url"])) {
+    setDisplayURL(*display);
+  }
+  f.eventThreshold = kDefaultEventThreshold;
+  f.dnuEnabled = diagnosticsSubmissionAllowed();
+  f.uuidRespectDnu = Zerith::getPersistentIdentifierForDNU(true);
+  f.uuidOverrideDnu = Zerith::getPersistentIdentifierForDNU(false);
+  const auto force = defaultsStringForKey("forceEventLogging");
+  f.forceEventLogging = force && (Value(*force).boolValue() || equalsIgnoringCase(*force, "true") ||
+                                  equalsIgnoringCase(*force, "yes"));
+  fields_ = std::move(f);
+}
+
+HTTPSPostBackend::~HTTPSPostBackend() = default;
+
+HTTPSPostBackend::Fields HTTPSPostBackend::fields() const {
+  std::lock_guard lock(fieldsMutex_);
+  return fields_;
+}
+
+void HTTPSPostBackend::setImmutable() {
+  std::lock_guard lock(fieldsMutex_);
+  fields_.immutable = true;
+}
+
+void HTTPSPostBackend::asyncOnStateQueue(std::function<void(HTTPSPostBackend&)> block) {
+  std::weak_ptr<ZerithBackend> weak = weak_from_this();
+  if (weak.expired()) {
+    stateQueue().sync([&] { block(*this); });
+    return;
+  }
+  stateQueue().async([weak = std::move(weak), block = std::move(block)] {
+    if (auto self = weak.lock()) {
+      block(static_cast<HTTPSPostBackend&>(*self));
+    }
+  });
+}
+
+// ---------------------------------------------------------------------------
+// Records, batch and envelope
+
+Dictionary HTTPSPostBackend::newEventDictfromPayload(const Value& payload, const timeval& timestamp,
+                                                     std::uint16_t method, std::uint16_t respCode,
+                                                     std::uint16_t) const {
+  Dictionary event = payload.isDict() ? payload.dictCopy() : Dictionary();
+  const double start = startTimeStamp();
+  const std::int64_t startTS = roundDownToMinute(static_cast<std::int64_t>(start));
+  event.set("_startTS", Value(static_cast<long long>(startTS)));
+  event.set("_sender", Value(senderCode(static_cast<std::uint32_t>(compType()))));
+  event.set("_clientVersion", Value(static_cast<unsigned>(clientVersion())));
+  if (auto combined = combinedSessionIDString()) {
+    event.set("_sessionID", Value(*combined));
+  }
+  const std::int32_t type = compType();
+  if (type == 7 || (isInternal() && (type == 11 || type == 13))) {
+    event.set("_sessionID", Value(static_cast<unsigned>(sessionID())));
+  }
+  event.set("_eventNumber", Value(static_cast<unsigned>(eventID())));
+  event.set("_method", Value(static_cast<unsigned>(method)));
+  event.set("_status", Value(static_cast<unsigned>(respCode)));
+  const double clientTS = sanitizeDouble(static_cast<double>(startTS) + (timevalToSeconds(timestamp) - start));
+  event.set("_clientTS", Value(clientTS));
+  event.set("eventTime", Value(clientTS));
+  event.set("_productFamily", productFamily() ? Value(*productFamily()) : Value());
+  event.set("_productModel", hardwareType() ? Value(*hardwareType()) : Value());
+  if (auto version = productVersion()) {
+    event.set("_osVersion", Value(*version));
+  }
+  if (auto build = buildVersion()) {
+    event.set("_build", Value(*build));
+  }
+  event.set("_internal", Value(isInternalBuild() ? 3u : 2u));
+  const std::string minor = selfVersionMinor() != 0 ? fmt::format(".{}", selfVersionMinor()) : std::string();
+  event.set("_reportVers", Value(fmt::format("{}.{}{}", selfVersionMajor(), selfVersionMiddle(), minor)));
+  event.set("_timezoneOffset", Value(static_cast<long long>(timeZoneOffsetSeconds())));
+  // Absent product facts leave no entry rather than a null on the wire.
+  for (const char* key : {"_productFamily", "_productModel"}) {
+    if (const Value* v = event.find(key); v && v->isNil()) {
+      event.erase(key);
+    }
+  }
+  return event;
+}
+
+void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Value& frameworkData) const {
+  if (const Dictionary* userInfo = userInfoDict().dict()) {
+    for (const auto& [key, value] : *userInfo) {
+      event.set(key, value);
+    }
+  }
+  if (const Dictionary* data = frameworkData.dict()) {
+    for (const auto& [key, value] : *data) {
+      event.set(key, value);
+    }
+  }
+  filterEvent(event);
+}
+
+std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
+  const auto method = static_cast<std::uint16_t>(recordInteger(event, "_method").value_or(0));
+  std::int64_t count = stateQueue().sync([&] {
+    if (!batch_.batchedEvents) {
+      batch_.batchedEvents.emplace();
+    }
+    for (const auto& [m, n] : batch_.eventMethodCounts) {
+      if (m == method) {
+        return n;
+      }
+    }
+    return std::int64_t{0};
+  });
+  std::optional<std::string> result;
+  if (count > fields().eventThreshold) {
+    logger().debug("HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method {}",
+                   method);
+    result = flushMessagesWithCompletion(nullptr);
+    count = 0;
+  }
+  asyncOnStateQueue([event = std::move(event), method, count](HTTPSPostBackend& self) mutable {
+    Batch& batch = self.batch_;
+    if (!batch.batchedEvents) {
+      batch.batchedEvents.emplace();
+    }
+    batch.batchedEvents->push_back(std::move(event));
+    for (auto& [m, n] : batch.eventMethodCounts) {
+      if (m == method) {
+        n = count + 1;
+        return;
+      }
+    }
+    batch.eventMethodCounts.emplace_back(method, count + 1);
+  });
+  return result;
+}
+
+std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
+    std::vector<Dictionary> events, std::optional<std::string>* prettyJsonString) const {
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  const Fields f = fields();
+
+  auto records = nlohmann::ordered_json::array();
+  for (const Dictionary& event : events) {
+    auto record = nlohmann::ordered_json::object();
+    for (const auto& [key, value] : event) {
+      if (auto wire = wireValue(key, value)) {
+        record[key] = std::move(*wire);
+      }
+    }
+    records.push_back(std::move(record));
+  }
+
+  std::optional<std::string> clientId = f.uuidCustom ? f.uuidCustom : (f.dnuType != 0 ? f.uuidOverrideDnu : f.uuidRespectDnu);
+  if (f.extrasOnInternal != 0 && isInternal()) {
+    const char* device = udid();
+    clientId = device ? std::optional<std::string>(device) : std::nullopt;
+  }
+
+  // The three keys go in as one list that ends at the first absent value.
+  auto envelope = nlohmann::ordered_json::object();
+  envelope["postTime"] = sanitizeDouble(timevalToSeconds(now));
+  if (clientId) {
+    envelope["clientId"] = *clientId;
+    envelope["events"] = std::move(records);
+  }
+
+  std::string compact;
+  try {
+    // Text that is not UTF-8 is carried with replacement characters rather
+    // than breaking the JSON.
+    compact = envelope.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+  } catch (const std::exception& e) {
+    logger().error("HTTPSPostBackend(createMessageForPostAndLogging): cannot serialise the envelope: {}", e.what());
+    return std::nullopt;
+  }
+
+  if (prettyJsonString) {
+    const ZerithEnvironmentType environment =
+        lastResolvedEnvironmentType() != kEnvironmentNone ? lastResolvedEnvironmentType() : userDefaultsEnvironment();
+    const bool forced = (environment == kEnvironmentDevelopment || environment == kEnvironmentInternal) && f.forceEventLogging;
+    const bool consented = f.dnuType == 0 && f.dnuEnabled;
+    if (forced || consented) {
+      *prettyJsonString = envelope.dump(4, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+    }
+  }
+  return compact;
+}
+
+// ---------------------------------------------------------------------------
+// Sending, posting, flushing
+
+std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, const timeval& timestamp,
+                                                         std::uint16_t method, std::uint16_t respCode,
+                                                         std::uint16_t eventID, std::int32_t flag) {
+  const std::int32_t currentState = state();
+  if (currentState == kBackendStateDisabled) {
+    return std::nullopt;
+  }
+  Value payload = message["ClientData"];
+  if (payload.isNil()) {
+    payload = message;
+  }
+  if (payload.isNil()) {
+    logger().error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
+    payload = Value(Dictionary());
+  }
+  Dictionary copy = payload.isDict() ? payload.dictCopy() : Dictionary();
+  if (method == 0 && respCode == 1) {
+    logger().debug(
+        "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary");
+    const Fields f = fields();
+    copy.set("Opt", Value(f.dnuType));
+    const Value threshold = samplingThreshold();
+    copy.set("SamplingThreshold", threshold.isNil() ? Value(-1) : threshold);
+    copy.set("OverrideSampling", f.overrideSampling.isNil() ? Value(-1) : f.overrideSampling);
+    copy.set("Batch", Value(batchEvents() ? 1 : 0));
+  }
+  Dictionary event = newEventDictfromPayload(Value(std::move(copy)), timestamp, method, respCode, eventID);
+  prepareEventForMessage(event, message["SharedData"]);
+
+  const bool realtime = (flag | 2) == 3;
+  if ((flag | 1) == 3 && currentState == kBackendStateSampledOut) {
+    setState(kBackendStateEnabled);
+  }
+  logger().debug("HTTPSPostBackend(sendMessage): realtime is {}", realtime ? 1 : 0);
+
+  const bool haveUserInfo = userInfoDict().count() > 0;
+  const bool batch = currentState == kBackendStateUndecided || currentState == kBackendStateSampledOut ||
+                     (!realtime && batchEvents()) || (requireUserInfo() && !haveUserInfo);
+  if (batch) {
+    logger().debug("HTTPSPostBackend(sendMessage): Batching {}, {}, {}", currentState, batchEvents() ? 1 : 0,
+                   requireUserInfo() ? 1 : 0);
+    return batchEvent(std::move(event));
+  }
+
+  std::optional<std::string> flushed;
+  bool flushPreceded = false;
+  if (currentState == kBackendStateEnabled && realtime && batchedEventCount() > 0) {
+    logger().debug(
+        "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush "
+        "here to keep events in order.");
+    flushed = flushMessagesWithCompletion(nullptr);
+    flushPreceded = true;
+  }
+  logger().debug("HTTPSPostBackend(sendMessage): Sending {}, {}, {}", currentState, batchEvents() ? 1 : 0,
+                 requireUserInfo() ? 1 : 0);
+  std::optional<std::string> pretty;
+  std::vector<Dictionary> one;
+  one.push_back(std::move(event));
+  const auto body = createMessageForPostAndLogging(std::move(one), &pretty);
+  if (!body) {
+    return std::nullopt;
+  }
+  std::optional<std::string> text = pretty;
+  if (flushPreceded) {
+    text = fmt::format("Flushed events:\n{}\nStandalone event:\n{}", orNull(flushed), orNull(pretty));
+  }
+  postJSONMessage(*body, flag, method, respCode, nullptr);
+  if (flushPreceded) {
+    setImmutable();
+  }
+  return text;
+}
+
+std::string HTTPSPostBackend::digestDescription(const std::array<std::uint8_t, 20>& digest) {
+  std::string out = "<";
+  for (std::size_t i = 0; i < digest.size(); ++i) {
+    if (i > 0 && i % 4 == 0) {
+      out += ' ';
+    }
+    out += fmt::format("{:02x}", digest[i]);
+  }
+  out += '>';
+  return out;
+}
+
+std::string HTTPSPostBackend::userAgent() const {
+  const std::string minor = selfVersionMinor() != 0 ? fmt::format(".{}", selfVersionMinor()) : std::string();
+  return fmt::format("Zerith/{}.{}{} ({}; {})", selfVersionMajor(), selfVersionMiddle(), minor, orNull(hardwareType()),
+                     orNull(productVersion()));
+}
+
+void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t flag, std::optional<std::uint16_t> method,
+                                       std::optional<std::uint16_t> responseCode, PostCompletion completion) {
+  const Fields f = fields();
+  const bool realtime = (flag | 2) == 3;
+  std::optional<std::string> url = realtime ? f.realtimePostURL : f.postURL;
+  if (!url) {
+    logger().error("HTTPSPostBackend(postJsonMessage): postURL is nil");
+    if (completion) {
+      completion(Value(), makeZerithError("postURL is nil", -1));
+    }
+    return;
+  }
+
+  const auto jsonBytes = crypto::bytesOf(json);
+  Data body(jsonBytes.begin(), jsonBytes.end());
+  bool compressed = false;
+  if (auto gz = gzipDeflate(jsonBytes); gz && !gz->empty() && gz->size() < body.size()) {
+    body = std::move(*gz);
+    compressed = true;
+  }
+
+  if (!isInternalBuild()) {
+    const auto at = url->find("://");
+    if (at != std::string::npos && !equalsIgnoringCase(url->substr(0, at), "https")) {
+      // "https" + "://" + the second piece; a further "://" and what follows go.
+      std::string rest = url->substr(at + 3);
+      if (const auto again = rest.find("://"); again != std::string::npos) {
+        rest.resize(again);
+      }
+      url = "https://" + rest;
+    }
+  }
+  // Only HTTP(S) is ever posted to; anything else (no scheme, ftp on an
+  // internal build) is refused here instead of being handed to the transport.
+  const auto schemeEnd = url->find("://");
+  const std::string scheme = schemeEnd == std::string::npos ? std::string() : lowered(url->substr(0, schemeEnd));
+  if (scheme != "https" && scheme != "http") {
+    const std::string text = fmt::format("post URL '{}' is not an http(s) URL", *url);
+    logger().error("HTTPSPostBackend(postJsonMessage): post error: {}", text);
+    if (completion) {
+      completion(Value(), makeZerithError(text, -1));
+    }
+    return;
+  }
+
+  URLRequest request;
+  request.httpMethod = "POST";
+  request.url = *url;
+  request.timeoutSeconds = kPostTimeoutSeconds;
+  request.allowsCellularAccess = !shouldUseWiFiOnly();
+  const Value userInfo = userInfoDict();
+  const auto clientName = stringOf(userInfo[kZerithUserInfoClientName]);
+  const auto serviceName = stringOf(userInfo[kZerithUserInfoServiceName]);
+  // A missing name compares as equal: without user info there is no cellular.
+  if ((!clientName || equalsIgnoringCase(*clientName, "com.velmar.lumira")) &&
+      (!serviceName || equalsIgnoringCase(*serviceName, "haptics"))) {
+    request.allowsCellularAccess = false;
+  }
+
+  HTTPHeaders& headers = request.headers;
+  if (clientName) {
+    headers.emplace_back("X-ZTH-Client-Name", *clientName);
+  }
+  if (serviceName) {
+    headers.emplace_back("X-ZTH-Service-Name", *serviceName);
+  }
+  if (isInternal()) {
+    headers.emplace_back("X-ZTH-Internal-Build", "1");
+  }
+  headers.emplace_back("User-Agent", userAgent());
+  headers.emplace_back("X-ZTH-Client-Version", std::to_string(clientVersion()));
+  headers.emplace_back("X-ZTH-Sender", std::string(senderCode(static_cast<std::uint32_t>(compType()))));
+  if (method && responseCode) {
+    headers.emplace_back("X-ZTH-Event-Map", fmt::format("{} {}", *method, *responseCode));
+  }
+  headers.emplace_back("Accept", "application/json");
+  headers.emplace_back("Content-Type", "application/json");
+  headers.emplace_back("Content-Length", std::to_string(body.size()));
+  if (compressed) {
+    headers.emplace_back("Content-Encoding", "gzip");
+  }
+  if (const auto key = digestKey(); key && digestAlgorithm() == 0) {
+    headers.emplace_back("X-ZTH-DIGEST", digestDescription(crypto::hmacSha1(*key, jsonBytes)));
+  }
+  request.body = std::move(body);
+
+  auto transport = reportingSessionConnectivityDelegate();
+  if (!transport) {
+    return;
+  }
+  std::weak_ptr<ZerithBackend> weak = weak_from_this();
+  const std::string backendName = name();
+  transport->postURLRequestWithCompletionHandler(
+      request, [weak, backendName, completion](const Data&, const std::optional<HTTPURLResponse>& response,
+                                               const std::optional<Error>& error) {
+        if (error) {
+          logger().error("HTTPSPostBackend(postJsonMessage): post error: {}", error->description);
+        }
+        if (response && response->statusCode >= 500 && response->statusCode <= 599) {
+          const std::string text =
+              fmt::format("backend {} disabled by server {} return code", backendName, response->statusCode);
+          // The state is queued before the line is written, so whoever
+          // reads the line reads the disabled state too.
+          if (auto self = weak.lock()) {
+            self->setState(kBackendStateDisabled);
+          }
+          logger().info("postJSONMessage: {}", text);
+          if (completion) {
+            completion(Value(), makeZerithError(text, response->statusCode));
+          }
+          return;
+        }
+        if (completion) {
+          completion(Value(), error);
+        }
+      });
+}
+
+std::optional<std::string> HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
+  return stateQueue().sync([&] { return flushOnStateQueue(std::move(completion)); });
+}
+
+std::optional<std::string> HTTPSPostBackend::flushOnStateQueue(FlushCompletion completion) {
+  const auto fail = [&](const char* text) {
+    if (completion) {
+      completion(Value(), makeZerithError(text, -1));
+    }
+  };
+  if (!batch_.batchedEvents) {
+    fail("Nothing to flush");
+    return std::nullopt;
+  }
+  if (stateOnQueue() != kBackendStateEnabled) {
+    batch_ = Batch{};
+    fail("Nothing to flush");
+    return std::nullopt;
+  }
+  Dictionary userInfo = userInfoDict().isDict() ? userInfoDict().dictCopy() : Dictionary();
+  if (requireUserInfo() && userInfo.empty()) {
+    fail("Can not flush: userInfo is required");
+    return std::nullopt;
+  }
+  logger().debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
+  filterEvent(userInfo);
+  std::vector<Dictionary> kept;
+  for (Dictionary& event : *batch_.batchedEvents) {
+    const auto category = static_cast<std::uint16_t>(recordInteger(event, "_method").value_or(0));
+    if (!isWhitelistedEvent(category)) {
+      logger().debug("flushMessagesWithCompletion: Dropping event with category {} as it is not whitelisted for backend {}",
+                     category, name());
+      continue;
+    }
+    if (isBlacklistedEvent(category)) {
+      logger().info("flushMessagesWithCompletion: Dropping event with category {} as it is blacklisted for backend {}",
+                    category, name());
+      continue;
+    }
+    for (const auto& [key, value] : userInfo) {
+      event.set(key, value);
+    }
+    kept.push_back(std::move(event));
+  }
+  batch_ = Batch{};
+  std::optional<std::string> pretty;
+  const auto body = kept.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(kept), &pretty);
+  if (!body) {
+    fail("Nothing to flush: batched events were completely filtered out");
+    return std::nullopt;
+  }
+  postJSONMessage(*body, 0, std::nullopt, std::nullopt, std::move(completion));
+  if (pretty) {
+    setImmutable();
+  }
+  return pretty;
+}
+
+void HTTPSPostBackend::setCorrelatedSessionID(std::optional<std::string> sessionID) {
+  ZerithBackend::setCorrelatedSessionID(sessionID);
+  stateQueue().sync([&] {
+    if (!batch_.batchedEvents) {
+      return;
+    }
+    for (Dictionary& event : *batch_.batchedEvents) {
+      if (sessionID) {
+        event.set("_sessionID", Value(*sessionID));
+      } else {
+        event.erase("_sessionID");
+      }
+    }
+  });
+}
+
+std::uint32_t HTTPSPostBackend::batchedEventsSize() {
+  return stateQueue().sync([&]() -> std::uint32_t {
+    if (!batch_.batchedEvents) {
+      return 0;
+    }
+    Array records;
+    records.reserve(batch_.batchedEvents->size());
+    for (const Dictionary& event : *batch_.batchedEvents) {
+      records.emplace_back(event);
+    }
+    return static_cast<std::uint32_t>(estimatedPlistMemorySize(Value(std::move(records))));
+  });
+}
+
+std::size_t HTTPSPostBackend::batchedEventCount() const {
+  return stateQueue().sync([&]() -> std::size_t { return batch_.batchedEvents ? batch_.batchedEvents->size() : 0; });
+}
+
+// ---------------------------------------------------------------------------
+// Storebag-driven state and filters
+
+bool HTTPSPostBackend::matchExactStringWithList(const Value& list, const std::optional<std::string>& wholeString,
+                                                bool whitelist) {
+  if (list.count() == 0) {
+    return whitelist;
+  }
+  if (!wholeString) {
+    return !whitelist;
+  }
+  for (const Value& element : *list.array()) {
+    if (const std::string* s = element.string(); s && equalsIgnoringCase(*s, *wholeString)) {
+      return true;
+    }
+  }
+  return false;
+}
+
+bool HTTPSPostBackend::matchStringWithList(const Value& list, const std::optional<std::string>& wholeString,
+                                           bool whitelist) {
+  if (list.count() == 0 || !list.isArray()) {
+    return whitelist;
+  }
+  if (!wholeString) {
+    return !whitelist;
+  }
+  for (const Value& element : *list.array()) {
+    if (const std::string* s = element.string(); s && containsIgnoringCase(*wholeString, *s)) {
+      return true;
+    }
+  }
+  return false;
+}
+
+bool HTTPSPostBackend::matchClientNameAndServiceID(const Value& client, const std::optional<std::string>& clientName,
+                                                   const std::optional<std::string>& serviceID) const {
+  if (!matchExactStringWithList(nameList(client, "client"), clientName, true)) {
+    return false;
+  }
+  return matchStringWithList(nameList(client, "service"), serviceID, true);
+}
+
+bool HTTPSPostBackend::isFrameworkEnabledForClient(const Value& client) const {
+  const auto since = stringKey(client, "enabledSince");
+  if (!since) {
+    return true;
+  }
+  const auto pieces = split(*since, '.');
+  std::uint8_t wanted[3] = {0, 0, 0};
+  for (std::size_t i = 0; i < 3 && i < pieces.size(); ++i) {
+    wanted[i] = static_cast<std::uint8_t>(Value(pieces[i]).intValue());
+  }
+  const std::uint8_t have[3] = {selfVersionMajor(), selfVersionMiddle(), selfVersionMinor()};
+  return std::lexicographical_compare(wanted, wanted + 3, have, have + 3) ||
+         std::equal(wanted, wanted + 3, have);
+}
+
+bool HTTPSPostBackend::updatePostLink(const Value& client) {
+  std::lock_guard lock(fieldsMutex_);
+  Fields& f = fields_;
+  bool taken = false;
+  if (!(f.useDefaultPostURL && f.postURL)) {
+    f.useDefaultPostURL = false;
+    if (auto url = stringKey(client, "post_url")) {
+      f.postURL = *url;
+      logger().info("HTTPSPostBackend(updatePostLink): Storebag '{}' for postURL", *url);
+      taken = true;
+    }
+  }
+  if (!(f.useDefaultRealtimePostURL && f.realtimePostURL)) {
+    f.useDefaultRealtimePostURL = false;
+    f.realtimePostURL.reset();
+    if (auto url = stringKey(client, "realtime_post_url")) {
+      f.realtimePostURL = *url;
+      logger().info("HTTPSPostBackend(updatePostLink): Storebag '{}' for realtimePostURL", *url);
+    } else {
+      f.realtimePostURL = f.postURL;
+      logger().info("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '{}'", orNull(f.postURL));
+    }
+  }
+  return taken;
+}
+
+void HTTPSPostBackend::resetBackendStateWithClient(const Value& client) {
+  const std::int32_t threshold = int32Of(numberOf(client, "event_threshold"));
+  const std::int32_t extras = int32Of(numberOf(client, "extras_on_internal"));
+  {
+    std::lock_guard lock(fieldsMutex_);
+    fields_.eventThreshold = threshold;
+    fields_.extrasOnInternal = extras;
+  }
+  logger().info("resetBackendStateWithClient: event_threshold set to {}", threshold);
+  if (threshold < 0) {
+    logger().error("resetBackendStateWithClient: event_threshold {} is negative: every batched event flushes the batch",
+                   threshold);
+  }
+  logger().info("setBackendStateWithClient: extras on internal is set to {}", extras);
+}
+
+void HTTPSPostBackend::createFiltersFromArray(const Value& array) {
+  if (!array.isArray() || array.count() == 0) {
+    return;
+  }
+  auto filters = std::make_shared<std::vector<Filter>>();
+  for (const Value& element : *array.array()) {
+    Filter filter;
+    if (!element.isDict()) {
+      logger().error("HTTPSPostBackend(createFiltersFromArray): a filter is {}, not a dictionary; it keeps nothing",
+                     element.kindName());
+    }
+    const Value method = element["method"];
+    const Value status = element["status"];
+    filter.method = method.isNil() ? -1 : int32Of(method);
+    filter.status = status.isNil() ? -1 : int32Of(status);
+    const auto action = stringOf(element["action"]);
+    filter.action = action == "remove" ? kFilterRemove : (action == "sha256" ? kFilterSHA256 : kFilterKeep);
+    if (action && filter.action == kFilterKeep) {
+      logger().debug("HTTPSPostBackend(createFiltersFromArray): unknown filter action '{}' keeps its key", *action);
+    }
+    filter.key = stringOf(element["key"]).value_or(std::string());
+    filters->push_back(std::move(filter));
+  }
+  std::lock_guard lock(fieldsMutex_);
+  fields_.numberOfFilters = static_cast<std::int32_t>(filters->size());
+  fields_.filters = std::move(filters);
+}
+
+void HTTPSPostBackend::filterEvent(Dictionary& event) const {
+  std::shared_ptr<const std::vector<Filter>> filters;
+  {
+    std::lock_guard lock(fieldsMutex_);
+    filters = fields_.filters;
+  }
+  if (filters->empty()) {
+    return;
+  }
+  const std::int64_t method = recordInteger(event, "_method").value_or(0);
+  const std::int64_t status = recordInteger(event, "_status").value_or(0);
+  std::vector<std::string> keys;
+  keys.reserve(event.size());
+  for (const auto& [key, value] : event) {
+    keys.push_back(key);
+  }
+  for (const std::string& key : keys) {
+    for (const Filter& filter : *filters) {
+      if (filter.key.empty() || !equalsIgnoringCase(filter.key, key) || (filter.method != -1 && filter.method != method) ||
+          (filter.status != -1 && filter.status != status)) {
+        continue;
+      }
+      if (filter.action == kFilterSHA256) {
+        event.set(key, Value(convertIntoSHA256(hashableText(event.get(key)))));
+      } else if (filter.action == kFilterRemove) {
+        event.erase(key);
+      }
+      break;
+    }
+  }
+}
+
+void HTTPSPostBackend::updateState() { setState(updateBackendState()); }
+
+std::int32_t HTTPSPostBackend::updateBackendState() {
+  if (isImmutable()) {
+    return state();
+  }
+  const Value clients = profile()["clients"];
+  if (!clients.isArray()) {
+    if (!clients.isNil()) {
+      logger().error("HTTPSPostBackend(updateBackendState): \"clients\" holds {}, not a list", clients.kindName());
+    }
+    return kBackendStateDisabled;
+  }
+  const Value userInfo = userInfoDict();
+  const auto clientName = stringOf(userInfo[kZerithUserInfoClientName]);
+  const auto serviceName = stringOf(userInfo[kZerithUserInfoServiceName]);
+
+  std::vector<Value> entries;
+  for (const Value& entry : *clients.array()) {
+    if (entry.isDict()) {
+      entries.push_back(entry);
+    } else {
+      logger().error("HTTPSPostBackend(updateBackendState): a client entry is {}, not a dictionary; skipped",
+                     entry.kindName());
+    }
+  }
+
+  for (const Value& entry : entries) {
+    if (matchClientNameAndServiceID(entry, clientName, serviceName)) {
+      const Value expedite = numberOf(entry, "expedite");
+      if (!expedite.isNil()) {
+        const bool batch = expedite.intValue() == 0;
+        setBatchEvents(batch);
+        logger().debug("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent={}", batch ? 1 : 0);
+      }
+      break;
+    }
+  }
+
+  if (!requireUserInfo()) {
+    for (const Value& entry : entries) {
+      if (updatePostLink(entry)) {
+        resetBackendStateWithClient(entry);
+        break;
+      }
+    }
+    return kBackendStateEnabled;
+  }
+  if (userInfo.count() == 0) {
+    return kBackendStateUndecided;
+  }
+
+  const auto country = localeCountryCode();
+  for (const Value& entry : entries) {
+    if (!matchClientNameAndServiceID(entry, clientName, serviceName) || !isFrameworkEnabledForClient(entry)) {
+      continue;
+    }
+    bool dnuEnabled;
+    {
+      std::lock_guard lock(fieldsMutex_);
+      dnuEnabled = fields_.dnuEnabled;
+    }
+    const Value overrideDnu = numberOf(entry, "override_dnu");
+    std::int32_t dnuType;
+    if (overrideDnu.isNil() || overrideDnu.intValue() != 1) {
+      dnuType = 0;
+    } else {
+      dnuType = dnuEnabled ? 2 : 1;
+    }
+    {
+      std::lock_guard lock(fieldsMutex_);
+      fields_.dnuType = dnuType;
+    }
+    if (dnuType == 0 && !dnuEnabled) {
+      logger().debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: {}.", overrideDnu.intValue());
+      return kBackendStateDisabled;
+    }
+    const Value locales = listOf(entry, "locale_whitelist");
+    if (!matchStringWithList(locales, country, false)) {
+      logger().debug("HTTPSPostBackend(updateBackendState): ({}) isn't in country code list {}", orNull(country),
+                     locales.description());
+      return kBackendStateDisabled;
+    }
+    const Value deviceWhitelist = listOf(entry, "device_whitelist");
+    if (!matchStringWithList(deviceWhitelist, productFamily(), true)) {
+      logger().debug("HTTPSPostBackend(updateBackendState): ({}) isn't in device whitelist {}", orNull(productFamily()),
+                     deviceWhitelist.description());
+      return kBackendStateDisabled;
+    }
+    const Value deviceBlacklist = listOf(entry, "device_blacklist");
+    if (matchStringWithList(deviceBlacklist, hardwareType(), false)) {
+      logger().debug("HTTPSPostBackend(updateBackendState): ({}) is in device blacklist {}", orNull(hardwareType()),
+                     deviceBlacklist.description());
+      return kBackendStateDisabled;
+    }
+    const Value filters = listOf(entry, "filters");
+    if (filters.isNil()) {
+      logger().error("HTTPSPostBackend(updateBackendState): filters are required.");
+      return kBackendStateDisabled;
+    }
+    createFiltersFromArray(filters);
+
+    Value threshold = numberOf(entry, "sampling_threshold");
+    if (const Array* perCountry = listOf(entry, "per_country_sampling_thresholds").array(); perCountry && country) {
+      for (const Value& rule : *perCountry) {
+        const Array* countries = rule["country"].array();
+        if (!countries || std::none_of(countries->begin(), countries->end(), [&](const Value& c) {
+              return c.string() && *c.string() == *country;
+            })) {
+          continue;
+        }
+        const Value replacement = numberOf(rule, "threshold");
+        logger().info("HTTPSPostBackend(updateBackendState): sampling threshold for {} changed from {:.2f} to {:.2f}",
+                      *country, static_cast<float>(threshold.doubleValue()),
+                      static_cast<float>(replacement.doubleValue()));
+        threshold = replacement;
+        break;
+      }
+    }
+    setSamplingThreshold(threshold);
+
+    const double factor = samplingFactor();
+    std::int32_t result;
+    const Value overrideSampling = numberOf(entry, "override_sampling");
+    {
+      std::lock_guard lock(fieldsMutex_);
+      fields_.overrideSampling = overrideSampling;
+    }
+    if (threshold.isNil()) {
+      result = kBackendStateDisabled;
+    } else if (factor < threshold.doubleValue()) {
+      result = kBackendStateEnabled;
+    } else if (overrideSampling.isNil()) {
+      result = kBackendStateSampledOut;
+    } else if (factor >= overrideSampling.doubleValue()) {
+      result = kBackendStateDisabled;
+    } else {
+      result = kBackendStateSampledOut;
+    }
+
+    resetBackendStateWithClient(entry);
+    if (auto custom = stringKey(entry, "custom_clientId")) {
+      std::lock_guard lock(fieldsMutex_);
+      fields_.uuidCustom = *custom;
+    }
+    logger().info("HTTPSPostBackend(updateBackendState): {}: client found {}:{}, state={}, samplingFactor={:f}", name(),
+                  orNull(clientName), orNull(serviceName), result, factor);
+
+    updatePostLink(entry);
+    if (const Value whitelist = listOf(entry, "event_whitelist"); !whitelist.isNil()) {
+      setEventWhitelist(whitelist);
+      logger().info("HTTPSPostBackend(updateBackendState): {}: eventWhitelist={}", name(), whitelist.description());
+    }
+    if (const Value blacklist = listOf(entry, "event_blacklist"); !blacklist.isNil()) {
+      setEventBlacklist(blacklist);
+      logger().info("HTTPSPostBackend(updateBackendState): {}: eventBlacklist={}", name(), blacklist.description());
+    }
+    setShouldUseWiFiOnly(numberOf(entry, "use_wifi_only").intValue() != 0);
+    return result;
+  }
+  return kBackendStateDisabled;
+}
+
+// ---------------------------------------------------------------------------
+// Accessors
+
+std::optional<std::string> HTTPSPostBackend::postURL() const { return fields().postURL; }
+void HTTPSPostBackend::setPostURL(std::optional<std::string> url) {
+  std::lock_guard lock(fieldsMutex_);
+  fields_.postURL = std::move(url);
+}
+std::optional<std::string> HTTPSPostBackend::realtimePostURL() const { return fields().realtimePostURL; }
+std::int32_t HTTPSPostBackend::eventThreshold() const { return fields().eventThreshold; }
+std::int32_t HTTPSPostBackend::dnuType() const { return fields().dnuType; }
+bool HTTPSPostBackend::isImmutable() const { return fields().immutable; }
+Value HTTPSPostBackend::overrideSampling() const { return fields().overrideSampling; }
+std::vector<HTTPSPostBackend::Filter> HTTPSPostBackend::filters() const { return *fields().filters; }
+std::int32_t HTTPSPostBackend::numberOfFilters() const { return fields().numberOfFilters; }
+std::optional<std::string> HTTPSPostBackend::uuidCustom() const { return fields().uuidCustom; }
+
+}  // namespace zerith

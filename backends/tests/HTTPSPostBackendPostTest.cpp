@@ -1,0 +1,363 @@
+// The HTTPS backend posting to real HTTPS servers on loopback: headers on the
+// wire, digest, gzip, batching thresholds, flushing, realtime order, server
+// refusals and TLS refusals.
+
+#include "backends/tests/HTTPSPostBackendTestSupport.h"
+#include "backends/tests/WireCaptureServer.h"
+#include "zerith/ZerithConstants.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+
+class HTTPSPostTest : public HTTPSBackendTest {
+ protected:
+  // Enabled, posting every event at once to `url`.
+  std::shared_ptr<HTTPSPostBackend> immediate(const std::string& url, Value info = userInfo()) {
+    return backend(profileWith({enablingClient(url)}), std::move(info), true, false);
+  }
+  std::shared_ptr<HTTPSPostBackend> batching(const std::string& url) {
+    return backend(profileWith({enablingClient(url)}), userInfo(), true, true);
+  }
+  static Value event(int n) { return Value(Dictionary{{"ClientData", Dictionary{{"n", n}}}}); }
+};
+
+TEST_F(HTTPSPostTest, HeadersGoOutInTheirOrderWithAnIndependentlyCheckedDigest) {
+  WireCaptureServer wire;
+  auto b = immediate(wire.url("/post"));
+  const std::string key = "collector-key";
+  b->setDigestKey(Data(key.begin(), key.end()));
+  b->setIsInternal(true);
+  b->sendMessage(event(1), at(1001), 3, 4, 1);
+  ASSERT_TRUE(wire.waitForConnections(1));
+  const auto request = wire.requests().at(0);
+  EXPECT_EQ(request.requestLine, "POST /post HTTP/1.1");
+
+  std::vector<std::string> ours;
+  for (const auto& [name, value] : request.headers) {
+    if (name != "Host" && name != "X-ZTH-Source-Application") {  // the transport's own
+      ours.push_back(name);
+    }
+  }
+  const std::vector<std::string> expected = {"X-ZTH-Client-Name", "X-ZTH-Service-Name", "X-ZTH-Internal-Build",
+                                             "User-Agent",        "X-ZTH-Client-Version", "X-ZTH-Sender",
+                                             "X-ZTH-Event-Map",   "Accept",              "Content-Type",
+                                             "Content-Length",    "Content-Encoding",    "X-ZTH-DIGEST"};
+  EXPECT_EQ(ours, expected);
+  std::map<std::string, std::string> h(request.headers.begin(), request.headers.end());
+  EXPECT_EQ(h["X-ZTH-Client-Name"], "demo");
+  EXPECT_EQ(h["X-ZTH-Service-Name"], "cli");
+  EXPECT_EQ(h["X-ZTH-Internal-Build"], "1");
+  EXPECT_EQ(h["User-Agent"], "Zerith/8.1 (Board9,1; 12.4)");
+  EXPECT_EQ(h["X-ZTH-Client-Version"], "12");
+  EXPECT_EQ(h["X-ZTH-Sender"], "YJ");
+  EXPECT_EQ(h["X-ZTH-Event-Map"], "3 4");
+  EXPECT_EQ(h["Accept"], "application/json");
+  EXPECT_EQ(h["Content-Type"], "application/json");
+  EXPECT_EQ(h["Content-Length"], std::to_string(request.body.size()));
+  EXPECT_EQ(h["Content-Encoding"], "gzip");
+  const std::string json = inflateGzip(request.body);
+  ASSERT_FALSE(json.empty());
+  EXPECT_LT(request.body.size(), json.size());
+  // The digest covers the JSON before compression.
+  EXPECT_EQ(h["X-ZTH-DIGEST"], independentDigest(key, json));
+  EXPECT_EQ(nlohmann::ordered_json::parse(json)["events"][0]["n"], 1);
+}
+
+TEST_F(HTTPSPostTest, UserAgentMinorVersionAndOptionalHeaders) {
+  WireCaptureServer wire;
+  auto b = immediate(wire.url("/post"));
+  b->setSelfVersion("1.2.3");
+  b->setHardwareType(std::nullopt);
+  b->setDigestKey(Data{1, 2, 3});
+  b->setDigestAlgorithm(1);  // no digest for other algorithms
+  // A tiny body: gzip would be longer, so it goes as it is.
+  b->postJSONMessage("{}", 0, std::nullopt, std::nullopt, nullptr);
+  ASSERT_TRUE(wire.waitForConnections(1));
+  const auto request = wire.requests().at(0);
+  std::map<std::string, std::string> h(request.headers.begin(), request.headers.end());
+  EXPECT_EQ(h["User-Agent"], "Zerith/1.2.3 ((null); 12.4)");
+  EXPECT_EQ(request.body, "{}");
+  EXPECT_FALSE(h.count("Content-Encoding"));
+  EXPECT_FALSE(h.count("X-ZTH-DIGEST"));
+  EXPECT_FALSE(h.count("X-ZTH-Event-Map"));
+  EXPECT_FALSE(h.count("X-ZTH-Internal-Build"));
+  EXPECT_EQ(h["Content-Length"], "2");
+}
+
+TEST_F(HTTPSPostTest, PlainHttpURLIsUpgradedToHttpsOnCustomerDevices) {
+  server.on("/post", Reply{});
+  const std::string https = server.url("/post");
+  auto b = immediate("HTTP://" + https.substr(std::string("https://").size()));
+  b->sendMessage(event(1), at(1001), 1, 1, 1);
+  ASSERT_TRUE(server.waitForRequests(1));
+  EXPECT_EQ(server.requests()[0].path, "/post");
+
+  auto other = immediate("ftp-like");
+  auto results = ResultLog::make();
+  other->postJSONMessage("{\"a\":1}", 0, std::nullopt, std::nullopt, results->handler());
+  ASSERT_TRUE(results->waitFor(1));
+  ASSERT_TRUE(results->errors()[0]);
+  EXPECT_EQ(results->errors()[0]->code, -1);
+}
+
+TEST_F(HTTPSPostTest, FiftyRecordsOfAMethodStayBatchedAndTheFiftyFirstFlushesAll) {
+  server.on("/post", Reply{});
+  auto b = batching(server.url("/post"));
+  ASSERT_EQ(b->eventThreshold(), 49);
+  b->sendMessage(event(-1), at(1001), 2, 0, 0);  // another method, flushed with them
+  for (int i = 0; i < 50; ++i) {
+    EXPECT_FALSE(b->sendMessage(event(i), at(1001), 1, 0, 0));
+  }
+  EXPECT_EQ(b->batchedEventCount(), 51u);
+  EXPECT_EQ(server.requestCount(), 0u);
+  b->sendMessage(event(50), at(1001), 1, 0, 0);
+  ASSERT_TRUE(server.waitForRequests(1));
+  const auto events = envelopeOf(server.requests()[0])["events"];
+  ASSERT_EQ(events.size(), 51u);
+  EXPECT_EQ(events[0]["n"], -1);
+  EXPECT_EQ(events[50]["n"], 49);
+  EXPECT_EQ(b->batchedEventCount(), 1u);
+  // The batch went without method or status: no event map header.
+  EXPECT_FALSE(server.requests()[0].header("X-ZTH-Event-Map"));
+}
+
+TEST_F(HTTPSPostTest, FlushPostsTheBatchAndReportsWhyItCouldNot) {
+  server.on("/post", Reply{});
+  auto b = batching(server.url("/post"));
+  auto results = ResultLog::make();
+  EXPECT_FALSE(b->flushMessagesWithCompletion(results->handler()));
+  ASSERT_TRUE(results->waitFor(1));
+  EXPECT_EQ(results->errors()[0]->description, "Nothing to flush");
+
+  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  EXPECT_GT(b->batchedEventsSize(), 0u);
+  b->flushMessagesWithCompletion(results->handler());
+  ASSERT_TRUE(results->waitFor(2));
+  EXPECT_FALSE(results->errors()[1]) << results->errors()[1]->description;
+  ASSERT_EQ(server.requestCount(), 1u);
+  EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 2u);
+  EXPECT_EQ(b->batchedEventsSize(), 0u);
+
+  // User info required but gone: the batch stays.
+  b->sendMessage(event(3), at(1001), 1, 0, 0);
+  b->setUserInfoDict(Value());
+  b->flushMessagesWithCompletion(results->handler());
+  ASSERT_TRUE(results->waitFor(3));
+  EXPECT_EQ(results->errors()[2]->description, "Can not flush: userInfo is required");
+  EXPECT_EQ(b->batchedEventCount(), 1u);
+
+  // Every record filtered out by the event lists.
+  b->setUserInfoDict(userInfo());
+  auto client = enablingClient(server.url("/post"));
+  client.set("event_blacklist", Array{Value(1)});
+  auto blocked = backend(profileWith({client}), userInfo(), true, true);
+  blocked->sendMessage(event(4), at(1001), 1, 0, 0);
+  blocked->flushMessagesWithCompletion(results->handler());
+  ASSERT_TRUE(results->waitFor(4));
+  EXPECT_EQ(results->errors()[3]->description, "Nothing to flush: batched events were completely filtered out");
+  EXPECT_TRUE(logs.contains("flushMessagesWithCompletion: Dropping event with category 1 as it is blacklisted for backend httpsPost"));
+
+  // A state other than enabled drops the batch.
+  b->setState(kBackendStateUndecided);
+  b->flushMessagesWithCompletion(results->handler());
+  ASSERT_TRUE(results->waitFor(5));
+  EXPECT_EQ(b->batchedEventCount(), 0u);
+  EXPECT_EQ(server.requestCount(), 1u);
+}
+
+TEST_F(HTTPSPostTest, RealtimeEventWhileBatchedFlushesFirstAndFreezesTheState) {
+  auto client = enablingClient(server.url("/batch"));
+  client.erase("override_dnu");  // consent respected: printable copies
+  client.set("realtime_post_url", server.url("/now"));
+  server.on("/batch", Reply{});
+  server.on("/now", Reply{});
+  auto b = backend(profileWith({client}), userInfo(), true, true);
+  ASSERT_EQ(b->state(), kBackendStateEnabled);
+  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  const auto text = b->sendMessage(event(3), at(1002), 7, 8, 1);
+  ASSERT_TRUE(text);
+  EXPECT_EQ(text->rfind("Flushed events:\n{", 0), 0u) << *text;
+  const auto standalone = text->find("\nStandalone event:\n{");
+  ASSERT_NE(standalone, std::string::npos);
+  EXPECT_NE(text->substr(0, standalone).find("\"n\": 2"), std::string::npos);
+  EXPECT_NE(text->substr(standalone).find("\"n\": 3"), std::string::npos);
+  ASSERT_TRUE(server.waitForRequestTo("/batch"));
+  ASSERT_TRUE(server.waitForRequestTo("/now"));
+  EXPECT_TRUE(b->isImmutable());
+  // Frozen: a storebag that now refuses does not change the state.
+  b->setUserInfoDict(userInfo("nobody", "x"));
+  b->updateState();
+  EXPECT_EQ(b->state(), kBackendStateEnabled);
+}
+
+TEST_F(HTTPSPostTest, SampledOutBackendIsWokenByFlagTwoOrThreeButBatchesThatEvent) {
+  server.on("/post", Reply{});
+  for (int flag : {2, 3}) {
+    auto client = enablingClient(server.url("/post"));
+    client.set("sampling_threshold", 0.0);
+    client.set("override_sampling", 1.0);
+    auto b = backend(profileWith({client}));
+    ASSERT_EQ(b->state(), kBackendStateSampledOut);
+    const std::size_t before = server.requestCount();
+    b->sendMessage(event(1), at(1001), 1, 0, 1);  // realtime, but sampled out: batched
+    EXPECT_EQ(b->state(), kBackendStateSampledOut);
+    b->sendMessage(event(2), at(1001), 1, 0, flag);
+    EXPECT_EQ(b->state(), kBackendStateEnabled);
+    EXPECT_EQ(b->batchedEventCount(), 2u);
+    EXPECT_EQ(server.requestCount(), before);
+    b->sendMessage(event(3), at(1001), 1, 0, 1);
+    ASSERT_TRUE(server.waitForRequests(before + 2));
+  }
+}
+
+TEST_F(HTTPSPostTest, SessionEndMessageCarriesConsentAndSamplingFigures) {
+  server.on("/post", Reply{});
+  auto b = immediate(server.url("/post"));
+  b->sendMessage(Value(Dictionary{}), at(1001), 0, 1, 1);
+  ASSERT_TRUE(server.waitForRequests(1));
+  const auto record = envelopeOf(server.requests()[0])["events"][0];
+  EXPECT_EQ(record["Opt"], 2);
+  EXPECT_EQ(record["SamplingThreshold"], 1.0);
+  EXPECT_EQ(record["OverrideSampling"], -1);
+  EXPECT_EQ(record["Batch"], 0);
+}
+
+TEST_F(HTTPSPostTest, ServerErrorDisablesTheBackendAndLaterEventsStopAtOnce) {
+  server.on("/post", Reply{.status = 503});
+  auto b = immediate(server.url("/post"));
+  auto results = ResultLog::make();
+  b->sendMessage(event(1), at(1001), 1, 0, 1);
+  ASSERT_TRUE(logs.waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"));
+  EXPECT_EQ(b->state(), kBackendStateDisabled);
+  EXPECT_FALSE(b->sendMessage(event(2), at(1001), 1, 0, 1));
+  EXPECT_EQ(server.requestCount(), 1u);
+
+  // The error reaches a flush's completion with the status as its code.
+  auto batched = batching(server.url("/post"));
+  batched->sendMessage(event(3), at(1001), 1, 0, 0);
+  batched->flushMessagesWithCompletion(results->handler());
+  ASSERT_TRUE(results->waitFor(1));
+  ASSERT_TRUE(results->errors()[0]);
+  EXPECT_EQ(results->errors()[0]->code, 503);
+  EXPECT_EQ(results->errors()[0]->description, "backend httpsPost disabled by server 503 return code");
+}
+
+TEST_F(HTTPSPostTest, ClientErrorsRedirectsAndHugeAnswersLeaveTheBackendEnabled) {
+  server.on("/404", Reply{.status = 404});
+  server.on("/302", Reply{.status = 302, .headers = {{"Location", "/gone"}}});
+  server.on("/huge", Reply{.body = std::string(8 << 20, 'x')});
+  for (const char* path : {"/404", "/302", "/huge"}) {
+    auto b = immediate(server.url(path));
+    auto results = ResultLog::make();
+    b->postJSONMessage("{\"a\":1}", 0, 1, 1, results->handler());
+    ASSERT_TRUE(results->waitFor(1)) << path;
+    EXPECT_EQ(b->state(), kBackendStateEnabled) << path;
+  }
+}
+
+TEST_F(HTTPSPostTest, ClosedConnectionIsLoggedAsAPostError) {
+  RefusingPort refusing;
+  auto b = immediate(refusing.url("/post"));
+  auto results = ResultLog::make();
+  b->postJSONMessage("{\"a\":1}", 0, std::nullopt, std::nullopt, results->handler());
+  ASSERT_TRUE(results->waitFor(1));
+  EXPECT_TRUE(results->errors()[0]);
+  EXPECT_TRUE(logs.contains("HTTPSPostBackend(postJsonMessage): post error: "));
+  EXPECT_EQ(b->state(), kBackendStateEnabled);
+}
+
+TEST_F(HTTPSPostTest, UntrustedOrWrongHostCertificatesAreRefusedBeforeAnyRequestByte) {
+  TestCA stranger("stranger CA");
+  WireCaptureServer selfSigned(stranger.serverCertificate());
+  WireCaptureServer wrongHost(TestCA::shared().issueServerCertificate({"collector.invalid"}, {}));
+  for (WireCaptureServer* wire : {&selfSigned, &wrongHost}) {
+    auto b = immediate(wire->url("/post"));
+    auto results = ResultLog::make();
+    b->postJSONMessage("{\"a\":1}", 0, std::nullopt, std::nullopt, results->handler());
+    ASSERT_TRUE(results->waitFor(1));
+    EXPECT_TRUE(results->errors()[0]);
+    EXPECT_EQ(wire->requestBytes(), 0u);
+    EXPECT_TRUE(wire->requests().empty());
+  }
+}
+
+TEST_F(HTTPSPostTest, CellularIsForbiddenForHapticsAndForBackendsWithoutUserInfo) {
+  // The wire does not show cellular access; the request the transport gets
+  // does, so look at it through a transport that only records it.
+  struct Recording : ReportingSessionConnectivityInterface {
+    std::vector<URLRequest> requests;
+    void postURLRequestWithCompletionHandler(const URLRequest& r, URLCompletion) override { requests.push_back(r); }
+    void getURLRequestWithCompletionHandler(const URLRequest&, URLCompletion) override {}
+  };
+  auto recording = std::make_shared<Recording>();
+  const auto cellular = [&](Value info, bool wifiOnly) {
+    auto client = enablingClient("https://127.0.0.1:1/");
+    client.set("use_wifi_only", wifiOnly ? 1 : 0);
+    client.set("client", "demo,com.velmar.lumira");
+    client.set("service", "cli,haptics");
+    const bool require = !info.isNil();
+    auto b = backend(profileWith({client}), std::move(info), require);
+    b->setReportingSessionConnectivityDelegate(recording);
+    b->postJSONMessage("{}", 0, std::nullopt, std::nullopt, nullptr);
+    return recording->requests.back().allowsCellularAccess;
+  };
+  EXPECT_TRUE(cellular(userInfo(), false));
+  EXPECT_FALSE(cellular(userInfo(), true));
+  EXPECT_FALSE(cellular(userInfo("COM.velmar.lumira", "Haptics"), false));
+  EXPECT_FALSE(cellular(Value(), false));
+}
+
+TEST_F(HTTPSPostTest, DefaultsURLBeatsTheStorebagAndAGoneTransportSendsNothing) {
+  server.on("/from-defaults", Reply{});
+  Defaults(kZerithDefaultsDomain).setObject("httpsPostURL", Value(server.url("/from-defaults")));
+  auto b = immediate(server.url("/from-storebag"));
+  EXPECT_EQ(b->postURL(), server.url("/from-defaults"));
+  EXPECT_TRUE(logs.contains("HTTPSPostBackend(initWithName): Using user default '" + server.url("/from-defaults") +
+                            "' for postURL"));
+  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  ASSERT_TRUE(server.waitForRequestTo("/from-defaults"));
+
+  // The realtime URL follows the storebag's post URL when neither is set.
+  EXPECT_EQ(b->realtimePostURL(), server.url("/from-defaults"));
+
+  // Without a transport the post is dropped and its completion never runs.
+  auto orphan = immediate(server.url("/post"));
+  orphan->setReportingSessionConnectivityDelegate({});
+  auto results = ResultLog::make();
+  orphan->postJSONMessage("{}", 0, std::nullopt, std::nullopt, results->handler());
+  EXPECT_TRUE(results->errors().empty());
+}
+
+TEST_F(HTTPSPostTest, CorrelatedSessionIDRewritesTheBatch) {
+  server.on("/post", Reply{});
+  auto b = batching(server.url("/post"));
+  b->setCompType(3);
+  b->setCombinedSessionIDString("OLD");
+  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  b->setCorrelatedSessionID("ROOT.CHILD");
+  b->flushMessagesWithCompletion(nullptr);
+  ASSERT_TRUE(server.waitForRequests(1));
+  const auto envelope = envelopeOf(server.requests()[0]);
+  EXPECT_EQ(envelope["events"][0]["_sessionID"], "ROOT.CHILD");
+  EXPECT_EQ(envelope["events"][0]["_sender"], "YB");
+  EXPECT_EQ(server.requests()[0].header("X-ZTH-Sender"), "YB");
+}
+
+TEST(HTTPSBackendFactory, HttpsNamesMakeHttpsBackends) {
+  TempRoot root;
+  const Value profile = profileWith({});
+  for (const char* name : {kZerithBackendHTTPPost, kZerithBackendHTTPPost2, kZerithBackendQRS}) {
+    auto b = ZerithBackend::newBackendWithName(name, profile, std::string("F"), 7);
+    ASSERT_TRUE(b) << name;
+    EXPECT_TRUE(std::dynamic_pointer_cast<HTTPSPostBackend>(b)) << name;
+    EXPECT_EQ(b->name(), name);
+  }
+  EXPECT_FALSE(ZerithBackend::newBackendWithName(kZerithBackendHTTPPost, Value(Dictionary{}), std::string("F"), 7));
+}
+
+}  // namespace
+}  // namespace zerith::test

@@ -1,0 +1,379 @@
+// The HTTPS backend's records, envelope, state decision and filters.
+
+#include <cmath>
+#include <limits>
+
+#include "backends/tests/HTTPSPostBackendTestSupport.h"
+#include "zerith/Zerith.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+
+class HTTPSRecordTest : public HTTPSBackendTest {};
+
+TEST_F(HTTPSRecordTest, RecordCountsFromTheStartMinuteAndCarriesEveryKeyInOrder) {
+  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  ASSERT_TRUE(b);
+  Dictionary payload{{"_method", "overwritten"}, {"bytes", 17}};
+  const Dictionary record = b->newEventDictfromPayload(Value(payload), at(1010, 250000), 5, 6, 99);
+
+  std::vector<std::string> keys;
+  for (const auto& [key, value] : record) {
+    keys.push_back(key);
+  }
+  // Payload keys keep their place; the backend's keys follow in their order.
+  const std::vector<std::string> expected = {"_method",        "bytes",       "_startTS",       "_sender",
+                                             "_clientVersion", "_sessionID",  "_eventNumber",   "_status",
+                                             "_clientTS",      "eventTime",   "_productFamily", "_productModel",
+                                             "_osVersion",     "_build",      "_internal",      "_reportVers",
+                                             "_timezoneOffset"};
+  EXPECT_EQ(keys, expected);
+  EXPECT_EQ(record.get("_startTS"), Value(960));
+  EXPECT_EQ(record.get("_sender"), Value("YJ"));
+  EXPECT_EQ(record.get("_clientVersion"), Value(12u));
+  EXPECT_EQ(record.get("_sessionID"), Value(42u));
+  EXPECT_EQ(record.get("_eventNumber"), Value(0u));  // the backend's counter, not the argument
+  EXPECT_EQ(record.get("_method"), Value(5u));
+  EXPECT_EQ(record.get("_status"), Value(6u));
+  EXPECT_DOUBLE_EQ(record.get("_clientTS").doubleValue(), 969.75);
+  EXPECT_EQ(record.get("eventTime"), record.get("_clientTS"));
+  EXPECT_EQ(record.get("_productFamily"), Value("TestFamily"));
+  EXPECT_EQ(record.get("_productModel"), Value("Board9,1"));
+  EXPECT_EQ(record.get("_osVersion"), Value("12.4"));
+  EXPECT_EQ(record.get("_build"), Value("Z1234"));
+  EXPECT_EQ(record.get("_internal"), Value(2u));
+  EXPECT_EQ(record.get("_reportVers"), Value("8.1"));
+  EXPECT_EQ(record.get("_timezoneOffset"), Value(static_cast<long long>(timeZoneOffsetSeconds())));
+}
+
+TEST_F(HTTPSRecordTest, SessionIdentifierFormDependsOnComponentTypeAndInternalFlag) {
+  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  b->setCombinedSessionIDString("AAA.BBB");
+  const auto sessionOf = [&](int type, bool internal) {
+    b->setCompType(type);
+    b->setIsInternal(internal);
+    return b->newEventDictfromPayload(Value(Dictionary{}), at(1001), 1, 1, 1).get("_sessionID");
+  };
+  EXPECT_EQ(sessionOf(7, false), Value(42u));
+  EXPECT_EQ(sessionOf(11, false), Value("AAA.BBB"));
+  EXPECT_EQ(sessionOf(11, true), Value(42u));
+  EXPECT_EQ(sessionOf(13, true), Value(42u));
+  EXPECT_EQ(sessionOf(3, true), Value("AAA.BBB"));
+  b->setCombinedSessionIDString(std::nullopt);
+  EXPECT_TRUE(sessionOf(3, false).isNil());
+
+  b->setSelfVersion("2.5.3");
+  EXPECT_EQ(b->newEventDictfromPayload(Value(Dictionary{}), at(1001), 1, 1, 1).get("_reportVers"), Value("2.5.3"));
+  // A non-finite event time becomes -1.
+  b->setStartTimestamp(timeval{std::numeric_limits<time_t>::max(), 0});
+  const auto record = b->newEventDictfromPayload(Value(Dictionary{}), at(1), 1, 1, 1);
+  EXPECT_TRUE(std::isfinite(record.get("_clientTS").doubleValue()));
+}
+
+TEST_F(HTTPSRecordTest, EnvelopeCarriesDatesAsSecondsAndDropsWhatJsonCannotHold) {
+  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  Dictionary record{{"when", Date{1234.5}},
+                    {"inf", std::numeric_limits<double>::infinity()},
+                    {"nan", std::numeric_limits<double>::quiet_NaN()},
+                    {"list", Array{Value(1)}},
+                    {"nested", Dictionary{{"a", 1}}},
+                    {"blob", Data{1, 2}},
+                    {"flag", true},
+                    {"bad utf8", std::string("a\xff\xfe" "b")},
+                    {"quote\"key", "line\nbreak"}};
+  std::optional<std::string> pretty;
+  const auto body = b->createMessageForPostAndLogging({record}, &pretty);
+  ASSERT_TRUE(body);
+  const auto envelope = nlohmann::ordered_json::parse(*body);  // valid JSON despite the bytes above
+  ASSERT_TRUE(envelope.contains("events"));
+  const auto& event = envelope["events"][0];
+  EXPECT_DOUBLE_EQ(event["when"].get<double>(), 1234.5);
+  EXPECT_TRUE(event["flag"].get<bool>());
+  EXPECT_EQ(event["quote\"key"], "line\nbreak");
+  EXPECT_EQ(event["bad utf8"], "a\xEF\xBF\xBD\xEF\xBF\xBD" "b");
+  for (const char* dropped : {"inf", "nan", "list", "nested", "blob"}) {
+    EXPECT_FALSE(event.contains(dropped)) << dropped;
+    EXPECT_TRUE(logs.contains(std::string("HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable "
+                                          "to handle key: ") + dropped))
+        << dropped;
+  }
+  EXPECT_EQ(envelope.begin().key(), "postTime");
+  EXPECT_EQ(envelope["clientId"], Zerith::getPersistentIdentifierForDNU(false));  // override_dnu 1
+  // Consent given but overridden: no printable copy.
+  EXPECT_FALSE(pretty);
+}
+
+TEST_F(HTTPSRecordTest, EnvelopeWithoutClientIdentifierHoldsOnlyPostTime) {
+  auto client = enablingClient(server.url("/post"));
+  client.set("extras_on_internal", 1);
+  auto b = backend(profileWith({client}));
+  b->setIsInternal(true);  // identified by the device identifier, which is absent
+  const auto body = b->createMessageForPostAndLogging({Dictionary{{"a", 1}}}, nullptr);
+  ASSERT_TRUE(body);
+  const auto envelope = nlohmann::ordered_json::parse(*body);
+  EXPECT_EQ(envelope.size(), 1u);
+  EXPECT_TRUE(envelope.contains("postTime"));
+
+  const char udid[] = "00112233445566778899aabbccddeeff00112233";
+  b->setUdid(udid);
+  EXPECT_EQ(nlohmann::ordered_json::parse(*b->createMessageForPostAndLogging({}, nullptr))["clientId"], udid);
+}
+
+TEST_F(HTTPSRecordTest, PrintableCopyOnlyWhenConsentIsRespectedOrLoggingIsForced) {
+  auto client = enablingClient(server.url("/post"));
+  client.erase("override_dnu");
+  auto b = backend(profileWith({client}));
+  ASSERT_EQ(b->state(), kBackendStateEnabled);
+  ASSERT_EQ(b->dnuType(), 0);
+  std::optional<std::string> pretty;
+  const auto body = b->createMessageForPostAndLogging({Dictionary{{"a", 1}}}, &pretty);
+  ASSERT_TRUE(pretty);
+  EXPECT_EQ(nlohmann::ordered_json::parse(*pretty), nlohmann::ordered_json::parse(*body));
+  EXPECT_NE(pretty->find("\n    \"clientId\""), std::string::npos);
+  EXPECT_EQ(nlohmann::ordered_json::parse(*body)["clientId"], Zerith::getPersistentIdentifierForDNU(true));
+}
+
+class HTTPSStateTest : public HTTPSBackendTest {};
+
+TEST_F(HTTPSStateTest, ClientNamesMatchExactlyAndServicesBySubstringIgnoringCase) {
+  auto b = backend(profileWith({enablingClient("https://x/")}));
+  Dictionary entry{{"client", "mail,Demo"}, {"service", "Sync,CL"}};
+  EXPECT_TRUE(b->matchClientNameAndServiceID(Value(entry), "DEMO", "the-cli-service"));
+  EXPECT_TRUE(b->matchClientNameAndServiceID(Value(entry), "mail", "sync"));
+  EXPECT_FALSE(b->matchClientNameAndServiceID(Value(entry), "dem", "cli"));
+  EXPECT_FALSE(b->matchClientNameAndServiceID(Value(entry), "demo", "other"));
+  EXPECT_FALSE(b->matchClientNameAndServiceID(Value(entry), std::nullopt, "cli"));
+  EXPECT_TRUE(b->matchClientNameAndServiceID(Value(Dictionary{}), std::nullopt, std::nullopt));
+
+  EXPECT_TRUE(HTTPSPostBackend::matchStringWithList(Value(Array{}), std::nullopt, true));
+  EXPECT_FALSE(HTTPSPostBackend::matchStringWithList(Value(Array{}), "x", false));
+  EXPECT_TRUE(HTTPSPostBackend::matchStringWithList(Value(Array{Value("a")}), std::nullopt, false));
+}
+
+TEST_F(HTTPSStateTest, FrameworkVersionGateComparesMajorMiddleMinor) {
+  auto b = backend(profileWith({enablingClient("https://x/")}));
+  b->setSelfVersion("8.1.0");
+  EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{})));
+  EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "8.1"}})));
+  EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "7.9.9"}})));
+  EXPECT_FALSE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "8.1.1"}})));
+  EXPECT_FALSE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "9"}})));
+}
+
+TEST_F(HTTPSStateTest, EachRefusalDisablesWithItsOwnLine) {
+  struct Case {
+    const char* name;
+    std::function<void(Dictionary&)> change;
+    const char* line;
+  };
+  Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(false));
+  const std::vector<Case> cases = {
+      {"no consent", [](Dictionary& c) { c.erase("override_dnu"); },
+       "HTTPSPostBackend(updateBackendState): reporting disabled by DNU: 0."},
+      {"no locale list", [](Dictionary& c) { c.erase("locale_whitelist"); },
+       "HTTPSPostBackend(updateBackendState): (GB) isn't in country code list"},
+      {"other country", [](Dictionary& c) { c.set("locale_whitelist", Array{Value("fr")}); },
+       "HTTPSPostBackend(updateBackendState): (GB) isn't in country code list"},
+      {"device whitelist", [](Dictionary& c) { c.set("device_whitelist", Array{Value("Other")}); },
+       "HTTPSPostBackend(updateBackendState): (TestFamily) isn't in device whitelist"},
+      {"device blacklist", [](Dictionary& c) { c.set("device_blacklist", Array{Value("board9")}); },
+       "HTTPSPostBackend(updateBackendState): (Board9,1) is in device blacklist"},
+      {"no filters", [](Dictionary& c) { c.erase("filters"); },
+       "HTTPSPostBackend(updateBackendState): filters are required."},
+      {"no threshold", [](Dictionary& c) { c.erase("sampling_threshold"); }, nullptr},
+  };
+  for (const auto& c : cases) {
+    logs.clear();
+    auto client = enablingClient("https://x/");
+    c.change(client);
+    auto b = backend(profileWith({client}));
+    EXPECT_EQ(b->state(), kBackendStateDisabled) << c.name;
+    if (c.line) {
+      EXPECT_TRUE(logs.contains(c.line)) << c.name;
+    }
+  }
+}
+
+TEST_F(HTTPSStateTest, UserInfoDecidesBetweenUndecidedAndTheCheckedPath) {
+  auto client = enablingClient("https://x/");
+  client.erase("locale_whitelist");  // would disable on the checked path
+  EXPECT_EQ(backend(profileWith({client}), Value(), true)->state(), kBackendStateUndecided);
+  EXPECT_EQ(backend(profileWith({client}), userInfo(), true)->state(), kBackendStateDisabled);
+  // Without required user info no check applies; the post link is taken.
+  auto unchecked = backend(profileWith({client}), Value(), false);
+  EXPECT_EQ(unchecked->state(), kBackendStateEnabled);
+  EXPECT_EQ(unchecked->postURL(), "https://x/");
+  EXPECT_EQ(unchecked->realtimePostURL(), "https://x/");
+  EXPECT_TRUE(logs.contains("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL 'https://x/'"));
+  // No entry for this client at all.
+  EXPECT_EQ(backend(profileWith({client}), userInfo("mail", "sync"), true)->state(), kBackendStateDisabled);
+}
+
+TEST_F(HTTPSStateTest, SamplingThresholdAndOverrideGiveEnabledSampledOutOrDisabled) {
+  auto client = enablingClient("https://x/");
+  client.set("sampling_threshold", 0.25);
+  auto b = backend(profileWith({client}));
+  const auto decide = [&](double factor, std::optional<double> override) {
+    auto c = client;
+    if (override) {
+      c.set("override_sampling", *override);
+    }
+    auto x = backend(profileWith({c}));
+    x->setSamplingFactor(factor);
+    x->updateState();
+    return x->state();
+  };
+  EXPECT_EQ(decide(0.1, std::nullopt), kBackendStateEnabled);
+  EXPECT_EQ(decide(0.3, std::nullopt), kBackendStateSampledOut);
+  EXPECT_EQ(decide(0.3, 0.2), kBackendStateDisabled);
+  EXPECT_EQ(decide(0.3, 0.5), kBackendStateSampledOut);
+  EXPECT_EQ(decide(0.25, std::nullopt), kBackendStateSampledOut);  // the threshold itself is out
+}
+
+TEST_F(HTTPSStateTest, PerCountryThresholdReplacesTheGeneralOneForListedCountries) {
+  auto client = enablingClient("https://x/");
+  client.set("sampling_threshold", 0.0);
+  client.set("per_country_sampling_thresholds",
+             Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}),
+                   Value(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", 1.0}})});
+  auto b = backend(profileWith({client}));
+  EXPECT_EQ(b->state(), kBackendStateEnabled);
+  EXPECT_TRUE(logs.contains("HTTPSPostBackend(updateBackendState): sampling threshold for GB changed from 0.00 to 1.00"));
+  EXPECT_EQ(b->samplingThreshold(), Value(1.0));
+}
+
+TEST_F(HTTPSStateTest, SamplingDrawOverManyBackendsStaysWithinBinomialBounds) {
+  auto client = enablingClient("https://x/");
+  client.set("sampling_threshold", 0.25);
+  client.set("override_sampling", 0.5);
+  const Value profile = profileWith({client});
+  constexpr int kBackends = 1000;
+  int enabled = 0;
+  int sampledOut = 0;
+  double sum = 0;
+  for (int i = 0; i < kBackends; ++i) {
+    auto b = backend(profile);
+    const double f = b->samplingFactor();
+    ASSERT_GE(f, 0.0);
+    ASSERT_LE(f, 0.9999);
+    EXPECT_NEAR(f * 10000, std::round(f * 10000), 1e-6);  // a multiple of 1/10000
+    sum += f;
+    enabled += b->state() == kBackendStateEnabled;
+    sampledOut += b->state() == kBackendStateSampledOut;
+  }
+  // 250 and 250 expected, standard deviation about 13.7: five of them each way.
+  EXPECT_NEAR(enabled, 250, 69);
+  EXPECT_NEAR(sampledOut, 250, 69);
+  EXPECT_NEAR(sum / kBackends, 0.5, 0.05);
+}
+
+TEST_F(HTTPSStateTest, WrongTypesInEveryProfileKeyAreLoggedAndNeverCrash) {
+  Dictionary client{{"client", 5},
+                    {"service", Array{}},
+                    {"expedite", "yes"},
+                    {"enabledSince", 8},
+                    {"override_dnu", "1"},
+                    {"locale_whitelist", "GB"},
+                    {"device_whitelist", 3},
+                    {"device_blacklist", Dictionary{}},
+                    {"filters", "udid"},
+                    {"sampling_threshold", "0.5"},
+                    {"per_country_sampling_thresholds", "GB"},
+                    {"override_sampling", Array{}},
+                    {"event_threshold", "many"},
+                    {"extras_on_internal", Array{}},
+                    {"custom_clientId", 12},
+                    {"post_url", 1},
+                    {"realtime_post_url", Dictionary{}},
+                    {"event_whitelist", 1},
+                    {"event_blacklist", "2"},
+                    {"use_wifi_only", "x"}};
+  // As the only entry, unnamed (a name list of the wrong kind matches nobody).
+  auto named = backend(profileWith({client}));
+  EXPECT_EQ(named->state(), kBackendStateDisabled);
+  EXPECT_TRUE(logs.contains("\"client\" holds an integer, not a string of names"));
+  // Named properly, every other key still of the wrong kind.
+  client.set("client", "demo");
+  client.set("service", "cli");
+  for (bool require : {true, false}) {
+    auto b = backend(profileWith({client}), userInfo(), require);
+    EXPECT_EQ(b->state(), require ? kBackendStateDisabled : kBackendStateEnabled);
+    EXPECT_FALSE(b->postURL());
+    EXPECT_EQ(b->eventThreshold(), HTTPSPostBackend::kDefaultEventThreshold);
+  }
+  EXPECT_TRUE(logs.contains("\"locale_whitelist\" holds a string, not a list; ignored"));
+  // Entries that are not dictionaries, and a "clients" that is not a list.
+  EXPECT_EQ(backend(Value(Dictionary{{"clients", Array{Value(1), Value("x")}}}))->state(), kBackendStateDisabled);
+  EXPECT_EQ(backend(Value(Dictionary{{"clients", "all"}}))->state(), kBackendStateDisabled);
+  // No client list at all: no backend.
+  EXPECT_FALSE(HTTPSPostBackend::initWithName("httpsPost", Value(Dictionary{{"x", 1}}), std::string("F")));
+  EXPECT_TRUE(logs.has(Level::Error, "HTTPSPostBackend(initWithName): can't find the client list."));
+  EXPECT_FALSE(HTTPSPostBackend::initWithName("httpsPost", profileWith({}), std::nullopt));
+}
+
+TEST_F(HTTPSStateTest, NegativeAndStringThresholdsKeepTheBackendWorking) {
+  auto client = enablingClient(server.url("/post"));
+  client.set("event_threshold", -3);
+  server.on("/post", Reply{});
+  auto b = backend(profileWith({client}), userInfo(), true, true);
+  ASSERT_EQ(b->eventThreshold(), -3);
+  EXPECT_TRUE(logs.contains("resetBackendStateWithClient: event_threshold -3 is negative"));
+  // Each batched event flushes what came before it.
+  b->sendMessage(Value(Dictionary{{"n", 1}}), at(1001), 1, 1, 0);
+  b->sendMessage(Value(Dictionary{{"n", 2}}), at(1002), 1, 1, 0);
+  ASSERT_TRUE(server.waitForRequests(1));
+  EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 1u);
+  EXPECT_EQ(b->batchedEventCount(), 1u);
+}
+
+TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndUserInfo) {
+  auto client = enablingClient(server.url("/post"));
+  client.set("filters", Array{Value(Dictionary{{"key", "UDID"}, {"action", "sha256"}}),
+                              Value(Dictionary{{"key", "secret"}, {"method", 5}, {"action", "remove"}}),
+                              Value(Dictionary{{"key", "account"}, {"status", 9}, {"action", "sha256"}}),
+                              Value(Dictionary{{"key", "clientName"}, {"action", "sha256"}}),
+                              Value(Dictionary{{"key", "bytes"}, {"action", "shred"}}),
+                              Value("not a filter")});
+  server.on("/post", Reply{});
+  auto b = backend(profileWith({client}), userInfo(), true, true);
+  ASSERT_EQ(b->state(), kBackendStateEnabled);
+  EXPECT_EQ(b->numberOfFilters(), 6);
+
+  const Value sharedData(Dictionary{{"udid", "device-1"}, {"session", Dictionary{{"udid", "inner"}}}});
+  const Value payload(Dictionary{{"secret", "s"}, {"account", "a"}, {"bytes", 3}, {"number", 77},
+                                 {"nested", Dictionary{{"udid", "deep"}, {"secret", "deep"}}}});
+  b->sendMessage(Value(Dictionary{{"ClientData", payload}, {"SharedData", sharedData}}), at(1001), 5, 9, 0);
+  b->sendMessage(Value(Dictionary{{"ClientData", payload}, {"SharedData", sharedData}}), at(1001), 6, 1, 0);
+  b->flushMessagesWithCompletion(nullptr);
+  ASSERT_TRUE(server.waitForRequests(1));
+  const auto events = envelopeOf(server.requests()[0])["events"];
+  ASSERT_EQ(events.size(), 2u);
+  const std::string hashedUdid = ZerithBackend::convertIntoSHA256("device-1");
+  // Method 5, status 9: everything applies.
+  EXPECT_EQ(events[0]["udid"], hashedUdid);
+  EXPECT_FALSE(events[0].contains("secret"));
+  EXPECT_EQ(events[0]["account"], ZerithBackend::convertIntoSHA256("a"));
+  EXPECT_EQ(events[0]["bytes"], 3);  // unknown action keeps
+  EXPECT_EQ(events[0]["clientName"], ZerithBackend::convertIntoSHA256("demo"));
+  // Nested containers never reach the wire, so nothing under them leaks.
+  EXPECT_FALSE(events[0].contains("nested"));
+  EXPECT_FALSE(events[0].contains("session"));
+  // Method 6, status 1: only the unconditional filters.
+  EXPECT_EQ(events[1]["udid"], hashedUdid);
+  EXPECT_EQ(events[1]["secret"], "s");
+  EXPECT_EQ(events[1]["account"], "a");
+  EXPECT_EQ(events[1]["clientName"], ZerithBackend::convertIntoSHA256("demo"));
+  const std::string wire = jsonOf(server.requests()[0]);
+  EXPECT_EQ(wire.find("device-1"), std::string::npos);
+  EXPECT_EQ(wire.find("deep"), std::string::npos);
+  EXPECT_EQ(wire.find("inner"), std::string::npos);
+
+  // An empty filter list keeps the old filters.
+  b->createFiltersFromArray(Value(Array{}));
+  EXPECT_EQ(b->numberOfFilters(), 6);
+}
+
+}  // namespace
+}  // namespace zerith::test

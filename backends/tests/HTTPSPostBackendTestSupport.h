@@ -1,0 +1,204 @@
+#pragma once
+
+// Scenario helpers of the HTTPS backend tests: a fixture with a temporary
+// root, the test CA trusted, a recording HTTPS server and a real
+// connectivity helper; profiles; gzip inflation and an independent HMAC.
+
+#include <gtest/gtest.h>
+#include <openssl/evp.h>
+#include <openssl/hmac.h>
+#include <zlib.h>
+
+#include <condition_variable>
+#include <cstdlib>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+#include "backends/HTTPSPostBackend.h"
+#include "config/ClientTypes.h"
+#include "config/DeviceInfo.h"
+#include "platform/Defaults.h"
+#include "platform/Log.h"
+#include "tests/support/HttpsTestServer.h"
+#include "tests/support/TempRoot.h"
+#include "tests/support/TestCA.h"
+#include "transport/ReportingSessionConnectivityHelper.h"
+#include "transport/URLSession.h"
+
+namespace zerith::test {
+
+// The body as the server saw it, inflated when it came gzip'd (zlib itself,
+// not the code under test, undoes it).
+inline std::string inflateGzip(const std::string& body) {
+  z_stream stream{};
+  if (inflateInit2(&stream, 16 + MAX_WBITS) != Z_OK) {
+    return {};
+  }
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(body.data()));
+  stream.avail_in = static_cast<uInt>(body.size());
+  std::string out;
+  char buffer[65536];
+  int rc = Z_OK;
+  while (rc == Z_OK) {
+    stream.next_out = reinterpret_cast<Bytef*>(buffer);
+    stream.avail_out = sizeof(buffer);
+    rc = inflate(&stream, Z_NO_FLUSH);
+    out.append(buffer, sizeof(buffer) - stream.avail_out);
+  }
+  inflateEnd(&stream);
+  return rc == Z_STREAM_END ? out : std::string();
+}
+
+// The recording server's library undoes gzip itself when it can; a body
+// still in gzip form is inflated here.
+inline std::string jsonOf(const RecordedRequest& request) {
+  const bool gzip = request.body.size() > 2 && static_cast<unsigned char>(request.body[0]) == 0x1f &&
+                    static_cast<unsigned char>(request.body[1]) == 0x8b;
+  return gzip ? inflateGzip(request.body) : request.body;
+}
+
+inline nlohmann::ordered_json envelopeOf(const RecordedRequest& request) {
+  return nlohmann::ordered_json::parse(jsonOf(request));
+}
+
+// HMAC-SHA-1 through OpenSSL's own one-shot call, in the header's form.
+inline std::string independentDigest(const std::string& key, const std::string& message) {
+  unsigned char out[EVP_MAX_MD_SIZE];
+  unsigned int length = 0;
+  HMAC(EVP_sha1(), key.data(), static_cast<int>(key.size()), reinterpret_cast<const unsigned char*>(message.data()),
+       message.size(), out, &length);
+  std::string text = "<";
+  char hex[3];
+  for (unsigned int i = 0; i < length; ++i) {
+    if (i > 0 && i % 4 == 0) {
+      text += ' ';
+    }
+    std::snprintf(hex, sizeof(hex), "%02x", out[i]);
+    text += hex;
+  }
+  return text + ">";
+}
+
+class ScopedLocale {
+ public:
+  explicit ScopedLocale(const char* value) {
+    if (const char* old = std::getenv("LC_ALL")) {
+      old_ = old;
+    }
+    ::setenv("LC_ALL", value, 1);
+  }
+  ~ScopedLocale() {
+    if (old_) {
+      ::setenv("LC_ALL", old_->c_str(), 1);
+    } else {
+      ::unsetenv("LC_ALL");
+    }
+  }
+
+ private:
+  std::optional<std::string> old_;
+};
+
+// Completions of flushes and posts, in order.
+class ResultLog : public std::enable_shared_from_this<ResultLog> {
+ public:
+  static std::shared_ptr<ResultLog> make() { return std::make_shared<ResultLog>(); }
+  ZerithBackend::FlushCompletion handler() {
+    return [self = shared_from_this()](const Value&, const std::optional<Error>& error) {
+      {
+        std::lock_guard lock(self->mutex_);
+        self->errors_.push_back(error);
+      }
+      self->changed_.notify_all();
+    };
+  }
+  bool waitFor(std::size_t count) const {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, std::chrono::seconds(10), [&] { return errors_.size() >= count; });
+  }
+  std::vector<std::optional<Error>> errors() const {
+    std::lock_guard lock(mutex_);
+    return errors_;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  mutable std::condition_variable changed_;
+  std::vector<std::optional<Error>> errors_;
+};
+
+inline Value userInfo(const std::string& client = "demo", const std::string& service = "cli") {
+  return Value(Dictionary{{"clientName", client}, {"serviceName", service}});
+}
+
+// One client entry that enables everything for `demo`/`cli` in GB.
+inline Dictionary enablingClient(const std::string& postURL) {
+  return Dictionary{{"client", "demo"},
+                    {"service", "cli"},
+                    {"override_dnu", 1},
+                    {"locale_whitelist", Array{Value("GB"), Value("US")}},
+                    {"filters", Array{Value(Dictionary{{"key", "none"}, {"action", "keep"}})}},
+                    {"sampling_threshold", 1.0},
+                    {"event_threshold", 49},
+                    {"post_url", postURL}};
+}
+
+inline Value profileWith(std::vector<Dictionary> clients) {
+  Array list;
+  for (auto& c : clients) {
+    list.emplace_back(std::move(c));
+  }
+  return Value(Dictionary{{"clients", Value(std::move(list))}});
+}
+
+class HTTPSBackendTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(URLSession::setExtraCAFile(TestCA::shared().caFile().string()));
+    transport = ReportingSessionConnectivityHelper::initWithDelegate({}, 4);
+    Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(true));
+  }
+  void TearDown() override {
+    transport->invalidate();
+    server.stop();
+  }
+
+  // A backend as a session sets it up: client type 7, version 12, session
+  // 42, started at 1000.5 s, framework 8.1.0, then its state decided.
+  std::shared_ptr<HTTPSPostBackend> backend(const Value& profile, Value info = userInfo(), bool requireUserInfo = true,
+                                            bool batch = false, const std::string& name = "httpsPost") {
+    auto b = HTTPSPostBackend::initWithName(name, profile, std::string("TestFamily"));
+    if (!b) {
+      return nullptr;
+    }
+    b->setSessionID(42);
+    b->setCompType(7);
+    b->setClientVersion(12);
+    b->setProductVersion("12.4");
+    b->setBuildVersion("Z1234");
+    b->setHardwareType("Board9,1");
+    b->setRequireUserInfo(requireUserInfo);
+    b->setBatchEvents(batch);
+    b->setUserInfoDict(std::move(info));
+    b->setSelfVersion("8.1.0");
+    b->setStartTimestamp(timeval{1000, 500000});
+    b->setReportingSessionConnectivityDelegate(transport);
+    b->updateState();
+    return b;
+  }
+
+  static timeval at(long seconds, long micros = 0) { return timeval{seconds, micros}; }
+
+  TempRoot root;
+  ScopedLocale locale{"en_GB.UTF-8"};
+  log::LogCapture logs;
+  HttpsTestServer server;
+  std::shared_ptr<ReportingSessionConnectivityHelper> transport;
+};
+
+}  // namespace zerith::test

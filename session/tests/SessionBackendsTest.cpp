@@ -1,0 +1,513 @@
+// A session's backend set under a real agent: built from the storebag
+// through the real factory (recording backends registered under the names
+// the storebag uses), the road of one event to every backend, the result
+// the client gets, the joined flush, states and identifiers in a hierarchy,
+// one-shot messages and the end of a session.
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "daemon/tests/AgentFixture.h"
+#include "session/tests/RecordingBackend.h"
+#include "transport/ReportingSessionConnectivityHelper.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+
+class SessionBackendsTest : public AgentFixture {
+ protected:
+  SessionBackendsTest() {
+    RecordingBackend::registerAs({"recA", "recB", "recC", kZerithBackendHTTPPost, kZerithBackendHTTPPost2,
+                                  kZerithBackendDashboard, kZerithBackendQRS});
+    storebagVersion = Value("7");
+  }
+
+  void useStorebag(Dictionary section) { storebag = Value(std::move(section)); }
+
+  // A configured session on the current storebag.
+  Client started(const Value& info, bool aggregator = false, const Value& userInfo = Value()) {
+    auto c = newSession(info, aggregator, userInfo);
+    c.session->startConfigWithCompletionHandler(nullptr);
+    return c;
+  }
+
+  static std::shared_ptr<RecordingBackend> rec(const Client& c, std::string_view name) {
+    return RecordingBackend::of(c.session->backendNamed(name));
+  }
+
+  static Value event(unsigned category, unsigned type, const Value& payload = Value(), const Value& flag = Value()) {
+    Dictionary d{{kZerithMessageParametersCategory, Value(category)}, {kZerithMessageParametersType, Value(type)}};
+    if (!payload.isNil()) {
+      d.set(kZerithMessageParametersPayload, payload);
+    }
+    if (!flag.isNil()) {
+      d.set(kZerithMessageParametersFlag, flag);
+    }
+    return Value(std::move(d));
+  }
+
+  static Value send(Client& c, const Value& message) {
+    std::optional<Value> reply;
+    c.session->sendMessageWithDictionary(message, [&](Value v) { reply = v; });
+    EXPECT_TRUE(reply.has_value());
+    return reply.value_or(Value());
+  }
+
+  std::string messageLog() const {
+    std::string text;
+    const auto dir = root / "/var/log/faultkeep/retired";
+    if (!std::filesystem::exists(dir)) {
+      return text;
+    }
+    for (const auto& entry : std::filesystem::directory_iterator(dir)) {
+      std::ifstream in(entry.path());
+      text.append(std::istreambuf_iterator<char>(in), {});
+    }
+    return text;
+  }
+};
+
+// --- The set --------------------------------------------------------------------------
+
+TEST_F(SessionBackendsTest, SetFollowsTheStorebagOrderAndEveryBackendGetsTheSessionsTransportAndIdentifier) {
+  useStorebag({{"recB", Value(Dictionary{})},
+               {"noSuchKind", Value(Dictionary{})},
+               {"recA", Value(Dictionary{{"state", Value(1)}})},
+               {"recC", Value(Dictionary{{"state", Value(3)}})}});
+  auto c = newSession(sessionInfo(5));
+  std::optional<Value> names;
+  c.session->startConfigWithCompletionHandler([&](Value v) { names = v; });
+  // Disabled recA is not reporting; sampled-out-but-kept recC is.
+  EXPECT_EQ(names, Value(Array{Value("recB"), Value("recC")}));
+  EXPECT_TRUE(logs.has(Level::Error, "ZerithBackend(newBackendWithName): noSuchKind"));
+
+  const auto set = c.session->backends();
+  ASSERT_NE(set, nullptr);
+  ASSERT_EQ(set->size(), 3u);
+  EXPECT_EQ((*set)[0].first, "recB");
+  EXPECT_EQ((*set)[1].first, "recA");
+  for (const auto& [name, backend] : *set) {
+    EXPECT_EQ(backend->reportingSessionConnectivityDelegate().get(),
+              static_cast<ReportingSessionConnectivityInterface*>(c.session->connectivityHelper().get()))
+        << name;
+    EXPECT_EQ(backend->combinedSessionIDString(), c.session->sessionIDString());
+    EXPECT_EQ(backend->sessionID(), 5u);
+    // The start message went to every backend, state or not: a backend's
+    // own send decides what its state means.
+    ASSERT_EQ(rec(c, name)->events().size(), 1u) << name;
+    EXPECT_EQ(rec(c, name)->events()[0].method, 0u);
+    EXPECT_EQ(rec(c, name)->events()[0].respCode, 0u);
+  }
+}
+
+TEST_F(SessionBackendsTest, NewStorebagReplacesTheSetAndCleansUpTheOldOne) {
+  useStorebag({{"recA", Value(Dictionary{})}});
+  auto c = started(sessionInfo(5));
+  const auto first = rec(c, "recA");
+  useStorebag({{"recB", Value(Dictionary{})}});
+  fetchedClientTypes.clear();
+  // The agent's cache still answers with the first storebag for type 7; a
+  // new session info under type 8 (another storebag name) fetches the second.
+  Dictionary info = sessionInfo(5, 8).dictCopy();
+  c.session->setSessionInfo(Value(info), Value(), Value(), false);
+  c.session->startConfigWithCompletionHandler(nullptr);
+  EXPECT_EQ(first->cleanups(), 1);
+  EXPECT_EQ(c.session->backendNamed("recA"), nullptr);
+  EXPECT_NE(rec(c, "recB"), nullptr);
+}
+
+// --- One event ------------------------------------------------------------------------
+
+TEST_F(SessionBackendsTest, EveryBackendGetsClientDataSharedDataTheNumbersAndTheFlag) {
+  useStorebag({{"recA", Value(Dictionary{})}, {"recB", Value(Dictionary{})}});
+  auto c = started(hierarchyInfo(5, "call", 0));
+  c.session->updateSharedDataWithDictionary(Value(Dictionary{{"room", Value("blue")}}));
+  const Value payload(Dictionary{{"rtt", Value(12)}});
+  EXPECT_TRUE(send(c, event(3, 70004, payload, Value(0x1'0000'0009ull))).isNil());
+
+  for (const char* name : {"recA", "recB"}) {
+    const auto events = rec(c, name)->events();
+    ASSERT_EQ(events.size(), 2u) << name;  // the start message, then this one
+    const auto& e = events[1];
+    EXPECT_EQ(e.message, Value(Dictionary{{"SharedData", Value(Dictionary{{"room", Value("blue")}})},
+                                          {"ClientData", payload}}));
+    EXPECT_EQ(e.method, 3u);
+    EXPECT_EQ(e.respCode, 70004u & 0xffffu);
+    EXPECT_EQ(e.flag, 9);  // read as 32 bits
+    EXPECT_EQ(e.eventID, 2u);  // numbered per backend; the start message was 1
+  }
+  // Without a payload and without shared data the dictionary is empty.
+  auto standalone = started(sessionInfo(6));
+  send(standalone, event(4, 1));
+  EXPECT_EQ(rec(standalone, "recA")->events()[1].message, Value(Dictionary{}));
+  EXPECT_EQ(rec(standalone, "recA")->events()[1].flag, 0);
+}
+
+TEST_F(SessionBackendsTest, WhitelistAndBlacklistDecidePerBackend) {
+  useStorebag({{"recA", Value(Dictionary{{"whitelist", Value(Array{Value(3), Value(4)})}})},
+               {"recB", Value(Dictionary{{"blacklist", Value(Array{Value(4)})}})},
+               {"recC", Value(Dictionary{{"whitelist", Value(Array{})}, {"blacklist", Value(Array{})}})}});
+  auto c = started(sessionInfo(5));
+  logs.clear();
+  send(c, event(3, 1));
+  send(c, event(4, 1));
+  send(c, event(5, 1));
+  auto categories = [&](const char* name) {
+    std::vector<unsigned> out;
+    for (const auto& e : rec(c, name)->events()) {
+      if (e.method != 0) {
+        out.push_back(e.method);
+      }
+    }
+    return out;
+  };
+  EXPECT_EQ(categories("recA"), (std::vector<unsigned>{3, 4}));
+  EXPECT_EQ(categories("recB"), (std::vector<unsigned>{3, 5}));
+  EXPECT_TRUE(categories("recC").empty());  // an empty whitelist admits nothing
+  EXPECT_TRUE(logs.has(Level::Debug,
+                       "sendMessageWithDictionary: Dropping event with category 5 as it is not whitelisted for backend recA"));
+  EXPECT_TRUE(
+      logs.has(Level::Debug, "sendMessageWithDictionary: Dropping event with category 4 as it is blacklisted for backend recB"));
+  EXPECT_EQ(logs.count("as it is not whitelisted for backend recC"), 3u);
+  EXPECT_EQ(logs.count("as it is blacklisted for backend recC"), 0u);
+}
+
+TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutOne) {
+  // Each set under a client type with a storebag name of its own, so that
+  // none is served from the agent's cache.
+  const std::int64_t types[] = {12, 16, 17, 18, 19, 21};
+  std::size_t next = 0;
+  auto resultOf = [&](Dictionary section) {
+    useStorebag(std::move(section));
+    auto c = started(sessionInfo(5, types[next++]));
+    return send(c, event(3, 1));
+  };
+  Dictionary dash{{"result", Value("dash#")}};
+  Dictionary https{{"result", Value("post#")}};
+  Dictionary https2{{"result", Value("post2#")}};
+  EXPECT_EQ(resultOf({{kZerithBackendHTTPPost2, Value(https2)}, {kZerithBackendHTTPPost, Value(https)}}),
+            Value("post#2"));
+  EXPECT_EQ(resultOf({{kZerithBackendHTTPPost, Value(https)}, {kZerithBackendHTTPPost2, Value(https2)}}),
+            Value("post2#2"));
+  EXPECT_EQ(resultOf({{"recA", Value(Dictionary{{"result", Value("other#")}})}, {kZerithBackendDashboard, Value(dash)}}),
+            Value("dash#2"));
+  EXPECT_EQ(resultOf({{kZerithBackendDashboard, Value(dash)}, {kZerithBackendHTTPPost, Value(https)}}),
+            Value("post#2"));
+  EXPECT_EQ(resultOf({{kZerithBackendHTTPPost, Value(https)}, {kZerithBackendDashboard, Value(dash)}}),
+            Value("post#2"));
+  // Other kinds' results are logged, never returned.
+  EXPECT_TRUE(resultOf({{"recA", Value(Dictionary{{"result", Value("other#")}})}}).isNil());
+  const std::string log = messageLog();
+  EXPECT_NE(log.find(") [recA -> sendMessageWithDictionary] other#2\n"), std::string::npos) << log;
+  EXPECT_NE(log.find(") [dashboard -> sendMessageWithDictionary] dash#2\n"), std::string::npos) << log;
+}
+
+TEST_F(SessionBackendsTest, PayloadThatIsNotADictionaryIsRefusedAndTheSessionGoesOn) {
+  useStorebag({{"recA", Value(Dictionary{})}});
+  auto c = started(sessionInfo(5));
+  EXPECT_TRUE(send(c, event(3, 1, Value("text"))).isNil());
+  EXPECT_TRUE(send(c, event(3, 1, Value(Array{Value(1)}))).isNil());
+  EXPECT_EQ(countExact(Level::Error,
+                       "sendMessageWithDictionary: Dropping event with category 3 as its payload is not a dictionary"),
+            2u);
+  send(c, event(3, 2, Value(Dictionary{{"ok", Value(true)}})));
+  const auto events = rec(c, "recA")->events();
+  ASSERT_EQ(events.size(), 2u);  // the start message and the good event
+  EXPECT_EQ(events[1].respCode, 2u);
+}
+
+TEST_F(SessionBackendsTest, SharedDataIsPerTokenAndBadOrOversizedUpdatesChangeNothing) {
+  useStorebag({{"recA", Value(Dictionary{})}});
+  auto a = started(hierarchyInfo(1, "call", 0));
+  auto b = started(hierarchyInfo(2, "call", 1));
+  auto other = started(hierarchyInfo(3, "meeting", 0));
+  auto alone = started(sessionInfo(4));
+  a.session->updateSharedDataForKey(Value("room"), Value("blue"));
+  alone.session->updateSharedDataForKey(Value("room"), Value("red"));  // no token: nothing happens
+  b.session->updateSharedDataWithDictionary(Value("not a dictionary"));
+  EXPECT_TRUE(logs.has(Level::Error,
+                       "updateSharedDataWithDictionary: Ignoring shared data of session 2 as it is not a dictionary"));
+  a.session->updateSharedDataForKey(Value("blob"), Value(Data(kSharedDataSizeLimit, 0x41)));
+  EXPECT_TRUE(logs.contains("updateSharedDataForSession: Refusing shared data of session 1 for hierarchyToken call"));
+  a.session->updateSharedDataForKey(Value(7), Value("x"));  // a key that is not a string
+  EXPECT_TRUE(logs.has(Level::Error, "updateSharedDataForKey: Ignoring shared data without a string key for session 1"));
+
+  for (auto* c : {&a, &b, &other, &alone}) {
+    send(*c, event(9, 9));
+  }
+  const Value shared(Dictionary{{"room", Value("blue")}});
+  EXPECT_EQ(rec(a, "recA")->events().back().message, Value(Dictionary{{"SharedData", shared}}));
+  EXPECT_EQ(rec(b, "recA")->events().back().message, Value(Dictionary{{"SharedData", shared}}));
+  EXPECT_EQ(rec(other, "recA")->events().back().message, Value(Dictionary{}));
+  EXPECT_EQ(rec(alone, "recA")->events().back().message, Value(Dictionary{}));
+}
+
+TEST_F(SessionBackendsTest, LevelsFarAboveTheOthersOrNegativeFindTheAggregatorWithoutWalkingEveryLevel) {
+  useStorebag({{"recA", Value(Dictionary{})}});
+  auto root = started(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  auto far = started(hierarchyInfo(2, "call", 4'000'000'000ll));
+  auto negative = started(hierarchyInfo(3, "call", -1));
+  EXPECT_TRUE(logs.has(Level::Error, "setSessionInfo: Session 3 has the negative hierarchy level -1, taken as 4294967295"));
+  EXPECT_EQ(negative.session->hierarchyLevel(), 4294967295u);
+  send(far, event(5, 1));
+  send(negative, event(6, 1));
+  std::vector<unsigned> atRoot;
+  for (const auto& m : aggregated(*root.connection)) {
+    atRoot.push_back(static_cast<unsigned>(m.get("category").unsignedValue()));
+  }
+  // Both start messages and both events reach the root's aggregator.
+  EXPECT_EQ(std::count(atRoot.begin(), atRoot.end(), 5u), 1);
+  EXPECT_EQ(std::count(atRoot.begin(), atRoot.end(), 6u), 1);
+  // Neither has a parent one level up: a gap, so no combined identifier.
+  EXPECT_EQ(rec(far, "recA")->combinedSessionIDString(), far.session->sessionIDString());
+  EXPECT_TRUE(logs.contains("parentSessionIDStringForSession: Found a gap in hierarchy"));
+}
+
+// --- Flush --------------------------------------------------------------------------------
+
+TEST_F(SessionBackendsTest, FlushCompletesOnceAtTheFirstErrorOrAfterTheLastBackend) {
+  useStorebag({{"recA", Value(Dictionary{{"flushResult", Value("a flushed")}})},
+               {"recB", Value(Dictionary{{"flushError", Value("b failed")}, {"flushResult", Value("b text")}})},
+               {"recC", Value(Dictionary{{"flushResult", Value("c flushed")}})}});
+  auto c = started(sessionInfo(5));
+  std::vector<std::pair<Value, std::optional<Error>>> calls;
+  c.session->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { calls.emplace_back(v, e); });
+  ASSERT_EQ(calls.size(), 1u);
+  EXPECT_EQ(calls[0].first, Value("b text"));
+  ASSERT_TRUE(calls[0].second.has_value());
+  EXPECT_EQ(calls[0].second->description, "b failed");
+  EXPECT_EQ(rec(c, "recC")->flushes(), 1);  // every backend was asked all the same
+  for (const char* name : {"recA", "recB", "recC"}) {
+    EXPECT_TRUE(logs.has(Level::Debug, std::string("internalFlushMessagesWithCompletion: ") + name));
+  }
+  const std::string log = messageLog();
+  EXPECT_NE(log.find(") [recA -> flushMessages] a flushed\n"), std::string::npos) << log;
+  EXPECT_NE(log.find(") [recC -> flushMessages] c flushed\n"), std::string::npos) << log;
+
+  // Without errors: the last backend's text, no error.
+  useStorebag({{"recA", Value(Dictionary{{"flushResult", Value("a")}})},
+               {"recB", Value(Dictionary{{"flushResult", Value("b")}})}});
+  auto quiet = started(sessionInfo(6, 8));
+  calls.clear();
+  quiet.session->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { calls.emplace_back(v, e); });
+  ASSERT_EQ(calls.size(), 1u);
+  EXPECT_EQ(calls[0].first, Value("b"));
+  EXPECT_FALSE(calls[0].second.has_value());
+}
+
+TEST_F(SessionBackendsTest, DeferredFlushesJoinAcrossThreadsAndAnErrorArrivingFirstWins) {
+  useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(true)}, {"flushResult", Value("a")}})},
+               {"recB", Value(Dictionary{{"flushDeferred", Value(true)}, {"flushError", Value("b failed")}})},
+               {"recC", Value(Dictionary{{"flushDeferred", Value(true)}, {"flushResult", Value("c")}})}});
+  auto c = started(sessionInfo(5));
+  std::atomic<int> calls{0};
+  std::optional<Error> seen;
+  c.session->flushMessagesWithCompletion([&](Value, std::optional<Error> e) {
+    seen = e;
+    ++calls;
+  });
+  EXPECT_EQ(calls, 0);  // nothing has answered yet
+  // The error arrives first, on another thread; the two others follow on
+  // two more threads at once.
+  std::thread([&] { rec(c, "recB")->completeFlush(); }).join();
+  EXPECT_EQ(calls, 1);
+  ASSERT_TRUE(seen.has_value());
+  EXPECT_EQ(seen->description, "b failed");
+  std::thread a([&] { rec(c, "recA")->completeFlush(); });
+  std::thread cc([&] { rec(c, "recC")->completeFlush(); });
+  a.join();
+  cc.join();
+  EXPECT_EQ(calls, 1);
+
+  // Two sessions flushing at once from two threads each get their own join.
+  auto other = started(sessionInfo(6, 11));
+  std::atomic<int> first{0};
+  std::atomic<int> second{0};
+  c.session->flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++first; });
+  other.session->flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++second; });
+  std::vector<std::thread> threads;
+  for (const auto* s : {&c, &other}) {
+    for (const char* name : {"recA", "recC", "recB"}) {
+      threads.emplace_back([s, name] { rec(*s, name)->completeFlush(); });
+    }
+  }
+  for (auto& t : threads) {
+    t.join();
+  }
+  EXPECT_EQ(first, 1);
+  EXPECT_EQ(second, 1);
+}
+
+TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSafely) {
+  useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(true)}})}});
+  auto c = started(sessionInfo(5));
+  const auto a = rec(c, "recA");
+  int calls = 0;
+  c.session->flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++calls; });
+  agent->invalidateReportingSession(c.session);
+  c.session.reset();
+  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
+  EXPECT_EQ(a->cleanups(), 1);
+  // The client's flush and the end-of-session flush both still wait.
+  EXPECT_TRUE(a->completeFlush());
+  EXPECT_EQ(calls, 1);
+  EXPECT_TRUE(a->completeFlush());
+  EXPECT_FALSE(a->completeFlush());
+}
+
+// --- States and identifiers in a hierarchy ---------------------------------------------------
+
+TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifier) {
+  useStorebag({{"recA", Value(Dictionary{{"state", Value(2)}, {"threshold", Value(0.25)}})},
+               {"recB", Value(Dictionary{{"state", Value(1)}})}});
+  auto root = started(hierarchyInfo(1, "call", 0));
+  // The child's storebag disagrees with its parent (a client type with
+  // another storebag name).
+  useStorebag({{"recA", Value(Dictionary{{"state", Value(1)}})},
+               {"recB", Value(Dictionary{{"state", Value(3)}})},
+               {"recC", Value(Dictionary{{"state", Value(2)}})}});
+  auto child = started(hierarchyInfo(2, "call", 1, 8));
+  std::optional<Value> states;
+  child.session->fetchStatesWithUserInfo(Value(), [&](Value v) { states = v; });
+  // recA copied from the parent, recB kept (state 3), recC missing at the parent.
+  EXPECT_EQ(states, Value(Array{Value("recA"), Value("recB")}));
+  EXPECT_EQ(rec(child, "recA")->samplingThreshold(), Value(0.25));
+  EXPECT_EQ(rec(child, "recC")->state(), kBackendStateDisabled);
+  EXPECT_TRUE(logs.has(Level::Debug,
+                       "HTTPSPostBackend(syncReportingStates): recA: state and sampling rate updated to 2, 0.25%"));
+
+  auto grandchild = started(hierarchyInfo(3, "call", 2, 8));
+  const std::string combined = root.session->sessionIDString() + "." + child.session->sessionIDString() + "." +
+                               grandchild.session->sessionIDString();
+  for (const auto& [name, backend] : *grandchild.session->backends()) {
+    EXPECT_EQ(backend->combinedSessionIDString(), combined) << name;
+  }
+  EXPECT_TRUE(logs.has(Level::Debug, "updateCombinedSessionID: Updating combined session ID '" + combined +
+                                         "' for session 3 backends"));
+  // The root keeps its own identifier and states.
+  EXPECT_EQ(rec(root, "recA")->combinedSessionIDString(), root.session->sessionIDString());
+}
+
+TEST_F(SessionBackendsTest, ChildWithoutItsParentKeepsItsStatesAndSaysSo) {
+  useStorebag({{"recA", Value(Dictionary{{"state", Value(2)}})}});
+  auto child = started(hierarchyInfo(2, "orphan", 1));
+  EXPECT_EQ(rec(child, "recA")->state(), kBackendStateEnabled);
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "syncReportingStates: child session 2 (backend recA) with hierarchy 1 is missing its parent"));
+  EXPECT_EQ(rec(child, "recA")->combinedSessionIDString(), child.session->sessionIDString());
+}
+
+TEST_F(SessionBackendsTest, UserInfoReachesEveryBackendAndTheDigestKeyOnlyTheDigestBackend) {
+  useStorebag({{"recA", Value(Dictionary{})}, {kZerithBackendQRS, Value(Dictionary{})}});
+  auto c = started(sessionInfo(5));
+  const Value key(Data{1, 2, 3});
+  c.session->setDigestKey(key, 4);
+  EXPECT_EQ(rec(c, kZerithBackendQRS)->digestKey(), Data({1, 2, 3}));
+  EXPECT_EQ(rec(c, kZerithBackendQRS)->digestAlgorithm(), 4);
+  EXPECT_EQ(rec(c, "recA")->digestKey(), std::nullopt);
+
+  const Value user(Dictionary{{kZerithUserInfoClientName, Value("mail")}});
+  c.session->fetchStatesWithUserInfo(user, nullptr);
+  EXPECT_EQ(rec(c, "recA")->userInfoDict(), user);
+  EXPECT_EQ(rec(c, kZerithBackendQRS)->userInfoDict(), user);
+  // The user-info update hands the session's key on again, with the
+  // algorithm the session keeps (never the one setDigestKey was given).
+  EXPECT_EQ(rec(c, kZerithBackendQRS)->digestKey(), Data({1, 2, 3}));
+  EXPECT_EQ(rec(c, kZerithBackendQRS)->digestAlgorithm(), 0);
+}
+
+TEST_F(SessionBackendsTest, DisplayURLComesFromTheFirstHttpsBackendThatHasOneThenTheDashboard) {
+  useStorebag({{kZerithBackendDashboard, Value(Dictionary{{"displayURL", Value("https://dash/1")}})},
+               {kZerithBackendHTTPPost, Value(Dictionary{})},
+               {kZerithBackendHTTPPost2, Value(Dictionary{{"displayURL", Value("https://post2/1")}})}});
+  auto c = started(sessionInfo(5));
+  std::optional<Value> url;
+  c.session->fetchDisplayURL([&](Value v) { url = v; });
+  EXPECT_EQ(url, Value("https://post2/1"));
+
+  useStorebag({{kZerithBackendDashboard, Value(Dictionary{{"displayURL", Value("https://dash/1")}})}});
+  auto d = started(sessionInfo(6, 8));
+  d.session->fetchDisplayURL([&](Value v) { url = v; });
+  EXPECT_EQ(url, Value("https://dash/1"));
+}
+
+// --- Health and the end of a session -------------------------------------------------------------
+
+TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedUp) {
+  useStorebag({{"recA", Value(Dictionary{{"batchedBytes", Value(300)}})},
+               {"recB", Value(Dictionary{{"batchedBytes", Value(45)}})}});
+  auto other = started(sessionInfo(6));  // another type-7 session, still live
+  auto c = started(sessionInfo(5));
+  EXPECT_EQ(c.session->batchedEventsSize(), 345u);
+  const auto a = rec(c, "recA");
+  const auto b = rec(c, "recB");
+  agent->invalidateReportingSession(c.session);
+  c.session.reset();
+  ASSERT_TRUE(logs.waitFor("dealloc: ZerithdSession dealloc: 5"));
+  ASSERT_TRUE(a->waitForCount(2));
+  const auto end = a->events().back();
+  EXPECT_EQ(end.method, 0u);
+  EXPECT_EQ(end.respCode, 1u);
+  const Value health = end.message["ClientData"];
+  EXPECT_EQ(health["SessionsCount_YJ"], Value(2ull));
+  EXPECT_EQ(health["BatchSize_YJ"], Value(690u));
+  EXPECT_EQ(health["CalculatedMemoryUsage"].unsignedValue(), 690u + health["StorebagsSize"].unsignedValue());
+  EXPECT_GT(health["StorebagsSize"].unsignedValue(), 0u);
+  EXPECT_GT(health["ProcessMemoryUsage"].unsignedValue(), 0u);
+  EXPECT_EQ(a->cleanups(), 1);
+  EXPECT_EQ(b->cleanups(), 1);
+  EXPECT_GE(a->flushes(), 1);
+}
+
+// --- One-shot messages ------------------------------------------------------------------------------
+
+TEST_F(SessionBackendsTest, OneShotHandsThePayloadItselfToAThrowAwaySet) {
+  useStorebag({{"recA", Value(Dictionary{{"result", Value("one#")}})},
+               {"recB", Value(Dictionary{{"whitelist", Value(Array{Value(9)})}})}});
+  std::vector<std::shared_ptr<RecordingBackend>> made;
+  RecordingBackend::registerBackendKind("recA", [&](std::string_view n, const Value& p,
+                                                    const std::optional<std::string>& f, std::int32_t) {
+    made.push_back(std::make_shared<RecordingBackend>(std::string(n), p, f));
+    return made.back();
+  });
+  auto c = newSession();
+  std::optional<Value> reply;
+  const Value payload(Dictionary{{"k", Value("v")}});
+  c.session->sendMessageWithSessionInfo(sessionInfo(8), Value(Dictionary{{kZerithUserInfoClientName, Value("x")}}), 4,
+                                        2, payload, [&](Value v) { reply = v; });
+  EXPECT_EQ(reply, Value("finished"));
+  ASSERT_EQ(made.size(), 1u);
+  const auto events = made[0]->events();
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(events[0].message, payload);  // no ClientData wrapping on a customer build
+  EXPECT_EQ(events[0].method, 4u);
+  EXPECT_EQ(events[0].flag, 0);
+  EXPECT_EQ(made[0]->cleanups(), 1);
+  EXPECT_EQ(made[0]->state(), kBackendStateEnabled);
+  EXPECT_NE(made[0]->reportingSessionConnectivityDelegate(), nullptr);
+  EXPECT_EQ(made[0]->reportingSessionConnectivityDelegate().get(),
+            static_cast<ReportingSessionConnectivityInterface*>(ZerithdSession::oneShotConnectivityHelper().get()));
+  EXPECT_TRUE(logs.has(Level::Debug,
+                       "sendMessageWithSessionInfo: Dropping event with category 4 as it is not whitelisted for backend recB"));
+  EXPECT_TRUE(logs.has(Level::Error, "sendMessageWithSessionInfo: user info provided without requiring it."));
+  EXPECT_NE(messageLog().find(") [recA -> sendMessageWithSessionInfo] one#1\n"), std::string::npos);
+  // The one-shot set is not the session's: the session still has none.
+  EXPECT_EQ(c.session->backends(), nullptr);
+  RecordingBackend::registerAs({"recA"});
+}
+
+TEST_F(SessionBackendsTest, OneShotSenderRefusesNilPartsAndEmptyStorebags) {
+  ZerithdSession::sendMessageWithSessionInfo(Value(), Value(), Value(Dictionary{}), 1, 1, Value());
+  ZerithdSession::sendMessageWithSessionInfo(sessionInfo(3), Value(), Value(), 1, 1, Value());
+  EXPECT_EQ(countExact(Level::Error,
+                       "RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters"),
+            2u);
+}
+
+}  // namespace
+}  // namespace zerith::test

@@ -1,0 +1,105 @@
+#pragma once
+
+// The collector's HTTP(S) server: HTTP/1.1 with keep-alive over TLS
+// (OpenSSL) or plain TCP, one thread per connection up to a limit. Every
+// request becomes one or more JSON lines handed to the line writer:
+//
+//   POST of a JSON envelope   one "record" line per event record, with the
+//                             record's "_sender" and "_sessionID" beside it
+//                             (an envelope without events: one "envelope"
+//                             line)
+//   any other POST            one "upload" (or "logdata") line with the
+//                             path, query, sizes and SHA-256; the body, gzip
+//                             undone, is stored in the store folder
+//   GET                       one "get" line; files of the serve folder are
+//                             answered (with Last-Modified/304)
+//   refused request           one "refused" line with the reason
+//
+// Every line carries the method, path, query, the headers in wire order,
+// the status answered and, when a digest key is set, whether
+// "X-ZTH-DIGEST" matched the HMAC-SHA-1 of the body ("valid", "invalid",
+// "missing").
+//
+// Untrusted input is bounded before it is parsed: the header block (64 KiB,
+// 100 lines), the body (Content-Length only, up to the body limit), the
+// inflated size and the JSON nesting depth (CollectorBody.h), idle time.
+
+#include <atomic>
+#include <condition_variable>
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <string>
+
+#include "tools/zerith-collector/CollectorBody.h"
+
+namespace zerith::collector {
+
+struct CollectorOptions {
+  std::string listenAddress = "127.0.0.1";
+  int port = 0;  // 0: any free port
+  bool plain = false;  // plain HTTP instead of TLS
+  std::filesystem::path certificateFile;  // PEM, leaf first (chain may follow)
+  std::filesystem::path keyFile;          // PEM
+  int status = 200;                       // the status every POST is answered with
+  std::optional<std::string> digestKey;
+  std::filesystem::path storeFolder;      // empty: uploads are not stored
+  std::string answerText = "success";     // body of the answer to uploads
+  std::string logDataPath = "/logdata";   // POSTs here are answered with the stored file's path
+  std::filesystem::path serveFolder;      // empty: GET answers 404
+  BodyLimits limits;
+  std::size_t maxConnections = 64;
+  int idleTimeoutSeconds = 10;
+};
+
+class CollectorServer {
+ public:
+  using LineWriter = std::function<void(const std::string& line)>;
+
+  CollectorServer(CollectorOptions options, LineWriter writer);
+  ~CollectorServer();
+  CollectorServer(const CollectorServer&) = delete;
+  CollectorServer& operator=(const CollectorServer&) = delete;
+
+  // Loads the certificate, binds and listens. False with the reason.
+  bool start(std::string* error);
+  int port() const { return port_; }
+  // "https://127.0.0.1:<port>"
+  std::string baseURL() const;
+
+  // Accepts connections until stop().
+  void run();
+  // Ends run(), closes every connection and waits for their threads.
+  void stop();
+
+  struct Connection;
+
+ private:
+  void serveConnection(int fd);
+  void handle(Connection& connection);
+
+  CollectorOptions options_;
+  LineWriter writer_;
+  void* sslContext_ = nullptr;  // SSL_CTX*
+  int listenFd_ = -1;
+  int wakeFds_[2] = {-1, -1};
+  int port_ = 0;
+  std::atomic<bool> stopping_{false};
+  std::atomic<std::uint64_t> stored_{0};
+
+  std::mutex mutex_;
+  std::condition_variable idle_;
+  std::set<int> connections_;
+  std::size_t threads_ = 0;
+};
+
+// A CA and a server certificate for localhost, 127.0.0.1 and ::1 issued by
+// it, written as ca.pem, cert.pem and key.pem into `folder` (kept when they
+// already exist). False with the reason.
+bool generateCertificates(const std::filesystem::path& folder, std::string* error);
+
+}  // namespace zerith::collector

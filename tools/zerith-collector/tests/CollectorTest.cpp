@@ -1,0 +1,417 @@
+// zerith-collector: its body decoding on hostile input, and the built
+// executable receiving what a real HTTPS backend, libcurl uploads and
+// static-file GETs send it.
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <zlib.h>
+
+#include <curl/curl.h>
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include "backends/HTTPSPostBackend.h"
+#include "platform/Defaults.h"
+#include "config/DeviceInfo.h"
+#include "platform/FileUtil.h"
+#include "platform/Log.h"
+#include "tests/support/TempRoot.h"
+#include "tools/zerith-collector/CollectorBody.h"
+#include "transport/ReportingSessionConnectivityHelper.h"
+#include "transport/URLSession.h"
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size);
+
+namespace zerith::test {
+namespace {
+
+namespace fs = std::filesystem;
+using collector::BodyLimits;
+using collector::decodeRequestBody;
+using Json = nlohmann::ordered_json;
+
+std::string gzipOf(const std::string& text) {
+  z_stream s{};
+  deflateInit2(&s, 9, Z_DEFLATED, 16 + MAX_WBITS, 8, Z_DEFAULT_STRATEGY);
+  std::string out(deflateBound(&s, text.size()), '\0');
+  s.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
+  s.avail_in = static_cast<uInt>(text.size());
+  s.next_out = reinterpret_cast<Bytef*>(out.data());
+  s.avail_out = static_cast<uInt>(out.size());
+  deflate(&s, Z_FINISH);
+  out.resize(s.total_out);
+  deflateEnd(&s);
+  return out;
+}
+
+TEST(CollectorBody, GzipBombsTruncationAndTrailingBytesAreRefusedBeforeParsing) {
+  const BodyLimits limits{.maxBodyBytes = 1 << 20, .maxInflatedBytes = 1 << 20, .maxJsonDepth = 8};
+  const std::string bomb = gzipOf(std::string(8 << 20, '{'));
+  ASSERT_LT(bomb.size(), 64u * 1024);
+  auto decoded = decodeRequestBody("gzip", bomb, limits);
+  EXPECT_FALSE(decoded.ok);
+  EXPECT_NE(decoded.error.find("inflates beyond 1048576 bytes"), std::string::npos) << decoded.error;
+
+  const std::string whole = gzipOf("{\"postTime\":1}");
+  EXPECT_FALSE(decodeRequestBody("gzip", whole.substr(0, whole.size() - 3), limits).ok);
+  decoded = decodeRequestBody("gzip", whole + "junk", limits);
+  EXPECT_FALSE(decoded.ok);
+  EXPECT_EQ(decoded.error, "gzip body has trailing bytes");
+  // The magic bytes are enough, whatever the header says.
+  decoded = decodeRequestBody("", whole, limits);
+  ASSERT_TRUE(decoded.ok);
+  EXPECT_TRUE(decoded.wasGzip);
+  EXPECT_TRUE(decoded.envelope);
+
+  EXPECT_FALSE(decodeRequestBody("", std::string((1 << 20) + 1, 'x'), limits).ok);
+  EXPECT_FALSE(decodeRequestBody("br", "{}", limits).ok);
+}
+
+TEST(CollectorBody, OnlyBoundedObjectsWithPostTimeAreEnvelopes) {
+  const BodyLimits limits{.maxJsonDepth = 8};
+  EXPECT_TRUE(decodeRequestBody("", " {\"postTime\":1,\"clientId\":\"A\",\"events\":[{\"a\":1}]}", limits).envelope);
+  EXPECT_TRUE(decodeRequestBody("", "{\"postTime\":1}", limits).envelope);
+  EXPECT_FALSE(decodeRequestBody("", "{\"postTime\":1,\"events\":{}}", limits).envelope);
+  EXPECT_FALSE(decodeRequestBody("", "{\"events\":[]}", limits).envelope);
+  EXPECT_FALSE(decodeRequestBody("", "{\"postTime\":1", limits).envelope);
+  EXPECT_FALSE(decodeRequestBody("", "[1]", limits).envelope);
+  // Too deep to parse safely: kept as a file.
+  const std::string deep = "{\"postTime\":1,\"x\":" + std::string(20, '[') + std::string(20, ']') + "}";
+  const auto decoded = decodeRequestBody("", deep, limits);
+  EXPECT_TRUE(decoded.ok);
+  EXPECT_FALSE(decoded.envelope);
+  // Brackets inside strings do not count.
+  EXPECT_EQ(collector::jsonNestingDepth("{\"a\":\"[[[[\\\"[[[\"}", 100), 1u);
+}
+
+TEST(CollectorBodyCorpus, EveryCorpusInputDecodesWithoutCrashing) {
+  const auto corpus = sourceDir() / "fuzz/corpus/collector_body_fuzz";
+  ASSERT_TRUE(fs::is_directory(corpus)) << corpus;
+  std::size_t inputs = 0;
+  for (const auto& entry : fs::directory_iterator(corpus)) {
+    const auto bytes = file::readAll(entry.path(), 1u << 20);
+    ASSERT_TRUE(bytes) << entry.path();
+    LLVMFuzzerTestOneInput(bytes->data(), bytes->size());
+    ++inputs;
+  }
+  EXPECT_GT(inputs, 0u);
+}
+
+// The collector executable with its standard output on a pipe.
+class CollectorProcess {
+ public:
+  explicit CollectorProcess(std::vector<std::string> args) {
+    int out[2];
+    int err[2];
+    EXPECT_EQ(::pipe2(out, O_CLOEXEC), 0);
+    EXPECT_EQ(::pipe2(err, O_CLOEXEC), 0);
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      ::dup2(out[1], 1);
+      ::dup2(err[1], 2);
+      std::vector<char*> argv;
+      args.insert(args.begin(), ZERITH_COLLECTOR_TOOL);
+      for (auto& a : args) {
+        argv.push_back(a.data());
+      }
+      argv.push_back(nullptr);
+      ::execv(argv[0], argv.data());
+      ::_exit(127);
+    }
+    ::close(out[1]);
+    ::close(err[1]);
+    out_ = out[0];
+    err_ = err[0];
+    // Ready once it says where it listens.
+    std::string said;
+    while (said.find("listening on ") == std::string::npos || said.back() != '\n') {
+      if (!readSome(err_, said)) {
+        break;
+      }
+    }
+    const auto at = said.rfind(':');
+    port_ = at == std::string::npos ? 0 : std::atoi(said.c_str() + at + 1);
+  }
+  ~CollectorProcess() {
+    if (pid_ > 0) {
+      ::kill(pid_, SIGTERM);
+      int status = 0;
+      ::waitpid(pid_, &status, 0);
+    }
+    ::close(out_);
+    ::close(err_);
+  }
+
+  int port() const { return port_; }
+  std::string url(const std::string& path) const { return "https://127.0.0.1:" + std::to_string(port_) + path; }
+
+  // The next JSON line, or nullopt after ten seconds.
+  std::optional<Json> nextLine() {
+    while (true) {
+      const auto newline = pending_.find('\n');
+      if (newline != std::string::npos) {
+        const std::string line = pending_.substr(0, newline);
+        pending_.erase(0, newline + 1);
+        return Json::parse(line);
+      }
+      if (!readSome(out_, pending_)) {
+        return std::nullopt;
+      }
+    }
+  }
+
+ private:
+  static bool readSome(int fd, std::string& into) {
+    pollfd p{fd, POLLIN, 0};
+    if (::poll(&p, 1, 10000) <= 0) {
+      return false;
+    }
+    char buffer[65536];
+    const ssize_t n = ::read(fd, buffer, sizeof(buffer));
+    if (n <= 0) {
+      return false;
+    }
+    into.append(buffer, static_cast<std::size_t>(n));
+    return true;
+  }
+
+  pid_t pid_ = -1;
+  int out_ = -1;
+  int err_ = -1;
+  int port_ = 0;
+  std::string pending_;
+};
+
+class CollectorToolTest : public ::testing::Test {
+ protected:
+  void SetUp() override { certs = root.path() / "certs"; }
+
+  std::vector<std::string> baseArgs() const { return {"--generate-cert", certs.string(), "--port", "0"}; }
+
+  // A real HTTPS backend that posts every event at once to `url`.
+  std::shared_ptr<HTTPSPostBackend> backendFor(const std::string& url) {
+    EXPECT_TRUE(URLSession::setExtraCAFile((certs / "ca.pem").string()));
+    Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(true));
+    transport = ReportingSessionConnectivityHelper::initWithDelegate({}, 4);
+    Dictionary client{{"post_url", url}, {"event_threshold", 49}};
+    auto b = HTTPSPostBackend::initWithName("httpsPost", Value(Dictionary{{"clients", Array{Value(client)}}}),
+                                            std::string("Family"));
+    b->setCompType(7);
+    b->setSessionID(77);
+    b->setUserInfoDict(Value(Dictionary{{"clientName", "demo"}, {"serviceName", "cli"}}));
+    b->setReportingSessionConnectivityDelegate(transport);
+    b->updateState();
+    return b;
+  }
+
+  TempRoot root;
+  fs::path certs;
+  std::shared_ptr<ReportingSessionConnectivityHelper> transport;
+};
+
+TEST_F(CollectorToolTest, BackendRecordsArriveOneLinePerRecordWithSenderSessionAndCheckedDigest) {
+  auto args = baseArgs();
+  args.insert(args.end(), {"--digest-key", "secret"});
+  CollectorProcess collector(args);
+  ASSERT_GT(collector.port(), 0);
+  auto b = backendFor(collector.url("/post"));
+  b->setDigestKey(Data{'s', 'e', 'c', 'r', 'e', 't'});
+  b->setBatchEvents(true);
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  b->sendMessage(Value(Dictionary{{"ClientData", Dictionary{{"n", 1}}}}), now, 4, 5, 0);
+  b->sendMessage(Value(Dictionary{{"ClientData", Dictionary{{"n", 2}}}}), now, 4, 5, 0);
+  b->flushMessagesWithCompletion(nullptr);
+  for (int n : {1, 2}) {
+    const auto line = collector.nextLine();
+    ASSERT_TRUE(line);
+    EXPECT_EQ((*line)["kind"], "record");
+    EXPECT_EQ((*line)["path"], "/post");
+    EXPECT_EQ((*line)["_sender"], "YJ");
+    EXPECT_EQ((*line)["_sessionID"], 77);
+    EXPECT_EQ((*line)["digest"], "valid");
+    EXPECT_EQ((*line)["gzip"], true);
+    EXPECT_EQ((*line)["record"]["n"], n);
+    EXPECT_EQ((*line)["headers"][0][0], "Host");
+  }
+
+  // A wrong key on the device side shows as an invalid digest.
+  b->setDigestKey(Data{'x'});
+  b->sendMessage(Value(Dictionary{}), now, 4, 5, 1);
+  const auto line = collector.nextLine();
+  ASSERT_TRUE(line);
+  EXPECT_EQ((*line)["digest"], "invalid");
+}
+
+TEST_F(CollectorToolTest, ChosenServerErrorDisablesTheBackend) {
+  auto args = baseArgs();
+  args.insert(args.end(), {"--status", "503"});
+  CollectorProcess collector(args);
+  auto b = backendFor(collector.url("/post"));
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  log::LogCapture logs;
+  b->sendMessage(Value(Dictionary{}), now, 1, 1, 1);
+  ASSERT_TRUE(collector.nextLine());
+  ASSERT_TRUE(logs.waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"));
+  EXPECT_EQ(b->state(), kBackendStateDisabled);
+}
+
+struct CurlAnswer {
+  long status = 0;
+  std::string body;
+};
+
+CurlAnswer curlPost(const std::string& url, const fs::path& ca, const std::string& body,
+                    const std::vector<std::string>& headers) {
+  CURL* curl = curl_easy_init();
+  CurlAnswer answer;
+  curl_slist* list = nullptr;
+  for (const auto& h : headers) {
+    list = curl_slist_append(list, h.c_str());
+  }
+  curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
+  curl_easy_setopt(curl, CURLOPT_CAINFO, ca.c_str());
+  curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body.data());
+  curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
+  curl_easy_setopt(curl, CURLOPT_HTTPHEADER, list);
+  curl_easy_setopt(curl, CURLOPT_TIMEOUT, 20L);
+  curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, +[](char* p, size_t s, size_t n, void* u) {
+    static_cast<std::string*>(u)->append(p, s * n);
+    return s * n;
+  });
+  curl_easy_setopt(curl, CURLOPT_WRITEDATA, &answer.body);
+  if (curl_easy_perform(curl) == CURLE_OK) {
+    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &answer.status);
+  }
+  curl_slist_free_all(list);
+  curl_easy_cleanup(curl);
+  return answer;
+}
+
+TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLocation) {
+  const fs::path store = root.path() / "store";
+  auto args = baseArgs();
+  args.insert(args.end(), {"--store", store.string(), "--log-data-path", "/logs"});
+  CollectorProcess collector(args);
+  const std::string file = "diagnostic log\n" + std::string(5000, 'z');
+  const auto upload = curlPost(collector.url("/upload?uuid=abc&sequence=3&filename=x.log.gz&raw=true"), certs / "ca.pem",
+                               gzipOf(file), {"Content-Type: application/octet-stream", "Content-Encoding: gzip"});
+  EXPECT_EQ(upload.status, 200);
+  EXPECT_EQ(upload.body, "success");
+  auto line = collector.nextLine();
+  ASSERT_TRUE(line);
+  EXPECT_EQ((*line)["kind"], "upload");
+  EXPECT_EQ((*line)["query"], "uuid=abc&sequence=3&filename=x.log.gz&raw=true");
+  EXPECT_EQ((*line)["size"], file.size());
+  EXPECT_EQ((*line)["sha256"], collector::sha256Hex(file));
+  const auto stored = file::readAll((*line)["stored"].get<std::string>(), 1 << 20);
+  ASSERT_TRUE(stored);
+  EXPECT_EQ(std::string(stored->begin(), stored->end()), file);
+
+  const auto logData = curlPost(collector.url("/logs"), certs / "ca.pem", "archived log data", {});
+  line = collector.nextLine();
+  ASSERT_TRUE(line);
+  EXPECT_EQ((*line)["kind"], "logdata");
+  EXPECT_EQ(logData.body, (*line)["stored"]);
+  EXPECT_EQ(fs::path(logData.body).parent_path(), store);
+}
+
+TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
+  auto args = baseArgs();
+  args.insert(args.end(), {"--max-body", "100000", "--max-inflated", "200000"});
+  CollectorProcess collector(args);
+  const auto bomb = curlPost(collector.url("/post"), certs / "ca.pem", gzipOf(std::string(4 << 20, 'a')),
+                             {"Content-Encoding: gzip"});
+  EXPECT_EQ(bomb.status, 413);
+  auto line = collector.nextLine();
+  ASSERT_TRUE(line);
+  EXPECT_EQ((*line)["kind"], "refused");
+  const auto big = curlPost(collector.url("/post"), certs / "ca.pem", std::string(100001, 'a'), {});
+  EXPECT_EQ(big.status, 413);
+  ASSERT_TRUE(collector.nextLine());
+  const auto broken = curlPost(collector.url("/post"), certs / "ca.pem", "\x1f\x8bnot gzip", {});
+  EXPECT_EQ(broken.status, 415);
+  ASSERT_TRUE(collector.nextLine());
+  // Still answering.
+  const auto fine = curlPost(collector.url("/post"), certs / "ca.pem", "{\"postTime\":1}", {});
+  EXPECT_EQ(fine.status, 200);
+  line = collector.nextLine();
+  ASSERT_TRUE(line);
+  EXPECT_EQ((*line)["kind"], "envelope");
+}
+
+TEST_F(CollectorToolTest, ServesStaticFilesWithLastModifiedAndNothingOutsideItsFolder) {
+  const fs::path www = root.path() / "www";
+  fs::create_directories(www);
+  std::ofstream(www / "dravon") << "signed bag";
+  std::ofstream(root.path() / "secret") << "no";
+  auto args = baseArgs();
+  args.insert(args.end(), {"--serve", www.string()});
+  CollectorProcess collector(args);
+  const auto get = [&](const std::string& path, const std::vector<std::string>& headers) {
+    CURL* curl = curl_easy_init();
+    CurlAnswer answer;
+    curl_slist* list = nullptr;
+    for (const auto& h : headers) {
+      list = curl_slist_append(list, h.c_str());
+    }
+    curl_easy_setopt(curl, CURLOPT_URL, collector.url(path).c_str());
+    curl_easy_setopt(curl, CURLOPT_CAINFO, (certs / "ca.pem").c_str());
+    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, list);
+    curl_easy_setopt(curl, CURLOPT_PATH_AS_IS, 1L);
+    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, +[](char* p, size_t s, size_t n, void* u) {
+      static_cast<std::string*>(u)->append(p, s * n);
+      return s * n;
+    });
+    curl_easy_setopt(curl, CURLOPT_WRITEDATA, &answer.body);
+    curl_easy_perform(curl);
+    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &answer.status);
+    curl_slist_free_all(list);
+    curl_easy_cleanup(curl);
+    return answer;
+  };
+  const auto bag = get("/dravon?version=8.1", {});
+  EXPECT_EQ(bag.status, 200);
+  EXPECT_EQ(bag.body, "signed bag");
+  EXPECT_EQ(get("/dravon", {"If-Modified-Since: Fri, 01 Jan 2100 00:00:00 GMT"}).status, 304);
+  EXPECT_EQ(get("/../secret", {}).status, 404);
+  EXPECT_EQ(get("/missing", {}).status, 404);
+}
+
+TEST_F(CollectorToolTest, RefusesToStartWithoutCertificateOrWithABadOne) {
+  std::ofstream(root.path() / "bad.pem") << "not a certificate";
+  for (const auto& args : std::vector<std::vector<std::string>>{
+           {"--port", "0"}, {"--cert", (root.path() / "bad.pem").string(), "--key", (root.path() / "bad.pem").string()}}) {
+    const pid_t pid = ::fork();
+    if (pid == 0) {
+      const int devnull = ::open("/dev/null", O_WRONLY);
+      ::dup2(devnull, 2);
+      std::vector<std::string> all = args;
+      all.insert(all.begin(), ZERITH_COLLECTOR_TOOL);
+      std::vector<char*> argv;
+      for (auto& a : all) {
+        argv.push_back(a.data());
+      }
+      argv.push_back(nullptr);
+      ::execv(argv[0], argv.data());
+      ::_exit(127);
+    }
+    int status = 0;
+    ::waitpid(pid, &status, 0);
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_NE(WEXITSTATUS(status), 0);
+    EXPECT_NE(WEXITSTATUS(status), 127);
+  }
+}
+
+}  // namespace
+}  // namespace zerith::test
