@@ -49,6 +49,7 @@ struct Settings {
   int idleSessions = 10;
   std::chrono::milliseconds stall{30000};
   bool smoke = false;
+  std::string collector = "zerith-collector";
 };
 
 struct Report {
@@ -178,20 +179,21 @@ std::string kib(const std::optional<ProcSample>& s, std::uint64_t ProcSample::*f
 }
 
 void print(const Settings& s, const std::vector<Report>& reports) {
-  std::printf("clients=%d events=%llu rate=%s window=%d\n", s.load.clients, static_cast<unsigned long long>(s.events),
+  std::printf("clients=%d events=%llu rate=%s window=%d collector=%s\n", s.load.clients,
+              static_cast<unsigned long long>(s.events),
               s.load.eventsPerSecond > 0 ? std::to_string(static_cast<long long>(s.load.eventsPerSecond)).c_str()
                                          : "max",
-              s.load.window);
+              s.load.window, s.collector.c_str());
   std::printf(
       "| pipeline | accepted/s | delivered/s | CPU µs/event | peak RSS KiB | private KiB @%llu | private KiB @end | "
-      "requests | gzip | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|---|\n",
+      "posts | gzip | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|---|\n",
       static_cast<unsigned long long>(s.memorySample));
   for (const auto& r : reports) {
     std::printf("| %s | %.0f | %.0f | %.2f | %s | %s | %s | %llu | %llu | %llu | %lld | %llu |\n", r.pipeline.c_str(),
                 r.acceptedPerSecond(), r.deliveredPerSecond(), r.cpuMicrosPerEvent(),
                 kib(r.after, &ProcSample::peakRssKiB).c_str(), kib(r.atSample, &ProcSample::privateRssKiB).c_str(),
-                kib(r.after, &ProcSample::privateRssKiB).c_str(), static_cast<unsigned long long>(r.counts.requests),
-                static_cast<unsigned long long>(r.counts.gzipRequests), static_cast<unsigned long long>(r.counts.records),
+                kib(r.after, &ProcSample::privateRssKiB).c_str(), static_cast<unsigned long long>(r.counts.posts),
+                static_cast<unsigned long long>(r.counts.gzipPosts), static_cast<unsigned long long>(r.counts.records),
                 static_cast<long long>(r.expected) - static_cast<long long>(r.counts.records),
                 static_cast<unsigned long long>(r.counts.duplicates));
   }
@@ -245,6 +247,8 @@ int main(int argc, char** argv) {
   app.add_option("--memory-sample", s.memorySample, "also sample memory after this many delivered events");
   app.add_option("--idle-seconds", s.idleSeconds, "measure the idle process with open sessions this long first");
   app.add_option("--idle-sessions", s.idleSessions, "sessions held open while idle");
+  app.add_option("--collector", s.collector, "zerith-collector (one line per record) or test-server")
+      ->check(CLI::IsMember({"zerith-collector", "test-server"}));
   app.add_flag("--smoke", s.smoke, "exit 1 unless every pipeline delivered every event exactly once");
   CLI11_PARSE(app, argc, argv);
 
@@ -261,7 +265,8 @@ int main(int argc, char** argv) {
   }
   std::vector<Report> reports;
   {
-    Collector collector;
+    Collector collector(s.collector == "test-server" ? Collector::Server::TestServer
+                                                     : Collector::Server::ZerithCollector);
     for (const auto& pipeline : s.pipelines) {
       reports.push_back(pipeline == "peer" ? runPeer(s, collector, folder) : runZerithd(s, collector));
     }

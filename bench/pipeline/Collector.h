@@ -1,11 +1,14 @@
 #pragma once
 
-// The collector of the pipeline benchmark: an HTTPS server on loopback
-// (tests/support/HttpsTestServer, kept-alive connections, no request kept)
-// that counts the records of every posted JSON envelope by their event
+// The collector of the pipeline benchmark: an HTTPS server on loopback that
+// counts the records of every posted JSON envelope by their event
 // identifier, so that an event lost or delivered twice shows in the counts.
-// Bodies sent with "Content-Encoding: gzip" arrive inflated (the server
-// library inflates them); they are counted as compressed requests.
+// Two servers can do the receiving:
+// - zerith-collector's server (tools/zerith-collector), run in this
+//   process: it inflates gzip bodies, parses each envelope and hands one
+//   JSON line per record, which is counted here;
+// - the test support's HTTPS server (kept-alive connections, no request
+//   kept), whose library inflates gzip bodies; the body is scanned here.
 
 #include <chrono>
 #include <condition_variable>
@@ -14,10 +17,14 @@
 #include <mutex>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <vector>
 
 namespace zerith::test {
 class HttpsTestServer;
+}
+namespace zerith::collector {
+class CollectorServer;
 }
 
 namespace zerith::bench {
@@ -52,17 +59,19 @@ bool forEachEventId(std::string_view body, OnId&& onId) {
 
 class Collector {
  public:
+  enum class Server { ZerithCollector, TestServer };
+
   struct Counts {
     std::uint64_t records = 0;      // distinct expected identifiers seen
     std::uint64_t duplicates = 0;   // identifiers seen again
     std::uint64_t unexpected = 0;   // identifiers outside the expected range
-    std::uint64_t requests = 0;
-    std::uint64_t gzipRequests = 0;
-    std::uint64_t malformed = 0;    // bodies with an unreadable identifier
+    std::uint64_t posts = 0;        // requests (test server) or record lines (zerith-collector)
+    std::uint64_t gzipPosts = 0;    // of those, sent gzip-compressed
+    std::uint64_t malformed = 0;    // unreadable identifiers, refused requests
     std::uint64_t inflatedBytes = 0;
   };
 
-  Collector();
+  explicit Collector(Server server = Server::ZerithCollector);
   ~Collector();
   Collector(const Collector&) = delete;
   Collector& operator=(const Collector&) = delete;
@@ -80,12 +89,15 @@ class Collector {
 
  private:
   void count(std::string_view body, bool gzip);
+  void countLine(const std::string& line);
 
   mutable std::mutex mutex_;
   mutable std::condition_variable changed_;
   std::vector<bool> seen_;
   Counts counts_;
-  std::unique_ptr<test::HttpsTestServer> server_;
+  std::unique_ptr<test::HttpsTestServer> testServer_;
+  std::unique_ptr<collector::CollectorServer> collectorServer_;
+  std::thread collectorThread_;
 };
 
 }  // namespace zerith::bench

@@ -60,7 +60,7 @@ std::string PeerPipeline::configuration(const Options& o, const std::filesystem:
        "       batch-lines(" << o.batchLines << ") batch-bytes(0) batch-timeout(200)\n"
        "       headers(\"Content-Type: application/json\")\n"
        "       tls(ca-file(\"" << o.caFile.string() << "\") peer-verify(yes))\n"
-       "       body-prefix(\"{\\\"events\\\":[\") delimiter(\",\") body-suffix(\"]}\")\n"
+       "       body-prefix(\"{\\\"postTime\\\":0,\\\"events\\\":[\") delimiter(\",\") body-suffix(\"]}\")\n"
        "       body(\"$(format-json --key .ev.* --rekey .ev.* --shift 4)\"));\n"
        "};\n"
        "log { source(s_bench); parser(p_json); destination(d_collector); flags(flow-control); };\n";

@@ -6,7 +6,8 @@
 // or written):
 //
 //   unix-stream() source of JSON lines -> json-parser() -> http() destination
-//   posting batches of 50 records as {"events":[...]} to the collector, one
+//   posting batches of 50 records as {"postTime":0,"events":[...]} (the
+//   envelope's shape, its post time left constant) to the collector, one
 //   worker, the path under flags(flow-control) so that a full queue stops
 //   the reading instead of dropping events.
 //
