@@ -171,6 +171,11 @@ Report runZerithd(const Settings& s, Collector& collector) {
   measure(
       r, s, collector, daemon.pid(), [&] { return open(s.idleSessions, 1000); },
       [&] { return runZerithdLoad(s.load, sessions); });
+  if (!r.lossless()) {
+    // The daemon's errors say where events went (a failed post drops its batch).
+    const std::string log = daemon.output();
+    r.error += "\n" + log.substr(log.size() > 4000 ? log.size() - 4000 : 0);
+  }
   return r;
 }
 

@@ -75,9 +75,24 @@ LoadResult runZerithdLoad(const LoadOptions& o, std::vector<std::unique_ptr<Zeri
   return runClients(o, [&](int c, const Pacer& pacer, std::atomic<std::uint64_t>& accepted,
                            std::atomic<std::uint64_t>& refused) -> std::string {
     Zerith& session = *sessions[static_cast<std::size_t>(c)];
-    std::mutex mutex;
-    std::condition_variable answered;
-    std::uint64_t outstanding = 0;
+    // Shared with the completions, which may still run after this client
+    // gave up (a connection that goes away fails its calls later).
+    struct Window {
+      std::mutex mutex;
+      std::condition_variable answered;
+      std::uint64_t outstanding = 0;
+      std::uint64_t replies = 0;
+    };
+    auto window = std::make_shared<Window>();
+    // The replies counted so far join the total however this client ends.
+    struct Tally {
+      std::shared_ptr<Window> window;
+      std::atomic<std::uint64_t>& accepted;
+      ~Tally() {
+        std::lock_guard lock(window->mutex);
+        accepted.fetch_add(window->replies);
+      }
+    } tally{window, accepted};
     const std::uint64_t first = static_cast<std::uint64_t>(c) * o.eventsPerClient;
     for (std::uint64_t i = 0; i < o.eventsPerClient; ++i) {
       pacer.wait(i);
@@ -85,28 +100,35 @@ LoadResult runZerithdLoad(const LoadOptions& o, std::vector<std::unique_ptr<Zeri
                                      {kZerithMessageParametersType, Value(unsigned{kEventType})},
                                      {kZerithMessageParametersPayload, eventPayload(first + i)}});
       {
-        std::unique_lock lock(mutex);
-        if (!answered.wait_for(lock, std::chrono::seconds(60),
-                               [&] { return outstanding < static_cast<std::uint64_t>(o.window); })) {
+        std::unique_lock lock(window->mutex);
+        if (!window->answered.wait_for(lock, std::chrono::seconds(60), [&] {
+              return window->outstanding < static_cast<std::uint64_t>(o.window);
+            })) {
           return "no reply from zerithd for 60 s";
         }
-        ++outstanding;
+        ++window->outstanding;
       }
-      session.sendMessageWithDictionary(message, [&](Value) {
+      if (!session.isValid()) {
+        return "the connection to zerithd was invalidated";
+      }
+      session.sendMessageWithDictionary(message, [window](Value) {
         // A nil result is the answer of a backend that batched the event:
-        // the daemon took it either way. Refusals show as a failed call,
-        // which also arrives here as nil; the collector's count tells.
-        accepted.fetch_add(1, std::memory_order_relaxed);
-        std::lock_guard lock(mutex);
-        --outstanding;
-        answered.notify_one();
+        // the daemon took it either way. A failed call also arrives here as
+        // nil; the collector's count tells.
+        std::lock_guard lock(window->mutex);
+        ++window->replies;
+        --window->outstanding;
+        window->answered.notify_one();
       });
     }
-    std::unique_lock lock(mutex);
-    if (!answered.wait_for(lock, std::chrono::seconds(60), [&] { return outstanding == 0; })) {
+    std::unique_lock lock(window->mutex);
+    if (!window->answered.wait_for(lock, std::chrono::seconds(60), [&] { return window->outstanding == 0; })) {
       return "replies missing from zerithd after 60 s";
     }
     lock.unlock();
+    if (!session.isValid()) {
+      return "the connection to zerithd was invalidated";
+    }
     // The last partial batch goes out with the client's flush.
     if (auto flushed = session.flushMessages(std::chrono::seconds(60)); !flushed) {
       refused.fetch_add(1);

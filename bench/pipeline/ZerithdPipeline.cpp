@@ -99,9 +99,9 @@ std::unique_ptr<Zerith> ZerithdPipeline::openSession(std::uint32_t sessionID, st
   const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(static_cast<unsigned long long>(sessionID))},
                               {kZerithSessionInfoClientType, Value(static_cast<unsigned long long>(kClientType))},
                               {kZerithSessionInfoBatchEvent, Value(true)}});
-  const Value userInfo(Dictionary{{kZerithUserInfoClientName, Value(kClientName)},
-                                  {kZerithUserInfoServiceName, Value("playback")}});
-  if (auto r = session->setSessionInfo(info, userInfo, Value(), false, 10s); !r) {
+  // No user info: the session does not require it, and the storebag's
+  // client entry then applies without the consent and locale checks.
+  if (auto r = session->setSessionInfo(info, Value(), Value(), false, 10s); !r) {
     *why = "setSessionInfo: " + r.error->description;
     return nullptr;
   }
