@@ -205,10 +205,17 @@ void print(const Settings& s, const std::vector<Report>& reports) {
   for (const auto& r : reports) {
     if (r.idleBefore && r.idleAfter && r.idleSeconds > 0) {
       const double perMinute = 60.0 / r.idleSeconds;
-      std::printf("idle %s, %d sessions, %.0f s: CPU %.2f ms/min, wake-ups %.1f/min (voluntary switches)\n",
+      // Switches are summed over the threads alive at each sample: a thread
+      // that ended in between takes its count with it.
+      const std::string wakeups =
+          r.idleAfter->voluntarySwitches >= r.idleBefore->voluntarySwitches
+              ? std::to_string(static_cast<long long>(
+                    static_cast<double>(r.idleAfter->voluntarySwitches - r.idleBefore->voluntarySwitches) * perMinute))
+              : std::string("unknown (threads ended)");
+      std::printf("idle %s, %d sessions, %.0f s: CPU %.2f ms/min, wake-ups %s/min (voluntary switches), threads %llu\n",
                   r.pipeline.c_str(), s.idleSessions, r.idleSeconds,
-                  (r.idleAfter->cpuSeconds - r.idleBefore->cpuSeconds) * 1e3 * perMinute,
-                  static_cast<double>(r.idleAfter->voluntarySwitches - r.idleBefore->voluntarySwitches) * perMinute);
+                  (r.idleAfter->cpuSeconds - r.idleBefore->cpuSeconds) * 1e3 * perMinute, wakeups.c_str(),
+                  static_cast<unsigned long long>(r.idleAfter->threads));
     }
   }
   const Report* z = nullptr;

@@ -65,6 +65,7 @@ std::optional<ProcSample> sampleProcess(pid_t pid) {
   s.privateRssKiB = field(*smaps, "Private_Clean") + field(*smaps, "Private_Dirty");
   std::error_code ec;
   for (const auto& task : std::filesystem::directory_iterator(dir / "task", ec)) {
+    ++s.threads;
     if (const auto t = slurp(task.path() / "status")) {
       s.voluntarySwitches += field(*t, "voluntary_ctxt_switches");
       s.involuntarySwitches += field(*t, "nonvoluntary_ctxt_switches");

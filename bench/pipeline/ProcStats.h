@@ -19,6 +19,7 @@ struct ProcSample {
   std::uint64_t peakRssKiB = 0;       // VmHWM
   std::uint64_t rssKiB = 0;           // VmRSS
   std::uint64_t privateRssKiB = 0;    // Private_Clean + Private_Dirty of smaps_rollup
+  std::uint64_t threads = 0;
 };
 
 // nullopt when the process is gone or /proc cannot be read.
