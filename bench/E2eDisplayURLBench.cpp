@@ -7,6 +7,7 @@
 
 #include <benchmark/benchmark.h>
 
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -14,9 +15,11 @@
 #include <chrono>
 #include <cstdlib>
 #include <memory>
+#include <optional>
 #include <thread>
 #include <vector>
 
+#include "bench/pipeline/ProcStats.h"
 #include "ipc/Frame.h"
 #include "platform/FileUtil.h"
 #include "platform/PropertyList.h"
@@ -39,6 +42,43 @@ void reportLatencies(benchmark::State& state, std::vector<double>& micros) {
   state.counters["p99_us"] = at(0.99);
   state.counters["round_trips"] =
       benchmark::Counter(static_cast<double>(micros.size()), benchmark::Counter::kIsRate);
+}
+
+// CPU seconds (user + system) of every thread of this process so far.
+double processCpuSeconds() {
+  rusage usage{};
+  ::getrusage(RUSAGE_SELF, &usage);
+  return static_cast<double>(usage.ru_utime.tv_sec + usage.ru_stime.tv_sec) +
+         static_cast<double>(usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) / 1e6;
+}
+
+// CPU per round trip of this process (both ends of the echo, or the
+// client framework's threads) and, when given, of the daemon: on a loaded
+// machine these hold where the times do not.
+// Voluntary context switches (a thread going to sleep: each is a wake-up
+// later) per round trip tell the thread hand-offs apart from the work.
+struct CpuMark {
+  double clientCpu = processCpuSeconds();
+  std::uint64_t clientSwitches = bench::sampleProcess(::getpid()).value_or(bench::ProcSample{}).voluntarySwitches;
+  std::optional<bench::ProcSample> daemon;
+};
+
+void reportCpu(benchmark::State& state, const CpuMark& before, pid_t daemon) {
+  const double trips = static_cast<double>(state.iterations());
+  if (trips == 0) {
+    return;
+  }
+  state.counters["client_cpu_us"] = (processCpuSeconds() - before.clientCpu) * 1e6 / trips;
+  if (const auto self = bench::sampleProcess(::getpid())) {
+    state.counters["client_sleeps"] = static_cast<double>(self->voluntarySwitches - before.clientSwitches) / trips;
+  }
+  if (before.daemon) {
+    if (const auto after = bench::sampleProcess(daemon)) {
+      state.counters["daemon_cpu_us"] = (after->cpuSeconds - before.daemon->cpuSeconds) * 1e6 / trips;
+      state.counters["daemon_sleeps"] =
+          static_cast<double>(after->voluntarySwitches - before.daemon->voluntarySwitches) / trips;
+    }
+  }
 }
 
 // The frames one fetchDisplayURL: round trip moves.
@@ -92,6 +132,7 @@ void BM_UnixSocketEcho(benchmark::State& state) {
   });
   std::vector<double> micros;
   std::vector<std::uint8_t> body;
+  const CpuMark before;
   for (auto _ : state) {
     const auto start = Clock::now();
     if (!writeAll(client.get(), request) || !readFrame(client.get(), body)) {
@@ -102,6 +143,7 @@ void BM_UnixSocketEcho(benchmark::State& state) {
   }
   ::shutdown(client.get(), SHUT_RDWR);
   echo.join();
+  reportCpu(state, before, 0);
   state.counters["request_bytes"] = static_cast<double>(request.size());
   state.counters["reply_bytes"] = static_cast<double>(reply.size());
   reportLatencies(state, micros);
@@ -138,6 +180,8 @@ void BM_DaemonFetchDisplayURL(benchmark::State& state) {
     return;
   }
   std::vector<double> micros;
+  CpuMark before;
+  before.daemon = bench::sampleProcess(daemon.process->pid());
   for (auto _ : state) {
     const auto start = Clock::now();
     const auto reply = daemon.client->fetchDisplayURL(std::chrono::seconds(10));
@@ -147,6 +191,7 @@ void BM_DaemonFetchDisplayURL(benchmark::State& state) {
     }
     micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
   }
+  reportCpu(state, before, daemon.process->pid());
   reportLatencies(state, micros);
 }
 BENCHMARK(BM_DaemonFetchDisplayURL)->UseRealTime()->MinTime(2.0);

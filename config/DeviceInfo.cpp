@@ -5,11 +5,13 @@
 
 #include <algorithm>
 #include <cctype>
+#include <chrono>
 #include <climits>
 #include <cstdlib>
 #include <ctime>
 #include <functional>
 #include <mutex>
+#include <string>
 
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
@@ -312,7 +314,25 @@ std::optional<std::string> localeCountryCode() {
 }
 
 long timeZoneOffsetSeconds() {
-  ::tzset();
+  // tzset() stats the zone file on every call, and every record asks. It is
+  // re-run when TZ changed and otherwise at most once a second, so a new
+  // zone (TZ or the zone file) still shows within a second.
+  {
+    static std::mutex mutex;
+    static std::string lastTZ;
+    static bool hadTZ = false;
+    static std::chrono::steady_clock::time_point lastRead{};
+    const auto now = std::chrono::steady_clock::now();
+    std::lock_guard lock(mutex);
+    const char* tz = std::getenv("TZ");
+    const bool tzChanged = (tz != nullptr) != hadTZ || (tz && lastTZ != tz);
+    if (tzChanged || lastRead == std::chrono::steady_clock::time_point{} || now - lastRead >= std::chrono::seconds(1)) {
+      ::tzset();
+      hadTZ = tz != nullptr;
+      lastTZ = tz ? tz : "";
+      lastRead = now;
+    }
+  }
   const std::time_t now = std::time(nullptr);
   std::tm local{};
   if (::localtime_r(&now, &local) == nullptr) {

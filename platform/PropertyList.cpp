@@ -388,6 +388,255 @@ bool skipMarkup(std::string_view s, std::size_t& i) {
   return true;
 }
 
+
+// ---- binary writer ---------------------------------------------------------------
+//
+// Writes a Value as "bplist00" directly, without building a libplist tree:
+// libplist's writer sets up and sweeps a 4096-bucket hash table on every
+// call, which costs more than the whole of a small frame. The output is what
+// libplist reads back to the same Value (objects are not uniqued; that is
+// the only difference): integers as 1, 2, 4 or 8 big-endian bytes of their
+// 64 raw bits, reals as 8-byte doubles, dates as libplist 2.2 keeps them
+// (32-bit seconds and microseconds since 2001), text as ASCII or UTF-16BE,
+// strings and keys cut at a NUL byte, nil entries left out.
+class BinaryWriter {
+ public:
+  Data run(const Value& root) {
+    const std::size_t objects = countObjects(root);
+    if (objects == 0) {
+      return {};
+    }
+    refSize_ = objects < 0x100 ? 1 : objects < 0x10000 ? 2 : 4;
+    out_.reserve(64 + objects * 16);
+    out_.insert(out_.end(), {'b', 'p', 'l', 'i', 's', 't', '0', '0'});
+    offsets_.reserve(objects);
+    write(root);
+    const std::uint64_t tableOffset = out_.size();
+    const std::uint64_t maxOffset = offsets_.empty() ? 0 : offsets_.back();
+    const unsigned offsetSize = maxOffset < 0x100 ? 1 : maxOffset < 0x10000 ? 2 : maxOffset < 0x100000000ull ? 4 : 8;
+    for (const std::uint64_t o : offsets_) {
+      putBigEndian(o, offsetSize);
+    }
+    out_.insert(out_.end(), 6, 0);
+    out_.push_back(static_cast<std::uint8_t>(offsetSize));
+    out_.push_back(static_cast<std::uint8_t>(refSize_));
+    putBigEndian(offsets_.size(), 8);
+    putBigEndian(0, 8);  // the root is object 0
+    putBigEndian(tableOffset, 8);
+    return std::move(out_);
+  }
+
+ private:
+  // Objects in the subtree of `v`: nil counts none, a dictionary one per
+  // key besides its values.
+  static std::size_t countObjects(const Value& v) {
+    switch (v.type()) {
+      case Value::Type::Nil: return 0;
+      case Value::Type::Array: {
+        std::size_t n = 1;
+        for (const auto& e : *v.array()) {
+          n += countObjects(e);
+        }
+        return n;
+      }
+      case Value::Type::Dict: {
+        std::size_t n = 1;
+        for (const auto& [k, e] : *v.dict()) {
+          const std::size_t c = countObjects(e);
+          n += c == 0 ? 0 : 1 + c;
+        }
+        return n;
+      }
+      default: return 1;
+    }
+  }
+
+  static std::string_view untilNul(const std::string& s) {
+    const auto nul = s.find('\0');
+    return std::string_view(s).substr(0, nul);
+  }
+
+  void putBigEndian(std::uint64_t v, unsigned bytes) {
+    for (unsigned i = bytes; i-- > 0;) {
+      out_.push_back(static_cast<std::uint8_t>(v >> (8 * i)));
+    }
+  }
+
+  void putInteger(std::uint64_t v) {
+    if (v < 0x100) {
+      out_.push_back(0x10);
+      putBigEndian(v, 1);
+    } else if (v < 0x10000) {
+      out_.push_back(0x11);
+      putBigEndian(v, 2);
+    } else if (v < 0x100000000ull) {
+      out_.push_back(0x12);
+      putBigEndian(v, 4);
+    } else {
+      out_.push_back(0x13);
+      putBigEndian(v, 8);
+    }
+  }
+
+  // A marker with its count: in the low nibble, or 0xF and an integer.
+  void putMarker(std::uint8_t kind, std::size_t count) {
+    if (count < 15) {
+      out_.push_back(static_cast<std::uint8_t>(kind | count));
+    } else {
+      out_.push_back(static_cast<std::uint8_t>(kind | 0x0f));
+      putInteger(count);
+    }
+  }
+
+  void putDouble(std::uint8_t marker, double d) {
+    std::uint64_t bits = 0;
+    std::memcpy(&bits, &d, sizeof bits);
+    out_.push_back(marker);
+    putBigEndian(bits, 8);
+  }
+
+  void putString(std::string_view s) {
+    offsets_.push_back(out_.size());
+    if (std::all_of(s.begin(), s.end(), [](char c) { return static_cast<unsigned char>(c) < 0x80; })) {
+      putMarker(0x50, s.size());
+      out_.insert(out_.end(), s.begin(), s.end());
+      return;
+    }
+    std::vector<std::uint16_t> units;
+    units.reserve(s.size());
+    const auto* p = reinterpret_cast<const unsigned char*>(s.data());
+    const auto* end = p + s.size();
+    while (p < end) {
+      std::uint32_t code = 0xfffd;
+      std::size_t extra = 0;
+      if (*p < 0x80) {
+        code = *p;
+      } else if ((*p & 0xe0) == 0xc0) {
+        extra = 1, code = *p & 0x1f;
+      } else if ((*p & 0xf0) == 0xe0) {
+        extra = 2, code = *p & 0x0f;
+      } else if ((*p & 0xf8) == 0xf0) {
+        extra = 3, code = *p & 0x07;
+      }
+      bool valid = static_cast<std::size_t>(end - p) > extra;
+      for (std::size_t i = 1; valid && i <= extra; ++i) {
+        valid = (p[i] & 0xc0) == 0x80;
+        code = (code << 6) | (p[i] & 0x3f);
+      }
+      if (!valid || code > 0x10ffff || (code >= 0xd800 && code <= 0xdfff)) {
+        // Not UTF-8: one replacement character for the byte.
+        code = 0xfffd;
+        extra = 0;
+      }
+      p += extra + 1;
+      if (code >= 0x10000) {
+        code -= 0x10000;
+        units.push_back(static_cast<std::uint16_t>(0xd800 | (code >> 10)));
+        units.push_back(static_cast<std::uint16_t>(0xdc00 | (code & 0x3ff)));
+      } else {
+        units.push_back(static_cast<std::uint16_t>(code));
+      }
+    }
+    putMarker(0x60, units.size());
+    for (const std::uint16_t u : units) {
+      putBigEndian(u, 2);
+    }
+  }
+
+  // Writes `v` (not nil) and its subtree in preorder: the object numbers
+  // are the order of writing.
+  void write(const Value& v) {
+    switch (v.type()) {
+      case Value::Type::Nil: return;
+      case Value::Type::Bool:
+        offsets_.push_back(out_.size());
+        out_.push_back(v.boolValue() ? 0x09 : 0x08);
+        return;
+      case Value::Type::Int:
+      case Value::Type::UInt:
+        offsets_.push_back(out_.size());
+        putInteger(v.unsignedValue());
+        return;
+      case Value::Type::Real:
+        offsets_.push_back(out_.size());
+        putDouble(0x23, v.doubleValue());
+        return;
+      case Value::Type::Date: {
+        // As libplist 2.2 stores it: clamped 32-bit seconds and whole
+        // microseconds since 2001.
+        double rel = v.date()->secondsSince1970 - kEpochOffset;
+        rel = std::isnan(rel) ? 0.0 : std::clamp(rel, -2147483648.0, 2147483647.0);
+        const auto sec = static_cast<std::int32_t>(rel);
+        const auto usec = static_cast<std::int32_t>((rel - sec) * 1e6);
+        offsets_.push_back(out_.size());
+        putDouble(0x33, sec + usec / 1e6);
+        return;
+      }
+      case Value::Type::String: putString(untilNul(*v.string())); return;
+      case Value::Type::Data:
+        offsets_.push_back(out_.size());
+        putMarker(0x40, v.data()->size());
+        out_.insert(out_.end(), v.data()->begin(), v.data()->end());
+        return;
+      case Value::Type::Array: {
+        const std::size_t self = offsets_.size();
+        offsets_.push_back(out_.size());
+        std::size_t n = 0;
+        std::size_t next = self + 1;
+        std::vector<std::size_t> refs;
+        for (const auto& e : *v.array()) {
+          if (const std::size_t c = countObjects(e)) {
+            refs.push_back(next);
+            next += c;
+            ++n;
+          }
+        }
+        putMarker(0xa0, n);
+        for (const std::size_t r : refs) {
+          putBigEndian(r, refSize_);
+        }
+        for (const auto& e : *v.array()) {
+          write(e);
+        }
+        return;
+      }
+      case Value::Type::Dict: {
+        const std::size_t self = offsets_.size();
+        offsets_.push_back(out_.size());
+        std::vector<std::size_t> counts;
+        for (const auto& [k, e] : *v.dict()) {
+          if (const std::size_t c = countObjects(e)) {
+            counts.push_back(c);
+          }
+        }
+        const std::size_t n = counts.size();
+        putMarker(0xd0, n);
+        // Keys are objects self+1 .. self+n, then each value's subtree.
+        for (std::size_t i = 0; i < n; ++i) {
+          putBigEndian(self + 1 + i, refSize_);
+        }
+        std::size_t next = self + 1 + n;
+        for (const std::size_t c : counts) {
+          putBigEndian(next, refSize_);
+          next += c;
+        }
+        for (const auto& [k, e] : *v.dict()) {
+          if (!e.isNil()) {
+            putString(untilNul(k));
+          }
+        }
+        for (const auto& [k, e] : *v.dict()) {
+          write(e);
+        }
+        return;
+      }
+    }
+  }
+
+  Data out_;
+  std::vector<std::uint64_t> offsets_;
+  unsigned refSize_ = 1;
+};
 }  // namespace
 
 bool looksBinary(Bytes bytes) { return bytes.size() >= 8 && std::memcmp(bytes.data(), "bplist00", 8) == 0; }
@@ -485,18 +734,7 @@ std::optional<Value> decode(Bytes bytes, const Limits& limits, std::string* erro
   return looksBinary(bytes) ? decodeBinary(bytes, limits, error) : decodeXml(bytes, limits, error);
 }
 
-Data encodeBinary(const Value& value) {
-  PlistPtr root(toNode(value));
-  if (!root) {
-    return {};
-  }
-  char* out = nullptr;
-  std::uint32_t len = 0;
-  plist_to_bin(root.get(), &out, &len);
-  Data data(reinterpret_cast<std::uint8_t*>(out), reinterpret_cast<std::uint8_t*>(out) + (out ? len : 0));
-  plist_to_bin_free(out);
-  return data;
-}
+Data encodeBinary(const Value& value) { return BinaryWriter().run(value); }
 
 std::string encodeXml(const Value& value) {
   PlistPtr root(toNode(value));

@@ -1,6 +1,7 @@
 #include "platform/SerialQueue.h"
 
 #include <algorithm>
+#include <atomic>
 #include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
@@ -19,18 +20,53 @@ namespace zerith {
 
 namespace {
 
+struct ThreadPool;
+thread_local ThreadPool* tPool = nullptr;
+
+// A pool whose threads may wait for a queue's turn, and the turn may need a
+// thread of the same pool (a sync onto a queue whose queued blocks wait for
+// a drainer). When every thread of the pool would be waiting so, one more
+// thread joins: a pool never starves itself. Threads are not taken away
+// again; their number stays at the most that ever waited at once, plus one.
 struct ThreadPool {
   asio::io_context context;
   asio::executor_work_guard<asio::io_context::executor_type> work{context.get_executor()};
-  std::vector<std::thread> threads;
+  std::atomic<unsigned> threads{0};
+  std::atomic<unsigned> waiting{0};
 
   explicit ThreadPool(unsigned count) {
     for (unsigned i = 0; i < count; ++i) {
-      threads.emplace_back([this] { context.run(); });
-      threads.back().detach();
+      addThread();
     }
   }
+
+  void addThread() {
+    threads.fetch_add(1);
+    std::thread([this] {
+      tPool = this;
+      context.run();
+    }).detach();
+  }
+
+  // Around a wait of the calling thread for a turn of a queue of this pool.
+  bool willWait() {
+    if (tPool != this) {
+      return false;
+    }
+    if (waiting.fetch_add(1) + 1 >= threads.load()) {
+      addThread();
+    }
+    return true;
+  }
+  void doneWaiting() { waiting.fetch_sub(1); }
 };
+
+ThreadPool& threadPool(Pool pool) {
+  // Leaked on purpose: detached pool threads may run until the process ends.
+  static ThreadPool* general = new ThreadPool(std::max(8u, 2 * std::thread::hardware_concurrency()));
+  static ThreadPool* transport = new ThreadPool(2);
+  return pool == Pool::Transport ? *transport : *general;
+}
 
 thread_local std::vector<const SerialQueue::State*> tCurrentQueues;
 
@@ -41,12 +77,7 @@ struct CurrentScope {
 
 }  // namespace
 
-asio::io_context& ioContext(Pool pool) {
-  // Leaked on purpose: detached pool threads may run until the process ends.
-  static ThreadPool* general = new ThreadPool(std::max(8u, 2 * std::thread::hardware_concurrency()));
-  static ThreadPool* transport = new ThreadPool(2);
-  return pool == Pool::Transport ? transport->context : general->context;
-}
+asio::io_context& ioContext(Pool pool) { return threadPool(pool).context; }
 
 struct SerialQueue::State : std::enable_shared_from_this<SerialQueue::State> {
   struct Ticket {
@@ -59,6 +90,7 @@ struct SerialQueue::State : std::enable_shared_from_this<SerialQueue::State> {
 
   std::string label;
   asio::io_context* context = nullptr;
+  ThreadPool* pool = nullptr;
   std::mutex mutex;
   std::condition_variable granted;
   std::deque<Item> items;
@@ -114,7 +146,8 @@ struct SerialQueue::Timer::Impl {
 
 SerialQueue::SerialQueue(std::string label, Pool pool) : state_(std::make_shared<State>()) {
   state_->label = std::move(label);
-  state_->context = &ioContext(pool);
+  state_->pool = &threadPool(pool);
+  state_->context = &state_->pool->context;
 }
 
 const std::string& SerialQueue::label() const { return state_->label; }
@@ -143,7 +176,12 @@ SerialQueue::Turn::Turn(const SerialQueue& queue) : state_(queue.state_.get()) {
       state_->active = true;
       state_->schedule();
     }
+    // The drainer that grants the turn needs a thread of the pool.
+    const bool counted = state_->pool->willWait();
     state_->granted.wait(lock, [&] { return ticket.granted; });
+    if (counted) {
+      state_->pool->doneWaiting();
+    }
   }
   tCurrentQueues.push_back(state_);
 }

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <limits>
 #include <cctype>
 #include <cerrno>
 #include <cstdlib>
@@ -154,7 +155,10 @@ struct TransferEngine::Impl {
       for (auto& [easy, task] : active) {
         flush(*task, *task->transfer_);
       }
-      int waitMs = 1000;
+      // Idle (no transfer, no timer) the thread sleeps until a command wakes
+      // it: an idle daemon has no wake-ups. With transfers under way
+      // libcurl shortens the wait to its own time-outs.
+      int waitMs = active.empty() ? std::numeric_limits<int>::max() : 1000;
       if (!timers.empty()) {
         const auto until = std::chrono::ceil<std::chrono::milliseconds>(timers.begin()->first - Clock::now()).count();
         waitMs = static_cast<int>(std::clamp<long long>(until, 0, waitMs));

@@ -3,6 +3,7 @@
 #include <atomic>
 #include <future>
 #include <latch>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -29,6 +30,35 @@ TEST(SerialQueueTest, AsyncBlocksRunInOrderOneAtATime) {
   EXPECT_FALSE(overlapped);
   ASSERT_EQ(seen.size(), 1000u);
   for (int i = 0; i < 1000; ++i) EXPECT_EQ(seen[static_cast<std::size_t>(i)], i);
+}
+
+// Every pool thread runs a block that queues work on a queue of its own and
+// then waits for that queue's turn: the turn needs a drainer from the same
+// pool. Without a thread joining the pool, all of them wait for ever.
+TEST(SerialQueueTest, SyncFromEveryPoolThreadOntoBusyQueuesDoesNotStarveThePool) {
+  constexpr int kOuter = 64;
+  std::vector<SerialQueue> outer;
+  std::vector<SerialQueue> inner;
+  for (int i = 0; i < kOuter; ++i) {
+    outer.emplace_back("test.outer." + std::to_string(i));
+    inner.emplace_back("test.inner." + std::to_string(i));
+  }
+  std::atomic<int> done{0};
+  std::promise<void> all;
+  for (int i = 0; i < kOuter; ++i) {
+    outer[static_cast<std::size_t>(i)].async([&, i] {
+      auto& q = inner[static_cast<std::size_t>(i)];
+      std::atomic<bool> ran{false};
+      q.async([&] { ran = true; });
+      const bool sawEarlier = q.sync([&] { return ran.load(); });
+      EXPECT_TRUE(sawEarlier);
+      if (done.fetch_add(1) + 1 == kOuter) {
+        all.set_value();
+      }
+    });
+  }
+  ASSERT_EQ(all.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready)
+      << done.load() << " of " << kOuter << " finished";
 }
 
 TEST(SerialQueueTest, SyncRunsOnTheCallingThreadAfterEarlierBlocks) {

@@ -83,6 +83,8 @@ struct HttpsTestServer::Impl {
   mutable std::condition_variable changed;
   std::map<std::string, RequestHandler> handlers;
   std::vector<RecordedRequest> recorded;
+  std::size_t received = 0;
+  bool recordRequests = true;
   bool held = false;
   bool stopping = false;
 
@@ -104,7 +106,10 @@ struct HttpsTestServer::Impl {
     RequestHandler handler;
     {
       std::lock_guard lock(mutex);
-      recorded.push_back(r);
+      ++received;
+      if (recordRequests) {
+        recorded.push_back(r);
+      }
       if (auto it = handlers.find(r.path); it != handlers.end()) {
         handler = it->second;
       }
@@ -171,6 +176,7 @@ HttpsTestServer::HttpsTestServer(const TestCA& ca, Options options) : impl_(std:
   if (!impl_->server->is_valid()) {
     throw std::runtime_error("HttpsTestServer: TLS context could not be set up");
   }
+  impl_->recordRequests = options.recordRequests;
   auto& server = *impl_->server;
   // A kept-alive connection holds a server thread while it stays open.
   const std::size_t threads = options.keepAlive ? 128 : 16;
@@ -256,12 +262,12 @@ std::vector<RecordedRequest> HttpsTestServer::requests() const {
 
 std::size_t HttpsTestServer::requestCount() const {
   std::lock_guard lock(impl_->mutex);
-  return impl_->recorded.size();
+  return impl_->received;
 }
 
 bool HttpsTestServer::waitForRequests(std::size_t count, std::chrono::milliseconds timeout) const {
   std::unique_lock lock(impl_->mutex);
-  return impl_->changed.wait_for(lock, timeout, [&] { return impl_->recorded.size() >= count; });
+  return impl_->changed.wait_for(lock, timeout, [&] { return impl_->received >= count; });
 }
 
 bool HttpsTestServer::waitForRequestTo(const std::string& path, std::chrono::milliseconds timeout) const {

@@ -68,6 +68,9 @@ class HttpsTestServer {
     // Keep connections open for further requests (benchmarks); stopping then
     // waits up to a second for idle connections.
     bool keepAlive = false;
+    // Keep every request for requests(); benchmarks that count millions of
+    // requests in their handlers turn this off (requestCount() still counts).
+    bool recordRequests = true;
   };
 
   explicit HttpsTestServer(const TestCA& ca = TestCA::shared());

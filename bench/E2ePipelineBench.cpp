@@ -1,0 +1,296 @@
+// The event's road end to end, beside a peer log pipeline in the same run:
+// N clients send the same events (ten keys, about 300 bytes of JSON) to
+// zerithd through the client framework and to syslog-ng through its stream
+// socket; both batch them by 50 and post them over HTTPS to one collector on
+// loopback that counts every record by its identifier. Reported per
+// pipeline: events per second accepted and delivered, CPU microseconds per
+// event (user + system of the pipeline's process, from /proc), peak and
+// private RSS, and whether every event arrived exactly once; with
+// --idle-seconds, the CPU time and wake-ups of the idle process holding ten
+// open sessions, per minute.
+//
+//   e2e_pipeline_bench --clients 8 --events 200000
+//   e2e_pipeline_bench --clients 8 --events 30000 --rate 1000
+//   e2e_pipeline_bench --events 1000000 --memory-sample 10000
+//   e2e_pipeline_bench --smoke --events 3000        (exit 1 unless lossless)
+//
+// Not a timed test: --smoke only checks the counts.
+
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <iostream>
+#include <optional>
+#include <sstream>
+#include <thread>
+
+#include "bench/pipeline/Collector.h"
+#include "bench/pipeline/LoadGenerator.h"
+#include "bench/pipeline/PeerPipeline.h"
+#include "bench/pipeline/ProcStats.h"
+#include "bench/pipeline/ZerithdPipeline.h"
+#include "tests/support/TestCA.h"
+
+namespace zerith::bench {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+struct Settings {
+  std::vector<std::string> pipelines{"peer", "zerithd"};
+  LoadOptions load;
+  std::uint64_t events = 10000;
+  std::uint64_t memorySample = 10000;
+  double idleSeconds = 0;
+  int idleSessions = 10;
+  std::chrono::milliseconds stall{30000};
+  bool smoke = false;
+  std::string collector = "zerith-collector";
+};
+
+struct Report {
+  std::string pipeline{};
+  std::string error{};
+  LoadResult load{};
+  double deliverSeconds = 0;
+  Collector::Counts counts{};
+  std::uint64_t expected = 0;
+  std::optional<ProcSample> before{}, after{}, atSample{};
+  std::optional<ProcSample> idleBefore{}, idleAfter{};
+  double idleSeconds = 0;
+
+  bool lossless() const {
+    return error.empty() && counts.records == expected && counts.duplicates == 0 && counts.unexpected == 0 &&
+           counts.malformed == 0;
+  }
+  double cpuMicrosPerEvent() const {
+    return before && after && counts.records ? (after->cpuSeconds - before->cpuSeconds) * 1e6 / counts.records : 0;
+  }
+  double deliveredPerSecond() const { return deliverSeconds > 0 ? counts.records / deliverSeconds : 0; }
+  double acceptedPerSecond() const { return load.seconds > 0 ? load.accepted / load.seconds : 0; }
+};
+
+// Measures one pipeline whose process is `pid`; `openIdle` opens the idle
+// sessions and returns what keeps them open, `run` sends the load.
+template <typename OpenIdle, typename Run>
+void measure(Report& r, const Settings& s, Collector& collector, pid_t pid, OpenIdle&& openIdle, Run&& run) {
+  if (s.idleSeconds > 0) {
+    auto holder = openIdle();
+    // Let the sessions' start-up work settle before the window opens.
+    std::this_thread::sleep_for(std::chrono::seconds(2));
+    r.idleBefore = sampleProcess(pid);
+    const auto t0 = Clock::now();
+    std::this_thread::sleep_for(std::chrono::duration<double>(s.idleSeconds));
+    r.idleAfter = sampleProcess(pid);
+    r.idleSeconds = std::chrono::duration<double>(Clock::now() - t0).count();
+  }
+  r.expected = s.events;
+  collector.expect(s.events);
+  r.before = sampleProcess(pid);
+  std::thread sampler;
+  if (s.memorySample > 0 && s.memorySample < s.events) {
+    sampler = std::thread([&] {
+      if (collector.waitForRecords(s.memorySample, s.stall)) {
+        r.atSample = sampleProcess(pid);
+      }
+    });
+  }
+  const auto t0 = Clock::now();
+  r.load = run();
+  if (!r.load.error.empty()) {
+    r.error = r.load.error;
+  }
+  if (!collector.waitForRecords(s.events, s.stall) && r.error.empty()) {
+    r.error = "delivery stalled";
+  }
+  r.deliverSeconds = std::chrono::duration<double>(Clock::now() - t0).count();
+  r.after = sampleProcess(pid);
+  if (sampler.joinable()) {
+    sampler.join();
+  }
+  r.counts = collector.counts();
+}
+
+Report runPeer(const Settings& s, Collector& collector, const std::filesystem::path& folder) {
+  Report r{.pipeline = "peer", .expected = s.events};
+  PeerPipeline peer({.folder = folder / "peer",
+                     .postURL = collector.url("/peer"),
+                     .caFile = test::TestCA::shared().caFile()});
+  if (!peer.ready()) {
+    r.error = "the peer did not start: " + peer.output();
+    return r;
+  }
+  measure(
+      r, s, collector, peer.pid(),
+      [&] {
+        struct Holder {
+          std::vector<int> fds;
+          ~Holder() {
+            for (int fd : fds) {
+              ::close(fd);
+            }
+          }
+        };
+        return std::make_unique<Holder>(Holder{openPeerConnections(peer.socketPath(), s.idleSessions)});
+      },
+      [&] { return runPeerLoad(s.load, peer.socketPath()); });
+  if (!r.error.empty()) {
+    r.error += "\n" + peer.output();
+  }
+  return r;
+}
+
+Report runZerithd(const Settings& s, Collector& collector) {
+  Report r{.pipeline = "zerithd", .expected = s.events};
+  ZerithdPipeline daemon({.postURL = collector.url("/zerithd")});
+  if (!daemon.ready()) {
+    r.error = daemon.error();
+    return r;
+  }
+  auto open = [&](int count, std::uint32_t firstID) {
+    std::vector<std::unique_ptr<Zerith>> sessions;
+    for (int i = 0; i < count; ++i) {
+      std::string why;
+      auto session = daemon.openSession(firstID + static_cast<std::uint32_t>(i), &why);
+      if (!session) {
+        r.error = why;
+        break;
+      }
+      sessions.push_back(std::move(session));
+    }
+    return sessions;
+  };
+  std::vector<std::unique_ptr<Zerith>> sessions = open(s.load.clients, 1);
+  if (!r.error.empty()) {
+    return r;
+  }
+  measure(
+      r, s, collector, daemon.pid(), [&] { return open(s.idleSessions, 1000); },
+      [&] { return runZerithdLoad(s.load, sessions); });
+  if (!r.lossless()) {
+    // The daemon's errors say where events went (a failed post drops its batch).
+    const std::string log = daemon.output();
+    r.error += "\n" + log.substr(log.size() > 4000 ? log.size() - 4000 : 0);
+  }
+  return r;
+}
+
+std::string kib(const std::optional<ProcSample>& s, std::uint64_t ProcSample::*field) {
+  return s ? std::to_string((*s).*field) : std::string("-");
+}
+
+void print(const Settings& s, const std::vector<Report>& reports) {
+  std::printf("clients=%d events=%llu rate=%s window=%d collector=%s\n", s.load.clients,
+              static_cast<unsigned long long>(s.events),
+              s.load.eventsPerSecond > 0 ? std::to_string(static_cast<long long>(s.load.eventsPerSecond)).c_str()
+                                         : "max",
+              s.load.window, s.collector.c_str());
+  std::printf(
+      "| pipeline | accepted/s | delivered/s | CPU µs/event | peak RSS KiB | private KiB @%llu | private KiB @end | "
+      "posts | gzip | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|---|\n",
+      static_cast<unsigned long long>(s.memorySample));
+  for (const auto& r : reports) {
+    std::printf("| %s | %.0f | %.0f | %.2f | %s | %s | %s | %llu | %llu | %llu | %lld | %llu |\n", r.pipeline.c_str(),
+                r.acceptedPerSecond(), r.deliveredPerSecond(), r.cpuMicrosPerEvent(),
+                kib(r.after, &ProcSample::peakRssKiB).c_str(), kib(r.atSample, &ProcSample::privateRssKiB).c_str(),
+                kib(r.after, &ProcSample::privateRssKiB).c_str(), static_cast<unsigned long long>(r.counts.posts),
+                static_cast<unsigned long long>(r.counts.gzipPosts), static_cast<unsigned long long>(r.counts.records),
+                static_cast<long long>(r.expected) - static_cast<long long>(r.counts.records),
+                static_cast<unsigned long long>(r.counts.duplicates));
+  }
+  for (const auto& r : reports) {
+    if (r.idleBefore && r.idleAfter && r.idleSeconds > 0) {
+      const double perMinute = 60.0 / r.idleSeconds;
+      // Switches are summed over the threads alive at each sample: a thread
+      // that ended in between takes its count with it.
+      const std::string wakeups =
+          r.idleAfter->voluntarySwitches >= r.idleBefore->voluntarySwitches
+              ? std::to_string(static_cast<long long>(
+                    static_cast<double>(r.idleAfter->voluntarySwitches - r.idleBefore->voluntarySwitches) * perMinute))
+              : std::string("unknown (threads ended)");
+      std::printf("idle %s, %d sessions, %.0f s: CPU %.2f ms/min, wake-ups %s/min (voluntary switches), threads %llu\n",
+                  r.pipeline.c_str(), s.idleSessions, r.idleSeconds,
+                  (r.idleAfter->cpuSeconds - r.idleBefore->cpuSeconds) * 1e3 * perMinute, wakeups.c_str(),
+                  static_cast<unsigned long long>(r.idleAfter->threads));
+    }
+  }
+  const Report* z = nullptr;
+  const Report* p = nullptr;
+  for (const auto& r : reports) {
+    (r.pipeline == "zerithd" ? z : p) = &r;
+  }
+  if (z && p && z->lossless() && p->lossless()) {
+    std::printf("ratio zerithd/peer: delivered/s %.2f, CPU per event %.2f, private RSS %.2f\n",
+                p->deliveredPerSecond() > 0 ? z->deliveredPerSecond() / p->deliveredPerSecond() : 0,
+                p->cpuMicrosPerEvent() > 0 ? z->cpuMicrosPerEvent() / p->cpuMicrosPerEvent() : 0,
+                p->after && z->after && p->after->privateRssKiB
+                    ? static_cast<double>(z->after->privateRssKiB) / static_cast<double>(p->after->privateRssKiB)
+                    : 0);
+  }
+  for (const auto& r : reports) {
+    std::printf("%s: %s", r.pipeline.c_str(), r.lossless() ? "lossless\n" : "NOT lossless");
+    if (!r.lossless()) {
+      std::printf(" (expected %llu, records %llu, duplicates %llu, unexpected %llu, malformed %llu)%s%s\n",
+                  static_cast<unsigned long long>(r.expected), static_cast<unsigned long long>(r.counts.records),
+                  static_cast<unsigned long long>(r.counts.duplicates),
+                  static_cast<unsigned long long>(r.counts.unexpected),
+                  static_cast<unsigned long long>(r.counts.malformed), r.error.empty() ? "" : ": ", r.error.c_str());
+    }
+  }
+  std::fflush(stdout);
+}
+
+}  // namespace
+}  // namespace zerith::bench
+
+int main(int argc, char** argv) {
+  using namespace zerith::bench;
+  Settings s;
+  CLI::App app{"End-to-end pipeline benchmark: zerithd beside a peer log pipeline"};
+  app.add_option("--pipelines", s.pipelines, "peer and/or zerithd")->check(CLI::IsMember({"peer", "zerithd"}));
+  app.add_option("--clients", s.load.clients, "client connections")->check(CLI::Range(1, 64));
+  app.add_option("--events", s.events, "events in all (split evenly over the clients)");
+  app.add_option("--rate", s.load.eventsPerSecond, "paced total events per second (0: as fast as taken)");
+  app.add_option("--window", s.load.window, "unanswered events per zerithd client")->check(CLI::Range(1, 100000));
+  app.add_option("--memory-sample", s.memorySample, "also sample memory after this many delivered events");
+  app.add_option("--idle-seconds", s.idleSeconds, "measure the idle process with open sessions this long first");
+  app.add_option("--idle-sessions", s.idleSessions, "sessions held open while idle");
+  app.add_option("--collector", s.collector, "zerith-collector (one line per record) or test-server")
+      ->check(CLI::IsMember({"zerith-collector", "test-server"}));
+  app.add_flag("--smoke", s.smoke, "exit 1 unless every pipeline delivered every event exactly once");
+  CLI11_PARSE(app, argc, argv);
+
+  s.load.eventsPerClient = s.events / static_cast<std::uint64_t>(s.load.clients);
+  s.events = s.load.eventsPerClient * static_cast<std::uint64_t>(s.load.clients);
+  if (!std::getenv("ZERITHD_BINARY")) {
+    ::setenv("ZERITHD_BINARY", ZERITHD_BUILT_BINARY, 1);
+  }
+  char folderTemplate[] = "/tmp/zerith-pipeline-XXXXXX";
+  const char* folder = ::mkdtemp(folderTemplate);
+  if (!folder) {
+    std::perror("mkdtemp");
+    return 2;
+  }
+  std::vector<Report> reports;
+  {
+    Collector collector(s.collector == "test-server" ? Collector::Server::TestServer
+                                                     : Collector::Server::ZerithCollector);
+    for (const auto& pipeline : s.pipelines) {
+      reports.push_back(pipeline == "peer" ? runPeer(s, collector, folder) : runZerithd(s, collector));
+    }
+  }
+  std::filesystem::remove_all(folder);
+  print(s, reports);
+  if (s.smoke) {
+    for (const auto& r : reports) {
+      if (!r.lossless()) {
+        return 1;
+      }
+    }
+  }
+  return 0;
+}

@@ -1,0 +1,23 @@
+# The end-to-end pipeline benchmark (zerithd beside a peer log pipeline, one
+# collector) and its smoke run in the test suite: a few thousand events
+# through each pipeline, every one counted exactly once. Needs the test
+# support library (daemon runner, HTTPS server, test CA).
+if(TARGET zerith_testsupport)
+  zerith_bench(NAME e2e_pipeline_bench
+    SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/E2ePipelineBench.cpp
+            ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/BenchEvent.cpp
+            ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/Collector.cpp
+            ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/LoadGenerator.cpp
+            ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/PeerPipeline.cpp
+            ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/ProcStats.cpp
+            ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/ZerithdPipeline.cpp
+    DEPS zerith "$<LINK_GROUP:RESCAN,zerith_config,zerith_transport,zerith_backends>" zerith_ipc zerith_platform
+         zerith_testsupport zerith_collector CLI11::CLI11)
+  add_dependencies(e2e_pipeline_bench zerithd)
+  target_compile_definitions(e2e_pipeline_bench PRIVATE ZERITHD_BUILT_BINARY="$<TARGET_FILE:zerithd>")
+  if(ZERITH_TESTS)
+    add_test(NAME e2e_pipeline_smoke
+      COMMAND e2e_pipeline_bench --smoke --clients 2 --events 3000 --memory-sample 0)
+    set_tests_properties(e2e_pipeline_smoke PROPERTIES TIMEOUT 180)
+  endif()
+endif()

@@ -1,0 +1,34 @@
+#!/usr/bin/env bash
+# Runs the end-to-end pipeline benchmark whole: zerithd beside the peer log
+# pipeline (syslog-ng), same collector, same events, in one go per load.
+#
+#   bench/run-e2e.sh [build-dir]        (default build/release)
+#
+# Loads: 1 and 8 clients as fast as taken; 8 clients paced at 100 and 1,000
+# events/s; one run of 1,000,000 events with a memory sample after 10,000;
+# the idle processes with ten open sessions for a minute. Every run checks
+# that each event arrived exactly once and prints "NOT lossless" otherwise.
+# Set QUICK=1 for shorter runs (a tenth of the events, 10 s idle).
+set -euo pipefail
+build="${1:-build/release}"
+bench="$build/bench/e2e_pipeline_bench"
+ninja -C "$build" e2e_pipeline_bench zerithd >/dev/null
+scale=1
+idle=60
+if [ "${QUICK:-0}" = 1 ]; then scale=10; idle=10; fi
+
+run() {
+  echo
+  echo "## $*"
+  "$bench" "$@"
+}
+
+echo "# e2e pipeline benchmark, $(date -u '+%Y-%m-%d %H:%M UTC'), load average: $(cut -d' ' -f1-3 /proc/loadavg)"
+run --clients 1 --events $((200000 / scale))
+run --clients 8 --events $((200000 / scale))
+run --clients 8 --events $((3000 / scale)) --rate 100 --memory-sample 0
+run --clients 8 --events $((30000 / scale)) --rate 1000 --memory-sample 0
+run --clients 8 --events $((1000000 / scale)) --memory-sample 10000
+run --clients 1 --events 1000 --memory-sample 0 --idle-seconds "$idle" --idle-sessions 10
+echo
+echo "load average after: $(cut -d' ' -f1-3 /proc/loadavg)"
