@@ -47,53 +47,6 @@ TEST(PropertyListTest, NilEntriesAreLeftOut) {
   EXPECT_TRUE(plist::encodeBinary(Value()).empty());
 }
 
-// The binary writer is our own; libplist reads what it writes. Each case
-// sits on an edge of the format: integer widths, the 15-entry count limit,
-// reference and offset widths, text outside ASCII.
-TEST(PropertyListTest, BinaryWriterEdgesReadBackThroughLibplist) {
-  Array many;
-  for (int i = 0; i < 300; ++i) {
-    many.push_back(Value(i * 1000));  // over 255 objects: two-byte references
-  }
-  Dictionary wide;
-  for (int i = 0; i < 20; ++i) {
-    wide.set("k" + std::to_string(i), Value(i));  // over 14 entries: counted marker
-  }
-  const std::vector<std::pair<std::string, Value>> cases = {
-      {"integer widths", Value(Array{Value(0), Value(255), Value(256), Value(65535), Value(65536),
-                                     Value(4294967295ll), Value(4294967296ll), Value(-1), Value(-4294967296ll),
-                                     Value(static_cast<long long>(INT64_MAX))})},
-      {"reals", Value(Array{Value(0.1), Value(-1e300), Value(3.0)})},
-      {"non-ASCII text", Value(Dictionary{{"café", Value("naïve – 😀 end")}, {"ascii", Value("plain")}})},
-      {"long text and data", Value(Dictionary{{"s", Value(std::string(70000, 'x'))},
-                                              {"d", Value(Data(100000, 0xab))}})},
-      {"many objects", Value(many)},
-      {"wide dictionary", Value(wide)},
-      {"empty containers", Value(Dictionary{{"a", Value(Array{})}, {"d", Value(Dictionary{})}, {"s", Value("")}})},
-      {"date with microseconds", Value(Date{1700000000.25})},
-      {"nested nil", Value(Array{Value(), Value(Dictionary{{"x", Value()}, {"y", Value(false)}}), Value()})},
-  };
-  for (const auto& [name, v] : cases) {
-    const Data bytes = plist::encodeBinary(v);
-    std::string why;
-    const auto back = plist::decodeBinary(plist::bytesOf(bytes), {}, &why);
-    ASSERT_TRUE(back) << name << ": " << why;
-    if (name == "nested nil") {
-      EXPECT_EQ(*back, Value(Array{Value(Dictionary{{"y", Value(false)}})})) << name;
-    } else {
-      EXPECT_EQ(*back, v) << name << ": " << back->description();
-    }
-  }
-}
-
-TEST(PropertyListTest, BinaryWriterCutsTextAtNulAndReplacesBytesThatAreNotUtf8) {
-  const Value v(Dictionary{{std::string("ke\0y", 4), Value(std::string("ab\0cd", 5))},
-                           {"bad", Value(std::string("a\xff" "b"))}});
-  const auto back = plist::decodeBinary(plist::bytesOf(plist::encodeBinary(v)));
-  ASSERT_TRUE(back);
-  EXPECT_EQ(*back, Value(Dictionary{{"ke", Value("ab")}, {"bad", Value("a\xef\xbf\xbd" "b")}}));
-}
-
 constexpr char kMagic[] = "bplist00";
 
 // Builds a binary list by hand: objects, then offset table, then trailer.
