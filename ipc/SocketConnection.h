@@ -48,8 +48,12 @@ inline constexpr std::size_t kMaxOutboxBytes = 64u << 20;
 inline constexpr std::size_t kMaxQueuedBytesAllConnections = 128u << 20;
 
 struct QueueLimits {
+  // Bytes waiting for one connection at which it stops reading, and below
+  // which it reads again.
   std::size_t pauseReadingAt = 1u << 20;
   std::size_t resumeReadingAt = 256u << 10;
+  // Bytes waiting for one connection / for all together past which
+  // connections are closed.
   std::size_t perConnection = kMaxOutboxBytes;
   std::size_t allConnections = kMaxQueuedBytesAllConnections;
   // Calls taken from one connection and not answered yet: at this many the
@@ -170,9 +174,9 @@ class SocketConnection final : public Connection {
   bool readPaused_ = false;
   // Mirrors for the process-wide limit, read without writeMutex_.
   std::atomic<std::size_t> queued_{0};
-  std::atomic<std::int64_t> waitingSince_{0};
-  std::atomic<bool> readPausedFlag_{false};  // readPaused_, for callAnswered's quick check
-  std::atomic<std::size_t> callsInFlight_{0};  // steady-clock ns since the outbox was last empty; 0 when empty
+  std::atomic<std::int64_t> waitingSince_{0};  // steady-clock ns since the outbox was last empty; 0 when empty
+  std::atomic<bool> readPausedFlag_{false};     // readPaused_, for callAnswered's quick check
+  std::atomic<std::size_t> callsInFlight_{0};
 
   std::mutex callsMutex_;
   std::uint64_t nextCall_ = 1;

@@ -273,15 +273,15 @@ TEST_F(InstalledTree, TheInstalledDaemonRunsWithTheInstalledFramework) {
   EXPECT_NE(help.output.find("--stop-timeout"), std::string::npos) << help.output;
 }
 
-// Waits for `name` to appear in the folder `inotify` watches.
-bool waitForCreation(int inotify, const fs::path& file, std::chrono::milliseconds timeout) {
+// Waits until the file that `inotify` watches holds `text`.
+bool waitForText(int inotify, const fs::path& file, const std::string& text, std::chrono::milliseconds timeout) {
   const auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (!fs::exists(file)) {
+  while (readFile(file).find(text) == std::string::npos) {
     const auto left =
         std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
     pollfd p{inotify, POLLIN, 0};
     if (left <= 0 || ::poll(&p, 1, static_cast<int>(left)) <= 0) {
-      return fs::exists(file);
+      return readFile(file).find(text) != std::string::npos;
     }
     char events[4096];
     (void)!::read(inotify, events, sizeof(events));
@@ -326,11 +326,14 @@ TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPasses
   root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
   const fs::path socketPath = paths::socketPath();
   fs::create_directories(socketPath.parent_path());
+  // The activator's and the daemon's output; the activator says when it
+  // listens.
+  const fs::path log = root.path() / "daemon.log";
+  std::ofstream(log).close();
   file::UniqueFd inotify(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
   ASSERT_TRUE(inotify);
-  ASSERT_GE(::inotify_add_watch(inotify.get(), socketPath.parent_path().c_str(), IN_CREATE), 0);
+  ASSERT_GE(::inotify_add_watch(inotify.get(), log.c_str(), IN_MODIFY), 0);
 
-  const fs::path log = root.path() / "daemon.log";
   const std::string lib = fs::exists(at("/usr/lib/x86_64-linux-gnu/libzerith.so.8"))
                               ? at("/usr/lib/x86_64-linux-gnu").string()
                               : at("/usr/lib").string();
@@ -341,7 +344,7 @@ TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPasses
   const pid_t pid = ::fork();
   ASSERT_GE(pid, 0);
   if (pid == 0) {
-    const int out = ::open(log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    const int out = ::open(log.c_str(), O_WRONLY | O_APPEND);
     ::dup2(out, STDOUT_FILENO);
     ::dup2(out, STDERR_FILENO);
     std::vector<char*> args;
@@ -365,7 +368,8 @@ TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPasses
     ::waitpid(pid, &status, 0);
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   };
-  ASSERT_TRUE(waitForCreation(inotify.get(), socketPath, std::chrono::seconds(10))) << (stopDaemon(), readFile(log));
+  ASSERT_TRUE(waitForText(inotify.get(), log, "Listening on " + socketPath.string(), std::chrono::seconds(10)))
+      << (stopDaemon(), readFile(log));
 
   file::UniqueFd client(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
   sockaddr_un address{};
