@@ -7,7 +7,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <new>
-#include <semaphore>
 
 #include <asio/posix/stream_descriptor.hpp>
 #include <fmt/format.h>
@@ -479,25 +478,13 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   request.body = std::move(archive);
   request.setValue("application/octet-stream", "Content-Type");
 
-  struct Answer {
-    std::binary_semaphore done{0};
-    Data data;
-    std::optional<Error> error;
-  };
-  auto answer = std::make_shared<Answer>();
-  transport->postURLRequestWithCompletionHandler(
-      request, [answer](const Data& data, const std::optional<HTTPURLResponse>&, const std::optional<Error>& error) {
-        answer->data = data;
-        answer->error = error;
-        answer->done.release();
-      });
-  answer->done.acquire();
+  const URLAnswer answer = postURLRequestAndWait(*transport, request);
 
-  if (answer->error) {
-    logger().error("DashboardBackend(uploadLogData): Error uploading log data array ({})", answer->error->description);
+  if (answer.error) {
+    logger().error("DashboardBackend(uploadLogData): Error uploading log data array ({})", answer.error->description);
     return false;
   }
-  const std::string location(answer->data.begin(), answer->data.end());
+  const std::string location(answer.data.begin(), answer.data.end());
   logger().info("DashboardBackend(uploadLogData): Log data uploaded to {}", location);
   timeval now{};
   gettimeofday(&now, nullptr);

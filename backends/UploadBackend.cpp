@@ -1,6 +1,5 @@
 #include "backends/UploadBackend.h"
 
-#include <semaphore>
 
 #include <fmt/format.h>
 
@@ -135,22 +134,10 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const char* extens
   request.setValue("gzip", "Content-Encoding");
   request.body = std::move(*body);
 
-  struct Answer {
-    std::binary_semaphore done{0};
-    Data data;
-    std::optional<Error> error;
-  };
-  auto answer = std::make_shared<Answer>();
-  transport->postURLRequestWithCompletionHandler(
-      request, [answer](const Data& data, const std::optional<HTTPURLResponse>&, const std::optional<Error>& error) {
-        answer->data = data;
-        answer->error = error;
-        answer->done.release();
-      });
-  answer->done.acquire();
+  const URLAnswer answer = postURLRequestAndWait(*transport, request);
 
-  if (!answer->data.empty()) {
-    const std::string text(answer->data.begin(), answer->data.end());
+  if (!answer.data.empty()) {
+    const std::string text(answer.data.begin(), answer.data.end());
     logger().debug("UploadBackend(uploadFileAtPath): sending to |{}|, Json output: {}", *base, text);
     if (text.find("success") != std::string::npos) {
       if (!file->remove(&why)) {
@@ -159,7 +146,7 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const char* extens
     }
   } else {
     logger().error("UploadBackend(uploadFileAtPath): post {}",
-                   answer->error ? answer->error->description : std::string("(null)"));
+                   answer.error ? answer.error->description : std::string("(null)"));
   }
   return true;
 }

@@ -52,4 +52,16 @@ class ReportingSessionConnectivityInterface {
   virtual void getURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) = 0;
 };
 
+// What a POST that its caller waited for was answered.
+struct URLAnswer {
+  Data data;
+  std::optional<HTTPURLResponse> response;
+  std::optional<Error> error;
+};
+
+// Posts `request` and blocks the calling thread until its completion has run,
+// without a time limit of its own (uploads wait for their answer). Completions
+// run on the helper's state queue, so never call this from one.
+URLAnswer postURLRequestAndWait(ReportingSessionConnectivityInterface& transport, const URLRequest& request);
+
 }  // namespace zerith

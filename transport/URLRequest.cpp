@@ -1,6 +1,8 @@
 #include <strings.h>
 
 #include <algorithm>
+#include <memory>
+#include <semaphore>
 
 #include "transport/ReportingSessionConnectivityInterface.h"
 
@@ -41,6 +43,22 @@ std::optional<std::string> URLRequest::valueForHTTPHeaderField(std::string_view 
 
 std::optional<std::string> HTTPURLResponse::valueForHTTPHeaderField(std::string_view field) const {
   return findField(headers, field);
+}
+
+URLAnswer postURLRequestAndWait(ReportingSessionConnectivityInterface& transport, const URLRequest& request) {
+  struct Waiter {
+    std::binary_semaphore done{0};
+    URLAnswer answer;
+  };
+  auto waiter = std::make_shared<Waiter>();
+  transport.postURLRequestWithCompletionHandler(
+      request, [waiter](const Data& data, const std::optional<HTTPURLResponse>& response,
+                        const std::optional<Error>& error) {
+        waiter->answer = URLAnswer{data, response, error};
+        waiter->done.release();
+      });
+  waiter->done.acquire();
+  return std::move(waiter->answer);
 }
 
 }  // namespace zerith
