@@ -132,8 +132,11 @@ class RecordingBackend final : public ZerithBackend {
   }
 
   void cleanup() override {
-    std::lock_guard lock(mutex_);
-    ++cleanups_;
+    {
+      std::lock_guard lock(mutex_);
+      ++cleanups_;
+    }
+    changed_.notify_all();
   }
 
   std::vector<Event> events() const {
@@ -151,6 +154,12 @@ class RecordingBackend final : public ZerithBackend {
   int cleanups() const {
     std::lock_guard lock(mutex_);
     return cleanups_;
+  }
+  // The session cleans its backends up last in its teardown, after its end
+  // message and flush: wait for that rather than for the dealloc line.
+  bool waitForCleanups(int n, std::chrono::milliseconds timeout = std::chrono::seconds(10)) const {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, timeout, [&] { return cleanups_ >= n; });
   }
   bool waitForCount(std::size_t n, std::chrono::milliseconds timeout = std::chrono::seconds(10)) const {
     std::unique_lock lock(mutex_);

@@ -506,6 +506,8 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
   EXPECT_EQ(health["CalculatedMemoryUsage"].unsignedValue(), 690u + health["StorebagsSize"].unsignedValue());
   EXPECT_GT(health["StorebagsSize"].unsignedValue(), 0u);
   EXPECT_GT(health["ProcessMemoryUsage"].unsignedValue(), 0u);
+  ASSERT_TRUE(a->waitForCleanups(1));
+  ASSERT_TRUE(b->waitForCleanups(1));
   EXPECT_EQ(a->cleanups(), 1);
   EXPECT_EQ(b->cleanups(), 1);
   EXPECT_GE(a->flushes(), 1);
