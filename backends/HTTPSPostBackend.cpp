@@ -268,8 +268,9 @@ Dictionary HTTPSPostBackend::newEventDictfromPayload(const Value& payload, const
 }
 
 void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Value& frameworkData) const {
-  if (const Dictionary* userInfo = userInfoDict().dict()) {
-    for (const auto& [key, value] : *userInfo) {
+  const Value userInfo = userInfoDict();
+  if (const Dictionary* entries = userInfo.dict()) {
+    for (const auto& [key, value] : *entries) {
       event.set(key, value);
     }
   }
@@ -946,9 +947,11 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
     createFiltersFromArray(filters);
 
     Value threshold = numberOf(entry, "sampling_threshold");
-    if (const Array* perCountry = listOf(entry, "per_country_sampling_thresholds").array(); perCountry && country) {
+    const Value perCountryRules = listOf(entry, "per_country_sampling_thresholds");
+    if (const Array* perCountry = perCountryRules.array(); perCountry && country) {
       for (const Value& rule : *perCountry) {
-        const Array* countries = rule["country"].array();
+        const Value countryList = rule["country"];
+        const Array* countries = countryList.array();
         if (!countries || std::none_of(countries->begin(), countries->end(), [&](const Value& c) {
               return c.string() && *c.string() == *country;
             })) {

@@ -80,7 +80,8 @@ class SessionsRunner {
   };
 
   static std::string text(const Value& command, const char* key) {
-    const auto* s = command[key].string();
+    const Value v = command[key];
+    const auto* s = v.string();
     if (!s || s->empty()) {
       throw ScriptError{std::string("\"") + key + "\" must be a non-empty string"};
     }
