@@ -164,7 +164,10 @@ TEST_F(StorebagVerifyTest, SignatureOverOtherBytesIsRefused) {
 
 TEST_F(StorebagVerifyTest, ContainerSignedWithAnotherKeyIsRefused) {
   EXPECT_TRUE(verify(signedContainer(sampleStorebag(), test::otherStorebagKeys())).isNil());
-  EXPECT_TRUE(logs_.contains(notVerified("invalid padding")));
+  // OpenSSL's reason depends on whether the signature, as a number, is below
+  // the other key's modulus: both keys are random.
+  EXPECT_TRUE(logs_.contains(notVerified("invalid padding")) ||
+              logs_.contains(notVerified("data too large for modulus")));
 }
 
 TEST_F(StorebagVerifyTest, TruncatedBase64IsRefused) {

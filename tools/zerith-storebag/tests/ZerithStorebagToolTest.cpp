@@ -113,7 +113,9 @@ TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
   write("junk", "not a property list");
   const Case cases[] = {
       {"verify --public other.der --in container",
-       "zerith-storebag: 'container' refused: the signature does not match the bag under this public key (invalid padding)\n"},
+       // OpenSSL's reason depends on the two random keys ("invalid padding"
+       // or "data too large for modulus"); it follows in brackets.
+       "zerith-storebag: 'container' refused: the signature does not match the bag under this public key ("},
       {"verify --public publicKey.der --in bag.plist",
        "zerith-storebag: 'bag.plist' refused: the container has no \"signature\" string\n"},
       {"show --public key.pem --in container",
