@@ -1,4 +1,5 @@
 #include "backends/CreateBackends.h"
+#include "backends/BackendsLog.h"
 
 #include <sys/time.h>
 
@@ -12,11 +13,6 @@ namespace zerith {
 
 namespace {
 
-const log::Logger& logger() {
-  static const log::Logger l("backends");
-  return l;
-}
-
 std::optional<std::string> stringOf(const Value& v) {
   return v.string() ? std::optional<std::string>(*v.string()) : std::nullopt;
 }
@@ -26,11 +22,11 @@ std::optional<std::string> stringOf(const Value& v) {
 std::optional<BackendDictionary> createBackends(const Value& storebagSection, const Value& sessionInfo,
                                                 const Value& userInfo, const char* udid) {
   if (storebagSection.isNil()) {
-    logger().error("createBackends: Attempted to create backends with nil storebag");
+    backendsLogger().error("createBackends: Attempted to create backends with nil storebag");
     return std::nullopt;
   }
   if (sessionInfo.isNil()) {
-    logger().error("createBackends: Attempted to create backends with nil session info");
+    backendsLogger().error("createBackends: Attempted to create backends with nil session info");
     return std::nullopt;
   }
 

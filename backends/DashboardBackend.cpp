@@ -1,4 +1,5 @@
 #include "backends/DashboardBackend.h"
+#include "backends/BackendsLog.h"
 
 #include <arpa/inet.h>
 #include <sys/socket.h>
@@ -18,15 +19,6 @@
 #include "platform/PropertyList.h"
 
 namespace zerith {
-
-namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("backends");
-  return l;
-}
-
-}  // namespace
 
 struct DashboardBackend::ReadSource {
   explicit ReadSource(int fd) : descriptor(ioContext(Pool::General), fd) {}
@@ -87,18 +79,18 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(std::string nam
   if (!profile.isNil()) {
     // An "ip" that is not text cannot be resolved either.
     if (!profileIP.string()) {
-      logger().error("DashboardBackend(initWithName): can't resolve server IP");
+      backendsLogger().error("DashboardBackend(initWithName): can't resolve server IP");
       return nullptr;
     }
     if (profilePort.isNil()) {
-      logger().error("DashboardBackend(initWithName): can't resolve server port");
+      backendsLogger().error("DashboardBackend(initWithName): can't resolve server port");
       return nullptr;
     }
   }
 
   const int fd = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, IPPROTO_UDP);
   if (fd < 0) {
-    logger().error("DashboardBackend(initWithName): socket() failed ({})", errno);
+    backendsLogger().error("DashboardBackend(initWithName): socket() failed ({})", errno);
     return nullptr;
   }
   // From here the backend owns the socket: its destructor closes it.
@@ -130,7 +122,7 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(std::string nam
     }
   } else {
     if (!serverIP) {
-      logger().error("DashboardBackend(initWithName): initWitName with all null params.");
+      backendsLogger().error("DashboardBackend(initWithName): initWitName with all null params.");
       return nullptr;
     }
     address = *serverIP;
@@ -142,11 +134,11 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(std::string nam
   if (backend->serverAddress_.sin_addr.s_addr == INADDR_NONE) {
     // inet_addr's "no address" is also 255.255.255.255, which is no
     // dashboard either.
-    logger().error("DashboardBackend(initWithName): can't parse server IP {}", address);
+    backendsLogger().error("DashboardBackend(initWithName): can't parse server IP {}", address);
     return nullptr;
   }
   if (::connect(fd, reinterpret_cast<const sockaddr*>(&backend->serverAddress_), sizeof backend->serverAddress_) != 0) {
-    logger().error("DashboardBackend(initWithName): socket connect() failed.");
+    backendsLogger().error("DashboardBackend(initWithName): socket connect() failed.");
     return nullptr;
   }
 
@@ -166,7 +158,7 @@ void DashboardBackend::useReliableUDP() {
   any.sin_addr.s_addr = htonl(INADDR_ANY);
   any.sin_port = 0;
   if (::bind(socketDescriptor_, reinterpret_cast<const sockaddr*>(&any), sizeof any) != 0) {
-    logger().error("DashboardBackend(useReliableUDP): can't bind socket, {}", errno);
+    backendsLogger().error("DashboardBackend(useReliableUDP): can't bind socket, {}", errno);
     return;
   }
   sockaddr_in bound{};
@@ -178,7 +170,7 @@ void DashboardBackend::useReliableUDP() {
   try {
     readSource_ = std::make_unique<ReadSource>(socketDescriptor_);
   } catch (const std::exception&) {
-    logger().error("DashboardBackend(useReliableUDP): can't create read source");
+    backendsLogger().error("DashboardBackend(useReliableUDP): can't create read source");
     readSource_.reset();
   }
 }
@@ -241,7 +233,7 @@ std::optional<std::string> DashboardBackend::sendMessage(const Value& message, c
                                               (usingProfile_ ? 0 : dashboard::kFlagNotFromProfile));
     datagram = dashboard::encode(header, dashboard::buildText(items));
   } catch (const std::bad_alloc&) {
-    logger().error("DashboardBackend(sendMessage): can't malloc.");
+    backendsLogger().error("DashboardBackend(sendMessage): can't malloc.");
     return std::nullopt;
   }
   std::string line = writeLocalLog(datagram);
@@ -314,18 +306,18 @@ void DashboardBackend::processSocketRead() {
     const std::size_t length = std::min<std::size_t>(static_cast<std::size_t>(n), buffer.size());
     if (fromLength < sizeof from || from.sin_family != AF_INET ||
         from.sin_addr.s_addr != serverAddress_.sin_addr.s_addr || from.sin_port != serverAddress_.sin_port) {
-      logger().debug("DashboardBackend(processSocketRead): ignoring a datagram that did not come from the server");
+      backendsLogger().debug("DashboardBackend(processSocketRead): ignoring a datagram that did not come from the server");
       continue;
     }
     const auto event = dashboard::acknowledgedEventNumber(std::span(buffer.data(), length), truncated);
     if (!event) {
-      logger().debug("DashboardBackend(processSocketRead): ignoring an acknowledgement of {} bytes", n);
+      backendsLogger().debug("DashboardBackend(processSocketRead): ignoring an acknowledgement of {} bytes", n);
       continue;
     }
     const auto match = std::find_if(messageQueue_.begin(), messageQueue_.end(),
                                     [&](const UDPPacketToSend& p) { return p.eventNumber() == *event; });
     if (match == messageQueue_.end()) {
-      logger().debug("DashboardBackend(processSocketRead): no queued datagram for event {}", *event);
+      backendsLogger().debug("DashboardBackend(processSocketRead): no queued datagram for event {}", *event);
       continue;
     }
     messageQueue_.erase(match);
@@ -396,11 +388,11 @@ void DashboardBackend::myPeriodicTask() {
     return;
   }
   if (messageQueue_.empty()) {
-    logger().debug("DashboardBackend(myPeriodicTask): clean up at myPeriodicTask.");
+    backendsLogger().debug("DashboardBackend(myPeriodicTask): clean up at myPeriodicTask.");
     cleanupSources();
   } else if (cleanupState_ == kCleanupRequested) {
     cleanupState_ = kLastResortScheduled;
-    logger().debug("DashboardBackend(myPeriodicTask): scheduled last resort clean-up in {} ms.",
+    backendsLogger().debug("DashboardBackend(myPeriodicTask): scheduled last resort clean-up in {} ms.",
                    kLastResortCleanup.count());
     networkProcQueue_.after(kLastResortCleanup, [self = self()] { self->cleanupSources(); });
   }
@@ -455,7 +447,7 @@ void DashboardBackend::closeSocket() {
 
 bool DashboardBackend::uploadLogData(const Value& logData) {
   if (!postURL_) {
-    logger().error("DashboardBackend(uploadLogData): Post URL for log data array is nil");
+    backendsLogger().error("DashboardBackend(uploadLogData): Post URL for log data array is nil");
     return false;
   }
   // The keyed archive of the array, as a binary property list.
@@ -464,12 +456,12 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
     archive = plist::encodeBinary(logData);
   }
   if (archive.empty()) {
-    logger().error("DashboardBackend(uploadLogData): Failed to serialize log data array for upload");
+    backendsLogger().error("DashboardBackend(uploadLogData): Failed to serialize log data array for upload");
     return false;
   }
   const auto transport = reportingSessionConnectivityDelegate();
   if (!transport) {
-    logger().error("DashboardBackend(uploadLogData): Error uploading log data array ({})", "no transport");
+    backendsLogger().error("DashboardBackend(uploadLogData): Error uploading log data array ({})", "no transport");
     return false;
   }
   URLRequest request;
@@ -481,11 +473,11 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   const URLAnswer answer = postURLRequestAndWait(*transport, request);
 
   if (answer.error) {
-    logger().error("DashboardBackend(uploadLogData): Error uploading log data array ({})", answer.error->description);
+    backendsLogger().error("DashboardBackend(uploadLogData): Error uploading log data array ({})", answer.error->description);
     return false;
   }
   const std::string location(answer.data.begin(), answer.data.end());
-  logger().info("DashboardBackend(uploadLogData): Log data uploaded to {}", location);
+  backendsLogger().info("DashboardBackend(uploadLogData): Log data uploaded to {}", location);
   timeval now{};
   gettimeofday(&now, nullptr);
   ZerithBackend::sendMessage(Value(Dictionary{{"LogDataUploadLocation", Value(location)}}), now, 0, 2, 0);

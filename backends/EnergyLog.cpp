@@ -1,4 +1,5 @@
 #include "backends/EnergyLog.h"
+#include "backends/BackendsLog.h"
 
 #include <fcntl.h>
 #include <systemd/sd-journal.h>
@@ -19,11 +20,6 @@ namespace zerith::energy {
 
 namespace {
 
-const log::Logger& logger() {
-  static const log::Logger l("backends");
-  return l;
-}
-
 bool writeToJournal(std::uint32_t category, std::string_view eventName, const std::string& payload) {
   const std::string name(eventName);
   const int rc = sd_journal_send("MESSAGE=Energy event %s (category %u)", name.c_str(), category,
@@ -33,7 +29,7 @@ bool writeToJournal(std::uint32_t category, std::string_view eventName, const st
                                  "ZERITH_ENERGY_PAYLOAD=%s", payload.c_str(),
                                  nullptr);
   if (rc < 0) {
-    logger().error("EnergyLog: journal refused event {}: {}", name, std::strerror(-rc));
+    backendsLogger().error("EnergyLog: journal refused event {}: {}", name, std::strerror(-rc));
     return false;
   }
   return true;
@@ -45,7 +41,7 @@ bool appendLine(const std::string& line) {
   std::filesystem::create_directories(path.parent_path(), ec);
   file::UniqueFd fd(::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644));
   if (!fd) {
-    logger().error("EnergyLog: cannot open {}: {}", path.string(), std::strerror(errno));
+    backendsLogger().error("EnergyLog: cannot open {}: {}", path.string(), std::strerror(errno));
     return false;
   }
   std::string_view rest = line;
@@ -55,7 +51,7 @@ bool appendLine(const std::string& line) {
       continue;
     }
     if (n <= 0) {
-      logger().error("EnergyLog: cannot write to {}: {}", path.string(), std::strerror(errno));
+      backendsLogger().error("EnergyLog: cannot write to {}: {}", path.string(), std::strerror(errno));
       return false;
     }
     rest.remove_prefix(static_cast<std::size_t>(n));

@@ -1,4 +1,5 @@
 #include "backends/HTTPSPostBackend.h"
+#include "backends/BackendsLog.h"
 
 #include <algorithm>
 #include <cctype>
@@ -23,11 +24,6 @@
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("backends");
-  return l;
-}
 
 // Posts that get no answer within this time fail instead of holding their
 // connection for ever.
@@ -83,7 +79,7 @@ Value nameList(const Value& client, std::string_view key) {
       list.emplace_back(std::move(piece));
     }
   } else {
-    logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a string of names", key,
+    backendsLogger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a string of names", key,
                    names.kindName());
     list.emplace_back(std::string());  // matches no name: the entry is not ours
   }
@@ -97,7 +93,7 @@ Value numberOf(const Value& client, std::string_view key) {
   if (v.isNil() || v.isNumber() || v.isBool()) {
     return v;
   }
-  logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a number; ignored", key, v.kindName());
+  backendsLogger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a number; ignored", key, v.kindName());
   return {};
 }
 
@@ -107,7 +103,7 @@ Value listOf(const Value& client, std::string_view key) {
   if (v.isNil() || v.isArray()) {
     return v;
   }
-  logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a list; ignored", key, v.kindName());
+  backendsLogger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a list; ignored", key, v.kindName());
   return {};
 }
 
@@ -117,7 +113,7 @@ std::optional<std::string> stringKey(const Value& client, std::string_view key) 
     return std::nullopt;
   }
   if (!v.isString()) {
-    logger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a string; ignored", key, v.kindName());
+    backendsLogger().error("HTTPSPostBackend(updateBackendState): \"{}\" holds {}, not a string; ignored", key, v.kindName());
     return std::nullopt;
   }
   return *v.string();
@@ -164,7 +160,7 @@ std::optional<nlohmann::ordered_json> wireValue(const std::string& key, const Va
     case Value::Type::Date: return nlohmann::ordered_json(sanitizeDouble(v.date()->secondsSince1970));
     default: break;
   }
-  logger().error("HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable to handle key: {}, value: {}",
+  backendsLogger().error("HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable to handle key: {}, value: {}",
                  key, v.description());
   return std::nullopt;
 }
@@ -177,7 +173,7 @@ std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(std::string nam
     return nullptr;
   }
   if (profile["clients"].isNil()) {
-    logger().error("HTTPSPostBackend(initWithName): can't find the client list.");
+    backendsLogger().error("HTTPSPostBackend(initWithName): can't find the client list.");
     return nullptr;
   }
   return std::make_shared<HTTPSPostBackend>(Token{}, std::move(name), profile, productFamily);
@@ -188,12 +184,12 @@ HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::
   Fields f;
   if (auto url = defaultsStringForKey("httpsPostURL")) {
     f.postURL = *url;
-    logger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for postURL", *url);
+    backendsLogger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for postURL", *url);
   }
   f.useDefaultPostURL = f.postURL.has_value();
   if (auto url = defaultsStringForKey("httpsRealtimePostURL")) {
     f.realtimePostURL = *url;
-    logger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for realtimePostURL", *url);
+    backendsLogger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for realtimePostURL", *url);
   }
   f.useDefaultRealtimePostURL = f.realtimePostURL.has_value();
   if (auto display = stringOf(this->profile()["display_url"])) {
@@ -297,7 +293,7 @@ std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
   });
   std::optional<std::string> result;
   if (count > eventThreshold()) {
-    logger().debug("HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method {}",
+    backendsLogger().debug("HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method {}",
                    method);
     result = flushMessagesWithCompletion(nullptr);
     count = 0;
@@ -361,7 +357,7 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
     // than breaking the JSON.
     compact = envelope.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
   } catch (const std::exception& e) {
-    logger().error("HTTPSPostBackend(createMessageForPostAndLogging): cannot serialise the envelope: {}", e.what());
+    backendsLogger().error("HTTPSPostBackend(createMessageForPostAndLogging): cannot serialise the envelope: {}", e.what());
     return std::nullopt;
   }
 
@@ -392,12 +388,12 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
     payload = message;
   }
   if (payload.isNil()) {
-    logger().error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
+    backendsLogger().error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
     payload = Value(Dictionary());
   }
   Dictionary copy = payload.isDict() ? payload.dictCopy() : Dictionary();
   if (method == 0 && respCode == 1) {
-    logger().debug(
+    backendsLogger().debug(
         "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary");
     const Fields f = fields();
     copy.set("Opt", Value(f.dnuType));
@@ -413,13 +409,13 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
   if ((flag | 1) == 3 && currentState == kBackendStateSampledOut) {
     setState(kBackendStateEnabled);
   }
-  logger().debug("HTTPSPostBackend(sendMessage): realtime is {}", realtime ? 1 : 0);
+  backendsLogger().debug("HTTPSPostBackend(sendMessage): realtime is {}", realtime ? 1 : 0);
 
   const bool haveUserInfo = userInfoDict().count() > 0;
   const bool batch = currentState == kBackendStateUndecided || currentState == kBackendStateSampledOut ||
                      (!realtime && batchEvents()) || (requireUserInfo() && !haveUserInfo);
   if (batch) {
-    logger().debug("HTTPSPostBackend(sendMessage): Batching {}, {}, {}", currentState, batchEvents() ? 1 : 0,
+    backendsLogger().debug("HTTPSPostBackend(sendMessage): Batching {}, {}, {}", currentState, batchEvents() ? 1 : 0,
                    requireUserInfo() ? 1 : 0);
     return batchEvent(std::move(event));
   }
@@ -427,13 +423,13 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
   std::optional<std::string> flushed;
   bool flushPreceded = false;
   if (currentState == kBackendStateEnabled && realtime && batchedEventCount() > 0) {
-    logger().debug(
+    backendsLogger().debug(
         "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush "
         "here to keep events in order.");
     flushed = flushMessagesWithCompletion(nullptr);
     flushPreceded = true;
   }
-  logger().debug("HTTPSPostBackend(sendMessage): Sending {}, {}, {}", currentState, batchEvents() ? 1 : 0,
+  backendsLogger().debug("HTTPSPostBackend(sendMessage): Sending {}, {}, {}", currentState, batchEvents() ? 1 : 0,
                  requireUserInfo() ? 1 : 0);
   std::optional<std::string> pretty;
   std::vector<Dictionary> one;
@@ -477,7 +473,7 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
   const bool realtime = (flag | 2) == 3;
   std::optional<std::string> url = realtime ? f.realtimePostURL : f.postURL;
   if (!url) {
-    logger().error("HTTPSPostBackend(postJsonMessage): postURL is nil");
+    backendsLogger().error("HTTPSPostBackend(postJsonMessage): postURL is nil");
     if (completion) {
       completion(Value(), makeZerithError("postURL is nil", -1));
     }
@@ -509,7 +505,7 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
   const std::string scheme = schemeEnd == std::string::npos ? std::string() : lowered(url->substr(0, schemeEnd));
   if (scheme != "https" && scheme != "http") {
     const std::string text = fmt::format("post URL '{}' is not an http(s) URL", *url);
-    logger().error("HTTPSPostBackend(postJsonMessage): post error: {}", text);
+    backendsLogger().error("HTTPSPostBackend(postJsonMessage): post error: {}", text);
     if (completion) {
       completion(Value(), makeZerithError(text, -1));
     }
@@ -567,7 +563,7 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
       request, [weak, backendName, completion](const Data&, const std::optional<HTTPURLResponse>& response,
                                                const std::optional<Error>& error) {
         if (error) {
-          logger().error("HTTPSPostBackend(postJsonMessage): post error: {}", error->description);
+          backendsLogger().error("HTTPSPostBackend(postJsonMessage): post error: {}", error->description);
         }
         if (response && response->statusCode >= 500 && response->statusCode <= 599) {
           const std::string text =
@@ -577,7 +573,7 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
           if (auto self = weak.lock()) {
             self->setState(kBackendStateDisabled);
           }
-          logger().info("postJSONMessage: {}", text);
+          backendsLogger().info("postJSONMessage: {}", text);
           if (completion) {
             completion(Value(), makeZerithError(text, response->statusCode));
           }
@@ -622,18 +618,18 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
     outcome.error = "Can not flush: userInfo is required";
     return outcome;
   }
-  logger().debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
+  backendsLogger().debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
   filterEvent(userInfo);
   std::vector<Dictionary> kept;
   for (Dictionary& event : *batch_.batchedEvents) {
     const auto category = static_cast<std::uint16_t>(recordInteger(event, "_method").value_or(0));
     if (!isWhitelistedEvent(category)) {
-      logger().debug("flushMessagesWithCompletion: Dropping event with category {} as it is not whitelisted for backend {}",
+      backendsLogger().debug("flushMessagesWithCompletion: Dropping event with category {} as it is not whitelisted for backend {}",
                      category, name());
       continue;
     }
     if (isBlacklistedEvent(category)) {
-      logger().info("flushMessagesWithCompletion: Dropping event with category {} as it is blacklisted for backend {}",
+      backendsLogger().info("flushMessagesWithCompletion: Dropping event with category {} as it is blacklisted for backend {}",
                     category, name());
       continue;
     }
@@ -750,7 +746,7 @@ bool HTTPSPostBackend::updatePostLink(const Value& client) {
     f.useDefaultPostURL = false;
     if (auto url = stringKey(client, "post_url")) {
       f.postURL = *url;
-      logger().info("HTTPSPostBackend(updatePostLink): Storebag '{}' for postURL", *url);
+      backendsLogger().info("HTTPSPostBackend(updatePostLink): Storebag '{}' for postURL", *url);
       taken = true;
     }
   }
@@ -759,10 +755,10 @@ bool HTTPSPostBackend::updatePostLink(const Value& client) {
     f.realtimePostURL.reset();
     if (auto url = stringKey(client, "realtime_post_url")) {
       f.realtimePostURL = *url;
-      logger().info("HTTPSPostBackend(updatePostLink): Storebag '{}' for realtimePostURL", *url);
+      backendsLogger().info("HTTPSPostBackend(updatePostLink): Storebag '{}' for realtimePostURL", *url);
     } else {
       f.realtimePostURL = f.postURL;
-      logger().info("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '{}'", orNull(f.postURL));
+      backendsLogger().info("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '{}'", orNull(f.postURL));
     }
   }
   return taken;
@@ -776,12 +772,12 @@ void HTTPSPostBackend::resetBackendStateWithClient(const Value& client) {
     fields_.eventThreshold = threshold;
     fields_.extrasOnInternal = extras;
   }
-  logger().info("resetBackendStateWithClient: event_threshold set to {}", threshold);
+  backendsLogger().info("resetBackendStateWithClient: event_threshold set to {}", threshold);
   if (threshold < 0) {
-    logger().error("resetBackendStateWithClient: event_threshold {} is negative: every batched event flushes the batch",
+    backendsLogger().error("resetBackendStateWithClient: event_threshold {} is negative: every batched event flushes the batch",
                    threshold);
   }
-  logger().info("setBackendStateWithClient: extras on internal is set to {}", extras);
+  backendsLogger().info("setBackendStateWithClient: extras on internal is set to {}", extras);
 }
 
 void HTTPSPostBackend::createFiltersFromArray(const Value& array) {
@@ -792,7 +788,7 @@ void HTTPSPostBackend::createFiltersFromArray(const Value& array) {
   for (const Value& element : *array.array()) {
     Filter filter;
     if (!element.isDict()) {
-      logger().error("HTTPSPostBackend(createFiltersFromArray): a filter is {}, not a dictionary; it keeps nothing",
+      backendsLogger().error("HTTPSPostBackend(createFiltersFromArray): a filter is {}, not a dictionary; it keeps nothing",
                      element.kindName());
     }
     const Value method = element["method"];
@@ -802,7 +798,7 @@ void HTTPSPostBackend::createFiltersFromArray(const Value& array) {
     const auto action = stringOf(element["action"]);
     filter.action = action == "remove" ? kFilterRemove : (action == "sha256" ? kFilterSHA256 : kFilterKeep);
     if (action && filter.action == kFilterKeep) {
-      logger().debug("HTTPSPostBackend(createFiltersFromArray): unknown filter action '{}' keeps its key", *action);
+      backendsLogger().debug("HTTPSPostBackend(createFiltersFromArray): unknown filter action '{}' keeps its key", *action);
     }
     filter.key = stringOf(element["key"]).value_or(std::string());
     filters->push_back(std::move(filter));
@@ -853,7 +849,7 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
   const Value clients = profile()["clients"];
   if (!clients.isArray()) {
     if (!clients.isNil()) {
-      logger().error("HTTPSPostBackend(updateBackendState): \"clients\" holds {}, not a list", clients.kindName());
+      backendsLogger().error("HTTPSPostBackend(updateBackendState): \"clients\" holds {}, not a list", clients.kindName());
     }
     return kBackendStateDisabled;
   }
@@ -866,7 +862,7 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
     if (entry.isDict()) {
       entries.push_back(entry);
     } else {
-      logger().error("HTTPSPostBackend(updateBackendState): a client entry is {}, not a dictionary; skipped",
+      backendsLogger().error("HTTPSPostBackend(updateBackendState): a client entry is {}, not a dictionary; skipped",
                      entry.kindName());
     }
   }
@@ -877,7 +873,7 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
       if (!expedite.isNil()) {
         const bool batch = expedite.intValue() == 0;
         setBatchEvents(batch);
-        logger().debug("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent={}", batch ? 1 : 0);
+        backendsLogger().debug("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent={}", batch ? 1 : 0);
       }
       break;
     }
@@ -918,30 +914,30 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
       fields_.dnuType = dnuType;
     }
     if (dnuType == 0 && !dnuEnabled) {
-      logger().debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: {}.", overrideDnu.intValue());
+      backendsLogger().debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: {}.", overrideDnu.intValue());
       return kBackendStateDisabled;
     }
     const Value locales = listOf(entry, "locale_whitelist");
     if (!matchStringWithList(locales, country, false)) {
-      logger().debug("HTTPSPostBackend(updateBackendState): ({}) isn't in country code list {}", orNull(country),
+      backendsLogger().debug("HTTPSPostBackend(updateBackendState): ({}) isn't in country code list {}", orNull(country),
                      locales.description());
       return kBackendStateDisabled;
     }
     const Value deviceWhitelist = listOf(entry, "device_whitelist");
     if (!matchStringWithList(deviceWhitelist, productFamily(), true)) {
-      logger().debug("HTTPSPostBackend(updateBackendState): ({}) isn't in device whitelist {}", orNull(productFamily()),
+      backendsLogger().debug("HTTPSPostBackend(updateBackendState): ({}) isn't in device whitelist {}", orNull(productFamily()),
                      deviceWhitelist.description());
       return kBackendStateDisabled;
     }
     const Value deviceBlacklist = listOf(entry, "device_blacklist");
     if (matchStringWithList(deviceBlacklist, hardwareType(), false)) {
-      logger().debug("HTTPSPostBackend(updateBackendState): ({}) is in device blacklist {}", orNull(hardwareType()),
+      backendsLogger().debug("HTTPSPostBackend(updateBackendState): ({}) is in device blacklist {}", orNull(hardwareType()),
                      deviceBlacklist.description());
       return kBackendStateDisabled;
     }
     const Value filters = listOf(entry, "filters");
     if (filters.isNil()) {
-      logger().error("HTTPSPostBackend(updateBackendState): filters are required.");
+      backendsLogger().error("HTTPSPostBackend(updateBackendState): filters are required.");
       return kBackendStateDisabled;
     }
     createFiltersFromArray(filters);
@@ -958,7 +954,7 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
           continue;
         }
         const Value replacement = numberOf(rule, "threshold");
-        logger().info("HTTPSPostBackend(updateBackendState): sampling threshold for {} changed from {:.2f} to {:.2f}",
+        backendsLogger().info("HTTPSPostBackend(updateBackendState): sampling threshold for {} changed from {:.2f} to {:.2f}",
                       *country, static_cast<float>(threshold.doubleValue()),
                       static_cast<float>(replacement.doubleValue()));
         threshold = replacement;
@@ -991,17 +987,17 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
       std::lock_guard lock(fieldsMutex_);
       fields_.uuidCustom = *custom;
     }
-    logger().info("HTTPSPostBackend(updateBackendState): {}: client found {}:{}, state={}, samplingFactor={:f}", name(),
+    backendsLogger().info("HTTPSPostBackend(updateBackendState): {}: client found {}:{}, state={}, samplingFactor={:f}", name(),
                   orNull(clientName), orNull(serviceName), result, factor);
 
     updatePostLink(entry);
     if (const Value whitelist = listOf(entry, "event_whitelist"); !whitelist.isNil()) {
       setEventWhitelist(whitelist);
-      logger().info("HTTPSPostBackend(updateBackendState): {}: eventWhitelist={}", name(), whitelist.description());
+      backendsLogger().info("HTTPSPostBackend(updateBackendState): {}: eventWhitelist={}", name(), whitelist.description());
     }
     if (const Value blacklist = listOf(entry, "event_blacklist"); !blacklist.isNil()) {
       setEventBlacklist(blacklist);
-      logger().info("HTTPSPostBackend(updateBackendState): {}: eventBlacklist={}", name(), blacklist.description());
+      backendsLogger().info("HTTPSPostBackend(updateBackendState): {}: eventBlacklist={}", name(), blacklist.description());
     }
     setShouldUseWiFiOnly(numberOf(entry, "use_wifi_only").intValue() != 0);
     return result;

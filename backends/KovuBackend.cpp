@@ -1,18 +1,10 @@
 #include "backends/KovuBackend.h"
+#include "backends/BackendsLog.h"
 
 #include "platform/Log.h"
 #include "platform/Paths.h"
 
 namespace zerith {
-
-namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("backends");
-  return l;
-}
-
-}  // namespace
 
 KovuBackend::KovuBackend(std::string name, Value profile, std::optional<std::string> productFamily)
     : ZerithBackend(std::move(name), std::move(profile), std::move(productFamily)) {}
@@ -21,9 +13,9 @@ std::shared_ptr<KovuBackend> KovuBackend::initWithName(std::string name, Value p
                                                        std::optional<std::string> productFamily,
                                                        std::int32_t clientType) {
   std::shared_ptr<KovuBackend> backend(new KovuBackend(std::move(name), std::move(profile), std::move(productFamily)));
-  logger().info("KovuBackend(initWithName): Loading Kovu adaptor class for client type {}", clientType);
+  backendsLogger().info("KovuBackend(initWithName): Loading Kovu adaptor class for client type {}", clientType);
   if (!isClientTypeAllowed(clientType)) {
-    logger().error("KovuBackend(initWithName): No matching bundle found for client type {}", clientType);
+    backendsLogger().error("KovuBackend(initWithName): No matching bundle found for client type {}", clientType);
     return nullptr;
   }
 
@@ -32,18 +24,18 @@ std::shared_ptr<KovuBackend> KovuBackend::initWithName(std::string name, Value p
   backend->clientBundle_.reset(::dlopen(path.c_str(), RTLD_NOW | RTLD_LOCAL));
   if (!backend->clientBundle_) {
     const char* why = ::dlerror();
-    logger().error("KovuBackend(initWithName): Could not load adaptor plugin {}: {}", path, why ? why : "unknown error");
+    backendsLogger().error("KovuBackend(initWithName): Could not load adaptor plugin {}: {}", path, why ? why : "unknown error");
     return backend;
   }
   backend->kovuAdaptorClass_ =
       reinterpret_cast<KovuAdaptorFactory>(::dlsym(backend->clientBundle_.get(), kKovuAdaptorFactorySymbol));
   if (backend->kovuAdaptorClass_ == nullptr) {
-    logger().error("KovuBackend(initWithName): Adaptor plugin {} has no {}", path, kKovuAdaptorFactorySymbol);
+    backendsLogger().error("KovuBackend(initWithName): Adaptor plugin {} has no {}", path, kKovuAdaptorFactorySymbol);
     return backend;
   }
   backend->kovuAdaptor_.reset(backend->kovuAdaptorClass_());
   if (backend->kovuAdaptor_ && backend->kovuAdaptor_->abiVersion() != kKovuAdaptorABIVersion) {
-    logger().error("KovuBackend(initWithName): Adaptor plugin {} speaks interface version {}, not {}", path,
+    backendsLogger().error("KovuBackend(initWithName): Adaptor plugin {} speaks interface version {}, not {}", path,
                    backend->kovuAdaptor_->abiVersion(), kKovuAdaptorABIVersion);
     backend->kovuAdaptor_.reset();
   }
@@ -67,7 +59,7 @@ KovuBackend::~KovuBackend() {
 std::optional<std::string> KovuBackend::sendMessage(const Value& message, const timeval&, std::uint16_t method,
                                                     std::uint16_t respCode, std::uint16_t, std::int32_t) {
   if (!kovuAdaptor_ || !kovuAdaptor_->respondsToSelector(kKovuForwardingSelector)) {
-    logger().error("KovuBackend(sendMessage): Kovu adaptor {} does not respond to forwarding selector {}",
+    backendsLogger().error("KovuBackend(sendMessage): Kovu adaptor {} does not respond to forwarding selector {}",
                    kovuAdaptor_ ? kovuAdaptor_->description() : std::string("(null)"), kKovuForwardingSelector);
     return std::nullopt;
   }

@@ -1,4 +1,5 @@
 #include "backends/UploadBackend.h"
+#include "backends/BackendsLog.h"
 
 
 #include <fmt/format.h>
@@ -10,11 +11,6 @@
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("backends");
-  return l;
-}
 
 constexpr char kUploadDescription[] = "Vidra AFRC log";
 
@@ -43,7 +39,7 @@ std::shared_ptr<UploadBackend> UploadBackend::initWithName(std::string name, Val
                                                            std::optional<std::string> productFamily) {
   const Value postURL = profile["post_url"];
   if (!postURL.string()) {
-    logger().error("UploadBackend(initWithName): can't resolve upload post URL.");
+    backendsLogger().error("UploadBackend(initWithName): can't resolve upload post URL.");
     return nullptr;
   }
   auto backend = std::make_shared<UploadBackend>(Token{}, std::move(name), profile, std::move(productFamily));
@@ -86,7 +82,7 @@ std::string UploadBackend::uploadAddressForFileName(std::string_view fileName) c
 }
 
 bool UploadBackend::uploadFileAtPath(const std::string& path, const char* extensionToken) {
-  logger().debug("UploadBackend(uploadFileAtPath): Uploading file {}", path);
+  backendsLogger().debug("UploadBackend(uploadFileAtPath): Uploading file {}", path);
   const auto base = uploadURL();
   if (!base) {
     return false;
@@ -102,8 +98,8 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const char* extens
     file.reset();
   }
   if (!file) {
-    logger().error("UploadBackend(uploadFileAtPath): Only upload a regular file.");
-    logger().debug("UploadBackend(uploadFileAtPath): {}: {}", path, why);
+    backendsLogger().error("UploadBackend(uploadFileAtPath): Only upload a regular file.");
+    backendsLogger().debug("UploadBackend(uploadFileAtPath): {}: {}", path, why);
     return false;
   }
 
@@ -111,19 +107,19 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const char* extens
   {
     std::optional<Data> contents = file->readAll(&why);
     if (!contents) {
-      logger().error("UploadBackend(uploadFileAtPath): Only upload a regular file.");
-      logger().debug("UploadBackend(uploadFileAtPath): {}: {}", path, why);
+      backendsLogger().error("UploadBackend(uploadFileAtPath): Only upload a regular file.");
+      backendsLogger().debug("UploadBackend(uploadFileAtPath): {}: {}", path, why);
       return false;
     }
     if (contents->empty()) {
-      logger().error("UploadBackend(uploadFileAtPath): Input file is empty");
+      backendsLogger().error("UploadBackend(uploadFileAtPath): Input file is empty");
       return false;
     }
     body = gzipDeflate(*contents);
   }
   const auto transport = reportingSessionConnectivityDelegate();
   if (!body || !transport) {
-    logger().error("UploadBackend(uploadFileAtPath): Unable to create URL request");
+    backendsLogger().error("UploadBackend(uploadFileAtPath): Unable to create URL request");
     return false;
   }
 
@@ -138,14 +134,14 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const char* extens
 
   if (!answer.data.empty()) {
     const std::string text(answer.data.begin(), answer.data.end());
-    logger().debug("UploadBackend(uploadFileAtPath): sending to |{}|, Json output: {}", *base, text);
+    backendsLogger().debug("UploadBackend(uploadFileAtPath): sending to |{}|, Json output: {}", *base, text);
     if (text.find("success") != std::string::npos) {
       if (!file->remove(&why)) {
-        logger().debug("UploadBackend(uploadFileAtPath): {} not removed: {}", path, why);
+        backendsLogger().debug("UploadBackend(uploadFileAtPath): {} not removed: {}", path, why);
       }
     }
   } else {
-    logger().error("UploadBackend(uploadFileAtPath): post {}",
+    backendsLogger().error("UploadBackend(uploadFileAtPath): post {}",
                    answer.error ? answer.error->description : std::string("(null)"));
   }
   return true;

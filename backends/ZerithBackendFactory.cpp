@@ -6,6 +6,7 @@
 #include <vector>
 #include <string_view>
 
+#include "backends/BackendsLog.h"
 #include "backends/DashboardBackend.h"
 #include "backends/HTTPSPostBackend.h"
 #include "backends/KovuBackend.h"
@@ -19,11 +20,6 @@
 namespace zerith {
 
 namespace {
-
-const log::Logger& logger() {
-  static const log::Logger l("backends");
-  return l;
-}
 
 struct Kind {
   const char* const* name;
@@ -126,7 +122,7 @@ std::shared_ptr<ZerithBackend> ZerithBackend::newBackendWithName(std::string_vie
     }
     return kind.make(name, profile, productFamily, clientType);
   }
-  logger().error("ZerithBackend(newBackendWithName): {}", name);
+  backendsLogger().error("ZerithBackend(newBackendWithName): {}", name);
   return nullptr;
 }
 
