@@ -77,6 +77,24 @@ bool listHolds(const Value& list, std::uint16_t category) {
 
 }  // namespace
 
+std::string_view backendCountName(BackendCount what) {
+  switch (what) {
+    case BackendCount::sent: return "sent";
+    case BackendCount::batched: return "batched";
+    case BackendCount::spooled: return "spooled";
+    case BackendCount::retried: return "retried";
+    case BackendCount::delivered: return "delivered";
+    case BackendCount::droppedSampledOut: return "droppedSampledOut";
+    case BackendCount::droppedFiltered: return "droppedFiltered";
+    case BackendCount::droppedBlacklisted: return "droppedBlacklisted";
+    case BackendCount::droppedDisabled: return "droppedDisabled";
+    case BackendCount::droppedSpoolFull: return "droppedSpoolFull";
+    case BackendCount::droppedTransportError: return "droppedTransportError";
+    case BackendCount::count_: break;
+  }
+  return "unknown";
+}
+
 std::string ZerithBackend::convertIntoSHA256(std::string_view text) {
   const std::size_t n = utf16Length(text);
   const auto digest = crypto::sha256(crypto::bytesOf(text.substr(0, n)));

@@ -19,6 +19,7 @@
 #include <utility>
 #include <vector>
 
+#include "backends/BackendCounters.h"
 #include "platform/Error.h"
 #include "platform/SerialQueue.h"
 #include "platform/Value.h"
@@ -116,6 +117,10 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
 
   virtual std::uint32_t batchedEventsSize();
 
+  // What became of this backend's events so far (see BackendCounters.h).
+  BackendCounters& counters() { return counters_; }
+  const BackendCounters& counters() const { return counters_; }
+
   // Properties; every accessor is atomic.
   const std::string& name() const { return name_; }
   std::uint32_t sessionID() const { return sessionID_.load(); }
@@ -197,6 +202,7 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   std::optional<Data> digestKey_;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
 
+  BackendCounters counters_;
   std::atomic<double> startTimeStamp_{0};
   std::atomic<std::uint32_t> sessionID_{0};
   std::atomic<std::int32_t> compType_{0};
