@@ -57,18 +57,6 @@ double statusMB(pid_t pid, const std::string& field) {
   return 0;
 }
 
-file::UniqueFd connectToDaemon() {
-  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  const std::string path = paths::socketPath().string();
-  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
-  if (!fd || ::connect(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
-    return file::UniqueFd();
-  }
-  return fd;
-}
-
 struct FloodResult {
   long callsWritten = 0;
   bool closedByDaemon = false;
@@ -165,7 +153,7 @@ void BM_FloodWithoutReading(benchmark::State& state) {
   for (auto _ : state) {
     std::vector<file::UniqueFd> sockets;
     for (int i = 0; i < flooders; ++i) {
-      sockets.push_back(connectToDaemon());
+      sockets.push_back(test::connectToDaemonSocket());
       if (!sockets.back()) {
         state.SkipWithError("a flooder could not connect");
         return;

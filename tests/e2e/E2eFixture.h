@@ -33,12 +33,8 @@ using namespace std::chrono_literals;
 class RawClient {
  public:
   static std::optional<RawClient> connect() {
-    file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    const std::string path = paths::socketPath().string();
-    std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
-    if (!fd || ::connect(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+    file::UniqueFd fd = connectToDaemonSocket();
+    if (!fd) {
       return std::nullopt;
     }
     return RawClient(std::move(fd));

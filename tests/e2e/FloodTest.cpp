@@ -13,22 +13,10 @@ namespace {
 
 constexpr const char* kDisplayURL = "fetchDisplayURL:";
 
-file::UniqueFd connectRaw() {
-  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  const std::string path = paths::socketPath().string();
-  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
-  if (!fd || ::connect(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
-    return file::UniqueFd();
-  }
-  return fd;
-}
-
 TEST_F(E2eTest, AClientThatFloodsCallsWithoutReadingIsHeldBackAndAnsweredInFullLater) {
   grant(Value(true));
   startDaemon();
-  file::UniqueFd flooder = connectRaw();
+  file::UniqueFd flooder = connectToDaemonSocket();
   ASSERT_TRUE(flooder);
   ::fcntl(flooder.get(), F_SETFL, ::fcntl(flooder.get(), F_GETFL) | O_NONBLOCK);
 

@@ -55,7 +55,10 @@ class HTTPSCollectorTest : public E2eTest {
     startDaemon(options);
   }
 
-  std::unique_ptr<Zerith> startSession(std::uint32_t sessionID) {
+  // `expectPosting`: the start reply names the HTTPS backend. A collector
+  // that refuses may disable the backend with its answer to the session's
+  // start record before the reply lists the backends.
+  std::unique_ptr<Zerith> startSession(std::uint32_t sessionID, bool expectPosting = true) {
     auto client = Zerith::connect();
     EXPECT_TRUE(client);
     if (!client) {
@@ -70,7 +73,9 @@ class HTTPSCollectorTest : public E2eTest {
     EXPECT_TRUE(client->setSessionInfo(info, user, Value(), false, 10s));
     const auto started = client->startConfig(20s);
     EXPECT_TRUE(started);
-    EXPECT_EQ(started["backends"], Value(Array{Value("httpsPost")})) << daemon->output();
+    if (expectPosting) {
+      EXPECT_EQ(started["backends"], Value(Array{Value("httpsPost")})) << daemon->output();
+    }
     return client;
   }
 
@@ -114,7 +119,7 @@ TEST_F(HTTPSCollectorTest, ClientEventsArriveAsRecordsWithSenderCodeAndSessionID
 
 TEST_F(HTTPSCollectorTest, ServerErrorFromTheCollectorDisablesTheBackend) {
   startAll(503);
-  auto client = startSession(77);
+  auto client = startSession(77, false);
   ASSERT_TRUE(client);
   ASSERT_TRUE(client->sendMessage(event(3, 4, {{"n", 1}}), 10s));
   ASSERT_TRUE(daemon->waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"))

@@ -15,6 +15,7 @@
 #include <cstring>
 #include <stdexcept>
 
+#include "platform/Paths.h"
 #include "tests/support/TempRoot.h"
 
 extern char** environ;
@@ -318,6 +319,18 @@ std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout)
 std::optional<int> DaemonProcess::stop(std::chrono::milliseconds timeout) {
   signal(SIGTERM);
   return waitForExit(timeout);
+}
+
+file::UniqueFd connectToDaemonSocket() {
+  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  const std::string path = paths::socketPath().string();
+  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+  if (!fd || ::connect(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+    return file::UniqueFd();
+  }
+  return fd;
 }
 
 }  // namespace zerith::test

@@ -100,4 +100,9 @@ class DaemonProcess {
   bool ready_ = false;
 };
 
+// A bare client socket connected to the daemon's listener (the socket path
+// of the current root), for tests that speak the wire protocol themselves;
+// empty when nothing listens there.
+file::UniqueFd connectToDaemonSocket();
+
 }  // namespace zerith::test
