@@ -130,6 +130,11 @@ class E2eTest : public ::testing::Test {
     root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
   }
 
+  // The storebag signing key the daemon verifies with.
+  void installPublicKey(const Data& der) {
+    root.write("/usr/share/zerith/publicKey.der", std::string(der.begin(), der.end()));
+  }
+
   DaemonProcess& startDaemon(DaemonProcess::Options options = {}) {
     if (options.arguments.empty()) {
       options.arguments = {"--stop-timeout", "5"};

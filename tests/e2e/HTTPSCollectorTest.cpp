@@ -26,7 +26,7 @@ class HTTPSCollectorTest : public E2eTest {
     grant(Value(true));
     const auto keys = generateStorebagKeyPair(2048);
     ASSERT_TRUE(keys.has_value());
-    root.write("/usr/share/zerith/publicKey.der", std::string(keys->publicKeyDER.begin(), keys->publicKeyDER.end()));
+    installPublicKey(keys->publicKeyDER);
     const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     collector = std::make_unique<CollectorProcess>(

@@ -75,7 +75,7 @@ class SessionsTogetherTest : public E2eTest {
     grant(Value(true));
     const auto keys = generateStorebagKeyPair(2048);
     ASSERT_TRUE(keys.has_value());
-    root.write("/usr/share/zerith/publicKey.der", std::string(keys->publicKeyDER.begin(), keys->publicKeyDER.end()));
+    installPublicKey(keys->publicKeyDER);
     const Value bag(Dictionary{
         {"version", Value("6.1.0")},
         {"seed", Value(Dictionary{{kZerithBackendKovu, Value(Dictionary{})},

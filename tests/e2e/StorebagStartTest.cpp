@@ -45,10 +45,6 @@ class StorebagStartTest : public E2eTest {
     return startDaemon(options);
   }
 
-  void installPublicKey(const Data& der) {
-    root.write("/usr/share/zerith/publicKey.der", std::string(der.begin(), der.end()));
-  }
-
   // One session's start: its backends, nil when the daemon has no storebag.
   Value startSession() {
     auto client = Zerith::connect();
