@@ -553,6 +553,12 @@ void CollectorServer::handle(Connection& connection) {
     }
 
     const Behaviour now = behaviour();
+    if (now.kind == Behaviour::Kind::close) {
+      // A connection kept alive from before: closed at its next request.
+      line["kind"] = "closed";
+      writer_(render(line));
+      return;
+    }
     if (now.kind == Behaviour::Kind::stall) {
       const auto until = std::chrono::steady_clock::now() + std::chrono::milliseconds(now.value);
       while (!stopping_ && std::chrono::steady_clock::now() < until) {
