@@ -557,13 +557,15 @@ void SpoolStore::remove(const std::string& name) {
 std::vector<SpoolStore::Dropped> SpoolStore::dropExpired(std::int64_t nowMillis) {
   std::vector<Dropped> dropped;
   const std::int64_t oldestKept = nowMillis - maxAgeSeconds_ * 1000;
-  // Creation times follow the names, but a clock set back may break that:
-  // look at every entry.
+  // Names and creation times come from one clock reading, so the index is
+  // in creation order (a clock set back gives later batches both a smaller
+  // name and an earlier time): the expired ones are a prefix of it.
   std::vector<std::string> expired;
   for (const auto& [name, entry] : index_) {
-    if (entry.createdMillis < oldestKept) {
-      expired.push_back(name);
+    if (entry.createdMillis >= oldestKept) {
+      break;
     }
+    expired.push_back(name);
   }
   for (const std::string& name : expired) {
     Entry entry = index_.at(name);
