@@ -1,5 +1,6 @@
 #include "backends/HTTPSPostBackend.h"
 #include "backends/BackendsLog.h"
+#include "backends/Spool.h"
 
 #include <algorithm>
 #include <cctype>
@@ -165,6 +166,21 @@ std::optional<nlohmann::ordered_json> wireValue(const std::string& key, const Va
   return std::nullopt;
 }
 
+// A post that failed (no answer, or a 5xx): the spool keeps its batch when
+// it is on, otherwise the batch is gone and counted so.
+void postFailed(const std::weak_ptr<ZerithBackend>& weak, const std::shared_ptr<const URLRequest>& kept,
+                std::uint32_t records) {
+  if (kept) {
+    if (auto spool = Spool::shared()) {
+      spool->keep(*kept, records, weak);
+      return;
+    }
+  }
+  if (auto self = weak.lock()) {
+    self->counters().add(BackendCount::droppedTransportError, records);
+  }
+}
+
 }  // namespace
 
 std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(std::string name, const Value& profile,
@@ -202,6 +218,7 @@ HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::
   const auto force = defaultsStringForKey("forceEventLogging");
   f.forceEventLogging = force && (Value(*force).boolValue() || equalsIgnoringCase(*force, "true") ||
                                   equalsIgnoringCase(*force, "yes"));
+  f.spoolEnabled = spoolEnabledInDefaults();
   fields_ = std::move(f);
 }
 
@@ -333,6 +350,11 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
       if (auto wire = wireValue(key, value)) {
         record[key] = std::move(*wire);
       }
+    }
+    if (f.spoolEnabled) {
+      // Set once, here: a spooled batch is posted again byte for byte, so
+      // the collector sees the same ID on every copy of the record.
+      record["_recordID"] = newRecordID();
     }
     records.push_back(std::move(record));
   }
@@ -559,13 +581,30 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
   }
   std::weak_ptr<ZerithBackend> weak = weak_from_this();
   const std::string backendName = name();
+  const std::uint32_t records = countEnvelopeRecords(json);
+  // With the spool on, the request is kept for the answer: a failure hands
+  // it to the spool as it was sent.
+  std::shared_ptr<const URLRequest> kept = f.spoolEnabled ? std::make_shared<const URLRequest>(request) : nullptr;
   transport->postURLRequestWithCompletionHandler(
-      request, [weak, backendName, completion](const Data&, const std::optional<HTTPURLResponse>& response,
-                                               const std::optional<Error>& error) {
+      request, [weak, backendName, completion, records, kept](const Data&, const std::optional<HTTPURLResponse>& response,
+                                                              const std::optional<Error>& error) {
         if (error) {
           backendsLogger().error("HTTPSPostBackend(postJsonMessage): post error: {}", error->description);
         }
-        if (response && response->statusCode >= 500 && response->statusCode <= 599) {
+        const bool serverError = response && response->statusCode >= 500 && response->statusCode <= 599;
+        if (error || serverError) {
+          postFailed(weak, kept, records);
+        } else if (response && response->statusCode >= 200 && response->statusCode <= 299) {
+          if (auto self = weak.lock()) {
+            self->counters().add(BackendCount::delivered, records);
+          }
+          if (Spool* spool = Spool::current()) {
+            spool->collectorAnswered();
+          }
+        } else if (auto self = weak.lock()) {
+          self->counters().add(BackendCount::droppedTransportError, records);
+        }
+        if (serverError) {
           const std::string text =
               fmt::format("backend {} disabled by server {} return code", backendName, response->statusCode);
           // The state is queued before the line is written, so whoever

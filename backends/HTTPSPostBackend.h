@@ -138,6 +138,7 @@ class HTTPSPostBackend : public ZerithBackend {
     std::optional<std::string> uuidCustom;
     bool forceEventLogging = false;
     bool immutable = false;
+    bool spoolEnabled = false;  // "spoolEnabled": records carry "_recordID", failed posts are spooled
   };
   Fields fields() const;
   void setImmutable();

@@ -9,10 +9,19 @@
 // --idle-seconds, the CPU time and wake-ups of the idle process holding ten
 // open sessions, per minute.
 //
+// With --spool-outage, a further zerithd run with the spool on: the
+// collector is down (every connection closed at accept) while the load is
+// sent, so every batch goes to the spool; reported: events spooled per
+// second, the spool's disk bytes per event, the daemon's CPU per spooled
+// event, and the time to drain the backlog once the collector is up again
+// (first retry after at most the one-second back-off ceiling included),
+// beside the normal run's delivered rate.
+//
 //   e2e_pipeline_bench --clients 8 --events 200000
 //   e2e_pipeline_bench --clients 8 --events 30000 --rate 1000
 //   e2e_pipeline_bench --events 1000000 --memory-sample 10000
 //   e2e_pipeline_bench --smoke --events 3000        (exit 1 unless lossless)
+//   e2e_pipeline_bench --pipelines zerithd --events 1000000 --spool-outage --memory-sample 0
 //
 // Not a timed test: --smoke only checks the counts.
 
@@ -23,7 +32,9 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <iostream>
+#include <map>
 #include <optional>
 #include <sstream>
 #include <thread>
@@ -33,6 +44,7 @@
 #include "bench/pipeline/PeerPipeline.h"
 #include "bench/pipeline/ProcStats.h"
 #include "bench/pipeline/ZerithdPipeline.h"
+#include "backends/Spool.h"
 #include "tests/support/TestCA.h"
 
 namespace zerith::bench {
@@ -49,6 +61,7 @@ struct Settings {
   int idleSessions = 10;
   std::chrono::milliseconds stall{30000};
   bool smoke = false;
+  bool spoolOutage = false;
   std::string collector = "zerith-collector";
 };
 
@@ -179,6 +192,168 @@ Report runZerithd(const Settings& s, Collector& collector) {
   return r;
 }
 
+// The zerithd run with the collector down and then up again.
+struct OutageReport {
+  std::string error{};
+  std::uint64_t expected = 0;
+  LoadResult load{};
+  double spoolSeconds = 0;  // from the first event sent to the last record on disk
+  std::uint64_t spooledRecords = 0;
+  std::uint64_t spoolFiles = 0;
+  std::uint64_t spoolBytes = 0;
+  double drainSeconds = 0;  // from the collector's return to the last event delivered
+  Collector::Counts counts{};
+  std::optional<ProcSample> before{}, spooled{}, drained{};
+
+  bool lossless() const {
+    return error.empty() && counts.records == expected && counts.duplicates == 0 && counts.unexpected == 0;
+  }
+  double spooledPerSecond() const { return spoolSeconds > 0 ? expected / spoolSeconds : 0; }
+  double drainedPerSecond() const { return drainSeconds > 0 ? counts.records / drainSeconds : 0; }
+  double bytesPerEvent() const { return expected ? static_cast<double>(spoolBytes) / expected : 0; }
+  double cpuMicrosPerSpooledEvent() const {
+    return before && spooled && expected ? (spooled->cpuSeconds - before->cpuSeconds) * 1e6 / expected : 0;
+  }
+  double cpuMicrosPerDrainedEvent() const {
+    return spooled && drained && counts.records ? (drained->cpuSeconds - spooled->cpuSeconds) * 1e6 / counts.records : 0;
+  }
+};
+
+// The records, files and bytes in a spool folder, each file's header read
+// once (the daemon never rewrites a file in place).
+class SpoolScan {
+ public:
+  explicit SpoolScan(std::filesystem::path folder) : folder_(std::move(folder)) {}
+  void update() {
+    std::error_code ec;
+    for (const auto& entry : std::filesystem::directory_iterator(folder_, ec)) {
+      const std::string name = entry.path().filename().string();
+      if (entry.path().extension() != ".zspool" || seen_.count(name)) {
+        continue;
+      }
+      std::ifstream in(entry.path(), std::ios::binary);
+      std::uint8_t head[kSpoolHeaderSize];
+      if (!in.read(reinterpret_cast<char*>(head), sizeof head)) {
+        continue;
+      }
+      if (const auto header = decodeSpoolHeader(std::span<const std::uint8_t>(head, sizeof head), nullptr)) {
+        seen_[name] = header->recordCount;
+        records_ += header->recordCount;
+        bytes_ += kSpoolHeaderSize + header->bodyLength;
+      }
+    }
+  }
+  std::uint64_t records() const { return records_; }
+  std::uint64_t bytes() const { return bytes_; }
+  std::uint64_t files() const { return seen_.size(); }
+
+ private:
+  std::filesystem::path folder_;
+  std::map<std::string, std::uint32_t> seen_;
+  std::uint64_t records_ = 0;
+  std::uint64_t bytes_ = 0;
+};
+
+OutageReport runZerithdOutage(const Settings& s, Collector& collector) {
+  OutageReport r{.expected = s.events};
+  // A spool large enough for the backlog; a back-off ceiling of one second
+  // so that the drain starts soon after the collector's return.
+  ZerithdPipeline daemon({.postURL = collector.url("/spool"),
+                          .defaults = Dictionary{{"spoolEnabled", Value(true)},
+                                                 {"spoolMaxBytes", Value(16ull << 30)},
+                                                 {"spoolRetryInitialSeconds", Value(0.5)},
+                                                 {"spoolRetryMaxSeconds", Value(1.0)}}});
+  if (!daemon.ready()) {
+    r.error = daemon.error();
+    return r;
+  }
+  std::vector<std::unique_ptr<Zerith>> sessions;
+  for (int i = 0; i < s.load.clients; ++i) {
+    std::string why;
+    auto session = daemon.openSession(static_cast<std::uint32_t>(i) + 1, &why);
+    if (!session) {
+      r.error = why;
+      return r;
+    }
+    sessions.push_back(std::move(session));
+  }
+  collector.setDown(true);
+  collector.expect(s.events);
+  r.before = sampleProcess(daemon.pid());
+  const auto t0 = Clock::now();
+  r.load = runZerithdLoad(s.load, sessions);
+  if (!r.load.error.empty()) {
+    r.error = r.load.error;
+    collector.setDown(false);
+    return r;
+  }
+  // Every event on disk: the sessions' own start records come on top.
+  SpoolScan scan(daemon.spoolFolder());
+  auto lastChange = Clock::now();
+  std::uint64_t lastRecords = 0;
+  while (true) {
+    scan.update();
+    if (scan.records() >= s.events) {
+      break;
+    }
+    if (scan.records() != lastRecords) {
+      lastRecords = scan.records();
+      lastChange = Clock::now();
+    } else if (Clock::now() - lastChange > s.stall) {
+      r.error = "spooling stalled at " + std::to_string(scan.records()) + " records";
+      break;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  r.spoolSeconds = std::chrono::duration<double>(Clock::now() - t0).count();
+  r.spooled = sampleProcess(daemon.pid());
+  r.spooledRecords = scan.records();
+  r.spoolFiles = scan.files();
+  r.spoolBytes = scan.bytes();
+
+  const auto t1 = Clock::now();
+  collector.setDown(false);
+  if (!collector.waitForRecords(s.events, s.stall) && r.error.empty()) {
+    r.error = "drain stalled";
+  }
+  r.drainSeconds = std::chrono::duration<double>(Clock::now() - t1).count();
+  r.drained = sampleProcess(daemon.pid());
+  r.counts = collector.counts();
+  if (!r.lossless()) {
+    const std::string log = daemon.output();
+    r.error += "\n" + log.substr(log.size() > 4000 ? log.size() - 4000 : 0);
+  }
+  return r;
+}
+
+void printOutage(const OutageReport& o, const std::vector<Report>& reports) {
+  std::printf(
+      "\nspool outage run (collector down while sending, then up):\n"
+      "| events | spooled/s | spool files | spool bytes/event | CPU µs/spooled event | drain s | drained/s | "
+      "CPU µs/drained event | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|\n");
+  std::printf("| %llu | %.0f | %llu | %.1f | %.2f | %.2f | %.0f | %.2f | %llu | %lld | %llu |\n",
+              static_cast<unsigned long long>(o.expected), o.spooledPerSecond(),
+              static_cast<unsigned long long>(o.spoolFiles), o.bytesPerEvent(), o.cpuMicrosPerSpooledEvent(),
+              o.drainSeconds, o.drainedPerSecond(), o.cpuMicrosPerDrainedEvent(),
+              static_cast<unsigned long long>(o.counts.records),
+              static_cast<long long>(o.expected) - static_cast<long long>(o.counts.records),
+              static_cast<unsigned long long>(o.counts.duplicates));
+  for (const auto& r : reports) {
+    if (r.pipeline == "zerithd" && r.lossless() && r.deliveredPerSecond() > 0) {
+      std::printf("ratio to the normal zerithd run: spooled/s %.2f, drained/s %.2f (normal delivered/s %.0f)\n",
+                  o.spooledPerSecond() / r.deliveredPerSecond(), o.drainedPerSecond() / r.deliveredPerSecond(),
+                  r.deliveredPerSecond());
+    }
+  }
+  std::printf("zerithd-spool: %s", o.lossless() ? "lossless\n" : "NOT lossless");
+  if (!o.lossless()) {
+    std::printf(" (expected %llu, records %llu, duplicates %llu)%s%s\n", static_cast<unsigned long long>(o.expected),
+                static_cast<unsigned long long>(o.counts.records), static_cast<unsigned long long>(o.counts.duplicates),
+                o.error.empty() ? "" : ": ", o.error.c_str());
+  }
+  std::fflush(stdout);
+}
+
 std::string kib(const std::optional<ProcSample>& s, std::uint64_t ProcSample::*field) {
   return s ? std::to_string((*s).*field) : std::string("-");
 }
@@ -261,9 +436,15 @@ int main(int argc, char** argv) {
   app.add_option("--idle-sessions", s.idleSessions, "sessions held open while idle");
   app.add_option("--collector", s.collector, "zerith-collector (one line per record) or test-server")
       ->check(CLI::IsMember({"zerith-collector", "test-server"}));
+  app.add_flag("--spool-outage", s.spoolOutage,
+               "also run zerithd with the spool on and the collector down while sending, then up");
   app.add_flag("--smoke", s.smoke, "exit 1 unless every pipeline delivered every event exactly once");
   CLI11_PARSE(app, argc, argv);
 
+  if (s.spoolOutage && s.collector != "zerith-collector") {
+    std::fprintf(stderr, "--spool-outage needs --collector zerith-collector (the one that can go down)\n");
+    return 2;
+  }
   s.load.eventsPerClient = s.events / static_cast<std::uint64_t>(s.load.clients);
   s.events = s.load.eventsPerClient * static_cast<std::uint64_t>(s.load.clients);
   if (!std::getenv("ZERITHD_BINARY")) {
@@ -276,16 +457,26 @@ int main(int argc, char** argv) {
     return 2;
   }
   std::vector<Report> reports;
+  std::optional<OutageReport> outage;
   {
     Collector collector(s.collector == "test-server" ? Collector::Server::TestServer
                                                      : Collector::Server::ZerithCollector);
     for (const auto& pipeline : s.pipelines) {
       reports.push_back(pipeline == "peer" ? runPeer(s, collector, folder) : runZerithd(s, collector));
     }
+    if (s.spoolOutage) {
+      outage = runZerithdOutage(s, collector);
+    }
   }
   std::filesystem::remove_all(folder);
   print(s, reports);
+  if (outage) {
+    printOutage(*outage, reports);
+  }
   if (s.smoke) {
+    if (outage && !outage->lossless()) {
+      return 1;
+    }
     for (const auto& r : reports) {
       if (!r.lossless()) {
         return 1;

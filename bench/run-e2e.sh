@@ -6,7 +6,9 @@
 #
 # Loads: 1 and 8 clients as fast as taken; 8 clients paced at 100 and 1,000
 # events/s; one run of 1,000,000 events with a memory sample after 10,000;
-# the idle processes with ten open sessions for a minute. Every run checks
+# the idle processes with ten open sessions for a minute; zerithd with the
+# spool on and the collector down for 1,000,000 events, then up (backlog
+# spooled and drained). Every run checks
 # that each event arrived exactly once and prints "NOT lossless" otherwise.
 # Set QUICK=1 for shorter runs (a tenth of the events, 10 s idle).
 set -euo pipefail
@@ -30,5 +32,8 @@ run --clients 8 --events $((3000 / scale)) --rate 100 --memory-sample 0
 run --clients 8 --events $((30000 / scale)) --rate 1000 --memory-sample 0
 run --clients 8 --events $((1000000 / scale)) --memory-sample 10000
 run --clients 1 --events 1000 --memory-sample 0 --idle-seconds "$idle" --idle-sessions 10
+# The spool: a backlog of 1,000,000 events built while the collector is down,
+# then drained, beside a normal zerithd run of the same load.
+run --pipelines zerithd --clients 8 --events $((1000000 / scale)) --memory-sample 0 --spool-outage
 echo
 echo "load average after: $(cut -d' ' -f1-3 /proc/loadavg)"

@@ -18,6 +18,7 @@
 #include <sanitizer/lsan_interface.h>
 #endif
 
+#include "backends/Spool.h"
 #include "daemon/KeepAliveTransaction.h"
 #include "daemon/StorebagCache.h"
 #include "daemon/ZerithdAgent.h"
@@ -88,6 +89,9 @@ int ZerithdDaemon::run() {
     return 1;
   }
   ReportingSessionConnectivityHelper::cleanupStorageRootFolder();
+  // Batches that an earlier run spooled go out now, whether or not a
+  // client comes back: each file carries its URL and headers.
+  Spool::shared();
 
   auto listener = ipc::Listener::create(paths::socketPath(), std::make_shared<const ipc::EntitlementPolicy>());
   if (!listener) {

@@ -57,6 +57,7 @@ fs::path resolve(std::string_view absolute) {
 
 fs::path socketPath() { return resolve("/run/zerithd/com.velmar.zerithd"); }
 fs::path defaultsDir() { return resolve("/var/lib/zerithd/defaults"); }
+fs::path spoolDir() { return resolve("/var/lib/zerithd/spool"); }
 fs::path storebagCacheDir() {
   // Relocated: a folder of the root stands for the service user's home.
   if (relocated()) {

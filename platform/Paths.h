@@ -25,6 +25,7 @@ fs::path resolve(std::string_view absolute);
 
 fs::path socketPath();          // /run/zerithd/com.velmar.zerithd
 fs::path defaultsDir();         // /var/lib/zerithd/defaults
+fs::path spoolDir();            // /var/lib/zerithd/spool
 fs::path storebagCacheDir();    // ~/.cache/zerithd/storebags of the service user; $CACHE_DIRECTORY/storebags under systemd
 fs::path messageLogDir();       // /var/log/faultkeep/retired
 fs::path uploadStorageDir();    // /tmp/zthstorage

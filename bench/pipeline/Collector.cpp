@@ -47,6 +47,14 @@ Collector::~Collector() {
   }
 }
 
+void Collector::setDown(bool down) {
+  if (collectorServer_) {
+    collector::Behaviour behaviour;
+    behaviour.kind = down ? collector::Behaviour::Kind::close : collector::Behaviour::Kind::answer;
+    collectorServer_->setBehaviour(behaviour);
+  }
+}
+
 std::string Collector::url(std::string_view path) const {
   return collectorServer_ ? collectorServer_->baseURL() + std::string(path) : testServer_->url(path);
 }

@@ -79,6 +79,10 @@ class Collector {
   // "https://127.0.0.1:<port><path>"; every path counts.
   std::string url(std::string_view path) const;
 
+  // Down: every connection is closed as soon as it is accepted (the
+  // zerith-collector server only); up again: answered as before.
+  void setDown(bool down);
+
   // Starts a new count: identifiers 0 .. ids-1 are expected, once each.
   void expect(std::uint64_t ids);
   Counts counts() const;

@@ -15,6 +15,8 @@
 
 namespace zerith::bench {
 
+std::string ZerithdPipeline::spoolFolder() const { return (root_->path() / "var/lib/zerithd/spool").string(); }
+
 namespace {
 
 using namespace std::chrono_literals;
@@ -68,6 +70,9 @@ ZerithdPipeline::ZerithdPipeline(Options options) {
                                       .headers = {{"Cache-Control", "max-age=3600"}},
                                       .body = std::string(container->begin(), container->end())});
   Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(storebagServer_->url("/zerith")));
+  for (const auto& [key, value] : options.defaults) {
+    Defaults("com.velmar.zerith").setObject(key, value);
+  }
 
   test::DaemonProcess::Options daemonOptions;
   daemonOptions.debug = options.debugLog;

@@ -29,6 +29,9 @@ class ZerithdPipeline {
     std::string postURL;       // the collector
     int eventThreshold = 49;   // a batch is posted when its 51st record arrives: 50 per post
     bool debugLog = false;
+    // Defaults keys of com.velmar.zerith set before the daemon starts (the
+    // spool's, for the outage run).
+    Dictionary defaults{};
   };
 
   explicit ZerithdPipeline(Options options);
@@ -39,6 +42,8 @@ class ZerithdPipeline {
   bool ready() const;
   pid_t pid() const;
   std::string output() const;
+  // The daemon's spool folder.
+  std::string spoolFolder() const;
   // Why the pipeline is not ready (empty when it is).
   const std::string& error() const { return error_; }
 

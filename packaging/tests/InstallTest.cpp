@@ -249,6 +249,7 @@ TEST_F(InstalledTree, SysusersAndTmpfilesMakeTheUserTheGroupAndItsFolders) {
   };
   const std::vector<Expected> expected{
       {paths::defaultsDir(), true, 0750},
+      {paths::spoolDir(), true, 0700},
       {"/var/cache/zerithd/storebags", true, 0750},
       {paths::messageLogDir(), true, 0750},
       {"/var/log/zerithd", true, 0750},

@@ -314,7 +314,63 @@ void CollectorServer::stop() {
   idle_.wait(lock, [&] { return threads_ == 0; });
 }
 
+std::optional<Behaviour> Behaviour::parse(std::string_view text) {
+  std::istringstream in{std::string(text)};
+  std::string word;
+  in >> word;
+  Behaviour b;
+  if (word.empty() || word == "answer") {
+    return b;
+  }
+  if (word == "close") {
+    b.kind = Kind::close;
+    return b;
+  }
+  long long n = -1;
+  if (!(in >> n)) {
+    return std::nullopt;
+  }
+  if (word == "status" && n >= 100 && n <= 599) {
+    b.kind = Kind::status;
+  } else if (word == "stall" && n >= 0 && n <= 600000) {
+    b.kind = Kind::stall;
+  } else {
+    return std::nullopt;
+  }
+  b.value = static_cast<int>(n);
+  return b;
+}
+
+void CollectorServer::setBehaviour(Behaviour behaviour) {
+  std::lock_guard lock(behaviourMutex_);
+  behaviour_ = behaviour;
+}
+
+std::uint64_t CollectorServer::distinctRecords() const {
+  std::lock_guard lock(behaviourMutex_);
+  return seenRecordIDs_.size();
+}
+
+Behaviour CollectorServer::behaviour() {
+  std::lock_guard lock(behaviourMutex_);
+  if (!options_.behaviourFile.empty()) {
+    std::ifstream in(options_.behaviourFile);
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    if (in.is_open()) {
+      if (auto parsed = Behaviour::parse(text)) {
+        return *parsed;
+      }
+      writer_(render(Json{{"time", nowSeconds()}, {"kind", "refused"}, {"error", "bad behaviour file text: " + text}}));
+    }
+  }
+  return behaviour_;
+}
+
 void CollectorServer::serveConnection(int fd) {
+  if (behaviour().kind == Behaviour::Kind::close) {
+    writer_(render(Json{{"time", nowSeconds()}, {"kind", "closed"}}));
+    return;  // the caller closes the socket
+  }
   timeval tv{options_.idleTimeoutSeconds, 0};
   ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof(tv));
   ::setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof(tv));
@@ -496,13 +552,32 @@ void CollectorServer::handle(Connection& connection) {
       return;
     }
 
+    const Behaviour now = behaviour();
+    if (now.kind == Behaviour::Kind::close) {
+      // A connection kept alive from before: closed at its next request.
+      line["kind"] = "closed";
+      writer_(render(line));
+      return;
+    }
+    if (now.kind == Behaviour::Kind::stall) {
+      const auto until = std::chrono::steady_clock::now() + std::chrono::milliseconds(now.value);
+      while (!stopping_ && std::chrono::steady_clock::now() < until) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+      }
+      line["kind"] = "stalled";
+      line["bodySize"] = body.size();
+      writer_(render(line));
+      return;  // closed without an answer
+    }
+    const int status = now.kind == Behaviour::Kind::status ? now.value : options_.status;
+
     const DecodedBody decoded = decodeRequestBody(contentEncoding, body, options_.limits);
     if (!decoded.ok) {
       refuse(decoded.error.find("exceeds") != std::string::npos || decoded.error.find("beyond") != std::string::npos ? 413 : 415,
              decoded.error);
       return;
     }
-    line["status"] = options_.status;
+    line["status"] = status;
     line["bodySize"] = body.size();
     line["gzip"] = decoded.wasGzip;
     if (options_.digestKey) {
@@ -525,9 +600,22 @@ void CollectorServer::handle(Connection& connection) {
         common["events"] = 0;
         writer_(render(common));
       }
+      const bool taken = status >= 200 && status <= 299;
       for (const Json& record : events) {
         Json out = common;
         out["kind"] = "record";
+        if (options_.dropDuplicates && taken && record.is_object() && record.contains("_recordID") &&
+            record["_recordID"].is_string()) {
+          std::lock_guard lock(behaviourMutex_);
+          if (!seenRecordIDs_.insert(record["_recordID"].get<std::string>()).second) {
+            ++duplicates_;
+            out["kind"] = "duplicate";
+            out["_recordID"] = record["_recordID"];
+            out["duplicates"] = duplicates_.load();
+            writer_(render(out));
+            continue;
+          }
+        }
         out["_sender"] = record.is_object() && record.contains("_sender") ? record["_sender"] : Json(nullptr);
         out["_sessionID"] = record.is_object() && record.contains("_sessionID") ? record["_sessionID"] : Json(nullptr);
         out["record"] = record;
@@ -555,7 +643,7 @@ void CollectorServer::handle(Connection& connection) {
       writer_(render(line));
       answerText = logData ? stored : options_.answerText;
     }
-    if (!answer(options_.status, answerText) || !keepAlive) {
+    if (!answer(status, answerText) || !keepAlive) {
       return;
     }
   }

@@ -14,6 +14,18 @@
 //   GET                       one "get" line; files of the serve folder are
 //                             answered (with Last-Modified/304)
 //   refused request           one "refused" line with the reason
+//   a record seen before      with duplicate dropping on: one "duplicate"
+//                             line with its "_recordID" instead of "record"
+//
+// The behaviour can change while it runs (tests of a collector that fails
+// and recovers): setBehaviour(), or a behaviour file read before every
+// connection and request. Its text is one of
+//
+//   answer          answer as the options say (also: no file, empty file)
+//   status N        answer every POST with status N (records are not taken)
+//   stall MS        take the request, hold it MS milliseconds, then close the
+//                   connection without an answer ("stalled" line)
+//   close           close every connection as soon as it is accepted
 //
 // Every line carries the method, path, query, the headers in wire order,
 // the status answered and, when a digest key is set, whether
@@ -54,6 +66,18 @@ struct CollectorOptions {
   BodyLimits limits;
   std::size_t maxConnections = 64;
   int idleTimeoutSeconds = 10;
+  std::filesystem::path behaviourFile;    // empty: setBehaviour() only
+  // Records whose "_recordID" was taken before (2xx) are not taken again:
+  // they are written as "duplicate" lines and counted.
+  bool dropDuplicates = false;
+};
+
+struct Behaviour {
+  enum class Kind { answer, status, stall, close };
+  Kind kind = Kind::answer;
+  int value = 0;  // the status, or the stall in ms
+  // nullopt for text that is none of the behaviours.
+  static std::optional<Behaviour> parse(std::string_view text);
 };
 
 class CollectorServer {
@@ -76,6 +100,13 @@ class CollectorServer {
   // Ends run(), closes every connection and waits for their threads.
   void stop();
 
+  // Takes effect from the next connection or request (a behaviour file,
+  // when set, wins).
+  void setBehaviour(Behaviour behaviour);
+  // Records dropped as duplicates, and records taken (distinct IDs).
+  std::uint64_t duplicates() const { return duplicates_; }
+  std::uint64_t distinctRecords() const;
+
   struct Connection;
 
  private:
@@ -90,6 +121,12 @@ class CollectorServer {
   int port_ = 0;
   std::atomic<bool> stopping_{false};
   std::atomic<std::uint64_t> stored_{0};
+  std::atomic<std::uint64_t> duplicates_{0};
+
+  Behaviour behaviour();
+  mutable std::mutex behaviourMutex_;
+  Behaviour behaviour_;
+  std::set<std::string> seenRecordIDs_;  // behaviourMutex_
 
   std::mutex mutex_;
   std::condition_variable idle_;

@@ -10,7 +10,9 @@
 // --out FILE (stdout), --status N (200), --digest-key KEY, --store DIR,
 // --answer TEXT ("success"), --log-data-path PATH ("/logdata"),
 // --serve DIR (GET of static files, e.g. a storebag), --max-body BYTES,
-// --max-inflated BYTES. Stops on SIGINT/SIGTERM, or when the process named
+// --max-inflated BYTES, --behaviour-file FILE (answer | status N | stall MS |
+// close, read before every connection and request), --drop-duplicates
+// (records by "_recordID"). Stops on SIGINT/SIGTERM, or when the process named
 // by --parent-pid has gone.
 
 #include <signal.h>
@@ -59,6 +61,11 @@ int main(int argc, char** argv) {
   app.add_option("--max-body", maxBody, "largest body taken, in bytes")->check(CLI::PositiveNumber);
   app.add_option("--max-inflated", maxInflated, "largest body after gzip is undone, in bytes")->check(CLI::PositiveNumber);
   app.add_option("--parent-pid", parentPid, "stop once this process has gone");
+  app.add_option("--behaviour-file", options.behaviourFile,
+                 "read how to behave from this file before every connection and request: "
+                 "answer, status N, stall MS or close");
+  app.add_flag("--drop-duplicates", options.dropDuplicates,
+               "write records whose _recordID was taken before as \"duplicate\" lines");
   CLI11_PARSE(app, argc, argv);
 
   options.limits.maxBodyBytes = static_cast<std::size_t>(maxBody);

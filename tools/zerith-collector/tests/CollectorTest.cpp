@@ -26,6 +26,7 @@
 #include "tests/support/CollectorProcess.h"
 #include "tests/support/TempRoot.h"
 #include "tools/zerith-collector/CollectorBody.h"
+#include "tools/zerith-collector/CollectorServer.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 #include "transport/URLSession.h"
 
@@ -326,6 +327,24 @@ TEST_F(CollectorToolTest, RefusesToStartWithoutCertificateOrWithABadOne) {
     ASSERT_TRUE(WIFEXITED(status));
     EXPECT_NE(WEXITSTATUS(status), 0);
     EXPECT_NE(WEXITSTATUS(status), 127);
+  }
+}
+
+TEST(CollectorBehaviour, OnlyTheFourBehavioursWithSaneNumbersAreTaken) {
+  using collector::Behaviour;
+  EXPECT_EQ(Behaviour::parse("")->kind, Behaviour::Kind::answer);
+  EXPECT_EQ(Behaviour::parse("answer\n")->kind, Behaviour::Kind::answer);
+  EXPECT_EQ(Behaviour::parse("close")->kind, Behaviour::Kind::close);
+  const auto status = Behaviour::parse("status 503\n");
+  ASSERT_TRUE(status);
+  EXPECT_EQ(status->kind, Behaviour::Kind::status);
+  EXPECT_EQ(status->value, 503);
+  const auto stall = Behaviour::parse("stall 250");
+  ASSERT_TRUE(stall);
+  EXPECT_EQ(stall->kind, Behaviour::Kind::stall);
+  EXPECT_EQ(stall->value, 250);
+  for (const char* bad : {"status", "status 99", "status 600", "stall -1", "stall 600001", "stall x", "refuse"}) {
+    EXPECT_FALSE(Behaviour::parse(bad)) << bad;
   }
 }
 

@@ -1,0 +1,501 @@
+// The spool's file format, its folder of files (limits, bad files, a full
+// disk by RLIMIT_FSIZE in a child) and its retries against a real HTTPS
+// server that fails and then recovers.
+
+#include <gtest/gtest.h>
+
+#include <signal.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <condition_variable>
+#include <fstream>
+#include <mutex>
+#include <set>
+#include <thread>
+
+#include <zlib.h>
+
+#include "backends/Spool.h"
+#include "platform/FileUtil.h"
+#include "tests/support/HttpsTestServer.h"
+#include "tests/support/TempRoot.h"
+#include "tests/support/TestCA.h"
+#include "transport/ReportingSessionConnectivityHelper.h"
+#include "transport/URLSession.h"
+
+extern "C" int spoolFileFuzzOneInput(const std::uint8_t* data, std::size_t size);
+
+namespace zerith::test {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+SpoolBatch batchOf(std::uint32_t records, std::size_t bodyBytes, std::int64_t created = 1'700'000'000'000) {
+  SpoolBatch batch;
+  batch.createdMillis = created;
+  batch.recordCount = records;
+  batch.url = "https://127.0.0.1:4443/post";
+  batch.headers = {{"User-Agent", "Zerith/1.2 (x; y)"}, {"Content-Type", "application/json"}};
+  for (std::size_t i = 0; i < bodyBytes; ++i) {
+    batch.body.push_back(static_cast<std::uint8_t>('a' + i % 26));
+  }
+  return batch;
+}
+
+std::string slurp(const fs::path& path) {
+  std::ifstream in(path, std::ios::binary);
+  return std::string((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+}
+
+void spit(const fs::path& path, std::string_view bytes) {
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  out.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
+}
+
+mode_t modeOf(const fs::path& path) {
+  struct stat st {};
+  ::stat(path.c_str(), &st);
+  return st.st_mode & 07777;
+}
+
+std::set<std::string> namesIn(const fs::path& folder) {
+  std::set<std::string> names;
+  std::error_code ec;
+  for (const auto& entry : fs::directory_iterator(folder, ec)) {
+    if (entry.is_regular_file()) {
+      names.insert(entry.path().filename().string());
+    }
+  }
+  return names;
+}
+
+// ---------------------------------------------------------------------------
+// The file format
+
+TEST(SpoolFileTest, RoundTripKeepsEveryField) {
+  const SpoolBatch batch = batchOf(7, 300);
+  std::string why;
+  const auto back = decodeSpoolFile(encodeSpoolFile(batch), &why);
+  ASSERT_TRUE(back) << why;
+  EXPECT_EQ(back->createdMillis, batch.createdMillis);
+  EXPECT_EQ(back->recordCount, 7u);
+  EXPECT_EQ(back->url, batch.url);
+  EXPECT_EQ(back->headers, batch.headers);
+  EXPECT_EQ(back->body, batch.body);
+}
+
+TEST(SpoolFileTest, EveryTruncationAndEveryFlippedByteIsRefused) {
+  const Data bytes = encodeSpoolFile(batchOf(2, 40));
+  for (std::size_t n = 0; n < bytes.size(); ++n) {
+    std::string why;
+    EXPECT_FALSE(decodeSpoolFile(std::span<const std::uint8_t>(bytes.data(), n), &why)) << n;
+    EXPECT_FALSE(why.empty());
+  }
+  for (std::size_t i = 0; i < bytes.size(); ++i) {
+    Data flipped = bytes;
+    flipped[i] ^= 0x20;
+    EXPECT_FALSE(decodeSpoolFile(flipped, nullptr)) << "byte " << i;
+  }
+  Data longer = bytes;
+  longer.push_back(0);
+  EXPECT_FALSE(decodeSpoolFile(longer, nullptr));
+}
+
+TEST(SpoolFileTest, AnotherVersionOrMagicSaysSo) {
+  Data bytes = encodeSpoolFile(batchOf(1, 10));
+  bytes[8] = 2;
+  std::string why;
+  EXPECT_FALSE(decodeSpoolHeader(bytes, &why));
+  EXPECT_EQ(why, "format version 2 (this daemon reads 1)");
+  bytes[0] = 'X';
+  EXPECT_FALSE(decodeSpoolHeader(bytes, &why));
+  EXPECT_EQ(why, "not a spool file (bad magic)");
+}
+
+TEST(SpoolFileTest, LengthsInsideTheBodyAreBounded) {
+  // A body that claims a URL longer than the file: the checksum holds (the
+  // file was made so), the field check refuses.
+  Data body;
+  for (std::uint8_t b : {0xff, 0xff, 0xff, 0x7f, 0, 0, 0, 0, 0, 0, 0, 0}) {
+    body.push_back(b);
+  }
+  SpoolBatch batch;
+  Data bytes = encodeSpoolFile(batch);
+  bytes.resize(kSpoolHeaderSize);
+  bytes.insert(bytes.end(), body.begin(), body.end());
+  bytes[24] = static_cast<std::uint8_t>(body.size());
+  const uLong crc = crc32(crc32(0L, Z_NULL, 0), bytes.data(), 28);
+  const std::uint32_t sum = static_cast<std::uint32_t>(crc32(crc, body.data(), static_cast<uInt>(body.size())));
+  for (int i = 0; i < 4; ++i) {
+    bytes[28 + i] = static_cast<std::uint8_t>(sum >> (8 * i));
+  }
+  std::string why;
+  EXPECT_FALSE(decodeSpoolFile(bytes, &why));
+  EXPECT_EQ(why, "bad URL field");
+}
+
+TEST(SpoolFileTest, RecordsAreCountedOutsideStrings) {
+  EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1.5,"clientId":"a","events":[{"x":1},{"y":{"z":[{}]}}]})"), 2u);
+  EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1,"clientId":"{[","events":[{"s":"}\"{"},{"t":"]"}]})"), 2u);
+  EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1,"clientId":"a","events":[]})"), 0u);
+  EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1})"), 0u);
+}
+
+TEST(SpoolFileTest, RecordIDsAreDistinctHex) {
+  std::set<std::string> seen;
+  for (int i = 0; i < 1000; ++i) {
+    const std::string id = newRecordID();
+    ASSERT_EQ(id.size(), 32u);
+    ASSERT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
+    ASSERT_TRUE(seen.insert(id).second) << id;
+  }
+}
+
+// Every kept input of the spool file fuzz target goes through the readers
+// again (the target aborts on a broken invariant).
+TEST(SpoolFileTest, EveryCorpusInputIsReadWithItsInvariants) {
+  const auto corpus = sourceDir() / "fuzz/corpus/spool_file_fuzz";
+  ASSERT_TRUE(fs::is_directory(corpus)) << corpus;
+  std::size_t count = 0;
+  for (const auto& entry : fs::directory_iterator(corpus)) {
+    const auto bytes = file::readAll(entry.path(), 1u << 20);
+    ASSERT_TRUE(bytes.has_value()) << entry.path();
+    spoolFileFuzzOneInput(bytes->data(), bytes->size());
+    ++count;
+  }
+  EXPECT_GE(count, 7u);
+}
+
+TEST(SpoolConfigTest, BadValuesFallBackToTheDefaults) {
+  const SpoolConfig bad = SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", "maybe"},
+                                                                       {"spoolMaxBytes", -5},
+                                                                       {"spoolMaxAgeSeconds", "forever"},
+                                                                       {"spoolRetryInitialSeconds", Array{}},
+                                                                       {"spoolRetryMaxSeconds", 1e12}}));
+  EXPECT_FALSE(bad.enabled);
+  EXPECT_EQ(bad.maxBytes, SpoolConfig::kDefaultMaxBytes);
+  EXPECT_EQ(bad.maxAgeSeconds, SpoolConfig::kDefaultMaxAgeSeconds);
+  EXPECT_EQ(bad.retryInitialSeconds, SpoolConfig::kDefaultRetryInitialSeconds);
+  EXPECT_EQ(bad.retryMaxSeconds, SpoolConfig::kDefaultRetryMaxSeconds);
+
+  const SpoolConfig good = SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", "YES"},
+                                                                        {"spoolMaxBytes", "100000"},
+                                                                        {"spoolMaxAgeSeconds", 60},
+                                                                        {"spoolRetryInitialSeconds", 0.5},
+                                                                        {"spoolRetryMaxSeconds", 0.25}}));
+  EXPECT_TRUE(good.enabled);
+  EXPECT_EQ(good.maxBytes, 100000u);
+  EXPECT_EQ(good.maxAgeSeconds, 60);
+  // A ceiling below the first wait is raised to it.
+  EXPECT_EQ(good.retryMaxSeconds, 0.5);
+  EXPECT_TRUE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", true}})).enabled);
+  EXPECT_FALSE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", 2}})).enabled);
+}
+
+// ---------------------------------------------------------------------------
+// The folder
+
+class SpoolStoreTest : public ::testing::Test {
+ protected:
+  fs::path folder() const { return root.path() / "spool"; }
+  SpoolStore store(std::uint64_t maxBytes = 1 << 20, std::int64_t maxAge = 3600) {
+    SpoolStore s(folder(), maxBytes, maxAge);
+    s.clock = [this] { return now; };
+    std::string why;
+    EXPECT_TRUE(s.open(&why)) << why;
+    return s;
+  }
+  TempRoot root;
+  std::int64_t now = 1'700'000'000'000;
+};
+
+TEST_F(SpoolStoreTest, FolderAndFilesKeepOtherUsersOut) {
+  fs::create_directories(folder());
+  fs::permissions(folder(), fs::perms(0755));
+  SpoolStore s = store();
+  EXPECT_EQ(modeOf(folder()), 0700u);
+  const auto outcome = s.write(batchOf(3, 100, now));
+  ASSERT_TRUE(outcome.written);
+  EXPECT_EQ(modeOf(folder() / outcome.name), 0600u);
+  EXPECT_EQ(namesIn(folder()), std::set<std::string>{outcome.name});
+}
+
+TEST_F(SpoolStoreTest, EntriesSurviveReopeningOldestFirst) {
+  std::vector<std::string> names;
+  {
+    SpoolStore s = store();
+    for (std::uint32_t i = 1; i <= 4; ++i) {
+      now += 1000;
+      const auto outcome = s.write(batchOf(i, 50, now));
+      ASSERT_TRUE(outcome.written);
+      names.push_back(outcome.name);
+    }
+  }
+  SpoolStore again = store();
+  const auto entries = again.entries();
+  ASSERT_EQ(entries.size(), 4u);
+  for (std::size_t i = 0; i < entries.size(); ++i) {
+    EXPECT_EQ(entries[i].name, names[i]);
+    EXPECT_EQ(entries[i].records, i + 1);
+  }
+  EXPECT_EQ(again.totalRecords(), 10u);
+  const auto batch = again.read(names[2]);
+  ASSERT_TRUE(batch);
+  EXPECT_EQ(batch->recordCount, 3u);
+  again.remove(names[2]);
+  EXPECT_EQ(again.size(), 3u);
+  EXPECT_FALSE(fs::exists(folder() / names[2]));
+}
+
+TEST_F(SpoolStoreTest, BadFilesAreMovedAsideNeverRead) {
+  std::string good, corrupt, shortened;
+  {
+    SpoolStore s = store();
+    good = s.write(batchOf(1, 80, now)).name;
+    corrupt = s.write(batchOf(2, 80, now)).name;
+    shortened = s.write(batchOf(3, 80, now)).name;
+  }
+  // A flipped body byte keeps the size: found only by the checksum on read.
+  std::string bytes = slurp(folder() / corrupt);
+  bytes[bytes.size() - 5] ^= 1;
+  spit(folder() / corrupt, bytes);
+  bytes = slurp(folder() / shortened);
+  spit(folder() / shortened, bytes.substr(0, bytes.size() - 10));
+  Data other = encodeSpoolFile(batchOf(4, 10, now));
+  other[8] = 9;
+  spit(folder() / "0000000000000001-00000000.zspool", std::string(other.begin(), other.end()));
+  spit(folder() / "notes.txt", "hello");
+  // A write that a kill cut short.
+  spit(folder() / (".tmp-" + good + ".Ab12Cd"), "ZTHSPOOL half");
+
+  SpoolStore s = store();
+  EXPECT_EQ(namesIn(s.badFolder()),
+            (std::set<std::string>{shortened, "0000000000000001-00000000.zspool", "notes.txt"}));
+  EXPECT_EQ(namesIn(folder()), (std::set<std::string>{good, corrupt}));
+  EXPECT_FALSE(s.read(corrupt));
+  EXPECT_TRUE(fs::exists(s.badFolder() / corrupt));
+  EXPECT_EQ(s.size(), 1u);
+  EXPECT_TRUE(s.read(good));
+}
+
+TEST_F(SpoolStoreTest, SizeLimitDropsTheOldestFirst) {
+  const std::size_t fileSize = encodeSpoolFile(batchOf(1, 1000, now)).size();
+  SpoolStore s = store(3 * fileSize + 10);
+  std::vector<std::string> names;
+  std::vector<SpoolStore::Dropped> dropped;
+  for (std::uint32_t i = 1; i <= 5; ++i) {
+    now += 10;
+    auto outcome = s.write(batchOf(i, 1000, now));
+    ASSERT_TRUE(outcome.written) << i;
+    names.push_back(outcome.name);
+    dropped.insert(dropped.end(), outcome.dropped.begin(), outcome.dropped.end());
+  }
+  ASSERT_EQ(dropped.size(), 2u);
+  EXPECT_EQ(dropped[0].entry.name, names[0]);
+  EXPECT_EQ(dropped[0].entry.records, 1u);
+  EXPECT_EQ(dropped[1].entry.name, names[1]);
+  EXPECT_EQ(dropped[0].reason, SpoolStore::DropReason::size);
+  EXPECT_EQ(namesIn(folder()), (std::set<std::string>{names[2], names[3], names[4]}));
+  EXPECT_LE(s.totalBytes(), 3 * fileSize + 10);
+
+  // A batch larger than the whole spool is refused and drops nothing.
+  const auto huge = s.write(batchOf(9, 5000, now));
+  EXPECT_FALSE(huge.written);
+  EXPECT_EQ(huge.error, 0);
+  EXPECT_TRUE(huge.dropped.empty());
+  EXPECT_EQ(s.size(), 3u);
+}
+
+TEST_F(SpoolStoreTest, AgeLimitDropsWhatIsTooOld) {
+  SpoolStore s = store(1 << 20, 60);
+  const std::string old = s.write(batchOf(4, 10, now)).name;
+  now += 30'000;
+  const std::string young = s.write(batchOf(5, 10, now)).name;
+  now += 31'000;  // the first is 61 s old, the second 31 s
+  const auto dropped = s.dropExpired(now);
+  ASSERT_EQ(dropped.size(), 1u);
+  EXPECT_EQ(dropped[0].entry.name, old);
+  EXPECT_EQ(dropped[0].reason, SpoolStore::DropReason::age);
+  EXPECT_EQ(namesIn(folder()), std::set<std::string>{young});
+  // A write also drops what expired first.
+  now += 30'000;
+  const auto outcome = s.write(batchOf(1, 10, now));
+  ASSERT_EQ(outcome.dropped.size(), 1u);
+  EXPECT_EQ(outcome.dropped[0].entry.name, young);
+}
+
+TEST_F(SpoolStoreTest, FullDiskLosesOnlyTheBatchAndLeavesNoHalfFile) {
+  // RLIMIT_FSIZE makes every write past the limit fail with EFBIG, as a full
+  // disk fails with ENOSPC: the same path through the store. Done in a
+  // child so that the limit does not touch the test runner.
+  { SpoolStore s = store(); ASSERT_TRUE(s.write(batchOf(1, 10, now)).written); }
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    ::signal(SIGXFSZ, SIG_IGN);
+    rlimit limit{4096, 4096};
+    ::setrlimit(RLIMIT_FSIZE, &limit);
+    SpoolStore s(folder(), 1 << 20, 3600);
+    s.clock = [this] { return now; };
+    std::string why;
+    if (!s.open(&why)) {
+      ::_exit(10);
+    }
+    const auto outcome = s.write(batchOf(2, 20000, now));
+    if (outcome.written) {
+      ::_exit(11);
+    }
+    if (outcome.error != EFBIG) {
+      ::_exit(12);
+    }
+    // Spooling goes on once there is room again.
+    ::_exit(s.write(batchOf(3, 100, now)).written && s.size() == 2 ? 0 : 13);
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+  const auto names = namesIn(folder());
+  EXPECT_EQ(names.size(), 2u);
+  for (const auto& name : names) {
+    EXPECT_EQ(name.rfind(".tmp-", 0), std::string::npos) << name;
+  }
+}
+
+// ---------------------------------------------------------------------------
+// Retries against a real HTTPS server
+
+class SpoolRetryTest : public ::testing::Test {
+ protected:
+  SpoolRetryTest() { URLSession::setExtraCAFile(TestCA::shared().caFile().string()); }
+
+  std::shared_ptr<Spool> makeSpool(SpoolConfig config) {
+    config.enabled = true;
+    return Spool::create(root.path() / "spool", config,
+                         ReportingSessionConnectivityHelper::initWithDelegate(
+                             std::weak_ptr<ConnectivityHelperDelegate>(), ReportingSessionConnectivityHelper::POSTRequestMode()));
+  }
+  URLRequest requestTo(const std::string& url, const std::string& body) {
+    URLRequest request;
+    request.httpMethod = "POST";
+    request.url = url;
+    request.headers = {{"Content-Type", "application/json"}, {"X-Test", "kept"}};
+    request.body.assign(body.begin(), body.end());
+    return request;
+  }
+  // Waits until the spool has written (or dropped) what it was given.
+  static bool kept(Spool& spool, URLRequest request, std::uint32_t records) {
+    std::mutex m;
+    std::condition_variable cv;
+    std::optional<bool> result;
+    spool.keep(std::move(request), records, {}, [&](bool k) {
+      std::lock_guard lock(m);
+      result = k;
+      cv.notify_all();
+    });
+    std::unique_lock lock(m);
+    cv.wait_for(lock, 10s, [&] { return result.has_value(); });
+    return result.value_or(false);
+  }
+  static bool waitDrained(Spool& spool, std::chrono::milliseconds timeout = 20s) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (spool.pendingBatches() > 0) {
+      if (std::chrono::steady_clock::now() > deadline) {
+        return false;
+      }
+      std::this_thread::sleep_for(20ms);
+    }
+    return true;
+  }
+
+  TempRoot root;
+};
+
+TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
+  HttpsTestServer server;
+  std::mutex m;
+  int answered = 0;
+  server.on("/post", [&](const RecordedRequest&) {
+    std::lock_guard lock(m);
+    // Two 503s, then the collector takes everything.
+    return Reply{.status = ++answered <= 2 ? 503 : 200};
+  });
+  SpoolConfig config;
+  config.retryInitialSeconds = 0.05;
+  config.retryMaxSeconds = 0.2;
+  auto spool = makeSpool(config);
+  ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), R"({"events":[{"a":1}]})"), 1));
+  ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), R"({"events":[{"b":2},{"c":3}]})"), 2));
+  ASSERT_TRUE(waitDrained(*spool));
+  const auto requests = server.requests();
+  ASSERT_EQ(requests.size(), 4u);
+  // Oldest first; the failed one is posted again unchanged.
+  EXPECT_EQ(requests[0].body, R"({"events":[{"a":1}]})");
+  EXPECT_EQ(requests[1].body, requests[0].body);
+  EXPECT_EQ(requests[2].body, requests[0].body);
+  EXPECT_EQ(requests[3].body, R"({"events":[{"b":2},{"c":3}]})");
+  EXPECT_EQ(requests[3].header("X-Test"), "kept");
+  EXPECT_EQ(spool->counters().get(BackendCount::spooled), 3u);
+  EXPECT_EQ(spool->counters().get(BackendCount::delivered), 3u);
+  EXPECT_EQ(spool->counters().get(BackendCount::retried), 5u);  // 1 + 1 + 1 + 2
+  EXPECT_TRUE(namesIn(root.path() / "spool").empty());
+}
+
+TEST_F(SpoolRetryTest, WhatAnEarlierRunLeftIsDeliveredAtStart) {
+  HttpsTestServer server;
+  server.on("/post", Reply{.status = 200});
+  {
+    SpoolStore store(root.path() / "spool", 1 << 20, 3600);
+    std::string why;
+    ASSERT_TRUE(store.open(&why)) << why;
+    SpoolBatch batch = batchOf(4, 0);
+    batch.createdMillis = std::chrono::duration_cast<std::chrono::milliseconds>(
+                              std::chrono::system_clock::now().time_since_epoch())
+                              .count();
+    batch.url = server.url("/post");
+    const std::string body = R"({"events":[{},{},{},{}]})";
+    batch.body.assign(body.begin(), body.end());
+    ASSERT_TRUE(store.write(batch).written);
+  }
+  auto spool = makeSpool({});
+  ASSERT_TRUE(server.waitForRequests(1));
+  ASSERT_TRUE(waitDrained(*spool));
+  EXPECT_EQ(server.requests()[0].body, R"({"events":[{},{},{},{}]})");
+  EXPECT_EQ(spool->counters().get(BackendCount::delivered), 4u);
+}
+
+TEST_F(SpoolRetryTest, AClientErrorDropsTheBatchForGood) {
+  HttpsTestServer server;
+  server.on("/post", Reply{.status = 400});
+  SpoolConfig config;
+  config.retryInitialSeconds = 0.02;
+  auto spool = makeSpool(config);
+  ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), "{}"), 3));
+  ASSERT_TRUE(waitDrained(*spool));
+  EXPECT_EQ(server.requestCount(), 1u);
+  EXPECT_EQ(spool->counters().get(BackendCount::droppedTransportError), 3u);
+  EXPECT_EQ(spool->counters().get(BackendCount::delivered), 0u);
+}
+
+TEST_F(SpoolRetryTest, SizeLimitCountsWhatItDrops) {
+  SpoolConfig config;
+  config.maxBytes = SpoolConfig::kMinMaxBytes;
+  config.retryInitialSeconds = 3600;  // no retry during the test
+  auto spool = makeSpool(config);
+  RefusingPort refusing;
+  const std::string body(1500, 'x');
+  for (int i = 0; i < 3; ++i) {
+    ASSERT_TRUE(kept(*spool, requestTo(refusing.url("/post"), body), 10));
+  }
+  EXPECT_EQ(spool->pendingBatches(), 2u);
+  EXPECT_EQ(spool->counters().get(BackendCount::droppedSpoolFull), 10u);
+  EXPECT_FALSE(kept(*spool, requestTo(refusing.url("/post"), std::string(5000, 'y')), 7));
+  EXPECT_EQ(spool->counters().get(BackendCount::droppedSpoolFull), 17u);
+}
+
+}  // namespace
+}  // namespace zerith::test
