@@ -469,7 +469,8 @@ void ZerithdAgent::addAgentHealthInfoForSession(ZerithdSession& session, Diction
 void ZerithdAgent::backendsOfEndedSession(ZerithdSession& session, const BackendDictionary& backends) {
   const std::int64_t clientType = session.clientType();
   std::lock_guard lock(lock_);
-  for (const auto& [name, backend] : backends) {
+  for (const auto& entry : backends) {
+    const std::string& name = entry.first;
     auto total = std::find_if(endedTotals_.begin(), endedTotals_.end(),
                               [&](const EndedTotal& t) { return t.clientType == clientType && t.name == name; });
     if (total == endedTotals_.end()) {
@@ -477,7 +478,7 @@ void ZerithdAgent::backendsOfEndedSession(ZerithdSession& session, const Backend
       total = std::prev(endedTotals_.end());
     }
     ++total->sessions;
-    endedBackends_.push_back(EndedBackend{clientType, name, backend->sharedCounters()});
+    endedBackends_.push_back(EndedBackend{clientType, name, entry.second->sharedCounters()});
   }
   foldEndedBackends();
 }
