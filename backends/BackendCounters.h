@@ -27,6 +27,8 @@ enum class BackendCount : std::size_t {
   droppedDisabled,      // the backend was off (undecided, disabled by the server, or no URL)
   droppedSpoolFull,     // the spool's size or age limit, or a full disk
   droppedTransportError,  // a post failed and nothing kept its batch
+  droppedQueueFull,     // the datagram queue held its most and pushed out its oldest
+  droppedUnsupported,   // the backend carries no session events (upload, datagram, energy log)
   count_
 };
 

@@ -34,6 +34,8 @@ DashboardBackend::DashboardBackend(Token, std::string name, Value profile, std::
 DashboardBackend::~DashboardBackend() {
   // Reached only once the timer and the read source have let go (or were
   // never made): nothing else runs on the network queue for this backend.
+  // Datagrams still queued (unsent, or never acknowledged) go with it.
+  counters().add(BackendCount::droppedTransportError, messageQueue_.size());
   if (readSource_) {
     std::error_code ignored;
     readSource_->descriptor.close(ignored);
@@ -237,6 +239,7 @@ std::optional<std::string> DashboardBackend::sendMessage(const Value& message, c
     return std::nullopt;
   }
   std::string line = writeLocalLog(datagram);
+  counters().add(BackendCount::sent);
   networkProcQueue_.async([self = self(), datagram = std::move(datagram), eventID] {
     self->tryToSendMsg(datagram, eventID);
   });
@@ -264,6 +267,7 @@ void DashboardBackend::tryToSendMsg(std::span<const std::uint8_t> bytes, std::ui
   messageQueue_.push_back(std::move(packet));
   if (messageQueue_.size() > kMaxQueuedPackets) {
     messageQueue_.pop_front();
+    counters().add(BackendCount::droppedQueueFull);
   }
   notifyObserver();
 }
@@ -321,6 +325,7 @@ void DashboardBackend::processSocketRead() {
       continue;
     }
     messageQueue_.erase(match);
+    counters().add(BackendCount::delivered);
     notifyObserver();
   }
 }
@@ -352,7 +357,9 @@ void DashboardBackend::myPeriodicTask() {
     UDPPacketToSend& packet = messageQueue_[i];
     if (packet.state() == UDPPacketToSend::kAwaitingAcknowledgement) {
       if (packet.numberOfRetransmits() > 3) {
+        // Never acknowledged: the server did not take it.
         messageQueue_.erase(messageQueue_.begin() + static_cast<std::ptrdiff_t>(i));
+        counters().add(BackendCount::droppedTransportError);
         continue;
       }
       const int checks = packet.numberOfChecks() + 1;
@@ -360,6 +367,7 @@ void DashboardBackend::myPeriodicTask() {
         if (sendWhole(packet.data())) {
           packet.setNumberOfChecks(0);
           packet.setNumberOfRetransmits(packet.numberOfRetransmits() + 1);
+          counters().add(BackendCount::retried);
           changed = true;
         }
       } else {

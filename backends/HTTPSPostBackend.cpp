@@ -222,7 +222,13 @@ HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::
   fields_ = std::move(f);
 }
 
-HTTPSPostBackend::~HTTPSPostBackend() = default;
+// A batch still held at the end never went: the backend was never allowed
+// to post it (user info required and never given, or no flush came).
+HTTPSPostBackend::~HTTPSPostBackend() {
+  if (batch_.batchedEvents && !batch_.batchedEvents->empty()) {
+    counters().add(BackendCount::droppedDisabled, batch_.batchedEvents->size());
+  }
+}
 
 HTTPSPostBackend::Fields HTTPSPostBackend::fields() const {
   std::lock_guard lock(fieldsMutex_);
@@ -326,6 +332,7 @@ std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
       batch.batchedEvents.emplace();
     }
     batch.batchedEvents->push_back(std::move(event));
+    counters().add(BackendCount::batched);
     for (auto& [m, n] : batch.eventMethodCounts) {
       if (m == method) {
         n = count + 1;
@@ -403,6 +410,7 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
                                                          std::uint16_t eventID, std::int32_t flag) {
   const std::int32_t currentState = state();
   if (currentState == kBackendStateDisabled) {
+    counters().add(disabledBySampling() ? BackendCount::droppedSampledOut : BackendCount::droppedDisabled);
     return std::nullopt;
   }
   Value payload = message["ClientData"];
@@ -464,6 +472,7 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
   if (flushPreceded) {
     text = fmt::format("Flushed events:\n{}\nStandalone event:\n{}", orNull(flushed), orNull(pretty));
   }
+  countPosted(1, flag);
   postJSONMessage(*body, flag, method, respCode, nullptr);
   if (flushPreceded) {
     setImmutable();
@@ -624,6 +633,41 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
       });
 }
 
+namespace {
+
+// Whether a post to `url` gets past the post's own URL checks: a scheme
+// other than https becomes https on a device that is not an internal build,
+// and only http(s) is posted to.
+bool isPostableURL(const std::string& url) {
+  const auto at = url.find("://");
+  if (at == std::string::npos) {
+    return false;
+  }
+  const std::string scheme = lowered(url.substr(0, at));
+  return !isInternalBuild() || scheme == "https" || scheme == "http";
+}
+
+}  // namespace
+
+void HTTPSPostBackend::countPosted(std::size_t events, std::int32_t flag) {
+  if (events == 0) {
+    return;
+  }
+  bool postable = false;
+  {
+    std::lock_guard lock(fieldsMutex_);
+    const std::optional<std::string>& url = (flag | 2) == 3 ? fields_.realtimePostURL : fields_.postURL;
+    postable = url && isPostableURL(*url);
+  }
+  if (!postable) {
+    counters().add(BackendCount::droppedDisabled, events);
+  } else if (!reportingSessionConnectivityDelegate()) {
+    counters().add(BackendCount::droppedTransportError, events);
+  } else {
+    counters().add(BackendCount::sent, events);
+  }
+}
+
 std::optional<std::string> HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
   // The batch is taken in one turn on the state queue; the post and every
   // completion run after it, so a completion may read the state.
@@ -634,6 +678,7 @@ std::optional<std::string> HTTPSPostBackend::flushMessagesWithCompletion(FlushCo
     }
     return std::nullopt;
   }
+  countPosted(outcome.events, 0);
   postJSONMessage(*outcome.body, 0, std::nullopt, std::nullopt, std::move(completion));
   if (outcome.pretty) {
     setImmutable();
@@ -647,7 +692,12 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
     outcome.error = "Nothing to flush";
     return outcome;
   }
-  if (stateOnQueue() != kBackendStateEnabled) {
+  if (const std::int32_t state = stateOnQueue(); state != kBackendStateEnabled) {
+    // A batch that may not go is dropped: kept back by the sampling draw
+    // (sampled out, or disabled by the override threshold) or not reporting.
+    const bool sampled = state == kBackendStateSampledOut || (state == kBackendStateDisabled && disabledBySampling());
+    counters().add(sampled ? BackendCount::droppedSampledOut : BackendCount::droppedDisabled,
+                   batch_.batchedEvents->size());
     batch_ = Batch{};
     outcome.error = "Nothing to flush";
     return outcome;
@@ -665,11 +715,13 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
     if (!isWhitelistedEvent(category)) {
       backendsLogger().debug("flushMessagesWithCompletion: Dropping event with category {} as it is not whitelisted for backend {}",
                      category, name());
+      counters().add(BackendCount::droppedFiltered);
       continue;
     }
     if (isBlacklistedEvent(category)) {
       backendsLogger().info("flushMessagesWithCompletion: Dropping event with category {} as it is blacklisted for backend {}",
                     category, name());
+      counters().add(BackendCount::droppedBlacklisted);
       continue;
     }
     for (const auto& [key, value] : userInfo) {
@@ -678,6 +730,7 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
     kept.push_back(std::move(event));
   }
   batch_ = Batch{};
+  outcome.events = kept.size();
   outcome.body = kept.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(kept), &outcome.pretty);
   if (!outcome.body) {
     outcome.error = "Nothing to flush: batched events were completely filtered out";
@@ -885,6 +938,7 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
   if (isImmutable()) {
     return state();
   }
+  disabledBySampling_.store(false);
   const Value clients = profile()["clients"];
   if (!clients.isArray()) {
     if (!clients.isNil()) {
@@ -1020,6 +1074,9 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
     } else {
       result = kBackendStateSampledOut;
     }
+    // Whether the draw, not a rule, kept this device from reporting: what
+    // it drops then counts as sampled out.
+    disabledBySampling_.store(result == kBackendStateDisabled && !threshold.isNil());
 
     resetBackendStateWithClient(entry);
     if (auto custom = stringKey(entry, "custom_clientId")) {

@@ -16,6 +16,7 @@
 // through setState.
 
 #include <array>
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -118,6 +119,9 @@ class HTTPSPostBackend : public ZerithBackend {
   std::optional<std::string> uuidCustom() const;
   // Records waiting in the batch (a synchronous read on the state queue).
   std::size_t batchedEventCount() const;
+  // The last state decision disabled the backend by the sampling draw (its
+  // factor at or above the override threshold), not by a rule.
+  bool disabledBySampling() const { return disabledBySampling_.load(); }
 
  private:
   // Every storebag- and defaults-driven field, behind one mutex.
@@ -152,14 +156,19 @@ class HTTPSPostBackend : public ZerithBackend {
   // or why there is nothing to post.
   struct FlushOutcome {
     const char* error = nullptr;
+    std::size_t events = 0;  // records in the body
     std::optional<std::string> body;
     std::optional<std::string> pretty;
   };
   FlushOutcome takeBatchOnStateQueue();
+  // Counts `events` records handed to a post with `flag`: sent, or dropped
+  // when the post has no usable URL or no transport.
+  void countPosted(std::size_t events, std::int32_t flag);
 
   mutable std::mutex fieldsMutex_;
   Fields fields_;
   Batch batch_;  // state queue only
+  std::atomic<bool> disabledBySampling_{false};
 };
 
 }  // namespace zerith

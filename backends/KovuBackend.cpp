@@ -61,9 +61,11 @@ std::optional<std::string> KovuBackend::sendMessage(const Value& message, const 
   if (!kovuAdaptor_ || !kovuAdaptor_->respondsToSelector(kKovuForwardingSelector)) {
     backendsLogger().error("KovuBackend(sendMessage): Kovu adaptor {} does not respond to forwarding selector {}",
                    kovuAdaptor_ ? kovuAdaptor_->description() : std::string("(null)"), kKovuForwardingSelector);
+    counters().add(BackendCount::droppedTransportError);
     return std::nullopt;
   }
   kovuAdaptor_->sendMessageWithMethod(method, respCode, message);
+  counters().add(BackendCount::sent);
   return std::nullopt;
 }
 

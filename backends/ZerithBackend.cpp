@@ -90,6 +90,8 @@ std::string_view backendCountName(BackendCount what) {
     case BackendCount::droppedDisabled: return "droppedDisabled";
     case BackendCount::droppedSpoolFull: return "droppedSpoolFull";
     case BackendCount::droppedTransportError: return "droppedTransportError";
+    case BackendCount::droppedQueueFull: return "droppedQueueFull";
+    case BackendCount::droppedUnsupported: return "droppedUnsupported";
     case BackendCount::count_: break;
   }
   return "unknown";
@@ -174,6 +176,9 @@ void ZerithBackend::updateState() { setState(kBackendStateEnabled); }
 
 std::optional<std::string> ZerithBackend::sendMessage(const Value&, const timeval&, std::uint16_t, std::uint16_t,
                                                       std::uint16_t, std::int32_t) {
+  // A kind that does not take events (upload, datagram, energy log) lets
+  // them go here.
+  counters_->add(BackendCount::droppedUnsupported);
   return std::nullopt;
 }
 

@@ -118,8 +118,12 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   virtual std::uint32_t batchedEventsSize();
 
   // What became of this backend's events so far (see BackendCounters.h).
-  BackendCounters& counters() { return counters_; }
-  const BackendCounters& counters() const { return counters_; }
+  BackendCounters& counters() { return *counters_; }
+  const BackendCounters& counters() const { return *counters_; }
+  // The same counters, for whoever reads them after the backend has gone
+  // (the agent's totals of ended sessions: completions count on after the
+  // session's end).
+  std::shared_ptr<const BackendCounters> sharedCounters() const { return counters_; }
 
   // Properties; every accessor is atomic.
   const std::string& name() const { return name_; }
@@ -202,7 +206,7 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   std::optional<Data> digestKey_;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
 
-  BackendCounters counters_;
+  const std::shared_ptr<BackendCounters> counters_ = std::make_shared<BackendCounters>();
   std::atomic<double> startTimeStamp_{0};
   std::atomic<std::uint32_t> sessionID_{0};
   std::atomic<std::int32_t> compType_{0};

@@ -97,7 +97,28 @@ bool ZerithdAgent::shouldAcceptNewConnection(ipc::Listener& /*listener*/, std::s
                    connection->description());
     return false;
   }
-  connection->setExportedObject(std::make_shared<ipc::ClientSessionExporter>(session, connection->description()));
+  auto exporter = std::make_shared<ipc::ClientSessionExporter>(session, connection->description());
+  // The status shows every client's sessions: it takes an entitlement of its
+  // own, looked up now as the one that admitted the peer.
+  const Value statusEntitlement = connection->valueForEntitlement(ipc::kDaemonStatusEntitlement);
+  const bool mayReadStatus = statusEntitlement.isBool() && statusEntitlement.boolValue();
+  exporter->setStatusHandler([weakAgent = weak_from_this(), weakSession = std::weak_ptr<ZerithdSession>(session),
+                              mayReadStatus, peer = connection->description()](auto completion) {
+    if (!mayReadStatus) {
+      const std::string text = fmt::format("the daemon's status needs the entitlement {}", ipc::kDaemonStatusEntitlement);
+      logger().error("listener: refusing the status to {}: {}", peer, text);
+      completion(Value(), makeZerithError(text, -1));
+      return;
+    }
+    const auto agent = weakAgent.lock();
+    if (!agent) {
+      completion(Value(), makeZerithError("the daemon is shutting down", -1));
+      return;
+    }
+    const auto asking = weakSession.lock();
+    completion(agent->daemonStatus(asking.get()).toValue(), std::nullopt);
+  });
+  connection->setExportedObject(std::move(exporter));
 
   connection->setInterruptionHandler([weakSession = std::weak_ptr<ZerithdSession>(session)] {
     const auto s = weakSession.lock();
@@ -443,6 +464,91 @@ void ZerithdAgent::addAgentHealthInfoForSession(ZerithdSession& session, Diction
   payload.set("StorebagsSize", Value(storebagsSize));
   payload.set("CalculatedMemoryUsage", Value(batches + storebagsSize));
   payload.set("ProcessMemoryUsage", Value(processMemoryUsage()));
+}
+
+void ZerithdAgent::backendsOfEndedSession(ZerithdSession& session, const BackendDictionary& backends) {
+  const std::int64_t clientType = session.clientType();
+  std::lock_guard lock(lock_);
+  for (const auto& entry : backends) {
+    const std::string& name = entry.first;
+    auto total = std::find_if(endedTotals_.begin(), endedTotals_.end(),
+                              [&](const EndedTotal& t) { return t.clientType == clientType && t.name == name; });
+    if (total == endedTotals_.end()) {
+      endedTotals_.push_back(EndedTotal{clientType, name, 0, {}});
+      total = std::prev(endedTotals_.end());
+    }
+    ++total->sessions;
+    endedBackends_.push_back(EndedBackend{clientType, name, entry.second->sharedCounters()});
+  }
+  foldEndedBackends();
+}
+
+void ZerithdAgent::foldEndedBackends() {
+  std::lock_guard lock(lock_);
+  // Held by nobody else: the backend has gone and its counts are final.
+  std::erase_if(endedBackends_, [&](const EndedBackend& e) {
+    if (e.counters.use_count() != 1) {
+      return false;
+    }
+    auto total = std::find_if(endedTotals_.begin(), endedTotals_.end(),
+                              [&](const EndedTotal& t) { return t.clientType == e.clientType && t.name == e.name; });
+    if (total == endedTotals_.end()) {  // every ended backend has its total; kept safe all the same
+      endedTotals_.push_back(EndedTotal{e.clientType, e.name, 0, {}});
+      total = std::prev(endedTotals_.end());
+    }
+    const BackendCountsSnapshot counts = e.counters->snapshot();
+    for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
+      total->counts[i] += counts[i];
+    }
+    return true;
+  });
+}
+
+namespace {
+
+ipc::CountList countList(const BackendCountsSnapshot& counts) {
+  ipc::CountList list;
+  for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
+    list.emplace_back(std::string(backendCountName(static_cast<BackendCount>(i))), counts[i]);
+  }
+  return list;
+}
+
+}  // namespace
+
+ipc::DaemonStatus ZerithdAgent::daemonStatus(const ZerithdSession* asking) {
+  ipc::DaemonStatus status;
+  std::lock_guard lock(lock_);
+  for (const auto& session : sessionList_) {
+    if (session.get() == asking) {
+      continue;
+    }
+    ipc::SessionStatus entry;
+    entry.sessionID = session->sessionID();
+    entry.sessionIDString = session->sessionIDString();
+    entry.clientType = session->clientType();
+    if (const auto set = session->backends()) {
+      for (const auto& [name, backend] : *set) {
+        entry.backends.push_back(ipc::BackendStatus{name, backend->state(), countList(backend->counters().snapshot())});
+      }
+    }
+    status.sessions.push_back(std::move(entry));
+  }
+  foldEndedBackends();
+  for (const EndedTotal& total : endedTotals_) {
+    BackendCountsSnapshot counts = total.counts;
+    // Backends still finishing count on: their counts so far.
+    for (const EndedBackend& e : endedBackends_) {
+      if (e.clientType == total.clientType && e.name == total.name) {
+        const BackendCountsSnapshot more = e.counters->snapshot();
+        for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
+          counts[i] += more[i];
+        }
+      }
+    }
+    status.ended.push_back(ipc::EndedTotals{total.clientType, total.name, total.sessions, countList(counts)});
+  }
+  return status;
 }
 
 std::uint32_t ZerithdAgent::processMemoryUsage() {

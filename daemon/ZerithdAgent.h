@@ -20,6 +20,7 @@
 
 #include "daemon/KeepAliveTransaction.h"
 #include "daemon/StorebagCache.h"
+#include "ipc/DaemonStatus.h"
 #include "ipc/Listener.h"
 #include "platform/SerialQueue.h"
 #include "platform/Value.h"
@@ -73,6 +74,12 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
   void removeObjectFromSharedDataForSession(ZerithdSession& session, const std::string& key) override;
   Value sharedDataForSession(ZerithdSession& session) override;
   void addAgentHealthInfoForSession(ZerithdSession& session, Dictionary& payload) override;
+  void backendsOfEndedSession(ZerithdSession& session, const BackendDictionary& backends) override;
+
+  // The status call's answer: per live session (all but `asking`, the
+  // session that asks) and backend what became of its events, and the
+  // totals of ended sessions per client type and backend.
+  ipc::DaemonStatus daemonStatus(const ZerithdSession* asking);
 
   // Adds one session's per-sender figures to a health report and returns its
   // batch size.
@@ -104,6 +111,10 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
   SessionList* correlatedListFor(const std::string& token);
   Dictionary* sharedDataFor(const std::string& token);
 
+  // Folds the counters of ended sessions' backends that have gone into
+  // endedTotals_ (under the lock).
+  void foldEndedBackends();
+
   mutable std::recursive_mutex lock_;
   std::vector<std::shared_ptr<ZerithdSession>> sessionList_;
   std::unique_ptr<StorebagCache> cachedStorebags_;
@@ -113,6 +124,21 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
   // Hierarchy token -> shared key/value data.
   std::vector<std::pair<std::string, Dictionary>> sharedData_;
   std::int32_t VeskTransactionReference_ = 0;
+  // Ended sessions' counters: those whose backend may still count (a post
+  // in flight), and the totals they are folded into once it has gone.
+  struct EndedBackend {
+    std::int64_t clientType = 0;
+    std::string name;
+    std::shared_ptr<const BackendCounters> counters;
+  };
+  struct EndedTotal {
+    std::int64_t clientType = 0;
+    std::string name;
+    std::uint64_t sessions = 0;
+    BackendCountsSnapshot counts{};
+  };
+  std::vector<EndedBackend> endedBackends_;
+  std::vector<EndedTotal> endedTotals_;  // in order of first end
 
   const std::shared_ptr<KeepAliveTransaction> transaction_;
   // Unlisted sessions are let go on a later turn of this queue, never inside

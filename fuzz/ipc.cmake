@@ -3,3 +3,5 @@
 # (With ZERITH_FUZZ off, ipc/CMakeLists.txt replays both corpora as tests.)
 zerith_fuzz(NAME frame_decoder_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/FrameDecoderFuzz.cpp DEPS zerith_ipc)
 zerith_fuzz(NAME connection_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/ConnectionFuzz.cpp DEPS zerith_ipc)
+# The status reply that `zerith status` reads from the daemon.
+zerith_fuzz(NAME daemon_status_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/DaemonStatusFuzz.cpp DEPS zerith_ipc)

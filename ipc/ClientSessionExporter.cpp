@@ -1,6 +1,7 @@
 #include "ipc/ClientSessionExporter.h"
 
 #include "ipc/ClientSessionWire.h"
+#include "ipc/DaemonStatus.h"
 #include "ipc/Frame.h"
 
 namespace zerith::ipc {
@@ -19,6 +20,15 @@ ClientSessionExporter::ClientSessionExporter(std::shared_ptr<ClientSessionInterf
 void ClientSessionExporter::handleMessage(const Message& message, std::shared_ptr<Reply> reply) {
   const OperationSpec* op = sessionOperation(message.operation);
   const std::string from = peer_.empty() ? std::string() : " from " + peer_;
+  if (statusHandler_ && message.operation == kFetchDaemonStatus) {
+    // No arguments; the status is worked out whether or not it is read.
+    statusHandler_([reply, wantsReply = message.call.has_value()](Value status, std::optional<Error> error) {
+      if (wantsReply) {
+        reply->send(Dictionary{{kStatusArgument, std::move(status)}, {kError, valueOf(error)}});
+      }
+    });
+    return;
+  }
   if (!op) {
     const Error error = unknownOperationError(message.operation);
     log_.error("ClientSessionExporter: {}{}", error.description, from);

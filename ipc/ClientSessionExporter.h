@@ -12,6 +12,7 @@
 // it may skip). Operations without a completion answer an empty reply once
 // the session has taken the call, when one was asked for.
 
+#include <functional>
 #include <memory>
 #include <string>
 
@@ -28,11 +29,18 @@ class ClientSessionExporter final : public ExportedObject {
 
   void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override;
 
+  // Answers the daemon's status call (kFetchDaemonStatus in DaemonStatus.h):
+  // the handler completes with the status, or nil and the error that
+  // refused it. Without a handler the call is an unknown operation.
+  using StatusHandler = std::function<void(ClientSessionInterface::ValueErrorCompletion)>;
+  void setStatusHandler(StatusHandler handler) { statusHandler_ = std::move(handler); }
+
   const std::shared_ptr<ClientSessionInterface>& session() const { return session_; }
 
  private:
   std::shared_ptr<ClientSessionInterface> session_;
   std::string peer_;
+  StatusHandler statusHandler_;
   log::Logger log_{"ipc"};
 };
 

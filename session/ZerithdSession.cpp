@@ -136,11 +136,17 @@ ZerithdSession::~ZerithdSession() {
     std::lock_guard lock(d->agentLock());
     d->addAgentHealthInfoForSession(*this, payload);
   }
+  addBackendCounts(payload);
   if (hasBackendSet()) {
     internalSendMessage(Value(payload), now, 0, 1);
     internalFlushMessagesWithCompletion(nullptr);
   }
   shutdownSessionAggregation();
+  if (const auto set = backends()) {
+    if (const auto d = delegate()) {
+      d->backendsOfEndedSession(*this, *set);
+    }
+  }
 
   std::shared_ptr<const BackendDictionary> backends;
   {
@@ -540,6 +546,24 @@ void ZerithdSession::updateCombinedSessionID() {
   }
 }
 
+void ZerithdSession::addBackendCounts(Dictionary& payload) const {
+  const auto set = backends();
+  if (!set) {
+    return;
+  }
+  // Flat keys, as the health figures: the HTTPS records carry no nested
+  // dictionaries. A count of 0 is left out.
+  for (const auto& [name, backend] : *set) {
+    const BackendCountsSnapshot counts = backend->counters().snapshot();
+    for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
+      if (counts[i] != 0) {
+        payload.set(fmt::format("{}_{}_{}", kBackendCountsKey, name, backendCountName(static_cast<BackendCount>(i))),
+                    Value(counts[i]));
+      }
+    }
+  }
+}
+
 std::uint32_t ZerithdSession::batchedEventsSize() const {
   std::uint32_t size = 0;
   if (const auto set = backends()) {
@@ -626,11 +650,13 @@ Value ZerithdSession::sendMessageWithDictionary(const Value& message) {
     if (!backend->isWhitelistedEvent(category)) {
       logger().debug("sendMessageWithDictionary: Dropping event with category {} as it is not whitelisted for backend {}",
                      category, backend->name());
+      backend->counters().add(BackendCount::droppedFiltered);
       continue;
     }
     if (backend->isBlacklistedEvent(category)) {
       logger().debug("sendMessageWithDictionary: Dropping event with category {} as it is blacklisted for backend {}",
                      category, backend->name());
+      backend->counters().add(BackendCount::droppedBlacklisted);
       continue;
     }
     auto result = backend->sendMessage(methodDictionary, now, category, type, flag);
@@ -851,11 +877,13 @@ void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const 
     if (!backend->isWhitelistedEvent(category)) {
       logger().debug("sendMessageWithSessionInfo: Dropping event with category {} as it is not whitelisted for backend {}",
                      category, backend->name());
+      backend->counters().add(BackendCount::droppedFiltered);
       continue;
     }
     if (backend->isBlacklistedEvent(category)) {
       logger().debug("sendMessageWithSessionInfo: Dropping event with category {} as it is blacklisted for backend {}",
                      category, backend->name());
+      backend->counters().add(BackendCount::droppedBlacklisted);
       continue;
     }
     // A copy of the client's payload itself (no "ClientData" wrapping); a

@@ -28,6 +28,9 @@
 
 namespace zerith {
 
+// The prefix of the final report's per-backend counts.
+inline constexpr char kBackendCountsKey[] = "BackendCounts";
+
 namespace ipc {
 class Connection;
 }
@@ -98,6 +101,9 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
   void updateCombinedSessionID();
   // What the backends hold, for health reports.
   std::uint32_t batchedEventsSize() const;
+  // What became of each backend's events so far, as "BackendCounts_<backend>_<count>"
+  // entries of the final report (counts of 0 are left out).
+  void addBackendCounts(Dictionary& payload) const;
 
   // Dispatch.
   Value sendMessageWithDictionary(const Value& message);

@@ -12,6 +12,7 @@
 #include <mutex>
 #include <string>
 
+#include "backends/ZerithBackend.h"
 #include "platform/Value.h"
 #include "transport/ConnectivityHelperDelegate.h"
 
@@ -48,6 +49,11 @@ class ZerithdSessionDelegate : public ConnectivityHelperDelegate {
   virtual void removeObjectFromSharedDataForSession(ZerithdSession& session, const std::string& key) = 0;
   virtual Value sharedDataForSession(ZerithdSession& session) = 0;
   virtual void addAgentHealthInfoForSession(ZerithdSession& session, Dictionary& payload) = 0;
+
+  // A session that ends hands over its backends after its final report and
+  // flush, for the totals of ended sessions; their counters go on counting
+  // what completes later.
+  virtual void backendsOfEndedSession(ZerithdSession& /*session*/, const BackendDictionary& /*backends*/) {}
 };
 
 }  // namespace zerith

@@ -256,11 +256,20 @@ TEST_F(DashboardBackendTest, LossyNetworkStillGetsEveryDatagramAcknowledgedWithi
       acknowledged.insert(event);
     }
   }
+  std::uint64_t copiesSent = 0;
   for (std::uint16_t e = 1; e <= kEvents; ++e) {
     EXPECT_TRUE(acknowledged.contains(e)) << e;
     EXPECT_LE(sent[e], 5) << e;  // first sending and at most four more
     EXPECT_GE(sent[e], (e % 3 == 0 || e % 2 == 0) ? 2 : 1) << e;
+    copiesSent += static_cast<std::uint64_t>(sent[e]);
   }
+  // Every event handed over once and acknowledged once; each further copy
+  // that went out whole was a retransmission (a first copy the socket did
+  // not take whole is not one, but loopback takes them all).
+  EXPECT_EQ(b->counters().get(BackendCount::sent), kEvents);
+  EXPECT_EQ(b->counters().get(BackendCount::delivered), kEvents);
+  EXPECT_EQ(b->counters().get(BackendCount::retried), copiesSent - kEvents);
+  EXPECT_EQ(b->counters().get(BackendCount::droppedTransportError), 0u);
   b->cleanup();
   ASSERT_TRUE(watch.waitFor([](std::size_t, bool cancelled, int) { return cancelled; }));
 }
@@ -276,6 +285,10 @@ TEST_F(DashboardBackendTest, UnansweredDatagramIsSentFiveTimesThenDropped) {
   for (const auto& d : arrivals) {
     EXPECT_EQ(d.bytes, arrivals[0].bytes);
   }
+  EXPECT_EQ(b->counters().get(BackendCount::sent), 1u);
+  EXPECT_EQ(b->counters().get(BackendCount::retried), 4u);
+  EXPECT_EQ(b->counters().get(BackendCount::droppedTransportError), 1u);
+  EXPECT_EQ(b->counters().get(BackendCount::delivered), 0u);
   b->cleanup();
 }
 
@@ -291,6 +304,8 @@ TEST_F(DashboardBackendTest, FiftyFirstQueuedDatagramPushesOutTheOldest) {
   EXPECT_EQ(queue.front().eventNumber, 2);
   EXPECT_EQ(queue.back().eventNumber, 51);
   EXPECT_EQ(queue.front().state, UDPPacketToSend::kAwaitingAcknowledgement);
+  EXPECT_EQ(b->counters().get(BackendCount::sent), 51u);
+  EXPECT_EQ(b->counters().get(BackendCount::droppedQueueFull), 1u);
   b->cleanup();
 }
 

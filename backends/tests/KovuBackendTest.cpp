@@ -74,6 +74,7 @@ TEST_F(KovuBackendTest, AdaptorReceivesMethodRespCodeAndDictionaryOnly) {
   EXPECT_EQ(lines[0].dump(), R"({"dict":{"nested":{"x":1.5},"rssi":-61,"ssid":"lab"},"method":12,"respCode":3})");
   EXPECT_EQ(lines[1].dump(), R"({"dict":{},"method":65535,"respCode":0})");
   EXPECT_EQ(capture_.count("does not respond"), 0u);
+  EXPECT_EQ(backend->counters().get(BackendCount::sent), 2u);
 }
 
 TEST_F(KovuBackendTest, AdaptorWithoutTheOperationIsReportedOnEveryEvent) {
@@ -86,6 +87,8 @@ TEST_F(KovuBackendTest, AdaptorWithoutTheOperationIsReportedOnEveryEvent) {
   EXPECT_TRUE(capture_.has(Level::Error, kNotForwarded));
   EXPECT_EQ(capture_.count(kNotForwarded), 3u);
   EXPECT_FALSE(std::filesystem::exists(output_));
+  EXPECT_EQ(backend->counters().get(BackendCount::droppedTransportError), 3u);
+  EXPECT_EQ(backend->counters().get(BackendCount::sent), 0u);
 }
 
 TEST_F(KovuBackendTest, MissingPluginStillMakesABackendThatReportsEachEvent) {

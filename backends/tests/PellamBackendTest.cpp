@@ -34,6 +34,8 @@ TEST_F(PellamBackendTest, MethodZeroOrEmptyPayloadWritesNothing) {
   EXPECT_EQ(backend_.sendMessage(Value(Dictionary{}), now_, 3, 4, std::uint16_t{7}), std::nullopt);
   EXPECT_EQ(backend_.sendMessage(Value(), now_, 3, 4, std::uint16_t{7}), std::nullopt);
   EXPECT_FALSE(std::filesystem::exists(energy::localLogPath()));
+  EXPECT_EQ(backend_.counters().get(BackendCount::droppedFiltered), 3u);
+  EXPECT_EQ(backend_.counters().get(BackendCount::sent), 0u);
 }
 
 TEST_F(PellamBackendTest, RegisteredEventCarriesNumbersOverPayloadKeys) {
@@ -43,6 +45,7 @@ TEST_F(PellamBackendTest, RegisteredEventCarriesNumbersOverPayloadKeys) {
 
   const auto lines = written();
   ASSERT_EQ(lines.size(), 2u);
+  EXPECT_EQ(backend_.counters().get(BackendCount::sent), 2u);
   EXPECT_TRUE(lines[0]["time"].is_number_float());
   EXPECT_EQ(lines[0]["category"], 28);
   EXPECT_EQ(lines[0]["event"], "Hollond-ZTH");
@@ -57,6 +60,9 @@ TEST_F(PellamBackendTest, SessionDispatchReachesTheBaseSendAndWritesNothing) {
   EXPECT_EQ(asSessionSeesIt.sendMessage(Value(Dictionary{{"a", 1}}), now_, 3, 4, 0), std::nullopt);
   EXPECT_EQ(asSessionSeesIt.sendMessage(Value(Dictionary{{"a", 1}}), now_, 3, 4, 7, 0), std::nullopt);
   EXPECT_FALSE(std::filesystem::exists(energy::localLogPath()));
+  // Counted as what this kind does not carry, not as sent.
+  EXPECT_EQ(backend_.counters().get(BackendCount::droppedUnsupported), 2u);
+  EXPECT_EQ(backend_.counters().get(BackendCount::sent), 0u);
 }
 
 TEST_F(PellamBackendTest, UnwritableEnergyLogIsReportedNotThrown) {

@@ -72,6 +72,7 @@ class RecordingBackend final : public ZerithBackend {
   using ZerithBackend::sendMessage;
   std::optional<std::string> sendMessage(const Value& message, const timeval&, std::uint16_t method,
                                          std::uint16_t respCode, std::uint16_t eventID, std::int32_t flag) override {
+    counters().add(BackendCount::sent);
     {
       std::lock_guard lock(mutex_);
       ++count_;

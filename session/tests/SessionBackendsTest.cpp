@@ -513,6 +513,62 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
   EXPECT_GE(a->flushes(), 1);
 }
 
+TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTheTotalsOfEndedSessions) {
+  useStorebag({{"recA", Value(Dictionary{{"whitelist", Value(Array{Value(0), Value(3)})}})},
+               {"recB", Value(Dictionary{{"blacklist", Value(Array{Value(4)})}})}});
+  auto other = started(sessionInfo(6));
+  auto c = started(sessionInfo(5));
+  for (const unsigned category : {3u, 4u, 5u}) {
+    send(c, event(category, 1));
+  }
+  auto a = rec(c, "recA");
+  auto b = rec(c, "recB");
+  agent->invalidateReportingSession(c.session);
+  c.session.reset();
+  ASSERT_TRUE(a->waitForCleanups(1));
+  ASSERT_TRUE(b->waitForCleanups(1));
+
+  // The start message and category 3 went to recA, 4 and 5 were not on its
+  // list; recB took all but the blacklisted 4. The end message counts what
+  // came before it; a count of 0 is left out.
+  const Value end = a->events().back().message["ClientData"];
+  EXPECT_EQ(end["BackendCounts_recA_sent"], Value(2ull));
+  EXPECT_EQ(end["BackendCounts_recA_droppedFiltered"], Value(2ull));
+  EXPECT_EQ(end["BackendCounts_recB_sent"], Value(3ull));
+  EXPECT_EQ(end["BackendCounts_recB_droppedBlacklisted"], Value(1ull));
+  EXPECT_TRUE(end["BackendCounts_recA_batched"].isNil());
+  EXPECT_TRUE(end["BackendCounts_recB_droppedFiltered"].isNil());
+  EXPECT_EQ(end["SessionsCount_YJ"], Value(2ull));  // the health figures stay as they were
+
+  const auto expectStatus = [&](const char* when) {
+    SCOPED_TRACE(when);
+    const ipc::DaemonStatus status = agent->daemonStatus(nullptr);
+    ASSERT_EQ(status.sessions.size(), 1u);
+    EXPECT_EQ(status.sessions[0].sessionID, 6u);
+    EXPECT_EQ(status.sessions[0].clientType, 7);
+    ASSERT_EQ(status.sessions[0].backends.size(), 2u);
+    EXPECT_EQ(status.sessions[0].backends[0].name, "recA");
+    EXPECT_EQ(status.sessions[0].backends[0].state, kBackendStateEnabled);
+    EXPECT_EQ(ipc::countOf(status.sessions[0].backends[0].counts, "sent"), 1u);  // its start message
+    ASSERT_EQ(status.ended.size(), 2u);
+    EXPECT_EQ(status.ended[0].clientType, 7);
+    EXPECT_EQ(status.ended[0].backend, "recA");
+    EXPECT_EQ(status.ended[0].sessions, 1u);
+    EXPECT_EQ(ipc::countOf(status.ended[0].counts, "sent"), 3u);  // with the end message
+    EXPECT_EQ(ipc::countOf(status.ended[0].counts, "droppedFiltered"), 2u);
+    EXPECT_EQ(status.ended[1].backend, "recB");
+    EXPECT_EQ(ipc::countOf(status.ended[1].counts, "sent"), 4u);
+    EXPECT_EQ(ipc::countOf(status.ended[1].counts, "droppedBlacklisted"), 1u);
+    EXPECT_EQ(status.ended[1].counts.size(), kBackendCountKinds);
+  };
+  expectStatus("backends still held");
+  a.reset();
+  b.reset();
+  expectStatus("backends gone, their counts folded into the totals");
+  // The session that asks is left out of the live ones.
+  EXPECT_TRUE(agent->daemonStatus(other.session.get()).sessions.empty());
+}
+
 // --- One-shot messages ------------------------------------------------------------------------------
 
 TEST_F(SessionBackendsTest, OneShotHandsThePayloadItselfToAThrowAwaySet) {

@@ -18,6 +18,7 @@
 #include "platform/Log.h"
 #include "platform/Paths.h"
 #include "tools/zerith/ZerithSessions.h"
+#include "tools/zerith/ZerithStatus.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::cli {
@@ -518,6 +519,12 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
   identifier->add_flag("--dnu", dnu, "The identifier kept for DNU reporting");
   auto* version = app.add_subcommand("version", "Print the framework version and public-key location");
   version->allow_extras();
+  bool statusJson = false;
+  auto* status = app.add_subcommand(
+      "status", "Show what became of the events of live and ended sessions, per backend (needs the entitlement "
+                "com.velmar.private.zerithd.status)");
+  status->allow_extras();
+  status->add_flag("--json", statusJson, "Print the status as one JSON line instead of tables");
 
   const auto usage = [&](const std::string& what) {
     err << "zerith: " << what << "\nRun with --help for more information.\n";
@@ -530,7 +537,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return code == 0 ? 0 : kExitUsage;
   }
   CLI::App* chosen = nullptr;
-  for (auto* sub : {session, sessions, identifier, version}) {
+  for (auto* sub : {session, sessions, identifier, version, status}) {
     if (*sub) {
       chosen = sub;
     }
@@ -539,7 +546,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return usage(*problem);
   }
   if (!chosen) {
-    return usage("a command is required: session, sessions, identifier or version");
+    return usage("a command is required: session, sessions, status, identifier or version");
   }
   if (timeoutMs < 1) {
     return usage("--timeout must be at least 1 millisecond, not " + std::to_string(timeoutMs));
@@ -569,6 +576,10 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
                                               {"publicKey", Zerith::publicKeyPath().string()}}))
           << '\n';
       return 0;
+    }
+    if (chosen == status) {
+      return runStatus(socket ? std::filesystem::path(*socket) : Zerith::defaultSocketPath(),
+                       std::chrono::milliseconds(timeoutMs), statusJson, out, err);
     }
     if (chosen == sessions) {
       const auto path = socket ? std::filesystem::path(*socket) : Zerith::defaultSocketPath();

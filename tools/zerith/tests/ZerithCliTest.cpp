@@ -1,4 +1,5 @@
 #include "tools/zerith/ZerithCli.h"
+#include "tools/zerith/ZerithStatus.h"
 
 #include <gtest/gtest.h>
 
@@ -164,6 +165,41 @@ TEST_F(CliFixture, RefusedClientExitsWithTheRefusalStatus) {
   EXPECT_EQ(r.err, "zerith: the daemon closed the session during set-info (is this user granted com.velmar.private.zerithd?)\n");
 }
 
+TEST_F(CliFixture, StatusNeedsADaemonThatAnswersIt) {
+  const auto unreachable = runCli({"--socket", (root / "/nowhere/sock").string(), "status"});
+  EXPECT_EQ(unreachable.status, cli::kExitUnreachable);
+  EXPECT_EQ(unreachable.out, "");
+  // This daemon knows only the session interface: the call is unknown there.
+  const auto unknown = runCli({"--root", root.path().string(), "--timeout", "5000", "status", "--json"});
+  EXPECT_EQ(unknown.status, cli::kExitStepFailed);
+  EXPECT_EQ(unknown.err, "zerith: status: Unknown operation \"fetchDaemonStatusWithCompletionHandler:\"\n");
+  EXPECT_EQ(unknown.out, "");
+}
+
+TEST(Cli, StatusTablesShowEachBackendsCountsAndWhyEventsWereDropped) {
+  ipc::DaemonStatus status;
+  status.sessions.push_back(ipc::SessionStatus{
+      12, "s", 7,
+      {ipc::BackendStatus{"httpsPost", 2,
+                          {{"sent", 1200}, {"batched", 4}, {"droppedSampledOut", 0}, {"droppedFiltered", 3},
+                           {"droppedBlacklisted", 1}, {"delivered", 1190}}},
+       ipc::BackendStatus{"pellamlog", 3, {{"droppedUnsupported", 7}, {"droppedFutureReason", 2}}}}});
+  status.sessions.push_back(ipc::SessionStatus{13, "t", 9, {}});
+  status.ended.push_back(ipc::EndedTotals{7, "httpsPost", 2, {{"sent", 5}, {"retried", 2}}});
+  EXPECT_EQ(cli::statusTable(status),
+            "Live sessions: 2\n"
+            "SESSION  CLIENT  BACKEND    STATE        SENT  BATCHED  SPOOLED  RETRIED  DELIVERED  DROPPED  WHY\n"
+            "12       7       httpsPost  enabled      1200        4        0        0       1190        4  filtered 3, blacklisted 1\n"
+            "12       7       pellamlog  sampled out     0        0        0        0          0        9  unsupported 7, futureReason 2\n"
+            "13       9       -          no backends\n"
+            "\n"
+            "Ended sessions, totals by client type and backend:\n"
+            "CLIENT  BACKEND    SESSIONS  SENT  BATCHED  SPOOLED  RETRIED  DELIVERED  DROPPED  WHY\n"
+            "7       httpsPost         2     5        0        0        2          0        0  -\n");
+  EXPECT_EQ(cli::statusTable(ipc::DaemonStatus{}),
+            "Live sessions: 0\n\nEnded sessions, totals by client type and backend:\n(none)\n");
+}
+
 TEST_F(CliFixture, AStepThatTimesOutStopsTheScript) {
   daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
   auto args = session({"--step", "set-info", "--step", "display-url", "--step", "finish"});
@@ -184,7 +220,7 @@ TEST_F(CliFixture, BadCommandLinesAreRefusedBeforeConnecting) {
   EXPECT_EQ(runCli({"session", "--session-id", "1", "--step", "start"}).err, "zerith: session needs --client-type" + more);
   EXPECT_EQ(runCli({"session", "--client-type", "7", "--step", "start"}).err, "zerith: session needs --session-id" + more);
   EXPECT_EQ(runCli({"session", "--client-type", "7", "--session-id", "1"}).err, "zerith: session needs --step" + more);
-  EXPECT_EQ(runCli({}).err, "zerith: a command is required: session, sessions, identifier or version" + more);
+  EXPECT_EQ(runCli({}).err, "zerith: a command is required: session, sessions, status, identifier or version" + more);
 
   // Misspelt words are named, with the nearest known one.
   EXPECT_EQ(runCli(session({"--stepp", "start"})).err,

@@ -1,0 +1,135 @@
+// What the HTTPS backend counts for each event: sent, batched, and dropped
+// by the reason that decided it, against a real HTTPS server on loopback.
+
+#include "backends/tests/HTTPSPostBackendTestSupport.h"
+
+namespace zerith::test {
+namespace {
+
+class HTTPSCountsTest : public HTTPSBackendTest {
+ protected:
+  static Value event(int n) { return Value(Dictionary{{"ClientData", Dictionary{{"n", n}}}}); }
+
+  // Every count but the ones named is 0.
+  static void expectOnly(const ZerithBackend& b, std::initializer_list<std::pair<BackendCount, std::uint64_t>> wanted) {
+    for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
+      const auto kind = static_cast<BackendCount>(i);
+      std::uint64_t expected = 0;
+      for (const auto& [k, n] : wanted) {
+        if (k == kind) {
+          expected = n;
+        }
+      }
+      EXPECT_EQ(b.counters().get(kind), expected) << backendCountName(kind);
+    }
+  }
+
+  void flush(HTTPSPostBackend& b) {
+    auto results = ResultLog::make();
+    b.flushMessagesWithCompletion(results->handler());
+    ASSERT_TRUE(results->waitFor(1));
+  }
+};
+
+TEST_F(HTTPSCountsTest, BatchedEventsAreSentOrDroppedByTheEventListsAtTheFlush) {
+  server.on("/post", Reply{});
+  Dictionary client = enablingClient(server.url("/post"));
+  client.set("event_whitelist", Array{Value(1), Value(2)});
+  client.set("event_blacklist", Array{Value(2)});
+  auto b = backend(profileWith({client}), userInfo(), true, true);
+  ASSERT_EQ(b->state(), kBackendStateEnabled);
+  for (const std::uint16_t category : {1, 2, 3, 1}) {
+    b->sendMessage(event(category), at(1001), category, 0, 0);
+  }
+  expectOnly(*b, {{BackendCount::batched, 4}});
+  flush(*b);
+  ASSERT_TRUE(server.waitForRequests(1));
+  EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 2u);
+  // A realtime event passes the batch and goes at once.
+  b->sendMessage(event(9), at(1002), 1, 0, 1);
+  ASSERT_TRUE(server.waitForRequests(2));
+  expectOnly(*b, {{BackendCount::batched, 4},
+                  {BackendCount::sent, 3},
+                  {BackendCount::droppedFiltered, 1},
+                  {BackendCount::droppedBlacklisted, 1}});
+}
+
+TEST_F(HTTPSCountsTest, EventsThatMayNotGoCountTheReasonThatKeptThem) {
+  server.on("/post", Reply{});
+  struct Case {
+    const char* what;
+    Dictionary change;
+    bool withUserInfo;
+    bool withURL;
+    std::int32_t state;
+    BackendCount reason;
+    bool batchedFirst;
+  };
+  const Case cases[] = {
+      // The draw is never below 0: sampled out, batched, dropped at the flush.
+      {"sampled out", {{"sampling_threshold", 0.0}}, true, true, kBackendStateSampledOut, BackendCount::droppedSampledOut, true},
+      // At or above the override threshold the draw disables the backend.
+      {"disabled by the draw", {{"sampling_threshold", 0.0}, {"override_sampling", 0.0}}, true, true,
+       kBackendStateDisabled, BackendCount::droppedSampledOut, false},
+      {"disabled by the locale rule", {{"locale_whitelist", Array{Value("FR")}}}, true, true, kBackendStateDisabled,
+       BackendCount::droppedDisabled, false},
+      {"undecided without user info", {}, false, true, kBackendStateUndecided, BackendCount::droppedDisabled, true},
+      {"no post URL", {}, true, false, kBackendStateEnabled, BackendCount::droppedDisabled, false},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.what);
+    Dictionary client = enablingClient(server.url("/post"));
+    for (const auto& [key, value] : c.change) {
+      client.set(key, value);
+    }
+    if (!c.withURL) {
+      client.erase("post_url");
+    }
+    auto b = backend(profileWith({client}), c.withUserInfo ? userInfo() : Value(), true, false);
+    ASSERT_EQ(b->state(), c.state);
+    b->sendMessage(event(1), at(1001), 1, 0, 0);
+    b->sendMessage(event(2), at(1001), 1, 0, 0);
+    flush(*b);
+    if (c.batchedFirst) {
+      expectOnly(*b, {{BackendCount::batched, 2}, {c.reason, 2}});
+    } else {
+      expectOnly(*b, {{c.reason, 2}});
+    }
+  }
+  EXPECT_EQ(server.requestCount(), 0u);
+}
+
+TEST_F(HTTPSCountsTest, ServerRefusalAndAGoneTransportCountTheirDrops) {
+  server.on("/post", Reply{.status = 503});
+  auto b = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, true);
+  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  flush(*b);  // answered 503: disabled by the server
+  ASSERT_EQ(b->state(), kBackendStateDisabled);
+  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  expectOnly(*b, {{BackendCount::batched, 1}, {BackendCount::sent, 1}, {BackendCount::droppedDisabled, 1}});
+
+  auto orphan = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, false);
+  orphan->setReportingSessionConnectivityDelegate({});
+  orphan->sendMessage(event(3), at(1001), 1, 0, 0);
+  expectOnly(*orphan, {{BackendCount::droppedTransportError, 1}});
+  EXPECT_EQ(server.requestCount(), 1u);
+}
+
+TEST_F(HTTPSCountsTest, BatchStillHeldWhenTheBackendGoesIsCountedAsDropped) {
+  auto b = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, true);
+  ASSERT_EQ(b->state(), kBackendStateEnabled);
+  // User info taken away again: the batch may not be flushed, and stays.
+  b->setUserInfoDict(Value());
+  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  flush(*b);
+  EXPECT_EQ(b->batchedEventCount(), 2u);
+  const auto counters = b->sharedCounters();
+  b.reset();
+  EXPECT_EQ(counters->get(BackendCount::batched), 2u);
+  EXPECT_EQ(counters->get(BackendCount::droppedDisabled), 2u);
+  EXPECT_EQ(counters->get(BackendCount::sent), 0u);
+}
+
+}  // namespace
+}  // namespace zerith::test
