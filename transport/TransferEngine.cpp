@@ -38,6 +38,11 @@ constexpr int kBackgroundSocketPriority = 2;
 // Received bytes are handed to the delegate queue once per turn of the
 // transport loop, or earlier when this many are waiting.
 constexpr std::size_t kFlushThreshold = 1 << 20;
+// Open connections kept for reuse: enough for the posts of every session
+// that sends at once.
+constexpr long kCachedConnections = 32;
+// Parallel connections to one server (host and port).
+constexpr long kConnectionsPerServer = 6;
 constexpr const char* kSourceApplicationHeader = "X-ZTH-Source-Application";
 
 struct MultiFree {
@@ -100,6 +105,20 @@ struct TransferEngine::Impl {
       logger().error("URLSession: libcurl {} lacks what the transport needs (7.87 or later with TLS)", info->version);
     }
     multi.reset(curl_multi_init());
+    // Finished transfers leave their connection open in the multi handle's
+    // cache for the next request to the same server. libcurl's default size
+    // of that cache is four times the transfers under way at the moment a
+    // connection is returned, so after a burst of parallel posts it closed
+    // the connections it had just opened and the next burst paid a TLS
+    // handshake for every few posts. A fixed size keeps them.
+    curl_multi_setopt(multi.get(), CURLMOPT_MAXCONNECTS, kCachedConnections);
+    // Without a bound every post that finds no idle connection opens one:
+    // under load the transfer thread fell behind with TLS handshakes, posts
+    // piled up, each pile-up opened more connections (hundreds, each with
+    // its own TLS context), and handshakes took most of the daemon's CPU.
+    // Bounded, a post waits in libcurl's queue for a connection of the same
+    // server to come free and goes out on it without a new handshake.
+    curl_multi_setopt(multi.get(), CURLMOPT_MAX_HOST_CONNECTIONS, kConnectionsPerServer);
     thread = std::thread([this] { run(); });
     // Stops the thread before OpenSSL's own exit handler runs (registered
     // earlier, so it runs later).
