@@ -181,7 +181,8 @@ TEST_F(HTTPSPostTest, ConcurrentSendersAndFlushesPutEveryRecordInExactlyOneBatch
   for (const auto& post : posts) {
     std::vector<int> last(kSenders, -1);
     std::vector<int> first(kSenders, -1);
-    for (const auto& record : envelopeOf(post)["events"]) {
+    const auto envelope = envelopeOf(post);
+    for (const auto& record : envelope["events"]) {
       const int s = record["s"].get<int>();
       const int i = record["i"].get<int>();
       EXPECT_GT(i, last[s]) << "sender " << s << " out of order within a batch";
