@@ -245,8 +245,12 @@ void HTTPSPostBackend::setImmutable() {
 
 Dictionary HTTPSPostBackend::newEventDictfromPayload(const Value& payload, const timeval& timestamp,
                                                      std::uint16_t method, std::uint16_t respCode,
-                                                     std::uint16_t) const {
-  Dictionary event = payload.isDict() ? payload.dictCopy() : Dictionary();
+                                                     std::uint16_t eventID) const {
+  return completeRecord(payload.isDict() ? payload.dictCopy() : Dictionary(), timestamp, method, respCode, eventID);
+}
+
+Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& timestamp, std::uint16_t method,
+                                            std::uint16_t respCode, std::uint16_t) const {
   const double start = startTimeStamp();
   const std::int64_t startTS = roundDownToMinute(static_cast<std::int64_t>(start));
   event.set("_startTS", Value(static_cast<long long>(startTS)));
@@ -303,34 +307,19 @@ void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Value& fr
 
 std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
   const auto method = static_cast<std::uint16_t>(recordInteger(event, "_method").value_or(0));
-  std::int64_t count = stateQueue().sync([&] {
+  const std::int32_t threshold = eventThreshold();
+  // Creates the batch when there is none, with room for a method's full
+  // batch; on the state queue.
+  const auto createBatch = [&] {
     if (!batch_.batchedEvents) {
       batch_.batchedEvents.emplace();
+      batch_.batchedEvents->reserve(static_cast<std::size_t>(std::clamp<std::int32_t>(threshold, 0, 255)) + 1);
     }
-    for (const auto& [m, n] : batch_.eventMethodCounts) {
-      if (m == method) {
-        return n;
-      }
-    }
-    return std::int64_t{0};
-  });
-  std::optional<std::string> result;
-  if (count > eventThreshold()) {
-    backendsLogger().debug("HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method {}",
-                   method);
-    result = flushMessagesWithCompletion(nullptr);
-    count = 0;
-  }
-  // The append takes its own turn on the state queue after the forced
-  // flush, so the record that forced it is never part of what it flushed.
-  // The turn runs on this thread: waking a pool thread for every record cost
-  // more than the append itself, and a later read on the queue sees the
-  // record either way.
-  stateQueue().sync([&] {
+  };
+  // Appends the record and stores the method's new count; on the state queue.
+  const auto append = [&](std::int64_t count) {
     Batch& batch = batch_;
-    if (!batch.batchedEvents) {
-      batch.batchedEvents.emplace();
-    }
+    createBatch();
     batch.batchedEvents->push_back(std::move(event));
     counters().add(BackendCount::batched);
     for (auto& [m, n] : batch.eventMethodCounts) {
@@ -340,7 +329,38 @@ std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
       }
     }
     batch.eventMethodCounts.emplace_back(method, count + 1);
+  };
+  // One turn on the state queue reads the method's count and, when it does
+  // not force a flush, appends the record at once. The append may join the
+  // read because all that the batch's users rely on is that a later turn on
+  // the queue (a flush, a size or count read) sees every record whose
+  // batchEvent has returned; one turn gives that as well as two. The turn
+  // runs on this thread, so no pool thread is woken per record.
+  std::int64_t count = 0;
+  const bool appended = stateQueue().sync([&] {
+    createBatch();
+    for (const auto& [m, n] : batch_.eventMethodCounts) {
+      if (m == method) {
+        count = n;
+        break;
+      }
+    }
+    if (count > threshold) {
+      return false;
+    }
+    append(count);
+    return true;
   });
+  if (appended) {
+    return std::nullopt;
+  }
+  backendsLogger().debug("HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method {}",
+                 method);
+  std::optional<std::string> result = flushMessagesWithCompletion(nullptr);
+  // The record that forced the flush is appended in a turn of its own after
+  // it, so it is never part of what it flushed; it starts the method's new
+  // count.
+  stateQueue().sync([&] { append(0); });
   return result;
 }
 
@@ -351,19 +371,25 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
   const Fields f = fields();
 
   auto records = nlohmann::ordered_json::array();
+  auto& recordList = records.get_ref<nlohmann::ordered_json::array_t&>();
+  recordList.reserve(events.size());
   for (const Dictionary& event : events) {
     auto record = nlohmann::ordered_json::object();
+    auto& entries = record.get_ref<nlohmann::ordered_json::object_t&>();
+    entries.reserve(event.size());
     for (const auto& [key, value] : event) {
       if (auto wire = wireValue(key, value)) {
-        record[key] = std::move(*wire);
+        // A record's keys are unique already: appended without the ordered
+        // map's search for an equal key.
+        entries.emplace_back(key, std::move(*wire));
       }
     }
     if (f.spoolEnabled) {
       // Set once, here: a spooled batch is posted again byte for byte, so
       // the collector sees the same ID on every copy of the record.
-      record["_recordID"] = newRecordID();
+      entries.emplace_back("_recordID", newRecordID());
     }
-    records.push_back(std::move(record));
+    recordList.push_back(std::move(record));
   }
 
   std::optional<std::string> clientId = f.uuidCustom ? f.uuidCustom : (f.dnuType != 0 ? f.uuidOverrideDnu : f.uuidRespectDnu);
@@ -432,7 +458,7 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
     copy.set("OverrideSampling", f.overrideSampling.isNil() ? Value(-1) : f.overrideSampling);
     copy.set("Batch", Value(batchEvents() ? 1 : 0));
   }
-  Dictionary event = newEventDictfromPayload(Value(std::move(copy)), timestamp, method, respCode, eventID);
+  Dictionary event = completeRecord(std::move(copy), timestamp, method, respCode, eventID);
   prepareEventForMessage(event, message["SharedData"]);
 
   const bool realtime = (flag | 2) == 3;
@@ -512,11 +538,13 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
   }
 
   const auto jsonBytes = crypto::bytesOf(json);
-  Data body(jsonBytes.begin(), jsonBytes.end());
+  Data body;
   bool compressed = false;
-  if (auto gz = gzipDeflate(jsonBytes); gz && !gz->empty() && gz->size() < body.size()) {
+  if (auto gz = gzipDeflate(jsonBytes); gz && !gz->empty() && gz->size() < jsonBytes.size()) {
     body = std::move(*gz);
     compressed = true;
+  } else {
+    body.assign(jsonBytes.begin(), jsonBytes.end());
   }
 
   if (!isInternalBuild()) {
@@ -911,23 +939,26 @@ void HTTPSPostBackend::filterEvent(Dictionary& event) const {
   }
   const std::int64_t method = recordInteger(event, "_method").value_or(0);
   const std::int64_t status = recordInteger(event, "_status").value_or(0);
-  std::vector<std::string> keys;
-  keys.reserve(event.size());
+  // The first filter that names an entry decides its fate; the entries are
+  // changed after the scan, so only those that a filter acts on are named.
+  std::vector<std::pair<std::string, std::int32_t>> actions;
   for (const auto& [key, value] : event) {
-    keys.push_back(key);
-  }
-  for (const std::string& key : keys) {
     for (const Filter& filter : *filters) {
       if (filter.key.empty() || !equalsIgnoringCase(filter.key, key) || (filter.method != -1 && filter.method != method) ||
           (filter.status != -1 && filter.status != status)) {
         continue;
       }
-      if (filter.action == kFilterSHA256) {
-        event.set(key, Value(convertIntoSHA256(hashableText(event.get(key)))));
-      } else if (filter.action == kFilterRemove) {
-        event.erase(key);
+      if (filter.action == kFilterSHA256 || filter.action == kFilterRemove) {
+        actions.emplace_back(key, filter.action);
       }
       break;
+    }
+  }
+  for (const auto& [key, action] : actions) {
+    if (action == kFilterSHA256) {
+      event.set(key, Value(convertIntoSHA256(hashableText(event.get(key)))));
+    } else {
+      event.erase(key);
     }
   }
 }

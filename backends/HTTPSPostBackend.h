@@ -76,6 +76,9 @@ class HTTPSPostBackend : public ZerithBackend {
   // Records, batch and envelope.
   Dictionary newEventDictfromPayload(const Value& payload, const timeval& timestamp, std::uint16_t method,
                                      std::uint16_t respCode, std::uint16_t eventID) const;
+  // The same on a copy of the payload that the caller has already made.
+  Dictionary completeRecord(Dictionary event, const timeval& timestamp, std::uint16_t method, std::uint16_t respCode,
+                            std::uint16_t eventID) const;
   void prepareEventForMessage(Dictionary& event, const Value& frameworkData) const;
   std::optional<std::string> batchEvent(Dictionary event);
   // The compact envelope, or nullopt when it cannot be serialised. When

@@ -84,11 +84,15 @@ void Dictionary::set(std::string key, Value value) {
   }
   entries_.emplace_back(std::move(key), std::move(value));
   if (index_) {
-    // Keep the sorted index: insert the new position in order.
-    auto index = std::make_shared<std::vector<std::pair<std::size_t, std::size_t>>>(*index_);
+    // Keep the sorted index: insert the new position in order. Copies of
+    // this dictionary share the index, so a shared one is copied first; one
+    // held by this dictionary alone is updated in place (a record that grows
+    // past the threshold would otherwise copy its index for every key).
+    if (index_.use_count() != 1) {
+      index_ = std::make_shared<std::vector<std::pair<std::size_t, std::size_t>>>(*index_);
+    }
     auto entry = std::make_pair(hashKey(entries_.back().first), entries_.size() - 1);
-    index->insert(std::upper_bound(index->begin(), index->end(), entry), entry);
-    index_ = std::move(index);
+    index_->insert(std::upper_bound(index_->begin(), index_->end(), entry), entry);
   } else if (entries_.size() >= kIndexThreshold) {
     rebuildIndex();
   }

@@ -1,5 +1,6 @@
 #include "transport/TransferEngine.h"
 
+#include <malloc.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -12,6 +13,7 @@
 #include <functional>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <thread>
 #include <unordered_map>
@@ -38,6 +40,13 @@ constexpr int kBackgroundSocketPriority = 2;
 // Received bytes are handed to the delegate queue once per turn of the
 // transport loop, or earlier when this many are waiting.
 constexpr std::size_t kFlushThreshold = 1 << 20;
+// Open connections kept for reuse: enough for the posts of every session
+// that sends at once.
+constexpr long kCachedConnections = 32;
+// Least time between two returns of free memory to the system.
+constexpr auto kTrimInterval = std::chrono::seconds(1);
+// Parallel connections to one server (host and port).
+constexpr long kConnectionsPerServer = 6;
 constexpr const char* kSourceApplicationHeader = "X-ZTH-Source-Application";
 
 struct MultiFree {
@@ -92,6 +101,9 @@ struct TransferEngine::Impl {
   // Transport thread only.
   std::unordered_map<CURL*, std::shared_ptr<URLSessionTask>> active;
   std::multimap<Clock::time_point, std::function<void()>> timers;
+  // Transfers finished since the allocator last gave its free pages back.
+  std::size_t finishedSinceTrim = 0;
+  Clock::time_point lastTrim{};
 
   Impl() {
     curl_global_init(CURL_GLOBAL_DEFAULT);
@@ -100,6 +112,20 @@ struct TransferEngine::Impl {
       logger().error("URLSession: libcurl {} lacks what the transport needs (7.87 or later with TLS)", info->version);
     }
     multi.reset(curl_multi_init());
+    // Finished transfers leave their connection open in the multi handle's
+    // cache for the next request to the same server. libcurl's default size
+    // of that cache is four times the transfers under way at the moment a
+    // connection is returned, so after a burst of parallel posts it closed
+    // the connections it had just opened and the next burst paid a TLS
+    // handshake for every few posts. A fixed size keeps them.
+    curl_multi_setopt(multi.get(), CURLMOPT_MAXCONNECTS, kCachedConnections);
+    // Without a bound every post that finds no idle connection opens one:
+    // under load the transfer thread fell behind with TLS handshakes, posts
+    // piled up, each pile-up opened more connections (hundreds, each with
+    // its own TLS context), and handshakes took most of the daemon's CPU.
+    // Bounded, a post waits in libcurl's queue for a connection of the same
+    // server to come free and goes out on it without a new handshake.
+    curl_multi_setopt(multi.get(), CURLMOPT_MAX_HOST_CONNECTIONS, kConnectionsPerServer);
     thread = std::thread([this] { run(); });
     // Stops the thread before OpenSSL's own exit handler runs (registered
     // earlier, so it runs later).
@@ -150,8 +176,10 @@ struct TransferEngine::Impl {
           CURL* easy = message->easy_handle;
           const CURLcode result = message->data.result;
           finished(easy, result);
+          ++finishedSinceTrim;
         }
       }
+      const auto trimDue = trimIfDue();
       for (auto& [easy, task] : active) {
         flush(*task, *task->transfer_);
       }
@@ -163,8 +191,36 @@ struct TransferEngine::Impl {
         const auto until = std::chrono::ceil<std::chrono::milliseconds>(timers.begin()->first - Clock::now()).count();
         waitMs = static_cast<int>(std::clamp<long long>(until, 0, waitMs));
       }
+      if (trimDue) {
+        const auto until = std::chrono::ceil<std::chrono::milliseconds>(*trimDue - Clock::now()).count();
+        waitMs = static_cast<int>(std::clamp<long long>(until, 0, waitMs));
+      }
       curl_multi_poll(multi.get(), nullptr, 0, waitMs, nullptr);
     }
+  }
+
+  // Every request body, envelope and record of a batch is allocated on the
+  // threads that build and post it and freed after its transfer: the free
+  // memory stays with the allocator's per-thread arenas, scattered between
+  // live blocks, and the daemon's private memory crept up with the number of
+  // events sent. After transfers have finished, at most once a second, the
+  // free pages go back to the system (malloc_trim walks every arena; about
+  // a millisecond here, on this thread, never on a sender's). Returns when
+  // the next trim is due while one is owed, so that the thread wakes once
+  // for it after the last transfer and then sleeps.
+  std::optional<Clock::time_point> trimIfDue() {
+    if (finishedSinceTrim == 0) {
+      return std::nullopt;
+    }
+    const auto now = Clock::now();
+    const auto due = lastTrim + kTrimInterval;
+    if (now < due) {
+      return due;
+    }
+    ::malloc_trim(0);
+    lastTrim = now;
+    finishedSinceTrim = 0;
+    return std::nullopt;
   }
 
   void runDueTimers() {

@@ -2,6 +2,11 @@
 // wire, digest, gzip, batching thresholds, flushing, realtime order, server
 // refusals and TLS refusals.
 
+#include <algorithm>
+#include <atomic>
+#include <numeric>
+#include <thread>
+
 #include "backends/tests/HTTPSPostBackendTestSupport.h"
 #include "backends/tests/WireCaptureServer.h"
 #include "zerith/ZerithConstants.h"
@@ -121,6 +126,90 @@ TEST_F(HTTPSPostTest, FiftyRecordsOfAMethodStayBatchedAndTheFiftyFirstFlushesAll
   EXPECT_EQ(b->batchedEventCount(), 1u);
   // The batch went without method or status: no event map header.
   EXPECT_FALSE(server.requests()[0].header("X-ZTH-Event-Map"));
+}
+
+// Senders on several threads share one batch while another thread flushes
+// it: the count read and the append share one turn on the state queue, so
+// every record lands in exactly one batch, and one sender's records keep
+// their order within a batch and from one flush to the next.
+TEST_F(HTTPSPostTest, ConcurrentSendersAndFlushesPutEveryRecordInExactlyOneBatchInOrder) {
+  server.on("/post", Reply{});
+  auto b = batching(server.url("/post"));
+  constexpr int kSenders = 4;
+  constexpr int kEach = 300;
+  std::atomic<bool> sending{true};
+  std::thread flusher([&] {
+    while (sending.load()) {
+      b->flushMessagesWithCompletion(nullptr);
+      std::this_thread::yield();
+    }
+  });
+  std::vector<std::thread> senders;
+  for (int s = 0; s < kSenders; ++s) {
+    senders.emplace_back([&, s] {
+      for (int i = 0; i < kEach; ++i) {
+        // Two methods, so that both the per-method threshold and the
+        // flusher's flushes cut the batch.
+        b->sendMessage(Value(Dictionary{{"ClientData", Dictionary{{"s", s}, {"i", i}}}}), at(1001),
+                       static_cast<std::uint16_t>(1 + i % 2), 0, 0);
+      }
+    });
+  }
+  for (auto& sender : senders) {
+    sender.join();
+  }
+  sending.store(false);
+  flusher.join();
+  b->flushMessagesWithCompletion(nullptr);
+  EXPECT_EQ(b->batchedEventCount(), 0u);
+
+  // Every post holds at least one record: wait for posts until all arrived.
+  std::size_t records = 0;
+  std::vector<RecordedRequest> posts;
+  while (records < kSenders * kEach && server.waitForRequests(posts.size() + 1)) {
+    posts = server.requests();
+    records = 0;
+    for (const auto& post : posts) {
+      records += envelopeOf(post)["events"].size();
+    }
+  }
+  ASSERT_EQ(records, static_cast<std::size_t>(kSenders * kEach));
+  // Batches are cut in order but may arrive in any order over parallel
+  // connections: each batch's first record per sender tells where it goes.
+  std::vector<std::vector<int>> seen(kSenders);
+  std::vector<std::vector<std::pair<int, int>>> batchesPerSender(kSenders);  // (first i, last i) per batch
+  for (const auto& post : posts) {
+    std::vector<int> last(kSenders, -1);
+    std::vector<int> first(kSenders, -1);
+    const auto envelope = envelopeOf(post);
+    for (const auto& record : envelope["events"]) {
+      const int s = record["s"].get<int>();
+      const int i = record["i"].get<int>();
+      EXPECT_GT(i, last[s]) << "sender " << s << " out of order within a batch";
+      if (first[s] < 0) {
+        first[s] = i;
+      }
+      last[s] = i;
+      seen[s].push_back(i);
+    }
+    for (int s = 0; s < kSenders; ++s) {
+      if (first[s] >= 0) {
+        batchesPerSender[s].emplace_back(first[s], last[s]);
+      }
+    }
+  }
+  for (int s = 0; s < kSenders; ++s) {
+    std::sort(seen[s].begin(), seen[s].end());
+    std::vector<int> expected(kEach);
+    std::iota(expected.begin(), expected.end(), 0);
+    EXPECT_EQ(seen[s], expected) << "sender " << s << ": a record lost or in two batches";
+    // The batches of one sender do not interleave: each continues where the
+    // one before it ended.
+    std::sort(batchesPerSender[s].begin(), batchesPerSender[s].end());
+    for (std::size_t k = 1; k < batchesPerSender[s].size(); ++k) {
+      EXPECT_EQ(batchesPerSender[s][k].first, batchesPerSender[s][k - 1].second + 1) << "sender " << s;
+    }
+  }
 }
 
 TEST_F(HTTPSPostTest, FlushPostsTheBatchAndReportsWhyItCouldNot) {

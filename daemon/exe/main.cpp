@@ -1,9 +1,13 @@
 // zerithd: the on-device reporting service. Parses its options and runs.
 
+#include <malloc.h>
+
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <string>
+#include <thread>
 
 #include <CLI/CLI.hpp>
 
@@ -12,6 +16,13 @@
 #include "platform/Paths.h"
 
 int main(int argc, char** argv) {
+  // One allocator arena per core instead of glibc's eight per core: every
+  // pool thread that allocated got an arena of its own, each keeping the
+  // memory freed in it, and the daemon's private memory under load was a
+  // third larger (100 k events from 8 clients: 14 -> 10 MiB after 10 k
+  // events, 12.6-19.9 -> 10.9-12.9 MiB at the end, CPU per event alike).
+  ::mallopt(M_ARENA_MAX, static_cast<int>(std::max(2u, std::thread::hardware_concurrency())));
+
   // Before any thread exists, so that only the main loop takes the signals.
   zerith::ZerithdDaemon::blockStopSignals();
 
