@@ -720,11 +720,15 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
   startCall(
       operation, std::move(args),
       [waiter](std::optional<Dictionary> a, std::optional<Error> e) {
-        std::lock_guard lock(waiter->mutex);
-        waiter->arrived = true;
-        waiter->reply.args = std::move(a);
-        waiter->reply.error = std::move(e);
-        waiter->done.notify_all();
+        {
+          std::lock_guard lock(waiter->mutex);
+          waiter->arrived = true;
+          waiter->reply.args = std::move(a);
+          waiter->reply.error = std::move(e);
+        }
+        // After the lock: the woken caller does not block on it again. The
+        // handler's own reference keeps the waiter alive meanwhile.
+        waiter->done.notify_one();
       },
       true);
   std::unique_lock lock(waiter->mutex);
