@@ -1,5 +1,5 @@
 // Request/reply round trips over zerith_ipc (a real SocketConnection pair:
-// the caller's call() -> frame -> the answering connection's queue -> an
+// the caller's callAndWait() -> frame -> the answering connection's queue -> an
 // exported object that replies with the same arguments -> frame -> the
 // caller's reply handler) beside a bare Unix-socket echo of frames of the
 // same size (write length + bytes, read them back), in the same run.
@@ -44,6 +44,7 @@ void reportLatencies(benchmark::State& state, std::vector<double>& micros, std::
 class Echo : public ExportedObject {
  public:
   void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override { reply->send(message.args); }
+  bool answersWithoutWaiting(const Message&) const override { return true; }
 };
 
 void BM_IpcRoundTrip(benchmark::State& state) {
@@ -61,30 +62,14 @@ void BM_IpcRoundTrip(benchmark::State& state) {
 
   const Dictionary args = argsOfSize(static_cast<std::size_t>(state.range(0)));
   const std::size_t frameBytes = encodeCall("echo", 1, args).size();
-  std::mutex mutex;
-  std::condition_variable arrived;
-  bool done = false;
-  bool failed = false;
   std::vector<double> micros;
   micros.reserve(1 << 16);
 
   for (auto _ : state) {
     const auto start = Clock::now();
-    {
-      std::lock_guard lock(mutex);
-      done = false;
-    }
-    caller->call("echo", args, [&](std::optional<Dictionary> reply, std::optional<Error>) {
-      {
-        std::lock_guard lock(mutex);
-        done = true;
-        failed = !reply;
-      }
-      arrived.notify_one();
-    });
-    std::unique_lock lock(mutex);
-    arrived.wait(lock, [&] { return done; });
-    if (failed) {
+    // As a client's synchronous call does.
+    const auto reply = caller->callAndWait("echo", args, std::chrono::seconds(10));
+    if (!reply.args) {
       state.SkipWithError("call failed");
       break;
     }

@@ -2,7 +2,6 @@
 
 #include <fmt/format.h>
 
-#include <condition_variable>
 #include <mutex>
 
 #include "ipc/ClientSessionProxy.h"
@@ -69,13 +68,6 @@ class Dispatcher final : public ClientSessionReplyInterface {
   std::function<void()> invalidationHandler_;
 };
 
-struct Waiter {
-  std::mutex mutex;
-  std::condition_variable done;
-  bool arrived = false;
-  ZerithReply reply;
-};
-
 }  // namespace
 
 struct Zerith::Impl {
@@ -88,21 +80,12 @@ struct Zerith::Impl {
       return ZerithReply{{}, Error{kZerithErrorDomain, -1,
                                    fmt::format("{} cannot wait inside a callback of its own session", operation)}};
     }
-    auto waiter = std::make_shared<Waiter>();
-    connection->call(operation, std::move(args), [waiter](std::optional<Dictionary> a, std::optional<Error> e) {
-      {
-        std::lock_guard lock(waiter->mutex);
-        waiter->arrived = true;
-        waiter->reply = ZerithReply{a ? std::move(*a) : Dictionary(), std::move(e)};
-      }
-      waiter->done.notify_all();
-    });
-    std::unique_lock lock(waiter->mutex);
-    if (!waiter->done.wait_for(lock, timeout, [&] { return waiter->arrived; })) {
+    auto answer = connection->callAndWait(operation, std::move(args), timeout);
+    if (answer.timedOut) {
       return ZerithReply{{}, Error{kZerithErrorDomain, -1,
                                    fmt::format("No answer to {} within {} ms", operation, timeout.count())}};
     }
-    return std::move(waiter->reply);
+    return ZerithReply{answer.args ? std::move(*answer.args) : Dictionary(), std::move(answer.error)};
   }
 };
 

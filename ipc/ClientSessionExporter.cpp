@@ -17,6 +17,12 @@ Value valueOf(const std::optional<Error>& error) { return error ? error->toValue
 ClientSessionExporter::ClientSessionExporter(std::shared_ptr<ClientSessionInterface> session, std::string peer)
     : session_(std::move(session)), peer_(std::move(peer)) {}
 
+bool ClientSessionExporter::answersWithoutWaiting(const Message& message) const {
+  const std::string& name = message.operation;
+  return name == kFetchDisplayURL || name == kSendMessage || name == kSetSessionInfo || name == kUpdateSharedData ||
+         name == kUpdateSharedDataForKey || name == kSetDigestKey;
+}
+
 void ClientSessionExporter::handleMessage(const Message& message, std::shared_ptr<Reply> reply) {
   const OperationSpec* op = sessionOperation(message.operation);
   const std::string from = peer_.empty() ? std::string() : " from " + peer_;

@@ -28,6 +28,11 @@ class ClientSessionExporter final : public ExportedObject {
   explicit ClientSessionExporter(std::shared_ptr<ClientSessionInterface> session, std::string peer = {});
 
   void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override;
+  // The calls that only read or record the session's state: the display
+  // URL, an event's dispatch to the backends, session info and shared data.
+  // Configuration (which may fetch the storebag), flushes and uploads may
+  // wait for the network.
+  bool answersWithoutWaiting(const Message& message) const override;
 
   // Answers the daemon's status call (kFetchDaemonStatus in DaemonStatus.h):
   // the handler completes with the status, or nil and the error that

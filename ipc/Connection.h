@@ -61,6 +61,14 @@ class ExportedObject {
  public:
   virtual ~ExportedObject() = default;
   virtual void handleMessage(const Message& message, std::shared_ptr<Reply> reply) = 0;
+  // True when handling `message` never waits for other work (a storebag
+  // fetch, an upload, a network answer): such a call may be handled on the
+  // thread that read it from the socket, which serves other connections too.
+  // Every other call is handled by a thread of the queue's pool.
+  virtual bool answersWithoutWaiting(const Message& message) const {
+    (void)message;
+    return false;
+  }
 };
 
 class Connection : public std::enable_shared_from_this<Connection> {

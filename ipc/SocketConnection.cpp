@@ -11,6 +11,7 @@
 #include <asio/error.hpp>
 #include <cerrno>
 #include <chrono>
+#include <condition_variable>
 #include <cstring>
 #include <limits>
 
@@ -254,7 +255,7 @@ SocketConnection::SocketConnection(Private, file::UniqueFd fd, PeerCredentials p
       fd_(fd.get()),
       peer_(std::move(peer)),
       entitlements_(std::move(entitlements)),
-      socket_(ioContext()),
+      socket_(socketContext()),
       readBuffer_(kReadChunk) {
   std::error_code ec;
   socket_.assign(asio::local::stream_protocol(), fd.get(), ec);
@@ -355,7 +356,8 @@ void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
 void SocketConnection::continueReading() {
   for (;;) {
     switch (processInput()) {
-      case InputState::Closed: return;
+      case InputState::Closed:
+      case InputState::HandedOff: return;
       case InputState::NeedMore:
         decoder_.releaseSpare();
         startRead();
@@ -412,8 +414,31 @@ SocketConnection::InputState SocketConnection::processInput() {
       protocolError(why);
       return InputState::Closed;
     }
+    if (onSocketThread() && !handledWithoutWaiting(*message)) {
+      // The rest of this turn goes to the pool; the socket thread goes back
+      // to the other connections. The queue runs it right after this turn.
+      auto waiting = std::make_shared<IncomingMessage>(std::move(*message));
+      queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this()), waiting] {
+        if (self->invalidated_) {
+          return;
+        }
+        self->deliver(std::move(*waiting));
+        self->continueReading();
+      });
+      return InputState::HandedOff;
+    }
     deliver(std::move(*message));
   }
+}
+
+bool SocketConnection::handledWithoutWaiting(const IncomingMessage& message) {
+  if (message.kind == IncomingMessage::Kind::Reply) {
+    std::lock_guard lock(callsMutex_);
+    const auto it = pending_.find(message.replyTo);
+    return it == pending_.end() || it->second.neverWaits;
+  }
+  std::lock_guard lock(stateMutex_);
+  return !exported_ || exported_->answersWithoutWaiting(message.call);
 }
 
 void SocketConnection::deliver(IncomingMessage message) {
@@ -423,7 +448,7 @@ void SocketConnection::deliver(IncomingMessage message) {
       std::lock_guard lock(callsMutex_);
       const auto it = pending_.find(message.replyTo);
       if (it != pending_.end()) {
-        handler = std::move(it->second);
+        handler = std::move(it->second.handler);
         pending_.erase(it);
       }
     }
@@ -680,12 +705,49 @@ void SocketConnection::send(const std::string& operation, Dictionary args) {
 }
 
 void SocketConnection::call(const std::string& operation, Dictionary args, ReplyHandler handler) {
+  startCall(operation, std::move(args), std::move(handler), false);
+}
+
+SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& operation, Dictionary args,
+                                                            std::chrono::milliseconds timeout) {
+  struct Waiter {
+    std::mutex mutex;
+    std::condition_variable done;
+    bool arrived = false;
+    WaitedReply reply;
+  };
+  auto waiter = std::make_shared<Waiter>();
+  startCall(
+      operation, std::move(args),
+      [waiter](std::optional<Dictionary> a, std::optional<Error> e) {
+        {
+          std::lock_guard lock(waiter->mutex);
+          waiter->arrived = true;
+          waiter->reply.args = std::move(a);
+          waiter->reply.error = std::move(e);
+        }
+        // After the lock: the woken caller does not block on it again. The
+        // handler's own reference keeps the waiter alive meanwhile.
+        waiter->done.notify_one();
+      },
+      true);
+  std::unique_lock lock(waiter->mutex);
+  if (!waiter->done.wait_for(lock, timeout, [&] { return waiter->arrived; })) {
+    WaitedReply late;
+    late.timedOut = true;
+    return late;
+  }
+  return std::move(waiter->reply);
+}
+
+void SocketConnection::startCall(const std::string& operation, Dictionary args, ReplyHandler handler,
+                                 bool neverWaits) {
   std::uint64_t number = 0;
   {
     std::lock_guard lock(callsMutex_);
     if (!callsClosed_) {
       number = nextCall_++;
-      pending_.emplace(number, std::move(handler));
+      pending_.emplace(number, PendingCall{std::move(handler), neverWaits});
     }
   }
   if (number == 0) {
@@ -722,14 +784,14 @@ void SocketConnection::beginInvalidation() {
 void SocketConnection::finishInvalidation() {
   std::error_code ignored;
   socket_.close(ignored);
-  std::unordered_map<std::uint64_t, ReplyHandler> pending;
+  std::unordered_map<std::uint64_t, PendingCall> pending;
   {
     std::lock_guard lock(callsMutex_);
     callsClosed_ = true;
     pending.swap(pending_);
   }
-  for (auto& [number, handler] : pending) {
-    handler(std::nullopt, goneError());
+  for (auto& [number, call] : pending) {
+    call.handler(std::nullopt, goneError());
   }
   std::function<void()> handler;
   std::shared_ptr<ExportedObject> exported;

@@ -2,11 +2,15 @@
 
 // The Connection over a Unix-domain stream socket.
 //
-// Reading: one read is outstanding at a time; each chunk is decoded and its
-// messages delivered in a turn of the connection's serial queue (on the
-// thread that read it when the queue is free, so without a hand-off), and the
-// next read starts only once that is done, so a peer that floods the socket
-// waits for its earlier calls to be handled instead of filling memory.
+// Reading: one read is outstanding at a time, on one of the socket threads
+// (socketContext()); each chunk is decoded and its messages delivered in a
+// turn of the connection's serial queue (on the socket thread when the queue
+// is free, so without a hand-off), and the next read starts only once that
+// is done, so a peer that floods the socket waits for its earlier calls to be
+// handled instead of filling memory. A call that may wait (see
+// ExportedObject::answersWithoutWaiting), or a reply whose handler may, is
+// handed with the rest of the chunk to a thread of the queue's pool: the
+// socket thread serves other connections too.
 //
 // Writing: whole frames, from any thread, in the order the calls were made.
 // A frame is written straight from the calling thread when the socket takes
@@ -30,6 +34,7 @@
 // A standard header first: asio decides between aligned_alloc and operator
 // new by a libstdc++ macro, and every translation unit must decide alike.
 #include <atomic>
+#include <chrono>
 #include <deque>
 #include <filesystem>
 #include <mutex>
@@ -97,6 +102,15 @@ class SocketConnection final : public Connection {
   void send(const std::string& operation, Dictionary args) override;
   void call(const std::string& operation, Dictionary args, ReplyHandler handler) override;
 
+  // Calls `operation` and waits for its reply, up to `timeout`. Not from a
+  // block of this connection's queue (the reply arrives in one).
+  struct WaitedReply {
+    std::optional<Dictionary> args;  // set when answered
+    std::optional<Error> error;      // the peer's error, or the connection's end
+    bool timedOut = false;
+  };
+  WaitedReply callAndWait(const std::string& operation, Dictionary args, std::chrono::milliseconds timeout);
+
   const PeerCredentials& peer() const override { return peer_; }
   Value valueForEntitlement(const std::string& entitlement) const override;
   const SerialQueue& queue() const override { return queue_; }
@@ -118,7 +132,15 @@ class SocketConnection final : public Connection {
 
  private:
   friend struct QueueRegistry;
-  enum class InputState { NeedMore, Paused, Closed };
+  enum class InputState { NeedMore, Paused, Closed, HandedOff };
+  struct PendingCall {
+    ReplyHandler handler;
+    bool neverWaits = false;  // the handler may run on a socket thread
+  };
+
+  void startCall(const std::string& operation, Dictionary args, ReplyHandler handler, bool neverWaits);
+  // On a socket thread: may this message be handled here?
+  bool handledWithoutWaiting(const IncomingMessage& message);
 
   void startRead();
   void onRead(const std::error_code& ec, std::size_t size);
@@ -181,7 +203,7 @@ class SocketConnection final : public Connection {
   std::mutex callsMutex_;
   std::uint64_t nextCall_ = 1;
   bool callsClosed_ = false;
-  std::unordered_map<std::uint64_t, ReplyHandler> pending_;
+  std::unordered_map<std::uint64_t, PendingCall> pending_;
 };
 
 }  // namespace zerith::ipc

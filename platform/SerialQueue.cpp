@@ -79,6 +79,40 @@ struct CurrentScope {
 
 asio::io_context& ioContext(Pool pool) { return threadPool(pool).context; }
 
+namespace {
+
+thread_local bool tSocketThread = false;
+
+struct SocketThreads {
+  std::vector<std::unique_ptr<asio::io_context>> contexts;
+  std::atomic<unsigned> next{0};
+
+  SocketThreads() {
+    const unsigned count = std::clamp(std::thread::hardware_concurrency(), 2u, 4u);
+    for (unsigned i = 0; i < count; ++i) {
+      // A hint of one: the scheduler never wakes another thread for the
+      // reactor, and no other thread ever runs this context.
+      contexts.push_back(std::make_unique<asio::io_context>(1));
+      asio::io_context* context = contexts.back().get();
+      std::thread([context] {
+        tSocketThread = true;
+        auto work = asio::make_work_guard(*context);
+        context->run();
+      }).detach();
+    }
+  }
+};
+
+}  // namespace
+
+asio::io_context& socketContext() {
+  // Leaked on purpose, as the pools are.
+  static SocketThreads* threads = new SocketThreads();
+  return *threads->contexts[threads->next.fetch_add(1) % threads->contexts.size()];
+}
+
+bool onSocketThread() { return tSocketThread; }
+
 struct SerialQueue::State : std::enable_shared_from_this<SerialQueue::State> {
   struct Ticket {
     bool granted = false;

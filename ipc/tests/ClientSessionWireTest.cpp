@@ -150,7 +150,7 @@ TEST(ClientSessionWire, FailedCallsCompleteWithNilFalseAndTheError) {
   EXPECT_EQ(flush.second, (Error{kErrorDomain, -1, "The connection was invalidated"}));
   EXPECT_FALSE(wait(f3));
   // The session answering late, after its client is gone, harms nothing.
-  for (auto& late : link.session->takeHeld()) {
+  for (auto& late : link.session->takeHeld(3)) {
     late();
   }
 }
@@ -162,7 +162,7 @@ TEST(ClientSessionWire, ACompletionCalledLaterFromAnotherThreadStillReachesTheCl
   link.proxy.fetchDisplayURL([&](Value v) { url.set_value(v); });
   ASSERT_TRUE(link.session->log.waitFor(1));
   std::thread([&] {
-    for (auto& late : link.session->takeHeld()) {
+    for (auto& late : link.session->takeHeld(1)) {
       late();
     }
   }).join();

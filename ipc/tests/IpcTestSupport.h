@@ -56,6 +56,10 @@ class RecordingObject : public ExportedObject {
     r->send(m.args);
   };
   std::function<void()> onCall;  // runs after each recorded call
+  // Which calls may be handled on the socket thread (default: none).
+  std::function<bool(const Message&)> quick;
+
+  bool answersWithoutWaiting(const Message& message) const override { return quick && quick(message); }
 
   void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override {
     {

@@ -5,6 +5,7 @@
 // ClientSessionReplyInterface that records the daemon's messages. Used by the
 // IPC and client-framework tests and the connection fuzz target.
 
+#include <chrono>
 #include <condition_variable>
 #include <functional>
 #include <mutex>
@@ -64,8 +65,11 @@ class RecordingSession : public ClientSessionInterface {
 
   CallLog log;
 
-  std::vector<std::function<void()>> takeHeld() {
-    std::lock_guard lock(heldMutex_);
+  // The held completions, once at least `atLeast` are (a call is logged
+  // before its completion is held, so a test that saw the log waits here).
+  std::vector<std::function<void()>> takeHeld(std::size_t atLeast = 0) {
+    std::unique_lock lock(heldMutex_);
+    heldChanged_.wait_for(lock, std::chrono::seconds(10), [&] { return held_.size() >= atLeast; });
     return std::exchange(held_, {});
   }
 
@@ -132,10 +136,12 @@ class RecordingSession : public ClientSessionInterface {
     } else {
       std::lock_guard lock(heldMutex_);
       held_.push_back(std::move(run));
+      heldChanged_.notify_all();
     }
   }
 
   std::mutex heldMutex_;
+  std::condition_variable heldChanged_;
   std::vector<std::function<void()>> held_;
 };
 

@@ -4,9 +4,11 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <future>
 #include <thread>
 
 #include "ipc/tests/IpcTestSupport.h"
+#include "platform/Executors.h"
 #include "platform/Log.h"
 
 namespace zerith::ipc::test {
@@ -451,6 +453,96 @@ TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHand
     EXPECT_TRUE(weak.expired()) << "the connection still holds its exported object";
   }
   EXPECT_EQ(handlerSawObject.count(), 1);
+}
+
+// ---- the socket threads ------------------------------------------------------------
+
+TEST(SocketConnectionSocketThreads, ACallThatMayWaitLeavesTheSocketThreadsToTheOtherConnections) {
+  // More connections than socket threads: some share the blocked one's.
+  constexpr std::size_t kPeers = 9;
+  std::vector<std::unique_ptr<RawPeer>> peers;
+  for (std::size_t i = 0; i < kPeers; ++i) {
+    peers.push_back(std::make_unique<RawPeer>());
+  }
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  Counter blocked;
+  std::atomic<bool> blockedOnSocketThread{false};
+  peers[0]->object->answer = [&](const Message&, std::shared_ptr<Reply> r) {
+    blockedOnSocketThread = onSocketThread();
+    blocked.hit();
+    released.wait_for(kWait);
+    r->send(Dictionary{{"late", true}});
+  };
+  std::atomic<int> quickOffSocketThread{0};
+  for (std::size_t i = 1; i < kPeers; ++i) {
+    peers[i]->object->quick = [](const Message&) { return true; };
+    peers[i]->object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
+      if (!onSocketThread()) {
+        ++quickOffSocketThread;
+      }
+      r->send(m.args);
+    };
+  }
+  peers[0]->write(callFrame("upload", 1));
+  ASSERT_TRUE(blocked.waitFor(1));
+  for (std::size_t i = 1; i < kPeers; ++i) {
+    peers[i]->write(callFrame("quick", 7, Dictionary{{"i", static_cast<std::int64_t>(i)}}));
+  }
+  for (std::size_t i = 1; i < kPeers; ++i) {
+    const auto reply = peers[i]->readMessage();
+    ASSERT_TRUE(reply) << "connection " << i << " got no answer while another one's call waited";
+    EXPECT_EQ(reply->replyTo, 7u);
+    EXPECT_EQ(reply->replyArgs.get("i").intValue(), static_cast<std::int64_t>(i));
+  }
+  release.set_value();
+  const auto late = peers[0]->readMessage();
+  ASSERT_TRUE(late);
+  EXPECT_EQ(late->replyTo, 1u);
+  EXPECT_FALSE(blockedOnSocketThread) << "a call that may wait ran on a socket thread";
+  EXPECT_EQ(quickOffSocketThread, 0) << "calls that never wait were handed to the pool although the queue was free";
+}
+
+TEST(SocketConnectionSocketThreads, CallsThatMayWaitAndCallsThatNeverWaitStayInOrderOneAtATime) {
+  RawPeer peer;
+  std::atomic<int> inside{0};
+  std::atomic<bool> overlapped{false};
+  std::atomic<bool> offQueue{false};
+  peer.object->quick = [](const Message& m) { return m.operation.back() != '0'; };
+  peer.object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
+    if (++inside > 1) {
+      overlapped = true;
+    }
+    if (!peer.connection->queue().isCurrent()) {
+      offQueue = true;
+    }
+    if (m.operation.back() == '0') {
+      std::this_thread::sleep_for(1ms);  // a call that waits a little
+    }
+    --inside;
+    r->send(Dictionary{{"op", m.operation}});
+  };
+  constexpr int kCalls = 300;
+  Data all;
+  for (int n = 0; n < kCalls; ++n) {
+    const Data f = callFrame("n" + std::to_string(n), static_cast<std::uint64_t>(n + 1));
+    all.insert(all.end(), f.begin(), f.end());
+  }
+  std::thread writer([&] { peer.write(all, 1000); });
+  for (int n = 0; n < kCalls; ++n) {
+    const auto reply = peer.readMessage();
+    ASSERT_TRUE(reply) << "reply " << n << " missing";
+    EXPECT_EQ(reply->replyTo, static_cast<std::uint64_t>(n + 1));
+    EXPECT_EQ(reply->replyArgs.get("op"), Value("n" + std::to_string(n)));
+  }
+  writer.join();
+  const auto calls = peer.object->calls();
+  ASSERT_EQ(calls.size(), static_cast<std::size_t>(kCalls));
+  for (int n = 0; n < kCalls; ++n) {
+    EXPECT_EQ(calls[static_cast<std::size_t>(n)].operation, "n" + std::to_string(n));
+  }
+  EXPECT_FALSE(overlapped);
+  EXPECT_FALSE(offQueue);
 }
 
 // ---- identity ---------------------------------------------------------------------
