@@ -2,6 +2,8 @@
 #include <zlib.h>
 
 #include <string>
+#include <thread>
+#include <vector>
 
 #include "config/Compression.h"
 #include "platform/Crypto.h"
@@ -70,6 +72,63 @@ TEST(CompressionTest, GzipAndZlibHeadersAndRoundTrips) {
   }
   // Text this repetitive must shrink a lot.
   EXPECT_LT(compressDataWithZlibOrGzip(true, bytes(text))->size(), text.size() / 20);
+}
+
+// Streams are kept, reset, for later calls: a stream that compressed a
+// large input, of the other format, or on another thread at the same time,
+// must leave nothing behind that changes the next output. A fresh zlib
+// stream at the same settings is the reference for the exact bytes.
+Data freshDeflate(bool gzip, const Data& input) {
+  z_stream s{};
+  EXPECT_EQ(deflateInit2(&s, Z_DEFAULT_COMPRESSION, Z_DEFLATED, gzip ? 31 : 15, 8, Z_DEFAULT_STRATEGY), Z_OK);
+  Data out(deflateBound(&s, static_cast<uLong>(input.size())));
+  s.next_in = const_cast<Bytef*>(input.data());
+  s.avail_in = static_cast<uInt>(input.size());
+  s.next_out = out.data();
+  s.avail_out = static_cast<uInt>(out.size());
+  EXPECT_EQ(deflate(&s, Z_FINISH), Z_STREAM_END);
+  out.resize(s.total_out);
+  deflateEnd(&s);
+  return out;
+}
+
+TEST(CompressionTest, KeptStreamsGiveTheBytesOfAFreshStreamWhateverRanBefore) {
+  Data random(300000);
+  crypto::randomBytes(random);
+  std::string text;
+  for (int i = 0; i < 500; ++i) {
+    text += R"({"_sender":"YJ","_method":)" + std::to_string(i) + "},";
+  }
+  const std::vector<Data> inputs{random, bytes(text), bytes("a"), bytes(text.substr(0, 700))};
+  for (int round = 0; round < 3; ++round) {
+    for (const Data& input : inputs) {
+      for (const bool gzip : {true, false}) {
+        const auto out = compressDataWithZlibOrGzip(gzip, input);
+        ASSERT_TRUE(out);
+        EXPECT_EQ(*out, freshDeflate(gzip, input)) << (gzip ? "gzip" : "zlib") << " of " << input.size() << " bytes";
+      }
+    }
+  }
+  // More threads than streams kept: each gets a stream of its own, and
+  // every output is still exact.
+  std::vector<std::thread> threads;
+  std::vector<int> wrong(6, 0);
+  for (int t = 0; t < 6; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < 20; ++i) {
+        const Data& input = inputs[static_cast<std::size_t>((t + i) % 4)];
+        const bool gzip = (t + i) % 2 == 0;
+        const auto out = compressDataWithZlibOrGzip(gzip, input);
+        if (!out || *out != freshDeflate(gzip, input)) {
+          ++wrong[static_cast<std::size_t>(t)];
+        }
+      }
+    });
+  }
+  for (auto& thread : threads) {
+    thread.join();
+  }
+  EXPECT_EQ(wrong, std::vector<int>(6, 0));
 }
 
 TEST(CompressionTest, OneByteGrowsAndTheDebugLineReportsBothSizes) {

@@ -12,6 +12,7 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <set>
 
 #include "transport/tests/TransportTestSupport.h"
 
@@ -105,6 +106,34 @@ TEST_F(URLSessionTest, CallbacksArriveInWireOrderAndInvalidationComesLast) {
   ASSERT_TRUE(task->response());
   EXPECT_EQ(task->response()->valueForHTTPHeaderField("x-reply"), "yes");
   EXPECT_FALSE(session->hasDelegate());  // released once invalid
+}
+
+// Twenty posts at once to one server that holds its answers: at most six
+// connections open, the other posts wait for one of them and then go out on
+// it, so twenty requests arrive over no more than six connections (without
+// the bound every post opened a connection and paid a TLS handshake).
+TEST_F(URLSessionTest, PostsToOneServerShareAtMostSixKeptConnections) {
+  HttpsTestServer keeping(TestCA::shared(), {.keepAlive = true});
+  keeping.on("/post", Reply{.status = 204});
+  keeping.holdAnswers();
+  auto session = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+  constexpr std::size_t kPosts = 20;
+  for (std::size_t i = 0; i < kPosts; ++i) {
+    session->dataTaskWithRequest(post(keeping.url("/post"), "body " + std::to_string(i)))->resume();
+  }
+  // The first six are on the wire, each on its own connection.
+  ASSERT_TRUE(keeping.waitForRequests(6));
+  keeping.releaseAnswers();
+  ASSERT_TRUE(events->waitForCount("complete", kPosts));
+  const auto requests = keeping.requests();
+  ASSERT_EQ(requests.size(), kPosts);
+  std::set<int> connections;
+  for (const auto& request : requests) {
+    connections.insert(request.remotePort);
+  }
+  EXPECT_LE(connections.size(), 6u);
+  session->finishTasksAndInvalidate();
+  ASSERT_TRUE(events->waitFor("invalid"));
 }
 
 TEST_F(URLSessionTest, RequestHeadersOnTheWireAreExactlyTheCallersPlusTheSessionsOwn) {
