@@ -7,6 +7,7 @@
 #include <systemd/sd-daemon.h>
 
 #include <asio/local/stream_protocol.hpp>
+#include <atomic>
 #include <cerrno>
 #include <cstring>
 #include <mutex>
@@ -66,7 +67,8 @@ class SocketListener final : public Listener {
     Listener* owner = nullptr;
     ListenerDelegate* delegate = nullptr;
     bool resumed = false;
-    bool stopped = false;
+    // Set under `mutex`; the accept loop on `queue` reads it without.
+    std::atomic<bool> stopped{false};
 
     void arm() {
       if (stopped) {

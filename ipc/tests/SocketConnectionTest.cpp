@@ -239,6 +239,68 @@ TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
   pair.b->queue().sync([] {});  // the answering turn has finished with the locals
 }
 
+TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOwnReply) {
+  // Replies are taken on the socket threads while the callers wait; calls
+  // that never wait are answered on the socket thread, the others on the
+  // pool, so replies of one connection come back from both.
+  constexpr int kPairs = 3;
+  constexpr int kThreads = 6;
+  constexpr int kCalls = 150;
+  std::vector<std::unique_ptr<ConnectedPair>> pairs;
+  for (int p = 0; p < kPairs; ++p) {
+    pairs.push_back(std::make_unique<ConnectedPair>());
+    auto object = std::make_shared<RecordingObject>();
+    object->quick = [](const Message& m) { return m.args.get("n").intValue() % 3 != 0; };
+    pairs.back()->b->setExportedObject(object);
+    pairs.back()->a->resume();
+    pairs.back()->b->resume();
+  }
+  std::atomic<int> matched{0};
+  std::atomic<int> wrong{0};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int n = 0; n < kCalls; ++n) {
+        auto& pair = *pairs[static_cast<std::size_t>((t + n) % kPairs)];
+        const auto reply = pair.a->callAndWait("work", Dictionary{{"caller", t}, {"n", n}}, kWait);
+        if (reply.args && reply.args->get("caller").intValue() == t && reply.args->get("n").intValue() == n) {
+          ++matched;
+        } else {
+          ++wrong;
+        }
+      }
+    });
+  }
+  for (auto& th : threads) {
+    th.join();
+  }
+  EXPECT_EQ(matched, kThreads * kCalls);
+  EXPECT_EQ(wrong, 0);
+}
+
+TEST(SocketConnectionCalls, AWaitedCallEndsWithTheConnectionOrAtItsTimeOut) {
+  ConnectedPair pair;
+  auto object = std::make_shared<RecordingObject>();
+  object->answer = [](const Message&, std::shared_ptr<Reply>) {};  // never answers
+  pair.b->setExportedObject(object);
+  pair.a->resume();
+  pair.b->resume();
+  const auto late = pair.a->callAndWait("silence", Dictionary{}, 100ms);
+  EXPECT_TRUE(late.timedOut);
+  EXPECT_FALSE(late.args);
+
+  std::thread closer([&] {
+    object->received.waitFor(2);
+    pair.b->invalidate();
+  });
+  const auto gone = pair.a->callAndWait("silence", Dictionary{}, kWait);
+  closer.join();
+  EXPECT_FALSE(gone.timedOut);
+  EXPECT_FALSE(gone.args);
+  ASSERT_TRUE(gone.error);
+  EXPECT_EQ(gone.error->description, "The connection was invalidated");
+}
+
 TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
   RawPeer peer;
   constexpr int kThreads = 6;
