@@ -168,17 +168,15 @@ std::optional<nlohmann::ordered_json> wireValue(const std::string& key, const Va
 
 // A post that failed (no answer, or a 5xx): the spool keeps its batch when
 // it is on, otherwise the batch is gone and counted so.
-void postFailed(const std::weak_ptr<ZerithBackend>& weak, const std::shared_ptr<const URLRequest>& kept,
+void postFailed(const std::shared_ptr<BackendCounters>& counters, const std::shared_ptr<const URLRequest>& kept,
                 std::uint32_t records) {
   if (kept) {
     if (auto spool = Spool::shared()) {
-      spool->keep(*kept, records, weak);
+      spool->keep(*kept, records, counters);
       return;
     }
   }
-  if (auto self = weak.lock()) {
-    self->counters().add(BackendCount::droppedTransportError, records);
-  }
+  counters->add(BackendCount::droppedTransportError, records);
 }
 
 }  // namespace
@@ -622,24 +620,25 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
   // With the spool on, the request is kept for the answer: a failure hands
   // it to the spool as it was sent.
   std::shared_ptr<const URLRequest> kept = f.spoolEnabled ? std::make_shared<const URLRequest>(request) : nullptr;
+  // The answer is counted even when it comes after the session has ended:
+  // the agent's totals of ended sessions read the same counters.
+  std::shared_ptr<BackendCounters> counts = sharedCounters();
   transport->postURLRequestWithCompletionHandler(
-      request, [weak, backendName, completion, records, kept](const Data&, const std::optional<HTTPURLResponse>& response,
-                                                              const std::optional<Error>& error) {
+      request, [weak, counts, backendName, completion, records, kept](
+                   const Data&, const std::optional<HTTPURLResponse>& response, const std::optional<Error>& error) {
         if (error) {
           backendsLogger().error("HTTPSPostBackend(postJsonMessage): post error: {}", error->description);
         }
         const bool serverError = response && response->statusCode >= 500 && response->statusCode <= 599;
         if (error || serverError) {
-          postFailed(weak, kept, records);
+          postFailed(counts, kept, records);
         } else if (response && response->statusCode >= 200 && response->statusCode <= 299) {
-          if (auto self = weak.lock()) {
-            self->counters().add(BackendCount::delivered, records);
-          }
+          counts->add(BackendCount::delivered, records);
           if (Spool* spool = Spool::current()) {
             spool->collectorAnswered();
           }
-        } else if (auto self = weak.lock()) {
-          self->counters().add(BackendCount::droppedTransportError, records);
+        } else {
+          counts->add(BackendCount::droppedTransportError, records);
         }
         if (serverError) {
           const std::string text =

@@ -666,10 +666,10 @@ void Spool::start() {
   });
 }
 
-void Spool::keep(URLRequest request, std::uint32_t records, std::weak_ptr<ZerithBackend> backend,
+void Spool::keep(URLRequest request, std::uint32_t records, std::shared_ptr<BackendCounters> counters,
                  std::function<void(bool kept)> done) {
   std::weak_ptr<Spool> weak = weak_from_this();
-  queue_.async([weak, request = std::move(request), records, backend = std::move(backend), done = std::move(done)] {
+  queue_.async([weak, request = std::move(request), records, backend = std::move(counters), done = std::move(done)] {
     auto self = weak.lock();
     if (!self) {
       return;
@@ -677,8 +677,8 @@ void Spool::keep(URLRequest request, std::uint32_t records, std::weak_ptr<Zerith
     bool kept = false;
     const auto countBoth = [&](BackendCount what, std::uint64_t n) {
       self->counters_.add(what, n);
-      if (auto owner = backend.lock()) {
-        owner->counters().add(what, n);
+      if (backend) {
+        backend->add(what, n);
       }
     };
     if (!self->store_) {
@@ -764,8 +764,8 @@ void Spool::countDrops(const std::vector<SpoolStore::Dropped>& dropped) {
 void Spool::countOn(const std::string& name, BackendCount what, std::uint64_t n) {
   counters_.add(what, n);
   if (auto it = owners_.find(name); it != owners_.end()) {
-    if (auto owner = it->second.lock()) {
-      owner->counters().add(what, n);
+    if (it->second) {
+      it->second->add(what, n);
     }
   }
 }

@@ -229,9 +229,11 @@ class Spool : public std::enable_shared_from_this<Spool> {
         std::shared_ptr<ReportingSessionConnectivityInterface> transport);
 
   // Keeps a failed post's request (written on the spool's queue) and counts
-  // it, on `backend` too while that lives. `done` (optional) runs on the
-  // spool's queue once the batch is written or dropped.
-  void keep(URLRequest request, std::uint32_t records, std::weak_ptr<ZerithBackend> backend,
+  // it, on the posting backend's `counters` too (when given) until the batch
+  // is delivered or dropped, whether or not the backend still lives. `done`
+  // (optional) runs on the spool's queue once the batch is written or
+  // dropped.
+  void keep(URLRequest request, std::uint32_t records, std::shared_ptr<BackendCounters> counters,
             std::function<void(bool kept)> done = nullptr);
   // A collector answered a live post with 2xx: a waiting retry goes now.
   void collectorAnswered();
@@ -270,7 +272,7 @@ class Spool : public std::enable_shared_from_this<Spool> {
   SerialQueue::Timer timer_;
   double backoffSeconds_ = 0;  // 0: the next failure waits the initial delay
   std::uint64_t droppedRecords_ = 0;
-  std::map<std::string, std::weak_ptr<ZerithBackend>> owners_;
+  std::map<std::string, std::shared_ptr<BackendCounters>> owners_;  // a batch's backend's counts
   std::mt19937_64 random_;
   std::atomic<bool> hasBacklog_{false};
 };

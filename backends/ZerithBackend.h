@@ -124,6 +124,9 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   // (the agent's totals of ended sessions: completions count on after the
   // session's end).
   std::shared_ptr<const BackendCounters> sharedCounters() const { return counters_; }
+  // The same block for what counts on after the backend has gone (a post's
+  // answer, a spooled batch's delivery).
+  std::shared_ptr<BackendCounters> sharedCounters() { return counters_; }
 
   // Properties; every accessor is atomic.
   const std::string& name() const { return name_; }

@@ -14,9 +14,13 @@
 #include <map>
 #include <set>
 
+#include <sstream>
+
 #include "config/StorebagSigner.h"
+#include "ipc/DaemonStatus.h"
 #include "tests/e2e/E2eFixture.h"
 #include "tests/support/CollectorProcess.h"
+#include "tools/zerith/ZerithCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -193,6 +197,41 @@ TEST_F(HTTPSSpoolTest, EventsSentWhileTheCollectorClosesStallsAndFailsArriveOnce
   ASSERT_TRUE(daemon->waitFor("Spool: empty")) << daemon->output();
   EXPECT_EQ(daemon->count("Spool: delivered batch"), 3u);
   client->finishSession(10s);
+}
+
+TEST_F(HTTPSSpoolTest, BatchesKeptAfterTheirSessionEndedCountInTheEndedTotals) {
+  startAll(spoolOn());
+  auto client = startSession(505);
+  ASSERT_TRUE(client);
+  behave("close");
+  sendBatch(*client, 1, 5);
+  ASSERT_TRUE(daemon->waitFor("Spool: kept batch", 1)) << daemon->output();
+  // The final report's batch fails too, and its answer comes when the
+  // session and its backend may be gone.
+  client->finishSession(10s);
+  client.reset();
+  ASSERT_TRUE(daemon->waitFor("Spool: kept batch", 2)) << daemon->output();
+  behave("answer");
+  ASSERT_TRUE(daemon->waitFor("Spool: empty")) << daemon->output();
+
+  const Value policy(Dictionary{
+      {"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
+      {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", true}, {ipc::kDaemonStatusEntitlement, true}})}});
+  root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
+  const std::string rootPath = root.path().string();
+  std::vector<const char*> argv = {"zerith", "--root", rootPath.c_str(), "status", "--json"};
+  std::ostringstream out;
+  std::ostringstream err;
+  ASSERT_EQ(cli::run(static_cast<int>(argv.size()), argv.data(), out, err), 0) << err.str();
+  const auto status = Json::parse(out.str());
+  ASSERT_EQ(status["ended"].size(), 1u) << out.str();
+  const auto& counts = status["ended"][0]["counts"];
+  // Both kept batches (the five events and the final report), each posted
+  // again and delivered; the start record went through at once.
+  EXPECT_GE(counts.value("spooled", 0), 6) << out.str();
+  EXPECT_EQ(counts.value("delivered", 0), counts.value("spooled", 0) + 1) << out.str();
+  EXPECT_EQ(counts.value("retried", 0), counts.value("spooled", 0)) << out.str();
+  EXPECT_EQ(counts.value("droppedTransportError", 0), 0) << out.str();
 }
 
 TEST_F(HTTPSSpoolTest, SpooledBatchesSurviveAKillAndBadFilesAreMovedAside) {
