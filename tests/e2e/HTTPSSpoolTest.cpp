@@ -278,7 +278,6 @@ TEST_F(HTTPSSpoolTest, SpooledBatchesSurviveAKillAndBadFilesAreMovedAside) {
 
   behave("answer");
   daemon.reset();
-  fs::remove(root.path() / "notify.sock");  // the killed daemon's, still bound
   startDaemon(daemonOptions());
   ASSERT_TRUE(daemon->waitFor("Spool: empty", 1, 20s)) << daemon->output();
 

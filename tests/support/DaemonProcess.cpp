@@ -79,6 +79,8 @@ void DaemonProcess::start(const TempRoot& root, const Options& options) {
   wakeWrite_.reset(wake[1]);
 
   notifyPath_ = root.path() / "notify.sock";
+  // A daemon killed in this root earlier leaves its notify socket bound.
+  std::filesystem::remove(notifyPath_);
   notifySocket_.reset(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
   sockaddr_un addr{};
   addr.sun_family = AF_UNIX;
