@@ -34,9 +34,6 @@ class BackendCountsTest : public E2eTest {
 
   void startAll() {
     entitle(false);
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
-    root.write("/usr/share/zerith/publicKey.der", std::string(keys->publicKeyDER.begin(), keys->publicKeyDER.end()));
     const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     collector = std::make_unique<CollectorProcess>(
@@ -61,16 +58,8 @@ class BackendCountsTest : public E2eTest {
     const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{Value(posting)}}}},
                                    {"httpsPost2", Dictionary{{"clients", Array{Value(sampled)}}}}});
     const Value bag(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
-    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
-    fs::create_directories(www / "zerith");
-    file::writeAtomically(www / "zerith/dravon", *container, fs::perms(0644));
-    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(collector->url("/zerith")));
-
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", (certs / "ca.pem").string()};
-    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-    startDaemon(options);
+    publishSignedStorebag(bag, www, collector->url("/zerith"));
+    startDaemon(collectorDaemonOptions(certs));
   }
 
   struct Run {
@@ -102,14 +91,9 @@ class BackendCountsTest : public E2eTest {
 TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
   startAll();
   {
-    auto client = Zerith::connect();
-    ASSERT_TRUE(client);
-    const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(515)},
-                                {kZerithSessionInfoClientType, Value(7)},
-                                {kZerithSessionInfoRequireUserInfo, Value(true)}});
-    const Value user(Dictionary{{kZerithUserInfoClientName, "demo"}, {kZerithUserInfoServiceName, "cli"}});
-    ASSERT_TRUE(client->setSessionInfo(info, user, Value(), false, 10s));
-    const auto started = client->startConfig(20s);
+    ZerithReply started;
+    auto client = startDemoSession(515, &started);
+    ASSERT_TRUE(client) << daemon->output();
     ASSERT_TRUE(started) << daemon->output();
     EXPECT_EQ(started["backends"], Value(Array{Value("httpsPost"), Value("httpsPost2")})) << daemon->output();
     for (const int category : {3, 5, 6}) {  // posted, not whitelisted, blacklisted

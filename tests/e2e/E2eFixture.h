@@ -13,10 +13,12 @@
 
 #include <chrono>
 #include <cstring>
+#include <filesystem>
 #include <memory>
 #include <optional>
 #include <string>
 
+#include "config/StorebagSigner.h"
 #include "ipc/Frame.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
@@ -24,6 +26,7 @@
 #include "platform/PropertyList.h"
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/TempRoot.h"
+#include "zerith/Zerith.h"
 
 namespace zerith::test {
 
@@ -133,6 +136,52 @@ class E2eTest : public ::testing::Test {
   // The storebag signing key the daemon verifies with.
   void installPublicKey(const Data& der) {
     root.write("/usr/share/zerith/publicKey.der", std::string(der.begin(), der.end()));
+  }
+
+  // Signs `bag` with a fresh key pair whose public half the daemon trusts,
+  // writes it where a collector serving `www` hands out the storebag
+  // "dravon", and points the daemon's storebag URL at `storebagURL`.
+  void publishSignedStorebag(const Value& bag, const std::filesystem::path& www, const std::string& storebagURL) {
+    const auto keys = generateStorebagKeyPair(2048);
+    ASSERT_TRUE(keys.has_value());
+    installPublicKey(keys->publicKeyDER);
+    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
+    ASSERT_TRUE(container.has_value());
+    std::filesystem::create_directories(www / "zerith");
+    ASSERT_TRUE(file::writeAtomically(www / "zerith/dravon", *container, std::filesystem::perms(0644)));
+    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(storebagURL));
+  }
+
+  // A session of client type 7 that requires user info and gives the one
+  // the collector tests' storebags admit ("demo", "cli"), so that the whole
+  // storebag check runs (consent, locale, filters, sampling); `started`
+  // (when given) receives the start's answer.
+  std::unique_ptr<Zerith> startDemoSession(std::uint32_t sessionID, ZerithReply* started = nullptr) {
+    auto client = Zerith::connect();
+    EXPECT_TRUE(client);
+    if (!client) {
+      return nullptr;
+    }
+    const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)},
+                                {kZerithSessionInfoClientType, Value(7)},
+                                {kZerithSessionInfoRequireUserInfo, Value(true)}});
+    const Value user(Dictionary{{kZerithUserInfoClientName, "demo"}, {kZerithUserInfoServiceName, "cli"}});
+    EXPECT_TRUE(client->setSessionInfo(info, user, Value(), false, std::chrono::seconds(10)));
+    ZerithReply answer = client->startConfig(std::chrono::seconds(20));
+    EXPECT_TRUE(answer);
+    if (started) {
+      *started = std::move(answer);
+    }
+    return client;
+  }
+
+  // A daemon that trusts the CA a collector made in `certs` and reads its
+  // locale as British (the collector tests' storebags admit only GB).
+  static DaemonProcess::Options collectorDaemonOptions(const std::filesystem::path& certs) {
+    DaemonProcess::Options options;
+    options.arguments = {"--stop-timeout", "5", "--ca-file", (certs / "ca.pem").string()};
+    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
+    return options;
   }
 
   DaemonProcess& startDaemon(DaemonProcess::Options options = {}) {

@@ -24,9 +24,6 @@ class HTTPSCollectorTest : public E2eTest {
   // the daemon trusting its CA.
   void startAll(int status) {
     grant(Value(true));
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
-    installPublicKey(keys->publicKeyDER);
     const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     collector = std::make_unique<CollectorProcess>(
@@ -43,37 +40,17 @@ class HTTPSCollectorTest : public E2eTest {
                                   {"post_url", collector->url("/post")}});
     const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{client}}}}});
     const Value bag(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
-    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
-    fs::create_directories(www / "zerith");
-    file::writeAtomically(www / "zerith/dravon", *container, fs::perms(0644));
-    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(collector->url("/zerith")));
-
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", (certs / "ca.pem").string()};
-    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-    startDaemon(options);
+    publishSignedStorebag(bag, www, collector->url("/zerith"));
+    startDaemon(collectorDaemonOptions(certs));
   }
 
   // `expectPosting`: the start reply names the HTTPS backend. A collector
   // that refuses may disable the backend with its answer to the session's
   // start record before the reply lists the backends.
   std::unique_ptr<Zerith> startSession(std::uint32_t sessionID, bool expectPosting = true) {
-    auto client = Zerith::connect();
-    EXPECT_TRUE(client);
-    if (!client) {
-      return nullptr;
-    }
-    // User info required: the whole storebag check runs (consent, locale,
-    // filters, sampling).
-    const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)},
-                                {kZerithSessionInfoClientType, Value(7)},
-                                {kZerithSessionInfoRequireUserInfo, Value(true)}});
-    const Value user(Dictionary{{kZerithUserInfoClientName, "demo"}, {kZerithUserInfoServiceName, "cli"}});
-    EXPECT_TRUE(client->setSessionInfo(info, user, Value(), false, 10s));
-    const auto started = client->startConfig(20s);
-    EXPECT_TRUE(started);
-    if (expectPosting) {
+    ZerithReply started;
+    auto client = startDemoSession(sessionID, &started);
+    if (client && expectPosting) {
       EXPECT_EQ(started["backends"], Value(Array{Value("httpsPost")})) << daemon->output();
     }
     return client;

@@ -36,9 +36,6 @@ class HTTPSSpoolTest : public E2eTest {
     for (const auto& [key, value] : spoolKeys) {
       Defaults("com.velmar.zerith").setObject(key, value);
     }
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
-    root.write("/usr/share/zerith/publicKey.der", std::string(keys->publicKeyDER.begin(), keys->publicKeyDER.end()));
     const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     behaviourFile = root.path() / "collector/behaviour";
@@ -61,21 +58,11 @@ class HTTPSSpoolTest : public E2eTest {
                                   {"post_url", collector->url("/post")}});
     const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{client}}}}});
     const Value bag(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
-    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
-    fs::create_directories(www / "zerith");
-    file::writeAtomically(www / "zerith/dravon", *container, fs::perms(0644));
-    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(collector->url("/zerith")));
+    publishSignedStorebag(bag, www, collector->url("/zerith"));
     startDaemon(daemonOptions());
   }
 
-  DaemonProcess::Options daemonOptions() const {
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file",
-                         (root.path() / "collector/certs/ca.pem").string()};
-    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-    return options;
-  }
+  DaemonProcess::Options daemonOptions() const { return collectorDaemonOptions(root.path() / "collector/certs"); }
 
   static Dictionary spoolOn() {
     return Dictionary{{"spoolEnabled", true}, {"spoolRetryInitialSeconds", 0.2}, {"spoolRetryMaxSeconds", 1.0}};
@@ -87,18 +74,11 @@ class HTTPSSpoolTest : public E2eTest {
   }
 
   std::unique_ptr<Zerith> startSession(std::uint32_t sessionID) {
-    auto client = Zerith::connect();
-    EXPECT_TRUE(client);
+    ZerithReply started;
+    auto client = startDemoSession(sessionID, &started);
     if (!client) {
       return nullptr;
     }
-    const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)},
-                                {kZerithSessionInfoClientType, Value(7)},
-                                {kZerithSessionInfoRequireUserInfo, Value(true)}});
-    const Value user(Dictionary{{kZerithUserInfoClientName, "demo"}, {kZerithUserInfoServiceName, "cli"}});
-    EXPECT_TRUE(client->setSessionInfo(info, user, Value(), false, 10s));
-    const auto started = client->startConfig(20s);
-    EXPECT_TRUE(started);
     EXPECT_EQ(started["backends"], Value(Array{Value("httpsPost")})) << daemon->output();
     // The session's start record goes out while the collector answers, so
     // that every later batch holds only the test's events.
