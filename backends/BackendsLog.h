@@ -7,8 +7,9 @@
 namespace zerith {
 
 inline const log::Logger& backendsLogger() {
-  static const log::Logger logger("backends");
-  return logger;
+  // Never destroyed: pool threads may still log while the process exits.
+  static const auto* logger = new log::Logger("backends");
+  return *logger;
 }
 
 }  // namespace zerith

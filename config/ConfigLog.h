@@ -7,8 +7,9 @@
 namespace zerith {
 
 inline const log::Logger& configLogger() {
-  static const log::Logger logger("config");
-  return logger;
+  // Never destroyed: pool threads may still log while the process exits.
+  static const auto* logger = new log::Logger("config");
+  return *logger;
 }
 
 }  // namespace zerith

@@ -18,8 +18,9 @@ namespace zerith {
 namespace {
 
 const log::Logger& logger() {
-  static const log::Logger l("daemon");
-  return l;
+  // Never destroyed: pool threads may still log while the process exits.
+  static const auto* l = new log::Logger("daemon");
+  return *l;
 }
 
 constexpr const char* kStorebagData = "StorebagData";

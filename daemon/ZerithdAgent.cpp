@@ -20,8 +20,9 @@ namespace zerith {
 namespace {
 
 const log::Logger& logger() {
-  static const log::Logger l("daemon");
-  return l;
+  // Never destroyed: pool threads may still log while the process exits.
+  static const auto* l = new log::Logger("daemon");
+  return *l;
 }
 
 constexpr std::string_view kEntitlement = "com.velmar.private.zerithd";

@@ -34,8 +34,9 @@ namespace zerith {
 namespace {
 
 const log::Logger& logger() {
-  static const log::Logger l("daemon");
-  return l;
+  // Never destroyed: pool threads may still log while the process exits.
+  static const auto* l = new log::Logger("daemon");
+  return *l;
 }
 
 // From linux/ioprio.h, which older kernels' headers lack.

@@ -21,8 +21,9 @@ namespace zerith {
 namespace {
 
 const log::Logger& logger() {
-  static const log::Logger l("defaults");
-  return l;
+  // Never destroyed: pool threads may still log while the process exits.
+  static const auto* l = new log::Logger("defaults");
+  return *l;
 }
 
 struct FileIdentity {

@@ -26,8 +26,9 @@ namespace zerith {
 namespace {
 
 const log::Logger& logger() {
-  static const log::Logger l("session");
-  return l;
+  // Never destroyed: pool threads may still log while the process exits.
+  static const auto* l = new log::Logger("session");
+  return *l;
 }
 
 constexpr char kNoBackends[] = "No backends available to send message";
