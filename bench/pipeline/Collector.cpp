@@ -69,20 +69,24 @@ void Collector::countLine(const std::string& line) {
     bool any = false;
     const bool readable = forEachEventId(line, [&](std::uint64_t id) {
       any = true;
-      if (id >= seen_.size()) {
-        ++counts_.unexpected;
-      } else if (seen_[id]) {
-        ++counts_.duplicates;
-      } else {
-        seen_[id] = true;
-        ++counts_.records;
-      }
+      noteEventId(id);
     });
     // Lines without an identifier are the sessions' own records (start and
     // end messages) or envelopes without events; a refused request counts.
     counts_.malformed += (!readable || (!any && line.find("\"kind\":\"refused\"") != std::string::npos)) ? 1 : 0;
   }
   changed_.notify_all();
+}
+
+void Collector::noteEventId(std::uint64_t id) {
+  if (id >= seen_.size()) {
+    ++counts_.unexpected;
+  } else if (seen_[id]) {
+    ++counts_.duplicates;
+  } else {
+    seen_[id] = true;
+    ++counts_.records;
+  }
 }
 
 void Collector::expect(std::uint64_t ids) {
@@ -102,16 +106,7 @@ void Collector::count(std::string_view body, bool gzip) {
     ++counts_.posts;
     counts_.gzipPosts += gzip ? 1 : 0;
     counts_.inflatedBytes += body.size();
-    const bool readable = forEachEventId(body, [&](std::uint64_t id) {
-      if (id >= seen_.size()) {
-        ++counts_.unexpected;
-      } else if (seen_[id]) {
-        ++counts_.duplicates;
-      } else {
-        seen_[id] = true;
-        ++counts_.records;
-      }
-    });
+    const bool readable = forEachEventId(body, [&](std::uint64_t id) { noteEventId(id); });
     counts_.malformed += readable ? 0 : 1;
   }
   changed_.notify_all();

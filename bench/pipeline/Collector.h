@@ -93,6 +93,8 @@ class Collector {
 
  private:
   void count(std::string_view body, bool gzip);
+  // Marks one event identifier as seen; under mutex_.
+  void noteEventId(std::uint64_t id);
   void countLine(const std::string& line);
 
   mutable std::mutex mutex_;

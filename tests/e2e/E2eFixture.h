@@ -25,6 +25,7 @@
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
 #include "tests/support/DaemonProcess.h"
+#include "tests/support/HttpsTestServer.h"
 #include "tests/support/TempRoot.h"
 #include "zerith/Zerith.h"
 
@@ -173,6 +174,20 @@ class E2eTest : public ::testing::Test {
       *started = std::move(answer);
     }
     return client;
+  }
+
+  // The same for a test server: it answers "/zerith/dravon" with the signed
+  // `bag` (cacheable for ten minutes), and the daemon asks it for storebags.
+  void serveSignedStorebag(HttpsTestServer& server, const Value& bag) {
+    const auto keys = generateStorebagKeyPair(2048);
+    ASSERT_TRUE(keys.has_value());
+    installPublicKey(keys->publicKeyDER);
+    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
+    ASSERT_TRUE(container.has_value());
+    server.on("/zerith/dravon", {.status = 200,
+                                 .headers = {{"Cache-Control", "max-age=600"}},
+                                 .body = std::string(container->begin(), container->end())});
+    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
   }
 
   // A daemon that trusts the CA a collector made in `certs` and reads its

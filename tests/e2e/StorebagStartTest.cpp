@@ -21,17 +21,9 @@ class StorebagStartTest : public E2eTest {
  protected:
   void SetUp() override {
     grant(Value(true));
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
-    installPublicKey(keys->publicKeyDER);
     const Value bag(Dictionary{{"version", Value("5.2.0")},
                                {"seed", Value(Dictionary{{"kovu", Value(Dictionary{{"active", Value(true)}})}})}});
-    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
-    server.on("/zerith/dravon", {.status = 200,
-                                 .headers = {{"Cache-Control", "max-age=600"}},
-                                 .body = std::string(container->begin(), container->end())});
-    Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
+    serveSignedStorebag(server, bag);
   }
 
   DaemonProcess& start(bool trustTestCA) {
