@@ -157,16 +157,7 @@ struct Daemon {
   std::unique_ptr<Zerith> client;
 
   Daemon() {
-    if (!std::getenv("ZERITHD_BINARY")) {
-      ::setenv("ZERITHD_BINARY", ZERITHD_BUILT_BINARY, 1);
-    }
-    const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
-                                  {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", Value(true)}})}});
-    root.write("/etc/zerithd/entitlements.d/bench.plist", plist::encodeXml(policy));
-    test::DaemonProcess::Options options;
-    options.debug = false;
-    options.arguments = {"--stop-timeout", "5"};
-    process = std::make_unique<test::DaemonProcess>(root, options);
+    process = test::startEntitledDaemon(root, ZERITHD_BUILT_BINARY);
     if (process->ready()) {
       client = Zerith::connect();
     }

@@ -16,6 +16,8 @@
 #include <stdexcept>
 
 #include "platform/Paths.h"
+#include "platform/PropertyList.h"
+#include "platform/Value.h"
 #include "tests/support/TempRoot.h"
 
 extern char** environ;
@@ -321,6 +323,19 @@ std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout)
 std::optional<int> DaemonProcess::stop(std::chrono::milliseconds timeout) {
   signal(SIGTERM);
   return waitForExit(timeout);
+}
+
+std::unique_ptr<DaemonProcess> startEntitledDaemon(TempRoot& root, const char* builtBinary) {
+  if (!std::getenv("ZERITHD_BINARY")) {
+    ::setenv("ZERITHD_BINARY", builtBinary, 1);
+  }
+  const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
+                                {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", Value(true)}})}});
+  root.write("/etc/zerithd/entitlements.d/bench.plist", plist::encodeXml(policy));
+  DaemonProcess::Options options;
+  options.debug = false;
+  options.arguments = {"--stop-timeout", "5"};
+  return std::make_unique<DaemonProcess>(root, options);
 }
 
 file::UniqueFd connectToDaemonSocket() {

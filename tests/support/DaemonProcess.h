@@ -11,6 +11,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <filesystem>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -99,6 +100,13 @@ class DaemonProcess {
   std::vector<std::string> notifications_;
   bool ready_ = false;
 };
+
+class TempRoot;
+
+// A quiet daemon (no debug log, a 5 s stop timeout) in `root`, whose
+// entitlements policy lets the current user open sessions: the benchmarks'
+// daemon. ZERITHD_BINARY, when unset, becomes `builtBinary`.
+std::unique_ptr<DaemonProcess> startEntitledDaemon(TempRoot& root, const char* builtBinary);
 
 // A bare client socket connected to the daemon's listener (the socket path
 // of the current root), for tests that speak the wire protocol themselves;
