@@ -159,8 +159,31 @@ void BM_FrameEncodeDecode(benchmark::State& state) {
   state.SetItemsProcessed(state.iterations());
 }
 
+// The reply of an accepted event (no arguments): as the daemon writes it,
+// beside the same reply written by libplist (the reference).
+void BM_EmptyReply(benchmark::State& state) {
+  std::uint64_t call = 1;
+  for (auto _ : state) {
+    const Data frame = encodeReply(++call, Dictionary{});
+    benchmark::DoNotOptimize(frame.data());
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
+void BM_EmptyReplyByLibplist(benchmark::State& state) {
+  std::uint64_t call = 1;
+  for (auto _ : state) {
+    const Data frame =
+        encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(++call))}, {"args", Dictionary{}}}));
+    benchmark::DoNotOptimize(frame.data());
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
 }  // namespace
 
+BENCHMARK(BM_EmptyReply)->Unit(benchmark::kMicrosecond);
+BENCHMARK(BM_EmptyReplyByLibplist)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_FrameEncodeDecode)->Arg(64)->Arg(1024)->Arg(16384)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_IpcRoundTrip)->Arg(64)->Arg(1024)->Arg(16384)->UseRealTime()->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_BareUnixEcho)->Arg(64)->Arg(1024)->Arg(16384)->UseRealTime()->Unit(benchmark::kMicrosecond);

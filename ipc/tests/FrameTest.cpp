@@ -2,7 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <climits>
 #include <random>
+#include <vector>
 
 namespace zerith::ipc {
 namespace {
@@ -54,6 +56,38 @@ TEST(FrameCodec, CallsAndRepliesSurviveTheRoundTrip) {
   EXPECT_EQ(m2->replyArgs, args);
   EXPECT_FALSE(m2->replyError);
   EXPECT_EQ(m3->replyError, (Error{"dom", -3, "why"}));
+}
+
+TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
+  // Empty replies are copied from one encoding with the number set in eight
+  // bytes; every number must read back as itself, and a number that needs all
+  // eight bytes must come out exactly as libplist writes it.
+  const std::uint64_t wide = 0x1234567890abcdefull;
+  EXPECT_EQ(encodeReply(wide, Dictionary{}),
+            encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(wide))}, {"args", Dictionary{}}})));
+  FrameDecoder decoder;
+  const std::vector<std::uint64_t> numbers{0,           1,           255,        256,     65535, 65536, 0xffffffffull,
+                                           1ull << 32,  1ull << 40,  wide,       static_cast<std::uint64_t>(INT64_MAX)};
+  for (const std::uint64_t n : numbers) {
+    const Data frame = encodeReply(n, Dictionary{});
+    decoder.append(frame.data(), frame.size());
+  }
+  const auto bodies = drain(decoder);
+  ASSERT_EQ(bodies.size(), numbers.size());
+  for (std::size_t i = 0; i < numbers.size(); ++i) {
+    std::string why;
+    const auto m = decodeMessage(plist::bytesOf(bodies[i]), &why);
+    ASSERT_TRUE(m) << numbers[i] << ": " << why;
+    EXPECT_EQ(m->kind, IncomingMessage::Kind::Reply);
+    EXPECT_EQ(m->replyTo, numbers[i]);
+    EXPECT_TRUE(m->replyArgs.empty());
+    EXPECT_FALSE(m->replyError);
+  }
+  // Replies with arguments are still written whole.
+  const Data frame = encodeReply(7, Dictionary{{"result", "r"}});
+  const auto withArgs = decodeMessage(plist::Bytes(frame.data() + 4, frame.size() - 4));
+  ASSERT_TRUE(withArgs);
+  EXPECT_EQ(withArgs->replyArgs, (Dictionary{{"result", "r"}}));
 }
 
 TEST(FrameCodec, DatesBeyondThirtyTwoBitSecondsAreClampedNotOverflowed) {
