@@ -10,6 +10,7 @@
 // codec's share (a round trip encodes and decodes two frames).
 
 #include <benchmark/benchmark.h>
+#include <plist/plist.h>
 #include <sys/socket.h>
 
 #include <algorithm>
@@ -18,6 +19,7 @@
 #include <thread>
 #include <vector>
 
+#include "bench/pipeline/BenchEvent.h"
 #include "ipc/Frame.h"
 #include "ipc/SocketConnection.h"
 
@@ -159,6 +161,42 @@ void BM_FrameEncodeDecode(benchmark::State& state) {
   state.SetItemsProcessed(state.iterations());
 }
 
+// The call frame of one event as the client framework sends it: the
+// end-to-end benchmark's ten-key event.
+Data eventCallFrame() {
+  const Dictionary message{{"category", Value(static_cast<long long>(bench::kEventCategory))},
+                           {"type", Value(static_cast<long long>(bench::kEventType))},
+                           {"payload", bench::eventPayload(12345)}};
+  return encodeCall("sendMessageWithDictionary:reply:", 77, Dictionary{{"message", Value(message)}});
+}
+
+// libplist alone: the event's frame body parsed into libplist's tree and
+// freed, without the structural check or the value tree (the share of a
+// frame's decode that the library itself takes).
+void BM_ReferenceLibplistParseOfAnEvent(benchmark::State& state) {
+  const Data frame = eventCallFrame();
+  const char* body = reinterpret_cast<const char*>(frame.data() + kFrameHeaderBytes);
+  const auto length = static_cast<std::uint32_t>(frame.size() - kFrameHeaderBytes);
+  for (auto _ : state) {
+    plist_t tree = nullptr;
+    plist_from_bin(body, length, &tree);
+    benchmark::DoNotOptimize(tree);
+    plist_free(tree);
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
+// The daemon's side of the same frame: decoded only (structural check,
+// libplist, value tree).
+void BM_FrameDecodeOfAnEvent(benchmark::State& state) {
+  const Data frame = eventCallFrame();
+  for (auto _ : state) {
+    auto message = decodeMessage(plist::Bytes(frame.data() + kFrameHeaderBytes, frame.size() - kFrameHeaderBytes));
+    benchmark::DoNotOptimize(message);
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
 // The reply of an accepted event (no arguments): as the daemon writes it,
 // beside the same reply written by libplist (the reference).
 void BM_EmptyReply(benchmark::State& state) {
@@ -184,6 +222,8 @@ void BM_EmptyReplyByLibplist(benchmark::State& state) {
 
 BENCHMARK(BM_EmptyReply)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_EmptyReplyByLibplist)->Unit(benchmark::kMicrosecond);
+BENCHMARK(BM_FrameDecodeOfAnEvent)->Unit(benchmark::kMicrosecond);
+BENCHMARK(BM_ReferenceLibplistParseOfAnEvent)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_FrameEncodeDecode)->Arg(64)->Arg(1024)->Arg(16384)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_IpcRoundTrip)->Arg(64)->Arg(1024)->Arg(16384)->UseRealTime()->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_BareUnixEcho)->Arg(64)->Arg(1024)->Arg(16384)->UseRealTime()->Unit(benchmark::kMicrosecond);
