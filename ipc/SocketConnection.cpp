@@ -358,6 +358,14 @@ void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
   }
 }
 
+bool SocketConnection::outboxHoldsReading(std::size_t waiting) const {
+  // A client end reads on whatever it has to write: what it reads are the
+  // daemon's replies, and a daemon that waits for the client to read them
+  // before it reads on would never drain the client's outbox. Its writers
+  // are held back instead (waitForRoom).
+  return !clientEnd_ && waiting >= gPauseReadingAt.load();
+}
+
 void SocketConnection::continueReading() {
   for (;;) {
     cork();
@@ -384,7 +392,7 @@ void SocketConnection::continueReading() {
       }
       waiting = outboxBytes_;
       unanswered = callsInFlight_.load();
-      hold = waiting >= gPauseReadingAt.load() || unanswered >= gCallsInFlight.load();
+      hold = outboxHoldsReading(waiting) || unanswered >= gCallsInFlight.load();
       if (hold) {
         // onWritable or callAnswered reads on once the peer has caught up.
         readPaused_ = true;
@@ -393,7 +401,7 @@ void SocketConnection::continueReading() {
       }
     }
     if (hold) {
-      if (waiting >= gPauseReadingAt.load()) {
+      if (outboxHoldsReading(waiting)) {
         log_.debug("{}: peer does not read its replies ({} bytes waiting); reading paused", description(), waiting);
       } else {
         log_.debug("{}: {} calls wait for their answers; reading paused", description(), unanswered);
@@ -409,7 +417,7 @@ SocketConnection::InputState SocketConnection::processInput() {
     if (invalidated_) {
       return InputState::Closed;
     }
-    if (queued_.load() >= gPauseReadingAt.load() || callsInFlight_.load() >= gCallsInFlight.load()) {
+    if (outboxHoldsReading(queued_.load()) || callsInFlight_.load() >= gCallsInFlight.load()) {
       return InputState::Paused;
     }
     plist::Bytes body;
@@ -755,7 +763,7 @@ void SocketConnection::onWritable(const std::error_code& ec) {
 
 // Called with writeMutex_ held: ends a pause once the peer has caught up.
 bool SocketConnection::mayReadOn() {
-  if (!readPaused_ || writeClosed_ || outboxBytes_ >= gResumeReadingAt.load() ||
+  if (!readPaused_ || writeClosed_ || (!clientEnd_ && outboxBytes_ >= gResumeReadingAt.load()) ||
       callsInFlight_.load() >= std::max<std::size_t>(gCallsInFlight.load() / 2, 1)) {
     return false;
   }

@@ -37,7 +37,8 @@
 // the replies is throttled, not buffered. Once its outbox holds
 // pauseReadingAt bytes the connection delivers no further call and stops
 // reading its socket (the peer's writes then block in the kernel) until the
-// outbox has drained below resumeReadingAt. Calls that are taken but not
+// outbox has drained below resumeReadingAt (on the daemon's ends: a client
+// end reads its replies on, see below). Calls that are taken but not
 // answered yet count too: at callsInFlight of them the connection takes no
 // further call until half are answered. An outbox over perConnection
 // (kMaxOutboxBytes) still means the peer has stopped reading; the connection
@@ -164,6 +165,9 @@ class SocketConnection final : public Connection {
   // Delivers buffered frames and reads on, unless the outbox holds the
   // reading back.
   void continueReading();
+  // Do `waiting` bytes in the outbox hold the reading back? Only on the
+  // daemon's ends.
+  bool outboxHoldsReading(std::size_t waiting) const;
   InputState processInput();
   void deliver(IncomingMessage message);
   void readFailed(const std::error_code& ec);

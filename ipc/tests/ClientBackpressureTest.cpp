@@ -175,6 +175,30 @@ TEST_F(ClientBackpressure, ABlockOfTheConnectionsQueueNeverWaits) {
   ASSERT_TRUE(end.invalidated.waitFor(1));
 }
 
+TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
+  // A daemon that waits for its replies to be read before it reads on, and a
+  // client that would read them only once its own outbox drained, would wait
+  // for each other for ever.
+  log::LogCapture capture;
+  ClientEnd end;
+  ASSERT_TRUE(end.connection);
+  Counter answered;
+  for (int n = 0; n < 3; ++n) {
+    end.connection->call("ask", Dictionary{{"n", n}}, [&](std::optional<Dictionary> args, std::optional<Error>) {
+      EXPECT_TRUE(args);
+      answered.hit();
+    });
+  }
+  EventWriter writer(*end.connection, 1500);
+  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  const Data replies = concat({encodeReply(1, Dictionary{}), encodeReply(2, Dictionary{}), encodeReply(3, Dictionary{})});
+  ASSERT_EQ(::send(end.raw.get(), replies.data(), replies.size(), MSG_NOSIGNAL), static_cast<ssize_t>(replies.size()));
+  EXPECT_TRUE(answered.waitFor(3)) << "the client stopped reading because its own outbox was full";
+  EXPECT_FALSE(end.connection->readingPaused());
+  end.connection->invalidate();
+  ASSERT_TRUE(end.invalidated.waitFor(1));
+}
+
 // How a waiting writer is released: the client ends the connection, or the
 // daemon goes away.
 class ClientBackpressureRelease : public ClientBackpressure, public ::testing::WithParamInterface<bool> {};
