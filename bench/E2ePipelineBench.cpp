@@ -19,6 +19,7 @@
 //
 //   e2e_pipeline_bench --clients 8 --events 200000
 //   e2e_pipeline_bench --clients 8 --events 30000 --rate 1000
+//   e2e_pipeline_bench --clients 8 --events 200000 --replies none   (one-way events)
 //   e2e_pipeline_bench --events 1000000 --memory-sample 10000
 //   e2e_pipeline_bench --smoke --events 3000        (exit 1 unless lossless)
 //   e2e_pipeline_bench --pipelines zerithd --events 1000000 --spool-outage --memory-sample 0
@@ -359,11 +360,11 @@ std::string kib(const std::optional<ProcSample>& s, std::uint64_t ProcSample::*f
 }
 
 void print(const Settings& s, const std::vector<Report>& reports) {
-  std::printf("clients=%d events=%llu rate=%s window=%d collector=%s\n", s.load.clients,
+  std::printf("clients=%d events=%llu rate=%s window=%d replies=%s collector=%s\n", s.load.clients,
               static_cast<unsigned long long>(s.events),
               s.load.eventsPerSecond > 0 ? std::to_string(static_cast<long long>(s.load.eventsPerSecond)).c_str()
                                          : "max",
-              s.load.window, s.collector.c_str());
+              s.load.window, s.load.replies ? "each" : "none", s.collector.c_str());
   std::printf(
       "| pipeline | accepted/s | delivered/s | CPU µs/event | peak RSS KiB | private KiB @%llu | private KiB @end | "
       "posts | gzip | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|---|\n",
@@ -431,6 +432,10 @@ int main(int argc, char** argv) {
   app.add_option("--events", s.events, "events in all (split evenly over the clients)");
   app.add_option("--rate", s.load.eventsPerSecond, "paced total events per second (0: as fast as taken)");
   app.add_option("--window", s.load.window, "unanswered events per zerithd client")->check(CLI::Range(1, 100000));
+  std::string replies = "each";
+  app.add_option("--replies", replies,
+                 "zerithd clients: each (every event asks for a reply) or none (one-way events, one flush at the end)")
+      ->check(CLI::IsMember({"each", "none"}));
   app.add_option("--memory-sample", s.memorySample, "also sample memory after this many delivered events");
   app.add_option("--idle-seconds", s.idleSeconds, "measure the idle process with open sessions this long first");
   app.add_option("--idle-sessions", s.idleSessions, "sessions held open while idle");
@@ -440,6 +445,7 @@ int main(int argc, char** argv) {
                "also run zerithd with the spool on and the collector down while sending, then up");
   app.add_flag("--smoke", s.smoke, "exit 1 unless every pipeline delivered every event exactly once");
   CLI11_PARSE(app, argc, argv);
+  s.load.replies = replies == "each";
 
   if (s.spoolOutage && s.collector != "zerith-collector") {
     std::fprintf(stderr, "--spool-outage needs --collector zerith-collector (the one that can go down)\n");

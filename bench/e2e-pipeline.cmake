@@ -19,5 +19,10 @@ if(TARGET zerith_testsupport)
     add_test(NAME e2e_pipeline_smoke
       COMMAND e2e_pipeline_bench --smoke --clients 2 --events 3000 --memory-sample 0)
     set_tests_properties(e2e_pipeline_smoke PROPERTIES TIMEOUT 180)
+    # The same with one-way events (no reply per event, one flush at the end).
+    add_test(NAME e2e_pipeline_smoke_oneway
+      COMMAND e2e_pipeline_bench --smoke --pipelines zerithd --clients 2 --events 3000 --memory-sample 0
+              --replies none)
+    set_tests_properties(e2e_pipeline_smoke_oneway PROPERTIES TIMEOUT 180)
   endif()
 endif()

@@ -5,7 +5,8 @@
 #   bench/run-e2e.sh [build-dir]        (default build/release)
 #
 # Loads: 1 and 8 clients as fast as taken; 8 clients paced at 100 and 1,000
-# events/s; one run of 1,000,000 events with a memory sample after 10,000;
+# events/s; 8 clients unpaced and at 1,000 events/s again with one-way events
+# (--replies none); one run of 1,000,000 events with a memory sample after 10,000;
 # the idle processes with ten open sessions for a minute; zerithd with the
 # spool on and the collector down for 1,000,000 events, then up (backlog
 # spooled and drained). Every run checks
@@ -30,6 +31,10 @@ run --clients 1 --events $((200000 / scale))
 run --clients 8 --events $((200000 / scale))
 run --clients 8 --events $((3000 / scale)) --rate 100 --memory-sample 0
 run --clients 8 --events $((30000 / scale)) --rate 1000 --memory-sample 0
+# The same two loads with one-way events: no reply per event, one flush per
+# client at the end (the framework's backpressure paces the senders).
+run --clients 8 --events $((200000 / scale)) --replies none
+run --clients 8 --events $((30000 / scale)) --rate 1000 --memory-sample 0 --replies none
 run --clients 8 --events $((1000000 / scale)) --memory-sample 10000
 run --clients 1 --events 1000 --memory-sample 0 --idle-seconds "$idle" --idle-sessions 10
 # The spool: a backlog of 1,000,000 events built while the collector is down,

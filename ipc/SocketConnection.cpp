@@ -1,6 +1,7 @@
 #include "ipc/SocketConnection.h"
 
 #include <sys/socket.h>
+#include <sys/uio.h>
 #include <sys/un.h>
 
 #if defined(__GLIBC__)
@@ -22,6 +23,8 @@ namespace zerith::ipc {
 namespace {
 
 constexpr std::size_t kReadChunk = 64u << 10;
+// Frames handed to the kernel in one sendmsg.
+constexpr std::size_t kFramesPerWrite = 64;
 
 std::string errnoText(int err) { return std::error_code(err, std::generic_category()).message(); }
 
@@ -247,7 +250,9 @@ std::shared_ptr<SocketConnection> SocketConnection::connect(const std::filesyste
   if (!peer) {
     return fail("Cannot identify the listener at " + p + ": " + why);
   }
-  return adopt(std::move(fd), std::move(*peer), Dictionary());
+  auto connection = adopt(std::move(fd), std::move(*peer), Dictionary());
+  connection->clientEnd_ = true;
+  return connection;
 }
 
 SocketConnection::SocketConnection(Private, file::UniqueFd fd, PeerCredentials peer, Dictionary entitlements)
@@ -353,9 +358,22 @@ void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
   }
 }
 
+bool SocketConnection::outboxHoldsReading(std::size_t waiting) const {
+  // A client end reads on whatever it has to write: what it reads are the
+  // daemon's replies, and a daemon that waits for the client to read them
+  // before it reads on would never drain the client's outbox. Its writers
+  // are held back instead (waitForRoom).
+  return !clientEnd_ && waiting >= gPauseReadingAt.load();
+}
+
 void SocketConnection::continueReading() {
   for (;;) {
-    switch (processInput()) {
+    cork();
+    const InputState state = processInput();
+    // The chunk's replies leave before the next read and before the outbox
+    // is weighed for a pause.
+    uncork();
+    switch (state) {
       case InputState::Closed:
       case InputState::HandedOff: return;
       case InputState::NeedMore:
@@ -374,7 +392,7 @@ void SocketConnection::continueReading() {
       }
       waiting = outboxBytes_;
       unanswered = callsInFlight_.load();
-      hold = waiting >= gPauseReadingAt.load() || unanswered >= gCallsInFlight.load();
+      hold = outboxHoldsReading(waiting) || unanswered >= gCallsInFlight.load();
       if (hold) {
         // onWritable or callAnswered reads on once the peer has caught up.
         readPaused_ = true;
@@ -383,7 +401,7 @@ void SocketConnection::continueReading() {
       }
     }
     if (hold) {
-      if (waiting >= gPauseReadingAt.load()) {
+      if (outboxHoldsReading(waiting)) {
         log_.debug("{}: peer does not read its replies ({} bytes waiting); reading paused", description(), waiting);
       } else {
         log_.debug("{}: {} calls wait for their answers; reading paused", description(), unanswered);
@@ -399,7 +417,7 @@ SocketConnection::InputState SocketConnection::processInput() {
     if (invalidated_) {
       return InputState::Closed;
     }
-    if (queued_.load() >= gPauseReadingAt.load() || callsInFlight_.load() >= gCallsInFlight.load()) {
+    if (outboxHoldsReading(queued_.load()) || callsInFlight_.load() >= gCallsInFlight.load()) {
       return InputState::Paused;
     }
     plist::Bytes body;
@@ -414,9 +432,14 @@ SocketConnection::InputState SocketConnection::processInput() {
       protocolError(why);
       return InputState::Closed;
     }
-    if (onSocketThread() && !handledWithoutWaiting(*message)) {
+    if (handledWithoutWaiting(*message)) {
+      deliver(std::move(*message));
+      continue;
+    }
+    if (onSocketThread()) {
       // The rest of this turn goes to the pool; the socket thread goes back
       // to the other connections. The queue runs it right after this turn.
+      // The message that may wait is delivered there uncorked.
       auto waiting = std::make_shared<IncomingMessage>(std::move(*message));
       queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this()), waiting] {
         if (self->invalidated_) {
@@ -427,7 +450,11 @@ SocketConnection::InputState SocketConnection::processInput() {
       });
       return InputState::HandedOff;
     }
+    // Already on the pool: what the chunk wrote so far leaves now, and no
+    // frame waits for this handler, which may take long.
+    uncork();
     deliver(std::move(*message));
+    cork();
   }
 }
 
@@ -522,11 +549,17 @@ bool SocketConnection::writeFrame(Data frame) {
   bool overflow = false;
   std::size_t limit = 0;
   {
-    std::lock_guard lock(writeMutex_);
+    std::unique_lock lock(writeMutex_);
     if (writeClosed_) {
       return false;
     }
-    if (outbox_.empty()) {
+    if (clientEnd_ && outboxBytes_ > gPauseReadingAt.load()) {
+      waitForRoom(lock);
+      if (writeClosed_) {
+        return false;
+      }
+    }
+    if (outbox_.empty() && !corked_) {
       std::size_t sent = 0;
       err = sendSome(frame.data(), frame.size(), sent);
       if (!err && sent < frame.size()) {
@@ -536,6 +569,8 @@ bool SocketConnection::writeFrame(Data frame) {
         armWritable();
       }
     } else {
+      // Behind frames that wait for the socket, or gathered for the write at
+      // the end of a delivery: either way it leaves after them.
       setOutboxBytes(outboxBytes_ + frame.size());
       outbox_.push_back(std::move(frame));
       limit = gPerConnection.load();
@@ -560,6 +595,96 @@ bool SocketConnection::writeFrame(Data frame) {
   return !isInvalidated();
 }
 
+void SocketConnection::waitForRoom(std::unique_lock<std::mutex>& lock) {
+  // The threads that drain the outbox must never wait for it: a socket
+  // thread writes it out, and a block of the queue holds the deliveries
+  // that end a gathering write.
+  if (onSocketThread() || queue_.isCurrent()) {
+    return;
+  }
+  log_.debug("{}: peer does not read ({} bytes waiting); the writer waits", description(), outboxBytes_);
+  ++drainWaiters_;
+  drained_.wait(lock, [this] { return writeClosed_ || outboxBytes_ < gResumeReadingAt.load(); });
+  --drainWaiters_;
+}
+
+void SocketConnection::cork() {
+  std::lock_guard lock(writeMutex_);
+  corked_ = true;
+}
+
+void SocketConnection::uncork() {
+  int err = 0;
+  {
+    std::lock_guard lock(writeMutex_);
+    corked_ = false;
+    // With a wait for the socket armed, onWritable drains the outbox.
+    if (writeClosed_ || outbox_.empty() || writeArmed_) {
+      return;
+    }
+    err = drainOutbox();
+    if (err) {
+      writeClosed_ = true;
+    } else if (!outbox_.empty()) {
+      armWritable();
+    }
+  }
+  if (err) {
+    writeFailed(err);
+  }
+}
+
+int SocketConnection::drainOutbox() {
+  std::size_t bytes = outboxBytes_;
+  int err = 0;
+  while (!outbox_.empty()) {
+    iovec parts[kFramesPerWrite];
+    std::size_t count = 0;
+    std::size_t offered = 0;
+    for (auto it = outbox_.begin(); it != outbox_.end() && count < kFramesPerWrite; ++it, ++count) {
+      const std::size_t skip = count == 0 ? outboxOffset_ : 0;
+      parts[count].iov_base = it->data() + skip;
+      parts[count].iov_len = it->size() - skip;
+      offered += it->size() - skip;
+    }
+    msghdr message{};
+    message.msg_iov = parts;
+    message.msg_iovlen = count;
+    const ssize_t n = ::sendmsg(fd_, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (n < 0 && errno == EINTR) {
+      continue;
+    }
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+      break;
+    }
+    if (n <= 0) {
+      err = n < 0 ? errno : EPIPE;
+      break;
+    }
+    auto taken = static_cast<std::size_t>(n);
+    bytes -= taken;
+    while (taken > 0) {
+      const std::size_t left = outbox_.front().size() - outboxOffset_;
+      if (taken < left) {
+        outboxOffset_ += taken;
+        break;
+      }
+      taken -= left;
+      outbox_.pop_front();
+      outboxOffset_ = 0;
+    }
+    if (static_cast<std::size_t>(n) < offered) {
+      break;  // the socket is full
+    }
+  }
+  setOutboxBytes(bytes);
+  if (outbox_.empty() && outboxWasLarge_) {
+    std::deque<Data>().swap(outbox_);
+    outboxWasLarge_ = false;
+  }
+  return err;
+}
+
 void SocketConnection::setOutboxBytes(std::size_t bytes) {
   auto& registry = QueueRegistry::get();
   if (bytes >= outboxBytes_) {
@@ -577,6 +702,9 @@ void SocketConnection::setOutboxBytes(std::size_t bytes) {
   }
   outboxBytes_ = bytes;
   queued_ = bytes;
+  if (drainWaiters_ > 0 && bytes < gResumeReadingAt.load()) {
+    drained_.notify_all();
+  }
 }
 
 void SocketConnection::closeOverGlobalLimit(std::size_t total, std::size_t limit) {
@@ -613,24 +741,7 @@ void SocketConnection::onWritable(const std::error_code& ec) {
     if (ec || writeClosed_) {
       return;
     }
-    std::size_t bytes = outboxBytes_;
-    while (!outbox_.empty()) {
-      Data& front = outbox_.front();
-      std::size_t sent = outboxOffset_;
-      err = sendSome(front.data(), front.size(), sent);
-      bytes -= sent - outboxOffset_;
-      outboxOffset_ = sent;
-      if (err || sent < front.size()) {
-        break;
-      }
-      outbox_.pop_front();
-      outboxOffset_ = 0;
-    }
-    setOutboxBytes(bytes);
-    if (outbox_.empty() && outboxWasLarge_) {
-      std::deque<Data>().swap(outbox_);
-      outboxWasLarge_ = false;
-    }
+    err = drainOutbox();
     if (err) {
       writeClosed_ = true;
     } else {
@@ -652,7 +763,7 @@ void SocketConnection::onWritable(const std::error_code& ec) {
 
 // Called with writeMutex_ held: ends a pause once the peer has caught up.
 bool SocketConnection::mayReadOn() {
-  if (!readPaused_ || writeClosed_ || outboxBytes_ >= gResumeReadingAt.load() ||
+  if (!readPaused_ || writeClosed_ || (!clientEnd_ && outboxBytes_ >= gResumeReadingAt.load()) ||
       callsInFlight_.load() >= std::max<std::size_t>(gCallsInFlight.load() / 2, 1)) {
     return false;
   }
@@ -771,6 +882,7 @@ void SocketConnection::beginInvalidation() {
     readPausedFlag_ = false;
     setOutboxBytes(0);
     std::deque<Data>().swap(outbox_);
+    drained_.notify_all();  // writers waiting for room return
     // Wakes the outstanding read; the descriptor itself is closed on the
     // queue, where every other socket operation starts.
     if (socketOpen_) {

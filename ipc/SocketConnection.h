@@ -15,13 +15,30 @@
 // Writing: whole frames, from any thread, in the order the calls were made.
 // A frame is written straight from the calling thread when the socket takes
 // it; what the socket does not take waits in an outbox that drains as the
-// peer reads.
+// peer reads. While the connection delivers the messages of one read chunk
+// that answer without waiting, the frames written meanwhile (their replies
+// above all, but also frames of other threads) are gathered in the outbox
+// and leave in one write when that stretch of delivery ends: one system call
+// and one wake-up of the peer per chunk instead of one per reply. Before a
+// message that may wait is delivered, what was gathered leaves, and nothing
+// is held while it runs.
+//
+// Backpressure on the client end (connections made by connect): a thread
+// that writes a frame while the outbox holds more than pauseReadingAt bytes
+// waits until it has drained below resumeReadingAt, as a blocking socket
+// write would, so that a client sending one-way messages faster than the
+// daemon reads is slowed down instead of reaching perConnection and losing
+// its connection. Socket threads and blocks of the connection's own queue
+// never wait (they are what drains it); their frames are queued. The end of
+// the connection releases a waiting writer at once. The daemon's end never
+// waits.
 //
 // Memory under a flood (QueueLimits): a peer that sends calls without reading
 // the replies is throttled, not buffered. Once its outbox holds
 // pauseReadingAt bytes the connection delivers no further call and stops
 // reading its socket (the peer's writes then block in the kernel) until the
-// outbox has drained below resumeReadingAt. Calls that are taken but not
+// outbox has drained below resumeReadingAt (on the daemon's ends: a client
+// end reads its replies on, see below). Calls that are taken but not
 // answered yet count too: at callsInFlight of them the connection takes no
 // further call until half are answered. An outbox over perConnection
 // (kMaxOutboxBytes) still means the peer has stopped reading; the connection
@@ -35,6 +52,7 @@
 // new by a libstdc++ macro, and every translation unit must decide alike.
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <deque>
 #include <filesystem>
 #include <mutex>
@@ -147,6 +165,9 @@ class SocketConnection final : public Connection {
   // Delivers buffered frames and reads on, unless the outbox holds the
   // reading back.
   void continueReading();
+  // Do `waiting` bytes in the outbox hold the reading back? Only on the
+  // daemon's ends.
+  bool outboxHoldsReading(std::size_t waiting) const;
   InputState processInput();
   void deliver(IncomingMessage message);
   void readFailed(const std::error_code& ec);
@@ -154,6 +175,16 @@ class SocketConnection final : public Connection {
 
   // Sends what the socket takes now; 0 or an errno.
   int sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent);
+  // Called with writeMutex_ held: writes as much of the outbox as the socket
+  // takes, several frames per system call; 0 or an errno.
+  int drainOutbox();
+  // Called with writeMutex_ held, on a client end over the mark: waits until
+  // the outbox has drained or the connection no longer writes.
+  void waitForRoom(std::unique_lock<std::mutex>& lock);
+  // Around a stretch of delivery whose messages answer without waiting:
+  // frames written meanwhile gather in the outbox and leave at uncork.
+  void cork();
+  void uncork();
   void armWritable();
   void onWritable(const std::error_code& ec);
   void writeFailed(int err);
@@ -194,6 +225,11 @@ class SocketConnection final : public Connection {
   bool writeArmed_ = false;
   bool writeClosed_ = false;
   bool readPaused_ = false;
+  bool corked_ = false;
+  // Writers waiting for the outbox to drain (client ends only).
+  std::condition_variable drained_;
+  std::size_t drainWaiters_ = 0;
+  bool clientEnd_ = false;  // made by connect; set before the connection is shared
   // Mirrors for the process-wide limit, read without writeMutex_.
   std::atomic<std::size_t> queued_{0};
   std::atomic<std::int64_t> waitingSince_{0};  // steady-clock ns since the outbox was last empty; 0 when empty

@@ -8,6 +8,7 @@
 #include <condition_variable>
 #include <cstring>
 #include <mutex>
+#include <optional>
 #include <thread>
 
 #include "bench/pipeline/BenchEvent.h"
@@ -68,9 +69,74 @@ LoadResult runClients(const LoadOptions& o, PerClient&& perClient) {
 
 }  // namespace
 
+namespace {
+
+// Sends a client's events one-way, then flushes its session and waits for the
+// flush's completion.
+std::string sendOneWay(const LoadOptions& o, Zerith& session, std::uint64_t first, const Pacer& pacer,
+                       std::atomic<std::uint64_t>& accepted, std::atomic<std::uint64_t>& refused) {
+  std::uint64_t sent = 0;
+  // The sends returned so far join the total however this client ends.
+  struct Tally {
+    std::uint64_t& sent;
+    std::atomic<std::uint64_t>& accepted;
+    ~Tally() { accepted.fetch_add(sent); }
+  } tally{sent, accepted};
+  for (std::uint64_t i = 0; i < o.eventsPerClient; ++i) {
+    pacer.wait(i);
+    if (!session.isValid()) {
+      return "the connection to zerithd was invalidated";
+    }
+    session.sendMessageWithDictionary(
+        Value(Dictionary{{kZerithMessageParametersCategory, Value(unsigned{kEventCategory})},
+                         {kZerithMessageParametersType, Value(unsigned{kEventType})},
+                         {kZerithMessageParametersPayload, eventPayload(first + i)}}),
+        nullptr);
+    ++sent;
+  }
+  // Shared with the completion, which may still run after a time-out.
+  struct Flush {
+    std::mutex mutex;
+    std::condition_variable done;
+    bool finished = false;
+    std::optional<std::string> error;
+  };
+  auto flush = std::make_shared<Flush>();
+  session.flushMessagesWithCompletion([flush](Value, std::optional<Error> error) {
+    std::lock_guard lock(flush->mutex);
+    flush->finished = true;
+    if (error) {
+      flush->error = error->description;
+    }
+    flush->done.notify_one();
+  });
+  std::unique_lock lock(flush->mutex);
+  if (!flush->done.wait_for(lock, std::chrono::seconds(60), [&] { return flush->finished; })) {
+    refused.fetch_add(1);
+    return "flushMessagesWithCompletion: no completion after 60 s";
+  }
+  if (flush->error) {
+    refused.fetch_add(1);
+    return "flushMessagesWithCompletion: " + *flush->error;
+  }
+  if (!session.isValid()) {
+    return "the connection to zerithd was invalidated";
+  }
+  return {};
+}
+
+}  // namespace
+
 LoadResult runZerithdLoad(const LoadOptions& o, std::vector<std::unique_ptr<Zerith>>& sessions) {
   if (static_cast<int>(sessions.size()) < o.clients) {
     return {.error = "fewer sessions than clients"};
+  }
+  if (!o.replies) {
+    return runClients(o, [&](int c, const Pacer& pacer, std::atomic<std::uint64_t>& accepted,
+                             std::atomic<std::uint64_t>& refused) -> std::string {
+      return sendOneWay(o, *sessions[static_cast<std::size_t>(c)], static_cast<std::uint64_t>(c) * o.eventsPerClient,
+                        pacer, accepted, refused);
+    });
   }
   return runClients(o, [&](int c, const Pacer& pacer, std::atomic<std::uint64_t>& accepted,
                            std::atomic<std::uint64_t>& refused) -> std::string {

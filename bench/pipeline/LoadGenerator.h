@@ -5,10 +5,15 @@
 // taken or paced to a total rate. Event identifiers are dense: client c
 // sends c * perClient .. (c + 1) * perClient - 1.
 //
-// - zerithd: each client is a session of the client framework; an event is
-//   accepted when the daemon's reply to sendMessageWithDictionary:reply:
-//   arrives (at most `window` unanswered per client); the client flushes its
-//   session at the end, as a client that ends its work does.
+// - zerithd: each client is a session of the client framework. With replies
+//   (the default) an event is accepted when the daemon's reply to
+//   sendMessageWithDictionary:reply: arrives (at most `window` unanswered per
+//   client); the client flushes its session at the end, as a client that
+//   ends its work does. Without replies each event is sent one-way (no reply
+//   block, like the peer's lines) and accepted once the send returned (the
+//   framework's backpressure holds a sender back while the daemon does not
+//   keep up); the client then flushes with flushMessagesWithCompletion: and
+//   waits for its completion.
 // - the peer: each client writes one JSON line per event to the peer's
 //   stream socket; an event is accepted once the socket took it (the peer's
 //   flow control holds writes back when its queue is full).
@@ -29,6 +34,7 @@ struct LoadOptions {
   std::uint64_t eventsPerClient = 1000;
   double eventsPerSecond = 0;  // all clients together; 0: as fast as taken
   int window = 256;            // unanswered events per zerithd client
+  bool replies = true;         // zerithd: each event asks for a reply; false: one-way sends
 };
 
 struct LoadResult {

@@ -607,6 +607,125 @@ TEST(SocketConnectionSocketThreads, CallsThatMayWaitAndCallsThatNeverWaitStayInO
   EXPECT_FALSE(offQueue);
 }
 
+// ---- writes gathered per chunk ------------------------------------------------------
+
+// Which calls of a chunk answer without waiting: all, none, or every other.
+class SocketConnectionGatheredReplies : public ::testing::TestWithParam<int> {};
+
+TEST_P(SocketConnectionGatheredReplies, ManyCallsInOneWriteAreAllAnsweredInOrder) {
+  RawPeer peer;
+  const int mode = GetParam();
+  peer.object->quick = [mode](const Message& m) {
+    return mode == 0 || (mode == 2 && m.args.get("n").intValue() % 2 == 0);
+  };
+  constexpr int kCalls = 400;
+  Data all;
+  for (int n = 0; n < kCalls; ++n) {
+    // Replies of varied sizes, some larger than a socket buffer takes at once.
+    const Data f = callFrame("echo", static_cast<std::uint64_t>(n + 1),
+                             Dictionary{{"n", n}, {"pad", Value(Data(static_cast<std::size_t>(n * 331 % 9000), 7))}});
+    all.insert(all.end(), f.begin(), f.end());
+  }
+  // Written whole from a thread of its own: the connection stops reading
+  // while this test has not read the replies yet.
+  std::thread writer([&] { peer.write(all); });
+  for (int n = 0; n < kCalls; ++n) {
+    const auto reply = peer.readMessage();
+    if (!reply || reply->replyTo != static_cast<std::uint64_t>(n + 1)) {
+      peer.raw.reset();  // the writer ends too
+      writer.join();
+      FAIL() << "reply " << n << " missing or out of order";
+    }
+    EXPECT_EQ(reply->replyArgs.get("n").intValue(), n);
+  }
+  writer.join();
+}
+
+INSTANTIATE_TEST_SUITE_P(QuickCalls, SocketConnectionGatheredReplies, ::testing::Values(0, 1, 2));
+
+TEST(SocketConnectionGatheredWrites, AFrameAnotherThreadWritesDuringADeliveryKeepsItsPlace) {
+  RawPeer peer;
+  peer.object->quick = [](const Message&) { return true; };
+  peer.object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
+    if (m.operation == "a") {
+      // Written, and done, before the reply below is made.
+      std::thread([&] { peer.connection->send("aside", Dictionary{}); }).join();
+    }
+    r->send(m.args);
+  };
+  peer.write(concat({callFrame("a", 1), callFrame("b", 2)}));
+  const auto first = peer.readMessage();
+  ASSERT_TRUE(first);
+  EXPECT_EQ(first->kind, IncomingMessage::Kind::Call);
+  EXPECT_EQ(first->call.operation, "aside");
+  const auto second = peer.readMessage();
+  ASSERT_TRUE(second);
+  EXPECT_EQ(second->replyTo, 1u);
+  const auto third = peer.readMessage();
+  ASSERT_TRUE(third);
+  EXPECT_EQ(third->replyTo, 2u);
+}
+
+TEST(SocketConnectionGatheredWrites, AReplyMadeLaterFromAnotherThreadLeavesAtOnceWhileNothingElseHappens) {
+  std::promise<std::shared_ptr<Reply>> kept;  // outlives the connection's handlers
+  RawPeer peer;
+  peer.object->quick = [](const Message&) { return true; };
+  peer.object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
+    if (m.operation == "later") {
+      kept.set_value(std::move(r));
+      return;
+    }
+    r->send(m.args);
+  };
+  peer.write(concat({callFrame("later", 1), callFrame("now", 2)}));
+  const auto now = peer.readMessage();
+  ASSERT_TRUE(now);
+  EXPECT_EQ(now->replyTo, 2u);
+  auto future = kept.get_future();
+  ASSERT_EQ(future.wait_for(kWait), std::future_status::ready);
+  std::thread([reply = future.get()] { reply->send(Dictionary{{"late", true}}); }).join();
+  const auto late = peer.readMessage();
+  ASSERT_TRUE(late) << "a reply written outside any delivery stayed in the outbox";
+  EXPECT_EQ(late->replyTo, 1u);
+  EXPECT_EQ(late->replyArgs, (Dictionary{{"late", true}}));
+}
+
+TEST(SocketConnectionGatheredWrites, AHandlerThatMayWaitHoldsNoFrameBack) {
+  // slow, quick, slow in one chunk: the first slow call is handed to the
+  // pool from the socket thread, the second is met on the pool itself. Each
+  // writes a frame and waits until the test has read it; gathered frames
+  // would never arrive.
+  std::promise<void> seen[2];  // outlives the connection's handlers
+  RawPeer peer;
+  peer.object->quick = [](const Message& m) { return m.operation == "quick"; };
+  peer.object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
+    if (m.operation == "slow") {
+      const auto n = m.args.get("n").intValue();
+      peer.connection->send("progress", Dictionary{{"n", n}});
+      if (seen[n].get_future().wait_for(kWait) != std::future_status::ready) {
+        ADD_FAILURE() << "progress frame " << n << " was not read";
+      }
+    }
+    r->send(m.args);
+  };
+  peer.write(concat({callFrame("slow", 1, Dictionary{{"n", 0}}), callFrame("quick", 2),
+                     callFrame("slow", 3, Dictionary{{"n", 1}})}));
+  // On the wire: progress 0, reply 1, reply 2, progress 1, reply 3.
+  const std::vector<std::uint64_t> repliesAfter[2] = {{1, 2}, {3}};
+  for (int n = 0; n < 2; ++n) {
+    const auto progress = peer.readMessage();
+    ASSERT_TRUE(progress) << "progress " << n << " held back while its handler waits";
+    EXPECT_EQ(progress->call.operation, "progress");
+    EXPECT_EQ(progress->call.args.get("n").intValue(), n);
+    seen[n].set_value();
+    for (const std::uint64_t call : repliesAfter[n]) {
+      const auto reply = peer.readMessage();
+      ASSERT_TRUE(reply) << "reply to call " << call << " missing";
+      EXPECT_EQ(reply->replyTo, call);
+    }
+  }
+}
+
 // ---- identity ---------------------------------------------------------------------
 
 TEST(SocketConnectionIdentity, PeerCredentialsComeFromTheSocket) {

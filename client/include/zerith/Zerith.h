@@ -22,6 +22,17 @@
 //   from a callback of this session (its queue) fails at once instead of
 //   deadlocking.
 //
+// Backpressure: an asynchronous call returns once its message is queued for
+// the daemon, and a one-way message (sendMessageWithDictionary(message,
+// nullptr), no completion) gets no answer at all. A thread that sends faster
+// than the daemon reads would only grow the session's outbox, and a session
+// whose outbox passes 64 MiB is closed with its messages. So once more than
+// 1 MiB waits for the daemon, the thread that sends the next message waits
+// until less than 256 KiB does, as a blocking socket write would; the end of
+// the session releases it at once (its message is then dropped, as every
+// message after the end is). Callbacks of the session (its queue) never wait
+// this way: their messages are queued.
+//
 // Completion argument names: startConfig/fetchStates "backends" (array of
 // backend names or absent), fetchDisplayURL "url", sendMessage and
 // sendMessageWithSessionInfo "result", flushMessages "result" and "error",

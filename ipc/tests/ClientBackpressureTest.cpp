@@ -1,0 +1,246 @@
+// A client end (a connection made by connect) whose daemon stops reading:
+// the thread that sends one-way messages waits at the outbox's mark instead
+// of growing it, nothing is lost once the daemon reads again, the threads
+// that drain the connection never wait, and the end of the connection
+// releases a waiting writer.
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <future>
+#include <thread>
+
+#include "ipc/SocketConnection.h"
+#include "ipc/tests/IpcTestSupport.h"
+#include "platform/Log.h"
+
+namespace zerith::ipc::test {
+namespace {
+
+constexpr std::size_t kPause = 64u << 10;
+constexpr std::size_t kResume = 16u << 10;
+constexpr std::size_t kPad = 4000;
+
+Data eventArgsPad() { return Data(kPad, 0x65); }
+
+// A listener's socket in a folder of its own, the client end connected to it
+// with SocketConnection::connect, and the accepted daemon end as a raw
+// socket the test reads (or leaves unread) itself.
+struct ClientEnd {
+  std::filesystem::path folder;
+  file::UniqueFd listening;
+  file::UniqueFd raw;
+  std::shared_ptr<SocketConnection> connection;
+  Counter invalidated;
+  FrameDecoder decoder{64u << 20};
+
+  ClientEnd() {
+    char folderTemplate[] = "/tmp/zerith-ipc-XXXXXX";
+    const char* made = ::mkdtemp(folderTemplate);
+    EXPECT_NE(made, nullptr);
+    folder = made ? made : "/tmp";
+    const std::string path = (folder / "socket").string();
+    listening.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
+    EXPECT_EQ(::listen(listening.get(), 1), 0);
+    Error error;
+    connection = SocketConnection::connect(path, &error);
+    EXPECT_TRUE(connection) << error.description;
+    raw.reset(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    EXPECT_TRUE(raw);
+    if (connection) {
+      connection->setInvalidationHandler([this] { invalidated.hit(); });
+      connection->resume();
+    }
+  }
+  ~ClientEnd() {
+    if (connection) {
+      connection->invalidate();
+      invalidated.waitFor(1);
+    }
+    std::error_code ignored;
+    std::filesystem::remove_all(folder, ignored);
+  }
+
+  // Reads one frame from the daemon's end; nullopt on EOF or time-out.
+  std::optional<IncomingMessage> readMessage() {
+    for (;;) {
+      plist::Bytes body;
+      std::string why;
+      switch (decoder.next(body, why)) {
+        case FrameDecoder::Status::Frame: return decodeMessage(body, &why);
+        case FrameDecoder::Status::Invalid: ADD_FAILURE() << why; return std::nullopt;
+        case FrameDecoder::Status::NeedMore: break;
+      }
+      pollfd p{raw.get(), POLLIN, 0};
+      if (::poll(&p, 1, static_cast<int>(std::chrono::milliseconds(kWait).count())) <= 0) {
+        return std::nullopt;
+      }
+      std::uint8_t buffer[65536];
+      const ssize_t n = ::recv(raw.get(), buffer, sizeof(buffer), 0);
+      if (n <= 0) {
+        return std::nullopt;
+      }
+      decoder.append(buffer, static_cast<std::size_t>(n));
+    }
+  }
+};
+
+class ClientBackpressure : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    setQueueLimits({.pauseReadingAt = kPause, .resumeReadingAt = kResume, .perConnection = 1u << 20,
+                    .allConnections = 1u << 30});
+  }
+  void TearDown() override { setQueueLimits(QueueLimits{}); }
+};
+
+// Sends `count` one-way events from a thread of its own, noting the most the
+// outbox held after each send.
+struct EventWriter {
+  std::atomic<int> sent{0};
+  std::atomic<std::size_t> mostQueued{0};
+  std::thread thread;
+
+  EventWriter(SocketConnection& connection, int count) {
+    thread = std::thread([this, &connection, count] {
+      for (int n = 0; n < count; ++n) {
+        connection.send("event", Dictionary{{"n", n}, {"pad", Value(eventArgsPad())}});
+        mostQueued = std::max(mostQueued.load(), connection.queuedBytes());
+        ++sent;
+      }
+    });
+  }
+  ~EventWriter() {
+    if (thread.joinable()) {
+      thread.join();
+    }
+  }
+};
+
+TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAndAllArriveOnceItReads) {
+  log::LogCapture capture;
+  ClientEnd end;
+  ASSERT_TRUE(end.connection);
+  // Far more than the kernel's socket buffers and the outbox's mark take.
+  constexpr int kEvents = 1500;
+  EventWriter writer(*end.connection, kEvents);
+  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  EXPECT_LT(writer.sent.load(), kEvents) << "the writer was not held back";
+  const std::size_t frame = encodeCall("event", std::nullopt, Dictionary{{"n", 0}, {"pad", Value(eventArgsPad())}}).size();
+  EXPECT_GT(end.connection->queuedBytes(), kPause);
+  EXPECT_LE(end.connection->queuedBytes(), kPause + frame + 16);
+
+  for (int n = 0; n < kEvents; ++n) {
+    const auto event = end.readMessage();
+    ASSERT_TRUE(event) << "event " << n << " of " << kEvents << " missing";
+    ASSERT_EQ(event->kind, IncomingMessage::Kind::Call);
+    EXPECT_FALSE(event->call.call) << "a one-way event carries no call number";
+    ASSERT_EQ(event->call.args.get("n").intValue(), n);
+  }
+  writer.thread.join();
+  EXPECT_EQ(writer.sent.load(), kEvents);
+  EXPECT_LE(writer.mostQueued.load(), kPause + frame + 16) << "the outbox grew past its mark";
+  EXPECT_EQ(end.connection->queuedBytes(), 0u);
+  EXPECT_FALSE(end.connection->isInvalidated());
+  EXPECT_FALSE(capture.contains("closing connection"));
+}
+
+TEST_F(ClientBackpressure, ABlockOfTheConnectionsQueueNeverWaits) {
+  log::LogCapture capture;
+  ClientEnd end;
+  ASSERT_TRUE(end.connection);
+  EventWriter writer(*end.connection, 1500);
+  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  // Over the mark, nothing read: a block of the connection's own queue still
+  // gets its frame queued and goes on.
+  Counter fromQueue;
+  end.connection->queue().async([&] {
+    end.connection->send("fromQueue", Dictionary{});
+    fromQueue.hit();
+  });
+  EXPECT_TRUE(fromQueue.waitFor(1)) << "a block of the connection's queue waited for the outbox";
+  // Its frame is queued behind the writer's, past the mark by one frame.
+  EXPECT_GT(end.connection->queuedBytes(), kPause);
+  end.connection->invalidate();
+  ASSERT_TRUE(end.invalidated.waitFor(1));
+}
+
+TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
+  // A daemon that waits for its replies to be read before it reads on, and a
+  // client that would read them only once its own outbox drained, would wait
+  // for each other for ever.
+  log::LogCapture capture;
+  ClientEnd end;
+  ASSERT_TRUE(end.connection);
+  Counter answered;
+  for (int n = 0; n < 3; ++n) {
+    end.connection->call("ask", Dictionary{{"n", n}}, [&](std::optional<Dictionary> args, std::optional<Error>) {
+      EXPECT_TRUE(args);
+      answered.hit();
+    });
+  }
+  EventWriter writer(*end.connection, 1500);
+  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  const Data replies = concat({encodeReply(1, Dictionary{}), encodeReply(2, Dictionary{}), encodeReply(3, Dictionary{})});
+  ASSERT_EQ(::send(end.raw.get(), replies.data(), replies.size(), MSG_NOSIGNAL), static_cast<ssize_t>(replies.size()));
+  EXPECT_TRUE(answered.waitFor(3)) << "the client stopped reading because its own outbox was full";
+  EXPECT_FALSE(end.connection->readingPaused());
+  end.connection->invalidate();
+  ASSERT_TRUE(end.invalidated.waitFor(1));
+}
+
+// How a waiting writer is released: the client ends the connection, or the
+// daemon goes away.
+class ClientBackpressureRelease : public ClientBackpressure, public ::testing::WithParamInterface<bool> {};
+
+TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtOnce) {
+  log::LogCapture capture;
+  ClientEnd end;
+  ASSERT_TRUE(end.connection);
+  constexpr int kEvents = 1500;
+  EventWriter writer(*end.connection, kEvents);
+  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  const int before = writer.sent.load();
+  ASSERT_LT(before, kEvents);
+  if (GetParam()) {
+    end.connection->invalidate();
+  } else {
+    end.raw.reset();  // the daemon goes away
+  }
+  // Every send after the end returns at once; the writer gets through the rest.
+  auto done = std::async(std::launch::async, [&] { writer.thread.join(); });
+  ASSERT_EQ(done.wait_for(kWait), std::future_status::ready) << "the writer still waits after the connection ended";
+  EXPECT_EQ(writer.sent.load(), kEvents);
+  EXPECT_TRUE(end.invalidated.waitFor(1));
+  EXPECT_EQ(end.connection->queuedBytes(), 0u);
+}
+
+INSTANTIATE_TEST_SUITE_P(ByClientOrDaemon, ClientBackpressureRelease, ::testing::Bool(),
+                         [](const auto& info) { return info.param ? "ClientInvalidates" : "DaemonGoesAway"; });
+
+TEST_F(ClientBackpressure, TheDaemonsEndNeverWaits) {
+  // A connection the daemon adopted goes on queueing past the mark (and is
+  // closed at its limit) instead of holding the daemon's thread.
+  RawPeer peer;
+  constexpr int kEvents = 400;  // 1.6 MB: past the 1 MiB limit of this test
+  auto done = std::async(std::launch::async, [&] {
+    for (int n = 0; n < kEvents; ++n) {
+      peer.connection->send("event", Dictionary{{"n", n}, {"pad", Value(eventArgsPad())}});
+    }
+  });
+  ASSERT_EQ(done.wait_for(kWait), std::future_status::ready) << "the daemon's end waited for its peer";
+  EXPECT_TRUE(peer.invalidated.waitFor(1)) << "the outbox limit no longer closes a peer that never reads";
+}
+
+}  // namespace
+}  // namespace zerith::ipc::test
