@@ -26,6 +26,11 @@ namespace zerith {
 
 namespace {
 
+// Keys a record gains beyond its payload: the sixteen completeRecord sets
+// and the four a session's stop message carries.
+constexpr std::size_t kRecordKeys = 16;
+constexpr std::size_t kStopMessageKeys = 4;
+
 // Posts that get no answer within this time fail instead of holding their
 // connection for ever.
 constexpr double kPostTimeoutSeconds = 60;
@@ -244,7 +249,9 @@ void HTTPSPostBackend::setImmutable() {
 Dictionary HTTPSPostBackend::newEventDictfromPayload(const Value& payload, const timeval& timestamp,
                                                      std::uint16_t method, std::uint16_t respCode,
                                                      std::uint16_t eventID) const {
-  return completeRecord(payload.isDict() ? payload.dictCopy() : Dictionary(), timestamp, method, respCode, eventID);
+  const std::size_t capacity = payload.count() + kRecordKeys + userInfoDict().count();
+  Dictionary event = payload.isDict() ? Dictionary(*payload.dict(), capacity) : Dictionary(Dictionary(), capacity);
+  return completeRecord(std::move(event), timestamp, method, respCode, eventID);
 }
 
 Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& timestamp, std::uint16_t method,
@@ -267,8 +274,18 @@ Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& tim
   const double clientTS = sanitizeDouble(static_cast<double>(startTS) + (timevalToSeconds(timestamp) - start));
   event.set("_clientTS", Value(clientTS));
   event.set("eventTime", Value(clientTS));
-  event.set("_productFamily", productFamily() ? Value(*productFamily()) : Value());
-  event.set("_productModel", hardwareType() ? Value(*hardwareType()) : Value());
+  // Absent product facts leave no entry rather than a null on the wire (an
+  // entry of the payload by that name goes too).
+  if (auto family = productFamily()) {
+    event.set("_productFamily", Value(std::move(*family)));
+  } else {
+    event.erase("_productFamily");
+  }
+  if (auto model = hardwareType()) {
+    event.set("_productModel", Value(std::move(*model)));
+  } else {
+    event.erase("_productModel");
+  }
   if (auto version = productVersion()) {
     event.set("_osVersion", Value(*version));
   }
@@ -279,12 +296,6 @@ Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& tim
   const std::string minor = selfVersionMinor() != 0 ? fmt::format(".{}", selfVersionMinor()) : std::string();
   event.set("_reportVers", Value(fmt::format("{}.{}{}", selfVersionMajor(), selfVersionMiddle(), minor)));
   event.set("_timezoneOffset", Value(static_cast<long long>(timeZoneOffsetSeconds())));
-  // Absent product facts leave no entry rather than a null on the wire.
-  for (const char* key : {"_productFamily", "_productModel"}) {
-    if (const Value* v = event.find(key); v && v->isNil()) {
-      event.erase(key);
-    }
-  }
   return event;
 }
 
@@ -445,8 +456,15 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
     backendsLogger().error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
     payload = Value(Dictionary());
   }
-  Dictionary copy = payload.isDict() ? payload.dictCopy() : Dictionary();
-  if (method == 0 && respCode == 1) {
+  // The record's final size is known here: the payload, the keys the
+  // record adds, user info and the shared data. Room for all of them up
+  // front spares the copy regrowing (and moving every entry) as keys come.
+  const Value sharedData = message["SharedData"];
+  const bool stopMessage = method == 0 && respCode == 1;
+  const std::size_t capacity = payload.count() + kRecordKeys + (stopMessage ? kStopMessageKeys : 0) +
+                               userInfoDict().count() + sharedData.count();
+  Dictionary copy = payload.isDict() ? Dictionary(*payload.dict(), capacity) : Dictionary(Dictionary(), capacity);
+  if (stopMessage) {
     backendsLogger().debug(
         "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary");
     const Fields f = fields();
@@ -457,7 +475,7 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
     copy.set("Batch", Value(batchEvents() ? 1 : 0));
   }
   Dictionary event = completeRecord(std::move(copy), timestamp, method, respCode, eventID);
-  prepareEventForMessage(event, message["SharedData"]);
+  prepareEventForMessage(event, sharedData);
 
   const bool realtime = (flag | 2) == 3;
   if ((flag | 1) == 3 && currentState == kBackendStateSampledOut) {
@@ -737,6 +755,7 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
   backendsLogger().debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
   filterEvent(userInfo);
   std::vector<Dictionary> kept;
+  kept.reserve(batch_.batchedEvents->size());
   for (Dictionary& event : *batch_.batchedEvents) {
     const auto category = static_cast<std::uint16_t>(recordInteger(event, "_method").value_or(0));
     if (!isWhitelistedEvent(category)) {

@@ -53,9 +53,7 @@ class BinaryChecker {
         numObjects_ > (tableEnd - tableOffset_) / offsetSize_) {
       return std::string("binary offset table is out of range");
     }
-    state_.assign(numObjects_, 0);
-    expanded_.assign(numObjects_, 0);
-    height_.assign(numObjects_, 0);
+    objects_.assign(numObjects_, Object{});
     std::uint64_t nodes = 0;
     std::size_t height = 0;
     if (auto err = visit(topObject_, 1, nodes, height)) {
@@ -109,18 +107,19 @@ class BinaryChecker {
     if (depth > limits_.maxDepth) {
       return fmt::format("nesting deeper than {}", limits_.maxDepth);
     }
-    if (state_[ref] == 2) {
-      if (depth + height_[ref] - 1 > limits_.maxDepth) {
+    Object& object = objects_[ref];
+    if (object.state == 2) {
+      if (depth + object.height - 1 > limits_.maxDepth) {
         return fmt::format("nesting deeper than {}", limits_.maxDepth);
       }
-      nodesOut = expanded_[ref];
-      heightOut = height_[ref];
+      nodesOut = object.expanded;
+      heightOut = object.height;
       return std::nullopt;
     }
-    if (state_[ref] == 1) {
+    if (object.state == 1) {
       return std::string("object references form a cycle");
     }
-    state_[ref] = 1;
+    object.state = 1;
 
     const std::uint64_t offset = readBE(b_.data() + tableOffset_ + ref * offsetSize_, offsetSize_);
     if (offset < 8 || offset >= tableOffset_) {
@@ -222,9 +221,9 @@ class BinaryChecker {
       default:
         return fmt::format("unknown object type 0x{:x}", type);
     }
-    state_[ref] = 2;
-    expanded_[ref] = nodes;
-    height_[ref] = height;
+    // A height is at most the depth limit, which a walk's stack bounds well
+    // below 2^32.
+    objects_[ref] = Object{nodes, static_cast<std::uint32_t>(height), 2};
     nodesOut = nodes;
     heightOut = height;
     return std::nullopt;
@@ -237,9 +236,13 @@ class BinaryChecker {
   std::uint64_t numObjects_ = 0;
   std::uint64_t topObject_ = 0;
   std::uint64_t tableOffset_ = 0;
-  std::vector<std::uint8_t> state_;     // 0 unvisited, 1 on the current path, 2 done
-  std::vector<std::uint64_t> expanded_;
-  std::vector<std::size_t> height_;
+  // What the walk knows of each object, in one vector (one allocation).
+  struct Object {
+    std::uint64_t expanded = 0;  // nodes it expands to
+    std::uint32_t height = 0;
+    std::uint8_t state = 0;  // 0 unvisited, 1 on the current path, 2 done
+  };
+  std::vector<Object> objects_;
 };
 
 // ---- libplist <-> Value ---------------------------------------------------------
@@ -263,25 +266,24 @@ Value fromNode(plist_t node) {
       plist_get_real_val(node, &d);
       return Value(d);
     }
-    case PLIST_STRING:
+    case PLIST_STRING: {
+      // Read in place (the node keeps its text until the tree is freed)
+      // instead of through a copy of it. The text ends at its first NUL, as
+      // a copy made by libplist would.
+      const char* s = plist_get_string_ptr(node, nullptr);
+      return Value(std::string(s ? s : ""));
+    }
     case PLIST_KEY: {
       char* s = nullptr;
-      if (plist_get_node_type(node) == PLIST_KEY) {
-        plist_get_key_val(node, &s);
-      } else {
-        plist_get_string_val(node, &s);
-      }
+      plist_get_key_val(node, &s);
       std::string out = s ? s : "";
       std::free(s);
       return Value(std::move(out));
     }
     case PLIST_DATA: {
-      char* d = nullptr;
-      std::uint64_t len = 0;
-      plist_get_data_val(node, &d, &len);
-      Data out(reinterpret_cast<std::uint8_t*>(d), reinterpret_cast<std::uint8_t*>(d) + (d ? len : 0));
-      std::free(d);
-      return Value(std::move(out));
+      std::uint64_t length = 0;
+      const auto* d = reinterpret_cast<const std::uint8_t*>(plist_get_data_ptr(node, &length));
+      return Value(d ? Data(d, d + length) : Data());
     }
     case PLIST_DATE: {
       std::int32_t sec = 0;
@@ -305,6 +307,7 @@ Value fromNode(plist_t node) {
     }
     case PLIST_DICT: {
       Dictionary out;
+      out.reserve(plist_dict_get_size(node));
       plist_dict_iter it = nullptr;
       plist_dict_new_iter(node, &it);
       for (;;) {

@@ -3,6 +3,7 @@
 #include <malloc.h>
 
 #include <algorithm>
+#include <atomic>
 #include <charconv>
 #include <chrono>
 #include <cmath>
@@ -31,6 +32,11 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
   for (const auto& entry : entries) {
     set(entry.first, entry.second);
   }
+}
+
+Dictionary::Dictionary(const Dictionary& other, std::size_t capacity) : index_(other.index_) {
+  entries_.reserve(std::max(capacity, other.size()));
+  entries_.insert(entries_.end(), other.entries_.begin(), other.entries_.end());
 }
 
 std::ptrdiff_t Dictionary::indexOf(std::string_view key) const {
@@ -129,30 +135,93 @@ bool Dictionary::operator==(const Dictionary& other) const {
 
 // ---- Value -------------------------------------------------------------------
 
-Value::Value(bool v) : node_(new Storage(std::in_place_type<bool>, v)) {}
-Value::Value(long long v) : node_(new Storage(std::in_place_type<std::int64_t>, v)) {}
+namespace {
+// What the allocator really hands out for one node block (the reference
+// counts and the storage together); every node block has the same size, so
+// the first one measured stands for all. 0 until a node was made.
+std::atomic<std::size_t> nodeBlockUsableSize{0};
+
+// Allocates a node's one block: the reference counts and the storage
+// together, as make_shared does, and notes what the allocator handed out for
+// such a block the first time (a block's start is not reachable from the
+// stored value, so allocationSize could not ask for it later).
+template <typename T>
+struct NodeAllocator {
+  using value_type = T;
+  NodeAllocator() = default;
+  template <typename U>
+  NodeAllocator(const NodeAllocator<U>&) noexcept {}
+  T* allocate(std::size_t n) {
+    T* block = std::allocator<T>().allocate(n);
+    static const bool measured = [block] {
+      nodeBlockUsableSize.store(malloc_usable_size(block), std::memory_order_relaxed);
+      return true;
+    }();
+    (void)measured;
+    return block;
+  }
+  void deallocate(T* block, std::size_t n) noexcept { std::allocator<T>().deallocate(block, n); }
+  template <typename U>
+  bool operator==(const NodeAllocator<U>&) const noexcept {
+    return true;
+  }
+};
+}  // namespace
+
+template <typename... Args>
+std::shared_ptr<const Value::Storage> Value::makeNode(Args&&... args) {
+  return std::allocate_shared<const Storage>(NodeAllocator<Storage>(), std::forward<Args>(args)...);
+}
+
+// Booleans and small integers (method and status codes, counts, flags) are
+// in most records and messages: their nodes are made once and shared, as
+// copies of one value share theirs. Never destroyed, so that a value held
+// by a static outlives nothing it needs.
+std::shared_ptr<const Value::Storage> Value::sharedNode(bool v) {
+  static const auto* const nodes = new std::shared_ptr<const Storage>[2] {
+    makeNode(std::in_place_type<bool>, false), makeNode(std::in_place_type<bool>, true)
+  };
+  return nodes[v ? 1 : 0];
+}
+
+std::shared_ptr<const Value::Storage> Value::sharedNode(std::int64_t v) {
+  static const auto* const nodes = [] {
+    auto* made = new std::shared_ptr<const Storage>[kSharedIntegerMax - kSharedIntegerMin + 1];
+    for (std::int64_t i = kSharedIntegerMin; i <= kSharedIntegerMax; ++i) {
+      made[i - kSharedIntegerMin] = makeNode(std::in_place_type<std::int64_t>, i);
+    }
+    return made;
+  }();
+  return nodes[v - kSharedIntegerMin];
+}
+
+Value::Value(bool v) : node_(sharedNode(v)) {}
+Value::Value(long long v)
+    : node_(v >= kSharedIntegerMin && v <= kSharedIntegerMax ? sharedNode(static_cast<std::int64_t>(v))
+                                                             : makeNode(std::in_place_type<std::int64_t>, v)) {}
 Value::Value(unsigned long v) : Value(static_cast<unsigned long long>(v)) {}
 Value::Value(unsigned long long v) {
   // Unsigned values that fit a signed integer are plain integers, so that a
   // number compares equal whichever way it was built.
-  if (v <= static_cast<unsigned long long>(std::numeric_limits<std::int64_t>::max())) {
-    node_.reset(new Storage(std::in_place_type<std::int64_t>, static_cast<std::int64_t>(v)));
+  if (v <= static_cast<unsigned long long>(kSharedIntegerMax)) {
+    node_ = sharedNode(static_cast<std::int64_t>(v));
+  } else if (v <= static_cast<unsigned long long>(std::numeric_limits<std::int64_t>::max())) {
+    node_ = makeNode(std::in_place_type<std::int64_t>, static_cast<std::int64_t>(v));
   } else {
-    node_.reset(new Storage(std::in_place_type<std::uint64_t>, v));
+    node_ = makeNode(std::in_place_type<std::uint64_t>, v);
   }
 }
-Value::Value(double v) : node_(new Storage(std::in_place_type<double>, v)) {}
-Value::Value(const char* v) : Value(std::string(v ? v : "")) {
-  if (!v) {
-    node_.reset();
+Value::Value(double v) : node_(makeNode(std::in_place_type<double>, v)) {}
+Value::Value(const char* v) {
+  if (v) {
+    node_ = makeNode(std::in_place_type<std::string>, v);
   }
 }
-Value::Value(std::string v) : node_(new Storage(std::in_place_type<std::string>, std::move(v))) {}
-Value::Value(zerith::Data v) : node_(new Storage(std::in_place_type<zerith::Data>, std::move(v))) {}
-Value::Value(zerith::Date v) : node_(new Storage(std::in_place_type<zerith::Date>, v)) {}
-Value::Value(zerith::Array v) : node_(new Storage(std::in_place_type<zerith::Array>, std::move(v))) {}
-Value::Value(zerith::Dictionary v)
-    : node_(new Storage(std::in_place_type<zerith::Dictionary>, std::move(v))) {}
+Value::Value(std::string v) : node_(makeNode(std::in_place_type<std::string>, std::move(v))) {}
+Value::Value(zerith::Data v) : node_(makeNode(std::in_place_type<zerith::Data>, std::move(v))) {}
+Value::Value(zerith::Date v) : node_(makeNode(std::in_place_type<zerith::Date>, v)) {}
+Value::Value(zerith::Array v) : node_(makeNode(std::in_place_type<zerith::Array>, std::move(v))) {}
+Value::Value(zerith::Dictionary v) : node_(makeNode(std::in_place_type<zerith::Dictionary>, std::move(v))) {}
 
 Value::Type Value::type() const {
   if (!node_) {
@@ -399,7 +468,7 @@ std::size_t Value::allocationSize() const {
   if (!node_) {
     return 0;
   }
-  std::size_t size = malloc_usable_size(const_cast<Storage*>(node_.get()));
+  std::size_t size = nodeBlockUsableSize.load(std::memory_order_relaxed);
   if (const auto* s = string(); s && s->capacity() > std::string().capacity()) {
     size += malloc_usable_size(const_cast<char*>(s->data()));
   } else if (const auto* d = data()) {

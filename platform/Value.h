@@ -54,6 +54,13 @@ class Dictionary {
 
   Dictionary() = default;
   Dictionary(std::initializer_list<Entry> entries);
+  // A copy of `other` with room for `capacity` entries, for a builder that
+  // will add to the copy and knows how much.
+  Dictionary(const Dictionary& other, std::size_t capacity);
+  Dictionary(const Dictionary&) = default;
+  Dictionary(Dictionary&&) noexcept = default;
+  Dictionary& operator=(const Dictionary&) = default;
+  Dictionary& operator=(Dictionary&&) noexcept = default;
 
   // nullptr when absent.
   const Value* find(std::string_view key) const ZERITH_LIFETIMEBOUND;
@@ -65,6 +72,9 @@ class Dictionary {
   void set(std::string key, Value value);
   bool erase(std::string_view key);
   void clear();
+  // Room for `count` entries without growing again (a builder that knows its
+  // final size).
+  void reserve(std::size_t count) { entries_.reserve(count); }
 
   // Defined below Value: until Value is complete, clang cannot instantiate
   // the entries' members.
@@ -167,6 +177,14 @@ class Value {
  private:
   using Storage = std::variant<bool, std::int64_t, std::uint64_t, double, std::string, zerith::Data,
                                zerith::Date, zerith::Array, zerith::Dictionary>;
+  // A node in one allocation: the storage beside its reference counts.
+  template <typename... Args>
+  static std::shared_ptr<const Storage> makeNode(Args&&... args);
+  // Shared nodes of booleans and of integers in [kSharedIntegerMin, kSharedIntegerMax].
+  static constexpr std::int64_t kSharedIntegerMin = -1;
+  static constexpr std::int64_t kSharedIntegerMax = 255;
+  static std::shared_ptr<const Storage> sharedNode(bool v);
+  static std::shared_ptr<const Storage> sharedNode(std::int64_t v);
   std::shared_ptr<const Storage> node_;
 };
 

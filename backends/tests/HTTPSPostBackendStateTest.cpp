@@ -48,6 +48,25 @@ TEST_F(HTTPSRecordTest, RecordCountsFromTheStartMinuteAndCarriesEveryKeyInOrder)
   EXPECT_EQ(record.get("_timezoneOffset"), Value(static_cast<long long>(timeZoneOffsetSeconds())));
 }
 
+TEST_F(HTTPSRecordTest, AbsentHardwareTypeLeavesNoModelEvenWhenThePayloadNamedOne) {
+  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  ASSERT_TRUE(b);
+  b->setHardwareType(std::nullopt);
+  // A payload past the dictionary's index threshold, so that the removal
+  // goes through the index too.
+  Dictionary payload{{"_productModel", "client-said"}, {"first", 1}};
+  for (int i = 0; i < 20; ++i) {
+    payload.set("k" + std::to_string(i), i);
+  }
+  const Dictionary record = b->newEventDictfromPayload(Value(payload), at(1010), 5, 6, 99);
+  EXPECT_FALSE(record.contains("_productModel"));
+  EXPECT_EQ(record.get("_productFamily"), Value("TestFamily"));
+  EXPECT_EQ(record.size(), payload.size() - 1 + 15);
+  EXPECT_EQ(record.entries()[0].first, "first");
+  EXPECT_EQ(record.get("k19"), Value(19));
+  EXPECT_EQ(record.get("_timezoneOffset"), Value(static_cast<long long>(timeZoneOffsetSeconds())));
+}
+
 TEST_F(HTTPSRecordTest, SessionIdentifierFormDependsOnComponentTypeAndInternalFlag) {
   auto b = backend(profileWith({enablingClient(server.url("/post"))}));
   b->setCombinedSessionIDString("AAA.BBB");

@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <string>
 
 #include "platform/PropertyList.h"
 
@@ -128,6 +129,54 @@ TEST(PropertyListTest, CyclesDepthAndBadOffsetsAreRejected) {
     EXPECT_FALSE(plist::decodeBinary(plist::bytesOf(b.finish(0)), {}, &why));
     EXPECT_NE(why.find("key is not a string"), std::string::npos) << why;
   }
+}
+
+TEST(PropertyListTest, LargeContainersAndTextComeBackWhole) {
+  // Past the dictionary's index threshold, beyond short-string storage, data
+  // and strings read in place: every entry back, in order, found by key.
+  Dictionary big;
+  Array list;
+  for (int i = 0; i < 1000; ++i) {
+    big.set("key-" + std::to_string(i), i % 3 == 0 ? Value(std::string(40, static_cast<char>('a' + i % 26)))
+                                                   : Value(i * 1000));
+    list.push_back(i % 2 ? Value(Data(static_cast<std::size_t>(i % 50), static_cast<std::uint8_t>(i))) : Value(i));
+  }
+  big.set("list", Value(list));
+  big.set("empty", Value(std::string()));
+  big.set("unicode", Value("caf\xc3\xa9 \xe2\x82\xac"));
+  const Value v(big);
+  for (bool binary : {true, false}) {
+    const auto back = binary ? plist::decode(plist::bytesOf(plist::encodeBinary(v)))
+                             : plist::decode(plist::bytesOf(plist::encodeXml(v)));
+    ASSERT_TRUE(back) << binary;
+    EXPECT_EQ(*back, v) << binary;
+    ASSERT_EQ(back->count(), 1003u);
+    EXPECT_EQ(back->dict()->entries()[999].first, "key-999");
+    EXPECT_EQ((*back)["key-998"].intValue(), 998000);
+    EXPECT_EQ(*(*back)["key-999"].string(), std::string(40, static_cast<char>('a' + 999 % 26)));
+    EXPECT_EQ((*back)["list"].count(), 1000u);
+    EXPECT_EQ((*back)["list"].at(49).data()->size(), 49u);
+    EXPECT_EQ(*(*back)["unicode"].string(), "caf\xc3\xa9 \xe2\x82\xac");
+    EXPECT_TRUE((*back)["empty"].string()->empty());
+  }
+}
+
+TEST(PropertyListTest, RepeatedDictionaryKeyKeepsTheLastValueAtTheFirstPlace) {
+  // A hand-made list whose dictionary names "a" twice: one entry, the
+  // later value, where the key first stood.
+  BinaryBuilder b;
+  b.add({0xD3, 0x01, 0x02, 0x01, 0x03, 0x04, 0x05});  // {a: 1, b: 2, a: 3}
+  b.add({0x51, 'a'});
+  b.add({0x51, 'b'});
+  b.add({0x10, 0x01});
+  b.add({0x10, 0x02});
+  b.add({0x10, 0x03});
+  const auto back = plist::decodeBinary(plist::bytesOf(b.finish(0)));
+  ASSERT_TRUE(back);
+  ASSERT_EQ(back->count(), 2u);
+  EXPECT_EQ(back->dict()->entries()[0].first, "a");
+  EXPECT_EQ((*back)["a"].intValue(), 3);
+  EXPECT_EQ((*back)["b"].intValue(), 2);
 }
 
 TEST(PropertyListTest, EveryTruncationOfAValidListFailsCleanly) {

@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <limits>
+#include <string>
 
 #include "platform/Crypto.h"
 #include "platform/Json.h"
@@ -61,6 +63,73 @@ TEST(ValueTest, JsonKeepsOrderAndEncodesDataAsBase64) {
 TEST(ValueTest, AllocationSizeCountsHeapBuffers) {
   EXPECT_EQ(Value().allocationSize(), 0u);
   EXPECT_GT(Value(std::string(100, 'x')).allocationSize(), Value("x").allocationSize() + 90);
+}
+
+TEST(ValueTest, SharedSmallNumbersBehaveAsNumbersMadeApart) {
+  // Booleans and integers from -1 to 255 share their nodes; either side of
+  // that range they are made apart. Type, equality and identity of copies
+  // are the same for both.
+  for (long long n : {-2LL, -1LL, 0LL, 1LL, 254LL, 255LL, 256LL}) {
+    const Value a(n);
+    const Value b(static_cast<double>(n));
+    EXPECT_EQ(a.type(), Value::Type::Int) << n;
+    EXPECT_EQ(a.intValue(), n);
+    EXPECT_EQ(a, b) << n;
+    EXPECT_EQ(a, Value(n)) << n;
+    EXPECT_FALSE(a == Value(n + 1)) << n;
+    if (n >= 0) {
+      EXPECT_EQ(Value(static_cast<unsigned long long>(n)), a) << n;
+      EXPECT_EQ(Value(static_cast<unsigned long long>(n)).type(), Value::Type::Int) << n;
+    }
+    const Value copy = a;
+    EXPECT_EQ(copy.identity(), a.identity());
+  }
+  EXPECT_EQ(Value(7).identity(), Value(7u).identity());
+  EXPECT_NE(Value(256).identity(), Value(256).identity());
+  EXPECT_EQ(Value(std::numeric_limits<unsigned long long>::max()).type(), Value::Type::UInt);
+  // A boolean is not the number of the same value, shared node or not.
+  EXPECT_TRUE(Value(true).isBool());
+  EXPECT_FALSE(Value(true) == Value(1));
+  EXPECT_FALSE(Value(false) == Value(0));
+  EXPECT_EQ(Value(true), Value(true));
+  EXPECT_FALSE(Value(true) == Value(false));
+  // A dictionary built from shared values and changed stays apart from
+  // another holding the same values.
+  Dictionary d{{"a", 1}, {"b", true}};
+  const Value frozen(d);
+  d.set("a", 2);
+  EXPECT_EQ(frozen["a"].intValue(), 1);
+  EXPECT_EQ(Value(d)["a"].intValue(), 2);
+  EXPECT_GT(Value(5).allocationSize(), 0u);
+  EXPECT_EQ(Value(5).allocationSize(), Value(100000).allocationSize());
+}
+
+TEST(ValueTest, CopyWithRoomKeepsEntriesOrderAndLookupsApartFromTheOriginal) {
+  for (int size : {0, 3, 15, 16, 40}) {
+    Dictionary original;
+    for (int i = 0; i < size; ++i) original.set("k" + std::to_string(i), i);
+    Dictionary copy(original, static_cast<std::size_t>(size) + 20);
+    EXPECT_EQ(copy, original) << size;
+    EXPECT_GE(copy.entries().capacity(), static_cast<std::size_t>(size) + 20);
+    for (int i = 0; i < 20; ++i) copy.set("new" + std::to_string(i), i);
+    if (size > 0) {
+      copy.set("k0", 100);  // replaced in place
+    }
+    EXPECT_EQ(copy.size(), static_cast<std::size_t>(size) + 20) << size;
+    EXPECT_EQ(original.size(), static_cast<std::size_t>(size));
+    EXPECT_FALSE(original.contains("new0"));
+    for (int i = 0; i < size; ++i) {
+      EXPECT_EQ(copy.entries()[static_cast<std::size_t>(i)].first, "k" + std::to_string(i));
+      EXPECT_EQ(original.get("k" + std::to_string(i)).intValue(), i);
+    }
+    for (int i = 0; i < 20; ++i) EXPECT_EQ(copy.get("new" + std::to_string(i)).intValue(), i) << size;
+    if (size > 0) {
+      EXPECT_EQ(copy.get("k0").intValue(), 100);
+    }
+  }
+  // Asked for less room than the original holds: a whole copy all the same.
+  Dictionary three{{"a", 1}, {"b", 2}, {"c", 3}};
+  EXPECT_EQ(Dictionary(three, 1), three);
 }
 
 TEST(CryptoTest, Base64IgnoresForeignCharactersAndRejectsTruncation) {

@@ -1,0 +1,195 @@
+// The daemon's own work per event, in one process, with the allocations it
+// makes (every malloc, calloc and realloc of the process, libplist's and
+// libstdc++'s included, counted by a pass-through to glibc's allocator):
+// - a client's event frame decoded (structural check, libplist, value
+//   tree, the message's checks), beside nlohmann-json parsing the same event
+//   as one JSON line, what a log pipeline does per event;
+// - 50 events made records by the HTTPS backend (payload copy, its keys,
+//   user info, filters) and written as one envelope, beside nlohmann-json
+//   dumping an envelope of the same 50 records already built as its objects.
+// The event is the end-to-end pipeline benchmark's (bench/pipeline).
+
+#include <benchmark/benchmark.h>
+#include <sys/time.h>
+
+#include <atomic>
+#include <cstdlib>
+#include <string>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+#include "backends/HTTPSPostBackend.h"
+#include "bench/pipeline/BenchEvent.h"
+#include "config/DeviceInfo.h"
+#include "zerith/ZerithConstants.h"
+#include "ipc/ClientSessionWire.h"
+#include "ipc/Frame.h"
+#include "platform/Defaults.h"
+#include "platform/Json.h"
+#include "tests/support/TempRoot.h"
+
+// ---- allocation count ----------------------------------------------------------
+
+namespace {
+std::atomic<std::uint64_t> allocations{0};
+}  // namespace
+
+extern "C" {
+void* __libc_malloc(std::size_t size);
+void* __libc_calloc(std::size_t n, std::size_t size);
+void* __libc_realloc(void* p, std::size_t size);
+void __libc_free(void* p);
+
+void* malloc(std::size_t size) {
+  allocations.fetch_add(1, std::memory_order_relaxed);
+  return __libc_malloc(size);
+}
+void* calloc(std::size_t n, std::size_t size) {
+  allocations.fetch_add(1, std::memory_order_relaxed);
+  return __libc_calloc(n, size);
+}
+void* realloc(void* p, std::size_t size) {
+  allocations.fetch_add(1, std::memory_order_relaxed);
+  return __libc_realloc(p, size);
+}
+void free(void* p) { __libc_free(p); }
+}
+
+namespace {
+
+using namespace zerith;
+
+constexpr int kEvents = 64;
+constexpr int kBatch = 50;
+
+Value message(std::uint64_t id) {
+  return Value(Dictionary{{kZerithMessageParametersCategory, Value(unsigned{bench::kEventCategory})},
+                          {kZerithMessageParametersType, Value(unsigned{bench::kEventType})},
+                          {kZerithMessageParametersPayload, bench::eventPayload(id)}});
+}
+
+void countAllocations(benchmark::State& state, std::uint64_t before, std::uint64_t events) {
+  state.counters["allocs/event"] =
+      static_cast<double>(allocations.load() - before) / static_cast<double>(events);
+}
+
+void BM_EventFrameDecode(benchmark::State& state) {
+  std::vector<Data> frames;
+  for (int i = 0; i < kEvents; ++i) {
+    frames.push_back(ipc::encodeCall(ipc::wire::kSendMessage, static_cast<std::uint64_t>(i + 1),
+                                     ipc::wire::sendMessageArgs(message(static_cast<std::uint64_t>(i)))));
+  }
+  std::size_t i = 0;
+  const std::uint64_t before = allocations.load();
+  for (auto _ : state) {
+    const Data& frame = frames[i++ % frames.size()];
+    auto decoded = ipc::decodeMessage(plist::Bytes(frame.data() + ipc::kFrameHeaderBytes,
+                                                   frame.size() - ipc::kFrameHeaderBytes));
+    if (!decoded) {
+      state.SkipWithError("an event frame did not decode");
+      break;
+    }
+    benchmark::DoNotOptimize(decoded);
+  }
+  countAllocations(state, before, state.iterations());
+  state.SetItemsProcessed(state.iterations());
+}
+
+void BM_ReferenceJsonLineParse(benchmark::State& state) {
+  std::vector<std::string> lines;
+  for (int i = 0; i < kEvents; ++i) {
+    lines.push_back(bench::eventJsonLine(static_cast<std::uint64_t>(i)));
+  }
+  std::size_t i = 0;
+  const std::uint64_t before = allocations.load();
+  for (auto _ : state) {
+    auto parsed = nlohmann::json::parse(lines[i++ % lines.size()]);
+    benchmark::DoNotOptimize(parsed);
+  }
+  countAllocations(state, before, state.iterations());
+  state.SetItemsProcessed(state.iterations());
+}
+
+// The backend as the pipeline benchmark's storebag makes it: batching, a
+// user info dictionary, no filters that match the event.
+std::shared_ptr<HTTPSPostBackend> makeBackend() {
+  Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(true));
+  const Value client(Dictionary{{"post_url", "https://127.0.0.1:1/"}, {"event_threshold", 49}});
+  auto b = HTTPSPostBackend::initWithName("httpsPost", Value(Dictionary{{"clients", Array{client}}}), std::string("Bench"));
+  b->setCompType(7);
+  b->setSessionID(1234);
+  b->setClientVersion(3);
+  b->setProductVersion("12.4");
+  b->setBuildVersion("Z1234");
+  b->setHardwareType("Board9,1");
+  b->setSelfVersion("8.1.0");
+  b->setBatchEvents(true);
+  b->setUserInfoDict(Value(Dictionary{{"clientName", "demo"}, {"serviceName", "cli"}}));
+  timeval start{};
+  gettimeofday(&start, nullptr);
+  b->setStartTimestamp(start);
+  b->updateState();
+  return b;
+}
+
+void BM_RecordsAndEnvelopeOf50(benchmark::State& state) {
+  test::TempRoot root;
+  auto b = makeBackend();
+  std::vector<Value> messages;
+  for (int i = 0; i < kBatch; ++i) {
+    messages.push_back(message(static_cast<std::uint64_t>(i)));
+  }
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  std::size_t bytes = 0;
+  const std::uint64_t before = allocations.load();
+  for (auto _ : state) {
+    std::vector<Dictionary> records;
+    records.reserve(kBatch);
+    for (const Value& m : messages) {
+      Dictionary record = b->newEventDictfromPayload(m[kZerithMessageParametersPayload], now, 42, 7, 1);
+      b->prepareEventForMessage(record, Value());
+      records.push_back(std::move(record));
+    }
+    const auto body = b->createMessageForPostAndLogging(std::move(records), nullptr);
+    bytes += body->size();
+    benchmark::DoNotOptimize(body);
+  }
+  countAllocations(state, before, state.iterations() * kBatch);
+  state.SetItemsProcessed(state.iterations() * kBatch);
+  state.counters["envelope bytes"] = static_cast<double>(bytes) / static_cast<double>(state.iterations());
+}
+
+// The floor of the envelope: the same 50 records, already nlohmann objects
+// with the same keys and values, dumped.
+void BM_ReferenceEnvelopeDump(benchmark::State& state) {
+  test::TempRoot root;
+  auto b = makeBackend();
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  std::vector<Dictionary> records;
+  for (int i = 0; i < kBatch; ++i) {
+    Dictionary record = b->newEventDictfromPayload(message(static_cast<std::uint64_t>(i))[kZerithMessageParametersPayload],
+                                                   now, 42, 7, 1);
+    b->prepareEventForMessage(record, Value());
+    records.push_back(std::move(record));
+  }
+  const auto envelope = nlohmann::ordered_json::parse(*b->createMessageForPostAndLogging(std::move(records), nullptr));
+  const std::uint64_t before = allocations.load();
+  for (auto _ : state) {
+    const std::string body = envelope.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+    benchmark::DoNotOptimize(body);
+  }
+  countAllocations(state, before, state.iterations() * kBatch);
+  state.SetItemsProcessed(state.iterations() * kBatch);
+}
+
+}  // namespace
+
+BENCHMARK(BM_EventFrameDecode);
+BENCHMARK(BM_ReferenceJsonLineParse);
+BENCHMARK(BM_RecordsAndEnvelopeOf50);
+BENCHMARK(BM_ReferenceEnvelopeDump);
+
+BENCHMARK_MAIN();
