@@ -189,10 +189,21 @@ class EmptyReplyTemplate {
   std::size_t numberAt_ = 0;
 };
 
+// No argument with a value: a property list has no nil, so the reply is
+// written without them (an accepted event's answer is {"result": nil}).
+bool carriesNothing(const Dictionary& args) {
+  for (const auto& [key, value] : args) {
+    if (!value.isNil()) {
+      return false;
+    }
+  }
+  return true;
+}
+
 }  // namespace
 
 Data encodeReply(std::uint64_t call, const Dictionary& args) {
-  if (args.empty()) {
+  if (carriesNothing(args)) {
     static const EmptyReplyTemplate kEmptyReply;
     if (auto frame = kEmptyReply.reply(call)) {
       return std::move(*frame);

@@ -83,6 +83,10 @@ TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
     EXPECT_TRUE(m->replyArgs.empty());
     EXPECT_FALSE(m->replyError);
   }
+  // Arguments without a value are left out, as libplist leaves them out.
+  const Dictionary nils{{"result", Value()}, {"error", Value()}};
+  EXPECT_EQ(encodeReply(wide, nils),
+            encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(wide))}, {"args", Value(nils)}})));
   // Replies with arguments are still written whole.
   const Data frame = encodeReply(7, Dictionary{{"result", "r"}});
   const auto withArgs = decodeMessage(plist::Bytes(frame.data() + 4, frame.size() - 4));
