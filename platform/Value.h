@@ -57,10 +57,6 @@ class Dictionary {
   // A copy of `other` with room for `capacity` entries, for a builder that
   // will add to the copy and knows how much.
   Dictionary(const Dictionary& other, std::size_t capacity);
-  Dictionary(const Dictionary&) = default;
-  Dictionary(Dictionary&&) noexcept = default;
-  Dictionary& operator=(const Dictionary&) = default;
-  Dictionary& operator=(Dictionary&&) noexcept = default;
 
   // nullptr when absent.
   const Value* find(std::string_view key) const ZERITH_LIFETIMEBOUND;
@@ -74,7 +70,7 @@ class Dictionary {
   void clear();
   // Room for `count` entries without growing again (a builder that knows its
   // final size).
-  void reserve(std::size_t count) { entries_.reserve(count); }
+  void reserve(std::size_t count);
 
   // Defined below Value: until Value is complete, clang cannot instantiate
   // the entries' members.
@@ -190,6 +186,7 @@ class Value {
 
 inline std::size_t Dictionary::size() const { return entries_.size(); }
 inline bool Dictionary::empty() const { return entries_.empty(); }
+inline void Dictionary::reserve(std::size_t count) { entries_.reserve(count); }
 inline std::vector<Dictionary::Entry>::const_iterator Dictionary::begin() const { return entries_.begin(); }
 inline std::vector<Dictionary::Entry>::const_iterator Dictionary::end() const { return entries_.end(); }
 
