@@ -4,6 +4,7 @@
 // - a client's event frame decoded (structural check, libplist, value
 //   tree, the message's checks), beside nlohmann-json parsing the same event
 //   as one JSON line, what a log pipeline does per event;
+// - the daemon's answer to an event (a reply frame with empty arguments);
 // - 50 events made records by the HTTPS backend (payload copy, its keys,
 //   user info, filters) and written as one envelope, beside nlohmann-json
 //   dumping an envelope of the same 50 records already built as its objects.
@@ -33,6 +34,7 @@
 
 namespace {
 std::atomic<std::uint64_t> allocations{0};
+std::atomic<std::uint64_t> allocatedBytes{0};
 }  // namespace
 
 extern "C" {
@@ -43,14 +45,17 @@ void __libc_free(void* p);
 
 void* malloc(std::size_t size) {
   allocations.fetch_add(1, std::memory_order_relaxed);
+  allocatedBytes.fetch_add(size, std::memory_order_relaxed);
   return __libc_malloc(size);
 }
 void* calloc(std::size_t n, std::size_t size) {
   allocations.fetch_add(1, std::memory_order_relaxed);
+  allocatedBytes.fetch_add(n * size, std::memory_order_relaxed);
   return __libc_calloc(n, size);
 }
 void* realloc(void* p, std::size_t size) {
   allocations.fetch_add(1, std::memory_order_relaxed);
+  allocatedBytes.fetch_add(size, std::memory_order_relaxed);
   return __libc_realloc(p, size);
 }
 void free(void* p) { __libc_free(p); }
@@ -69,9 +74,15 @@ Value message(std::uint64_t id) {
                           {kZerithMessageParametersPayload, bench::eventPayload(id)}});
 }
 
-void countAllocations(benchmark::State& state, std::uint64_t before, std::uint64_t events) {
-  state.counters["allocs/event"] =
-      static_cast<double>(allocations.load() - before) / static_cast<double>(events);
+struct AllocationCount {
+  std::uint64_t calls = allocations.load();
+  std::uint64_t bytes = allocatedBytes.load();
+};
+
+void countAllocations(benchmark::State& state, const AllocationCount& before, std::uint64_t events) {
+  state.counters["allocs/event"] = static_cast<double>(allocations.load() - before.calls) / static_cast<double>(events);
+  state.counters["alloc bytes/event"] =
+      static_cast<double>(allocatedBytes.load() - before.bytes) / static_cast<double>(events);
 }
 
 void BM_EventFrameDecode(benchmark::State& state) {
@@ -81,7 +92,7 @@ void BM_EventFrameDecode(benchmark::State& state) {
                                      ipc::wire::sendMessageArgs(message(static_cast<std::uint64_t>(i)))));
   }
   std::size_t i = 0;
-  const std::uint64_t before = allocations.load();
+  const AllocationCount before;
   for (auto _ : state) {
     const Data& frame = frames[i++ % frames.size()];
     auto decoded = ipc::decodeMessage(plist::Bytes(frame.data() + ipc::kFrameHeaderBytes,
@@ -96,13 +107,29 @@ void BM_EventFrameDecode(benchmark::State& state) {
   state.SetItemsProcessed(state.iterations());
 }
 
+// The answer to an event whose backends batched it: no result, no error.
+void BM_EventReplyEncode(benchmark::State& state) {
+  const Dictionary args{{"result", Value()}, {"error", Value()}};
+  std::uint64_t call = 1;
+  std::size_t bytes = 0;
+  const AllocationCount before;
+  for (auto _ : state) {
+    const Data frame = ipc::encodeReply(call++, args);
+    bytes += frame.size();
+    benchmark::DoNotOptimize(frame);
+  }
+  countAllocations(state, before, state.iterations());
+  state.SetItemsProcessed(state.iterations());
+  state.counters["frame bytes"] = static_cast<double>(bytes) / static_cast<double>(state.iterations());
+}
+
 void BM_ReferenceJsonLineParse(benchmark::State& state) {
   std::vector<std::string> lines;
   for (int i = 0; i < kEvents; ++i) {
     lines.push_back(bench::eventJsonLine(static_cast<std::uint64_t>(i)));
   }
   std::size_t i = 0;
-  const std::uint64_t before = allocations.load();
+  const AllocationCount before;
   for (auto _ : state) {
     auto parsed = nlohmann::json::parse(lines[i++ % lines.size()]);
     benchmark::DoNotOptimize(parsed);
@@ -143,7 +170,7 @@ void BM_RecordsAndEnvelopeOf50(benchmark::State& state) {
   timeval now{};
   gettimeofday(&now, nullptr);
   std::size_t bytes = 0;
-  const std::uint64_t before = allocations.load();
+  const AllocationCount before;
   for (auto _ : state) {
     std::vector<Dictionary> records;
     records.reserve(kBatch);
@@ -176,7 +203,7 @@ void BM_ReferenceEnvelopeDump(benchmark::State& state) {
     records.push_back(std::move(record));
   }
   const auto envelope = nlohmann::ordered_json::parse(*b->createMessageForPostAndLogging(std::move(records), nullptr));
-  const std::uint64_t before = allocations.load();
+  const AllocationCount before;
   for (auto _ : state) {
     const std::string body = envelope.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
     benchmark::DoNotOptimize(body);
@@ -188,6 +215,7 @@ void BM_ReferenceEnvelopeDump(benchmark::State& state) {
 }  // namespace
 
 BENCHMARK(BM_EventFrameDecode);
+BENCHMARK(BM_EventReplyEncode);
 BENCHMARK(BM_ReferenceJsonLineParse);
 BENCHMARK(BM_RecordsAndEnvelopeOf50);
 BENCHMARK(BM_ReferenceEnvelopeDump);
