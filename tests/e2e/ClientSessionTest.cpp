@@ -171,11 +171,13 @@ TEST_F(ClientSessionTest, RefusedClientSeesItsCallsFailAndItsConnectionEnd) {
 }
 
 TEST_F(ClientSessionTest, AggregatingRootEndsItsChildsAggregationOverTheChildsConnection) {
+  // What the message handler touches outlives the clients: a message may
+  // arrive while they are being torn down.
+  std::promise<Dictionary> received;
+  std::atomic<int> messages{0};
   auto root = connect();
   auto child = connect();
   ASSERT_TRUE(root && child);
-  std::promise<Dictionary> received;
-  std::atomic<int> messages{0};
   child->setMessageHandler([&](const Value& message, double timestamp, std::uint16_t category, std::uint16_t type,
                                const Value& payload) {
     if (messages++ == 0) {

@@ -163,12 +163,14 @@ class SessionsTogetherTest : public E2eTest {
 };
 
 TEST_F(SessionsTogetherTest, ThreeLevelsShareStatesIdentifiersDataAndTheRootsAggregator) {
+  // Declared before the clients, so that they outlive them: the daemon
+  // still sends to the root's aggregation block while the grandchild ends.
+  Aggregated atRoot;
+  Aggregated atGrandchild;
   auto root = connect();
   auto child = connect();
   auto grandchild = connect();
   ASSERT_TRUE(root && child && grandchild);
-  Aggregated atRoot;
-  Aggregated atGrandchild;
   atRoot.attach(*root);
   atGrandchild.attach(*grandchild);
   start(*root, hierarchy(1, "call-1", 0), /*aggregator=*/true);

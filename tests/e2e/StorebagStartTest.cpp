@@ -59,10 +59,11 @@ class StorebagStartTest : public E2eTest {
 
 TEST_F(StorebagStartTest, SignedStorebagStartsTheSessionAndItsStartMessageReachesTheAggregator) {
   start(/*trustTestCA=*/true);
-  auto client = Zerith::connect();
-  ASSERT_TRUE(client);
+  // What the message handler touches outlives the client.
   std::promise<Dictionary> startMessage;
   std::atomic<int> messages{0};
+  auto client = Zerith::connect();
+  ASSERT_TRUE(client);
   client->setMessageHandler([&](const Value& message, double, std::uint16_t category, std::uint16_t type,
                                 const Value& payload) {
     if (messages++ == 0) {
