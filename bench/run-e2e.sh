@@ -11,11 +11,13 @@
 # spool on and the collector down for 1,000,000 events, then up (backlog
 # spooled and drained). Every run checks
 # that each event arrived exactly once and prints "NOT lossless" otherwise.
+# Last, the library floor: libplist, nlohmann, zlib and libcurl alone on one
+# event's share of the work (ipc_bench, https_bench).
 # Set QUICK=1 for shorter runs (a tenth of the events, 10 s idle).
 set -euo pipefail
 build="${1:-build/release}"
 bench="$build/bench/e2e_pipeline_bench"
-ninja -C "$build" e2e_pipeline_bench zerithd >/dev/null
+ninja -C "$build" e2e_pipeline_bench zerithd ipc_bench https_bench >/dev/null
 scale=1
 idle=60
 if [ "${QUICK:-0}" = 1 ]; then scale=10; idle=10; fi
@@ -40,5 +42,14 @@ run --clients 1 --events 1000 --memory-sample 0 --idle-seconds "$idle" --idle-se
 # The spool: a backlog of 1,000,000 events built while the collector is down,
 # then drained, beside a normal zerithd run of the same load.
 run --pipelines zerithd --clients 8 --events $((1000000 / scale)) --memory-sample 0 --spool-outage
+# The library floor of one event in the same run: what libplist, nlohmann,
+# zlib and libcurl take on their own for the work the design gives them
+# (medians of three, CPU time per event).
+echo
+echo "## the library floor of one event"
+floor=(--benchmark_repetitions=3 --benchmark_report_aggregates_only=true)
+"$build/bench/ipc_bench" --benchmark_filter='OfAnEvent|EmptyReply' "${floor[@]}" 2>/dev/null | grep _median
+"$build/bench/https_bench" --benchmark_filter='ReferenceNlohmannRecord|ReferenceZlib|ReferenceCurl' "${floor[@]}" 2>/dev/null |
+  grep _median
 echo
 echo "load average after: $(cut -d' ' -f1-3 /proc/loadavg)"
