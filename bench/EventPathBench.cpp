@@ -21,6 +21,7 @@
 #include <nlohmann/json.hpp>
 
 #include "backends/HTTPSPostBackend.h"
+#include "bench/BenchBackend.h"
 #include "bench/pipeline/BenchEvent.h"
 #include "config/DeviceInfo.h"
 #include "zerith/ZerithConstants.h"
@@ -141,21 +142,7 @@ void BM_ReferenceJsonLineParse(benchmark::State& state) {
 // The backend as the pipeline benchmark's storebag makes it: batching, a
 // user info dictionary, no filters that match the event.
 std::shared_ptr<HTTPSPostBackend> makeBackend() {
-  Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(true));
-  const Value client(Dictionary{{"post_url", "https://127.0.0.1:1/"}, {"event_threshold", 49}});
-  auto b = HTTPSPostBackend::initWithName("httpsPost", Value(Dictionary{{"clients", Array{client}}}), std::string("Bench"));
-  b->setCompType(7);
-  b->setSessionID(1234);
-  b->setClientVersion(3);
-  b->setProductVersion("12.4");
-  b->setBuildVersion("Z1234");
-  b->setHardwareType("Board9,1");
-  b->setSelfVersion("8.1.0");
-  b->setBatchEvents(true);
-  b->setUserInfoDict(Value(Dictionary{{"clientName", "demo"}, {"serviceName", "cli"}}));
-  timeval start{};
-  gettimeofday(&start, nullptr);
-  b->setStartTimestamp(start);
+  auto b = bench::makeBenchBackend(Value(Dictionary{{"post_url", "https://127.0.0.1:1/"}, {"event_threshold", 49}}));
   b->updateState();
   return b;
 }

@@ -20,6 +20,7 @@
 #include <nlohmann/json.hpp>
 
 #include "backends/HTTPSPostBackend.h"
+#include "bench/BenchBackend.h"
 #include "config/Compression.h"
 #include "config/DeviceInfo.h"
 #include "platform/Crypto.h"
@@ -51,28 +52,14 @@ Value payload(int n) {
 
 std::shared_ptr<HTTPSPostBackend> makeBackend(const std::string& postURL,
                                               std::shared_ptr<ReportingSessionConnectivityInterface> transport) {
-  Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(true));
-  const Value client(Dictionary{{"post_url", postURL},
-                                {"event_threshold", 1000},
-                                {"filters", Array{Value(Dictionary{{"key", "udid"}, {"action", "sha256"}})}}});
-  auto b = HTTPSPostBackend::initWithName("httpsPost", Value(Dictionary{{"clients", Array{client}}}), std::string("Bench"));
-  b->setCompType(7);
-  b->setSessionID(1234);
-  b->setClientVersion(3);
-  b->setProductVersion("12.4");
-  b->setBuildVersion("Z1234");
-  b->setHardwareType("Board9,1");
-  b->setSelfVersion("8.1.0");
-  b->setBatchEvents(true);
-  b->setUserInfoDict(Value(Dictionary{{"clientName", "demo"}, {"serviceName", "cli"}}));
+  const Value udidFilters(Array{Value(Dictionary{{"key", "udid"}, {"action", "sha256"}})});
+  auto b = bench::makeBenchBackend(
+      Value(Dictionary{{"post_url", postURL}, {"event_threshold", 1000}, {"filters", udidFilters}}));
   b->setDigestKey(Data{'k', 'e', 'y'});
-  timeval start{};
-  gettimeofday(&start, nullptr);
-  b->setStartTimestamp(start);
   b->setReportingSessionConnectivityDelegate(std::move(transport));
   b->updateState();
   // The filter list is read on the checked path only; set it directly.
-  b->createFiltersFromArray(Value(Array{Value(Dictionary{{"key", "udid"}, {"action", "sha256"}})}));
+  b->createFiltersFromArray(udidFilters);
   return b;
 }
 

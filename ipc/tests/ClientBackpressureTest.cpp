@@ -127,14 +127,22 @@ struct EventWriter {
   }
 };
 
+// Far more one-way events than the kernel's socket buffers and the outbox's
+// mark take.
+constexpr int kHeldBackEvents = 1500;
+
+// True once the client end's writer is held back at the outbox mark.
+bool writerHeldBack(log::LogCapture& capture, const ClientEnd& end) {
+  return capture.waitFor(end.connection->description() + ": peer does not read (");
+}
+
 TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAndAllArriveOnceItReads) {
   log::LogCapture capture;
   ClientEnd end;
   ASSERT_TRUE(end.connection);
-  // Far more than the kernel's socket buffers and the outbox's mark take.
-  constexpr int kEvents = 1500;
+  constexpr int kEvents = kHeldBackEvents;
   EventWriter writer(*end.connection, kEvents);
-  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  ASSERT_TRUE(writerHeldBack(capture, end));
   EXPECT_LT(writer.sent.load(), kEvents) << "the writer was not held back";
   const std::size_t frame = encodeCall("event", std::nullopt, Dictionary{{"n", 0}, {"pad", Value(eventArgsPad())}}).size();
   EXPECT_GT(end.connection->queuedBytes(), kPause);
@@ -159,8 +167,8 @@ TEST_F(ClientBackpressure, ABlockOfTheConnectionsQueueNeverWaits) {
   log::LogCapture capture;
   ClientEnd end;
   ASSERT_TRUE(end.connection);
-  EventWriter writer(*end.connection, 1500);
-  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  EventWriter writer(*end.connection, kHeldBackEvents);
+  ASSERT_TRUE(writerHeldBack(capture, end));
   // Over the mark, nothing read: a block of the connection's own queue still
   // gets its frame queued and goes on.
   Counter fromQueue;
@@ -189,8 +197,8 @@ TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
       answered.hit();
     });
   }
-  EventWriter writer(*end.connection, 1500);
-  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  EventWriter writer(*end.connection, kHeldBackEvents);
+  ASSERT_TRUE(writerHeldBack(capture, end));
   const Data replies = concat({encodeReply(1, Dictionary{}), encodeReply(2, Dictionary{}), encodeReply(3, Dictionary{})});
   ASSERT_EQ(::send(end.raw.get(), replies.data(), replies.size(), MSG_NOSIGNAL), static_cast<ssize_t>(replies.size()));
   EXPECT_TRUE(answered.waitFor(3)) << "the client stopped reading because its own outbox was full";
@@ -207,9 +215,9 @@ TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtO
   log::LogCapture capture;
   ClientEnd end;
   ASSERT_TRUE(end.connection);
-  constexpr int kEvents = 1500;
+  constexpr int kEvents = kHeldBackEvents;
   EventWriter writer(*end.connection, kEvents);
-  ASSERT_TRUE(capture.waitFor(end.connection->description() + ": peer does not read ("));
+  ASSERT_TRUE(writerHeldBack(capture, end));
   const int before = writer.sent.load();
   ASSERT_LT(before, kEvents);
   if (GetParam()) {
