@@ -190,6 +190,24 @@ class E2eTest : public ::testing::Test {
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
   }
 
+  // The collector tests' storebag: one HTTPS backend for the demo client,
+  // posting to `postURL`, admitted for the GB locale, every event sampled in
+  // and the device identifier hashed; `extra` adds or replaces entries.
+  static Value collectorStorebag(const std::string& postURL, const Dictionary& extra = {}) {
+    Dictionary client{{"client", "demo"},
+                      {"service", "cli"},
+                      {"override_dnu", 1},
+                      {"locale_whitelist", Array{Value("GB")}},
+                      {"filters", Array{Value(Dictionary{{"key", "udid"}, {"action", "sha256"}})}},
+                      {"sampling_threshold", 1.0},
+                      {"post_url", postURL}};
+    for (const auto& [key, value] : extra) {
+      client.set(key, value);
+    }
+    const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{Value(std::move(client))}}}}});
+    return Value(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
+  }
+
   // A daemon that trusts the CA a collector made in `certs` and reads its
   // locale as British (the collector tests' storebags admit only GB).
   static DaemonProcess::Options collectorDaemonOptions(const std::filesystem::path& certs) {

@@ -32,15 +32,7 @@ class HTTPSCollectorTest : public E2eTest {
                                                         "--status", std::to_string(status)});
     ASSERT_GT(collector->port(), 0) << collector->said();
 
-    const Value client(Dictionary{{"client", "demo"},
-                                  {"service", "cli"},
-                                  {"override_dnu", 1},
-                                  {"locale_whitelist", Array{Value("GB")}},
-                                  {"filters", Array{Value(Dictionary{{"key", "udid"}, {"action", "sha256"}})}},
-                                  {"sampling_threshold", 1.0},
-                                  {"post_url", collector->url("/post")}});
-    const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{client}}}}});
-    const Value bag(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
+    const Value bag = collectorStorebag(collector->url("/post"));
     publishSignedStorebag(bag, www, collector->url("/zerith"));
     startDaemon(collectorDaemonOptions(certs));
   }

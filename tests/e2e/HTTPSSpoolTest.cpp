@@ -47,17 +47,8 @@ class HTTPSSpoolTest : public E2eTest {
                                                         "--drop-duplicates"});
     ASSERT_GT(collector->port(), 0) << collector->said();
 
-    const Value client(Dictionary{{"client", "demo"},
-                                  {"service", "cli"},
-                                  {"expedite", 0},  // events wait for the flush: one post per batch
-                                  {"event_threshold", 100},
-                                  {"override_dnu", 1},
-                                  {"locale_whitelist", Array{Value("GB")}},
-                                  {"filters", Array{Value(Dictionary{{"key", "udid"}, {"action", "sha256"}})}},
-                                  {"sampling_threshold", 1.0},
-                                  {"post_url", collector->url("/post")}});
-    const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{client}}}}});
-    const Value bag(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
+    // Events wait for the flush: one post per batch.
+    const Value bag = collectorStorebag(collector->url("/post"), Dictionary{{"expedite", 0}, {"event_threshold", 100}});
     publishSignedStorebag(bag, www, collector->url("/zerith"));
     startDaemon(daemonOptions());
   }
