@@ -14,6 +14,7 @@
 #include <cstring>
 #include <filesystem>
 #include <future>
+#include <memory>
 #include <thread>
 
 #include "ipc/SocketConnection.h"
@@ -136,13 +137,28 @@ bool writerHeldBack(log::LogCapture& capture, const ClientEnd& end) {
   return capture.waitFor(end.connection->description() + ": peer does not read (");
 }
 
-TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAndAllArriveOnceItReads) {
+// A client end whose writer sends kHeldBackEvents one-way events to a daemon
+// end that reads nothing.
+struct HeldBackWriter {
   log::LogCapture capture;
   ClientEnd end;
-  ASSERT_TRUE(end.connection);
+  std::unique_ptr<EventWriter> writer;
+
+  HeldBackWriter() {
+    if (end.connection) {
+      writer = std::make_unique<EventWriter>(*end.connection, kHeldBackEvents);
+    }
+  }
+  // True once the writer waits at the outbox mark.
+  bool held() { return writer && writerHeldBack(capture, end); }
+};
+
+TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAndAllArriveOnceItReads) {
+  HeldBackWriter held;
+  ASSERT_TRUE(held.held());
+  ClientEnd& end = held.end;
+  EventWriter& writer = *held.writer;
   constexpr int kEvents = kHeldBackEvents;
-  EventWriter writer(*end.connection, kEvents);
-  ASSERT_TRUE(writerHeldBack(capture, end));
   EXPECT_LT(writer.sent.load(), kEvents) << "the writer was not held back";
   const std::size_t frame = encodeCall("event", std::nullopt, Dictionary{{"n", 0}, {"pad", Value(eventArgsPad())}}).size();
   EXPECT_GT(end.connection->queuedBytes(), kPause);
@@ -160,15 +176,13 @@ TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAnd
   EXPECT_LE(writer.mostQueued.load(), kPause + frame + 16) << "the outbox grew past its mark";
   EXPECT_EQ(end.connection->queuedBytes(), 0u);
   EXPECT_FALSE(end.connection->isInvalidated());
-  EXPECT_FALSE(capture.contains("closing connection"));
+  EXPECT_FALSE(held.capture.contains("closing connection"));
 }
 
 TEST_F(ClientBackpressure, ABlockOfTheConnectionsQueueNeverWaits) {
-  log::LogCapture capture;
-  ClientEnd end;
-  ASSERT_TRUE(end.connection);
-  EventWriter writer(*end.connection, kHeldBackEvents);
-  ASSERT_TRUE(writerHeldBack(capture, end));
+  HeldBackWriter held;
+  ASSERT_TRUE(held.held());
+  ClientEnd& end = held.end;
   // Over the mark, nothing read: a block of the connection's own queue still
   // gets its frame queued and goes on.
   Counter fromQueue;
@@ -212,12 +226,11 @@ TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
 class ClientBackpressureRelease : public ClientBackpressure, public ::testing::WithParamInterface<bool> {};
 
 TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtOnce) {
-  log::LogCapture capture;
-  ClientEnd end;
-  ASSERT_TRUE(end.connection);
+  HeldBackWriter held;
+  ASSERT_TRUE(held.held());
+  ClientEnd& end = held.end;
+  EventWriter& writer = *held.writer;
   constexpr int kEvents = kHeldBackEvents;
-  EventWriter writer(*end.connection, kEvents);
-  ASSERT_TRUE(writerHeldBack(capture, end));
   const int before = writer.sent.load();
   ASSERT_LT(before, kEvents);
   if (GetParam()) {
