@@ -386,11 +386,14 @@ class Runner {
   std::ostream& out_;
   SessionOptions o_;
   std::chrono::milliseconds timeout_;
-  std::unique_ptr<Zerith> session_;
   Value sessionInfo_;
   Value userInfo_;
   bool answered_ = false;
   std::mutex outMutex_;
+  // Last, so that it goes first: its message handler prints through out_ and
+  // outMutex_, and a message can still arrive while it is torn down (a step
+  // that failed leaves it open).
+  std::unique_ptr<Zerith> session_;
 };
 
 // Edit distance, for "did you mean" hints on misspelt words.
