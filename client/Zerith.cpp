@@ -40,9 +40,13 @@ class Dispatcher final : public ClientSessionReplyInterface {
       messageHandler_(message, timestamp, category, type, payload);
     }
   }
+  // The end of the connection reaches a handler once, however it is told:
+  // the connection's own end, or a handler set after the end began (which
+  // can race with the connection's end being delivered).
   void invalidated() {
     std::lock_guard lock(mutex_);
-    if (invalidationHandler_) {
+    if (invalidationHandler_ && !endDelivered_) {
+      endDelivered_ = true;
       invalidationHandler_();
     }
   }
@@ -53,6 +57,7 @@ class Dispatcher final : public ClientSessionReplyInterface {
   void setInvalidationHandler(std::function<void()> handler) {
     std::lock_guard lock(mutex_);
     invalidationHandler_ = std::move(handler);
+    endDelivered_ = false;
   }
   // Waits for a handler that is running (unless the caller is that
   // handler) and drops both.
@@ -66,6 +71,7 @@ class Dispatcher final : public ClientSessionReplyInterface {
   std::recursive_mutex mutex_;
   Zerith::MessageHandler messageHandler_;
   std::function<void()> invalidationHandler_;
+  bool endDelivered_ = false;  // to the handler set now
 };
 
 }  // namespace
