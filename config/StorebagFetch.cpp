@@ -89,7 +89,7 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
   const auto helper = storebagHTTPHelper();
   const auto wait = synchronous ? std::make_shared<SynchronousFetch>() : nullptr;
   helper->getURLRequestWithCompletionHandler(
-      request, [name, wait](const Data& body, const std::optional<HTTPURLResponse>& response,
+      request, [name, url, wait](const Data& body, const std::optional<HTTPURLResponse>& response,
                             const std::optional<Error>& error) {
         // This runs on the helper's queue: what the verification below notes
         // belongs to no caller.
@@ -101,7 +101,7 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
             saveLastLoadedStorebagMetricsWithName(name, *response);
           }
           if (!body.empty()) {
-            parseAndVerifyStorebag(name, body, true);  // saves a verified copy; the caller reads it from disk
+            parseAndVerifyStorebag(name, body, true, StorebagSource{url});  // saves a verified copy; the caller reads it from disk
           } else {
             configLogger().debug("fetchNetworkStorebag: received zero-length storebag for '{}\u2018, treat as unchanged",
                            name);
@@ -149,9 +149,12 @@ Value fetchStorebagWithName(const std::string& name, std::int32_t& maxAgeOut, bo
 
   std::unique_lock lock(ZerithdUtil::lock());
   std::optional<Data> data = loadStorebagFromDisk(name);
+  // A body fetched here was checked (and counted) when it arrived.
+  StorebagSource source;
   if (!data) {
     lock.unlock();
     data = fetchNetworkStorebag(name, true, std::nullopt);
+    source = StorebagSource{storebagRequestURL(name), false};
   } else {
     getLastLoadedStorebagMetricsWithName(name, &maxAgeOut, &unchangedOut, &lastModified);
     const auto modified = storebagCacheModificationDate(name);
@@ -173,7 +176,7 @@ Value fetchStorebagWithName(const std::string& name, std::int32_t& maxAgeOut, bo
   if (unchangedOut || !data) {
     return Value();
   }
-  return parseAndVerifyStorebag(name, *data, false);
+  return parseAndVerifyStorebag(name, *data, false, source);
 }
 
 Value fetchStorebagForEnvironmentAndClientType(std::int32_t clientType, std::int32_t& maxAgeOut, Value& versionOut,

@@ -7,8 +7,16 @@
 // ignored). The decoded "bag" bytes are the storebag proper, signed with RSA
 // PKCS#1 v1.5 over their SHA-1 digest. The public key is the client
 // framework's "publicKey.der", read afresh at every verification.
+//
+// A container may carry a second signature over the same bag bytes,
+// "signature_ed25519" (base64 of an Ed25519 signature). It is required, and
+// checked, only when the framework also holds "publicKeyEd25519.der"; without
+// that file it is ignored.
 
+#include <atomic>
 #include <cstddef>
+#include <cstdint>
+#include <filesystem>
 #include <optional>
 #include <span>
 #include <string>
@@ -32,23 +40,63 @@ enum class StorebagVerifyStatus {
   BadSignatureText,   // "signature" does not decode
   BadBagText,         // "bag" is missing or does not decode
   SignatureMismatch,  // the signature does not cover the bag bytes with this key
+  // With an Ed25519 key installed:
+  BadStrongPublicKey,         // the Ed25519 key file is not an Ed25519 public key
+  StrongSignatureMissing,     // no "signature_ed25519" string
+  BadStrongSignatureText,     // "signature_ed25519" does not decode
+  StrongSignatureMismatch,    // it does not cover the bag bytes with this key
 };
+
+// The container's key of the second signature.
+inline constexpr const char* kStorebagStrongSignatureKey = "signature_ed25519";
 
 struct StorebagVerification {
   StorebagVerifyStatus status = StorebagVerifyStatus::NotAPropertyList;
   std::string parseError;  // the parser's reason when NotAPropertyList
-  std::string verifyError;  // OpenSSL's reason when SignatureMismatch
+  std::string verifyError;  // OpenSSL's reason when SignatureMismatch or StrongSignatureMismatch
   Data bagBytes;           // the signed bytes when Verified
 };
 
 // Checks a container against a DER public key (SubjectPublicKeyInfo or a
-// PKCS#1 RSAPublicKey). No logging, no files: the building block of
-// parseAndVerifyStorebag, the tool and the fuzz target.
+// PKCS#1 RSAPublicKey) and, when `ed25519KeyDER` is given, against that
+// Ed25519 key (SubjectPublicKeyInfo) as well: both signatures must then
+// verify. An XML container must end with its "</plist>" (white space aside),
+// as a binary one must end with its trailer. No logging, no files: the
+// building block of parseAndVerifyStorebag, the tool and the fuzz target.
 StorebagVerification verifyStorebagContainer(std::span<const std::uint8_t> container,
-                                             const std::optional<Data>& publicKeyDER);
+                                             const std::optional<Data>& publicKeyDER,
+                                             const std::optional<Data>& ed25519KeyDER = std::nullopt);
 
-// The decoded storebag proper of verified bag bytes: a dictionary, or nil.
-Value decodeStorebagBag(const Data& bagBytes);
+// What a refusal means, for the tool and the log ("the signature does not
+// match the bag under this public key (bad signature)").
+std::string describeStorebagRefusal(const StorebagVerification& verification);
+
+// The decoded storebag proper of verified bag bytes: a dictionary, or nil
+// with `why` ("the bag is an array, not a dictionary", the parser's reason).
+Value decodeStorebagBag(const Data& bagBytes, std::string* why = nullptr);
+
+// The framework's Ed25519 key: nullopt when "publicKeyEd25519.der" does not
+// exist (one signature is enough), its bytes otherwise (empty when it cannot
+// be read, which refuses every container).
+std::optional<Data> frameworkStrongPublicKey();
+std::filesystem::path frameworkStrongPublicKeyPath();
+
+// Refusals after a container verified, since the daemon started (`zerith
+// status` shows them).
+struct StorebagRefusalCounts {
+  std::atomic<std::uint64_t> rollbacks{0};          // issued before the newest accepted issue time
+  std::atomic<std::uint64_t> missingIssueTime{0};   // no issue time while one is required
+  std::atomic<std::uint64_t> unusable{0};           // the bag is no property list dictionary
+};
+StorebagRefusalCounts& storebagRefusalCounts();
+
+// Where a container came from: the log names it, and a container that was
+// already checked when it arrived is not counted again when its bytes are
+// read back.
+struct StorebagSource {
+  std::string where = "the disk cache";
+  bool counted = true;
+};
 
 // Why the latest storebag fetch of this thread came back empty ("HTTP
 // status 404", the TLS error, "signature can not be verified, bad
@@ -60,10 +108,14 @@ void clearStorebagFailure();
 // fallback refused).
 void noteStorebagFailure(const std::string& cause);
 
-// Parses and verifies a container with the framework's public key; when
-// `save` is set, a verified container is saved to the disk cache under
-// `name`. Returns the storebag proper (a dictionary) or nil, logging each
+// Parses and verifies a container with the framework's public key(s), then
+// checks its bag: a property list dictionary, with an issue time not older
+// than the newest one accepted for `name` (and with one at all when the
+// defaults require it). When `save` is set, a container that passes is saved
+// to the disk cache under `name`; one that verifies but is unusable is never
+// kept there. Returns the storebag proper (a dictionary) or nil, logging each
 // refusal.
-Value parseAndVerifyStorebag(const std::string& name, const Data& data, bool save);
+Value parseAndVerifyStorebag(const std::string& name, const Data& data, bool save,
+                             const StorebagSource& source = {});
 
 }  // namespace zerith

@@ -1,7 +1,6 @@
 #include "daemon/StorebagCache.h"
 
 #include <cmath>
-#include <ctime>
 #include <utility>
 
 #include <fmt/format.h>
@@ -10,6 +9,7 @@
 #include "config/Conversions.h"
 #include "config/StorebagDiskCache.h"
 #include "config/StorebagFetch.h"
+#include "config/StorebagIssueTimes.h"
 #include "config/StorebagVerify.h"
 #include "platform/Log.h"
 
@@ -35,16 +35,7 @@ constexpr const char* kFetchFailure = "Fetch Failure";
 constexpr int kRetryIntervalSeconds = 900;
 
 // A date as the system log shows dates: "2024-05-01 12:00:00 +0000".
-std::string describeDate(const std::optional<Date>& date) {
-  if (!date) {
-    return "(null)";
-  }
-  const auto seconds = static_cast<std::time_t>(std::floor(date->secondsSince1970));
-  std::tm tm{};
-  gmtime_r(&seconds, &tm);
-  return fmt::format("{:04}-{:02}-{:02} {:02}:{:02}:{:02} +0000", tm.tm_year + 1900, tm.tm_mon + 1, tm.tm_mday,
-                     tm.tm_hour, tm.tm_min, tm.tm_sec);
-}
+std::string describeDate(const std::optional<Date>& date) { return date ? describeIssueTime(*date) : "(null)"; }
 
 std::optional<std::string> nameForClientType(std::int32_t clientType) {
   return storebagNameForClientType(static_cast<ZerithClientType>(clientType));

@@ -2,7 +2,9 @@
 // the disk cache. Runs the structural check, the parser, base64 decoding and
 // the signature check against a fixed public key (the seeds in the corpus
 // are signed with its private key, so verified inputs reach the bag
-// decoder), and the bag decoder on the raw input as well.
+// decoder), and the bag decoder on the raw input as well. Each input is
+// checked twice: with the RSA key alone, and with the Ed25519 key too (the
+// "strong-" seeds carry that key's signature, so they reach its check).
 
 #include <cstddef>
 #include <cstdint>
@@ -39,6 +41,18 @@ const zerith::Data& corpusPublicKey() {
   return key;
 }
 
+// The public half of the Ed25519 key that signed the "strong-" seeds
+// (SubjectPublicKeyInfo).
+const zerith::Data& corpusEd25519Key() {
+  static const zerith::Data key = {
+    0x30, 0x2a, 0x30, 0x05, 0x06, 0x03, 0x2b, 0x65, 0x70, 0x03, 0x21, 0x00,
+    0x3b, 0x88, 0xba, 0x96, 0xca, 0x4c, 0x5b, 0xce, 0xc1, 0xe7, 0x49, 0x93,
+    0xd4, 0x29, 0x10, 0x69, 0x00, 0x6d, 0x5c, 0xff, 0xb4, 0x1e, 0x4e, 0xb1,
+    0xb7, 0x96, 0xea, 0x2d, 0x28, 0x55, 0x3b, 0x2d
+  };
+  return key;
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
@@ -46,6 +60,10 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   const auto result = zerith::verifyStorebagContainer(input, corpusPublicKey());
   if (result.status == zerith::StorebagVerifyStatus::Verified) {
     (void)zerith::decodeStorebagBag(result.bagBytes);
+  }
+  const auto strong = zerith::verifyStorebagContainer(input, corpusPublicKey(), corpusEd25519Key());
+  if (strong.status == zerith::StorebagVerifyStatus::Verified) {
+    (void)zerith::decodeStorebagBag(strong.bagBytes);
   }
   (void)zerith::decodeStorebagBag(zerith::Data(input.begin(), input.end()));
   return 0;

@@ -7,6 +7,7 @@
 #include <filesystem>
 
 #include "config/StorebagDiskCache.h"
+#include "config/StorebagIssueTimes.h"
 #include "config/StorebagVerify.h"
 #include "platform/FileUtil.h"
 #include "tests/support/TempRoot.h"
@@ -35,6 +36,19 @@ TEST(StorebagCorpus, ContainerInputsAreRefusedOrVerifiedWithoutCrashing) {
     const auto result = verifyStorebagContainer(*bytes, std::nullopt);
     EXPECT_NE(result.status, StorebagVerifyStatus::Verified) << path;
     (void)decodeStorebagBag(*bytes);
+  }
+}
+
+TEST(StorebagCorpus, IssueTimesInputsAreReadOrRefusedWithoutCrashing) {
+  const auto files = corpus("storebag_issue_times_fuzz");
+  ASSERT_FALSE(files.empty());
+  for (const auto& path : files) {
+    const auto bytes = file::readAll(path, kMaxStorebagIssueTimesBytes);
+    ASSERT_TRUE(bytes) << path;
+    std::string why;
+    if (!decodeStorebagIssueTimes(*bytes, &why)) {
+      EXPECT_FALSE(why.empty()) << path;
+    }
   }
 }
 

@@ -1,0 +1,243 @@
+// The checks a signed storebag passes beyond its RSA signature: the Ed25519
+// signature when its key is installed, an XML container that ends where it
+// ends, a usable bag, and an issue time not older than the newest accepted.
+
+#include <gtest/gtest.h>
+
+#include <functional>
+
+#include "config/StorebagIssueTimes.h"
+#include "config/StorebagVerify.h"
+#include "config/tests/StorebagTestFixture.h"
+#include "platform/Crypto.h"
+
+namespace zerith {
+namespace {
+
+using log::Level;
+using test::bytes;
+using test::sampleStorebag;
+using test::storebagKeys;
+using test::text;
+
+const StorebagKeyPair& ed25519Keys() {
+  static const StorebagKeyPair keys = *generateStorebagEd25519KeyPair();
+  return keys;
+}
+const StorebagKeyPair& otherEd25519Keys() {
+  static const StorebagKeyPair keys = *generateStorebagEd25519KeyPair();
+  return keys;
+}
+
+Data bagBytes(const std::string& version = "2.4.0") { return plist::encodeBinary(sampleStorebag(version)); }
+
+// A container whose Ed25519 signature, when there is one, is `strong`.
+Data container(const Data& bag, const std::optional<Data>& strong) {
+  const auto rsa = signStorebagBytes(storebagKeys().privateKeyPEM, bag);
+  return plist::encodeBinary(makeStorebagContainer(*rsa, bag, strong));
+}
+Data ed25519Signature(const Data& bag, const StorebagKeyPair& keys = ed25519Keys()) {
+  return *signStorebagBytes(keys.privateKeyPEM, bag, nullptr, /*ed25519=*/true);
+}
+
+struct StrongCase {
+  const char* name;
+  bool strongKeyInstalled;
+  std::function<Data()> make;
+  StorebagVerifyStatus expected;
+};
+
+class StrongSignature : public ::testing::TestWithParam<StrongCase> {};
+
+TEST_P(StrongSignature, RequiredExactlyWhenItsKeyIsInstalled) {
+  const StrongCase& c = GetParam();
+  const std::optional<Data> strongKey =
+      c.strongKeyInstalled ? std::optional<Data>(ed25519Keys().publicKeyDER) : std::nullopt;
+  const auto result = verifyStorebagContainer(plist::bytesOf(c.make()), storebagKeys().publicKeyDER, strongKey);
+  EXPECT_EQ(result.status, c.expected) << describeStorebagRefusal(result);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Containers, StrongSignature,
+    ::testing::Values(
+        StrongCase{"BothSignatures", true, [] { return container(bagBytes(), ed25519Signature(bagBytes())); },
+                   StorebagVerifyStatus::Verified},
+        StrongCase{"RsaOnlyWithStrongKey", true, [] { return container(bagBytes(), std::nullopt); },
+                   StorebagVerifyStatus::StrongSignatureMissing},
+        StrongCase{"StrongOverOtherBytes", true,
+                   [] { return container(bagBytes(), ed25519Signature(bagBytes("9.9.9"))); },
+                   StorebagVerifyStatus::StrongSignatureMismatch},
+        StrongCase{"StrongByAnotherKey", true,
+                   [] { return container(bagBytes(), ed25519Signature(bagBytes(), otherEd25519Keys())); },
+                   StorebagVerifyStatus::StrongSignatureMismatch},
+        StrongCase{"StrongNotBase64", true,
+                   [] {
+                     Dictionary c = plist::decode(plist::bytesOf(container(bagBytes(), std::nullopt)))->dictCopy();
+                     c.set(kStorebagStrongSignatureKey, "QUJD" "Q");  // a stray symbol after the last group
+                     return plist::encodeBinary(Value(std::move(c)));
+                   },
+                   StorebagVerifyStatus::BadStrongSignatureText},
+        // A good strong signature does not excuse a bad RSA one.
+        StrongCase{"GoodStrongBadRsa", true,
+                   [] {
+                     const Data other = *signStorebagBytes(storebagKeys().privateKeyPEM, bagBytes("9.9.9"));
+                     return plist::encodeBinary(
+                         makeStorebagContainer(other, bagBytes(), ed25519Signature(bagBytes())));
+                   },
+                   StorebagVerifyStatus::SignatureMismatch},
+        StrongCase{"RsaOnlyWithoutStrongKey", false, [] { return container(bagBytes(), std::nullopt); },
+                   StorebagVerifyStatus::Verified},
+        StrongCase{"BothWithoutStrongKey", false, [] { return container(bagBytes(), ed25519Signature(bagBytes())); },
+                   StorebagVerifyStatus::Verified},
+        StrongCase{"BadStrongWithoutStrongKey", false,
+                   [] { return container(bagBytes(), ed25519Signature(bagBytes("9.9.9"))); },
+                   StorebagVerifyStatus::Verified}),
+    [](const auto& info) { return std::string(info.param.name); });
+
+TEST(StrongSignatureKey, AnRsaKeyInTheEd25519PlaceRefusesEverything) {
+  const Data c = container(bagBytes(), ed25519Signature(bagBytes()));
+  EXPECT_EQ(verifyStorebagContainer(plist::bytesOf(c), storebagKeys().publicKeyDER, storebagKeys().publicKeyDER).status,
+            StorebagVerifyStatus::BadStrongPublicKey);
+  EXPECT_EQ(verifyStorebagContainer(plist::bytesOf(c), storebagKeys().publicKeyDER, Data()).status,
+            StorebagVerifyStatus::BadStrongPublicKey);
+}
+
+struct TrailingCase {
+  const char* name;
+  bool xml;
+  const char* tail;
+  bool accepted;
+};
+
+class ContainerEnd : public ::testing::TestWithParam<TrailingCase> {};
+
+TEST_P(ContainerEnd, BytesAfterTheListAreRefusedInEitherForm) {
+  const TrailingCase& c = GetParam();
+  const Value fields = *plist::decode(plist::bytesOf(container(bagBytes(), std::nullopt)));
+  std::string encoded = c.xml ? plist::encodeXml(fields) : text(plist::encodeBinary(fields));
+  encoded += c.tail;
+  const auto result = verifyStorebagContainer(plist::bytesOf(encoded), storebagKeys().publicKeyDER);
+  EXPECT_EQ(result.status == StorebagVerifyStatus::Verified, c.accepted) << describeStorebagRefusal(result);
+}
+
+INSTANTIATE_TEST_SUITE_P(Forms, ContainerEnd,
+                         ::testing::Values(TrailingCase{"Xml", true, "", true},
+                                           TrailingCase{"XmlWhiteSpace", true, "\n \t\r\n", true},
+                                           TrailingCase{"XmlJunk", true, "junk", false},
+                                           TrailingCase{"XmlSecondList", true, "<plist><dict/></plist>", false},
+                                           TrailingCase{"BinaryJunk", false, "junk", false}),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+// The daemon's check of a container: with the framework's keys, the
+// remembered issue times and the disk cache.
+class StorebagIssueTimeTest : public test::StorebagTest {
+ protected:
+  static Data stamped(double issued, const Value& bag = sampleStorebag()) {
+    return container(*stampStorebagIssueTime(plist::encodeBinary(bag), Date{issued}), std::nullopt);
+  }
+  Value accept(const Data& c, bool save = true) {
+    return parseAndVerifyStorebag("ambrel", c, save, StorebagSource{"https://bags.test/zerith/ambrel"});
+  }
+  static constexpr double kOlder = 1'700'000'000;  // 2023-11-14 22:13:20
+  static constexpr double kNewer = 1'800'000'000;  // 2027-01-15 08:00:00
+};
+
+TEST_F(StorebagIssueTimeTest, AnOlderBagIsRefusedUntilTheOperatorForgetsTheNewerTime) {
+  const std::uint64_t before = storebagRefusalCounts().rollbacks.load();
+  ASSERT_FALSE(accept(stamped(kNewer)).isNil());
+  EXPECT_EQ(rememberedStorebagIssueTime("ambrel"), Date{kNewer});
+  const auto newerOnDisk = cached("ambrel");
+
+  EXPECT_TRUE(accept(stamped(kOlder)).isNil());
+  EXPECT_TRUE(logs_.has(Level::Error,
+                        "fetchStorebagWithName: storebag 'ambrel' from https://bags.test/zerith/ambrel was issued "
+                             "at 2023-11-14 22:13:20 +0000, before 2027-01-15 08:00:00 +0000, the newest issue time "
+                             "accepted for it: refused as a rollback"));
+  EXPECT_EQ(storebagRefusalCounts().rollbacks.load(), before + 1);
+  EXPECT_EQ(cached("ambrel"), newerOnDisk);
+  // The same issue time again, and a bag without one, still pass.
+  EXPECT_FALSE(accept(stamped(kNewer)).isNil());
+  EXPECT_FALSE(accept(container(bagBytes(), std::nullopt), false).isNil());
+
+  std::optional<Date> forgotten;
+  std::string error;
+  ASSERT_TRUE(forgetStorebagIssueTime("ambrel", forgotten, &error)) << error;
+  EXPECT_EQ(forgotten, Date{kNewer});
+  EXPECT_FALSE(accept(stamped(kOlder)).isNil());
+  EXPECT_EQ(rememberedStorebagIssueTime("ambrel"), Date{kOlder});
+  EXPECT_EQ(rememberedStorebagIssueTime("bostin"), std::nullopt);
+}
+
+TEST_F(StorebagIssueTimeTest, TheDefaultsKeyRequiresAnIssueTime) {
+  setDefaultsObjectForKey(kRequireStorebagIssueTimeKey, true);
+  EXPECT_TRUE(accept(container(bagBytes(), std::nullopt)).isNil());
+  EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagWithName: storebag 'ambrel' from "
+                                           "https://bags.test/zerith/ambrel has no \"issue_time\" and "
+                                           "storebag_require_issue_time is set: refused"));
+  EXPECT_FALSE(cached("ambrel"));
+  EXPECT_FALSE(accept(stamped(kOlder)).isNil());
+}
+
+TEST_F(StorebagIssueTimeTest, ADamagedTimesFileCountsAsEmptyAndIsWrittenAfresh) {
+  root_.write("/var/lib/zerithd/storebag-issue-times.plist", "not a list");
+  EXPECT_FALSE(accept(stamped(kOlder)).isNil());
+  EXPECT_TRUE(logs_.contains("rememberStorebagIssueTime: '" + storebagIssueTimesFile().string() +
+                                               "' is unusable: "));
+  EXPECT_EQ(rememberedStorebagIssueTime("ambrel"), Date{kOlder});
+}
+
+struct UnusableCase {
+  const char* name;
+  std::function<Data()> bag;
+  const char* cause;
+};
+
+class UnusableBag : public StorebagIssueTimeTest, public ::testing::WithParamInterface<UnusableCase> {};
+
+TEST_P(UnusableBag, IsLoggedWithItsCauseAndNotCached) {
+  const std::uint64_t before = storebagRefusalCounts().unusable.load();
+  EXPECT_TRUE(accept(container(GetParam().bag(), std::nullopt)).isNil());
+  EXPECT_TRUE(logs_.contains(std::string("fetchStorebagWithName: storebag 'ambrel' from "
+                                         "https://bags.test/zerith/ambrel is signed but unusable: ") +
+                             GetParam().cause));
+  EXPECT_FALSE(cached("ambrel"));
+  EXPECT_EQ(storebagRefusalCounts().unusable.load(), before + 1);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Bags, UnusableBag,
+    ::testing::Values(
+        UnusableCase{"Array", [] { return plist::encodeBinary(Value(Array{Value(1)})); },
+                     "the bag is an array, not a dictionary"},
+        UnusableCase{"NotAList", [] { return bytes("plain text"); }, "the bag is not a property list ("},
+        UnusableCase{"TooDeep",
+                     [] {
+                       Value v(Dictionary{});
+                       for (int i = 0; i < 40; ++i) v = Value(Dictionary{{"k", v}});
+                       return plist::encodeBinary(v);
+                     },
+                     "the bag is not a property list (nesting deeper than 32)"},
+        UnusableCase{"IssueTimeNotADate",
+                     [] { return plist::encodeBinary(test::withEntry(sampleStorebag(), "issue_time", Value("today"))); },
+                     "its \"issue_time\" is "}),
+    [](const auto& info) { return std::string(info.param.name); });
+
+TEST(StorebagIssueTimesFile, OnlyADictionaryOfDatesIsRead) {
+  const std::pair<const char*, std::string> bad[] = {
+      {"array", plist::encodeXml(Value(Array{}))},
+      {"number entry", plist::encodeXml(Value(Dictionary{{"dravon", 5}}))},
+      {"empty name", text(encodeStorebagIssueTimes({{"", Date{1}}}))},
+      {"nested", plist::encodeXml(Value(Dictionary{{"a", Dictionary{{"b", Dictionary{}}}}}))},
+      {"oversized", std::string(kMaxStorebagIssueTimesBytes + 1, ' ')},
+  };
+  for (const auto& [what, encoded] : bad) {
+    std::string why;
+    EXPECT_FALSE(decodeStorebagIssueTimes(plist::bytesOf(encoded), &why)) << what;
+    EXPECT_FALSE(why.empty()) << what;
+  }
+  const StorebagIssueTimes times{{"dravon", Date{1'800'000'000}}, {"ambrel", Date{3}}};
+  EXPECT_EQ(decodeStorebagIssueTimes(plist::bytesOf(encodeStorebagIssueTimes(times))), times);
+}
+
+}  // namespace
+}  // namespace zerith
