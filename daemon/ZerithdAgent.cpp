@@ -8,6 +8,7 @@
 #include <fmt/format.h>
 
 #include "config/Conversions.h"
+#include "config/StorebagVerify.h"
 #include "daemon/SenderCodes.h"
 #include "ipc/ClientSessionExporter.h"
 #include "ipc/Connection.h"
@@ -549,6 +550,10 @@ ipc::DaemonStatus ZerithdAgent::daemonStatus(const ZerithdSession* asking) {
     }
     status.ended.push_back(ipc::EndedTotals{total.clientType, total.name, total.sessions, countList(counts)});
   }
+  const StorebagRefusalCounts& refused = storebagRefusalCounts();
+  status.storebags = {{"rollbacksRefused", refused.rollbacks.load()},
+                      {"missingIssueTimeRefused", refused.missingIssueTime.load()},
+                      {"unusableRefused", refused.unusable.load()}};
   return status;
 }
 

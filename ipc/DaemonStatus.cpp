@@ -127,7 +127,9 @@ Value DaemonStatus::toValue() const {
                                         {"sessions", Value(static_cast<unsigned long long>(std::min(e.sessions, kMaxWireCount)))},
                                         {"counts", countsValue(e.counts)}});
   }
-  return Value(Dictionary{{"sessions", Value(std::move(liveSessions))}, {"ended", Value(std::move(endedTotals))}});
+  return Value(Dictionary{{"sessions", Value(std::move(liveSessions))},
+                          {"ended", Value(std::move(endedTotals))},
+                          {"storebags", Value(Dictionary{{"counts", countsValue(storebags)}})}});
 }
 
 std::optional<DaemonStatus> DaemonStatus::fromValue(const Value& v, std::string* why) {
@@ -157,6 +159,9 @@ std::optional<DaemonStatus> DaemonStatus::fromValue(const Value& v, std::string*
       status.ended.push_back(EndedTotals{signedAt(e, "clientType", where), nameAt(e, "backend", where),
                                          unsignedAt(e, "sessions", where, kMaxWireCount),
                                          countsAt(e, where)});
+    }
+    if (const Value* storebags = top.find("storebags")) {
+      status.storebags = countsAt(dictionaryAt(*storebags, "status.storebags"), "status.storebags");
     }
     return status;
   } catch (const Refused& refused) {

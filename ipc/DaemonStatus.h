@@ -7,7 +7,8 @@
 // On the wire (the reply's "status" argument):
 //   {"sessions": [{"sessionID": u32, "sessionIDString": string, "clientType": int,
 //                  "backends": [{"name": string, "state": int, "counts": {name: u64}}]}],
-//    "ended":    [{"clientType": int, "backend": string, "sessions": u64, "counts": {name: u64}}]}
+//    "ended":    [{"clientType": int, "backend": string, "sessions": u64, "counts": {name: u64}}],
+//    "storebags": {"counts": {name: u64}}}   (absent from older daemons)
 // Count names are the backends' counter names ("sent", "droppedFiltered");
 // names this side does not know are kept as they are, so an older tool
 // shows a newer daemon's counts.
@@ -61,6 +62,8 @@ struct EndedTotals {
 struct DaemonStatus {
   std::vector<SessionStatus> sessions;
   std::vector<EndedTotals> ended;
+  // Signed storebags the daemon refused ("rollbacksRefused", ...).
+  CountList storebags;
 
   Value toValue() const;
   // nullopt, with `why`, when `v` is not a status of the shape above.

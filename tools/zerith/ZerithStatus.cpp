@@ -122,6 +122,13 @@ std::string statusTable(const ipc::DaemonStatus& status) {
     ended.push_back(std::move(row));
   }
   out += ended.size() > 1 ? render(ended, 2) : std::string("(none)\n");
+  if (!status.storebags.empty()) {
+    out += "\nSigned storebags refused:";
+    for (const auto& [name, value] : status.storebags) {
+      out += fmt::format(" {} {}", name, value);
+    }
+    out += '\n';
+  }
   return out;
 }
 
