@@ -1,13 +1,20 @@
 // zerith-storebag: the operator's tool for signed storebag containers.
 //
-//   zerith-storebag keygen --private key.pem --public publicKey.der
-//   zerith-storebag sign   --key key.pem --in bag.plist --out container.plist [--format binary|xml]
-//   zerith-storebag verify --public publicKey.der --in container.plist
-//   zerith-storebag show   --public publicKey.der --in container.plist
+//   zerith-storebag keygen --private key.pem --public publicKey.der [--type rsa|ed25519]
+//   zerith-storebag sign   --key key.pem [--ed25519-key ed.pem] --in bag.plist --out container.plist
+//                          [--format binary|xml]
+//   zerith-storebag verify --public publicKey.der [--ed25519-public publicKeyEd25519.der] --in container.plist
+//   zerith-storebag show   --public publicKey.der [--ed25519-public publicKeyEd25519.der] --in container.plist
+//   zerith-storebag [--root DIR] forget-issue-time --name dravon
+//
+// `sign` stamps the bag with its issue time ("issue_time", now) before it
+// signs it; `forget-issue-time` is the operator's way back past the daemon's
+// anti-rollback check for one storebag name.
 //
 // Exit status 0 on success, 1 when an operation fails (unreadable input, a
 // refused container), CLI11's codes for usage errors.
 
+#include <cmath>
 #include <cstdio>
 #include <filesystem>
 #include <iostream>
@@ -17,9 +24,11 @@
 #include <CLI/CLI.hpp>
 
 #include "config/StorebagDiskCache.h"
+#include "config/StorebagIssueTimes.h"
 #include "config/StorebagSigner.h"
 #include "config/StorebagVerify.h"
 #include "platform/FileUtil.h"
+#include "platform/Paths.h"
 #include "platform/PropertyList.h"
 
 namespace {
@@ -55,24 +64,10 @@ bool writeOutput(const std::string& path, const Data& bytes, fs::perms perms, st
   return true;
 }
 
-std::string describe(zerith::StorebagVerifyStatus status, const std::string& parseError,
-                     const std::string& verifyError) {
-  using S = zerith::StorebagVerifyStatus;
-  switch (status) {
-    case S::Verified: return "verified";
-    case S::NotAPropertyList: return "the container is not a property list: " + parseError;
-    case S::SignatureMissing: return "the container has no \"signature\" string";
-    case S::BadPublicKey: return "the public key is not an RSA public key in DER form";
-    case S::BadSignatureText: return "\"signature\" is not valid base64";
-    case S::BadBagText: return "\"bag\" is missing or not valid base64";
-    case S::SignatureMismatch: return "the signature does not match the bag under this public key (" + verifyError + ")";
-  }
-  return "unknown failure";
-}
-
-int keygen(const std::string& privatePath, const std::string& publicPath, int bits) {
+int keygen(const std::string& privatePath, const std::string& publicPath, int bits, const std::string& type) {
   std::string error;
-  const auto pair = zerith::generateStorebagKeyPair(bits, &error);
+  const auto pair = type == "ed25519" ? zerith::generateStorebagEd25519KeyPair(&error)
+                                      : zerith::generateStorebagKeyPair(bits, &error);
   if (!pair) {
     return failWith(error);
   }
@@ -85,29 +80,40 @@ int keygen(const std::string& privatePath, const std::string& publicPath, int bi
   return 0;
 }
 
-int sign(const std::string& keyPath, const std::string& inPath, const std::string& outPath, const std::string& format) {
+int sign(const std::string& keyPath, const std::string& strongKeyPath, const std::string& inPath,
+         const std::string& outPath, const std::string& format) {
   std::string error;
   const auto key = readInput(keyPath, error);
   if (!key) {
     return failWith(error);
   }
-  const auto bag = readInput(inPath, error);
-  if (!bag) {
+  std::optional<Data> strongKey;
+  if (!strongKeyPath.empty() && !(strongKey = readInput(strongKeyPath, error))) {
     return failWith(error);
   }
-  std::string why;
-  const auto parsed = zerith::plist::decode(zerith::plist::bytesOf(*bag), zerith::storebagBagLimits(), &why);
-  if (!parsed) {
-    return failWith("'" + inPath + "' is not a property list: " + why);
+  const auto input = readInput(inPath, error);
+  if (!input) {
+    return failWith(error);
   }
-  if (!parsed->isDict()) {
-    return failWith("'" + inPath + "' is not a property list dictionary");
+  // Whole seconds: the XML form of a date keeps no fraction.
+  const zerith::Date now{std::floor(zerith::Date::now().secondsSince1970)};
+  const auto bag = zerith::stampStorebagIssueTime(*input, now, &error);
+  if (!bag) {
+    return failWith("'" + inPath + "' is " + error);
   }
   const auto signature = zerith::signStorebagBytes(std::string(key->begin(), key->end()), *bag, &error);
   if (!signature) {
     return failWith("cannot sign with '" + keyPath + "': " + error);
   }
-  const auto container = zerith::makeStorebagContainer(*signature, *bag);
+  std::optional<Data> strongSignature;
+  if (strongKey) {
+    strongSignature =
+        zerith::signStorebagBytes(std::string(strongKey->begin(), strongKey->end()), *bag, &error, /*ed25519=*/true);
+    if (!strongSignature) {
+      return failWith("cannot sign with '" + strongKeyPath + "': " + error);
+    }
+  }
+  const auto container = zerith::makeStorebagContainer(*signature, *bag, strongSignature);
   Data out;
   if (format == "xml") {
     const std::string xml = zerith::plist::encodeXml(container);
@@ -118,36 +124,61 @@ int sign(const std::string& keyPath, const std::string& inPath, const std::strin
   if (!writeOutput(outPath, out, fs::perms(0644), error)) {
     return failWith(error);
   }
-  std::cout << "signed " << bag->size() << " bag bytes into " << outPath << "\n";
+  std::cout << "signed " << bag->size() << " bag bytes" << (strongSignature ? " (RSA and Ed25519)" : "")
+            << " issued " << zerith::describeIssueTime(now) << " into " << outPath << "\n";
   return 0;
 }
 
 // Verifies and, for `show`, prints the storebag as XML.
-int check(const std::string& publicPath, const std::string& inPath, bool show) {
+// With an Ed25519 key both signatures must verify, as in the daemon.
+int check(const std::string& publicPath, const std::string& strongPublicPath, const std::string& inPath, bool show) {
   std::string error;
   const auto key = readInput(publicPath, error);
   if (!key) {
+    return failWith(error);
+  }
+  std::optional<Data> strongKey;
+  if (!strongPublicPath.empty() && !(strongKey = readInput(strongPublicPath, error))) {
     return failWith(error);
   }
   const auto container = readInput(inPath, error);
   if (!container) {
     return failWith(error);
   }
-  const auto result = zerith::verifyStorebagContainer(zerith::plist::bytesOf(*container), key);
+  const auto result = zerith::verifyStorebagContainer(zerith::plist::bytesOf(*container), key, strongKey);
   if (result.status != zerith::StorebagVerifyStatus::Verified) {
-    return failWith("'" + inPath + "' refused: " + describe(result.status, result.parseError, result.verifyError));
+    return failWith("'" + inPath + "' refused: " + zerith::describeStorebagRefusal(result));
   }
-  const auto bag = zerith::decodeStorebagBag(result.bagBytes);
-  if (bag.isNil()) {
-    return failWith("'" + inPath + "' is signed, but its bag is not a property list dictionary");
+  std::string why;
+  const auto bag = zerith::decodeStorebagBag(result.bagBytes, &why);
+  const auto issued = bag.isNil() ? std::nullopt : zerith::storebagIssueTime(bag, &why);
+  if (!why.empty()) {
+    return failWith("'" + inPath + "' is signed, but unusable: " + why);
   }
   if (show) {
     std::cout << zerith::plist::encodeXml(bag);
   } else {
     const zerith::Value versionValue = bag["version"];
     const auto* version = versionValue.string();
-    std::cout << "verified: " << result.bagBytes.size() << " bag bytes, version " << (version ? *version : "(none)")
-              << "\n";
+    std::cout << "verified" << (strongKey ? " (RSA and Ed25519)" : "") << ": " << result.bagBytes.size()
+              << " bag bytes, version " << (version ? *version : "(none)") << ", issued "
+              << (issued ? zerith::describeIssueTime(*issued) : std::string("(no issue time)")) << "\n";
+  }
+  return 0;
+}
+
+int forgetIssueTime(const std::string& root, const std::string& name) {
+  zerith::paths::setRoot(root);
+  std::optional<zerith::Date> forgotten;
+  std::string error;
+  if (!zerith::forgetStorebagIssueTime(name, forgotten, &error)) {
+    return failWith(error);
+  }
+  if (forgotten) {
+    std::cout << "forgot issue time " << zerith::describeIssueTime(*forgotten) << " of storebag " << name << " in "
+              << zerith::storebagIssueTimesFile().string() << "\n";
+  } else {
+    std::cout << "no issue time remembered for storebag " << name << "\n";
   }
   return 0;
 }
@@ -158,38 +189,49 @@ int main(int argc, char** argv) {
   CLI::App app{"Makes and checks signed zerithd storebag containers"};
   app.require_subcommand(1);
 
-  std::string privatePath, publicPath, keyPath, inPath, outPath, format = "binary";
+  std::string privatePath, publicPath, strongPublicPath, keyPath, strongKeyPath, inPath, outPath, name;
+  std::string format = "binary", type = "rsa";
+  std::string root = zerith::paths::defaultRoot().string();
   int bits = 2048;
+  app.add_option("--root", root, "Root folder of every zerithd path, for forget-issue-time (environment ZERITHD_ROOT)");
 
-  auto* keygenCmd = app.add_subcommand("keygen", "Create an RSA key pair (PEM private key, DER public key)");
+  auto* keygenCmd = app.add_subcommand("keygen", "Create a key pair (PEM private key, DER public key)");
   keygenCmd->add_option("--private", privatePath, "Private key file to write (PEM)")->required();
   keygenCmd->add_option("--public", publicPath, "Public key file to write (DER)")->required();
-  keygenCmd->add_option("--bits", bits, "Key size")->check(CLI::Range(2048, 8192));
+  keygenCmd->add_option("--bits", bits, "RSA key size")->check(CLI::Range(2048, 8192));
+  keygenCmd->add_option("--type", type, "rsa (publicKey.der) or ed25519 (publicKeyEd25519.der)")
+      ->check(CLI::IsMember({"rsa", "ed25519"}));
 
-  auto* signCmd = app.add_subcommand("sign", "Sign a storebag (XML or binary property list) into a container");
-  signCmd->add_option("--key", keyPath, "Private key (PEM)")->required();
+  auto* signCmd = app.add_subcommand("sign", "Stamp a storebag (XML or binary property list) with its issue time and "
+                                             "sign it into a container");
+  signCmd->add_option("--key", keyPath, "RSA private key (PEM)")->required();
+  signCmd->add_option("--ed25519-key", strongKeyPath, "Ed25519 private key (PEM): adds the second signature");
   signCmd->add_option("--in", inPath, "Storebag property list")->required();
   signCmd->add_option("--out", outPath, "Container to write")->required();
   signCmd->add_option("--format", format, "Container format")->check(CLI::IsMember({"binary", "xml"}));
 
   auto* verifyCmd = app.add_subcommand("verify", "Verify a container");
-  verifyCmd->add_option("--public", publicPath, "Public key (DER)")->required();
-  verifyCmd->add_option("--in", inPath, "Container")->required();
-
   auto* showCmd = app.add_subcommand("show", "Verify a container and print its storebag as XML");
-  showCmd->add_option("--public", publicPath, "Public key (DER)")->required();
-  showCmd->add_option("--in", inPath, "Container")->required();
+  for (auto* cmd : {verifyCmd, showCmd}) {
+    cmd->add_option("--public", publicPath, "RSA public key (DER)")->required();
+    cmd->add_option("--ed25519-public", strongPublicPath, "Ed25519 public key (DER): its signature is required too");
+    cmd->add_option("--in", inPath, "Container")->required();
+  }
+
+  auto* forgetCmd = app.add_subcommand("forget-issue-time", "Let the daemon accept an older storebag of this name "
+                                                            "again (the operator's way back)");
+  forgetCmd->add_option("--name", name, "Storebag name (dravon, ...)")->required();
 
   CLI11_PARSE(app, argc, argv);
 
   if (keygenCmd->parsed()) {
-    return keygen(privatePath, publicPath, bits);
+    return keygen(privatePath, publicPath, bits, type);
   }
   if (signCmd->parsed()) {
-    return sign(keyPath, inPath, outPath, format);
+    return sign(keyPath, strongKeyPath, inPath, outPath, format);
   }
-  if (verifyCmd->parsed()) {
-    return check(publicPath, inPath, false);
+  if (forgetCmd->parsed()) {
+    return forgetIssueTime(root, name);
   }
-  return check(publicPath, inPath, true);
+  return check(publicPath, strongPublicPath, inPath, showCmd->parsed());
 }
