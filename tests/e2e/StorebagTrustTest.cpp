@@ -189,6 +189,7 @@ TEST_F(StorebagTrustTest, ASignedButUnusableBagIsLoggedWithItsCauseAndNotCached)
       {plist::encodeBinary(Value(Array{Value("seed")})), "the bag is an array, not a dictionary"},
       {Data{'n', 'o', 't', ' ', 'a', ' ', 'l', 'i', 's', 't'}, "the bag is not a property list ("},
       {plist::encodeBinary(deep), "the bag is not a property list (nesting deeper than 32)"},
+      {plist::encodeBinary(Value(Dictionary{{"issue_time", "yesterday"}})), "its \"issue_time\" is "},
   };
   start();
   std::size_t hangups = 0;
@@ -202,7 +203,7 @@ TEST_F(StorebagTrustTest, ASignedButUnusableBagIsLoggedWithItsCauseAndNotCached)
     EXPECT_FALSE(fs::exists(paths::storebagCacheDir() / "dravon"));
     forgetStorebags(++hangups);
   }
-  EXPECT_GE(refusedCount("unusableRefused"), 3u);
+  EXPECT_GE(refusedCount("unusableRefused"), 4u);
 }
 
 }  // namespace
