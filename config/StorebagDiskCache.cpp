@@ -26,11 +26,12 @@ std::string describe(const std::optional<std::string>& s) { return s ? *s : std:
 
 }  // namespace
 
-std::recursive_mutex& ZerithdUtil::lock() {
+RankedMutex<std::recursive_mutex>& ZerithdUtil::lock() {
   // Process-wide by design: the disk cache and the metrics are shared by every
-  // caller in the process, and so is the lock that guards them.
-  static std::recursive_mutex mutex;
-  return mutex;
+  // caller in the process, and so is the lock that guards them. Never
+  // destroyed: transport completions may still take it while the process exits.
+  static auto* mutex = new RankedMutex<std::recursive_mutex>(LockRank::StorebagDisk, "the storebag disk cache lock");
+  return *mutex;
 }
 
 Value defaultsObjectForKey(std::string_view key) { return Defaults(kZerithDefaultsDomain).objectForKey(key); }

@@ -20,6 +20,7 @@
 #include <string_view>
 
 #include "config/ClientTypes.h"
+#include "platform/LockRank.h"
 #include "platform/Value.h"
 #include "transport/ReportingSessionConnectivityInterface.h"
 
@@ -29,7 +30,7 @@ namespace zerith {
 // the storebag fetch's HTTP helper).
 class ZerithdUtil {
  public:
-  static std::recursive_mutex& lock();
+  static RankedMutex<std::recursive_mutex>& lock();
 };
 
 // Reads an object of the "com.velmar.zerith" domain (nil when absent).

@@ -12,7 +12,9 @@
 #include "config/StorebagServers.h"
 #include "config/StorebagVerify.h"
 #include "config/ConfigLog.h"
+#include "platform/LockRank.h"
 #include "platform/PropertyList.h"
+#include "platform/ThreadPools.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 #include "zerith/ZerithBundle.h"
 
@@ -124,7 +126,11 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
 
   // The completion runs on the helper's own transport queue and takes
   // ZerithdUtil's lock, which the caller does not hold here.
-  wait->done.acquire();
+  lockrank::assertNoLockHeld("an HTTP answer");
+  {
+    const PoolWait poolWait;
+    wait->done.acquire();
+  }
   if (wait->error || wait->statusCode != 200) {
     // An answer other than 200 has no error of its own: its status is the cause.
     const std::string cause =

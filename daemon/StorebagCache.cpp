@@ -12,6 +12,7 @@
 #include "config/StorebagIssueTimes.h"
 #include "config/StorebagVerify.h"
 #include "platform/Log.h"
+#include "platform/ThreadPools.h"
 
 namespace zerith {
 
@@ -54,9 +55,12 @@ StorebagCache::StorebagCache(Clock clock, Fetch fetch, DiskDate diskDate)
     : clock_(std::move(clock)), fetch_(std::move(fetch)), diskDate_(std::move(diskDate)) {}
 
 Value StorebagCache::storebagForClientType(std::int32_t clientType, std::uint32_t sessionID) {
+  lockrank::assertNoLockHeld("a storebag fetch");
   logger().debug("storebagForSession: Retrieving storebag for session {} with client type {}", sessionID, clientType);
   const auto name = nameForClientType(clientType);
+  Lock lock(mutex_);
   if (name) {
+    waitForFetchOf(lock, *name);
     if (const Value* entry = cachedStorebags_.find(*name)) {
       const auto fetchTime = (*entry)[kStorebagFetchTime].date();
       const Date now = clock_();
@@ -83,7 +87,7 @@ Value StorebagCache::storebagForClientType(std::int32_t clientType, std::uint32_
       }
     }
   }
-  fetchAndCacheStorebag(clientType);
+  fetchAndCache(lock, clientType);
   if (name) {
     if (const Value* entry = cachedStorebags_.find(*name)) {
       return (*entry)[kStorebagData];
@@ -97,26 +101,54 @@ Value StorebagCache::storebagVersionForClientType(std::int32_t clientType) const
   if (!name) {
     return Value();
   }
+  Lock lock(mutex_);
   const Value* entry = cachedStorebags_.find(*name);
   return entry ? (*entry)[kStorebagVersion] : Value();
 }
 
 void StorebagCache::fetchAndCacheStorebag(std::int32_t clientType) {
+  lockrank::assertNoLockHeld("a storebag fetch");
+  Lock lock(mutex_);
+  fetchAndCache(lock, clientType);
+}
+
+void StorebagCache::waitForFetchOf(Lock& lock, const std::string& name) {
+  if (!fetching_.contains(name)) {
+    return;
+  }
+  // Bounded by the fetch's own time-out; the fetch needs only the transport.
+  const PoolWait wait;
+  fetchEnded_.wait(lock, [&] { return !fetching_.contains(name); });
+}
+
+void StorebagCache::fetchAndCache(Lock& lock, std::int32_t clientType) {
   logger().debug("fetchAndCacheStorebag: Fetching storebag for client type {}", clientType);
   const auto name = nameForClientType(clientType);
   if (!name) {
     logger().error("fetchAndCacheStorebag: clientType {} is invalid", clientType);
     return;
   }
-  const Value* existing = cachedStorebags_.find(*name);
-  Dictionary entry = existing ? existing->dictCopy() : Dictionary();
+  waitForFetchOf(lock, *name);
+  fetching_.insert(*name);
 
   std::int32_t maxAge = 0;
   Value version;
   bool unchanged = false;
-  clearStorebagFailure();
-  const Value storebag = fetch_(clientType, maxAge, version, unchanged);
+  Value storebag;
+  lock.unlock();
+  {
+    const PoolWait wait;
+    clearStorebagFailure();
+    storebag = fetch_(clientType, maxAge, version, unchanged);
+  }
+  lock.lock();
+  fetching_.erase(*name);
+  fetchEnded_.notify_all();
   logger().debug("fetchAndCacheStorebag: Storebag max age: {} seconds", maxAge);
+
+  // Read after the fetch: a drop meanwhile leaves no entry to build on.
+  const Value* existing = cachedStorebags_.find(*name);
+  Dictionary entry = existing ? existing->dictCopy() : Dictionary();
 
   if (!storebag.isNil()) {
     entry.set(kStorebagData, storebag);
@@ -138,15 +170,24 @@ void StorebagCache::fetchAndCacheStorebag(std::int32_t clientType) {
 }
 
 std::size_t StorebagCache::drop() {
+  Lock lock(mutex_);
   const std::size_t dropped = cachedStorebags_.size();
   cachedStorebags_ = Dictionary();
   return dropped;
 }
 
-std::size_t StorebagCache::count() const { return cachedStorebags_.size(); }
+std::size_t StorebagCache::count() const {
+  Lock lock(mutex_);
+  return cachedStorebags_.size();
+}
 
 std::size_t StorebagCache::estimatedSize() const {
-  return estimatedPlistMemorySize(Value(cachedStorebags_));
+  return estimatedPlistMemorySize(Value(entries()));
+}
+
+Dictionary StorebagCache::entries() const {
+  Lock lock(mutex_);
+  return cachedStorebags_;
 }
 
 }  // namespace zerith

@@ -6,13 +6,22 @@
 // refreshed behind its back, and refetches a failed storebag at most once
 // every 900 seconds.
 //
-// Not thread-safe by itself: the agent calls it with its lock held, so only
-// one fetch runs at a time and every session waits for it.
+// Thread-safe: its own lock guards the entries and is never held during a
+// fetch. One fetch per storebag name runs at a time; sessions that need the
+// same name wait for it (their pool counts them as waiting and grows), while
+// sessions of other names are answered from their entries meanwhile. The
+// caller holds no ranked lock (the agent lock above all): the fetch waits for
+// the transport, whose completions never wait on the agent.
 
+#include <condition_variable>
 #include <cstdint>
 #include <functional>
+#include <mutex>
 #include <optional>
+#include <set>
 #include <string>
+
+#include "platform/LockRank.h"
 
 #include "platform/Value.h"
 
@@ -32,7 +41,6 @@ class StorebagCache {
   StorebagCache();
   StorebagCache(Clock clock, Fetch fetch, DiskDate diskDate);
 
-  // storebagForSession: without the lock, which the caller holds.
   Value storebagForClientType(std::int32_t clientType, std::uint32_t sessionID);
   Value storebagVersionForClientType(std::int32_t clientType) const;
   void fetchAndCacheStorebag(std::int32_t clientType);
@@ -46,14 +54,25 @@ class StorebagCache {
   // For health reports: entries, and the estimated memory of the whole cache.
   std::size_t count() const;
   std::size_t estimatedSize() const;
-  // The entries ("StorebagData", "StorebagVersion", "StorebagFetchTime",
-  // "StorebagFetchState", "StorebagMaxAge") by storebag name.
-  const Dictionary& entries() const { return cachedStorebags_; }
+  // A copy of the entries ("StorebagData", "StorebagVersion",
+  // "StorebagFetchTime", "StorebagFetchState", "StorebagMaxAge") by storebag
+  // name.
+  Dictionary entries() const;
 
  private:
+  using Lock = std::unique_lock<RankedMutex<std::mutex>>;
+  // Waits (the lock let go meanwhile) until no fetch of `name` is under way.
+  void waitForFetchOf(Lock& lock, const std::string& name);
+  // Fetches with the lock let go and stores the answer; `lock` is held on
+  // entry and on return.
+  void fetchAndCache(Lock& lock, std::int32_t clientType);
+
   Clock clock_;
   Fetch fetch_;
   DiskDate diskDate_;
+  mutable RankedMutex<std::mutex> mutex_{LockRank::StorebagCache, "the storebag cache lock"};
+  std::condition_variable_any fetchEnded_;
+  std::set<std::string> fetching_;  // names whose fetch is under way
   Dictionary cachedStorebags_;
 };
 

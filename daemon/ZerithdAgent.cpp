@@ -141,6 +141,7 @@ std::shared_ptr<ZerithdSession> ZerithdAgent::createReportingSessionWithDelegate
     return nullptr;
   }
   std::lock_guard lock(lock_);
+  std::lock_guard keepAlive(keepAliveLock_);
   if (sessionList_.empty()) {
     transaction_->begin();
     logger().debug("createReportingSessionWithDelegate: Vesk transaction started with session {}",
@@ -188,12 +189,15 @@ void ZerithdAgent::invalidateReportingSession(const std::shared_ptr<ZerithdSessi
 }
 
 void ZerithdAgent::releaseVeskTransaction() {
-  std::lock_guard lock(lock_);
+  // The transport's queue calls this: it takes the keep-alive lock alone,
+  // never the agent lock, whose holder may wait for that very queue.
+  std::lock_guard lock(keepAliveLock_);
   --VeskTransactionReference_;
   logger().info("releaseVeskTransaction: Vesk transaction ref count is {}", VeskTransactionReference_);
   if (VeskTransactionReference_ == 0) {
-    transaction_->end();
+    // Said before the end: a stop that waits for the end exits right after.
     logger().info("releaseVeskTransaction: Vesk transaction ended");
+    transaction_->end();
   }
 }
 
@@ -201,18 +205,17 @@ void ZerithdAgent::releaseVeskTransaction() {
 
 Value ZerithdAgent::storebagForSession(ZerithdSession& session) {
   const auto clientType = static_cast<std::int32_t>(session.clientType());
-  std::lock_guard lock(lock_);
+  // The cache's own lock, let go during a fetch: a first fetch waits for the
+  // storebag server without holding anything other sessions need.
   return cachedStorebags_->storebagForClientType(clientType, session.sessionID());
 }
 
 Value ZerithdAgent::storebagVersionForSession(ZerithdSession& session) {
   const auto clientType = static_cast<std::int32_t>(session.clientType());
-  std::lock_guard lock(lock_);
   return cachedStorebags_->storebagVersionForClientType(clientType);
 }
 
 std::size_t ZerithdAgent::dropCachedStorebags() {
-  std::lock_guard lock(lock_);
   return cachedStorebags_->drop();
 }
 
@@ -358,22 +361,27 @@ void ZerithdAgent::updateDownstreamSessions(ZerithdSession& session) {
   if (!token.string()) {
     return;
   }
-  std::lock_guard lock(lock_);
+  // The table is read under the lock; the backends are updated after it is
+  // let go (their updates wait for the backends' queues). Each step below
+  // takes the lock again for its own lookup.
+  const std::uint32_t level = session.hierarchyLevel();
+  bool hasAncestorAggregator = false;
+  SessionList descendants;
+  {
+    std::lock_guard lock(lock_);
+    hasAncestorAggregator = level >= 1 && getAncestorWithAggregatorForSession(session);
+    if (const auto* list = correlatedListFor(*token.string())) {
+      descendants = *list;
+    }
+  }
   session.updateCombinedSessionID();
   session.syncReportingStates();
-  const std::uint32_t level = session.hierarchyLevel();
   bool shutDown = false;
-  if (level >= 1 && getAncestorWithAggregatorForSession(session)) {
+  if (hasAncestorAggregator) {
     session.shutdownSessionAggregation();
     shutDown = true;
   }
   const bool askingHasAggregator = session.hasAggregator();
-  const auto* list = correlatedListFor(*token.string());
-  if (!list) {
-    return;
-  }
-  // Snapshot: a descendant's calls must not invalidate the walk.
-  const SessionList descendants = *list;
   for (const auto& w : descendants) {
     const auto s = w.lock();
     if (!s || s->hierarchyLevel() <= level) {
@@ -455,12 +463,22 @@ std::uint32_t ZerithdAgent::addSessionHealthInfo(ZerithdSession& session, Dictio
 }
 
 void ZerithdAgent::addAgentHealthInfoForSession(ZerithdSession& session, Dictionary& payload) {
-  std::lock_guard lock(lock_);
+  // The figures come from the backends' queues: gathered with no lock held,
+  // from a copy of the list taken under the agent lock.
+  lockrank::assertNoLockHeld("the health figures");
+  std::vector<std::shared_ptr<ZerithdSession>> sessions;
+  {
+    std::lock_guard lock(lock_);
+    sessions = sessionList_;
+  }
   std::uint64_t batches = 0;
-  for (const auto& s : sessionList_) {
+  for (const auto& s : sessions) {
     batches += addSessionHealthInfo(*s, payload);
   }
   batches += addSessionHealthInfo(session, payload);
+  // A session that was unlisted meanwhile is let go on the release queue,
+  // as every unlisted session is, not inside this caller.
+  releaseQueue_.async([sessions = std::move(sessions)] {});
   const std::uint64_t storebagsSize = cachedStorebags_->estimatedSize();
   payload.set("StorebagsCount", Value(static_cast<std::uint64_t>(cachedStorebags_->count())));
   payload.set("StorebagsSize", Value(storebagsSize));
@@ -520,8 +538,13 @@ ipc::CountList countList(const BackendCountsSnapshot& counts) {
 
 ipc::DaemonStatus ZerithdAgent::daemonStatus(const ZerithdSession* asking) {
   ipc::DaemonStatus status;
-  std::lock_guard lock(lock_);
-  for (const auto& session : sessionList_) {
+  // A backend's state is a turn of its queue: read after the lock is let go.
+  std::vector<std::shared_ptr<ZerithdSession>> sessions;
+  {
+    std::lock_guard lock(lock_);
+    sessions = sessionList_;
+  }
+  for (const auto& session : sessions) {
     if (session.get() == asking) {
       continue;
     }
@@ -536,6 +559,8 @@ ipc::DaemonStatus ZerithdAgent::daemonStatus(const ZerithdSession* asking) {
     }
     status.sessions.push_back(std::move(entry));
   }
+  releaseQueue_.async([sessions = std::move(sessions)] {});
+  std::lock_guard lock(lock_);
   foldEndedBackends();
   for (const EndedTotal& total : endedTotals_) {
     BackendCountsSnapshot counts = total.counts;
@@ -577,7 +602,7 @@ std::size_t ZerithdAgent::sessionCount() const {
 }
 
 std::int32_t ZerithdAgent::veskTransactionReference() const {
-  std::lock_guard lock(lock_);
+  std::lock_guard lock(keepAliveLock_);
   return VeskTransactionReference_;
 }
 

@@ -7,8 +7,11 @@
 // their hierarchy, shared data and health figures.
 //
 // One recursive lock (agentLock) guards the session list, the hierarchy
-// table, the shared data, the storebag cache and the keep-alive count;
-// sessions take the same lock when they call in. The agent is owned by a
+// table and the shared data; sessions take the same lock when they call in.
+// It is only ever held for work on those tables: the storebag cache has its
+// own lock (a fetch waits under neither), the keep-alive count has its own
+// leaf lock (the transport's release takes only that one), and health
+// figures are gathered from the backends after the lock is let go. The agent is owned by a
 // shared_ptr: sessions and connectivity helpers hold it weakly.
 
 #include <cstdint>
@@ -55,7 +58,7 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
   void invalidateReportingSession(const std::shared_ptr<ZerithdSession>& session);
 
   // ZerithdSessionDelegate.
-  std::recursive_mutex& agentLock() override { return lock_; }
+  AgentLock& agentLock() override { return lock_; }
   void releaseVeskTransaction() override;
 
   Value storebagForSession(ZerithdSession& session) override;
@@ -115,7 +118,9 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
   // endedTotals_ (under the lock).
   void foldEndedBackends();
 
-  mutable std::recursive_mutex lock_;
+  mutable AgentLock lock_{LockRank::Agent, "the agent lock"};
+  // The keep-alive count and the transaction's begin and end: a leaf.
+  mutable RankedMutex<std::mutex> keepAliveLock_{LockRank::KeepAlive, "the keep-alive lock"};
   std::vector<std::shared_ptr<ZerithdSession>> sessionList_;
   std::unique_ptr<StorebagCache> cachedStorebags_;
   // Hierarchy token -> sessions, in order of first use. The session list owns

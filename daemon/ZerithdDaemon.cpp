@@ -11,6 +11,10 @@
 #include <cstring>
 #include <mutex>
 #include <system_error>
+#include <thread>
+
+#include <asio/post.hpp>
+#include <fmt/format.h>
 
 #include <systemd/sd-daemon.h>
 
@@ -21,12 +25,16 @@
 #include "backends/Spool.h"
 #include "daemon/KeepAliveTransaction.h"
 #include "daemon/StorebagCache.h"
+#include "daemon/Watchdog.h"
 #include "daemon/ZerithdAgent.h"
 #include "ipc/EntitlementPolicy.h"
 #include "ipc/Listener.h"
+#include "platform/Executors.h"
 #include "platform/Log.h"
+#include "platform/ThreadPools.h"
 #include "platform/Paths.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
+#include "transport/TransferEngine.h"
 #include "transport/URLSession.h"
 
 namespace zerith {
@@ -54,6 +62,54 @@ sigset_t stopSignals() {
   return set;
 }
 
+// The heartbeats' roads: every pool, the transport thread and its delegate
+// queue, each socket thread, and the agent lock (taken on the general pool).
+std::vector<Watchdog::Probe> watchdogProbes(const std::weak_ptr<ZerithdAgent>& agent) {
+  std::vector<Watchdog::Probe> probes;
+  probes.push_back({"the general pool and the agent lock", [agent](std::function<void()> beat) {
+                      asio::post(ioContext(Pool::General), [agent, beat = std::move(beat)] {
+                        if (const auto a = agent.lock()) {
+                          std::lock_guard lock(a->agentLock());
+                        }
+                        beat();
+                      });
+                    }});
+  probes.push_back({"the transport pool", [](std::function<void()> beat) {
+                      asio::post(ioContext(Pool::Transport), std::move(beat));
+                    }});
+  probes.push_back({"the main operation queue",
+                    [](std::function<void()> beat) { mainOperationQueue().async(std::move(beat)); }});
+  probes.push_back({"the transport thread",
+                    [](std::function<void()> beat) { TransferEngine::instance().post(std::move(beat)); }});
+  const auto contexts = socketContexts();
+  for (std::size_t i = 0; i < contexts.size(); ++i) {
+    probes.push_back({fmt::format("socket thread {}", i + 1), [context = contexts[i]](std::function<void()> beat) {
+                        asio::post(*context, std::move(beat));
+                      }});
+  }
+  return probes;
+}
+
+std::unique_ptr<Watchdog> startWatchdog(const std::shared_ptr<ZerithdAgent>& agent) {
+  const auto period = Watchdog::periodFromEnvironment();
+  if (!period) {
+    return nullptr;
+  }
+  logger().info("main: Watchdog on, pinging every {} ms while the daemon makes progress", period->count());
+  // Test hook: wedges the main operation queue for good after a delay, so
+  // that a test sees the pings stop.
+  if (const char* wedge = std::getenv("ZERITHD_TEST_WEDGE_MAIN_QUEUE_AFTER_MS"); wedge && *wedge) {
+    const auto delay = std::chrono::milliseconds(std::strtoll(wedge, nullptr, 10));
+    logger().error("main: Test hook: the main operation queue wedges in {} ms", delay.count());
+    mainOperationQueue().after(delay, [] {
+      for (;;) {
+        std::this_thread::sleep_for(std::chrono::hours(1));
+      }
+    });
+  }
+  return std::make_unique<Watchdog>(*period, watchdogProbes(agent), [](const char* state) { sd_notify(0, state); });
+}
+
 }  // namespace
 
 ZerithdDaemon::ZerithdDaemon(DaemonOptions options) : options_(std::move(options)) {}
@@ -61,6 +117,14 @@ ZerithdDaemon::ZerithdDaemon(DaemonOptions options) : options_(std::move(options
 void ZerithdDaemon::blockStopSignals() {
   const sigset_t set = stopSignals();
   pthread_sigmask(SIG_BLOCK, &set, nullptr);
+}
+
+void ZerithdDaemon::ignoreWriteSignals() {
+  struct sigaction ignore {};
+  ignore.sa_handler = SIG_IGN;
+  sigemptyset(&ignore.sa_mask);
+  sigaction(SIGPIPE, &ignore, nullptr);
+  sigaction(SIGXFSZ, &ignore, nullptr);
 }
 
 void ZerithdDaemon::setUtilityQualityOfService() {
@@ -105,6 +169,7 @@ int ZerithdDaemon::run() {
   listener->resume();
   logger().info("main: Listener resumes with sandbox, start loop.");
   sd_notify(0, "READY=1\nSTATUS=Listening");
+  const auto watchdog = startWatchdog(agent);
 
   const sigset_t set = stopSignals();
   int signal = 0;
@@ -137,9 +202,6 @@ int ZerithdDaemon::run() {
     }
   }
   listener.reset();
-  // The agent ends a transaction under its lock; taking it lets a release
-  // that is under way finish (and log) before the process goes.
-  { std::lock_guard lock(agent->agentLock()); }
   return 0;
 }
 

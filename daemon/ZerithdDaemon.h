@@ -33,6 +33,12 @@ class ZerithdDaemon {
   // first thing in main.
   static void blockStopSignals();
 
+  // A write past the file size limit (SIGXFSZ) or to a closed pipe or socket
+  // (SIGPIPE) must not kill the daemon: both are ignored, and the write
+  // fails with EFBIG or EPIPE where every write's other errors are handled.
+  // Call first thing in main.
+  static void ignoreWriteSignals();
+
   // The exit status.
   int run();
 

@@ -15,6 +15,8 @@
 #include <asio/steady_timer.hpp>
 
 #include "platform/Executors.h"
+#include "platform/LockRank.h"
+#include "platform/ThreadPools.h"
 
 namespace zerith {
 
@@ -79,6 +81,14 @@ struct CurrentScope {
 
 asio::io_context& ioContext(Pool pool) { return threadPool(pool).context; }
 
+PoolWait::PoolWait() : pool_(tPool != nullptr && tPool->willWait() ? tPool : nullptr) {}
+
+PoolWait::~PoolWait() {
+  if (pool_ != nullptr) {
+    static_cast<ThreadPool*>(pool_)->doneWaiting();
+  }
+}
+
 namespace {
 
 thread_local bool tSocketThread = false;
@@ -105,10 +115,27 @@ struct SocketThreads {
 
 }  // namespace
 
-asio::io_context& socketContext() {
+namespace {
+
+SocketThreads& socketThreads() {
   // Leaked on purpose, as the pools are.
   static SocketThreads* threads = new SocketThreads();
-  return *threads->contexts[threads->next.fetch_add(1) % threads->contexts.size()];
+  return *threads;
+}
+
+}  // namespace
+
+asio::io_context& socketContext() {
+  SocketThreads& threads = socketThreads();
+  return *threads.contexts[threads.next.fetch_add(1) % threads.contexts.size()];
+}
+
+std::vector<asio::io_context*> socketContexts() {
+  std::vector<asio::io_context*> contexts;
+  for (const auto& context : socketThreads().contexts) {
+    contexts.push_back(context.get());
+  }
+  return contexts;
 }
 
 bool onSocketThread() { return tSocketThread; }
@@ -199,6 +226,10 @@ SerialQueue::Turn::Turn(const SerialQueue& queue) : state_(queue.state_.get()) {
   if (queue.isCurrent()) {
     std::fprintf(stderr, "zerith: sync onto queue '%s' from its own block would deadlock\n", state_->label.c_str());
     std::abort();
+  }
+  if constexpr (kLockRanksChecked) {
+    // A turn may have to wait for the queue's blocks, which may take any lock.
+    lockrank::willAcquire(LockRank::QueueTurn, state_, state_->label.c_str(), false);
   }
   std::unique_lock lock(state_->mutex);
   if (!state_->active && state_->items.empty()) {

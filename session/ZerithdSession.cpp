@@ -134,7 +134,6 @@ ZerithdSession::~ZerithdSession() {
     payload.set("GracefulTermination", Value(hasFinishedGracefully()));
   }
   if (const auto d = delegate()) {
-    std::lock_guard lock(d->agentLock());
     d->addAgentHealthInfoForSession(*this, payload);
   }
   addBackendCounts(payload);
@@ -268,9 +267,9 @@ std::shared_ptr<ZerithBackend> ZerithdSession::backendNamed(std::string_view nam
   return nullptr;
 }
 
-std::mutex& ZerithdSession::classLock() {
-  static std::mutex lock;
-  return lock;
+RankedMutex<std::mutex>& ZerithdSession::classLock() {
+  static auto* lock = new RankedMutex<std::mutex>(LockRank::SessionClass, "the session class lock");
+  return *lock;
 }
 
 // --- Configuration -----------------------------------------------------------
@@ -481,8 +480,13 @@ void ZerithdSession::syncReportingStates() {
   if (!d) {
     return;
   }
-  std::lock_guard agentLock(d->agentLock());
-  const auto parent = d->parentSessionForChild(*this);
+  // The parent is looked up under the agent lock; the states are read and
+  // written after it is let go (each is a turn of a backend's queue).
+  std::shared_ptr<ZerithdSession> parent;
+  {
+    std::lock_guard agentLock(d->agentLock());
+    parent = d->parentSessionForChild(*this);
+  }
   const auto set = backends();
   if (!set) {
     return;

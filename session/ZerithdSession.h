@@ -145,7 +145,7 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
 
   // The class-wide lock: flush joins of every session and the one-shot
   // transport. A leaf: nothing else is taken while it is held.
-  static std::mutex& classLock();
+  static RankedMutex<std::mutex>& classLock();
   static std::shared_ptr<ReportingSessionConnectivityHelper>& oneShotHelperLocked();
 
   // Fields other threads read while the agent lock is held.

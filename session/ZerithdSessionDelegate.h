@@ -6,13 +6,16 @@
 // reference, never owning the agent.
 //
 // The agent is also a recursive lock (agentLock) for its tables; callers that
-// must hold it across several calls take it themselves.
+// must hold it across several calls take it themselves. It is held only for
+// table work: never while waiting for a queue's turn, a storebag fetch or any
+// HTTP answer (the lock rank check aborts a debug build that tries).
 
 #include <memory>
 #include <mutex>
 #include <string>
 
 #include "backends/ZerithBackend.h"
+#include "platform/LockRank.h"
 #include "platform/Value.h"
 #include "transport/ConnectivityHelperDelegate.h"
 
@@ -20,17 +23,20 @@ namespace zerith {
 
 class ZerithdSession;
 
+using AgentLock = RankedMutex<std::recursive_mutex>;
+
 class ZerithdSessionDelegate : public ConnectivityHelperDelegate {
  public:
   ~ZerithdSessionDelegate() override = default;
 
-  virtual std::recursive_mutex& agentLock() = 0;
+  virtual AgentLock& agentLock() = 0;
 
   // For logs.
   virtual std::string description() const { return "<ZerithdSessionDelegate>"; }
 
   // Keep-alive: called by a connectivity helper once its HTTP session has
-  // become invalid.
+  // become invalid, on the transport's queue: it takes only the keep-alive
+  // count's own lock, never the agent lock.
   void releaseVeskTransaction() override = 0;
 
   // Storebag cache.

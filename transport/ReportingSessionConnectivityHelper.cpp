@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <cerrno>
+#include <cstring>
 #include <system_error>
 
 #include <fmt/format.h>
@@ -64,8 +65,10 @@ file::UniqueFd writeBodyFile(const fs::path& path, const Data& body) {
       continue;
     }
     if (n <= 0) {
+      const int error = n < 0 ? errno : EIO;  // the caller reports it
       fd.reset();
       fs::remove(path, ec);
+      errno = error;
       return fd;
     }
     written += static_cast<std::size_t>(n);
@@ -157,6 +160,9 @@ void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(con
     const fs::path container = composeUniqueContainerURL();
     file::UniqueFd body = writeBodyFile(container, request.body);
     if (!body) {
+      // A full storage folder, the file size limit (EFBIG), no descriptor left.
+      logger().error("postURLRequestWithCompletionHandler: cannot write the body file {}: {}", container.string(),
+                     std::strerror(errno));
       return;  // no task and no completion
     }
     URLRequest copy = request;

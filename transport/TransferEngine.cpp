@@ -596,6 +596,8 @@ void TransferEngine::start(std::shared_ptr<URLSessionTask> task) {
   impl_->post([impl = impl_.get(), task = std::move(task)] { impl->begin(task); });
 }
 
+void TransferEngine::post(std::function<void()> block) { impl_->post(std::move(block)); }
+
 void TransferEngine::cancel(std::shared_ptr<URLSessionTask> task) {
   impl_->post([impl = impl_.get(), task = std::move(task)] { impl->cancelTask(task); });
 }

@@ -18,6 +18,7 @@
 #include <array>
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 
@@ -70,6 +71,9 @@ class TransferEngine {
 
   void start(std::shared_ptr<URLSessionTask> task);
   void cancel(std::shared_ptr<URLSessionTask> task);
+  // Runs `block` on the transport thread between two turns of its loop (the
+  // watchdog's heartbeat). The block must not wait.
+  void post(std::function<void()> block);
 
   struct Impl;
 

@@ -4,6 +4,8 @@
 #include <memory>
 #include <semaphore>
 
+#include "platform/LockRank.h"
+#include "platform/ThreadPools.h"
 #include "transport/ReportingSessionConnectivityInterface.h"
 
 namespace zerith {
@@ -57,6 +59,8 @@ URLAnswer postURLRequestAndWait(ReportingSessionConnectivityInterface& transport
         waiter->answer = URLAnswer{data, response, error};
         waiter->done.release();
       });
+  lockrank::assertNoLockHeld("an HTTP answer");
+  const PoolWait wait;
   waiter->done.acquire();
   return std::move(waiter->answer);
 }

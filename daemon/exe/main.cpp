@@ -25,6 +25,7 @@ int main(int argc, char** argv) {
 
   // Before any thread exists, so that only the main loop takes the signals.
   zerith::ZerithdDaemon::blockStopSignals();
+  zerith::ZerithdDaemon::ignoreWriteSignals();
 
   zerith::DaemonOptions options;
   std::string root = zerith::paths::defaultRoot().string();

@@ -313,10 +313,7 @@ TEST_F(ZerithdAgentTest, HealthFiguresCountListedSessionsPlusTheEndingOnePerSend
 
   agent->invalidateReportingSession(b.session);  // b ends
   Dictionary payload;
-  {
-    std::lock_guard lock(agent->agentLock());
-    agent->addAgentHealthInfoForSession(*b.session, payload);
-  }
+  agent->addAgentHealthInfoForSession(*b.session, payload);  // gathered with no lock held
   EXPECT_EQ(payload.get("SessionsCount_YJ"), Value(3ull));
   EXPECT_EQ(payload.get("SessionsCount_Unknown"), Value(1ull));
   EXPECT_EQ(payload.get("BatchSize_YJ"), Value(0u));
