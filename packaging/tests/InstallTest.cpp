@@ -155,7 +155,7 @@ TEST_F(InstalledTree, HoldsTheProgramsTheFrameworkTheUnitsAndTheSnippetsInTheirF
   EXPECT_TRUE(fs::exists(at("/usr/share/zerith/Info.plist")));
   EXPECT_TRUE(fs::is_directory(at("/etc/zerithd/entitlements.d")));
   EXPECT_TRUE(fs::is_empty(at("/etc/zerithd/entitlements.d"))) << "no policy is turned on by the install";
-  EXPECT_TRUE(fs::exists(at("/usr/share/doc/zerithd/50-zerith-group.plist")));
+  EXPECT_TRUE(fs::exists(at("/usr/share/doc/zerithd/examples/50-zerith-group.plist")));
   EXPECT_TRUE(fs::exists(at("/usr/lib/sysusers.d/zerithd.conf")));
   EXPECT_TRUE(fs::exists(at("/usr/lib/tmpfiles.d/zerithd.conf")));
   // Nothing of the build folder leaks into the installed programs.
