@@ -26,30 +26,6 @@ std::optional<std::uint64_t> callNumber(const Value& v) {
   return std::nullopt;
 }
 
-// Every string and key of a decoded message. A string that is not UTF-8
-// would silently change on its way on (the frame writer puts U+FFFD for its
-// bad bytes, libplist cuts it short at the first), so it is refused at the
-// door instead.
-bool allTextValid(const Value& v) {
-  if (const auto* s = v.string()) {
-    return bplist::validUtf8(*s);
-  }
-  if (const auto* d = v.dict()) {
-    for (const auto& [key, value] : *d) {
-      if (!bplist::validUtf8(key) || !allTextValid(value)) {
-        return false;
-      }
-    }
-  } else if (const auto* a = v.array()) {
-    for (const auto& element : *a) {
-      if (!allTextValid(element)) {
-        return false;
-      }
-    }
-  }
-  return true;
-}
-
 }  // namespace
 
 plist::Limits frameLimits() {
@@ -142,17 +118,17 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
     return std::nullopt;
   }
   std::string plistError;
-  const auto root = bplist::decode(body, frameLimits(), &plistError);
+  // Text that is not UTF-8 would silently change on its way on (the frame
+  // writer puts U+FFFD for its bad bytes, libplist cuts it short at the
+  // first), so the read refuses it at the door.
+  const auto root = bplist::decode(body, frameLimits(), &plistError, bplist::Text::Utf8Only);
   if (!root) {
-    setWhy(why, "frame body does not parse: " + plistError);
+    setWhy(why, plistError == bplist::kNotUtf8 ? std::string("message holds text that is not valid UTF-8")
+                                               : "frame body does not parse: " + plistError);
     return std::nullopt;
   }
   if (!root->isDict()) {
     setWhy(why, fmt::format("message is {}, not a dictionary", root->kindName()));
-    return std::nullopt;
-  }
-  if (!allTextValid(*root)) {
-    setWhy(why, "message holds text that is not valid UTF-8");
     return std::nullopt;
   }
   const Value args = (*root)["args"];

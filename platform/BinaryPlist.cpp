@@ -17,6 +17,11 @@ namespace {
 constexpr double kEpochOffset = 978307200.0;
 constexpr std::size_t kHeaderBytes = 8;
 constexpr std::size_t kTrailerBytes = 32;
+// Text and data shared by many references would make a tree far larger than
+// its bytes (a long key under every entry of a large dictionary): the text
+// and data of the expanded tree, counted as encoded, stay within the size
+// limit, as they do in any list that shares nothing.
+constexpr const char* kExpandsPast = "text and data expand to more than {} bytes";
 
 std::uint64_t readBE(const std::uint8_t* p, std::size_t n) {
   std::uint64_t v = 0;
@@ -112,9 +117,34 @@ std::uint32_t nextCodePoint(const unsigned char*& p, const unsigned char* end) {
   return code;
 }
 
+}  // namespace
+
+bool validUtf8(std::string_view text) {
+  const auto* p = reinterpret_cast<const unsigned char*>(text.data());
+  const auto* end = p + text.size();
+  while (p < end) {
+    // ASCII eight bytes at a time.
+    if (end - p >= 8) {
+      std::uint64_t word = 0;
+      std::memcpy(&word, p, sizeof word);
+      if ((word & 0x8080808080808080ull) == 0) {
+        p += 8;
+        continue;
+      }
+    }
+    if (nextCodePoint(p, end) == kBadUtf8) {
+      return false;
+    }
+  }
+  return true;
+}
+
+namespace {
+
 class Reader {
  public:
-  Reader(plist::Bytes bytes, const plist::Limits& limits) : b_(bytes.data()), size_(bytes.size()), limits_(limits) {}
+  Reader(plist::Bytes bytes, const plist::Limits& limits, Text text)
+      : b_(bytes.data()), size_(bytes.size()), limits_(limits), text_(text) {}
 
   std::optional<Value> run() {
     if (size_ > limits_.maxBytes) {
@@ -140,7 +170,18 @@ class Reader {
         numObjects_ > (tableEnd - tableOffset_) / offsetSize_) {
       return fail("binary offset table is out of range");
     }
-    objects_.assign(numObjects_, Object{});
+    // The objects' slots are the thread's, kept from one read to the next
+    // unless a large list made them large.
+    struct Release {
+      ~Release() {
+        if (objects_.capacity() > kKeptSlots) {
+          std::vector<Object>().swap(objects_);
+        } else {
+          objects_.clear();
+        }
+      }
+    } release;
+    objects_.resize(numObjects_);
     const Object* root = visit(top, 1);
     if (!root) {
       return std::nullopt;
@@ -154,6 +195,7 @@ class Reader {
   struct Object {
     Value value;
     std::uint64_t expanded = 0;  // nodes it expands to
+    std::uint64_t bytes = 0;     // text and data it expands to, as encoded
     std::uint32_t height = 0;
     std::uint8_t state = 0;  // 0 unvisited, 1 on the current path, 2 done
   };
@@ -200,6 +242,81 @@ class Reader {
 
   std::uint64_t refAt(std::uint64_t pos, std::uint64_t i) const { return readBE(b_ + pos + i * refSize_, refSize_); }
 
+  // Where object `ref` starts, or 0 when that is outside the object area.
+  std::uint64_t offsetOf(std::uint64_t ref) const {
+    const std::uint64_t offset = readBE(b_ + tableOffset_ + ref * offsetSize_, offsetSize_);
+    return offset >= kHeaderBytes && offset < tableOffset_ ? offset : 0;
+  }
+
+  // The text of a string object (marker type 0x5 or 0x6) whose content
+  // starts at `pos`; adds its encoded size to `bytes`.
+  bool readText(std::uint8_t type, std::uint8_t info, std::uint64_t pos, std::string& out, std::uint64_t& bytes) {
+    std::uint64_t length = 0;
+    if (!readLength(info, pos, length)) {
+      return false;
+    }
+    if (!fits(pos, length, type == 0x6 ? 2 : 1)) {
+      error = "object content runs past the object area";
+      return false;
+    }
+    const std::uint8_t* p = b_ + pos;
+    bytes += type == 0x6 ? 2 * length : length;
+    // libplist asserts that a string has no NUL inside (and aborts the
+    // process when it has): such strings are refused.
+    if (type == 0x5) {
+      const std::string_view text(reinterpret_cast<const char*>(p), length);
+      if (std::memchr(p, 0, length) != nullptr) {
+        error = "string holds a NUL character";
+        return false;
+      }
+      if (text_ == Text::Utf8Only && !validUtf8(text)) {
+        error = kNotUtf8;
+        return false;
+      }
+      out.assign(text);
+      return true;
+    }
+    if (length == 0) {
+      error = "empty UTF-16 string";  // libplist refuses it
+      return false;
+    }
+    for (std::uint64_t i = 0; i < length; ++i) {
+      if (p[2 * i] == 0 && p[2 * i + 1] == 0) {
+        error = "string holds a NUL character";
+        return false;
+      }
+    }
+    appendUtf16(p, length, out);
+    return true;
+  }
+
+  // The text of key object `ref` at nesting `depth`, counted as a node of
+  // the expanded tree like any other.
+  bool readKey(std::uint64_t ref, std::size_t depth, std::string& out, std::uint64_t& bytes) {
+    if (depth > limits_.maxDepth) {
+      error = fmt::format("nesting deeper than {}", limits_.maxDepth);
+      return false;
+    }
+    const std::uint64_t offset = offsetOf(ref);
+    if (offset == 0) {
+      error = "object offset is out of range";
+      return false;
+    }
+    const std::uint8_t type = b_[offset] >> 4;
+    if (type != 0x5 && type != 0x6) {
+      error = "dictionary key is not a string";
+      return false;
+    }
+    if (!readText(type, b_[offset] & 0x0F, offset + 1, out, bytes)) {
+      return false;
+    }
+    if (bytes > limits_.maxBytes) {
+      error = fmt::format(kExpandsPast, limits_.maxBytes);
+      return false;
+    }
+    return true;
+  }
+
   // Builds object `ref` reached at nesting `depth` (the root is 1); nullptr
   // with `error` set when it breaks a bound.
   const Object* visit(std::uint64_t ref, std::size_t depth) {
@@ -218,8 +335,8 @@ class Reader {
     }
     object.state = 1;
 
-    const std::uint64_t offset = readBE(b_ + tableOffset_ + ref * offsetSize_, offsetSize_);
-    if (offset < kHeaderBytes || offset >= tableOffset_) {
+    const std::uint64_t offset = offsetOf(ref);
+    if (offset == 0) {
       return failed("object offset is out of range");
     }
     const std::uint8_t marker = b_[offset];
@@ -227,6 +344,7 @@ class Reader {
     const std::uint8_t info = marker & 0x0F;
     std::uint64_t pos = offset + 1;
     std::uint64_t nodes = 1;
+    std::uint64_t bytes = 0;  // of text and data, as encoded
     std::uint32_t height = 1;
     Value value;
 
@@ -283,40 +401,24 @@ class Reader {
         value = Value(Date{sec + usec / 1e6 + kEpochOffset});
         break;
       }
-      case 0x4:
-      case 0x5:
-      case 0x6: {
+      case 0x4: {
         std::uint64_t length = 0;
         if (!readLength(info, pos, length)) {
           return nullptr;
         }
-        if (!fits(pos, length, type == 0x6 ? 2 : 1)) {
+        if (!fits(pos, length, 1)) {
           return failed("object content runs past the object area");
         }
-        const std::uint8_t* p = b_ + pos;
-        if (type == 0x4) {
-          value = Value(Data(p, p + length));
-          break;
-        }
-        // libplist asserts that a string has no NUL inside (and aborts the
-        // process when it has): such strings are refused.
-        if (type == 0x5) {
-          if (std::memchr(p, 0, length) != nullptr) {
-            return failed("string holds a NUL character");
-          }
-          value = Value(std::string(reinterpret_cast<const char*>(p), length));
-          break;
-        }
-        if (length == 0) {
-          return failed("empty UTF-16 string");  // libplist refuses it
-        }
-        for (std::uint64_t i = 0; i < length; ++i) {
-          if (p[2 * i] == 0 && p[2 * i + 1] == 0) {
-            return failed("string holds a NUL character");
-          }
-        }
+        value = Value(Data(b_ + pos, b_ + pos + length));
+        bytes = length;
+        break;
+      }
+      case 0x5:
+      case 0x6: {
         std::string text;
-        appendUtf16(p, length, text);
+        if (!readText(type, info, pos, text, bytes)) {
+          return nullptr;
+        }
         value = Value(std::move(text));
         break;
       }
@@ -344,9 +446,13 @@ class Reader {
             return nullptr;
           }
           nodes += c->expanded;
+          bytes += c->bytes;
           height = std::max(height, c->height + 1);
           if (nodes > limits_.maxNodes) {
             return failed(fmt::format("expands to more than {} nodes", limits_.maxNodes));
+          }
+          if (bytes > limits_.maxBytes) {
+            return failed(fmt::format(kExpandsPast, limits_.maxBytes));
           }
           return c;
         };
@@ -366,13 +472,14 @@ class Reader {
         Dictionary dict;
         dict.reserve(count);
         for (std::uint64_t i = 0; i < count; ++i) {
-          const Object* key = child(refAt(pos, i));
-          if (!key) {
+          // A key is read as text only: no Value is made for it.
+          std::string key;
+          if (!readKey(refAt(pos, i), depth + 1, key, bytes)) {
             return nullptr;
           }
-          const std::string* name = key->value.string();
-          if (!name) {
-            return failed("dictionary key is not a string");
+          height = std::max<std::uint32_t>(height, 2);
+          if (++nodes > limits_.maxNodes) {
+            return failed(fmt::format("expands to more than {} nodes", limits_.maxNodes));
           }
           const Object* entry = child(refAt(pos, count + i));
           if (!entry) {
@@ -380,7 +487,7 @@ class Reader {
           }
           // A key given twice keeps its first place and its last value, as
           // a tree read through libplist does.
-          dict.set(*name, entry->value);
+          dict.set(std::move(key), entry->value);
         }
         value = Value(std::move(dict));
         break;
@@ -395,20 +502,26 @@ class Reader {
     // `objects_` never grows during the walk: `object` is still valid.
     object.value = std::move(value);
     object.expanded = nodes;
+    object.bytes = bytes;
     object.height = height;
     object.state = 2;
     return &object;
   }
 
+  static constexpr std::size_t kKeptSlots = 4096;
+
   const std::uint8_t* b_;
   std::size_t size_;
   const plist::Limits& limits_;
+  Text text_;
   std::uint8_t offsetSize_ = 0;
   std::uint8_t refSize_ = 0;
   std::uint64_t numObjects_ = 0;
   std::uint64_t tableOffset_ = 0;
-  std::vector<Object> objects_;
+  static thread_local std::vector<Object> objects_;
 };
+
+thread_local std::vector<Reader::Object> Reader::objects_;
 
 // ---- writer
 // ---------------------------------------------------------------------
@@ -684,8 +797,8 @@ thread_local std::vector<std::uint16_t> Writer::units_;
 
 }  // namespace
 
-std::optional<Value> decode(plist::Bytes bytes, const plist::Limits& limits, std::string* error) {
-  Reader reader(bytes, limits);
+std::optional<Value> decode(plist::Bytes bytes, const plist::Limits& limits, std::string* error, Text text) {
+  Reader reader(bytes, limits, text);
   auto value = reader.run();
   if (!value && error) {
     *error = std::move(reader.error);
@@ -694,16 +807,5 @@ std::optional<Value> decode(plist::Bytes bytes, const plist::Limits& limits, std
 }
 
 std::size_t encode(const Value& value, Data& out) { return Writer(out).run(value); }
-
-bool validUtf8(std::string_view text) {
-  const auto* p = reinterpret_cast<const unsigned char*>(text.data());
-  const auto* end = p + text.size();
-  while (p < end) {
-    if (nextCodePoint(p, end) == kBadUtf8) {
-      return false;
-    }
-  }
-  return true;
-}
 
 }  // namespace zerith::bplist

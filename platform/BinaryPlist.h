@@ -27,9 +27,16 @@
 
 namespace zerith::bplist {
 
+enum class Text { Any, Utf8Only };
+// The error of a read with Text::Utf8Only that met such text.
+inline constexpr const char* kNotUtf8 = "holds text that is not valid UTF-8";
+
 // The Value tree of a binary property list, or nullopt (and, when `error` is
-// given, why) when the bytes break a bound or the format.
-std::optional<Value> decode(plist::Bytes bytes, const plist::Limits& limits = {}, std::string* error = nullptr);
+// given, why) when the bytes break a bound or the format, or, with
+// Text::Utf8Only, hold a string or key that is not strict UTF-8 (text in
+// UTF-16 always reads as UTF-8).
+std::optional<Value> decode(plist::Bytes bytes, const plist::Limits& limits = {}, std::string* error = nullptr,
+                            Text text = Text::Any);
 
 // Appends the binary property list of `value` to `out` and returns the bytes
 // appended. nil entries inside containers are left out (a property list has

@@ -162,7 +162,9 @@ Data listOf(const std::vector<Data>& objects, std::uint8_t refSize = 1) {
   trailer[6] = 1;
   trailer[7] = refSize;
   trailer[15] = static_cast<std::uint8_t>(objects.size());
-  trailer[31] = static_cast<std::uint8_t>(table);
+  for (int i = 0; i < 8; ++i) {
+    trailer[24 + i] = static_cast<std::uint8_t>(table >> (56 - 8 * i));
+  }
   out.insert(out.end(), trailer.begin(), trailer.end());
   return out;
 }
@@ -204,6 +206,16 @@ Data bomb() {
   return listOf(objects);
 }
 
+Data keyBomb() {
+  // A hundred references to one dictionary whose key is 700 bytes long:
+  // 70,000 bytes of text from a list of 900.
+  Data array{0xAF, 0x10, 100};
+  array.insert(array.end(), 100, 1);
+  Data key{0x5F, 0x11, 0x02, 0xBC};
+  key.insert(key.end(), 700, 'k');
+  return listOf({array, {0xD1, 3, 2}, {0x09}, key});
+}
+
 INSTANTIATE_TEST_SUITE_P(
     Bounds, BinaryPlistRefuses,
     testing::Values(
@@ -223,6 +235,7 @@ INSTANTIATE_TEST_SUITE_P(
             listOf({{0xA1, 1}, {0xA1, 2}, {0xA1, 3}, {0xA1, 4}, {0xA1, 5}, {0xA1, 6}, {0xA1, 7}, {0xA1, 8}, {0x09}}),
             "nesting deeper than 8"},
         Refused{"NodeBomb", bomb(), "expands to more than 1000 nodes"},
+        Refused{"SharedTextBomb", keyBomb(), "text and data expand to more than 65536 bytes"},
         Refused{"KeyNotString", listOf({{0xD1, 1, 2}, {0x09}, {0x09}}), "key is not a string"},
         Refused{"NulInString", listOf({{0xA1, 1}, {0x53, 'a', 0, 'b'}}), "NUL"},
         Refused{"EmptyUtf16", listOf({{0xA1, 1}, {0x60}}), "empty UTF-16"},
