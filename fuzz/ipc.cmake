@@ -5,3 +5,5 @@ zerith_fuzz(NAME frame_decoder_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/FrameDec
 zerith_fuzz(NAME connection_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/ConnectionFuzz.cpp DEPS zerith_ipc)
 # The status reply that `zerith status` reads from the daemon.
 zerith_fuzz(NAME daemon_status_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/DaemonStatusFuzz.cpp DEPS zerith_ipc)
+# The frame codec against libplist on the same bytes (differential).
+zerith_fuzz(NAME binary_plist_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/BinaryPlistFuzz.cpp DEPS zerith_ipc)

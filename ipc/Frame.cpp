@@ -2,8 +2,7 @@
 
 #include <fmt/format.h>
 
-#include <climits>
-#include <cstring>
+#include "platform/BinaryPlist.h"
 
 namespace zerith::ipc {
 
@@ -27,67 +26,6 @@ std::optional<std::uint64_t> callNumber(const Value& v) {
   return std::nullopt;
 }
 
-// Strict UTF-8: no overlong forms, no surrogates, nothing above U+10FFFF.
-bool validUtf8(std::string_view s) {
-  const auto* p = reinterpret_cast<const unsigned char*>(s.data());
-  const auto* end = p + s.size();
-  while (p < end) {
-    const unsigned c = *p;
-    std::size_t extra = 0;
-    std::uint32_t min = 0;
-    std::uint32_t code = 0;
-    if (c < 0x80) {
-      ++p;
-      continue;
-    } else if ((c & 0xe0) == 0xc0) {
-      extra = 1, min = 0x80, code = c & 0x1f;
-    } else if ((c & 0xf0) == 0xe0) {
-      extra = 2, min = 0x800, code = c & 0x0f;
-    } else if ((c & 0xf8) == 0xf0) {
-      extra = 3, min = 0x10000, code = c & 0x07;
-    } else {
-      return false;
-    }
-    if (static_cast<std::size_t>(end - p) <= extra) {
-      return false;
-    }
-    for (std::size_t i = 1; i <= extra; ++i) {
-      if ((p[i] & 0xc0) != 0x80) {
-        return false;
-      }
-      code = (code << 6) | (p[i] & 0x3f);
-    }
-    if (code < min || code > 0x10ffff || (code >= 0xd800 && code <= 0xdfff)) {
-      return false;
-    }
-    p += extra + 1;
-  }
-  return true;
-}
-
-// Every string and key of a decoded message. libplist re-encodes a string
-// that is not UTF-8 cut short at the first bad byte, so such a string would
-// silently change on its way on; it is refused at the door instead.
-bool allTextValid(const Value& v) {
-  if (const auto* s = v.string()) {
-    return validUtf8(*s);
-  }
-  if (const auto* d = v.dict()) {
-    for (const auto& [key, value] : *d) {
-      if (!validUtf8(key) || !allTextValid(value)) {
-        return false;
-      }
-    }
-  } else if (const auto* a = v.array()) {
-    for (const auto& element : *a) {
-      if (!allTextValid(element)) {
-        return false;
-      }
-    }
-  }
-  return true;
-}
-
 }  // namespace
 
 plist::Limits frameLimits() {
@@ -97,16 +35,15 @@ plist::Limits frameLimits() {
 }
 
 Data encodeFrame(const Value& message) {
-  const Data body = plist::encodeBinary(message);
-  Data frame(kFrameHeaderBytes + body.size());
-  const auto n = static_cast<std::uint32_t>(body.size());
+  // The header, then the body written in place behind it.
+  Data frame;
+  frame.reserve(256);
+  frame.resize(kFrameHeaderBytes);
+  const auto n = static_cast<std::uint32_t>(bplist::encode(message, frame));
   frame[0] = static_cast<std::uint8_t>(n >> 24);
   frame[1] = static_cast<std::uint8_t>(n >> 16);
   frame[2] = static_cast<std::uint8_t>(n >> 8);
   frame[3] = static_cast<std::uint8_t>(n);
-  if (!body.empty()) {
-    std::memcpy(frame.data() + kFrameHeaderBytes, body.data(), body.size());
-  }
   return frame;
 }
 
@@ -119,97 +56,8 @@ Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, c
   return encodeFrame(Value(std::move(message)));
 }
 
-namespace {
-
-Data encodeReplyFrame(std::uint64_t call, const Dictionary& args) {
-  return encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(call))}, {"args", Value(args)}}));
-}
-
-// The reply of a call answered with no arguments (every event the backends
-// took) is the same bytes from one call to the next but for the call number.
-// libplist's binary writer sets up, zeroes and walks a table of 4096 buckets
-// for every tree it writes, which costs more than the rest of such a reply
-// (about 3 µs, and much more with cold caches). So libplist writes this reply
-// once, with a call number wide enough to take eight bytes, and each reply
-// copies those bytes and puts its own number in the same eight: a number the
-// writer would have made narrower is the same integer in the wider form.
-class EmptyReplyTemplate {
- public:
-  EmptyReplyTemplate() {
-    // Two numbers that need all eight bytes and differ in each of them.
-    constexpr std::uint64_t kFirst = 0x5a5a5a5a5a5a5a5aull;
-    constexpr std::uint64_t kSecond = 0x2b2b2b2b2b2b2b2bull;
-    Data first = encodeReplyFrame(kFirst, Dictionary{});
-    const Data second = encodeReplyFrame(kSecond, Dictionary{});
-    if (first.size() != second.size()) {
-      return;
-    }
-    std::size_t begin = 0;
-    while (begin < first.size() && first[begin] == second[begin]) {
-      ++begin;
-    }
-    std::size_t end = first.size();
-    while (end > begin && first[end - 1] == second[end - 1]) {
-      --end;
-    }
-    // Exactly the number's eight big-endian bytes differ; anything else means
-    // the writer does not lay the reply out as expected, and every reply is
-    // then written by libplist.
-    if (end - begin != 8 || readBigEndian(first, begin) != kFirst || readBigEndian(second, begin) != kSecond) {
-      return;
-    }
-    frame_ = std::move(first);
-    numberAt_ = begin;
-  }
-
-  // The reply frame for `call`, or nullopt when the template is not usable
-  // (or the number would not read back as the same non-negative integer).
-  std::optional<Data> reply(std::uint64_t call) const {
-    if (frame_.empty() || call > static_cast<std::uint64_t>(INT64_MAX)) {
-      return std::nullopt;
-    }
-    Data frame = frame_;
-    for (int i = 7; i >= 0; --i) {
-      frame[numberAt_ + static_cast<std::size_t>(i)] = static_cast<std::uint8_t>(call & 0xff);
-      call >>= 8;
-    }
-    return frame;
-  }
-
- private:
-  static std::uint64_t readBigEndian(const Data& bytes, std::size_t at) {
-    std::uint64_t v = 0;
-    for (std::size_t i = 0; i < 8; ++i) {
-      v = (v << 8) | bytes[at + i];
-    }
-    return v;
-  }
-
-  Data frame_;
-  std::size_t numberAt_ = 0;
-};
-
-// No argument with a value: a property list has no nil, so the reply is
-// written without them (an accepted event's answer is {"result": nil}).
-bool carriesNothing(const Dictionary& args) {
-  for (const auto& [key, value] : args) {
-    if (!value.isNil()) {
-      return false;
-    }
-  }
-  return true;
-}
-
-}  // namespace
-
 Data encodeReply(std::uint64_t call, const Dictionary& args) {
-  if (carriesNothing(args)) {
-    static const EmptyReplyTemplate kEmptyReply;
-    if (auto frame = kEmptyReply.reply(call)) {
-      return std::move(*frame);
-    }
-  }
-  return encodeReplyFrame(call, args);
+  return encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(call))}, {"args", Value(args)}}));
 }
 
 Data encodeErrorReply(std::uint64_t call, const Error& error) {
@@ -270,17 +118,17 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
     return std::nullopt;
   }
   std::string plistError;
-  const auto root = plist::decodeBinary(body, frameLimits(), &plistError);
+  // Text that is not UTF-8 would silently change on its way on (the frame
+  // writer puts U+FFFD for its bad bytes, libplist cuts it short at the
+  // first), so the read refuses it at the door.
+  const auto root = bplist::decode(body, frameLimits(), &plistError, bplist::Text::Utf8Only);
   if (!root) {
-    setWhy(why, "frame body does not parse: " + plistError);
+    setWhy(why, plistError == bplist::kNotUtf8 ? std::string("message holds text that is not valid UTF-8")
+                                               : "frame body does not parse: " + plistError);
     return std::nullopt;
   }
   if (!root->isDict()) {
     setWhy(why, fmt::format("message is {}, not a dictionary", root->kindName()));
-    return std::nullopt;
-  }
-  if (!allTextValid(*root)) {
-    setWhy(why, "message holds text that is not valid UTF-8");
     return std::nullopt;
   }
   const Value args = (*root)["args"];

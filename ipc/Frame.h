@@ -29,7 +29,7 @@ inline constexpr const char* kErrorDomain = "com.velmar.zerith.ErrorDomain";
 
 inline constexpr std::size_t kFrameHeaderBytes = 4;
 
-// The structural limits a frame body must pass before libplist parses it.
+// The bounds a frame body must keep for the frame codec to read it.
 plist::Limits frameLimits();
 
 // One frame (header and body) carrying `message`.

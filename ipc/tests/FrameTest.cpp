@@ -59,9 +59,7 @@ TEST(FrameCodec, CallsAndRepliesSurviveTheRoundTrip) {
 }
 
 TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
-  // Empty replies are copied from one encoding with the number set in eight
-  // bytes; every number must read back as itself, and a number that needs all
-  // eight bytes must come out exactly as libplist writes it.
+  // Every number must read back as itself, whatever width it is written in.
   const std::uint64_t wide = 0x1234567890abcdefull;
   EXPECT_EQ(encodeReply(wide, Dictionary{}),
             encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(wide))}, {"args", Dictionary{}}})));
@@ -83,7 +81,7 @@ TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
     EXPECT_TRUE(m->replyArgs.empty());
     EXPECT_FALSE(m->replyError);
   }
-  // Arguments without a value are left out, as libplist leaves them out.
+  // Arguments without a value are left out: a property list has no nil.
   const Dictionary nils{{"result", Value()}, {"error", Value()}};
   EXPECT_EQ(encodeReply(wide, nils),
             encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(wide))}, {"args", Value(nils)}})));
