@@ -22,6 +22,7 @@
 #include "daemon/StorebagCache.h"
 #include "ipc/DaemonStatus.h"
 #include "ipc/Listener.h"
+#include "platform/RateLimitedLog.h"
 #include "platform/SerialQueue.h"
 #include "platform/Value.h"
 #include "session/ZerithdSessionDelegate.h"
@@ -114,6 +115,9 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
   // Folds the counters of ended sessions' backends that have gone into
   // endedTotals_ (under the lock).
   void foldEndedBackends();
+
+  // Refused clients: one line per uid and interval, with a count of the rest.
+  log::RateLimitedLog refusals_{"daemon", log::Level::Default, std::chrono::seconds(10)};
 
   mutable std::recursive_mutex lock_;
   std::vector<std::shared_ptr<ZerithdSession>> sessionList_;
