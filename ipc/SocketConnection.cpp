@@ -548,8 +548,13 @@ bool SocketConnection::accountInput() {
   registry.input -= inputHeld_;
   inputHeld_ = held;
   const std::size_t limit = gAllConnections.load();
-  const std::size_t all = registry.input.load() + registry.total.load();
-  if (decoder_.buffered() == 0 || all <= limit) {
+  const std::size_t input = registry.input.load();
+  const std::size_t waiting = registry.total.load();
+  const std::size_t all = input + waiting;
+  // Past the limit the reader goes when unfinished frames are what fills it
+  // (or its own frame alone is large); when waiting replies are, the
+  // slowest reader of those goes instead (QueueRegistry::enforce).
+  if (decoder_.buffered() == 0 || all <= limit || (input < waiting && decoder_.buffered() < gPauseReadingAt.load())) {
     return true;
   }
   badCallLog().log(peer_.uid,

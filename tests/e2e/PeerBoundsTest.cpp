@@ -241,6 +241,7 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
 TEST_F(PeerBoundsTest, AtTheConnectionLimitAcceptingWaitsUntilOneCloses) {
   grant(Value(true));
   Defaults("com.velmar.zerith").setObject("maxConnections", Value(20));
+  Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(20));
   startQuietDaemon();
   std::vector<RawClient> clients;
   for (int i = 0; i < 20; ++i) {
