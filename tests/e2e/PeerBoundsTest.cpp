@@ -49,6 +49,20 @@ class DescriptorLimit {
   rlim_t granted_ = 0;
 };
 
+// A one-byte message with room for one descriptor (SCM_RIGHTS).
+struct FdMessage {
+  char byte = 0;
+  iovec io{&byte, 1};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+  msghdr m{};
+  FdMessage() {
+    m.msg_iov = &io;
+    m.msg_iovlen = 1;
+    m.msg_control = control;
+    m.msg_controllen = sizeof control;
+  }
+};
+
 // A connection to the daemon made by a process running as `uid`, so that the
 // daemon sees that user at the other end.
 std::optional<RawClient> connectAs(uid_t uid) {
@@ -59,6 +73,7 @@ std::optional<RawClient> connectAs(uid_t uid) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   std::strncpy(address.sun_path, paths::socketPath().c_str(), sizeof(address.sun_path) - 1);
+  FdMessage message;
   const pid_t child = ::fork();
   if (child == 0) {  // system calls only until _exit
     const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
@@ -68,39 +83,23 @@ std::optional<RawClient> connectAs(uid_t uid) {
         ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
       ::_exit(1);
     }
-    char byte = 0;
-    iovec io{&byte, 1};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    msghdr m{};
-    m.msg_iov = &io;
-    m.msg_iovlen = 1;
-    m.msg_control = control;
-    m.msg_controllen = sizeof control;
-    cmsghdr* c = CMSG_FIRSTHDR(&m);
+    cmsghdr* c = CMSG_FIRSTHDR(&message.m);
     c->cmsg_level = SOL_SOCKET;
     c->cmsg_type = SCM_RIGHTS;
     c->cmsg_len = CMSG_LEN(sizeof(int));
     std::memcpy(CMSG_DATA(c), &fd, sizeof fd);
-    ::_exit(::sendmsg(pair[1], &m, 0) == 1 ? 0 : 1);
+    ::_exit(::sendmsg(pair[1], &message.m, 0) == 1 ? 0 : 1);
   }
   ::close(pair[1]);
   file::UniqueFd parent(pair[0]);
-  char byte = 0;
-  iovec io{&byte, 1};
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-  msghdr m{};
-  m.msg_iov = &io;
-  m.msg_iovlen = 1;
-  m.msg_control = control;
-  m.msg_controllen = sizeof control;
-  const bool got = ::recvmsg(parent.get(), &m, MSG_CMSG_CLOEXEC) == 1 && CMSG_FIRSTHDR(&m);
+  const bool got = ::recvmsg(parent.get(), &message.m, MSG_CMSG_CLOEXEC) == 1 && CMSG_FIRSTHDR(&message.m);
   int status = 0;
   ::waitpid(child, &status, 0);
   if (!got) {
     return std::nullopt;
   }
   int fd = -1;
-  std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&m)), sizeof fd);
+  std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&message.m)), sizeof fd);
   return RawClient::adopt(file::UniqueFd(fd));
 }
 
