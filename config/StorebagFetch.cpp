@@ -83,6 +83,8 @@ std::optional<Data> fetchNetworkStorebag(const std::string& name, bool synchrono
   request.url = url;
   request.ignoreLocalCache = true;
   request.timeoutSeconds = kStorebagRequestTimeout;
+  // A larger storebag would be refused anyway; the download stops there.
+  request.maxResponseBytes = kMaxStorebagContainerBytes;
   if (lastModified) {
     configLogger().debug("fetchNetworkStorebag: Adding 'Last-Modified: {}' to the header", *lastModified);
     request.setValue(*lastModified, "If-Modified-Since");

@@ -78,8 +78,9 @@ std::string ZerithdAgent::description() const { return fmt::format("<ZerithdAgen
 bool ZerithdAgent::shouldAcceptNewConnection(ipc::Listener& /*listener*/, std::shared_ptr<ipc::Connection> connection) {
   const Value entitlement = connection->valueForEntitlement(std::string(kEntitlement));
   if (!(entitlement.isBool() && entitlement.boolValue())) {
-    logger().debug("listener: new Vesk connection {} does not have required zerith entitlement. Closing connection...",
-                   connection->description());
+    const ipc::PeerCredentials& peer = connection->peer();
+    refusals_.log(peer.uid, "listener: refusing a client (uid {}, gid {}, pid {} at connect): it lacks the entitlement {}",
+                  peer.uid, peer.gid, peer.pid, kEntitlement);
     return false;
   }
 
@@ -99,7 +100,8 @@ bool ZerithdAgent::shouldAcceptNewConnection(ipc::Listener& /*listener*/, std::s
                    connection->description());
     return false;
   }
-  auto exporter = std::make_shared<ipc::ClientSessionExporter>(session, connection->description());
+  auto exporter = std::make_shared<ipc::ClientSessionExporter>(session, connection->description(),
+                                                                connection->peer().uid);
   // The status shows every client's sessions: it takes an entitlement of its
   // own, looked up now as the one that admitted the peer.
   const Value statusEntitlement = connection->valueForEntitlement(ipc::kDaemonStatusEntitlement);

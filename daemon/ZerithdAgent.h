@@ -25,6 +25,7 @@
 #include "daemon/StorebagCache.h"
 #include "ipc/DaemonStatus.h"
 #include "ipc/Listener.h"
+#include "platform/RateLimitedLog.h"
 #include "platform/SerialQueue.h"
 #include "platform/Value.h"
 #include "session/ZerithdSessionDelegate.h"
@@ -117,6 +118,9 @@ class ZerithdAgent final : public ZerithdSessionDelegate,
   // Folds the counters of ended sessions' backends that have gone into
   // endedTotals_ (under the lock).
   void foldEndedBackends();
+
+  // Refused clients: one line per uid and interval, with a count of the rest.
+  log::RateLimitedLog refusals_{"daemon", log::Level::Default, std::chrono::seconds(10)};
 
   mutable AgentLock lock_{LockRank::Agent, "the agent lock"};
   // The keep-alive count and the transaction's begin and end: a leaf.

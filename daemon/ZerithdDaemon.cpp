@@ -163,6 +163,9 @@ int ZerithdDaemon::run() {
     logger().error("main: Unable to listen on {}", paths::socketPath().string());
     return 1;
   }
+  const auto limits = ipc::ConnectionLimits::forThisProcess("com.velmar.zerith");
+  listener->setConnectionLimits(limits);
+  logger().info("main: at most {} client connections, {} per user", limits.total, limits.perUid);
   const auto transaction = std::make_shared<KeepAliveTransaction>();
   const auto agent = ZerithdAgent::create(transaction, std::make_unique<StorebagCache>());
   listener->setDelegate(agent.get());

@@ -3,6 +3,7 @@
 #include "ipc/ClientSessionWire.h"
 #include "ipc/DaemonStatus.h"
 #include "ipc/Frame.h"
+#include "ipc/SocketConnection.h"
 
 namespace zerith::ipc {
 
@@ -14,8 +15,9 @@ Value valueOf(const std::optional<Error>& error) { return error ? error->toValue
 
 }  // namespace
 
-ClientSessionExporter::ClientSessionExporter(std::shared_ptr<ClientSessionInterface> session, std::string peer)
-    : session_(std::move(session)), peer_(std::move(peer)) {}
+ClientSessionExporter::ClientSessionExporter(std::shared_ptr<ClientSessionInterface> session, std::string peer,
+                                             uid_t peerUid)
+    : session_(std::move(session)), peer_(std::move(peer)), peerUid_(peerUid) {}
 
 bool ClientSessionExporter::answersWithoutWaiting(const Message& message) const {
   const std::string& name = message.operation;
@@ -37,14 +39,14 @@ void ClientSessionExporter::handleMessage(const Message& message, std::shared_pt
   }
   if (!op) {
     const Error error = unknownOperationError(message.operation);
-    log_.error("ClientSessionExporter: {}{}", error.description, from);
+    badCallLog().log(peerUid_, "ClientSessionExporter: {}{}", error.description, from);
     if (message.call) {
       reply->fail(error);
     }
     return;
   }
   if (auto why = checkArguments(*op, message.args)) {
-    log_.error("ClientSessionExporter: {}{}", *why, from);
+    badCallLog().log(peerUid_, "ClientSessionExporter: {}{}", *why, from);
     if (message.call) {
       reply->fail(argumentError(std::move(*why)));
     }

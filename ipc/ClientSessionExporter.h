@@ -5,12 +5,14 @@
 // type, and sends the completions back as replies.
 //
 // An unknown operation or an argument of the wrong type is logged at error
-// level and, when the caller asked for a reply, answered with an error reply
+// level (rate-limited per uid: badCallLog()) and, when the caller asked for a reply, answered with an error reply
 // (kZerithErrorDomain, code -1); the session is not called and the
 // connection goes on. A completion is passed to the session only when the
 // caller asked for a reply (otherwise the session gets an empty one, which
 // it may skip). Operations without a completion answer an empty reply once
 // the session has taken the call, when one was asked for.
+
+#include <sys/types.h>
 
 #include <functional>
 #include <memory>
@@ -24,8 +26,10 @@ namespace zerith::ipc {
 
 class ClientSessionExporter final : public ExportedObject {
  public:
-  // `peer` names the connection in log lines (Connection::description()).
-  explicit ClientSessionExporter(std::shared_ptr<ClientSessionInterface> session, std::string peer = {});
+  // `peer` names the connection in log lines (Connection::description());
+  // `peerUid` is whose bad calls the error lines count (badCallLog()).
+  explicit ClientSessionExporter(std::shared_ptr<ClientSessionInterface> session, std::string peer = {},
+                                 uid_t peerUid = 0);
 
   void handleMessage(const Message& message, std::shared_ptr<Reply> reply) override;
   // The calls that only read or record the session's state: the display
@@ -45,8 +49,8 @@ class ClientSessionExporter final : public ExportedObject {
  private:
   std::shared_ptr<ClientSessionInterface> session_;
   std::string peer_;
+  uid_t peerUid_ = 0;
   StatusHandler statusHandler_;
-  log::Logger log_{"ipc"};
 };
 
 }  // namespace zerith::ipc

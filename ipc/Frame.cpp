@@ -75,8 +75,7 @@ void FrameDecoder::append(const std::uint8_t* bytes, std::size_t size) {
 }
 
 void FrameDecoder::releaseSpare() {
-  constexpr std::size_t kKeep = 128u << 10;
-  if (offset_ == buffer_.size() && buffer_.capacity() > kKeep) {
+  if (offset_ == buffer_.size() && buffer_.capacity() > 0) {
     Data().swap(buffer_);
     offset_ = 0;
   }

@@ -53,8 +53,11 @@ class FrameDecoder {
   Status next(plist::Bytes& body, std::string& why);
   // Bytes received but not yet handed out.
   std::size_t buffered() const { return buffer_.size() - offset_; }
-  // Gives back the storage a large frame left behind once nothing is
-  // buffered.
+  // Bytes of memory the decoder holds (what is buffered and the spare room
+  // behind it).
+  std::size_t held() const { return buffer_.capacity(); }
+  // Gives back its storage once nothing is buffered: an idle connection
+  // holds no buffer.
   void releaseSpare();
 
  private:

@@ -11,11 +11,18 @@
 #include <cerrno>
 #include <cstring>
 #include <mutex>
+#include <unordered_map>
+
+#if defined(__GLIBC__)
+#include <malloc.h>
+#endif
 
 #include "ipc/EntitlementPolicy.h"
 #include "ipc/SocketConnection.h"
+#include "platform/Defaults.h"
 #include "platform/Executors.h"
 #include "platform/Log.h"
+#include "platform/RateLimitedLog.h"
 
 namespace zerith::ipc {
 
@@ -23,6 +30,19 @@ namespace {
 
 constexpr int kAcceptsPerTurn = 64;
 constexpr auto kAcceptRetryDelay = std::chrono::milliseconds(100);
+// Refusals of one uid are logged at most once per interval, with a count.
+constexpr auto kRefusalLogInterval = std::chrono::seconds(10);
+// The key of the refusal log that stands for "the listener is full".
+constexpr std::uint64_t kFullKey = std::uint64_t{1} << 40;
+// Descriptors kept for the daemon's own files, spool and servers: an eighth
+// of the limit, at least this many.
+constexpr rlim_t kMinReservedDescriptors = 64;
+// The most connections derived from an unlimited descriptor limit.
+constexpr rlim_t kMaxDerivedConnections = 1u << 20;
+// After this many connections were open at once, the memory they took is
+// given back once most of them have closed.
+constexpr std::size_t kTrimAfterPeak = 64;
+constexpr auto kTrimDelay = std::chrono::seconds(1);
 
 std::string errnoText(int err) { return std::error_code(err, std::generic_category()).message(); }
 
@@ -63,6 +83,21 @@ class SocketListener final : public Listener {
     asio::local::stream_protocol::acceptor acceptor;  // used on `queue`
     std::shared_ptr<const EntitlementPolicy> policy;
 
+    // Open connections, in all and per uid. Touched by the accept loop and
+    // by connections ending (on their own queues).
+    mutable std::mutex countMutex;
+    ConnectionLimits limits = ConnectionLimits::forDescriptorLimit(descriptorLimit());
+    std::size_t open = 0;
+    std::size_t peak = 0;  // most open since memory was last given back
+    std::unordered_map<uid_t, std::size_t> openPerUid;
+    bool acceptPaused = false;
+    log::RateLimitedLog refusals{"ipc", log::Level::Default, kRefusalLogInterval};
+
+    static rlim_t descriptorLimit() {
+      rlimit rl{};
+      return ::getrlimit(RLIMIT_NOFILE, &rl) == 0 ? rl.rlim_cur : 1024;
+    }
+
     std::recursive_mutex mutex;  // held while the delegate decides
     Listener* owner = nullptr;
     ListenerDelegate* delegate = nullptr;
@@ -89,6 +124,9 @@ class SocketListener final : public Listener {
         return;
       }
       for (int n = 0; n < kAcceptsPerTurn && !stopped; ++n) {
+        if (pauseIfFull()) {
+          return;  // a closing connection arms again
+        }
         const int client = ::accept4(fd, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
         if (client >= 0) {
           admit(file::UniqueFd(client));
@@ -117,8 +155,13 @@ class SocketListener final : public Listener {
         log.error("Listener: refusing a connection whose peer is unknown: {}", why);
         return;
       }
+      auto slot = take(*peer);
+      if (!slot) {
+        return;  // `client` closes
+      }
       Dictionary entitlements = policy ? policy->entitlementsFor(*peer) : Dictionary();
       auto connection = SocketConnection::adopt(std::move(client), std::move(*peer), std::move(entitlements));
+      connection->holdUntilClosed(std::move(slot));
       bool accepted = false;
       {
         std::lock_guard lock(mutex);
@@ -135,6 +178,90 @@ class SocketListener final : public Listener {
       std::error_code ignored;
       acceptor.close(ignored);
     }
+
+    // On `queue`: at the limit, accepting stops (the socket's backlog holds
+    // who comes next) instead of failing or spinning on a readable socket.
+    bool pauseIfFull() {
+      std::size_t openNow = 0;
+      std::size_t limit = 0;
+      {
+        std::lock_guard lock(countMutex);
+        if (open < limits.total) {
+          return false;
+        }
+        acceptPaused = true;
+        openNow = open;
+        limit = limits.total;
+      }
+      refusals.log(kFullKey, "Listener: {} connections are open, the limit of {}; new clients wait until one closes",
+                   openNow, limit);
+      return true;
+    }
+
+    // A place for a connection of `peer`; empty (and the refusal logged) when
+    // its uid holds as many as one uid may. The place is given back when the
+    // returned token goes.
+    std::shared_ptr<void> take(const PeerCredentials& peer) {
+      std::size_t held = 0;
+      std::size_t limit = 0;
+      {
+        std::lock_guard lock(countMutex);
+        std::size_t& mine = openPerUid[peer.uid];
+        if (mine < limits.perUid) {
+          ++mine;
+          ++open;
+          peak = std::max(peak, open);
+          struct Slot {
+            std::weak_ptr<State> state;
+            uid_t uid;
+            ~Slot() {
+              if (auto self = state.lock()) {
+                self->release(uid);
+              }
+            }
+          };
+          return std::make_shared<Slot>(weak_from_this(), peer.uid);
+        }
+        held = mine;
+        limit = limits.perUid;
+      }
+      refusals.log(peer.uid, "Listener: refusing a client (uid {}, gid {}, pid {} at connect): its user holds {} connections, the most one user may have ({})",
+                   peer.uid, peer.gid, peer.pid, held, limit);
+      return nullptr;
+    }
+
+    void release(uid_t uid) {
+      bool resumeAccepting = false;
+      bool giveBack = false;
+      {
+        std::lock_guard lock(countMutex);
+        if (const auto it = openPerUid.find(uid); it != openPerUid.end() && --it->second == 0) {
+          openPerUid.erase(it);
+        }
+        --open;
+        if (acceptPaused && open < limits.total) {
+          acceptPaused = false;
+          resumeAccepting = true;
+        }
+        if (peak >= kTrimAfterPeak && open <= peak / 4) {
+          peak = open;
+          giveBack = true;
+        }
+      }
+      if (resumeAccepting) {
+        queue.async([self = shared_from_this()] { self->arm(); });
+      }
+      if (giveBack) {
+        // A burst of connections has mostly closed: the allocator's free
+        // pages (their sockets', buffers' and sessions' memory) go back to
+        // the system, once the sessions behind them have been torn down.
+        queue.after(kTrimDelay, [] {
+#if defined(__GLIBC__)
+          ::malloc_trim(0);
+#endif
+        });
+      }
+    }
   };
 
   SocketListener(std::shared_ptr<State> state, std::filesystem::path createdPath, ino_t createdInode)
@@ -147,6 +274,17 @@ class SocketListener final : public Listener {
   void setDelegate(ListenerDelegate* delegate) override {
     std::lock_guard lock(state_->mutex);
     state_->delegate = delegate;
+  }
+
+  void setConnectionLimits(const ConnectionLimits& limits) override {
+    std::lock_guard lock(state_->countMutex);
+    state_->limits = ConnectionLimits{std::max<std::size_t>(limits.total, 1),
+                                      std::clamp<std::size_t>(limits.perUid, 1, std::max<std::size_t>(limits.total, 1))};
+  }
+
+  std::size_t openConnections() const override {
+    std::lock_guard lock(state_->countMutex);
+    return state_->open;
   }
 
   void resume() override {
@@ -218,6 +356,40 @@ file::UniqueFd activatedSocket(const std::filesystem::path& socketPath, const lo
 }
 
 }  // namespace
+
+ConnectionLimits ConnectionLimits::forDescriptorLimit(rlim_t descriptors) {
+  descriptors = std::min(descriptors, kMaxDerivedConnections);
+  const rlim_t reserved = std::max(kMinReservedDescriptors, descriptors / 8);
+  const std::size_t total = descriptors > reserved + 16 ? descriptors - reserved : 16;
+  return ConnectionLimits{total, std::max<std::size_t>(total / 4, 1)};
+}
+
+ConnectionLimits ConnectionLimits::forThisProcess(const std::string& defaultsDomain) {
+  rlimit rl{};
+  const rlim_t descriptors = ::getrlimit(RLIMIT_NOFILE, &rl) == 0 ? rl.rlim_cur : 1024;
+  ConnectionLimits limits = forDescriptorLimit(descriptors);
+  const std::size_t most = descriptors > kMinReservedDescriptors ? descriptors - kMinReservedDescriptors : 16;
+  const Defaults defaults(defaultsDomain);
+  const auto key = [&](const char* name, std::size_t& value) {
+    const Value v = defaults.objectForKey(name);
+    if (v.isNil()) {
+      return;
+    }
+    if (!v.isNumber() || v.intValue() <= 0) {
+      log::Logger("ipc").error("Listener: ignoring {} = {}: not a positive integer", name, v.description());
+      return;
+    }
+    value = std::min<std::size_t>(static_cast<std::size_t>(v.intValue()), most);
+  };
+  const std::size_t derivedTotal = limits.total;
+  key("maxConnections", limits.total);
+  if (limits.total != derivedTotal) {
+    limits.perUid = std::max<std::size_t>(limits.total / 4, 1);
+  }
+  key("maxConnectionsPerUser", limits.perUid);
+  limits.perUid = std::min(limits.perUid, limits.total);
+  return limits;
+}
 
 std::unique_ptr<Listener> Listener::create(const std::filesystem::path& socketPath,
                                            std::shared_ptr<const EntitlementPolicy> policy) {

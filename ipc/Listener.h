@@ -4,6 +4,9 @@
 // ("com.velmar.zerithd" -> <runtime folder>/com.velmar.zerithd), created by
 // the daemon or handed over by systemd socket activation.
 
+#include <sys/resource.h>
+
+#include <cstddef>
 #include <filesystem>
 #include <memory>
 
@@ -24,6 +27,26 @@ class ListenerDelegate {
 
 class EntitlementPolicy;
 
+// Connections the listener keeps open at once. At `total` it stops accepting
+// (new clients wait in the socket's backlog, or their connect fails once the
+// backlog is full) until a connection closes; a uid at `perUid` has its
+// further connections closed at once. Both stay below the descriptor limit,
+// so that the daemon keeps descriptors for its files and servers.
+struct ConnectionLimits {
+  std::size_t total = 0;
+  std::size_t perUid = 0;
+
+  // From the process's descriptor limit: an eighth of it (at least 64) is
+  // kept for everything but clients, and one uid may hold a quarter of the
+  // rest.
+  static ConnectionLimits forDescriptorLimit(rlim_t descriptors);
+  // The limits of this process (RLIMIT_NOFILE's soft limit), with the
+  // defaults keys "maxConnections" and "maxConnectionsPerUser" of
+  // `defaultsDomain` taking their place when set (positive integers; never
+  // above what the descriptors allow).
+  static ConnectionLimits forThisProcess(const std::string& defaultsDomain);
+};
+
 class Listener {
  public:
   virtual ~Listener() = default;
@@ -36,6 +59,12 @@ class Listener {
                                           std::shared_ptr<const EntitlementPolicy> policy);
 
   virtual void setDelegate(ListenerDelegate* delegate) = 0;
+  // Before resume(); without a call the limits are those of
+  // ConnectionLimits::forDescriptorLimit for the process's descriptor limit.
+  // A listener that takes no connections of its own (a test's) ignores it.
+  virtual void setConnectionLimits(const ConnectionLimits& /*limits*/) {}
+  // Connections open now (accepted and not yet closed).
+  virtual std::size_t openConnections() const { return 0; }
   virtual void resume() = 0;
   // Stops accepting; existing connections go on.
   virtual void stop() = 0;

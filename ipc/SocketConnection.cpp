@@ -92,6 +92,9 @@ struct QueueRegistry {
   std::mutex mutex;
   std::vector<SocketConnection*> connections;
   std::atomic<std::size_t> total{0};
+  // Bytes the read sides hold for frames not complete yet; they count
+  // against the same limit as the outboxes.
+  std::atomic<std::size_t> input{0};
   // Set once bytes have waited for a peer that did not read; the memory they
   // took is given back when the outboxes have drained again.
   std::atomic<bool> giveBackArmed{false};
@@ -166,6 +169,11 @@ struct QueueRegistry {
               total.load());
   }
 };
+
+log::RateLimitedLog& badCallLog() {
+  static auto* log = new log::RateLimitedLog("ipc", log::Level::Error, std::chrono::seconds(10));  // used until exit
+  return *log;
+}
 
 QueueLimits queueLimits() {
   return QueueLimits{gPauseReadingAt.load(), gResumeReadingAt.load(), gPerConnection.load(), gAllConnections.load(),
@@ -260,8 +268,7 @@ SocketConnection::SocketConnection(Private, file::UniqueFd fd, PeerCredentials p
       fd_(fd.get()),
       peer_(std::move(peer)),
       entitlements_(std::move(entitlements)),
-      socket_(socketContext()),
-      readBuffer_(kReadChunk) {
+      socket_(socketContext()) {
   std::error_code ec;
   socket_.assign(asio::local::stream_protocol(), fd.get(), ec);
   if (ec) {
@@ -280,6 +287,7 @@ SocketConnection::~SocketConnection() {
     QueueRegistry::get().remove(this);
   }
   QueueRegistry::get().total -= queued_.load();
+  QueueRegistry::get().input -= inputHeld_;
 }
 
 bool SocketConnection::readingPaused() const {
@@ -315,6 +323,14 @@ void SocketConnection::resume() {
 
 void SocketConnection::invalidate() { beginInvalidation(); }
 
+void SocketConnection::holdUntilClosed(std::shared_ptr<void> token) {
+  std::lock_guard lock(stateMutex_);
+  if (!invalidated_) {
+    closeToken_ = std::move(token);
+  }
+  // Otherwise `token` goes here: the connection has ended already.
+}
+
 Value SocketConnection::valueForEntitlement(const std::string& entitlement) const {
   return entitlements_.get(entitlement);
 }
@@ -330,19 +346,22 @@ void SocketConnection::startRead() {
   if (invalidated_) {
     return;
   }
-  socket_.async_read_some(asio::buffer(readBuffer_),
-                          [self = std::static_pointer_cast<SocketConnection>(shared_from_this())](
-                              const std::error_code& ec, std::size_t size) { self->onRead(ec, size); });
+  // No buffer is held while the connection waits: the bytes are read when
+  // they are there, into the reading thread's own buffer, and only an
+  // unfinished frame stays with the connection (its decoder).
+  socket_.async_wait(asio::socket_base::wait_read,
+                     [self = std::static_pointer_cast<SocketConnection>(shared_from_this())](const std::error_code& ec) {
+                       self->onReadable(ec);
+                     });
 }
 
-void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
-  // The chunk is handled as a turn of the connection's queue: right here on
-  // the reading thread when the queue is free (no hand-off on the way to the
-  // exported object), else queued behind what the queue is doing. Never by
-  // waiting for the queue: a reading thread that waited could hold the very
-  // pool thread the queue needs. readBuffer_ stays untouched until then,
-  // since the next read starts from inside that turn.
-  auto handle = [this, ec, size] {
+void SocketConnection::onReadable(const std::error_code& ec) {
+  // The chunk is read and handled as a turn of the connection's queue: right
+  // here on the reading thread when the queue is free (no hand-off on the way
+  // to the exported object), else queued behind what the queue is doing.
+  // Never by waiting for the queue: a reading thread that waited could hold
+  // the very pool thread the queue needs.
+  auto handle = [this, ec] {
     if (ec) {
       readFailed(ec);
       return;
@@ -350,7 +369,22 @@ void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
     if (invalidated_) {
       return;
     }
-    decoder_.append(readBuffer_.data(), size);
+    thread_local std::vector<std::uint8_t> chunk(kReadChunk);
+    const ssize_t n = ::recv(fd_, chunk.data(), chunk.size(), MSG_DONTWAIT);
+    if (n < 0) {
+      const int err = errno;
+      if (err == EAGAIN || err == EWOULDBLOCK || err == EINTR) {
+        startRead();
+        return;
+      }
+      readFailed(std::error_code(err, std::system_category()));
+      return;
+    }
+    if (n == 0) {
+      readFailed(asio::error::eof);
+      return;
+    }
+    decoder_.append(chunk.data(), static_cast<std::size_t>(n));
     continueReading();
   };
   if (!queue_.runIfFree(handle)) {
@@ -378,7 +412,9 @@ void SocketConnection::continueReading() {
       case InputState::HandedOff: return;
       case InputState::NeedMore:
         decoder_.releaseSpare();
-        startRead();
+        if (accountInput()) {
+          startRead();
+        }
         return;
       case InputState::Paused: break;
     }
@@ -505,12 +541,43 @@ void SocketConnection::deliver(IncomingMessage message) {
   exported->handleMessage(message.call, std::move(reply));
 }
 
+bool SocketConnection::accountInput() {
+  QueueRegistry& registry = QueueRegistry::get();
+  const std::size_t held = decoder_.held();
+  registry.input += held;
+  registry.input -= inputHeld_;
+  inputHeld_ = held;
+  const std::size_t limit = gAllConnections.load();
+  const std::size_t input = registry.input.load();
+  const std::size_t waiting = registry.total.load();
+  const std::size_t all = input + waiting;
+  // Past the limit the reader goes when unfinished frames are what fills it
+  // (or its own frame alone is large); when waiting replies are, the
+  // slowest reader of those goes instead (QueueRegistry::enforce).
+  if (decoder_.buffered() == 0 || all <= limit || (input < waiting && decoder_.buffered() < gPauseReadingAt.load())) {
+    return true;
+  }
+  badCallLog().log(peer_.uid,
+                   "{}: closing connection: unfinished frames and waiting replies of all connections ({} bytes) exceed "
+                   "the limit of {}; this peer holds an unfinished frame of {} bytes",
+                   description(), all, limit, decoder_.buffered());
+  beginInvalidation();
+  return false;
+}
+
+void SocketConnection::releaseInput() {
+  decoder_ = FrameDecoder();
+  QueueRegistry::get().input -= inputHeld_;
+  inputHeld_ = 0;
+}
+
 void SocketConnection::readFailed(const std::error_code& ec) {
   if (invalidated_) {
     return;
   }
   if (decoder_.buffered() > 0) {
-    log_.error("{}: closing connection: it ended inside a frame ({} bytes unread)", description(), decoder_.buffered());
+    badCallLog().log(peer_.uid, "{}: closing connection: it ended inside a frame ({} bytes unread)", description(),
+                     decoder_.buffered());
   } else if (ec == asio::error::eof || ec == asio::error::connection_reset) {
     log_.debug("{}: peer closed the connection", description());
   } else {
@@ -520,7 +587,7 @@ void SocketConnection::readFailed(const std::error_code& ec) {
 }
 
 void SocketConnection::protocolError(const std::string& why) {
-  log_.error("{}: closing connection: {}", description(), why);
+  badCallLog().log(peer_.uid, "{}: closing connection: {}", description(), why);
   beginInvalidation();
 }
 
@@ -896,6 +963,7 @@ void SocketConnection::beginInvalidation() {
 void SocketConnection::finishInvalidation() {
   std::error_code ignored;
   socket_.close(ignored);
+  releaseInput();
   std::unordered_map<std::uint64_t, PendingCall> pending;
   {
     std::lock_guard lock(callsMutex_);
@@ -907,10 +975,12 @@ void SocketConnection::finishInvalidation() {
   }
   std::function<void()> handler;
   std::shared_ptr<ExportedObject> exported;
+  std::shared_ptr<void> token;  // given back after the handler, with the descriptor closed
   {
     std::lock_guard lock(stateMutex_);
     handler = std::move(invalidationHandler_);
     invalidationHandler_ = nullptr;
+    token = std::move(closeToken_);
     interruptionHandler_ = nullptr;
     exported = std::move(exported_);
     exported_ = nullptr;

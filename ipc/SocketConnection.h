@@ -2,8 +2,10 @@
 
 // The Connection over a Unix-domain stream socket.
 //
-// Reading: one read is outstanding at a time, on one of the socket threads
-// (socketContext()); each chunk is decoded and its messages delivered in a
+// Reading: one wait for readable bytes is outstanding at a time, on one of
+// the socket threads (socketContext()); the bytes are read into the reading
+// thread's own buffer, so an idle connection holds no read buffer, and only
+// a frame not complete yet stays with the connection. Each chunk is decoded and its messages delivered in a
 // turn of the connection's serial queue (on the socket thread when the queue
 // is free, so without a hand-off), and the next read starts only once that
 // is done, so a peer that floods the socket waits for its earlier calls to be
@@ -45,8 +47,10 @@
 // is then closed. The outboxes of all connections together are held under
 // allConnections: past it the connection whose peer has gone longest without
 // catching up is closed first, then the next, until the total is back under
-// the limit. Once the bytes that waited are written or dropped, the memory
-// they took is given back to the system.
+// the limit. The bytes held for unfinished frames count against the same
+// limit: a chunk that takes them past it closes its connection. Once the
+// bytes that waited are written or dropped, the memory they took is given
+// back to the system.
 
 // A standard header first: asio decides between aligned_alloc and operator
 // new by a libstdc++ macro, and every translation unit must decide alike.
@@ -64,6 +68,7 @@
 #include "ipc/Frame.h"
 #include "platform/FileUtil.h"
 #include "platform/Log.h"
+#include "platform/RateLimitedLog.h"
 
 namespace zerith::ipc {
 
@@ -89,6 +94,11 @@ QueueLimits queueLimits();
 void setQueueLimits(const QueueLimits& limits);
 // Bytes waiting in the outboxes of all connections of the process.
 std::size_t queuedBytesOfAllConnections();
+
+// Errors a client's bad calls cause (malformed frames, unknown operations,
+// arguments of the wrong type): one line per uid and interval, with a count
+// of the rest, so that a flood of bad calls leaves a bounded log.
+log::RateLimitedLog& badCallLog();
 
 // The peer of a connected Unix socket as the kernel recorded it when the
 // connection was made (SO_PEERCRED, SO_PEERGROUPS). nullopt, with `why`, when
@@ -147,6 +157,9 @@ class SocketConnection final : public Connection {
   std::size_t callsInFlight() const { return callsInFlight_.load(); }
   void callTaken();
   void callAnswered();
+  // Keeps `token` until the connection has ended (the listener's count of
+  // open connections goes with it).
+  void holdUntilClosed(std::shared_ptr<void> token);
 
  private:
   friend struct QueueRegistry;
@@ -161,7 +174,7 @@ class SocketConnection final : public Connection {
   bool handledWithoutWaiting(const IncomingMessage& message);
 
   void startRead();
-  void onRead(const std::error_code& ec, std::size_t size);
+  void onReadable(const std::error_code& ec);
   // Delivers buffered frames and reads on, unless the outbox holds the
   // reading back.
   void continueReading();
@@ -171,6 +184,12 @@ class SocketConnection final : public Connection {
   InputState processInput();
   void deliver(IncomingMessage message);
   void readFailed(const std::error_code& ec);
+  // After a chunk: brings the process's count of unfinished-frame bytes up
+  // to date; false (and the connection closed, with a log line) when this
+  // connection's unfinished frame takes the total past the limit.
+  bool accountInput();
+  // The decoder's memory goes, and with it the connection's share.
+  void releaseInput();
   void protocolError(const std::string& why);
 
   // Sends what the socket takes now; 0 or an errno.
@@ -210,12 +229,13 @@ class SocketConnection final : public Connection {
   std::shared_ptr<ExportedObject> exported_;
   std::function<void()> invalidationHandler_;
   std::function<void()> interruptionHandler_;
+  std::shared_ptr<void> closeToken_;
   std::atomic<bool> resumed_{false};
   std::atomic<bool> invalidated_{false};
 
   // Used only on the queue (or by the one outstanding read).
-  std::vector<std::uint8_t> readBuffer_;
   FrameDecoder decoder_;
+  std::size_t inputHeld_ = 0;  // decoder_.held() as last counted
 
   mutable std::mutex writeMutex_;
   std::deque<Data> outbox_;

@@ -7,6 +7,7 @@
 // (absent when none arrived) and the error (absent on success). HTTP status
 // codes are not interpreted by the transport.
 
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <optional>
@@ -22,6 +23,10 @@ namespace zerith {
 
 using HTTPHeaders = std::vector<std::pair<std::string, std::string>>;
 
+// What a server may answer to a request unless the request says otherwise:
+// a collector's answer to a post or an upload is a few bytes.
+inline constexpr std::size_t kDefaultMaxResponseBytes = 1u << 20;
+
 struct URLRequest {
   std::string httpMethod = "GET";
   std::string url;
@@ -30,6 +35,10 @@ struct URLRequest {
   double timeoutSeconds = 0;     // 0: no limit of the request's own
   bool ignoreLocalCache = false;  // never answer from a local cache
   bool allowsCellularAccess = true;
+  // The response body is cut while it arrives once it would pass this many
+  // bytes (or at once when its Content-Length says it will): the request
+  // then fails with kURLErrorResponseTooLarge.
+  std::size_t maxResponseBytes = kDefaultMaxResponseBytes;
 
   void setValue(std::string value, std::string field);  // replaces a header (case-insensitive name)
   std::optional<std::string> valueForHTTPHeaderField(std::string_view field) const;

@@ -297,6 +297,7 @@ struct TransferEngine::Impl {
       return;
     }
     t.responseHeaders.clear();
+    t.received = 0;
     t.readOffset = 0;
     t.lastSent = 0;
     t.errorBuffer[0] = '\0';
@@ -446,7 +447,13 @@ struct TransferEngine::Impl {
       return;
     }
     std::optional<Error> error;
-    if (result != CURLE_OK) {
+    if (t.tooLarge) {
+      const std::size_t limit = task->originalRequest().maxResponseBytes;
+      logger().error("URLSession: task <{}> cut: the answer from {} passed the limit of {} bytes", task->taskDescription(),
+                     task->originalRequest().url, limit);
+      error = Error{kURLErrorDomain, kURLErrorResponseTooLarge,
+                    fmt::format("The response is larger than the limit of {} bytes", limit)};
+    } else if (result != CURLE_OK) {
       error = curlError(result, t.errorBuffer.data());
     }
     complete(task, std::move(error));
@@ -531,6 +538,17 @@ struct TransferEngine::Impl {
   static size_t onData(char* data, size_t size, size_t count, void* userdata) {
     auto& t = *static_cast<Transfer*>(userdata);
     const size_t n = size * count;
+    // Cut at the limit while the body streams in: a short count makes libcurl
+    // end the transfer, and nothing past the limit is kept.
+    const std::size_t limit = t.task->originalRequest().maxResponseBytes;
+    curl_off_t announced = -1;
+    curl_easy_getinfo(t.easy.get(), CURLINFO_CONTENT_LENGTH_DOWNLOAD_T, &announced);
+    if (t.received + n > limit || (announced > 0 && static_cast<std::uint64_t>(announced) > limit)) {
+      t.tooLarge = true;
+      Data().swap(t.pending);
+      return n == 0 ? 1 : 0;
+    }
+    t.received += n;
     if (!t.responseDelivered) {
       deliverResponse(*t.task, t);
     }

@@ -53,6 +53,8 @@ struct Transfer {
   HTTPHeaders responseHeaders;  // of the response being received
   bool responseDelivered = false;
   Data pending;  // received, not yet handed to the delegate queue
+  std::uint64_t received = 0;  // body bytes of the current attempt
+  bool tooLarge = false;       // the body passed the request's limit and was cut
   std::int64_t lastSent = 0;
 
   std::optional<std::chrono::steady_clock::time_point> deadline;  // the request's own time-out

@@ -44,8 +44,8 @@ TEST_F(ZerithdAgentTest, RefusesEveryEntitlementThatIsNotExactlyTrue) {
   for (const auto& grant : grants) {
     auto connection = std::make_shared<FakeConnection>(grant);
     EXPECT_FALSE(accept(connection));
-    EXPECT_TRUE(logs.has(Level::Debug, "listener: new Vesk connection " + connection->description() +
-                                           " does not have required zerith entitlement. Closing connection..."));
+    EXPECT_TRUE(logs.has(Level::Default, "listener: refusing a client (uid 0, gid 0, pid 0 at connect): it lacks the "
+                                         "entitlement com.velmar.private.zerithd"));
     EXPECT_EQ(connection->exported(), nullptr);
     EXPECT_EQ(connection->resumed(), 0);
     EXPECT_FALSE(connection->hasInvalidationHandler());

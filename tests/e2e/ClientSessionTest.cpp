@@ -166,7 +166,7 @@ TEST_F(ClientSessionTest, RefusedClientSeesItsCallsFailAndItsConnectionEnd) {
   const auto reply = client->fetchDisplayURL(10s);
   EXPECT_FALSE(reply);
   EXPECT_EQ(invalidated.get_future().wait_for(10s), std::future_status::ready);
-  EXPECT_TRUE(daemon->waitFor("does not have required zerith entitlement. Closing connection..."));
+  EXPECT_TRUE(daemon->waitFor("it lacks the entitlement com.velmar.private.zerithd"));
   EXPECT_EQ(daemon->count("createReportingSessionWithDelegate"), 0u);
 }
 

@@ -42,7 +42,7 @@ TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
     client->call(kDisplayURL, 1);  // may already find the socket closed
     EXPECT_TRUE(client->waitClosed());
   }
-  EXPECT_TRUE(daemon->waitFor("does not have required zerith entitlement. Closing connection...", 3));
+  EXPECT_TRUE(daemon->waitFor("it lacks the entitlement com.velmar.private.zerithd", 3));
   EXPECT_EQ(daemon->count("Accepting new Vesk connection"), 0u);
   EXPECT_EQ(daemon->count("createReportingSessionWithDelegate"), 0u);
 

@@ -43,6 +43,7 @@ class RawClient {
     }
     return RawClient(std::move(fd));
   }
+  static RawClient adopt(file::UniqueFd fd) { return RawClient(std::move(fd)); }
 
   bool write(const Data& bytes) {
     std::size_t done = 0;

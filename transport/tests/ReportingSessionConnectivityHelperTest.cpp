@@ -104,7 +104,9 @@ TEST_F(ConnectivityHelperTest, LargeChunkedBodyArrivesWholeAndInOrder) {
   server.on("/big", Reply{.status = 200, .body = body, .chunkSize = 7001});
   auto helper = Helper::initWithDelegate({}, Helper::GETRequestMode());
   auto done = Completions::make();
-  helper->getURLRequestWithCompletionHandler(get(server.url("/big")), done->handler());
+  URLRequest request = get(server.url("/big"));
+  request.maxResponseBytes = 4u << 20;  // above the 1 MiB that requests take by default
+  helper->getURLRequestWithCompletionHandler(request, done->handler());
   ASSERT_TRUE(done->waitFor(1));
   const auto call = done->calls()[0];
   EXPECT_FALSE(call.error.has_value());

@@ -1,0 +1,315 @@
+// What peers can make the daemon hold: server answers far past their limit,
+// unfinished frames from many clients, thousands of idle connections, one
+// user holding every connection it may, refused clients and bad calls. The
+// daemon's memory stays bounded, other clients are served, and the log says
+// what happened in a bounded number of lines.
+
+#include <sys/fsuid.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+
+#include <fstream>
+#include <regex>
+#include <thread>
+#include <vector>
+
+#include "ipc/Listener.h"
+#include "tests/e2e/E2eFixture.h"
+
+namespace zerith::test {
+namespace {
+
+// A field of /proc/<pid>/status in KiB ("VmRSS", "VmHWM").
+std::uint64_t statusKiB(pid_t pid, const std::string& field) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(in, line)) {
+    if (line.rfind(field + ":", 0) == 0) {
+      return std::stoull(line.substr(field.size() + 1));
+    }
+  }
+  return 0;
+}
+
+// The process's descriptor limit for the length of a test.
+class DescriptorLimit {
+ public:
+  explicit DescriptorLimit(rlim_t wanted) {
+    ::getrlimit(RLIMIT_NOFILE, &saved_);
+    rlimit raised = saved_;
+    raised.rlim_cur = std::min(wanted, saved_.rlim_max);
+    ::setrlimit(RLIMIT_NOFILE, &raised);
+    granted_ = raised.rlim_cur;
+  }
+  ~DescriptorLimit() { ::setrlimit(RLIMIT_NOFILE, &saved_); }
+  rlim_t granted() const { return granted_; }
+
+ private:
+  rlimit saved_{};
+  rlim_t granted_ = 0;
+};
+
+// A one-byte message with room for one descriptor (SCM_RIGHTS).
+struct FdMessage {
+  char byte = 0;
+  iovec io{&byte, 1};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+  msghdr m{};
+  FdMessage() {
+    m.msg_iov = &io;
+    m.msg_iovlen = 1;
+    m.msg_control = control;
+    m.msg_controllen = sizeof control;
+  }
+};
+
+// A connection to the daemon made by a process running as `uid`, so that the
+// daemon sees that user at the other end.
+std::optional<RawClient> connectAs(uid_t uid) {
+  int pair[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) {
+    return std::nullopt;
+  }
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, paths::socketPath().c_str(), sizeof(address.sun_path) - 1);
+  FdMessage message;
+  const pid_t child = ::fork();
+  if (child == 0) {  // system calls only until _exit
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+    // The kernel records the effective uid at connect; the path is still
+    // looked up as root, through the test's private folders.
+    if (::setresuid(0, uid, 0) != 0 || (::setfsuid(0), false) ||
+        ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+      ::_exit(1);
+    }
+    cmsghdr* c = CMSG_FIRSTHDR(&message.m);
+    c->cmsg_level = SOL_SOCKET;
+    c->cmsg_type = SCM_RIGHTS;
+    c->cmsg_len = CMSG_LEN(sizeof(int));
+    std::memcpy(CMSG_DATA(c), &fd, sizeof fd);
+    ::_exit(::sendmsg(pair[1], &message.m, 0) == 1 ? 0 : 1);
+  }
+  ::close(pair[1]);
+  file::UniqueFd parent(pair[0]);
+  const bool got = ::recvmsg(parent.get(), &message.m, MSG_CMSG_CLOEXEC) == 1 && CMSG_FIRSTHDR(&message.m);
+  int status = 0;
+  ::waitpid(child, &status, 0);
+  if (!got) {
+    return std::nullopt;
+  }
+  int fd = -1;
+  std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&message.m)), sizeof fd);
+  return RawClient::adopt(file::UniqueFd(fd));
+}
+
+class PeerBoundsTest : public E2eTest {
+ protected:
+  // The test's own user and "nobody" may report.
+  void grantRootAndNobody() {
+    const Value policy(Dictionary{
+        {"users", Array{Value(0ull), Value(65534ull)}},
+        {"entitlements", Dictionary{{"com.velmar.private.zerithd", true}}}});
+    root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
+  }
+
+  // A client answered within a second and a half.
+  static bool answered(RawClient& client, std::uint64_t number = 1) {
+    return client.call("fetchDisplayURL:", number) && client.replyTo(number, 1500ms).has_value();
+  }
+
+  // Without --debug, where lines that peers cause are rate-limited.
+  DaemonProcess& startQuietDaemon(DaemonProcess::Options options = {}) {
+    options.debug = false;
+    if (options.arguments.empty()) {
+      options.arguments = {"--stop-timeout", "5"};
+    }
+    return startDaemon(std::move(options));
+  }
+
+  std::uint64_t rssKiB() const { return statusKiB(daemon->pid(), "VmRSS"); }
+  std::uint64_t peakKiB() const { return statusKiB(daemon->pid(), "VmHWM"); }
+};
+
+// The server answers far past the limit; the daemon cuts the body where the
+// limit is passed, logs it, and serves the next client.
+struct OversizedAnswer {
+  const char* name;
+  const char* path;           // where the server sends 64 MiB
+  const char* logged;         // the cut's line
+};
+
+class OversizedAnswerTest : public PeerBoundsTest, public ::testing::WithParamInterface<OversizedAnswer> {};
+
+TEST_P(OversizedAnswerTest, IsCutAtTheLimitWhileItStreamsAndOthersAreServed) {
+  grant(Value(true));
+  HttpsTestServer server;
+  serveSignedStorebag(server, collectorStorebag(server.url("/post")));
+  const std::string huge(64u << 20, 'x');
+  server.on(GetParam().path, {.status = 200, .body = huge, .chunkSize = 256u << 10});
+  DaemonProcess::Options options;
+  options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
+  options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
+  startQuietDaemon(options);
+  const std::uint64_t idle = rssKiB();
+
+  auto session = startDemoSession(1);
+  ASSERT_TRUE(session);
+  session->sendMessage(Value(Dictionary{{kZerithMessageParametersCategory, Value(1)},
+                                         {kZerithMessageParametersType, Value(2)},
+                                         {kZerithMessageParametersPayload, Value(Dictionary{{"k", "v"}})}}),
+                       10s);
+  session->finishSession(10s);
+  ASSERT_TRUE(daemon->waitFor(GetParam().logged, 1, 20s)) << daemon->output();
+
+  auto other = RawClient::connect();
+  ASSERT_TRUE(other);
+  EXPECT_TRUE(answered(*other));
+  EXPECT_LT(peakKiB(), idle + (24u << 10)) << "idle " << idle << " KiB";
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Servers, OversizedAnswerTest,
+    ::testing::Values(OversizedAnswer{"StorebagDownload", "/zerith/dravon", "passed the limit of 4194304 bytes"},
+                      OversizedAnswer{"CollectorAnswerToAPost", "/post", "passed the limit of 1048576 bytes"}),
+    [](const auto& info) { return std::string(info.param.name); });
+
+TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
+  grant(Value(true));
+  startQuietDaemon();
+  const std::uint64_t idle = rssKiB();
+  // 200 clients each start a frame of almost 4 MiB and send 1 MiB of it:
+  // 200 MiB together, past the 128 MiB the daemon holds for all clients.
+  constexpr std::size_t kClients = 200;
+  constexpr std::size_t kSent = 1u << 20;
+  const std::uint32_t length = (4u << 20) - 8;
+  Data start{static_cast<std::uint8_t>(length >> 24), static_cast<std::uint8_t>(length >> 16),
+             static_cast<std::uint8_t>(length >> 8), static_cast<std::uint8_t>(length)};
+  start.resize(kSent, 0);
+  std::vector<RawClient> clients;
+  std::size_t cut = 0;
+  for (std::size_t i = 0; i < kClients; ++i) {
+    auto client = RawClient::connect();
+    ASSERT_TRUE(client) << i;
+    cut += client->write(start) ? 0 : 1;  // closed while it wrote
+    clients.push_back(std::move(*client));
+  }
+  ASSERT_TRUE(daemon->waitFor("unfinished frames and waiting replies of all connections", 1, 20s)) << cut << " writes cut";
+  auto other = RawClient::connect();
+  ASSERT_TRUE(other);
+  EXPECT_TRUE(answered(*other));
+  EXPECT_LT(peakKiB(), idle + (128u << 10) + (48u << 10)) << "idle " << idle << " KiB";
+}
+
+TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack) {
+  DescriptorLimit limit(20000);
+  ASSERT_GE(limit.granted(), 10500u);
+  grant(Value(true));
+  Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(12000));
+  startQuietDaemon();
+  const std::uint64_t idle = rssKiB();
+  std::vector<RawClient> clients;
+  clients.reserve(10000);
+  for (int i = 0; i < 10000; ++i) {
+    auto c = RawClient::connect();
+    ASSERT_TRUE(c) << i;
+    clients.push_back(std::move(*c));
+  }
+  auto other = RawClient::connect();
+  ASSERT_TRUE(other);
+  // Behind the 10,000 in the listener's backlog.
+  EXPECT_TRUE(other->call("fetchDisplayURL:", 1) && other->replyTo(1, 10s));
+  const std::uint64_t held = rssKiB();
+  clients.clear();
+  other.reset();
+  // Every descriptor is given back, and the memory they took is trimmed.
+  const auto descriptors = [&] {
+    const std::filesystem::path fds = "/proc/" + std::to_string(daemon->pid()) + "/fd";
+    return std::distance(std::filesystem::directory_iterator(fds), std::filesystem::directory_iterator());
+  };
+  const auto deadline = std::chrono::steady_clock::now() + 10s;
+  while (descriptors() > 64 && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(100ms);
+  }
+  std::this_thread::sleep_for(2s);
+  EXPECT_LE(descriptors(), 64);
+  EXPECT_LT(held, idle + (96u << 10)) << "idle " << idle << " KiB";
+  EXPECT_LE(rssKiB(), held) << "idle " << idle << " KiB, with 10,000 open " << held << " KiB";
+}
+
+TEST_F(PeerBoundsTest, AtTheConnectionLimitAcceptingWaitsUntilOneCloses) {
+  grant(Value(true));
+  Defaults("com.velmar.zerith").setObject("maxConnections", Value(20));
+  Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(20));
+  startQuietDaemon();
+  std::vector<RawClient> clients;
+  for (int i = 0; i < 20; ++i) {
+    auto c = RawClient::connect();
+    ASSERT_TRUE(c && answered(*c)) << i;
+    clients.push_back(std::move(*c));
+  }
+  auto waiting = RawClient::connect();  // in the backlog
+  ASSERT_TRUE(waiting);
+  ASSERT_TRUE(waiting->call("fetchDisplayURL:", 1));
+  EXPECT_FALSE(waiting->replyTo(1, 1s));
+  EXPECT_FALSE(waiting->closed());
+  EXPECT_EQ(daemon->count("connections are open, the limit of 20; new clients wait until one closes"), 1u);
+  clients.front().close();
+  EXPECT_TRUE(waiting->replyTo(1, 5s));
+}
+
+TEST_F(PeerBoundsTest, UnderTheUnitsDescriptorLimitOneUserCannotLockOthersOut) {
+  const char* source = std::getenv("ZERITH_SOURCE_DIR");
+  ASSERT_TRUE(source) << "ZERITH_SOURCE_DIR names the source tree (ctest sets it)";
+  std::ifstream unit(std::string(source) + "/packaging/systemd/zerithd.service.in");
+  const std::string text((std::istreambuf_iterator<char>(unit)), std::istreambuf_iterator<char>());
+  std::smatch m;
+  ASSERT_TRUE(std::regex_search(text, m, std::regex("\nLimitNOFILE=([0-9]+)\n")));
+  DescriptorLimit limit(std::stoul(m[1]));
+  ASSERT_EQ(limit.granted(), std::stoul(m[1]));
+  grantRootAndNobody();
+  startQuietDaemon();
+  const auto limits = ipc::ConnectionLimits::forDescriptorLimit(limit.granted());
+  ASSERT_TRUE(daemon->waitFor(fmt::format("at most {} client connections, {} per user", limits.total, limits.perUid)));
+
+  // Root takes every connection it may, and then 100 more, each refused.
+  std::vector<RawClient> mine;
+  for (std::size_t i = 0; i < limits.perUid + 100; ++i) {
+    auto c = RawClient::connect();
+    ASSERT_TRUE(c) << i;
+    mine.push_back(std::move(*c));
+  }
+  EXPECT_TRUE(mine.back().waitClosed(5s));
+  auto nobody = connectAs(65534);
+  ASSERT_TRUE(nobody);
+  EXPECT_TRUE(answered(*nobody));
+  // One line for the refusals of the interval, then one with the count.
+  EXPECT_EQ(daemon->count("refusing a client (uid 0, gid 0, pid"), 1u);
+  EXPECT_TRUE(daemon->waitFor("(and 99 more like it in the last 10 s)", 1, 15s)) << daemon->output();
+}
+
+TEST_F(PeerBoundsTest, RefusedClientsAndBadCallsLeaveABoundedLog) {
+  grant(Value());  // no entitlement: every client is refused
+  startQuietDaemon();
+  for (int i = 0; i < 100; ++i) {
+    auto c = RawClient::connect();
+    ASSERT_TRUE(c && c->waitClosed(5s)) << i;
+  }
+  EXPECT_EQ(daemon->count("it lacks the entitlement com.velmar.private.zerithd"), 1u);
+  EXPECT_TRUE(daemon->waitFor("(and 99 more like it in the last 10 s)", 1, 15s)) << daemon->output();
+
+  grant(Value(true));
+  auto flooder = RawClient::connect();
+  ASSERT_TRUE(flooder);
+  Data calls;
+  for (int i = 0; i < 20000; ++i) {
+    const Data one = ipc::encodeCall("noSuchOperation", std::nullopt, {});
+    calls.insert(calls.end(), one.begin(), one.end());
+  }
+  ASSERT_TRUE(flooder->write(calls));
+  EXPECT_TRUE(answered(*flooder, 7));
+  EXPECT_LE(daemon->count("ClientSessionExporter: "), 2u);
+}
+
+}  // namespace
+}  // namespace zerith::test
