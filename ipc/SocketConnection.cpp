@@ -330,19 +330,99 @@ void SocketConnection::startRead() {
   if (invalidated_) {
     return;
   }
-  socket_.async_read_some(asio::buffer(readBuffer_),
-                          [self = std::static_pointer_cast<SocketConnection>(shared_from_this())](
-                              const std::error_code& ec, std::size_t size) { self->onRead(ec, size); });
+  // Read by hand (recvmsg) once the socket is readable: a call may carry
+  // descriptors, which a plain read would drop.
+  socket_.async_wait(asio::socket_base::wait_read,
+                     [self = std::static_pointer_cast<SocketConnection>(shared_from_this())](const std::error_code& ec) {
+                       self->onReadable(ec);
+                     });
 }
 
-void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
+void SocketConnection::onReadable(const std::error_code& ec) {
+  if (ec) {
+    onRead(ec, 0, {});
+    return;
+  }
+  iovec part{readBuffer_.data(), readBuffer_.size()};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxDescriptorsPerFrame)];
+  msghdr message{};
+  message.msg_iov = &part;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof(control);
+  ssize_t n = 0;
+  do {
+    n = ::recvmsg(fd_, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+  } while (n < 0 && errno == EINTR);
+  if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+    queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this())] { self->startRead(); });
+    return;
+  }
+  std::vector<file::UniqueFd> fds;
+  if (n > 0) {
+    for (cmsghdr* c = CMSG_FIRSTHDR(&message); c != nullptr; c = CMSG_NXTHDR(&message, c)) {
+      if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) {
+        continue;
+      }
+      const std::size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+      for (std::size_t i = 0; i < count; ++i) {
+        int fd = -1;
+        std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof(int));
+        fds.emplace_back(fd);
+      }
+    }
+    if ((message.msg_flags & MSG_CTRUNC) != 0) {
+      // More than a frame may carry, or no descriptor left in this process:
+      // the kernel closed what did not fit.
+      log_.error("{}: descriptors sent with a call were cut off (at most {} per call, or none left here)",
+                 description(), kMaxDescriptorsPerFrame);
+    }
+  }
+  const std::error_code failed = n < 0 ? std::error_code(errno, std::system_category())
+                                 : n == 0 ? std::error_code(asio::error::eof)
+                                          : std::error_code();
+  onRead(failed, n > 0 ? static_cast<std::size_t>(n) : 0, std::move(fds));
+}
+
+std::vector<std::shared_ptr<const file::UniqueFd>> SocketConnection::claimDescriptors(std::uint64_t frameStart,
+                                                                                     std::uint32_t count) {
+  closeStrayDescriptors(frameStart + 1);
+  std::vector<std::shared_ptr<const file::UniqueFd>> claimed;
+  if (count == 0 || receivedDescriptors_.empty()) {
+    return claimed;
+  }
+  ReceivedDescriptors& front = receivedDescriptors_.front();
+  if (front.first > frameStart) {
+    return claimed;  // they came with a later frame
+  }
+  for (auto& fd : front.fds) {
+    if (claimed.size() < count) {
+      claimed.push_back(std::make_shared<const file::UniqueFd>(std::move(fd)));
+    }
+  }
+  if (front.fds.size() > count) {
+    log_.error("{}: closed {} descriptors beyond the {} a call claimed", description(), front.fds.size() - count, count);
+  }
+  receivedDescriptors_.pop_front();  // what was not claimed closes here
+  return claimed;
+}
+
+void SocketConnection::closeStrayDescriptors(std::uint64_t before) {
+  while (!receivedDescriptors_.empty() && receivedDescriptors_.front().end < before) {
+    log_.error("{}: closed {} descriptors that no call claimed", description(), receivedDescriptors_.front().fds.size());
+    receivedDescriptors_.pop_front();
+  }
+}
+
+void SocketConnection::onRead(const std::error_code& ec, std::size_t size, std::vector<file::UniqueFd> fds) {
   // The chunk is handled as a turn of the connection's queue: right here on
   // the reading thread when the queue is free (no hand-off on the way to the
   // exported object), else queued behind what the queue is doing. Never by
   // waiting for the queue: a reading thread that waited could hold the very
   // pool thread the queue needs. readBuffer_ stays untouched until then,
   // since the next read starts from inside that turn.
-  auto handle = [this, ec, size] {
+  auto received = std::make_shared<std::vector<file::UniqueFd>>(std::move(fds));
+  auto handle = [this, ec, size, received] {
     if (ec) {
       readFailed(ec);
       return;
@@ -350,6 +430,10 @@ void SocketConnection::onRead(const std::error_code& ec, std::size_t size) {
     if (invalidated_) {
       return;
     }
+    if (!received->empty()) {
+      receivedDescriptors_.push_back(ReceivedDescriptors{bytesReceived_, bytesReceived_ + size, std::move(*received)});
+    }
+    bytesReceived_ += size;
     decoder_.append(readBuffer_.data(), size);
     continueReading();
   };
@@ -377,6 +461,9 @@ void SocketConnection::continueReading() {
       case InputState::Closed:
       case InputState::HandedOff: return;
       case InputState::NeedMore:
+        // The next frame starts at bytesDecoded_: descriptors that came
+        // before it belong to no frame.
+        closeStrayDescriptors(bytesDecoded_ + 1);
         decoder_.releaseSpare();
         startRead();
         return;
@@ -427,11 +514,14 @@ SocketConnection::InputState SocketConnection::processInput() {
       case FrameDecoder::Status::Invalid: protocolError(why); return InputState::Closed;
       case FrameDecoder::Status::Frame: break;
     }
+    const std::uint64_t frameStart = bytesDecoded_;
+    bytesDecoded_ += kFrameHeaderBytes + body.size();
     auto message = decodeMessage(body, &why);
     if (!message) {
       protocolError(why);
       return InputState::Closed;
     }
+    message->call.descriptors = claimDescriptors(frameStart, message->descriptorCount);
     if (handledWithoutWaiting(*message)) {
       deliver(std::move(*message));
       continue;
@@ -526,11 +616,50 @@ void SocketConnection::protocolError(const std::string& why) {
 
 // ---- writing (any thread) -----------------------------------------------------
 
-int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent) {
+namespace {
+
+// Room for the SCM_RIGHTS of one frame.
+struct DescriptorControl {
+  alignas(cmsghdr) char bytes[CMSG_SPACE(sizeof(int) * kMaxDescriptorsPerFrame)];
+};
+
+// Sets `message` up to carry `fds` (at most kMaxDescriptorsPerFrame).
+void attachDescriptors(msghdr& message, DescriptorControl& control, const std::vector<file::UniqueFd>& fds) {
+  if (fds.empty()) {
+    return;
+  }
+  const std::size_t count = std::min<std::size_t>(fds.size(), kMaxDescriptorsPerFrame);
+  message.msg_control = control.bytes;
+  message.msg_controllen = CMSG_SPACE(sizeof(int) * count);
+  cmsghdr* c = CMSG_FIRSTHDR(&message);
+  c->cmsg_level = SOL_SOCKET;
+  c->cmsg_type = SCM_RIGHTS;
+  c->cmsg_len = CMSG_LEN(sizeof(int) * count);
+  for (std::size_t i = 0; i < count; ++i) {
+    const int fd = fds[i].get();
+    std::memcpy(CMSG_DATA(c) + i * sizeof(int), &fd, sizeof(int));
+  }
+}
+
+}  // namespace
+
+int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent,
+                               std::vector<file::UniqueFd>* descriptors) {
   while (sent < size) {
-    const ssize_t n = ::send(fd_, bytes + sent, size - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+    iovec part{const_cast<std::uint8_t*>(bytes + sent), size - sent};
+    msghdr message{};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    DescriptorControl control;
+    if (descriptors != nullptr) {
+      attachDescriptors(message, control, *descriptors);
+    }
+    const ssize_t n = ::sendmsg(fd_, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (n > 0) {
       sent += static_cast<std::size_t>(n);
+      if (descriptors != nullptr) {
+        descriptors->clear();  // they left with the first byte; ours close
+      }
       continue;
     }
     if (n < 0 && errno == EINTR) {
@@ -544,7 +673,7 @@ int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std:
   return 0;
 }
 
-bool SocketConnection::writeFrame(Data frame) {
+bool SocketConnection::writeFrame(Data frame, std::vector<file::UniqueFd> descriptors) {
   int err = 0;
   bool overflow = false;
   std::size_t limit = 0;
@@ -561,11 +690,12 @@ bool SocketConnection::writeFrame(Data frame) {
     }
     if (outbox_.empty() && !corked_) {
       std::size_t sent = 0;
-      err = sendSome(frame.data(), frame.size(), sent);
+      err = sendSome(frame.data(), frame.size(), sent, &descriptors);
       if (!err && sent < frame.size()) {
         outboxOffset_ = sent;
         setOutboxBytes(frame.size() - sent);
         outbox_.push_back(std::move(frame));
+        outboxDescriptors_.push_back(std::move(descriptors));
         armWritable();
       }
     } else {
@@ -573,6 +703,7 @@ bool SocketConnection::writeFrame(Data frame) {
       // the end of a delivery: either way it leaves after them.
       setOutboxBytes(outboxBytes_ + frame.size());
       outbox_.push_back(std::move(frame));
+      outboxDescriptors_.push_back(std::move(descriptors));
       limit = gPerConnection.load();
       overflow = outboxBytes_ > limit;
     }
@@ -641,7 +772,12 @@ int SocketConnection::drainOutbox() {
     iovec parts[kFramesPerWrite];
     std::size_t count = 0;
     std::size_t offered = 0;
+    // A frame with descriptors starts a write of its own: they travel with
+    // its first byte.
     for (auto it = outbox_.begin(); it != outbox_.end() && count < kFramesPerWrite; ++it, ++count) {
+      if (count > 0 && !outboxDescriptors_[count].empty()) {
+        break;
+      }
       const std::size_t skip = count == 0 ? outboxOffset_ : 0;
       parts[count].iov_base = it->data() + skip;
       parts[count].iov_len = it->size() - skip;
@@ -650,6 +786,8 @@ int SocketConnection::drainOutbox() {
     msghdr message{};
     message.msg_iov = parts;
     message.msg_iovlen = count;
+    DescriptorControl control;
+    attachDescriptors(message, control, outboxDescriptors_.front());
     const ssize_t n = ::sendmsg(fd_, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (n < 0 && errno == EINTR) {
       continue;
@@ -663,6 +801,7 @@ int SocketConnection::drainOutbox() {
     }
     auto taken = static_cast<std::size_t>(n);
     bytes -= taken;
+    outboxDescriptors_.front().clear();
     while (taken > 0) {
       const std::size_t left = outbox_.front().size() - outboxOffset_;
       if (taken < left) {
@@ -671,6 +810,7 @@ int SocketConnection::drainOutbox() {
       }
       taken -= left;
       outbox_.pop_front();
+      outboxDescriptors_.pop_front();
       outboxOffset_ = 0;
     }
     if (static_cast<std::size_t>(n) < offered) {
@@ -680,6 +820,7 @@ int SocketConnection::drainOutbox() {
   setOutboxBytes(bytes);
   if (outbox_.empty() && outboxWasLarge_) {
     std::deque<Data>().swap(outbox_);
+    std::deque<std::vector<file::UniqueFd>>().swap(outboxDescriptors_);
     outboxWasLarge_ = false;
   }
   return err;
@@ -819,8 +960,20 @@ void SocketConnection::call(const std::string& operation, Dictionary args, Reply
   startCall(operation, std::move(args), std::move(handler), false);
 }
 
+void SocketConnection::call(const std::string& operation, Dictionary args, std::vector<file::UniqueFd> descriptors,
+                            ReplyHandler handler) {
+  if (descriptors.size() > kMaxDescriptorsPerFrame) {
+    queue_.async([handler = std::move(handler)] {
+      handler(std::nullopt, Error{kErrorDomain, -1, "Too many descriptors for one call"});
+    });
+    return;
+  }
+  startCall(operation, std::move(args), std::move(handler), false, std::move(descriptors));
+}
+
 SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& operation, Dictionary args,
-                                                            std::chrono::milliseconds timeout) {
+                                                            std::chrono::milliseconds timeout,
+                                                            std::vector<file::UniqueFd> descriptors) {
   struct Waiter {
     std::mutex mutex;
     std::condition_variable done;
@@ -841,7 +994,7 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
         // handler's own reference keeps the waiter alive meanwhile.
         waiter->done.notify_one();
       },
-      true);
+      true, std::move(descriptors));
   std::unique_lock lock(waiter->mutex);
   if (!waiter->done.wait_for(lock, timeout, [&] { return waiter->arrived; })) {
     WaitedReply late;
@@ -852,7 +1005,7 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
 }
 
 void SocketConnection::startCall(const std::string& operation, Dictionary args, ReplyHandler handler,
-                                 bool neverWaits) {
+                                 bool neverWaits, std::vector<file::UniqueFd> descriptors) {
   std::uint64_t number = 0;
   {
     std::lock_guard lock(callsMutex_);
@@ -866,7 +1019,18 @@ void SocketConnection::startCall(const std::string& operation, Dictionary args, 
     return;
   }
   // A failed write invalidates the connection, which fails the call.
-  writeFrame(encodeCall(operation, number, args));
+  const auto claimed = static_cast<std::uint32_t>(descriptors.size());
+  writeFrame(encodeCall(operation, number, args, claimed), std::move(descriptors));
+}
+
+// ---- connections that pass no descriptors -------------------------------------------
+
+void Connection::call(const std::string& operation, Dictionary args, std::vector<file::UniqueFd> descriptors,
+                      ReplyHandler handler) {
+  (void)operation;
+  (void)args;
+  descriptors.clear();
+  handler(std::nullopt, Error{kErrorDomain, -1, "This connection cannot pass descriptors"});
 }
 
 // ---- invalidation ---------------------------------------------------------------
@@ -882,6 +1046,7 @@ void SocketConnection::beginInvalidation() {
     readPausedFlag_ = false;
     setOutboxBytes(0);
     std::deque<Data>().swap(outbox_);
+    std::deque<std::vector<file::UniqueFd>>().swap(outboxDescriptors_);
     drained_.notify_all();  // writers waiting for room return
     // Wakes the outstanding read; the descriptor itself is closed on the
     // queue, where every other socket operation starts.

@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <cerrno>
+#include <cstring>
 #include <system_error>
 
 #include <fmt/format.h>
@@ -157,7 +158,15 @@ void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(con
     const fs::path container = composeUniqueContainerURL();
     file::UniqueFd body = writeBodyFile(container, request.body);
     if (!body) {
-      return;  // no task and no completion
+      if (request.completesWhenBodyFails && completion) {
+        const int err = errno;
+        stateQueue_.async([completion = std::move(completion), err] {
+          completion(Data(), std::nullopt,
+                     Error{kURLErrorDomain, kURLErrorCannotWriteBody,
+                           fmt::format("the body file cannot be written ({})", std::strerror(err))});
+        });
+      }
+      return;  // else no task and no completion
     }
     URLRequest copy = request;
     copy.body.clear();

@@ -30,6 +30,9 @@ struct URLRequest {
   double timeoutSeconds = 0;     // 0: no limit of the request's own
   bool ignoreLocalCache = false;  // never answer from a local cache
   bool allowsCellularAccess = true;
+  // A mode-1 POST whose body file cannot be written completes with
+  // kURLErrorCannotWriteBody instead of being dropped without a completion.
+  bool completesWhenBodyFails = false;
 
   void setValue(std::string value, std::string field);  // replaces a header (case-insensitive name)
   std::optional<std::string> valueForHTTPHeaderField(std::string_view field) const;
