@@ -335,6 +335,11 @@ void UploadBackend::run(const std::shared_ptr<Exchange>& exchange) {
     }
   }
   const std::string& name = exchange->name;
+  if (std::chrono::steady_clock::now() >= exchange->request.deadline) {
+    // Its turn came too late: nothing is read or posted.
+    backendsLogger().error("UploadBackend(uploadFileAtPath): {}: no answer within the time limit; answering NO", name);
+    return no();
+  }
   std::string why;
   std::optional<Data> body;
   {

@@ -945,17 +945,14 @@ void ZerithdSession::uploadFileWithURL(const Value& fileURL, std::shared_ptr<con
     bool removeFile = false;
   };
   auto answers = std::make_shared<Answers>();
-  const auto done = [weak = weak_from_this(), answers, shownPath, absoluteURL,
-                     completion = std::move(completion)]() {
+  const auto done = [answers, shownPath, absoluteURL, completion = std::move(completion)]() {
     const bool uploaded = answers->uploaded;
     if (uploaded) {
       logger().debug("uploadFileWithURL: File upload successful for {}", shownPath);
     } else {
       logger().error("uploadFileWithURL: File upload failed for {}", shownPath);
     }
-    if (const auto self = weak.lock()) {
-      self->writeToLogFile("[uploadFileWithURL] Upload {} for file {}", uploaded ? "succeeded" : "failed", absoluteURL);
-    }
+    writeToLogFile("[uploadFileWithURL] Upload {} for file {}", uploaded ? "succeeded" : "failed", absoluteURL);
     if (completion) {
       completion(uploaded, uploaded && answers->removeFile);
     }

@@ -11,6 +11,7 @@
 #include <fstream>
 
 #include "daemon/tests/AgentFixture.h"
+#include "platform/SandboxExtension.h"
 
 namespace zerith::test {
 namespace {
