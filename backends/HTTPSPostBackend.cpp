@@ -563,23 +563,11 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
     body.assign(jsonBytes.begin(), jsonBytes.end());
   }
 
-  if (!isInternalBuild()) {
-    const auto at = url->find("://");
-    if (at != std::string::npos && !equalsIgnoringCase(url->substr(0, at), "https")) {
-      // "https" + "://" + the second piece; a further "://" and what follows go.
-      std::string rest = url->substr(at + 3);
-      if (const auto again = rest.find("://"); again != std::string::npos) {
-        rest.resize(again);
-      }
-      url = "https://" + rest;
-    }
-  }
-  // Only HTTP(S) is ever posted to; anything else (no scheme, ftp on an
-  // internal build) is refused here instead of being handed to the transport.
-  const auto schemeEnd = url->find("://");
-  const std::string scheme = schemeEnd == std::string::npos ? std::string() : lowered(url->substr(0, schemeEnd));
-  if (scheme != "https" && scheme != "http") {
-    const std::string text = fmt::format("post URL '{}' is not an http(s) URL", *url);
+  // The https rule, shared with uploads.
+  std::string text;
+  if (auto postable = postableURL(*url, &text)) {
+    url = std::move(*postable);
+  } else {
     backendsLogger().error("HTTPSPostBackend(postJsonMessage): post error: {}", text);
     if (completion) {
       completion(Value(), makeZerithError(text, -1));
@@ -680,17 +668,8 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
 
 namespace {
 
-// Whether a post to `url` gets past the post's own URL checks: a scheme
-// other than https becomes https on a device that is not an internal build,
-// and only http(s) is posted to.
-bool isPostableURL(const std::string& url) {
-  const auto at = url.find("://");
-  if (at == std::string::npos) {
-    return false;
-  }
-  const std::string scheme = lowered(url.substr(0, at));
-  return !isInternalBuild() || scheme == "https" || scheme == "http";
-}
+// Whether a post to `url` gets past the post's own URL checks.
+bool isPostableURL(const std::string& url) { return postableURL(url).has_value(); }
 
 }  // namespace
 

@@ -1,8 +1,12 @@
 #include "backends/ZerithBackend.h"
 
 #include <climits>
+#include <cctype>
 #include <cstdlib>
 
+#include <fmt/format.h>
+
+#include "config/ClientTypes.h"
 #include "platform/Crypto.h"
 
 namespace zerith {
@@ -199,7 +203,11 @@ std::optional<std::string> ZerithBackend::flushMessagesWithCompletion(FlushCompl
   return std::nullopt;
 }
 
-bool ZerithBackend::uploadFileAtPath(const std::string&, const char*) { return false; }
+void ZerithBackend::uploadFileAtPath(const UploadRequest&, UploadCompletion completion) {
+  if (completion) {
+    completion(false, false);
+  }
+}
 
 bool ZerithBackend::uploadLogData(const Value&) { return false; }
 
@@ -249,5 +257,37 @@ ZERITH_LOCKED_PROPERTY(Value, eventBlacklist, setEventBlacklist, eventBlacklist_
 ZERITH_LOCKED_PROPERTY(std::optional<Data>, digestKey, setDigestKey, digestKey_)
 
 #undef ZERITH_LOCKED_PROPERTY
+
+std::optional<std::string> postableURL(std::string url, std::string* why) {
+  const auto lower = [](std::string_view text) {
+    std::string out(text);
+    for (char& c : out) {
+      c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    }
+    return out;
+  };
+  if (!isInternalBuild()) {
+    const auto at = url.find("://");
+    if (at != std::string::npos && lower(url.substr(0, at)) != "https") {
+      // "https" + "://" + the second piece; a further "://" and what follows go.
+      std::string rest = url.substr(at + 3);
+      if (const auto again = rest.find("://"); again != std::string::npos) {
+        rest.resize(again);
+      }
+      url = "https://" + rest;
+    }
+  }
+  // Only HTTP(S) is ever posted to; anything else (no scheme, ftp on an
+  // internal build) is refused instead of being handed to the transport.
+  const auto schemeEnd = url.find("://");
+  const std::string scheme = schemeEnd == std::string::npos ? std::string() : lower(url.substr(0, schemeEnd));
+  if (scheme != "https" && scheme != "http") {
+    if (why != nullptr) {
+      *why = fmt::format("post URL '{}' is not an http(s) URL", url);
+    }
+    return std::nullopt;
+  }
+  return url;
+}
 
 }  // namespace zerith

@@ -8,7 +8,10 @@
 
 #include <sys/time.h>
 
+#include <sys/types.h>
+
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -26,6 +29,26 @@
 #include "transport/ReportingSessionConnectivityInterface.h"
 
 namespace zerith {
+
+namespace sandbox {
+class GrantedFile;
+}
+
+// A file a client asked to upload: read through the descriptor the client
+// passed, named by the last component of the path it gave.
+struct UploadRequest {
+  std::shared_ptr<sandbox::GrantedFile> file;
+  std::string name;  // as the client gave it; escape before logging
+  uid_t client = 0;  // the connection's user, for the per-client limit
+  std::chrono::steady_clock::time_point deadline;  // the request's answer is due
+};
+using UploadCompletion = std::function<void(bool taken, bool serverSucceeded)>;
+
+// The URL a post goes to, after the https rule: a scheme other than https
+// becomes https on a device that is not an internal build (a further "://"
+// and what follows go), and only http(s) is posted to. nullopt, with the
+// reason, when the URL cannot be posted to.
+std::optional<std::string> postableURL(std::string url, std::string* why = nullptr);
 
 // Reporting states of a backend.
 inline constexpr std::int32_t kBackendStateUndecided = 0;
@@ -105,7 +128,11 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
 
   // Calls `completion` (when given) with nil and no error; returns nil.
   virtual std::optional<std::string> flushMessagesWithCompletion(FlushCompletion completion);
-  virtual bool uploadFileAtPath(const std::string& path, const char* extensionToken);
+  // Offers a file upload. `completion` runs exactly once, from any thread:
+  // `taken` when this backend posted the file, `serverSucceeded` when the
+  // server's answer said "success" (the client framework then deletes the
+  // file). This base class takes nothing.
+  virtual void uploadFileAtPath(const UploadRequest& request, UploadCompletion completion);
   // `logData` is the client's array of property-list values.
   virtual bool uploadLogData(const Value& logData);
   virtual void setCorrelatedSessionID(std::optional<std::string> sessionID);

@@ -12,6 +12,9 @@
 //   deflate loop (same level and window) and posted by libcurl's easy
 //   interface to the same server with the same headers.
 
+#include <fcntl.h>
+
+#include <future>
 #include <arpa/inet.h>
 #include <benchmark/benchmark.h>
 #include <curl/curl.h>
@@ -25,6 +28,7 @@
 #include "backends/DashboardBackend.h"
 #include "backends/DashboardDatagram.h"
 #include "backends/UploadBackend.h"
+#include "platform/SandboxExtension.h"
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/TempRoot.h"
 #include "tests/support/TestCA.h"
@@ -137,7 +141,15 @@ void BM_UploadFile10MB(benchmark::State& state) {
   backend->setReportingSessionConnectivityDelegate(transport);
   bool failed = false;
   for (auto _ : state) {
-    failed = failed || !backend->uploadFileAtPath(setup.file.string(), nullptr);
+    // Read through a descriptor, as the daemon reads a client's file.
+    UploadRequest request;
+    request.name = setup.file.filename().string();
+    request.deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+    request.file = sandbox::GrantedFile::adopt(
+        std::make_shared<const file::UniqueFd>(::open(setup.file.c_str(), O_RDONLY | O_CLOEXEC)), request.name);
+    std::promise<bool> taken;
+    backend->uploadFileAtPath(request, [&](bool t, bool) { taken.set_value(t); });
+    failed = failed || !taken.get_future().get();
   }
   if (failed || setup.server.requestCount() != static_cast<std::size_t>(state.iterations())) {
     state.SkipWithError("an upload failed");

@@ -2,11 +2,13 @@
 
 #include <fmt/format.h>
 
+#include <future>
 #include <mutex>
 
 #include "ipc/ClientSessionProxy.h"
 #include "ipc/ClientSessionReplyExporter.h"
 #include "ipc/ClientSessionWire.h"
+#include "ipc/ClientUploadFile.h"
 #include "ipc/SocketConnection.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
@@ -183,6 +185,10 @@ void Zerith::setDigestKey(const Value& digestKey, std::int32_t algorithm) {
 }
 
 void Zerith::call(const std::string& operation, Dictionary args, std::function<void(ZerithReply)> completion) {
+  if (operation == kUploadFile) {
+    uploadFile(args.get("fileURL"), std::move(completion));
+    return;
+  }
   if (!completion) {
     impl_->connection->send(operation, std::move(args));
     return;
@@ -210,8 +216,29 @@ ZerithReply Zerith::sendMessage(const Value& message, Timeout timeout) {
 }
 ZerithReply Zerith::flushMessages(Timeout timeout) { return impl_->wait(kFlushMessages, {}, timeout); }
 ZerithReply Zerith::finishSession(Timeout timeout) { return impl_->wait(kFinishSession, {}, timeout); }
-ZerithReply Zerith::uploadFile(const Value& fileURL, const Value& extensionToken, Timeout timeout) {
-  return impl_->wait(kUploadFile, uploadFileArgs(fileURL, extensionToken), timeout);
+ZerithReply Zerith::uploadFile(const Value& fileURL, const Value& /*extensionToken*/, Timeout timeout) {
+  if (impl_->connection->queue().isCurrent()) {
+    return ZerithReply{{}, Error{kZerithErrorDomain, -1,
+                                 fmt::format("{} cannot wait inside a callback of its own session", kUploadFile)}};
+  }
+  auto answer = std::make_shared<std::promise<ZerithReply>>();
+  auto reply = answer->get_future();
+  uploadFile(fileURL, [answer](ZerithReply r) { answer->set_value(std::move(r)); });
+  if (reply.wait_for(timeout) != std::future_status::ready) {
+    return ZerithReply{{}, Error{kZerithErrorDomain, -1,
+                                 fmt::format("No answer to {} within {} ms", kUploadFile, timeout.count())}};
+  }
+  return reply.get();
+}
+void Zerith::uploadFile(const Value& fileURL, std::function<void(ZerithReply)> completion) {
+  // The file is opened here, with this process's rights; its descriptor is
+  // the extension token. The file is deleted here too, on the daemon's word.
+  ipc::callUploadFile(*impl_->connection, fileURL,
+                      [completion = std::move(completion)](std::optional<Dictionary> a, std::optional<Error> e) {
+                        if (completion) {
+                          completion(ZerithReply{a ? std::move(*a) : Dictionary(), std::move(e)});
+                        }
+                      });
 }
 ZerithReply Zerith::uploadLogData(const Value& logData, Timeout timeout) {
   return impl_->wait(kUploadLogData, uploadLogDataArgs(logData), timeout);
@@ -231,6 +258,9 @@ ZerithReply Zerith::setDigestKey(const Value& digestKey, std::int32_t algorithm,
   return impl_->wait(kSetDigestKey, setDigestKeyArgs(digestKey, algorithm), timeout);
 }
 ZerithReply Zerith::callAndWait(const std::string& operation, Dictionary args, Timeout timeout) {
+  if (operation == kUploadFile) {
+    return uploadFile(args.get("fileURL"), Value(), timeout);
+  }
   return impl_->wait(operation, std::move(args), timeout);
 }
 

@@ -75,12 +75,6 @@ void ClientSessionExporter::handleMessage(const Message& message, std::shared_pt
     }
     return [reply](Value v, std::optional<Error> e) { reply->send(Dictionary{{kResult, std::move(v)}, {kError, valueOf(e)}}); };
   };
-  auto boolean = [&]() -> ClientSessionInterface::BoolCompletion {
-    if (!wantsReply) {
-      return nullptr;
-    }
-    return [reply](bool ok) { reply->send(Dictionary{{kSuccess, ok}}); };
-  };
   auto booleanError = [&]() -> ClientSessionInterface::BoolErrorCompletion {
     if (!wantsReply) {
       return nullptr;
@@ -106,7 +100,13 @@ void ClientSessionExporter::handleMessage(const Message& message, std::shared_pt
   } else if (name == kFinishSession) {
     s.finishSessionGracefully();
   } else if (name == kUploadFile) {
-    s.uploadFileAtPath(a.get("fileURL"), a.get("extensionToken"), boolean());
+    // The extension token is the descriptor that came with the call.
+    ClientSessionInterface::UploadCompletion uploaded;
+    if (wantsReply) {
+      uploaded = [reply](bool ok, bool remove) { reply->send(Dictionary{{kSuccess, ok}, {kRemoveFile, remove}}); };
+    }
+    s.uploadFileWithDescriptor(a.get("fileURL"), message.descriptors.empty() ? nullptr : message.descriptors.front(),
+                               std::move(uploaded));
   } else if (name == kUploadLogData) {
     s.uploadLogData(a.get("logData"), booleanError());
   } else if (name == kSendMessageWithSessionInfo) {

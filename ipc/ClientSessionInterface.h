@@ -14,9 +14,11 @@
 
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <optional>
 
 #include "platform/Error.h"
+#include "platform/FileUtil.h"
 #include "platform/Value.h"
 
 namespace zerith {
@@ -42,7 +44,21 @@ class ClientSessionInterface {
   virtual void flushMessagesWithCompletion(ValueErrorCompletion completion) = 0;
   virtual void finishSessionGracefully() = 0;
   // fileURL: string (a file:// URL or a path); extensionToken: string or nil.
+  // The client framework's proxy opens the file with the client's rights
+  // and passes its descriptor with the call; the token string is not used.
   virtual void uploadFileAtPath(const Value& fileURL, const Value& extensionToken, BoolCompletion completionHandler) = 0;
+  // The daemon's side of the same call: the descriptor that came with it
+  // (nullptr when none did). `removeFile`: the server answered "success",
+  // so the client framework deletes the file.
+  using UploadCompletion = std::function<void(bool uploaded, bool removeFile)>;
+  virtual void uploadFileWithDescriptor(const Value& fileURL, std::shared_ptr<const file::UniqueFd> descriptor,
+                                        UploadCompletion completion) {
+    (void)fileURL;
+    (void)descriptor;
+    if (completion) {
+      completion(false, false);
+    }
+  }
   virtual void uploadLogData(const Value& logData, BoolErrorCompletion completionHandler) = 0;
   virtual void sendMessageWithSessionInfo(const Value& sessionInfo, const Value& userInfo, std::uint16_t category,
                                           std::uint16_t type, const Value& payload, ValueCompletion reply) = 0;

@@ -1,6 +1,7 @@
 #include "ipc/ClientSessionProxy.h"
 
 #include "ipc/ClientSessionWire.h"
+#include "ipc/ClientUploadFile.h"
 
 namespace zerith::ipc {
 
@@ -61,16 +62,16 @@ void ClientSessionProxy::flushMessagesWithCompletion(ValueErrorCompletion comple
 
 void ClientSessionProxy::finishSessionGracefully() { connection_->send(kFinishSession, Dictionary()); }
 
-void ClientSessionProxy::uploadFileAtPath(const Value& fileURL, const Value& extensionToken,
+void ClientSessionProxy::uploadFileAtPath(const Value& fileURL, const Value& /*extensionToken*/,
                                           BoolCompletion completionHandler) {
-  if (!completionHandler) {
-    connection_->send(kUploadFile, uploadFileArgs(fileURL, extensionToken));
-    return;
-  }
-  connection_->call(kUploadFile, uploadFileArgs(fileURL, extensionToken),
-                    [completion = std::move(completionHandler)](std::optional<Dictionary> reply, std::optional<Error>) {
-                      completion(reply && reply->get(kSuccess).boolValue());
-                    });
+  // The token is the descriptor of the file, opened here with the client's
+  // own rights.
+  callUploadFile(*connection_, fileURL,
+                 [completion = std::move(completionHandler)](std::optional<Dictionary> reply, std::optional<Error>) {
+                   if (completion) {
+                     completion(reply && reply->get(kSuccess).boolValue());
+                   }
+                 });
 }
 
 void ClientSessionProxy::uploadLogData(const Value& logData, BoolErrorCompletion completionHandler) {

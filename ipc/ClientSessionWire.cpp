@@ -171,4 +171,38 @@ std::optional<Error> errorArgument(const Dictionary& replyArgs) {
   return Error::fromValue(error);
 }
 
+std::string filePathOfURL(const std::string& url) {
+  if (!url.starts_with("file://")) {
+    return url;
+  }
+  std::string rest = url.substr(7);
+  if (rest.starts_with("localhost/")) {
+    rest = rest.substr(9);
+  }
+  std::string path;
+  for (std::size_t i = 0; i < rest.size(); ++i) {
+    const auto hex = [](char c) -> int {
+      if (c >= '0' && c <= '9') return c - '0';
+      if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+      if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+      return -1;
+    };
+    if (rest[i] == '%' && i + 2 < rest.size() && hex(rest[i + 1]) >= 0 && hex(rest[i + 2]) >= 0) {
+      path.push_back(static_cast<char>(hex(rest[i + 1]) * 16 + hex(rest[i + 2])));
+      i += 2;
+    } else {
+      path.push_back(rest[i]);
+    }
+  }
+  return path;
+}
+
+std::string lastPathComponent(std::string path) {
+  while (path.size() > 1 && path.back() == '/') {
+    path.pop_back();
+  }
+  const auto slash = path.rfind('/');
+  return slash == std::string::npos ? path : path.substr(slash + 1);
+}
+
 }  // namespace zerith::ipc::wire

@@ -42,6 +42,10 @@ inline constexpr const char* kBackends = "backends";  // array of strings, absen
 inline constexpr const char* kURL = "url";            // string
 inline constexpr const char* kResult = "result";      // string, absent = nil
 inline constexpr const char* kSuccess = "success";    // boolean
+// In the reply to kUploadFile: true when the upload server answered
+// "success"; the client framework then deletes the file, in the client's
+// process (the daemon never touches it).
+inline constexpr const char* kRemoveFile = "removeFile";  // boolean, absent = false
 inline constexpr const char* kError = "error";        // error dictionary, absent = no error
 
 enum class ArgType {
@@ -100,5 +104,12 @@ Dictionary sendMessageToClientArgs(const Value& message, double timestamp, std::
 
 // The error a reply's arguments carry under "error", if any.
 std::optional<Error> errorArgument(const Dictionary& replyArgs);
+
+// The file-system path of a file URL ("file:///a%20b" -> "/a b", an
+// optional "localhost" host); anything that is not a file URL is taken as
+// a path as it stands.
+std::string filePathOfURL(const std::string& url);
+// The last component of a path ("/a/b.log/" -> "b.log").
+std::string lastPathComponent(std::string path);
 
 }  // namespace zerith::ipc::wire

@@ -24,6 +24,7 @@
 #include <vector>
 
 #include "platform/Error.h"
+#include "platform/FileUtil.h"
 #include "platform/SerialQueue.h"
 #include "platform/Value.h"
 
@@ -43,6 +44,9 @@ struct Message {
   std::string operation;
   std::optional<std::uint64_t> call;  // set when the caller wants a reply
   Dictionary args;
+  // Descriptors that came with the call (SCM_RIGHTS), in the order sent;
+  // fewer than the frame claimed when some could not be received.
+  std::vector<std::shared_ptr<const file::UniqueFd>> descriptors;
 };
 
 // Sends the reply to one call, at most once, from any thread. Dropping a
@@ -89,6 +93,11 @@ class Connection : public std::enable_shared_from_this<Connection> {
   virtual void send(const std::string& operation, Dictionary args) = 0;
   using ReplyHandler = std::function<void(std::optional<Dictionary> args, std::optional<Error> error)>;
   virtual void call(const std::string& operation, Dictionary args, ReplyHandler handler) = 0;
+  // A call that carries open descriptors (at most kMaxDescriptorsPerFrame)
+  // to the peer process. A connection that cannot pass descriptors fails
+  // the call.
+  virtual void call(const std::string& operation, Dictionary args, std::vector<file::UniqueFd> descriptors,
+                    ReplyHandler handler);
 
   virtual const PeerCredentials& peer() const = 0;
   // The peer's entitlement (nil when absent), looked up at connect time from

@@ -47,10 +47,14 @@ Data encodeFrame(const Value& message) {
   return frame;
 }
 
-Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args) {
+Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args,
+                std::uint32_t descriptors) {
   Dictionary message{{"op", Value(operation)}};
   if (call) {
     message.set("call", Value(static_cast<long long>(*call)));
+  }
+  if (descriptors > 0) {
+    message.set("fds", Value(static_cast<long long>(descriptors)));
   }
   message.set("args", Value(args));
   return encodeFrame(Value(std::move(message)));
@@ -156,6 +160,14 @@ std::optional<IncomingMessage> decodeMessage(plist::Bytes body, std::string* why
         setWhy(why, "message \"call\" is not an unsigned integer");
         return std::nullopt;
       }
+    }
+    if (const Value fds = (*root)["fds"]; !fds.isNil()) {
+      const auto count = callNumber(fds);
+      if (!count || *count > kMaxDescriptorsPerFrame) {
+        setWhy(why, fmt::format("message \"fds\" is not a count of at most {} descriptors", kMaxDescriptorsPerFrame));
+        return std::nullopt;
+      }
+      message.descriptorCount = static_cast<std::uint32_t>(*count);
     }
     if (const auto* d = args.dict()) {
       message.call.args = *d;

@@ -4,7 +4,8 @@
 //
 // A frame is a 4-byte big-endian body length followed by the body, a binary
 // property list (never XML on the socket). The body must be a dictionary:
-//   call:  {"op": <string>, "call": <unsigned, optional>, "args": <dictionary, optional>}
+//   call:  {"op": <string>, "call": <unsigned, optional>, "args": <dictionary, optional>,
+//           "fds": <unsigned, optional: descriptors the frame carries>}
 //   reply: {"reply": <unsigned>, "args": <dictionary, optional>}
 //          {"reply": <unsigned>, "error": {"domain", "code", "description"}}
 // Anything else is a protocol violation that ends the connection.
@@ -29,12 +30,17 @@ inline constexpr const char* kErrorDomain = "com.velmar.zerith.ErrorDomain";
 
 inline constexpr std::size_t kFrameHeaderBytes = 4;
 
+// Descriptors one call may carry (SCM_RIGHTS with the frame's first byte); a
+// frame that claims more is a protocol violation.
+inline constexpr std::uint32_t kMaxDescriptorsPerFrame = 4;
+
 // The bounds a frame body must keep for the frame codec to read it.
 plist::Limits frameLimits();
 
 // One frame (header and body) carrying `message`.
 Data encodeFrame(const Value& message);
-Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args);
+Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args,
+                std::uint32_t descriptors = 0);
 Data encodeReply(std::uint64_t call, const Dictionary& args);
 Data encodeErrorReply(std::uint64_t call, const Error& error);
 
@@ -71,6 +77,7 @@ struct IncomingMessage {
   enum class Kind { Call, Reply };
   Kind kind = Kind::Call;
   Message call;                      // Kind::Call
+  std::uint32_t descriptorCount = 0;  // Kind::Call: descriptors the frame claims
   std::uint64_t replyTo = 0;         // Kind::Reply
   Dictionary replyArgs;              // Kind::Reply without error
   std::optional<Error> replyError;   // Kind::Reply that failed

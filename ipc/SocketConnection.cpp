@@ -348,11 +348,43 @@ void SocketConnection::startRead() {
   }
   // No buffer is held while the connection waits: the bytes are read when
   // they are there, into the reading thread's own buffer, and only an
-  // unfinished frame stays with the connection (its decoder).
+  // unfinished frame stays with the connection (its decoder). They are read
+  // by hand (recvmsg): a call may carry descriptors, which a plain read would
+  // drop.
   socket_.async_wait(asio::socket_base::wait_read,
                      [self = std::static_pointer_cast<SocketConnection>(shared_from_this())](const std::error_code& ec) {
                        self->onReadable(ec);
                      });
+}
+
+std::vector<std::shared_ptr<const file::UniqueFd>> SocketConnection::claimDescriptors(std::uint64_t frameStart,
+                                                                                     std::uint32_t count) {
+  closeStrayDescriptors(frameStart + 1);
+  std::vector<std::shared_ptr<const file::UniqueFd>> claimed;
+  if (count == 0 || receivedDescriptors_.empty()) {
+    return claimed;
+  }
+  ReceivedDescriptors& front = receivedDescriptors_.front();
+  if (front.first > frameStart) {
+    return claimed;  // they came with a later frame
+  }
+  for (auto& fd : front.fds) {
+    if (claimed.size() < count) {
+      claimed.push_back(std::make_shared<const file::UniqueFd>(std::move(fd)));
+    }
+  }
+  if (front.fds.size() > count) {
+    log_.error("{}: closed {} descriptors beyond the {} a call claimed", description(), front.fds.size() - count, count);
+  }
+  receivedDescriptors_.pop_front();  // what was not claimed closes here
+  return claimed;
+}
+
+void SocketConnection::closeStrayDescriptors(std::uint64_t before) {
+  while (!receivedDescriptors_.empty() && receivedDescriptors_.front().end < before) {
+    log_.error("{}: closed {} descriptors that no call claimed", description(), receivedDescriptors_.front().fds.size());
+    receivedDescriptors_.pop_front();
+  }
 }
 
 void SocketConnection::onReadable(const std::error_code& ec) {
@@ -370,7 +402,14 @@ void SocketConnection::onReadable(const std::error_code& ec) {
       return;
     }
     thread_local std::vector<std::uint8_t> chunk(kReadChunk);
-    const ssize_t n = ::recv(fd_, chunk.data(), chunk.size(), MSG_DONTWAIT);
+    iovec part{chunk.data(), chunk.size()};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxDescriptorsPerFrame)];
+    msghdr message{};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof(control);
+    const ssize_t n = ::recvmsg(fd_, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
     if (n < 0) {
       const int err = errno;
       if (err == EAGAIN || err == EWOULDBLOCK || err == EINTR) {
@@ -380,11 +419,34 @@ void SocketConnection::onReadable(const std::error_code& ec) {
       readFailed(std::error_code(err, std::system_category()));
       return;
     }
+    std::vector<file::UniqueFd> fds;
+    for (cmsghdr* c = CMSG_FIRSTHDR(&message); c != nullptr; c = CMSG_NXTHDR(&message, c)) {
+      if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) {
+        continue;
+      }
+      const std::size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+      for (std::size_t i = 0; i < count; ++i) {
+        int fd = -1;
+        std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof(int));
+        fds.emplace_back(fd);
+      }
+    }
+    if ((message.msg_flags & MSG_CTRUNC) != 0) {
+      // More than a frame may carry, or no descriptor left in this process:
+      // the kernel closed what did not fit.
+      log_.error("{}: descriptors sent with a call were cut off (at most {} per call, or none left here)",
+                 description(), kMaxDescriptorsPerFrame);
+    }
     if (n == 0) {
       readFailed(asio::error::eof);
       return;
     }
-    decoder_.append(chunk.data(), static_cast<std::size_t>(n));
+    const auto size = static_cast<std::size_t>(n);
+    if (!fds.empty()) {
+      receivedDescriptors_.push_back(ReceivedDescriptors{bytesReceived_, bytesReceived_ + size, std::move(fds)});
+    }
+    bytesReceived_ += size;
+    decoder_.append(chunk.data(), size);
     continueReading();
   };
   if (!queue_.runIfFree(handle)) {
@@ -411,6 +473,9 @@ void SocketConnection::continueReading() {
       case InputState::Closed:
       case InputState::HandedOff: return;
       case InputState::NeedMore:
+        // The next frame starts at bytesDecoded_: descriptors that came
+        // before it belong to no frame.
+        closeStrayDescriptors(bytesDecoded_ + 1);
         decoder_.releaseSpare();
         if (accountInput()) {
           startRead();
@@ -463,11 +528,14 @@ SocketConnection::InputState SocketConnection::processInput() {
       case FrameDecoder::Status::Invalid: protocolError(why); return InputState::Closed;
       case FrameDecoder::Status::Frame: break;
     }
+    const std::uint64_t frameStart = bytesDecoded_;
+    bytesDecoded_ += kFrameHeaderBytes + body.size();
     auto message = decodeMessage(body, &why);
     if (!message) {
       protocolError(why);
       return InputState::Closed;
     }
+    message->call.descriptors = claimDescriptors(frameStart, message->descriptorCount);
     if (handledWithoutWaiting(*message)) {
       deliver(std::move(*message));
       continue;
@@ -593,11 +661,50 @@ void SocketConnection::protocolError(const std::string& why) {
 
 // ---- writing (any thread) -----------------------------------------------------
 
-int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent) {
+namespace {
+
+// Room for the SCM_RIGHTS of one frame.
+struct DescriptorControl {
+  alignas(cmsghdr) char bytes[CMSG_SPACE(sizeof(int) * kMaxDescriptorsPerFrame)];
+};
+
+// Sets `message` up to carry `fds` (at most kMaxDescriptorsPerFrame).
+void attachDescriptors(msghdr& message, DescriptorControl& control, const std::vector<file::UniqueFd>& fds) {
+  if (fds.empty()) {
+    return;
+  }
+  const std::size_t count = std::min<std::size_t>(fds.size(), kMaxDescriptorsPerFrame);
+  message.msg_control = control.bytes;
+  message.msg_controllen = CMSG_SPACE(sizeof(int) * count);
+  cmsghdr* c = CMSG_FIRSTHDR(&message);
+  c->cmsg_level = SOL_SOCKET;
+  c->cmsg_type = SCM_RIGHTS;
+  c->cmsg_len = CMSG_LEN(sizeof(int) * count);
+  for (std::size_t i = 0; i < count; ++i) {
+    const int fd = fds[i].get();
+    std::memcpy(CMSG_DATA(c) + i * sizeof(int), &fd, sizeof(int));
+  }
+}
+
+}  // namespace
+
+int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent,
+                               std::vector<file::UniqueFd>* descriptors) {
   while (sent < size) {
-    const ssize_t n = ::send(fd_, bytes + sent, size - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+    iovec part{const_cast<std::uint8_t*>(bytes + sent), size - sent};
+    msghdr message{};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    DescriptorControl control;
+    if (descriptors != nullptr) {
+      attachDescriptors(message, control, *descriptors);
+    }
+    const ssize_t n = ::sendmsg(fd_, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (n > 0) {
       sent += static_cast<std::size_t>(n);
+      if (descriptors != nullptr) {
+        descriptors->clear();  // they left with the first byte; ours close
+      }
       continue;
     }
     if (n < 0 && errno == EINTR) {
@@ -611,7 +718,7 @@ int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std:
   return 0;
 }
 
-bool SocketConnection::writeFrame(Data frame) {
+bool SocketConnection::writeFrame(Data frame, std::vector<file::UniqueFd> descriptors) {
   int err = 0;
   bool overflow = false;
   std::size_t limit = 0;
@@ -628,11 +735,12 @@ bool SocketConnection::writeFrame(Data frame) {
     }
     if (outbox_.empty() && !corked_) {
       std::size_t sent = 0;
-      err = sendSome(frame.data(), frame.size(), sent);
+      err = sendSome(frame.data(), frame.size(), sent, &descriptors);
       if (!err && sent < frame.size()) {
         outboxOffset_ = sent;
         setOutboxBytes(frame.size() - sent);
         outbox_.push_back(std::move(frame));
+        outboxDescriptors_.push_back(std::move(descriptors));
         armWritable();
       }
     } else {
@@ -640,6 +748,7 @@ bool SocketConnection::writeFrame(Data frame) {
       // the end of a delivery: either way it leaves after them.
       setOutboxBytes(outboxBytes_ + frame.size());
       outbox_.push_back(std::move(frame));
+      outboxDescriptors_.push_back(std::move(descriptors));
       limit = gPerConnection.load();
       overflow = outboxBytes_ > limit;
     }
@@ -708,7 +817,12 @@ int SocketConnection::drainOutbox() {
     iovec parts[kFramesPerWrite];
     std::size_t count = 0;
     std::size_t offered = 0;
+    // A frame with descriptors starts a write of its own: they travel with
+    // its first byte.
     for (auto it = outbox_.begin(); it != outbox_.end() && count < kFramesPerWrite; ++it, ++count) {
+      if (count > 0 && !outboxDescriptors_[count].empty()) {
+        break;
+      }
       const std::size_t skip = count == 0 ? outboxOffset_ : 0;
       parts[count].iov_base = it->data() + skip;
       parts[count].iov_len = it->size() - skip;
@@ -717,6 +831,8 @@ int SocketConnection::drainOutbox() {
     msghdr message{};
     message.msg_iov = parts;
     message.msg_iovlen = count;
+    DescriptorControl control;
+    attachDescriptors(message, control, outboxDescriptors_.front());
     const ssize_t n = ::sendmsg(fd_, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (n < 0 && errno == EINTR) {
       continue;
@@ -730,6 +846,7 @@ int SocketConnection::drainOutbox() {
     }
     auto taken = static_cast<std::size_t>(n);
     bytes -= taken;
+    outboxDescriptors_.front().clear();
     while (taken > 0) {
       const std::size_t left = outbox_.front().size() - outboxOffset_;
       if (taken < left) {
@@ -738,6 +855,7 @@ int SocketConnection::drainOutbox() {
       }
       taken -= left;
       outbox_.pop_front();
+      outboxDescriptors_.pop_front();
       outboxOffset_ = 0;
     }
     if (static_cast<std::size_t>(n) < offered) {
@@ -747,6 +865,7 @@ int SocketConnection::drainOutbox() {
   setOutboxBytes(bytes);
   if (outbox_.empty() && outboxWasLarge_) {
     std::deque<Data>().swap(outbox_);
+    std::deque<std::vector<file::UniqueFd>>().swap(outboxDescriptors_);
     outboxWasLarge_ = false;
   }
   return err;
@@ -886,8 +1005,20 @@ void SocketConnection::call(const std::string& operation, Dictionary args, Reply
   startCall(operation, std::move(args), std::move(handler), false);
 }
 
+void SocketConnection::call(const std::string& operation, Dictionary args, std::vector<file::UniqueFd> descriptors,
+                            ReplyHandler handler) {
+  if (descriptors.size() > kMaxDescriptorsPerFrame) {
+    queue_.async([handler = std::move(handler)] {
+      handler(std::nullopt, Error{kErrorDomain, -1, "Too many descriptors for one call"});
+    });
+    return;
+  }
+  startCall(operation, std::move(args), std::move(handler), false, std::move(descriptors));
+}
+
 SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& operation, Dictionary args,
-                                                            std::chrono::milliseconds timeout) {
+                                                            std::chrono::milliseconds timeout,
+                                                            std::vector<file::UniqueFd> descriptors) {
   struct Waiter {
     std::mutex mutex;
     std::condition_variable done;
@@ -908,7 +1039,7 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
         // handler's own reference keeps the waiter alive meanwhile.
         waiter->done.notify_one();
       },
-      true);
+      true, std::move(descriptors));
   std::unique_lock lock(waiter->mutex);
   if (!waiter->done.wait_for(lock, timeout, [&] { return waiter->arrived; })) {
     WaitedReply late;
@@ -919,7 +1050,7 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
 }
 
 void SocketConnection::startCall(const std::string& operation, Dictionary args, ReplyHandler handler,
-                                 bool neverWaits) {
+                                 bool neverWaits, std::vector<file::UniqueFd> descriptors) {
   std::uint64_t number = 0;
   {
     std::lock_guard lock(callsMutex_);
@@ -933,7 +1064,18 @@ void SocketConnection::startCall(const std::string& operation, Dictionary args, 
     return;
   }
   // A failed write invalidates the connection, which fails the call.
-  writeFrame(encodeCall(operation, number, args));
+  const auto claimed = static_cast<std::uint32_t>(descriptors.size());
+  writeFrame(encodeCall(operation, number, args, claimed), std::move(descriptors));
+}
+
+// ---- connections that pass no descriptors -------------------------------------------
+
+void Connection::call(const std::string& operation, Dictionary args, std::vector<file::UniqueFd> descriptors,
+                      ReplyHandler handler) {
+  (void)operation;
+  (void)args;
+  descriptors.clear();
+  handler(std::nullopt, Error{kErrorDomain, -1, "This connection cannot pass descriptors"});
 }
 
 // ---- invalidation ---------------------------------------------------------------
@@ -949,6 +1091,7 @@ void SocketConnection::beginInvalidation() {
     readPausedFlag_ = false;
     setOutboxBytes(0);
     std::deque<Data>().swap(outbox_);
+    std::deque<std::vector<file::UniqueFd>>().swap(outboxDescriptors_);
     drained_.notify_all();  // writers waiting for room return
     // Wakes the outstanding read; the descriptor itself is closed on the
     // queue, where every other socket operation starts.

@@ -129,6 +129,8 @@ class SocketConnection final : public Connection {
 
   void send(const std::string& operation, Dictionary args) override;
   void call(const std::string& operation, Dictionary args, ReplyHandler handler) override;
+  void call(const std::string& operation, Dictionary args, std::vector<file::UniqueFd> descriptors,
+            ReplyHandler handler) override;
 
   // Calls `operation` and waits for its reply, up to `timeout`. Not from a
   // block of this connection's queue (the reply arrives in one).
@@ -137,7 +139,8 @@ class SocketConnection final : public Connection {
     std::optional<Error> error;      // the peer's error, or the connection's end
     bool timedOut = false;
   };
-  WaitedReply callAndWait(const std::string& operation, Dictionary args, std::chrono::milliseconds timeout);
+  WaitedReply callAndWait(const std::string& operation, Dictionary args, std::chrono::milliseconds timeout,
+                          std::vector<file::UniqueFd> descriptors = {});
 
   const PeerCredentials& peer() const override { return peer_; }
   Value valueForEntitlement(const std::string& entitlement) const override;
@@ -147,7 +150,7 @@ class SocketConnection final : public Connection {
   bool isInvalidated() const { return invalidated_.load(); }
   // Queues one encoded frame (reply paths use it). False when the connection
   // no longer writes.
-  bool writeFrame(Data frame);
+  bool writeFrame(Data frame, std::vector<file::UniqueFd> descriptors = {});
   // Bytes waiting to be written to the peer.
   std::size_t queuedBytes() const { return queued_.load(); }
   // True while reading is held back because the peer does not read.
@@ -169,12 +172,23 @@ class SocketConnection final : public Connection {
     bool neverWaits = false;  // the handler may run on a socket thread
   };
 
-  void startCall(const std::string& operation, Dictionary args, ReplyHandler handler, bool neverWaits);
+  void startCall(const std::string& operation, Dictionary args, ReplyHandler handler, bool neverWaits,
+                 std::vector<file::UniqueFd> descriptors = {});
+  // Descriptors received with the bytes [first, end) of the stream.
+  struct ReceivedDescriptors {
+    std::uint64_t first = 0;
+    std::uint64_t end = 0;
+    std::vector<file::UniqueFd> fds;
+  };
+  // On the queue: the descriptors of the frame that starts at `frameStart`
+  // and claims `count`; closes those that no frame claimed.
+  std::vector<std::shared_ptr<const file::UniqueFd>> claimDescriptors(std::uint64_t frameStart, std::uint32_t count);
+  void closeStrayDescriptors(std::uint64_t before);
+  void onReadable(const std::error_code& ec);
   // On a socket thread: may this message be handled here?
   bool handledWithoutWaiting(const IncomingMessage& message);
 
   void startRead();
-  void onReadable(const std::error_code& ec);
   // Delivers buffered frames and reads on, unless the outbox holds the
   // reading back.
   void continueReading();
@@ -193,7 +207,8 @@ class SocketConnection final : public Connection {
   void protocolError(const std::string& why);
 
   // Sends what the socket takes now; 0 or an errno.
-  int sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent);
+  int sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent,
+               std::vector<file::UniqueFd>* descriptors = nullptr);
   // Called with writeMutex_ held: writes as much of the outbox as the socket
   // takes, several frames per system call; 0 or an errno.
   int drainOutbox();
@@ -236,9 +251,15 @@ class SocketConnection final : public Connection {
   // Used only on the queue (or by the one outstanding read).
   FrameDecoder decoder_;
   std::size_t inputHeld_ = 0;  // decoder_.held() as last counted
+  std::uint64_t bytesReceived_ = 0;  // stream offset of the next byte read
+  std::uint64_t bytesDecoded_ = 0;   // stream offset of the next frame
+  std::deque<ReceivedDescriptors> receivedDescriptors_;
 
   mutable std::mutex writeMutex_;
   std::deque<Data> outbox_;
+  // Beside each frame of the outbox: the descriptors that leave with its
+  // first byte (empty for most).
+  std::deque<std::vector<file::UniqueFd>> outboxDescriptors_;
   std::size_t outboxOffset_ = 0;  // of the front frame
   std::size_t outboxBytes_ = 0;
   bool outboxWasLarge_ = false;  // its storage is let go once it drains

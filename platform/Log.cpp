@@ -219,4 +219,25 @@ void LogCapture::clear() {
   sink_->captured.clear();
 }
 
+std::string escaped(std::string_view text) {
+  std::string out;
+  out.reserve(text.size());
+  for (const char ch : text) {
+    const auto c = static_cast<unsigned char>(ch);
+    switch (ch) {
+      case '\\': out += "\\\\"; break;
+      case '\n': out += "\\n"; break;
+      case '\r': out += "\\r"; break;
+      case '\t': out += "\\t"; break;
+      default:
+        if (c < 0x20 || c == 0x7f) {
+          out += fmt::format("\\x{:02x}", c);
+        } else {
+          out.push_back(ch);
+        }
+    }
+  }
+  return out;
+}
+
 }  // namespace zerith::log

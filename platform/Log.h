@@ -35,6 +35,11 @@ void configure(const Options& options);
 // The journal (syslog) priority a level is logged at.
 int journalPriority(Level level);
 
+// Text a client supplied (a path, a name), made safe for one log line:
+// control characters become \n, \r, \t or \xNN and a backslash doubles, so
+// that no client text can end a line or forge one.
+std::string escaped(std::string_view text);
+
 class Logger {
  public:
   explicit Logger(const std::string& subsystem);

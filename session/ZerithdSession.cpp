@@ -11,7 +11,9 @@
 #include "config/Conversions.h"
 #include "config/DeviceInfo.h"
 #include "config/MessageLog.h"
+#include "backends/UploadBackend.h"
 #include "ipc/ClientSessionReplyProxy.h"
+#include "ipc/ClientSessionWire.h"
 #include "ipc/Connection.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
@@ -35,34 +37,6 @@ constexpr char kNoBackends[] = "No backends available to send message";
 
 Value textOrUnknown(const Value& v) { return v.string() ? v : Value("Unknown"); }
 
-// The file-system path of a file URL ("file:///a%20b" -> "/a b", an
-// optional "localhost" host); anything that is not a file URL is taken as
-// a path as it stands.
-std::string filePathOfURL(const std::string& url) {
-  if (!url.starts_with("file://")) {
-    return url;
-  }
-  std::string rest = url.substr(7);
-  if (rest.starts_with("localhost/")) {
-    rest = rest.substr(9);
-  }
-  std::string path;
-  for (std::size_t i = 0; i < rest.size(); ++i) {
-    const auto hex = [](char c) -> int {
-      if (c >= '0' && c <= '9') return c - '0';
-      if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-      if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-      return -1;
-    };
-    if (rest[i] == '%' && i + 2 < rest.size() && hex(rest[i + 1]) >= 0 && hex(rest[i + 2]) >= 0) {
-      path.push_back(static_cast<char>(hex(rest[i + 1]) * 16 + hex(rest[i + 2])));
-      i += 2;
-    } else {
-      path.push_back(rest[i]);
-    }
-  }
-  return path;
-}
 
 double secondsNow() {
   timeval tv{};
@@ -943,53 +917,84 @@ void ZerithdSession::updateSharedDataForKey(const Value& key, const Value& value
 
 // --- Uploads -------------------------------------------------------------------------
 
-void ZerithdSession::uploadFileAtPath(const Value& fileURL, const Value& extensionToken,
+void ZerithdSession::uploadFileAtPath(const Value& fileURL, const Value& /*extensionToken*/,
                                       BoolCompletion completionHandler) {
-  logger().debug("uploadFileAtPath: Uploading file for session {}", sessionID());
-  uploadFileWithURL(fileURL, extensionToken, std::move(completionHandler));
+  // Without the descriptor (the token a client framework passes with the
+  // call) there is nothing the daemon may read.
+  uploadFileWithDescriptor(fileURL, nullptr, [completionHandler = std::move(completionHandler)](bool ok, bool) {
+    if (completionHandler) {
+      completionHandler(ok);
+    }
+  });
 }
 
-void ZerithdSession::uploadFileWithURL(const Value& fileURL, const Value& /*extensionToken*/,
-                                       BoolCompletion completionHandler) {
+void ZerithdSession::uploadFileWithDescriptor(const Value& fileURL, std::shared_ptr<const file::UniqueFd> descriptor,
+                                              UploadCompletion completion) {
+  logger().debug("uploadFileAtPath: Uploading file for session {}", sessionID());
+  uploadFileWithURL(fileURL, std::move(descriptor), std::move(completion));
+}
+
+void ZerithdSession::uploadFileWithURL(const Value& fileURL, std::shared_ptr<const file::UniqueFd> descriptor,
+                                       UploadCompletion completion) {
   const std::string url = fileURL.string() ? *fileURL.string() : std::string();
-  const std::string path = filePathOfURL(url);
-  const std::string absoluteURL = url.starts_with("file://") ? url : "file://" + path;
+  const std::string path = ipc::wire::filePathOfURL(url);
+  const std::string shownPath = log::escaped(path);
+  const std::string absoluteURL = log::escaped(url.starts_with("file://") ? url : "file://" + path);
 
-  // Linux has no sandbox extensions: the token the client sent proves
-  // nothing. The daemon opens the file itself for the client's identity, as
-  // the socket reported it at connect time, and hands its backends a token
-  // of its own that stands for that opening; they read and delete only
-  // through it.
-  bool uploaded = false;
-  std::string why;
-  std::shared_ptr<sandbox::GrantedFile> file;
-  if (const auto connection = connection_.lock()) {
-    const ipc::PeerCredentials& peer = connection->peer();
-    file = sandbox::GrantedFile::open(path, sandbox::Identity{peer.uid, peer.gid}, &why);
-  } else {
-    why = "the client has gone";
-  }
-  if (file) {
-    const std::string token = sandbox::issueExtension(file);
-    if (const auto set = backends()) {
-      for (const auto& [name, backend] : *set) {
-        // Every backend is asked, also after one has taken the file.
-        uploaded = backend->uploadFileAtPath(path, token.c_str()) || uploaded;
-      }
+  // What the backends hear about once all have answered.
+  struct Answers {
+    std::mutex mutex;
+    std::size_t outstanding = 0;
+    bool uploaded = false;
+    bool removeFile = false;
+  };
+  auto answers = std::make_shared<Answers>();
+  const auto done = [answers, shownPath, absoluteURL, completion = std::move(completion)]() {
+    const bool uploaded = answers->uploaded;
+    if (uploaded) {
+      logger().debug("uploadFileWithURL: File upload successful for {}", shownPath);
+    } else {
+      logger().error("uploadFileWithURL: File upload failed for {}", shownPath);
     }
-    sandbox::revokeExtension(token);
-  } else {
-    logger().error("uploadFileWithURL: Refusing to upload {}: {}", path, why);
-  }
+    writeToLogFile("[uploadFileWithURL] Upload {} for file {}", uploaded ? "succeeded" : "failed", absoluteURL);
+    if (completion) {
+      completion(uploaded, uploaded && answers->removeFile);
+    }
+  };
 
-  if (uploaded) {
-    logger().debug("uploadFileWithURL: File upload successful for {}", path);
-  } else {
-    logger().error("uploadFileWithURL: File upload failed for {}", path);
+  // The file is read only through the descriptor the client passed; the
+  // path is the file's name, nothing more.
+  std::string why;
+  UploadRequest request;
+  request.name = ipc::wire::lastPathComponent(path);
+  request.deadline = std::chrono::steady_clock::now() + UploadLimits::fromDefaults().timeLimit;
+  request.file = sandbox::GrantedFile::adopt(std::move(descriptor), request.name, &why);
+  if (const auto connection = connection_.lock()) {
+    request.client = connection->peer().uid;
   }
-  writeToLogFile("[uploadFileWithURL] Upload {} for file {}", uploaded ? "succeeded" : "failed", absoluteURL);
-  if (completionHandler) {
-    completionHandler(uploaded);
+  const auto set = backends();
+  if (!request.file) {
+    logger().error("uploadFileWithURL: Refusing to upload {}: {}", shownPath, why);
+  }
+  if (!request.file || !set || set->empty()) {
+    done();
+    return;
+  }
+  answers->outstanding = set->size();
+  for (const auto& [name, backend] : *set) {
+    // Every backend is asked, also after one has taken the file; the answer
+    // leaves once all have answered, from whichever thread answered last.
+    backend->uploadFileAtPath(request, [answers, done](bool taken, bool serverSucceeded) {
+      {
+        std::lock_guard lock(answers->mutex);
+        answers->uploaded = answers->uploaded || taken;
+        answers->removeFile = answers->removeFile || serverSucceeded;
+        if (--answers->outstanding > 0) {
+          return;
+        }
+      }
+      done();
+    });
   }
 }
 

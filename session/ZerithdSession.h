@@ -79,6 +79,8 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
   void flushMessagesWithCompletion(ValueErrorCompletion completion) override;
   void finishSessionGracefully() override;
   void uploadFileAtPath(const Value& fileURL, const Value& extensionToken, BoolCompletion completionHandler) override;
+  void uploadFileWithDescriptor(const Value& fileURL, std::shared_ptr<const file::UniqueFd> descriptor,
+                                UploadCompletion completion) override;
   void uploadLogData(const Value& logData, BoolErrorCompletion completionHandler) override;
   void sendMessageWithSessionInfo(const Value& sessionInfo, const Value& userInfo, std::uint16_t category,
                                   std::uint16_t type, const Value& payload, ValueCompletion reply) override;
@@ -121,7 +123,10 @@ class ZerithdSession final : public ClientSessionInterface, public std::enable_s
                                          std::uint16_t category, std::uint16_t type, const Value& payload);
 
   // Uploads.
-  void uploadFileWithURL(const Value& fileURL, const Value& extensionToken, BoolCompletion completionHandler);
+  // Offers the file to every backend and answers once all have answered,
+  // without holding the calling thread meanwhile.
+  void uploadFileWithURL(const Value& fileURL, std::shared_ptr<const file::UniqueFd> descriptor,
+                         UploadCompletion completion);
 
   // The session's transport (for its backends).
   std::shared_ptr<ReportingSessionConnectivityHelper> connectivityHelper() const { return connectivityHelper_; }

@@ -161,9 +161,17 @@ void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(con
     file::UniqueFd body = writeBodyFile(container, request.body);
     if (!body) {
       // A full storage folder, the file size limit (EFBIG), no descriptor left.
+      const int err = errno;
       logger().error("postURLRequestWithCompletionHandler: cannot write the body file {}: {}", container.string(),
-                     std::strerror(errno));
-      return;  // no task and no completion
+                     std::strerror(err));
+      if (request.completesWhenBodyFails && completion) {
+        stateQueue_.async([completion = std::move(completion), err] {
+          completion(Data(), std::nullopt,
+                     Error{kURLErrorDomain, kURLErrorCannotWriteBody,
+                           fmt::format("the body file cannot be written ({})", std::strerror(err))});
+        });
+      }
+      return;  // else no task and no completion
     }
     URLRequest copy = request;
     copy.body.clear();

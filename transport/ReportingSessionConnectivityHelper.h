@@ -18,7 +18,8 @@
 //
 // Requests of the wrong method for the mode are logged and dropped: their
 // completion never runs. So are mode-1 POSTs whose body file cannot be
-// written. A request made after `invalidate` completes at once with
+// written, unless the request asks to hear of it (completesWhenBodyFails:
+// uploads, whose client waits for an answer). A request made after `invalidate` completes at once with
 // kURLErrorSessionInvalidated.
 
 #include <cstdint>

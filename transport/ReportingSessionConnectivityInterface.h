@@ -39,6 +39,9 @@ struct URLRequest {
   // bytes (or at once when its Content-Length says it will): the request
   // then fails with kURLErrorResponseTooLarge.
   std::size_t maxResponseBytes = kDefaultMaxResponseBytes;
+  // A mode-1 POST whose body file cannot be written completes with
+  // kURLErrorCannotWriteBody instead of being dropped without a completion.
+  bool completesWhenBodyFails = false;
 
   void setValue(std::string value, std::string field);  // replaces a header (case-insensitive name)
   std::optional<std::string> valueForHTTPHeaderField(std::string_view field) const;

@@ -41,6 +41,7 @@ inline constexpr std::int64_t kURLErrorCancelled = -999;
 inline constexpr std::int64_t kURLErrorSessionInvalidated = -998;
 // The response body passed the request's maxResponseBytes.
 inline constexpr std::int64_t kURLErrorResponseTooLarge = -1103;
+inline constexpr std::int64_t kURLErrorCannotWriteBody = -3000;
 
 // The process's main operation queue: the delegate queue of the
 // connectivity helpers' sessions. Runs on the transport pool.

@@ -1,12 +1,15 @@
 #include "backends/UploadBackend.h"
 
 #include <gtest/gtest.h>
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
+#include <future>
 
+#include "platform/Defaults.h"
 #include "platform/Log.h"
 #include "platform/SandboxExtension.h"
 #include "tests/support/HttpsTestServer.h"
@@ -22,11 +25,14 @@ using log::Level;
 namespace fs = std::filesystem;
 
 constexpr char kUdid[] = "0123456789abcdef0123456789abcdef01234567";
-constexpr uid_t kOtherUser = 65534;
 
 void writeFile(const fs::path& path, const std::string& contents) {
   std::ofstream(path, std::ios::binary) << contents;
 }
+
+// The answer of one upload: (taken, serverSucceeded), or nullopt when none
+// came within the wait.
+using Answer = std::optional<std::pair<bool, bool>>;
 
 class UploadBackendTest : public ::testing::Test {
  protected:
@@ -43,12 +49,30 @@ class UploadBackendTest : public ::testing::Test {
     backend->setReportingSessionConnectivityDelegate(transport);
   }
 
-  // An upload refused before anything went to the server.
-  void expectRefused(const std::string& path) {
-    logs.clear();
-    EXPECT_FALSE(backend->uploadFileAtPath(path, nullptr)) << path;
-    EXPECT_TRUE(logs.has(Level::Error, "UploadBackend(uploadFileAtPath): Only upload a regular file.")) << path;
-    EXPECT_EQ(https.requestCount(), 0u);
+  // Starts an upload of `path` for user `client`, read through a descriptor
+  // as the daemon reads a client's file; the future holds the answer.
+  std::future<std::pair<bool, bool>> start(const fs::path& path, uid_t client = 1000,
+                                           std::chrono::milliseconds limit = std::chrono::seconds(20)) {
+    UploadRequest request;
+    request.name = path.filename().string();
+    request.client = client;
+    request.deadline = std::chrono::steady_clock::now() + limit;
+    request.file = sandbox::GrantedFile::adopt(
+        std::make_shared<const file::UniqueFd>(::open(path.c_str(), O_RDONLY | O_CLOEXEC)), request.name);
+    auto answer = std::make_shared<std::promise<std::pair<bool, bool>>>();
+    auto future = answer->get_future();
+    backend->uploadFileAtPath(request, [answer](bool taken, bool ok) { answer->set_value({taken, ok}); });
+    return future;
+  }
+  static Answer wait(std::future<std::pair<bool, bool>>& f, std::chrono::seconds limit = std::chrono::seconds(20)) {
+    if (f.wait_for(limit) != std::future_status::ready) {
+      return std::nullopt;
+    }
+    return f.get();
+  }
+  Answer upload(const fs::path& path) {
+    auto f = start(path);
+    return wait(f);
   }
 
   log::LogCapture logs;
@@ -60,13 +84,13 @@ class UploadBackendTest : public ::testing::Test {
   std::shared_ptr<UploadBackend> backend;
 };
 
-TEST_F(UploadBackendTest, FileIsPostedGzippedWithItsQueryAndDeletedOnSuccess) {
+TEST_F(UploadBackendTest, FileIsPostedGzippedWithItsQueryAndSuccessIsReported) {
   https.on("/upload", Reply{.body = "{\"result\": \"upload success\"}"});
   const fs::path file = files / "a b.log";
   const std::string contents = "line one\nline two\n" + std::string(10000, 'x');
   writeFile(file, contents);
 
-  EXPECT_TRUE(backend->uploadFileAtPath(file.string(), nullptr));
+  EXPECT_EQ(upload(file), std::make_pair(true, true));
   ASSERT_EQ(https.requestCount(), 1u);
   const auto request = https.requests()[0];
   EXPECT_EQ(request.method, "POST");
@@ -75,58 +99,105 @@ TEST_F(UploadBackendTest, FileIsPostedGzippedWithItsQueryAndDeletedOnSuccess) {
                                 "&filename=a%20b.log.gz&raw=true");
   EXPECT_EQ(request.header("Content-Type"), "application/octet-stream");
   EXPECT_EQ(request.header("Content-Encoding"), "gzip");
-  // The server undoes the gzip encoding it was told of (and refuses a body
-  // that is not gzip).
   EXPECT_EQ(request.body, contents);
-  EXPECT_FALSE(fs::exists(file));
-  EXPECT_TRUE(logs.has(Level::Debug, "UploadBackend(uploadFileAtPath): Uploading file " + file.string()));
+  // Deleting is the client framework's business, on the daemon's word.
+  EXPECT_TRUE(fs::exists(file));
   EXPECT_TRUE(logs.has(Level::Debug, "UploadBackend(uploadFileAtPath): sending to |" + https.url("/upload") +
                                          "|, Json output: {\"result\": \"upload success\"}"));
 }
 
-TEST_F(UploadBackendTest, ReplyWithoutSuccessKeepsTheFileAndStillAnswersYes) {
+TEST_F(UploadBackendTest, PostedWithoutSuccessOrWithATransportErrorStillAnswersYes) {
   https.on("/upload", Reply{.body = "ok"});
   const fs::path file = files / "report.log";
   writeFile(file, "data");
-  EXPECT_TRUE(backend->uploadFileAtPath(file.string(), nullptr));
-  EXPECT_EQ(https.requestCount(), 1u);
-  EXPECT_TRUE(fs::exists(file));
-}
+  EXPECT_EQ(upload(file), std::make_pair(true, false));
 
-TEST_F(UploadBackendTest, TransportErrorIsLoggedAndStillAnswersYes) {
   RefusingPort refusing;
   backend->setUploadURL(refusing.url("/upload"));
-  const fs::path file = files / "report.log";
-  writeFile(file, "data");
-  EXPECT_TRUE(backend->uploadFileAtPath(file.string(), nullptr));
+  EXPECT_EQ(upload(file), std::make_pair(true, false));
   EXPECT_TRUE(logs.contains("UploadBackend(uploadFileAtPath): post "));
-  EXPECT_TRUE(fs::exists(file));
 }
 
-TEST_F(UploadBackendTest, FoldersLinksFifosDevicesAndTraversalAreRefused) {
-  writeFile(files / "real.log", "secret");
-  fs::create_symlink(files / "real.log", files / "link.log");
-  ASSERT_EQ(::mkfifo((files / "pipe").c_str(), 0600), 0);
-  fs::create_directories(files / "sub");
-  fs::create_directory_symlink(files / "sub", files / "linkdir");
-  writeFile(files / "sub" / "inner.log", "x");
-
-  expectRefused(files.string());                                   // a folder
-  expectRefused((files / "link.log").string());                    // a symbolic link to a good file
-  expectRefused((files / "linkdir" / "inner.log").string());       // a link on the way
-  expectRefused((files / "pipe").string());                        // would block a reader
-  expectRefused("/dev/zero");                                      // a device
-  expectRefused((files / "sub" / ".." / "real.log").string());     // traversal
-  expectRefused("client/real.log");                                // relative
-  expectRefused((files / "missing.log").string());
-  EXPECT_TRUE(fs::exists(files / "real.log"));
-}
-
-TEST_F(UploadBackendTest, EmptyFileIsRefused) {
+TEST_F(UploadBackendTest, EmptyOrChangedFilesAreRefused) {
   writeFile(files / "empty.log", "");
-  EXPECT_FALSE(backend->uploadFileAtPath((files / "empty.log").string(), nullptr));
+  EXPECT_EQ(upload(files / "empty.log"), std::make_pair(false, false));
   EXPECT_TRUE(logs.has(Level::Error, "UploadBackend(uploadFileAtPath): Input file is empty"));
+
+  writeFile(files / "growing.log", "first");
+  auto granted = sandbox::GrantedFile::adopt(
+      std::make_shared<const file::UniqueFd>(::open((files / "growing.log").c_str(), O_RDONLY | O_CLOEXEC)), "g");
+  ASSERT_NE(granted, nullptr);
+  std::ofstream(files / "growing.log", std::ios::app) << " and more";
+  std::string why;
+  EXPECT_FALSE(granted->readAll(&why).has_value());
+  EXPECT_EQ(why, "the file changed while it was read");
   EXPECT_EQ(https.requestCount(), 0u);
+}
+
+TEST_F(UploadBackendTest, PlainHttpUploadAddressIsUpgradedAsEventPostsAre) {
+  https.on("/upload", Reply{.body = "success"});
+  // The server speaks only TLS: the file arrives only when the scheme was
+  // upgraded.
+  backend->setUploadURL("http://127.0.0.1:" + std::to_string(https.port()) + "/upload");
+  writeFile(files / "report.log", "data");
+  EXPECT_EQ(upload(files / "report.log"), std::make_pair(true, true));
+  EXPECT_EQ(https.requestCount(), 1u);
+  backend->setUploadURL("ftp-only-address");
+  EXPECT_EQ(upload(files / "report.log"), std::make_pair(false, false));
+  EXPECT_TRUE(logs.contains("is not an http(s) URL"));
+}
+
+TEST_F(UploadBackendTest, StalledServerEndsWithNoAtTheTimeLimit) {
+  https.on("/upload", Reply{.body = "success"});
+  https.holdAnswers();
+  writeFile(files / "report.log", "data");
+  const auto began = std::chrono::steady_clock::now();
+  auto f = start(files / "report.log", 1000, std::chrono::milliseconds(1500));
+  EXPECT_EQ(wait(f, std::chrono::seconds(10)), std::make_pair(false, false));
+  EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(8));
+  EXPECT_EQ(uploadLoad().running, 0u);
+  https.releaseAnswers();
+}
+
+TEST_F(UploadBackendTest, UploadsBeyondTheLimitsWaitWithoutAThreadOrAreRefused) {
+  https.on("/upload", Reply{.body = "success"});
+  https.holdAnswers();
+  writeFile(files / "report.log", "data");
+  // Two run for one client (the per-client limit), eight wait, the rest are
+  // refused at once; another client still gets a slot of the four.
+  std::vector<std::future<std::pair<bool, bool>>> mine;
+  for (int i = 0; i < 12; ++i) {
+    mine.push_back(start(files / "report.log", 1000));
+  }
+  auto theirs = start(files / "report.log", 2000);
+  ASSERT_TRUE(https.waitForRequests(3));
+  EXPECT_EQ(uploadLoad().running, 3u);
+  EXPECT_EQ(uploadLoad().waiting, 8u);
+  for (int i = 10; i < 12; ++i) {
+    EXPECT_EQ(wait(mine[i], std::chrono::seconds(5)), std::make_pair(false, false)) << i;
+  }
+  EXPECT_TRUE(logs.contains("uploads run and 8 wait already"));
+  https.releaseAnswers();
+  for (int i = 0; i < 10; ++i) {
+    EXPECT_EQ(wait(mine[i]), std::make_pair(true, true)) << i;
+  }
+  EXPECT_EQ(wait(theirs), std::make_pair(true, true));
+  EXPECT_EQ(https.requestCount(), 11u);
+  EXPECT_EQ(uploadLoad().running + uploadLoad().waiting, 0u);
+}
+
+TEST_F(UploadBackendTest, BodyFileThatCannotBeWrittenEndsWithNo) {
+  https.on("/upload", Reply{.body = "success"});
+  writeFile(files / "report.log", "data");
+  // A file where the storage folder should be: no body file can be made.
+  const fs::path storage = ReportingSessionConnectivityHelper::storageRootFolder();
+  fs::remove_all(storage);
+  fs::create_directories(storage.parent_path());
+  writeFile(storage, "in the way");
+  EXPECT_EQ(upload(files / "report.log"), std::make_pair(false, false));
+  EXPECT_TRUE(logs.contains("the body file cannot be written"));
+  EXPECT_EQ(https.requestCount(), 0u);
+  fs::remove(storage);
 }
 
 TEST_F(UploadBackendTest, ProfileWithoutPostURLMakesNoBackend) {
@@ -138,95 +209,6 @@ TEST_F(UploadBackendTest, ProfileWithoutPostURLMakesNoBackend) {
 
 TEST_F(UploadBackendTest, QueryEncodingKeepsTheQueryCharactersAndEscapesTheRest) {
   EXPECT_EQ(UploadBackend::percentEncodeQuery("a b%c#d&e=f/g?h\xc3\xa9"), "a%20b%25c%23d&e=f/g?h%C3%A9");
-}
-
-// --- Files granted for a client's identity ------------------------------------------------
-
-TEST_F(UploadBackendTest, TokenReadsTheFileTheSessionOpenedForTheClient) {
-  https.on("/upload", Reply{.body = "success"});
-  const fs::path file = files / "granted.log";
-  writeFile(file, "granted contents");
-  auto granted = sandbox::GrantedFile::open(file.string(), sandbox::Identity::ofProcess());
-  ASSERT_NE(granted, nullptr);
-  const std::string token = sandbox::issueExtension(granted);
-  // The token stands for one file only.
-  writeFile(files / "other.log", "other");
-  EXPECT_FALSE(backend->uploadFileAtPath((files / "other.log").string(), token.c_str()));
-  EXPECT_TRUE(backend->uploadFileAtPath(file.string(), token.c_str()));
-  sandbox::revokeExtension(token);
-  EXPECT_EQ(sandbox::consumeExtension(token.c_str()), nullptr);
-  ASSERT_EQ(https.requestCount(), 1u);
-  EXPECT_EQ(https.requests()[0].body, "granted contents");
-  EXPECT_FALSE(fs::exists(file));
-  EXPECT_TRUE(fs::exists(files / "other.log"));
-}
-
-TEST(GrantedFileTest, FileOfAnotherUserIsNeitherReadNorDeleted) {
-  TempRoot root;
-  const fs::path file = root.path() / "theirs.log";
-  writeFile(file, "theirs");
-  std::string why;
-  if (::geteuid() == 0) {
-    ASSERT_EQ(::chown(file.c_str(), kOtherUser, kOtherUser), 0);
-    EXPECT_EQ(sandbox::GrantedFile::open(file.string(), sandbox::Identity{0, 0}, &why), nullptr);
-    EXPECT_EQ(why, "the file belongs to user 65534, not to the client (user 0)");
-  }
-  // The other way round: a client that is not the file's owner.
-  ASSERT_EQ(::chown(file.c_str(), ::geteuid(), ::getegid()), 0);
-  EXPECT_EQ(sandbox::GrantedFile::open(file.string(), sandbox::Identity{kOtherUser, kOtherUser}, &why), nullptr);
-  EXPECT_TRUE(fs::exists(file));
-}
-
-TEST(GrantedFileTest, FolderTheClientCannotSearchStopsTheOpen) {
-  if (::geteuid() != 0) {
-    GTEST_SKIP() << "opening with another identity needs root";
-  }
-  TempRoot root;
-  ::chmod(root.path().c_str(), 0711);
-  const fs::path closed = root.path() / "closed";
-  fs::create_directories(closed);
-  ::chmod(closed.c_str(), 0700);  // root's own
-  const fs::path file = closed / "mine.log";
-  writeFile(file, "mine");
-  ASSERT_EQ(::chown(file.c_str(), kOtherUser, kOtherUser), 0);
-  std::string why;
-  EXPECT_EQ(sandbox::GrantedFile::open(file.string(), sandbox::Identity{kOtherUser, kOtherUser}, &why), nullptr);
-  EXPECT_EQ(why, "the file cannot be reached (Permission denied)");
-  // Searchable for everyone: the owner's file opens.
-  ::chmod(closed.c_str(), 0711);
-  EXPECT_NE(sandbox::GrantedFile::open(file.string(), sandbox::Identity{kOtherUser, kOtherUser}, &why), nullptr) << why;
-}
-
-TEST(GrantedFileTest, FileChangedAfterOpeningIsNotReadAndLargeFilesAreRefused) {
-  TempRoot root;
-  const fs::path file = root.path() / "growing.log";
-  writeFile(file, "first");
-  auto granted = sandbox::GrantedFile::open(file.string(), sandbox::Identity::ofProcess());
-  ASSERT_NE(granted, nullptr);
-  std::ofstream(file, std::ios::app) << " and more";
-  std::string why;
-  EXPECT_FALSE(granted->readAll(&why).has_value());
-  EXPECT_EQ(why, "the file changed while it was read");
-
-  const fs::path large = root.path() / "large.log";
-  { std::ofstream(large, std::ios::binary).put('x'); }
-  fs::resize_file(large, sandbox::kMaxUploadFileBytes + 1);
-  EXPECT_EQ(sandbox::GrantedFile::open(large.string(), sandbox::Identity::ofProcess(), &why), nullptr);
-  EXPECT_NE(why.find("more than the"), std::string::npos);
-}
-
-TEST(GrantedFileTest, RemoveLeavesANameThatNowNamesAnotherFile) {
-  TempRoot root;
-  const fs::path file = root.path() / "swapped.log";
-  writeFile(file, "original");
-  auto granted = sandbox::GrantedFile::open(file.string(), sandbox::Identity::ofProcess());
-  ASSERT_NE(granted, nullptr);
-  fs::remove(file);
-  writeFile(file, "replacement");
-  std::string why;
-  EXPECT_FALSE(granted->remove(&why));
-  EXPECT_EQ(why, "the name no longer names the uploaded file");
-  EXPECT_TRUE(fs::exists(file));
 }
 
 }  // namespace

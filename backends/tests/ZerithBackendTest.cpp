@@ -170,7 +170,9 @@ TEST(ZerithBackendTest, NoOpDefaultsAnswerNilAndNo) {
   EXPECT_EQ(b.sendMessage(Value(Dictionary{{"a", 1}}), now, 1, 2, 3, 0), std::nullopt);
   EXPECT_EQ(b.sendMessage(Value(Dictionary{{"a", 1}}), now, 1, 2, 0), std::nullopt);
   EXPECT_EQ(b.flushMessagesWithCompletion(nullptr), std::nullopt);
-  EXPECT_FALSE(b.uploadFileAtPath("/tmp/x", "token"));
+  bool taken = true;
+  b.uploadFileAtPath(UploadRequest{}, [&](bool t, bool) { taken = t; });
+  EXPECT_FALSE(taken);
   EXPECT_FALSE(b.uploadLogData(Value(Array{Value("line")})));
   EXPECT_EQ(b.batchedEventsSize(), 0u);
   b.cleanup();

@@ -78,7 +78,7 @@ TEST_F(CApiFixture, EveryOperationWithACompletionAnswersThroughItsCallback) {
   ASSERT_EQ(zerith_fetch_states(s.get(), R"({"clientName": "mail"})", &Catcher::callback, &states), 0);
   ASSERT_EQ(zerith_fetch_display_url(s.get(), &Catcher::callback, &url), 0);
   ASSERT_EQ(zerith_flush_messages(s.get(), &Catcher::callback, &flush), 0);
-  ASSERT_EQ(zerith_upload_file(s.get(), "file:///tmp/a", nullptr, &Catcher::callback, &upload), 0);
+  ASSERT_EQ(zerith_upload_file(s.get(), "file:///dev/null", nullptr, &Catcher::callback, &upload), 0);
   ASSERT_EQ(zerith_upload_log_data(s.get(), R"(["l1"])", &Catcher::callback, &uploadLog), 0);
   ASSERT_EQ(zerith_send_message_with_session_info(s.get(), "{}", nullptr, 65535, 0, R"({"p": true})", &Catcher::callback,
                                                   &oneShot), 0);
@@ -91,7 +91,7 @@ TEST_F(CApiFixture, EveryOperationWithACompletionAnswersThroughItsCallback) {
   EXPECT_EQ(states.get().reply, std::optional<std::string>(R"({"backends":["httpsPost","dashboard"]})"));
   EXPECT_EQ(url.get().reply, std::optional<std::string>(R"({"url":"https://display.example/session"})"));
   EXPECT_EQ(flush.get().reply, std::optional<std::string>(R"({"result":"flushed"})"));
-  EXPECT_EQ(upload.get().reply, std::optional<std::string>(R"({"success":true})"));
+  EXPECT_EQ(upload.get().reply, std::optional<std::string>(R"({"success":true,"removeFile":false})"));
   EXPECT_EQ(uploadLog.get().reply,
             std::optional<std::string>(
                 R"({"success":false,"error":{"domain":"com.velmar.zerith.ErrorDomain","code":-1,"description":"no upload backend"}})"));

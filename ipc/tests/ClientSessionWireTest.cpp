@@ -58,7 +58,7 @@ TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) 
   link.proxy.sendMessageWithDictionary(message, [&](Value v) { sent.set_value(v); });
   link.proxy.flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
   link.proxy.finishSessionGracefully();
-  link.proxy.uploadFileAtPath(Value("file:///tmp/x.log"), Value("token"), [&](bool ok) { uploaded.set_value(ok); });
+  link.proxy.uploadFileAtPath(Value("file:///dev/null"), Value("token"), [&](bool ok) { uploaded.set_value(ok); });
   link.proxy.uploadLogData(Value(Array{Value("line")}), [&](bool ok, std::optional<Error> e) { logUploaded.set_value({ok, e}); });
   link.proxy.sendMessageWithSessionInfo(sessionInfo, userInfo, 65535, 9, payload, [&](Value v) { oneShot.set_value(v); });
   link.proxy.updateSharedDataWithDictionary(Value(Dictionary{{"shared", 1}}));
@@ -97,7 +97,7 @@ TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) 
       {"sendMessage", {{"message", message}}},
       {"flushMessages", {}},
       {"finishSession", {}},
-      {"uploadFile", {{"fileURL", "file:///tmp/x.log"}, {"extensionToken", "token"}}},
+      {"uploadFile", {{"fileURL", "file:///dev/null"}, {"descriptor", true}}},
       {"uploadLogData", {{"logData", Array{Value("line")}}}},
       {"sendMessageWithSessionInfo", {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"category", 65535u},
                                       {"type", 9u}, {"payload", payload}}},
@@ -138,7 +138,7 @@ TEST(ClientSessionWire, FailedCallsCompleteWithNilFalseAndTheError) {
   std::promise<bool> uploaded;
   link.proxy.fetchDisplayURL([&](Value v) { url.set_value(v); });
   link.proxy.flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
-  link.proxy.uploadFileAtPath(Value("/x"), Value(), [&](bool ok) { uploaded.set_value(ok); });
+  link.proxy.uploadFileAtPath(Value("/dev/null"), Value(), [&](bool ok) { uploaded.set_value(ok); });
   ASSERT_TRUE(link.session->log.waitFor(3));
   link.pair.b->invalidate();  // the daemon end goes away mid-call
   auto f1 = url.get_future();

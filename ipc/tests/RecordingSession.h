@@ -103,6 +103,11 @@ class RecordingSession : public ClientSessionInterface {
     record("uploadFile", {{"fileURL", fileURL}, {"extensionToken", extensionToken}}, bool(completion));
     complete([=, this] { completion(uploadFileResult); }, bool(completion));
   }
+  void uploadFileWithDescriptor(const Value& fileURL, std::shared_ptr<const file::UniqueFd> descriptor,
+                                UploadCompletion completion) override {
+    record("uploadFile", {{"fileURL", fileURL}, {"descriptor", descriptor && *descriptor}}, bool(completion));
+    complete([=, this] { completion(uploadFileResult, false); }, bool(completion));
+  }
   void uploadLogData(const Value& logData, BoolErrorCompletion completion) override {
     record("uploadLogData", {{"logData", logData}}, bool(completion));
     complete([=, this] { completion(uploadLogResult, uploadLogError); }, bool(completion));

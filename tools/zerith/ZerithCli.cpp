@@ -38,7 +38,9 @@ constexpr const char* kStepsHelp = R"(Steps run in the order given, on one conne
   flush                  flushMessages               -> {"step":"flush","result":...,"error":...}
   one-shot[=MESSAGE]     sendMessageWithSessionInfo with the session options and
                          MESSAGE's category, type and payload
-  upload-file=PATH       uploadFileAtPath (--extension-token for the token)
+  upload-file=PATH       uploadFileAtPath: PATH is opened with this process's rights
+                         and its descriptor passed; deleted here on the daemon's word
+                         -> {"step":"upload-file","success":...,"removeFile":...}
   upload-log=ARRAY       uploadLogData with a JSON array
   shared-data=DICT       updateSharedDataWithDictionary with a JSON dictionary
   shared-key=KEY=VALUE   updateSharedDataForKey; VALUE is JSON, null removes the key
@@ -75,7 +77,6 @@ struct SessionOptions {
   std::uint32_t category = 0;
   std::uint32_t type = 0;
   std::string payload = "{}";
-  std::optional<std::string> extensionToken;
   std::vector<std::string> steps;
 };
 
@@ -283,8 +284,7 @@ class Runner {
     }
     if (n == "upload-file") {
       const Value file(need(step));
-      const Value token = o_.extensionToken ? Value(*o_.extensionToken) : Value();
-      return [this, file, token] { return session_->uploadFile(file, token, timeout_); };
+      return [this, file] { return session_->uploadFile(file, Value(), timeout_); };
     }
     if (n == "upload-log") {
       const Value data = parseJson(need(step), "upload-log data");
@@ -507,7 +507,6 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
   session->add_option("--category", o.category, "Category of send/one-shot steps without a MESSAGE")->check(CLI::Range(0, 65535));
   session->add_option("--type", o.type, "Type of send/one-shot steps without a MESSAGE")->check(CLI::Range(0, 65535));
   session->add_option("--payload", o.payload, "Payload of send/one-shot steps without a MESSAGE (JSON dictionary)");
-  session->add_option("--extension-token", o.extensionToken, "Sandbox extension token for upload-file");
   session->add_option("--step", o.steps, "A step (repeat; see below; at least one)");
 
   std::optional<std::string> script;

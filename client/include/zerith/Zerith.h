@@ -36,7 +36,7 @@
 // Completion argument names: startConfig/fetchStates "backends" (array of
 // backend names or absent), fetchDisplayURL "url", sendMessage and
 // sendMessageWithSessionInfo "result", flushMessages "result" and "error",
-// uploadFile "success", uploadLogData "success" and "error"; an error
+// uploadFile "success" and "removeFile", uploadLogData "success" and "error"; an error
 // argument is a dictionary {"domain", "code", "description"}.
 
 #include <chrono>
@@ -121,7 +121,14 @@ class ZERITH_EXPORT Zerith {
 
   // The generic form: any operation by its wire name; the completion gets
   // the reply (empty arguments for operations without a completion).
+  // An upload (by either form) opens the file here, with this process's
+  // rights, and passes its descriptor with the call; the extension token
+  // argument is not used. When the reply carries "removeFile" (the server
+  // answered "success") the file is deleted here, before the reply is handed
+  // on. A file this process cannot open fails the call without reaching the
+  // daemon.
   void call(const std::string& operation, Dictionary args, std::function<void(ZerithReply)> completion);
+  void uploadFile(const Value& fileURL, std::function<void(ZerithReply)> completion);
 
   // ---- blocking, with a time-out ---------------------------------------------
   // Operations without a completion return once the daemon has taken them.

@@ -1,0 +1,123 @@
+// Descriptors that travel with a call: the frame that claims them gets
+// them, and whatever no frame claims, or is beyond its claim, is closed at
+// once instead of piling up in the daemon.
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "ipc/tests/IpcTestSupport.h"
+
+namespace zerith::ipc::test {
+namespace {
+
+// Sends `frame` with `fds` attached to its first byte.
+void sendWithDescriptors(int socket, const Data& frame, const std::vector<int>& fds) {
+  iovec part{const_cast<std::uint8_t*>(frame.data()), frame.size()};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * 8)] = {};
+  msghdr m{};
+  m.msg_iov = &part;
+  m.msg_iovlen = 1;
+  if (!fds.empty()) {
+    m.msg_control = control;
+    m.msg_controllen = CMSG_SPACE(sizeof(int) * fds.size());
+    cmsghdr* c = CMSG_FIRSTHDR(&m);
+    c->cmsg_level = SOL_SOCKET;
+    c->cmsg_type = SCM_RIGHTS;
+    c->cmsg_len = CMSG_LEN(sizeof(int) * fds.size());
+    std::memcpy(CMSG_DATA(c), fds.data(), sizeof(int) * fds.size());
+  }
+  ASSERT_EQ(::sendmsg(socket, &m, MSG_NOSIGNAL), static_cast<ssize_t>(frame.size()));
+}
+
+// A pipe whose write end is sent: once every copy of it is closed, its read
+// end sees end of file.
+struct Pipe {
+  file::UniqueFd read, write;
+  Pipe() {
+    int p[2];
+    EXPECT_EQ(::pipe2(p, O_CLOEXEC), 0);
+    read.reset(p[0]);
+    write.reset(p[1]);
+  }
+  bool closedEverywhere() const {
+    pollfd p{read.get(), POLLIN, 0};
+    char byte = 0;
+    return ::poll(&p, 1, 5000) == 1 && ::read(read.get(), &byte, 1) == 0;
+  }
+};
+
+struct Case {
+  const char* name;
+  std::uint32_t claimed;
+  int sent;
+  std::size_t received;  // descriptors the call gets
+};
+
+class DescriptorPassingTest : public ::testing::TestWithParam<Case> {};
+
+TEST_P(DescriptorPassingTest, TheCallGetsWhatItClaimedAndTheRestIsClosed) {
+  const Case& c = GetParam();
+  RawPeer peer;
+  std::vector<Pipe> pipes(static_cast<std::size_t>(c.sent));
+  std::vector<int> fds;
+  for (const auto& p : pipes) {
+    fds.push_back(p.write.get());
+  }
+  sendWithDescriptors(peer.raw.get(), encodeCall("upload", 1, Dictionary(), c.claimed), fds);
+  ASSERT_TRUE(peer.object->received.waitFor(1));
+  const auto calls = peer.object->calls();
+  ASSERT_EQ(calls[0].descriptors.size(), c.received);
+  for (const auto& d : calls[0].descriptors) {
+    struct stat s {};
+    ASSERT_EQ(::fstat(d->get(), &s), 0);
+    EXPECT_TRUE(S_ISFIFO(s.st_mode));
+  }
+  // Ours go; the ones beyond what the call holds must be gone already.
+  for (auto& p : pipes) {
+    p.write.reset();
+  }
+  for (std::size_t i = c.received; i < pipes.size(); ++i) {
+    EXPECT_TRUE(pipes[i].closedEverywhere()) << i;
+  }
+  // A later call claims nothing that came before it.
+  peer.write(encodeCall("next", 2, Dictionary(), 1));
+  ASSERT_TRUE(peer.object->received.waitFor(2));
+  EXPECT_TRUE(peer.object->calls()[1].descriptors.empty());
+}
+
+INSTANTIATE_TEST_SUITE_P(Claims, DescriptorPassingTest,
+                         ::testing::Values(Case{"ClaimedAndSent", 1, 1, 1}, Case{"SentUnclaimed", 0, 1, 0},
+                                           Case{"MoreSentThanClaimed", 1, 3, 1}, Case{"ClaimedNotSent", 2, 0, 0}),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+TEST(DescriptorPassing, FrameClaimingMoreThanAFrameMayCarryEndsTheConnection) {
+  RawPeer peer;
+  peer.write(encodeCall("upload", 1, Dictionary(), kMaxDescriptorsPerFrame + 1));
+  EXPECT_TRUE(peer.invalidated.waitFor(1));
+  EXPECT_EQ(peer.object->received.count(), 0);
+}
+
+TEST(DescriptorPassing, ConnectionCallCarriesItsDescriptors) {
+  ConnectedPair pair;
+  auto object = std::make_shared<RecordingObject>();
+  pair.b->setExportedObject(object);
+  pair.a->resume();
+  pair.b->resume();
+  Pipe pipe;
+  std::vector<file::UniqueFd> fds;
+  fds.emplace_back(::dup(pipe.write.get()));
+  std::promise<void> answered;
+  pair.a->call("upload", Dictionary(), std::move(fds),
+               [&](std::optional<Dictionary>, std::optional<Error>) { answered.set_value(); });
+  ASSERT_EQ(answered.get_future().wait_for(kWait), std::future_status::ready);
+  const auto calls = object->calls();
+  ASSERT_EQ(calls.size(), 1u);
+  ASSERT_EQ(calls[0].descriptors.size(), 1u);
+  EXPECT_EQ(::write(calls[0].descriptors[0]->get(), "x", 1), 1);
+  char byte = 0;
+  EXPECT_EQ(::read(pipe.read.get(), &byte, 1), 1);
+}
+
+}  // namespace
+}  // namespace zerith::ipc::test

@@ -1,0 +1,251 @@
+// Uploads through the real daemon and client framework: the framework opens
+// the file with the client's own rights and passes the descriptor; the
+// daemon reads only through it, deletes nothing itself, and stays
+// responsive while an upload server stalls.
+
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <thread>
+
+#include "ipc/ClientSessionWire.h"
+#include "tests/e2e/E2eFixture.h"
+#include "zerith/Zerith.h"
+
+namespace zerith::test {
+namespace {
+
+using log::Level;
+namespace fs = std::filesystem;
+
+constexpr uid_t kNobody = 65534;
+
+// Runs `work` on a thread of its own whose user is `uid` (the rest of the
+// process keeps its identity: the raw system call changes one thread only).
+template <typename F>
+auto asUser(uid_t uid, F&& work) {
+  return std::async(std::launch::async, [uid, work = std::forward<F>(work)]() mutable {
+           // Saved user stays root so that the thread could go back; the
+           // effective and file-system user is `uid`.
+           EXPECT_EQ(::syscall(SYS_setresgid, uid, uid, 0), 0);
+           EXPECT_EQ(::syscall(SYS_setresuid, uid, uid, 0), 0);
+           return work();
+         })
+      .get();
+}
+
+class UploadByDescriptorTest : public E2eTest {
+ protected:
+  void SetUp() override {
+    grant(Value(true));
+    files = root.path() / "client";
+    fs::create_directories(files);
+    ::chmod(root.path().c_str(), 0755);
+    ::chmod(files.c_str(), 0777);
+  }
+
+  // A daemon whose demo client type has an upload backend posting to `postURL`.
+  void startWithUploadServer(const std::string& postURL) {
+    Dictionary client{{"client", "demo"},       {"service", "cli"},          {"override_dnu", 1},
+                      {"sampling_threshold", 1.0}, {"locale_whitelist", Array{Value("GB")}},
+                      {"post_url", postURL}};
+    const Value section(Dictionary{{"uploadServer", Dictionary{{"clients", Array{Value(std::move(client))}}}}});
+    serveSignedStorebag(https, Value(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}}));
+    DaemonProcess::Options options;
+    options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
+    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
+    startDaemon(std::move(options));
+  }
+
+  static void rootOnly(const fs::path& path) {
+    std::ofstream(path) << "secret";
+    ::chown(path.c_str(), 0, 0);
+    ::chmod(path.c_str(), 0600);
+  }
+
+  HttpsTestServer https;
+  fs::path files;
+};
+
+TEST_F(UploadByDescriptorTest, ClientRightsDecideWhatCanBeUploaded) {
+  if (::geteuid() != 0) {
+    GTEST_SKIP() << "changing a thread's user needs root";
+  }
+  startWithUploadServer(https.url("/upload"));
+  https.on("/upload", Reply{.body = "success"});
+  rootOnly(files / "secret.log");
+  fs::create_directories(files / "closed");
+  std::ofstream(files / "closed" / "theirs.log") << "theirs";
+  ::chown((files / "closed" / "theirs.log").c_str(), kNobody, kNobody);
+  ::chmod((files / "closed").c_str(), 0700);  // root's folder: nobody cannot search it
+
+  auto client = startDemoSession(1);
+  ASSERT_TRUE(client);
+  // Connected as root, then dropped to nobody: the framework's own open
+  // fails, and nothing reaches the daemon.
+  for (const fs::path& path : {files / "secret.log", files / "closed" / "theirs.log"}) {
+    const ZerithReply upload =
+        asUser(kNobody, [&] { return client->uploadFile(Value("file://" + path.string()), Value(), 10s); });
+    ASSERT_TRUE(upload.error) << path;
+    EXPECT_NE(upload.error->description.find("Permission denied"), std::string::npos) << upload.error->description;
+  }
+
+  // A connection made by root and handed to nobody (SCM_RIGHTS of the
+  // socket): nobody cannot open the root-only file, and the daemon does not
+  // open the named path for the connection's root credentials: a call
+  // without a descriptor is refused.
+  int pair[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
+  file::UniqueFd sender(pair[0]), receiver(pair[1]);
+  file::UniqueFd connection = connectToDaemonSocket();
+  ASSERT_TRUE(connection);
+  {
+    char byte = 'c';
+    iovec part{&byte, 1};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+    msghdr m{};
+    m.msg_iov = &part;
+    m.msg_iovlen = 1;
+    m.msg_control = control;
+    m.msg_controllen = sizeof control;
+    cmsghdr* c = CMSG_FIRSTHDR(&m);
+    c->cmsg_level = SOL_SOCKET;
+    c->cmsg_type = SCM_RIGHTS;
+    c->cmsg_len = CMSG_LEN(sizeof(int));
+    const int fd = connection.get();
+    std::memcpy(CMSG_DATA(c), &fd, sizeof fd);
+    ASSERT_EQ(::sendmsg(sender.get(), &m, 0), 1);
+  }
+  const bool refusedToOpen = asUser(kNobody, [&] {
+    char byte = 0;
+    iovec part{&byte, 1};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+    msghdr m{};
+    m.msg_iov = &part;
+    m.msg_iovlen = 1;
+    m.msg_control = control;
+    m.msg_controllen = sizeof control;
+    if (::recvmsg(receiver.get(), &m, MSG_CMSG_CLOEXEC) != 1 || CMSG_FIRSTHDR(&m) == nullptr) {
+      return false;
+    }
+    int fd = -1;
+    std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&m)), sizeof fd);
+    const file::UniqueFd handed(fd);
+    const bool denied = ::open((files / "secret.log").c_str(), O_RDONLY | O_CLOEXEC) < 0 && errno == EACCES;
+    // What the new holder can still do: name the path without a descriptor.
+    const Data call = ipc::encodeCall(ipc::wire::kUploadFile, 1,
+                                      ipc::wire::uploadFileArgs(Value((files / "secret.log").string()), Value()));
+    return denied && ::send(handed.get(), call.data(), call.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(call.size());
+  });
+  EXPECT_TRUE(refusedToOpen);
+  ipc::FrameDecoder decoder;
+  std::optional<Value> answer;
+  for (int i = 0; i < 100 && !answer; ++i) {
+    pollfd p{connection.get(), POLLIN, 0};
+    std::uint8_t buf[4096];
+    ssize_t n = 0;
+    if (::poll(&p, 1, 100) <= 0 || (n = ::recv(connection.get(), buf, sizeof buf, 0)) <= 0) {
+      continue;
+    }
+    decoder.append(buf, static_cast<std::size_t>(n));
+    plist::Bytes body;
+    std::string why;
+    if (decoder.next(body, why) == ipc::FrameDecoder::Status::Frame) {
+      answer = plist::decodeBinary(body);
+    }
+  }
+  ASSERT_TRUE(answer);
+  EXPECT_EQ((*answer)["args"]["success"], Value(false));
+  EXPECT_TRUE(daemon->waitFor("Refusing to upload " + (files / "secret.log").string() +
+                              ": no descriptor came with the request"));
+  EXPECT_EQ(https.requestCount(), 0u);
+  EXPECT_TRUE(fs::exists(files / "secret.log"));
+}
+
+TEST_F(UploadByDescriptorTest, PlainHttpIsUpgradedAndTheFrameworkDeletesOnSuccess) {
+  https.on("/upload", Reply{.body = "upload success"});
+  startWithUploadServer("http://127.0.0.1:" + std::to_string(https.port()) + "/upload");
+  auto client = startDemoSession(1);
+  ASSERT_TRUE(client);
+  // A name with a line feed: one log line, escaped.
+  const fs::path file = files / "a\nforged.log";
+  std::ofstream(file) << "contents";
+  const ZerithReply upload = client->uploadFile(Value(file.string()), Value(), 20s);
+  ASSERT_TRUE(upload) << upload.error->description;
+  EXPECT_EQ(upload["success"], Value(true));
+  EXPECT_EQ(upload["removeFile"], Value(true));
+  ASSERT_EQ(https.requestCount(), 1u);
+  EXPECT_EQ(https.requests()[0].body, "contents");
+  EXPECT_NE(https.requests()[0].target.find("filename=a%0Aforged.log.gz"), std::string::npos);
+  EXPECT_FALSE(fs::exists(file));
+  const std::string escaped = (files / "a").string() + "\\nforged.log";
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "uploadFileWithURL: File upload successful for " + escaped));
+  EXPECT_EQ(daemon->count("forged.log"), daemon->count("\\nforged.log"));
+}
+
+TEST_F(UploadByDescriptorTest, StalledServerHoldsNoThreadAndUploadsEndWithNoAtTheLimit) {
+  https.on("/upload", Reply{.body = "success"});
+  https.holdAnswers();
+  Defaults("com.velmar.zerith").setObject("uploadTimeoutSeconds", Value(3));
+  startWithUploadServer(https.url("/upload"));
+  std::ofstream(files / "report.log") << "report";
+
+  constexpr int kUploaders = 10;
+  std::vector<std::unique_ptr<Zerith>> clients;
+  std::vector<std::future<ZerithReply>> uploads;
+  for (int i = 0; i < kUploaders; ++i) {
+    clients.push_back(startDemoSession(static_cast<std::uint32_t>(10 + i)));
+    ASSERT_TRUE(clients.back());
+  }
+  const auto began = std::chrono::steady_clock::now();
+  for (auto& c : clients) {
+    uploads.push_back(std::async(std::launch::async, [&c, this] {
+      return c->uploadFile(Value((files / "report.log").string()), Value(), 20s);
+    }));
+  }
+  ASSERT_TRUE(https.waitForRequests(1));
+  // Meanwhile another client is served at once.
+  const auto asked = std::chrono::steady_clock::now();
+  auto other = Zerith::connect();
+  ASSERT_TRUE(other);
+  ASSERT_TRUE(other->fetchDisplayURL(5s));
+  EXPECT_LT(std::chrono::steady_clock::now() - asked, 1s);
+
+  for (auto& u : uploads) {
+    const ZerithReply r = u.get();
+    ASSERT_TRUE(r) << r.error->description;
+    EXPECT_EQ(r["success"], Value(false));
+  }
+  // All at the limit (waiting included), not when the server lets go.
+  EXPECT_LT(std::chrono::steady_clock::now() - began, 10s);
+  EXPECT_TRUE(daemon->waitFor("no answer within the time limit of 3000 ms"));
+  EXPECT_TRUE(fs::exists(files / "report.log"));
+  https.releaseAnswers();
+}
+
+TEST_F(UploadByDescriptorTest, BodyFileThatCannotBeWrittenEndsWithNo) {
+  startWithUploadServer(https.url("/upload"));
+  https.on("/upload", Reply{.body = "success"});
+  // A file where the storage folder should be.
+  const fs::path storage = root.path() / "tmp/zthstorage";
+  fs::remove_all(storage);
+  fs::create_directories(storage.parent_path());
+  std::ofstream(storage) << "in the way";
+  auto client = startDemoSession(1);
+  ASSERT_TRUE(client);
+  std::ofstream(files / "report.log") << "report";
+  const ZerithReply upload = client->uploadFile(Value((files / "report.log").string()), Value(), 20s);
+  ASSERT_TRUE(upload) << upload.error->description;
+  EXPECT_EQ(upload["success"], Value(false));
+  EXPECT_TRUE(daemon->waitFor("the body file cannot be written"));
+  EXPECT_EQ(https.requestCount(), 0u);
+}
+
+}  // namespace
+}  // namespace zerith::test
