@@ -197,9 +197,8 @@ void ZerithdAgent::releaseVeskTransaction() {
   --VeskTransactionReference_;
   logger().info("releaseVeskTransaction: Vesk transaction ref count is {}", VeskTransactionReference_);
   if (VeskTransactionReference_ == 0) {
-    // Said before the end: a stop that waits for the end exits right after.
-    logger().info("releaseVeskTransaction: Vesk transaction ended");
     transaction_->end();
+    logger().info("releaseVeskTransaction: Vesk transaction ended");
   }
 }
 

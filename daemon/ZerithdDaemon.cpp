@@ -205,6 +205,9 @@ int ZerithdDaemon::run() {
     }
   }
   listener.reset();
+  // The count is read under the keep-alive lock: a release under way
+  // finishes (and logs its end) before the process goes.
+  agent->veskTransactionReference();
   return 0;
 }
 
