@@ -8,7 +8,7 @@
 #include <fmt/format.h>
 
 #include "config/Conversions.h"
-#include "daemon/SenderCodes.h"
+#include "config/SenderCodes.h"
 #include "ipc/ClientSessionExporter.h"
 #include "ipc/Connection.h"
 #include "platform/Log.h"

@@ -6,7 +6,7 @@
 
 #include <cstring>
 
-#include "daemon/SenderCodes.h"
+#include "config/SenderCodes.h"
 #include "daemon/tests/AgentFixture.h"
 #include "ipc/Listener.h"
 
