@@ -2,17 +2,13 @@
 
 // Scenario helpers of the end-to-end tests: a temporary root with an
 // entitlements policy for the test's own user, the real zerithd started in
-// it, and raw socket clients that speak the frame protocol byte by byte.
+// it; raw socket clients are tests/support/RawFrameSocket.h.
 
 #include <gtest/gtest.h>
 
-#include <poll.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <cstring>
 #include <filesystem>
 #include <memory>
 #include <optional>
@@ -26,95 +22,13 @@
 #include "platform/PropertyList.h"
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/HttpsTestServer.h"
+#include "tests/support/RawFrameSocket.h"
 #include "tests/support/TempRoot.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
 
 using namespace std::chrono_literals;
-
-// A client socket that writes bytes and reads frames with a deadline.
-class RawClient {
- public:
-  static std::optional<RawClient> connect() {
-    file::UniqueFd fd = connectToDaemonSocket();
-    if (!fd) {
-      return std::nullopt;
-    }
-    return RawClient(std::move(fd));
-  }
-
-  bool write(const Data& bytes) {
-    std::size_t done = 0;
-    while (done < bytes.size()) {
-      const ssize_t n = ::send(fd_.get(), bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
-      if (n <= 0) {
-        return false;
-      }
-      done += static_cast<std::size_t>(n);
-    }
-    return true;
-  }
-  bool call(std::string_view operation, std::uint64_t number, const Dictionary& args = {}) {
-    return write(ipc::encodeCall(operation, number, args));
-  }
-
-  // The next message, or nullopt when the daemon closed the connection or
-  // nothing came before the deadline (closed() tells which).
-  std::optional<Value> read(std::chrono::milliseconds timeout = 10s) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    for (;;) {
-      plist::Bytes body;
-      std::string why;
-      switch (decoder_.next(body, why)) {
-        case ipc::FrameDecoder::Status::Frame:
-          return plist::decodeBinary(body);
-        case ipc::FrameDecoder::Status::Invalid:
-          return std::nullopt;
-        case ipc::FrameDecoder::Status::NeedMore:
-          break;
-      }
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
-      pollfd p{fd_.get(), POLLIN, 0};
-      if (left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
-        return std::nullopt;
-      }
-      std::uint8_t buf[65536];
-      const ssize_t n = ::recv(fd_.get(), buf, sizeof buf, 0);
-      if (n <= 0) {
-        closed_ = true;
-        return std::nullopt;
-      }
-      decoder_.append(buf, static_cast<std::size_t>(n));
-    }
-  }
-  // The reply to call `number` (other messages are skipped).
-  std::optional<Value> replyTo(std::uint64_t number, std::chrono::milliseconds timeout = 10s) {
-    for (;;) {
-      auto m = read(timeout);
-      if (!m || (*m)["reply"].unsignedValue() == number) {
-        return m;
-      }
-    }
-  }
-  // True when the daemon closes the connection before the deadline.
-  bool waitClosed(std::chrono::milliseconds timeout = 10s) {
-    while (!closed_) {
-      if (!read(timeout) && !closed_) {
-        return false;
-      }
-    }
-    return true;
-  }
-  bool closed() const { return closed_; }
-  void close() { fd_.reset(); }
-
- private:
-  explicit RawClient(file::UniqueFd fd) : fd_(std::move(fd)) {}
-  file::UniqueFd fd_;
-  ipc::FrameDecoder decoder_;
-  bool closed_ = false;
-};
 
 class E2eTest : public ::testing::Test {
  protected:
@@ -139,17 +53,25 @@ class E2eTest : public ::testing::Test {
     root.write("/usr/share/zerith/publicKey.der", std::string(der.begin(), der.end()));
   }
 
-  // Signs `bag` with a fresh key pair whose public half the daemon trusts,
-  // writes it where a collector serving `www` hands out the storebag
-  // "dravon", and points the daemon's storebag URL at `storebagURL`.
-  void publishSignedStorebag(const Value& bag, const std::filesystem::path& www, const std::string& storebagURL) {
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
+  // `bag` in a signed container; the key pair is made once per test process
+  // and its public half installed where this root's daemon reads it.
+  Data signedStorebag(const Value& bag) {
+    static const std::optional<StorebagKeyPair> keys = generateStorebagKeyPair(2048);
+    EXPECT_TRUE(keys.has_value());
+    if (!keys) {
+      return {};
+    }
     installPublicKey(keys->publicKeyDER);
     const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
+    EXPECT_TRUE(container.has_value());
+    return container.value_or(Data());
+  }
+
+  // Signs `bag` (signedStorebag), writes it where a collector serving `www` hands out the storebag
+  // "dravon", and points the daemon's storebag URL at `storebagURL`.
+  void publishSignedStorebag(const Value& bag, const std::filesystem::path& www, const std::string& storebagURL) {
     std::filesystem::create_directories(www / "zerith");
-    ASSERT_TRUE(file::writeAtomically(www / "zerith/dravon", *container, std::filesystem::perms(0644)));
+    ASSERT_TRUE(file::writeAtomically(www / "zerith/dravon", signedStorebag(bag), std::filesystem::perms(0644)));
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(storebagURL));
   }
 
@@ -179,14 +101,10 @@ class E2eTest : public ::testing::Test {
   // The same for a test server: it answers "/zerith/dravon" with the signed
   // `bag` (cacheable for ten minutes), and the daemon asks it for storebags.
   void serveSignedStorebag(HttpsTestServer& server, const Value& bag) {
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
-    installPublicKey(keys->publicKeyDER);
-    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
+    const Data container = signedStorebag(bag);
     server.on("/zerith/dravon", {.status = 200,
                                  .headers = {{"Cache-Control", "max-age=600"}},
-                                 .body = std::string(container->begin(), container->end())});
+                                 .body = std::string(container.begin(), container.end())});
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
   }
 

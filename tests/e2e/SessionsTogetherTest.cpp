@@ -352,7 +352,7 @@ TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWo
   EXPECT_NE(shared.error->description.find("dictionary"), std::string::npos) << shared.error->description;
 
   // A raw client asks for a flush and vanishes before the answer.
-  auto raw = RawClient::connect();
+  auto raw = RawFrameSocket::connect();
   ASSERT_TRUE(raw);
   ASSERT_TRUE(raw->call(ipc::wire::kSetSessionInfo, 1,
                         Dictionary{{"sessionInfo", info(63)}, {"hasAggregationBlock", Value(false)}}));
