@@ -4,7 +4,7 @@
 
 #include <fmt/format.h>
 
-#include "daemon/SenderCodes.h"
+#include "config/SenderCodes.h"
 
 namespace zerith::dashboard {
 

@@ -15,7 +15,7 @@
 #include "config/Conversions.h"
 #include "config/DeviceInfo.h"
 #include "config/Identifiers.h"
-#include "daemon/SenderCodes.h"
+#include "config/SenderCodes.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
 #include "platform/Log.h"

@@ -11,7 +11,7 @@ if(TARGET zerith_testsupport)
             ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/PeerPipeline.cpp
             ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/ProcStats.cpp
             ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/ZerithdPipeline.cpp
-    DEPS zerith "$<LINK_GROUP:RESCAN,zerith_config,zerith_transport,zerith_backends>" zerith_ipc zerith_platform
+    DEPS zerith_backends zerith_config zerith_transport zerith_ipc zerith zerith_platform
          zerith_testsupport zerith_collector CLI11::CLI11)
   add_dependencies(e2e_pipeline_bench zerithd)
   target_compile_definitions(e2e_pipeline_bench PRIVATE ZERITHD_BUILT_BINARY="$<TARGET_FILE:zerithd>")

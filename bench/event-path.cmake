@@ -4,6 +4,6 @@
 if(TARGET zerith_testsupport)
   zerith_bench(NAME event_path_bench
     SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/EventPathBench.cpp ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/BenchEvent.cpp
-    DEPS zerith "$<LINK_GROUP:RESCAN,zerith_config,zerith_transport,zerith_backends>" zerith_ipc zerith_platform
+    DEPS zerith_backends zerith_config zerith_transport zerith_ipc zerith zerith_platform
          zerith_testsupport)
 endif()

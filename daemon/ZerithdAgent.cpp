@@ -8,8 +8,8 @@
 #include <fmt/format.h>
 
 #include "config/Conversions.h"
+#include "config/SenderCodes.h"
 #include "config/StorebagVerify.h"
-#include "daemon/SenderCodes.h"
 #include "ipc/ClientSessionExporter.h"
 #include "ipc/Connection.h"
 #include "platform/Log.h"

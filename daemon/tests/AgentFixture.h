@@ -17,6 +17,7 @@
 #include "platform/Log.h"
 #include "session/ZerithdSession.h"
 #include "session/tests/FakeConnection.h"
+#include "tests/support/Command.h"
 #include "tests/support/TempRoot.h"
 #include "zerith/ZerithConstants.h"
 
@@ -91,6 +92,16 @@ class AgentFixture : public ::testing::Test {
       n += (line.level == level && line.text == text) ? 1 : 0;
     }
     return n;
+  }
+
+  // Every retired message-log file under the root, one after the other.
+  std::string messageLog() const {
+    std::string text;
+    std::error_code missing;
+    for (const auto& entry : std::filesystem::directory_iterator(root / "/var/log/faultkeep/retired", missing)) {
+      text += readText(entry.path());
+    }
+    return text;
   }
 
   TempRoot root;

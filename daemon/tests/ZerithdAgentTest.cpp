@@ -6,7 +6,7 @@
 
 #include <cstring>
 
-#include "daemon/SenderCodes.h"
+#include "config/SenderCodes.h"
 #include "daemon/tests/AgentFixture.h"
 #include "ipc/Listener.h"
 
@@ -94,31 +94,6 @@ TEST_F(ZerithdAgentTest, InterruptionNeverEndsTheSession) {
 }
 
 // --- Keep-alive ----------------------------------------------------------------
-
-TEST_F(ZerithdAgentTest, TransactionEndsOnceAfterBothTransportsHaveClosed) {
-  auto first = FakeConnection::entitled();
-  auto second = FakeConnection::entitled();
-  ASSERT_TRUE(accept(first));
-  ASSERT_TRUE(accept(second));
-
-  first->invalidate();
-  EXPECT_EQ(agent->sessionCount(), 1u);
-  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ref count is 1"));
-  EXPECT_TRUE(transaction->isOpen());
-  EXPECT_EQ(transaction->endCount(), 0u);
-
-  second->invalidate();
-  EXPECT_EQ(agent->sessionCount(), 0u);
-  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
-  EXPECT_TRUE(logs.has(Level::Default, "releaseVeskTransaction: Vesk transaction ref count is 0"));
-  EXPECT_EQ(agent->veskTransactionReference(), 0);
-  EXPECT_FALSE(transaction->isOpen());
-  EXPECT_EQ(transaction->beginCount(), 1u);
-  EXPECT_EQ(transaction->endCount(), 1u);
-  EXPECT_EQ(logs.count("releaseVeskTransaction: Vesk transaction ended"), 1u);
-  EXPECT_TRUE(logs.contains("listener: Vesk connection to <ZerithdSession: "));
-  EXPECT_EQ(logs.count("invalidateReportingSession: ZerithdSession <ZerithdSession: "), 2u);
-}
 
 TEST_F(ZerithdAgentTest, SessionArrivingBeforeThePreviousTransportClosedBeginsASecondTransaction) {
   auto a = newSession();

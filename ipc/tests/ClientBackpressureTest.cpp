@@ -36,10 +36,9 @@ Data eventArgsPad() { return Data(kPad, 0x65); }
 struct ClientEnd {
   std::filesystem::path folder;
   file::UniqueFd listening;
-  file::UniqueFd raw;
+  std::optional<RawFrameSocket> raw;
   std::shared_ptr<SocketConnection> connection;
   Counter invalidated;
-  FrameDecoder decoder{64u << 20};
 
   ClientEnd() {
     char folderTemplate[] = "/tmp/zerith-ipc-XXXXXX";
@@ -56,8 +55,9 @@ struct ClientEnd {
     Error error;
     connection = SocketConnection::connect(path, &error);
     EXPECT_TRUE(connection) << error.description;
-    raw.reset(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
-    EXPECT_TRUE(raw);
+    file::UniqueFd accepted(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    EXPECT_TRUE(accepted);
+    raw.emplace(std::move(accepted), 64u << 20);
     if (connection) {
       connection->setInvalidationHandler([this] { invalidated.hit(); });
       connection->resume();
@@ -72,28 +72,7 @@ struct ClientEnd {
     std::filesystem::remove_all(folder, ignored);
   }
 
-  // Reads one frame from the daemon's end; nullopt on EOF or time-out.
-  std::optional<IncomingMessage> readMessage() {
-    for (;;) {
-      plist::Bytes body;
-      std::string why;
-      switch (decoder.next(body, why)) {
-        case FrameDecoder::Status::Frame: return decodeMessage(body, &why);
-        case FrameDecoder::Status::Invalid: ADD_FAILURE() << why; return std::nullopt;
-        case FrameDecoder::Status::NeedMore: break;
-      }
-      pollfd p{raw.get(), POLLIN, 0};
-      if (::poll(&p, 1, static_cast<int>(std::chrono::milliseconds(kWait).count())) <= 0) {
-        return std::nullopt;
-      }
-      std::uint8_t buffer[65536];
-      const ssize_t n = ::recv(raw.get(), buffer, sizeof(buffer), 0);
-      if (n <= 0) {
-        return std::nullopt;
-      }
-      decoder.append(buffer, static_cast<std::size_t>(n));
-    }
-  }
+  std::optional<IncomingMessage> readMessage() { return readIncoming(*raw); }
 };
 
 class ClientBackpressure : public ::testing::Test {
@@ -214,7 +193,7 @@ TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
   EventWriter writer(*end.connection, kHeldBackEvents);
   ASSERT_TRUE(writerHeldBack(capture, end));
   const Data replies = concat({encodeReply(1, Dictionary{}), encodeReply(2, Dictionary{}), encodeReply(3, Dictionary{})});
-  ASSERT_EQ(::send(end.raw.get(), replies.data(), replies.size(), MSG_NOSIGNAL), static_cast<ssize_t>(replies.size()));
+  ASSERT_EQ(::send(end.raw->fd(), replies.data(), replies.size(), MSG_NOSIGNAL), static_cast<ssize_t>(replies.size()));
   EXPECT_TRUE(answered.waitFor(3)) << "the client stopped reading because its own outbox was full";
   EXPECT_FALSE(end.connection->readingPaused());
   end.connection->invalidate();
@@ -236,7 +215,7 @@ TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtO
   if (GetParam()) {
     end.connection->invalidate();
   } else {
-    end.raw.reset();  // the daemon goes away
+    end.raw->close();  // the daemon goes away
   }
   // Every send after the end returns at once; the writer gets through the rest.
   auto done = std::async(std::launch::async, [&] { writer.thread.join(); });

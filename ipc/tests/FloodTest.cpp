@@ -40,7 +40,7 @@ class Flood : public ::testing::Test {
 // pushed back).
 int floodUntilHeldBack(RawPeer& peer, std::size_t pad, int maxCalls,
                        std::chrono::milliseconds quiet = std::chrono::milliseconds(300)) {
-  const int fd = peer.raw.get();
+  const int fd = peer.raw.fd();
   ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) | O_NONBLOCK);
   int calls = 0;
   Data pending;

@@ -17,10 +17,13 @@
 
 #include "ipc/Frame.h"
 #include "ipc/SocketConnection.h"
+#include "tests/support/RawFrameSocket.h"
 
 namespace zerith::ipc::test {
 
 using namespace std::chrono_literals;
+using zerith::test::frameWithBody;
+using zerith::test::RawFrameSocket;
 inline constexpr auto kWait = 10s;
 
 // Counts events and lets a test wait for a number of them.
@@ -84,23 +87,21 @@ class RecordingObject : public ExportedObject {
   std::vector<Message> calls_;
 };
 
+// The next frame a connection wrote to a raw end; nullopt on EOF or time-out.
+inline std::optional<IncomingMessage> readIncoming(RawFrameSocket& raw, std::chrono::milliseconds timeout = kWait) {
+  const auto body = raw.readFrame(timeout);
+  std::string why;
+  return body ? decodeMessage(*body, &why) : std::nullopt;
+}
+
 // One end of a socket pair as a real connection, the other end raw.
 struct RawPeer {
   std::shared_ptr<SocketConnection> connection;
-  file::UniqueFd raw;
+  RawFrameSocket raw;
   std::shared_ptr<RecordingObject> object = std::make_shared<RecordingObject>();
   Counter invalidated;
 
-  RawPeer() {
-    int fds[2];
-    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
-    raw.reset(fds[1]);
-    PeerCredentials peer = *readPeerCredentials(fds[0]);
-    connection = SocketConnection::adopt(file::UniqueFd(fds[0]), peer, Dictionary());
-    connection->setExportedObject(object);
-    connection->setInvalidationHandler([this] { invalidated.hit(); });
-    connection->resume();
-  }
+  RawPeer() : RawPeer(socketPair()) {}
   ~RawPeer() {
     if (connection) {
       connection->invalidate();
@@ -108,62 +109,27 @@ struct RawPeer {
     }
   }
 
-  void write(const Data& bytes, std::size_t chunk = 0) {
-    std::size_t off = 0;
-    while (off < bytes.size()) {
-      const std::size_t n = chunk ? std::min(chunk, bytes.size() - off) : bytes.size() - off;
-      const ssize_t w = ::send(raw.get(), bytes.data() + off, n, MSG_NOSIGNAL);
-      ASSERT_GT(w, 0) << "peer write failed";
-      off += static_cast<std::size_t>(w);
-    }
-  }
-  void closeWrite() { ::shutdown(raw.get(), SHUT_WR); }
+  void write(const Data& bytes, std::size_t chunk = 0) { ASSERT_TRUE(raw.write(bytes, chunk)) << "peer write failed"; }
+  void closeWrite() { ::shutdown(raw.fd(), SHUT_WR); }
 
-  // Reads until one frame has arrived; nullopt on EOF or time-out.
   std::optional<IncomingMessage> readMessage(std::chrono::milliseconds timeout = kWait) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    for (;;) {
-      plist::Bytes body;
-      std::string why;
-      const auto status = decoder.next(body, why);
-      if (status == FrameDecoder::Status::Frame) {
-        return decodeMessage(body, &why);
-      }
-      if (status == FrameDecoder::Status::Invalid) {
-        ADD_FAILURE() << "invalid frame from the connection: " << why;
-        return std::nullopt;
-      }
-      if (!readSome(deadline)) {
-        return std::nullopt;
-      }
-    }
+    return readIncoming(raw, timeout);
   }
   // True when the connection closed its end (EOF) before the time-out.
-  bool seesEof(std::chrono::milliseconds timeout = kWait) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    while (readSome(deadline)) {
-    }
-    return eof;
-  }
-
-  FrameDecoder decoder{64u << 20};
-  bool eof = false;
+  bool seesEof(std::chrono::milliseconds timeout = kWait) { return raw.waitClosed(timeout); }
 
  private:
-  bool readSome(std::chrono::steady_clock::time_point deadline) {
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
-    pollfd p{raw.get(), POLLIN, 0};
-    if (left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
-      return false;
-    }
-    std::uint8_t buffer[65536];
-    const ssize_t n = ::recv(raw.get(), buffer, sizeof(buffer), 0);
-    if (n <= 0) {
-      eof = true;
-      return false;
-    }
-    decoder.append(buffer, static_cast<std::size_t>(n));
-    return true;
+  static std::pair<file::UniqueFd, file::UniqueFd> socketPair() {
+    int fds[2];
+    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+    return {file::UniqueFd(fds[0]), file::UniqueFd(fds[1])};
+  }
+  explicit RawPeer(std::pair<file::UniqueFd, file::UniqueFd> ends) : raw(std::move(ends.second), 64u << 20) {
+    const PeerCredentials peer = *readPeerCredentials(ends.first.get());
+    connection = SocketConnection::adopt(std::move(ends.first), peer, Dictionary());
+    connection->setExportedObject(object);
+    connection->setInvalidationHandler([this] { invalidated.hit(); });
+    connection->resume();
   }
 };
 
@@ -206,14 +172,6 @@ inline CallResult callAndWait(Connection& connection, const std::string& op, Dic
 }
 
 inline Data bytesOfText(const std::string& s) { return Data(s.begin(), s.end()); }
-
-// A frame whose body is exactly `body`.
-inline Data rawFrame(const Data& body) {
-  Data frame{static_cast<std::uint8_t>(body.size() >> 24), static_cast<std::uint8_t>(body.size() >> 16),
-             static_cast<std::uint8_t>(body.size() >> 8), static_cast<std::uint8_t>(body.size())};
-  frame.insert(frame.end(), body.begin(), body.end());
-  return frame;
-}
 
 inline Data concat(std::initializer_list<Data> parts) {
   Data out;

@@ -82,21 +82,21 @@ std::vector<BadInput> badInputs() {
   return {
       {"oversized length", Data{0x00, 0x40, 0x00, 0x01, 'b', 'p'}, "frame of 4194305 bytes exceeds the limit of 4194304"},
       {"zero length", Data{0, 0, 0, 0}, "empty frame"},
-      {"not a property list", rawFrame(bytesOfText("hello, daemon")), "frame body is not a binary property list"},
-      {"XML body", rawFrame(xml), "frame body is not a binary property list"},
-      {"array message", rawFrame(plist::encodeBinary(Value(Array{Value("op")}))), "message is an array, not a dictionary"},
-      {"string op missing", rawFrame(plist::encodeBinary(Value(Dictionary{{"call", 1}}))),
+      {"not a property list", frameWithBody(bytesOfText("hello, daemon")), "frame body is not a binary property list"},
+      {"XML body", frameWithBody(xml), "frame body is not a binary property list"},
+      {"array message", frameWithBody(plist::encodeBinary(Value(Array{Value("op")}))), "message is an array, not a dictionary"},
+      {"string op missing", frameWithBody(plist::encodeBinary(Value(Dictionary{{"call", 1}}))),
        "message has neither \"op\" nor \"reply\""},
-      {"numeric op", rawFrame(plist::encodeBinary(Value(Dictionary{{"op", 5}}))), "message \"op\" is an integer, not a string"},
-      {"negative call number", rawFrame(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"call", -1}}))),
+      {"numeric op", frameWithBody(plist::encodeBinary(Value(Dictionary{{"op", 5}}))), "message \"op\" is an integer, not a string"},
+      {"negative call number", frameWithBody(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"call", -1}}))),
        "message \"call\" is not an unsigned integer"},
-      {"args not a dictionary", rawFrame(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"args", Array{}}}))),
+      {"args not a dictionary", frameWithBody(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"args", Array{}}}))),
        "message \"args\" is an array, not a dictionary"},
-      {"truncated binary list", rawFrame(Data{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x08}), ""},
+      {"truncated binary list", frameWithBody(Data{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x08}), ""},
       // libplist would pass such text on cut short at the bad byte.
-      {"operation not UTF-8", rawFrame(oneEntryBinaryDictionary("op", "se\xffSession:")),
+      {"operation not UTF-8", frameWithBody(oneEntryBinaryDictionary("op", "se\xffSession:")),
        "message holds text that is not valid UTF-8"},
-      {"key not UTF-8 (overlong form)", rawFrame(oneEntryBinaryDictionary("o\xc0\xafp", "x")),
+      {"key not UTF-8 (overlong form)", frameWithBody(oneEntryBinaryDictionary("o\xc0\xafp", "x")),
        "message holds text that is not valid UTF-8"},
   };
 }
@@ -336,7 +336,7 @@ TEST(SocketConnectionCalls, PendingCallsFailWhenThePeerGoesAway) {
     promise->set_value(CallResult{true, std::move(a), std::move(e)});
   });
   ASSERT_TRUE(peer.readMessage());  // the call went out
-  peer.raw.reset();                 // the peer disconnects mid-call
+  peer.raw.close();                 // the peer disconnects mid-call
   ASSERT_EQ(future.wait_for(kWait), std::future_status::ready);
   const auto result = future.get();
   EXPECT_FALSE(result.args);
@@ -450,7 +450,7 @@ TEST(SocketConnectionDelivery, InvalidationHandlerRunsExactlyOnceWhenEofAndInval
       onQueue = onQueue && peer.connection->queue().isCurrent();
       peer.invalidated.hit();
     });
-    std::thread closer([&] { peer.raw.reset(); });
+    std::thread closer([&] { peer.raw.close(); });
     std::vector<std::thread> invalidators;
     for (int i = 0; i < 4; ++i) {
       invalidators.emplace_back([&] { peer.connection->invalidate(); });
@@ -475,7 +475,7 @@ TEST(SocketConnectionDelivery, InterruptionHandlerIsNeverCalled) {
     peer.connection->setInterruptionHandler([&] { interrupted.hit(); });
     peer.write(callFrame("x", 1));
     ASSERT_TRUE(peer.readMessage());
-    peer.raw.reset();
+    peer.raw.close();
     ASSERT_TRUE(peer.invalidated.waitFor(1));
   }
   EXPECT_EQ(interrupted.count(), 0);
@@ -509,7 +509,7 @@ TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHand
       peer.invalidated.hit();
     });
     peer.object.reset();
-    peer.raw.reset();
+    peer.raw.close();
     ASSERT_TRUE(peer.invalidated.waitFor(1));
     peer.connection->queue().sync([] {});
     EXPECT_TRUE(weak.expired()) << "the connection still holds its exported object";
@@ -632,7 +632,7 @@ TEST_P(SocketConnectionGatheredReplies, ManyCallsInOneWriteAreAllAnsweredInOrder
   for (int n = 0; n < kCalls; ++n) {
     const auto reply = peer.readMessage();
     if (!reply || reply->replyTo != static_cast<std::uint64_t>(n + 1)) {
-      peer.raw.reset();  // the writer ends too
+      peer.raw.close();  // the writer ends too
       writer.join();
       FAIL() << "reply " << n << " missing or out of order";
     }

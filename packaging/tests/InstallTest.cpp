@@ -8,17 +8,13 @@
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/inotify.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <cstring>
 
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <map>
@@ -32,6 +28,8 @@
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
+#include "tests/support/Command.h"
+#include "tests/support/RawFrameSocket.h"
 #include "tests/support/TempRoot.h"
 
 namespace zerith::packaging::test {
@@ -39,54 +37,10 @@ namespace {
 
 namespace fs = std::filesystem;
 
-struct Outcome {
-  int status = -1;
-  std::string output;  // standard output and error
-};
+using namespace zerith::test;
 
-std::string quote(const std::string& s) {
-  std::string out = "'";
-  for (const char c : s) {
-    out += c == '\'' ? std::string("'\\''") : std::string(1, c);
-  }
-  return out + "'";
-}
-
-// Runs a command line (bounded by `timeout`) and collects what it prints.
-Outcome run(const std::string& command, int timeoutSeconds = 120) {
-  Outcome r;
-  FILE* pipe = ::popen(("timeout " + std::to_string(timeoutSeconds) + " " + command + " 2>&1").c_str(), "r");
-  if (!pipe) {
-    return r;
-  }
-  char buffer[4096];
-  std::size_t n = 0;
-  while ((n = std::fread(buffer, 1, sizeof(buffer), pipe)) > 0) {
-    r.output.append(buffer, n);
-  }
-  const int status = ::pclose(pipe);
-  r.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-  return r;
-}
-
-bool onPath(const std::string& tool) {
-  const char* path = std::getenv("PATH");
-  std::istringstream dirs(path ? path : "/usr/bin:/bin");
-  std::string dir;
-  while (std::getline(dirs, dir, ':')) {
-    if (!dir.empty() && ::access((fs::path(dir) / tool).c_str(), X_OK) == 0) {
-      return true;
-    }
-  }
-  return false;
-}
-
-std::string readFile(const fs::path& p) {
-  std::ifstream in(p);
-  std::stringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
+// Runs a command line, bounded in time, with its standard error in the output.
+CommandResult run(const std::string& command) { return runCommand(command + " 2>&1"); }
 
 // The values of `key` in a unit file's lines "key=value".
 std::vector<std::string> unitValues(const std::string& unit, const std::string& key) {
@@ -112,8 +66,8 @@ class InstalledTree : public ::testing::Test {
     char pattern[] = "/tmp/zerith-install-XXXXXX";
     ASSERT_NE(::mkdtemp(pattern), nullptr);
     stage_ = new fs::path(pattern);
-    const Outcome install = run(quote(std::string(ZERITH_TREE_SOURCE) + "/scripts/install") + " --no-build --build-dir " +
-                            quote(ZERITH_TREE_BUILD) + " --destdir " + quote(stage_->string()));
+    const CommandResult install = run(shellQuote(std::string(ZERITH_TREE_SOURCE) + "/scripts/install") + " --no-build --build-dir " +
+                            shellQuote(ZERITH_TREE_BUILD) + " --destdir " + shellQuote(stage_->string()));
     ASSERT_EQ(install.status, 0) << install.output;
     installOutput_ = new std::string(install.output);
   }
@@ -130,8 +84,12 @@ class InstalledTree : public ::testing::Test {
   void SetUp() override { ASSERT_NE(stage_, nullptr); }
 
   static fs::path at(const std::string& absolute) { return *stage_ / fs::path(absolute).relative_path(); }
-  static std::string service() { return readFile(at("/usr/lib/systemd/system/zerithd.service")); }
-  static std::string socket() { return readFile(at("/usr/lib/systemd/system/zerithd.socket")); }
+  static std::string service() { return readText(at("/usr/lib/systemd/system/zerithd.service")); }
+  static std::string socket() { return readText(at("/usr/lib/systemd/system/zerithd.socket")); }
+  // Where the install put the framework (a multiarch folder or plain lib).
+  static fs::path libraryDir() {
+    return fs::exists(at("/usr/lib/x86_64-linux-gnu/libzerith.so.8")) ? at("/usr/lib/x86_64-linux-gnu") : at("/usr/lib");
+  }
 
   static fs::path* stage_;
   static std::string* installOutput_;
@@ -150,7 +108,7 @@ TEST_F(InstalledTree, HoldsTheProgramsTheFrameworkTheUnitsAndTheSnippetsInTheirF
   for (const char* tool : {"zerith", "zerith-defaults", "zerith-storebag"}) {
     EXPECT_TRUE(executable(at(std::string("/usr/bin/") + tool))) << tool;
   }
-  EXPECT_TRUE(fs::exists(at("/usr/lib/libzerith.so.8")) || fs::exists(at("/usr/lib/x86_64-linux-gnu/libzerith.so.8")));
+  EXPECT_TRUE(fs::exists(libraryDir() / "libzerith.so.8"));
   EXPECT_TRUE(fs::exists(at("/usr/include/zerith/Zerith.h")));
   EXPECT_TRUE(fs::exists(at("/usr/share/zerith/Info.plist")));
   EXPECT_TRUE(fs::is_directory(at("/etc/zerithd/entitlements.d")));
@@ -159,7 +117,7 @@ TEST_F(InstalledTree, HoldsTheProgramsTheFrameworkTheUnitsAndTheSnippetsInTheirF
   EXPECT_TRUE(fs::exists(at("/usr/lib/sysusers.d/zerithd.conf")));
   EXPECT_TRUE(fs::exists(at("/usr/lib/tmpfiles.d/zerithd.conf")));
   // Nothing of the build folder leaks into the installed programs.
-  const Outcome dynamic = run("readelf -d " + quote(at("/usr/sbin/zerithd").string()));
+  const CommandResult dynamic = run("readelf -d " + shellQuote(at("/usr/sbin/zerithd").string()));
   EXPECT_EQ(dynamic.output.find(ZERITH_TREE_BUILD), std::string::npos) << dynamic.output;
 }
 
@@ -213,8 +171,8 @@ TEST_F(InstalledTree, TheUnitsPassSystemdAnalyzeVerify) {
   svc.replace(at, installed.size(), "ExecStart=" + InstalledTree::at("/usr/sbin/zerithd").string());
   std::ofstream(units / "zerithd.service") << svc;
   fs::copy_file(InstalledTree::at("/usr/lib/systemd/system/zerithd.socket"), units / "zerithd.socket");
-  const Outcome verify = run("systemd-analyze verify --man=no " + quote((units / "zerithd.socket").string()) + " " +
-                         quote((units / "zerithd.service").string()));
+  const CommandResult verify = run("systemd-analyze verify --man=no " + shellQuote((units / "zerithd.socket").string()) + " " +
+                         shellQuote((units / "zerithd.service").string()));
   EXPECT_EQ(verify.status, 0) << verify.output;
   EXPECT_EQ(verify.output, "") << "systemd-analyze warned";
 }
@@ -224,10 +182,10 @@ TEST_F(InstalledTree, SysusersAndTmpfilesMakeTheUserTheGroupAndItsFolders) {
     GTEST_SKIP() << "systemd-sysusers or systemd-tmpfiles is not installed here; the snippets were not applied";
   }
   // Applied to the staged tree as its root, never to this machine.
-  const std::string root = quote(stage_->string());
-  const Outcome users = run("systemd-sysusers --root=" + root + " " + quote(at("/usr/lib/sysusers.d/zerithd.conf").string()));
+  const std::string root = shellQuote(stage_->string());
+  const CommandResult users = run("systemd-sysusers --root=" + root + " " + shellQuote(at("/usr/lib/sysusers.d/zerithd.conf").string()));
   ASSERT_EQ(users.status, 0) << users.output;
-  const std::string passwd = readFile(at("/etc/passwd"));
+  const std::string passwd = readText(at("/etc/passwd"));
   std::smatch m;
   ASSERT_TRUE(std::regex_search(passwd, m, std::regex("^zerithd:x:([0-9]+):([0-9]+):[^:]*:/var/lib/zerithd:([^\n]*)$",
                                                       std::regex::multiline)))
@@ -235,11 +193,11 @@ TEST_F(InstalledTree, SysusersAndTmpfilesMakeTheUserTheGroupAndItsFolders) {
   const uid_t uid = static_cast<uid_t>(std::stoul(m[1]));
   EXPECT_NE(uid, 0u);
   EXPECT_NE(m[3].str().find("nologin"), std::string::npos) << "the service user has a login shell";
-  const std::string group = readFile(at("/etc/group"));
+  const std::string group = readText(at("/etc/group"));
   EXPECT_TRUE(std::regex_search(group, std::regex("^zerith:x:[0-9]+:", std::regex::multiline))) << group;
 
-  const Outcome folders = run("systemd-tmpfiles --create --root=" + root + " " +
-                          quote(at("/usr/lib/tmpfiles.d/zerithd.conf").string()));
+  const CommandResult folders = run("systemd-tmpfiles --create --root=" + root + " " +
+                          shellQuote(at("/usr/lib/tmpfiles.d/zerithd.conf").string()));
   ASSERT_EQ(folders.status, 0) << folders.output;
   paths::setRoot("/");
   struct Expected {
@@ -266,10 +224,8 @@ TEST_F(InstalledTree, SysusersAndTmpfilesMakeTheUserTheGroupAndItsFolders) {
 }
 
 TEST_F(InstalledTree, TheInstalledDaemonRunsWithTheInstalledFramework) {
-  const std::string lib = fs::exists(at("/usr/lib/x86_64-linux-gnu/libzerith.so.8"))
-                              ? at("/usr/lib/x86_64-linux-gnu").string()
-                              : at("/usr/lib").string();
-  const Outcome help = run("env LD_LIBRARY_PATH=" + quote(lib) + " " + quote(at("/usr/sbin/zerithd").string()) + " --help");
+  const std::string lib = libraryDir().string();
+  const CommandResult help = run("env LD_LIBRARY_PATH=" + shellQuote(lib) + " " + shellQuote(at("/usr/sbin/zerithd").string()) + " --help");
   EXPECT_EQ(help.status, 0) << help.output;
   EXPECT_NE(help.output.find("--stop-timeout"), std::string::npos) << help.output;
 }
@@ -277,42 +233,17 @@ TEST_F(InstalledTree, TheInstalledDaemonRunsWithTheInstalledFramework) {
 // Waits until the file that `inotify` watches holds `text`.
 bool waitForText(int inotify, const fs::path& file, const std::string& text, std::chrono::milliseconds timeout) {
   const auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (readFile(file).find(text) == std::string::npos) {
+  while (readText(file).find(text) == std::string::npos) {
     const auto left =
         std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
     pollfd p{inotify, POLLIN, 0};
     if (left <= 0 || ::poll(&p, 1, static_cast<int>(left)) <= 0) {
-      return readFile(file).find(text) != std::string::npos;
+      return readText(file).find(text) != std::string::npos;
     }
     char events[4096];
     (void)!::read(inotify, events, sizeof(events));
   }
   return true;
-}
-
-// The first frame the socket delivers, or nullopt on time-out or close.
-std::optional<Value> readMessage(int fd, std::chrono::milliseconds timeout) {
-  ipc::FrameDecoder decoder;
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  std::uint8_t buffer[4096];
-  for (;;) {
-    plist::Bytes body;
-    std::string why;
-    if (decoder.next(body, why) == ipc::FrameDecoder::Status::Frame) {
-      return plist::decodeBinary(body);
-    }
-    const auto left =
-        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
-    pollfd p{fd, POLLIN, 0};
-    if (left <= 0 || ::poll(&p, 1, static_cast<int>(left)) <= 0) {
-      return std::nullopt;
-    }
-    const ssize_t n = ::recv(fd, buffer, sizeof(buffer), 0);
-    if (n <= 0) {
-      return std::nullopt;
-    }
-    decoder.append(buffer, static_cast<std::size_t>(n));
-  }
 }
 
 TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPassesIn) {
@@ -321,7 +252,7 @@ TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPasses
   if (!onPath("systemd-socket-activate")) {
     GTEST_SKIP() << "systemd-socket-activate is not installed here; socket activation was not tried";
   }
-  zerith::test::TempRoot root;
+  TempRoot root;
   const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
                                 {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", Value(true)}})}});
   root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
@@ -335,9 +266,7 @@ TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPasses
   ASSERT_TRUE(inotify);
   ASSERT_GE(::inotify_add_watch(inotify.get(), log.c_str(), IN_MODIFY), 0);
 
-  const std::string lib = fs::exists(at("/usr/lib/x86_64-linux-gnu/libzerith.so.8"))
-                              ? at("/usr/lib/x86_64-linux-gnu").string()
-                              : at("/usr/lib").string();
+  const std::string lib = libraryDir().string();
   const std::vector<std::string> argv{"systemd-socket-activate", "-l", socketPath.string(),
                                       "-E", "LD_LIBRARY_PATH=" + lib,
                                       at("/usr/sbin/zerithd").string(), "--root", root.path().string(),
@@ -370,19 +299,15 @@ TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPasses
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   };
   ASSERT_TRUE(waitForText(inotify.get(), log, "Listening on " + socketPath.string(), std::chrono::seconds(10)))
-      << (stopDaemon(), readFile(log));
+      << (stopDaemon(), readText(log));
 
-  file::UniqueFd client(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, socketPath.c_str(), sizeof(address.sun_path) - 1);
-  ASSERT_EQ(::connect(client.get(), reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
-  const Data call = ipc::encodeCall("fetchDisplayURL:", 1, {});
-  ASSERT_EQ(::send(client.get(), call.data(), call.size(), MSG_NOSIGNAL), static_cast<ssize_t>(call.size()));
-  const auto reply = readMessage(client.get(), std::chrono::seconds(15));
+  auto client = RawFrameSocket::connect();
+  ASSERT_TRUE(client.has_value()) << (stopDaemon(), readText(log));
+  ASSERT_TRUE(client->call("fetchDisplayURL:", 1));
+  const auto reply = client->read(std::chrono::seconds(15));
   client.reset();
   const int status = stopDaemon();
-  const std::string output = readFile(log);
+  const std::string output = readText(log);
   ASSERT_TRUE(reply.has_value()) << output;
   EXPECT_EQ((*reply)["reply"], Value(1));
   EXPECT_EQ((*reply)["args"]["url"], Value("URL not available"));
@@ -393,11 +318,11 @@ TEST_F(InstalledTree, TheInstalledDaemonServesOnTheSocketTheServiceManagerPasses
 }
 
 TEST(InstallScript, RefusesAnUnknownOptionAndAnInstallWithoutRootOrStagingFolder) {
-  const std::string script = quote(std::string(ZERITH_TREE_SOURCE) + "/scripts/install");
-  const Outcome unknown = run(script + " --frobnicate");
+  const std::string script = shellQuote(std::string(ZERITH_TREE_SOURCE) + "/scripts/install");
+  const CommandResult unknown = run(script + " --frobnicate");
   EXPECT_EQ(unknown.status, 2);
   EXPECT_NE(unknown.output.find("unknown option --frobnicate"), std::string::npos) << unknown.output;
-  const Outcome missing = run(script + " --no-build --build-dir /nonexistent --destdir /tmp/zerith-never-made");
+  const CommandResult missing = run(script + " --no-build --build-dir /nonexistent --destdir /tmp/zerith-never-made");
   EXPECT_EQ(missing.status, 1);
   EXPECT_NE(missing.output.find("/nonexistent/daemon/zerithd is missing"), std::string::npos) << missing.output;
   EXPECT_FALSE(fs::exists("/tmp/zerith-never-made"));

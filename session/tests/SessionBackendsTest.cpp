@@ -6,8 +6,6 @@
 
 #include <gtest/gtest.h>
 
-#include <filesystem>
-#include <fstream>
 #include <thread>
 
 #include "daemon/tests/AgentFixture.h"
@@ -56,19 +54,6 @@ class SessionBackendsTest : public AgentFixture {
     c.session->sendMessageWithDictionary(message, [&](Value v) { reply = v; });
     EXPECT_TRUE(reply.has_value());
     return reply.value_or(Value());
-  }
-
-  std::string messageLog() const {
-    std::string text;
-    const auto dir = root / "/var/log/faultkeep/retired";
-    if (!std::filesystem::exists(dir)) {
-      return text;
-    }
-    for (const auto& entry : std::filesystem::directory_iterator(dir)) {
-      std::ifstream in(entry.path());
-      text.append(std::istreambuf_iterator<char>(in), {});
-    }
-    return text;
   }
 };
 

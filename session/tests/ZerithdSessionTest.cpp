@@ -3,8 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <filesystem>
-#include <fstream>
 
 #include "daemon/tests/AgentFixture.h"
 #include "platform/Crypto.h"
@@ -230,14 +228,9 @@ TEST_F(ZerithdSessionTest, UploadsAreRefusedWithoutAnUploadBackend) {
   EXPECT_EQ(uploaded, false);
   EXPECT_TRUE(logs.has(Level::Debug, "uploadFileAtPath: Uploading file for session 5"));
   EXPECT_TRUE(logs.has(Level::Error, "uploadFileWithURL: File upload failed for /var/tmp/report.log"));
-  std::string messageLog;
-  for (const auto& entry : std::filesystem::directory_iterator(root / "/var/log/faultkeep/retired")) {
-    std::ifstream in(entry.path());
-    messageLog.append(std::istreambuf_iterator<char>(in), {});
-  }
-  EXPECT_NE(messageLog.find(") [uploadFileWithURL] Upload failed for file file:///var/tmp/report.log\n"),
-            std::string::npos)
-      << messageLog;
+  const std::string retired = messageLog();
+  EXPECT_NE(retired.find(") [uploadFileWithURL] Upload failed for file file:///var/tmp/report.log\n"), std::string::npos)
+      << retired;
 
   std::optional<std::pair<bool, std::optional<Error>>> logData;
   s.session->uploadLogData(Value(Array{Value("line")}), [&](bool ok, std::optional<Error> e) { logData = {ok, e}; });

@@ -157,19 +157,6 @@ TEST_F(ClientSessionTest, SessionsArrivingWhileAnEndedTransportClosesKeepThePair
   RecordProperty("second_transactions", secondTransactions);
 }
 
-TEST_F(ClientSessionTest, RefusedClientSeesItsCallsFailAndItsConnectionEnd) {
-  grant(Value(false));
-  auto client = connect();
-  ASSERT_TRUE(client);
-  std::promise<void> invalidated;
-  client->setInvalidationHandler([&] { invalidated.set_value(); });
-  const auto reply = client->fetchDisplayURL(10s);
-  EXPECT_FALSE(reply);
-  EXPECT_EQ(invalidated.get_future().wait_for(10s), std::future_status::ready);
-  EXPECT_TRUE(daemon->waitFor("it lacks the entitlement com.velmar.private.zerithd"));
-  EXPECT_EQ(daemon->count("createReportingSessionWithDelegate"), 0u);
-}
-
 TEST_F(ClientSessionTest, AggregatingRootEndsItsChildsAggregationOverTheChildsConnection) {
   // What the message handler touches outlives the clients: a message may
   // arrive while they are being torn down.

@@ -13,20 +13,11 @@ using log::Level;
 constexpr const char* kDisplayURL = "fetchDisplayURL:";
 
 // A session that answers proves the daemon is alive and serving.
-void expectServing(RawClient& client, std::uint64_t number) {
+void expectServing(RawFrameSocket& client, std::uint64_t number) {
   ASSERT_TRUE(client.call(kDisplayURL, number));
   const auto reply = client.replyTo(number);
   ASSERT_TRUE(reply.has_value());
   EXPECT_EQ((*reply)["args"]["url"], Value("URL not available"));
-}
-
-Data frameWithBody(const Data& body) {
-  Data frame(4 + body.size());
-  for (int i = 0; i < 4; ++i) {
-    frame[static_cast<std::size_t>(i)] = static_cast<std::uint8_t>(body.size() >> (24 - 8 * i));
-  }
-  std::copy(body.begin(), body.end(), frame.begin() + 4);
-  return frame;
 }
 
 // --- Admission ----------------------------------------------------------------
@@ -37,7 +28,7 @@ TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
     if (!daemon) {
       startDaemon();
     }
-    auto client = RawClient::connect();
+    auto client = RawFrameSocket::connect();
     ASSERT_TRUE(client.has_value());
     client->call(kDisplayURL, 1);  // may already find the socket closed
     EXPECT_TRUE(client->waitClosed());
@@ -47,7 +38,7 @@ TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
   EXPECT_EQ(daemon->count("createReportingSessionWithDelegate"), 0u);
 
   grant(Value(true));
-  auto client = RawClient::connect();
+  auto client = RawFrameSocket::connect();
   ASSERT_TRUE(client.has_value());
   expectServing(*client, 1);
   EXPECT_TRUE(daemon->waitFor("as it has proper entitlement, 0(0) connections."));
@@ -58,7 +49,7 @@ TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
 TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnection) {
   grant(Value(true));
   startDaemon();
-  auto bystander = RawClient::connect();
+  auto bystander = RawFrameSocket::connect();
   ASSERT_TRUE(bystander.has_value());
   expectServing(*bystander, 1);
 
@@ -79,7 +70,7 @@ TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnection) {
   std::uint64_t n = 2;
   for (const auto& [name, bytes] : attacks) {
     SCOPED_TRACE(name);
-    auto attacker = RawClient::connect();
+    auto attacker = RawFrameSocket::connect();
     ASSERT_TRUE(attacker.has_value());
     ASSERT_TRUE(attacker->write(bytes));
     EXPECT_TRUE(attacker->waitClosed());
@@ -91,7 +82,7 @@ TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnection) {
 TEST_F(E2eTest, WrongCallsAreAnsweredWithErrorsAndTheConnectionGoesOn) {
   grant(Value(true));
   startDaemon();
-  auto client = RawClient::connect();
+  auto client = RawFrameSocket::connect();
   ASSERT_TRUE(client.has_value());
 
   ASSERT_TRUE(client->call("noSuchOperation:", 1));
@@ -114,7 +105,7 @@ TEST_F(E2eTest, ClientVanishingMidCallEndsItsSessionAndTheTransaction) {
   grant(Value(true));
   startDaemon();
   {
-    auto client = RawClient::connect();
+    auto client = RawFrameSocket::connect();
     ASSERT_TRUE(client.has_value());
     ASSERT_TRUE(client->call("setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock:", 1,
                              Dictionary{{"sessionInfo", Value(Dictionary{{"sessionID", Value(77)}})}}));
@@ -127,7 +118,7 @@ TEST_F(E2eTest, ClientVanishingMidCallEndsItsSessionAndTheTransaction) {
   ASSERT_TRUE(daemon->waitForExact(Level::Default, kTransactionEnded));
   EXPECT_TRUE(daemon->has(Level::Default, "releaseVeskTransaction: Vesk transaction ref count is 0"));
 
-  auto next = RawClient::connect();
+  auto next = RawFrameSocket::connect();
   ASSERT_TRUE(next.has_value());
   expectServing(*next, 1);
 }
@@ -148,7 +139,7 @@ TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
 TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
   grant(Value(true));
   startDaemon();
-  auto client = RawClient::connect();
+  auto client = RawFrameSocket::connect();
   ASSERT_TRUE(client.has_value());
   expectServing(*client, 1);
 
@@ -158,7 +149,7 @@ TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
   expectServing(*client, 2);  // the open session goes on while draining
 
   // A newcomer is not served.
-  auto late = RawClient::connect();
+  auto late = RawFrameSocket::connect();
   if (late) {
     late->call(kDisplayURL, 1);
   }
@@ -177,7 +168,7 @@ TEST_F(E2eTest, StopTimeOutEndsTheDrainOfASessionThatStaysOpen) {
   DaemonProcess::Options options;
   options.arguments = {"--stop-timeout", "0.5"};
   startDaemon(options);
-  auto client = RawClient::connect();
+  auto client = RawFrameSocket::connect();
   ASSERT_TRUE(client.has_value());
   expectServing(*client, 1);
   EXPECT_EQ(daemon->stop(10s), 0) << daemon->output();

@@ -2,17 +2,13 @@
 
 // Scenario helpers of the end-to-end tests: a temporary root with an
 // entitlements policy for the test's own user, the real zerithd started in
-// it, and raw socket clients that speak the frame protocol byte by byte.
+// it; raw socket clients are tests/support/RawFrameSocket.h.
 
 #include <gtest/gtest.h>
 
-#include <poll.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <cstring>
 #include <filesystem>
 #include <memory>
 #include <optional>
@@ -26,6 +22,7 @@
 #include "platform/PropertyList.h"
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/HttpsTestServer.h"
+#include "tests/support/RawFrameSocket.h"
 #include "tests/support/TempRoot.h"
 #include "zerith/Zerith.h"
 
@@ -140,17 +137,25 @@ class E2eTest : public ::testing::Test {
     root.write("/usr/share/zerith/publicKey.der", std::string(der.begin(), der.end()));
   }
 
-  // Signs `bag` with a fresh key pair whose public half the daemon trusts,
-  // writes it where a collector serving `www` hands out the storebag
-  // "dravon", and points the daemon's storebag URL at `storebagURL`.
-  void publishSignedStorebag(const Value& bag, const std::filesystem::path& www, const std::string& storebagURL) {
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
+  // `bag` in a signed container; the key pair is made once per test process
+  // and its public half installed where this root's daemon reads it.
+  Data signedStorebag(const Value& bag) {
+    static const std::optional<StorebagKeyPair> keys = generateStorebagKeyPair(2048);
+    EXPECT_TRUE(keys.has_value());
+    if (!keys) {
+      return {};
+    }
     installPublicKey(keys->publicKeyDER);
     const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
+    EXPECT_TRUE(container.has_value());
+    return container.value_or(Data());
+  }
+
+  // Signs `bag` (signedStorebag), writes it where a collector serving `www` hands out the storebag
+  // "dravon", and points the daemon's storebag URL at `storebagURL`.
+  void publishSignedStorebag(const Value& bag, const std::filesystem::path& www, const std::string& storebagURL) {
     std::filesystem::create_directories(www / "zerith");
-    ASSERT_TRUE(file::writeAtomically(www / "zerith/dravon", *container, std::filesystem::perms(0644)));
+    ASSERT_TRUE(file::writeAtomically(www / "zerith/dravon", signedStorebag(bag), std::filesystem::perms(0644)));
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(storebagURL));
   }
 
@@ -180,14 +185,10 @@ class E2eTest : public ::testing::Test {
   // The same for a test server: it answers "/zerith/dravon" with the signed
   // `bag` (cacheable for ten minutes), and the daemon asks it for storebags.
   void serveSignedStorebag(HttpsTestServer& server, const Value& bag) {
-    const auto keys = generateStorebagKeyPair(2048);
-    ASSERT_TRUE(keys.has_value());
-    installPublicKey(keys->publicKeyDER);
-    const auto container = signStorebagContainer(keys->privateKeyPEM, plist::encodeBinary(bag));
-    ASSERT_TRUE(container.has_value());
+    const Data container = signedStorebag(bag);
     server.on("/zerith/dravon", {.status = 200,
                                  .headers = {{"Cache-Control", "max-age=600"}},
-                                 .body = std::string(container->begin(), container->end())});
+                                 .body = std::string(container.begin(), container.end())});
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
   }
 

@@ -47,7 +47,7 @@ TEST_F(E2eTest, AClientThatFloodsCallsWithoutReadingIsHeldBackAndAnsweredInFullL
   ASSERT_LT(written, kMax) << "the daemon never stopped taking calls";
 
   // Another client is served while the flooder sits there.
-  auto other = RawClient::connect();
+  auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other.has_value());
   ASSERT_TRUE(other->call(kDisplayURL, 1));
   const auto reply = other->replyTo(1);
@@ -56,23 +56,14 @@ TEST_F(E2eTest, AClientThatFloodsCallsWithoutReadingIsHeldBackAndAnsweredInFullL
 
   // Reading lets the daemon read on: every call written is answered, in order.
   ::fcntl(flooder.get(), F_SETFL, ::fcntl(flooder.get(), F_GETFL) & ~O_NONBLOCK);
-  ipc::FrameDecoder decoder;
+  RawFrameSocket reader(std::move(flooder));
   std::uint64_t answered = 0;
   const auto deadline = std::chrono::steady_clock::now() + 60s;
-  std::uint8_t buffer[65536];
   while (answered < written && std::chrono::steady_clock::now() < deadline) {
-    pollfd p{flooder.get(), POLLIN, 0};
-    ASSERT_GT(::poll(&p, 1, 10000), 0) << "replies stopped after " << answered << " of " << written;
-    const ssize_t n = ::recv(flooder.get(), buffer, sizeof(buffer), 0);
-    ASSERT_GT(n, 0) << "the daemon closed the flooder after " << answered << " replies";
-    decoder.append(buffer, static_cast<std::size_t>(n));
-    plist::Bytes body;
-    std::string why;
-    while (decoder.next(body, why) == ipc::FrameDecoder::Status::Frame) {
-      const auto message = plist::decodeBinary(body);
-      ASSERT_TRUE(message.has_value());
-      ASSERT_EQ((*message)["reply"], Value(static_cast<long long>(++answered)));
-    }
+    const auto message = reader.read();
+    ASSERT_TRUE(message.has_value()) << "replies stopped after " << answered << " of " << written
+                                     << (reader.closed() ? " (closed)" : "");
+    ASSERT_EQ((*message)["reply"], Value(static_cast<long long>(++answered)));
   }
   EXPECT_EQ(answered, written);
   EXPECT_EQ(daemon->count("closing connection: peer does not read"), 0u);

@@ -7,7 +7,6 @@
 #include <condition_variable>
 #include <filesystem>
 #include <fstream>
-#include <future>
 #include <regex>
 #include <sstream>
 #include <thread>
@@ -251,85 +250,6 @@ TEST_F(SessionsTogetherTest, GapsTokenChangesAndParentsLeavingFirstLeaveTheOther
   EXPECT_EQ(adaptorLinesOf(33, 1).size(), 1u);
 }
 
-TEST_F(SessionsTogetherTest, FlushesFromTwoClientsAtOnceEachCompleteOnce) {
-  auto a = connect();
-  auto b = connect();
-  auto unstarted = connect();
-  ASSERT_TRUE(a && b && unstarted);
-  start(*a, info(11));
-  start(*b, info(12));
-  ASSERT_TRUE(unstarted->setSessionInfo(info(13), Value(), Value(), false, 10s));
-  std::vector<std::promise<std::pair<Value, std::optional<Error>>>> done(3);
-  std::atomic<int> calls{0};
-  int i = 0;
-  for (auto* c : {a.get(), b.get(), unstarted.get()}) {
-    c->flushMessagesWithCompletion([&, i](Value v, std::optional<Error> e) {
-      ++calls;
-      done[static_cast<std::size_t>(i)].set_value({v, e});
-    });
-    ++i;
-  }
-  for (std::size_t k = 0; k < 2; ++k) {
-    auto f = done[k].get_future();
-    ASSERT_EQ(f.wait_for(10s), std::future_status::ready);
-    const auto [text, error] = f.get();
-    EXPECT_TRUE(text.isNil());
-    EXPECT_FALSE(error.has_value());  // both backends' flushes joined without an error
-  }
-  auto f = done[2].get_future();
-  ASSERT_EQ(f.wait_for(10s), std::future_status::ready);
-  EXPECT_EQ(f.get().second, (Error{kZerithErrorDomain, -1, "No backends available to send message"}));
-  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "internalFlushMessagesWithCompletion: kovu", 2));
-  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "internalFlushMessagesWithCompletion: pellamlog", 2));
-  EXPECT_EQ(calls, 3);
-}
-
-TEST_F(SessionsTogetherTest, OneShotMessageFromAProcessWithoutASession) {
-  auto client = connect();
-  ASSERT_TRUE(client);
-  const auto sent =
-      client->sendMessageWithSessionInfo(info(21), Value(), 40, 2, Value(Dictionary{{"once", Value(true)}}), 20s);
-  ASSERT_TRUE(sent) << sent.error->description;
-  EXPECT_EQ(sent["result"], Value("finished"));
-  const auto lines = adaptorLinesOf(40, 2);
-  ASSERT_EQ(lines.size(), 1u);
-  // The payload itself, not wrapped as ClientData.
-  EXPECT_EQ(lines[0]["dict"], nlohmann::json::parse(R"({"once":true})"));
-  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "sendMessageWithSessionInfo: Sending single message with sessionID 21"));
-
-  const auto refused = client->sendMessageWithSessionInfo(Value(Dictionary{{kZerithSessionInfoClientType, Value(7)}}),
-                                                          Value(), 40, 3, Value(), 10s);
-  ASSERT_TRUE(refused);
-  EXPECT_EQ(refused["result"], Value("Could not retrieve identifiers from sessionInfo"));
-  EXPECT_TRUE(adaptorLinesOf(40, 3).empty());
-}
-
-TEST_F(SessionsTogetherTest, FinalReportCarriesPlausibleHealthFigures) {
-  auto other = connect();
-  auto ending = connect();
-  ASSERT_TRUE(other && ending);
-  start(*other, info(50));
-  start(*ending, info(51));
-  ASSERT_TRUE(ending->finishSession(10s));
-  ending.reset();
-  ASSERT_TRUE(daemon->waitForExact(Level::Debug, "internalSendMessage: Sent internal message (method:0 respCode:1)"));
-  const auto lines = adaptorLinesOf(0, 1);
-  ASSERT_EQ(lines.size(), 1u);
-  const auto& report = lines[0]["dict"]["ClientData"];
-  EXPECT_EQ(report["StorebagVersion"], "6.1.0");
-  EXPECT_EQ(report["GracefulTermination"], true);
-  EXPECT_EQ(report["SessionsCount_YJ"], 2);  // the live one and the ending one
-  EXPECT_EQ(report["BatchSize_YJ"], 0);      // neither backend batches
-  EXPECT_EQ(report["StorebagsCount"], 1);
-  const auto storebags = report["StorebagsSize"].get<std::uint64_t>();
-  EXPECT_GT(storebags, 100u);
-  EXPECT_LT(storebags, 100'000u);
-  EXPECT_EQ(report["CalculatedMemoryUsage"].get<std::uint64_t>(), storebags);
-  const auto memory = report["ProcessMemoryUsage"].get<std::uint64_t>();
-  EXPECT_GT(memory, 256u * 1024);
-  EXPECT_LT(memory, 1024u * 1024 * 1024);
-}
-
 TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWorking) {
   auto aggregator = connect();
   auto child = connect();
@@ -352,7 +272,7 @@ TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWo
   EXPECT_NE(shared.error->description.find("dictionary"), std::string::npos) << shared.error->description;
 
   // A raw client asks for a flush and vanishes before the answer.
-  auto raw = RawClient::connect();
+  auto raw = RawFrameSocket::connect();
   ASSERT_TRUE(raw);
   ASSERT_TRUE(raw->call(ipc::wire::kSetSessionInfo, 1,
                         Dictionary{{"sessionInfo", info(63)}, {"hasAggregationBlock", Value(false)}}));

@@ -19,19 +19,13 @@
 #include <vector>
 
 #include "platform/FileUtil.h"
+#include "tests/support/Command.h"
 
 namespace zerith::test {
 
 namespace {
 
 constexpr const char* kNginx = "/usr/sbin/nginx";
-
-std::string readText(const std::filesystem::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::ostringstream out;
-  out << in.rdbuf();
-  return out.str();
-}
 
 // Waits up to `timeout` for the child to end; kills it when it does not.
 // Returns its wait status.

@@ -1,12 +1,11 @@
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 
-#include <cstdio>
 #include <fstream>
 #include <sstream>
 
 #include "platform/Defaults.h"
 #include "platform/PropertyList.h"
+#include "tests/support/Command.h"
 #include "tests/support/TempRoot.h"
 #include "tools/zerith-defaults/DefaultsTool.h"
 
@@ -32,20 +31,8 @@ class DefaultsToolTest : public ::testing::Test {
     const auto errFile = root_ / "/stderr.txt";
     const std::string command = std::string(ZERITH_DEFAULTS_TOOL) + " --root '" + root_.path().string() + "' " +
                                 arguments + " 2>'" + errFile.string() + "'";
-    Result r{-1, {}, {}};
-    FILE* pipe = ::popen(command.c_str(), "r");
-    if (pipe == nullptr) {
-      return r;
-    }
-    char buffer[4096];
-    for (std::size_t n; (n = std::fread(buffer, 1, sizeof(buffer), pipe)) > 0;) {
-      r.out.append(buffer, n);
-    }
-    const int status = ::pclose(pipe);
-    r.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-    std::ifstream in(errFile);
-    r.err.assign(std::istreambuf_iterator<char>(in), {});
-    return r;
+    const test::CommandResult r = test::runCommand(command);
+    return {r.status, r.output, test::readText(errFile)};
   }
 
   test::TempRoot root_;

@@ -1,7 +1,5 @@
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -9,6 +7,7 @@
 #include "platform/Crypto.h"
 #include "platform/FileUtil.h"
 #include "platform/PropertyList.h"
+#include "tests/support/Command.h"
 #include "tests/support/TempRoot.h"
 
 namespace zerith {
@@ -16,25 +15,13 @@ namespace {
 
 namespace fs = std::filesystem;
 
-struct ToolRun {
-  int status = -1;
-  std::string output;  // stdout and stderr together
-};
-
 class ZerithStorebagToolTest : public ::testing::Test {
  protected:
-  ToolRun run(const std::string& arguments) const {
-    const std::string command =
-        "cd '" + root_.path().string() + "' && " + std::string(ZERITH_STOREBAG_TOOL) + " " + arguments + " 2>&1";
-    ToolRun r;
-    FILE* pipe = ::popen(command.c_str(), "r");
-    if (!pipe) return r;
-    char buf[4096];
-    std::size_t n;
-    while ((n = std::fread(buf, 1, sizeof buf, pipe)) > 0) r.output.append(buf, n);
-    const int status = ::pclose(pipe);
-    r.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-    return r;
+  // The executable as an operator runs it, in the test's folder; standard
+  // error joins the output.
+  test::CommandResult run(const std::string& arguments) const {
+    return test::runCommand("cd '" + root_.path().string() + "' && " + std::string(ZERITH_STOREBAG_TOOL) + " " +
+                            arguments + " 2>&1");
   }
   fs::path at(const std::string& name) const { return root_.path() / name; }
   Data read(const std::string& name) const { return *file::readAll(at(name), 64u << 20); }
@@ -56,7 +43,7 @@ class ZerithStorebagToolTest : public ::testing::Test {
 TEST_F(ZerithStorebagToolTest, SignedContainerVerifiesAndShowsTheBag) {
   prepare();
   EXPECT_EQ(fs::status(at("key.pem")).permissions() & fs::perms::group_read, fs::perms::none);
-  const ToolRun signing = run("sign --key key.pem --in bag.plist --out container");
+  const test::CommandResult signing = run("sign --key key.pem --in bag.plist --out container");
   ASSERT_EQ(signing.status, 0) << signing.output;
 
   const Data container = read("container");
@@ -71,13 +58,13 @@ TEST_F(ZerithStorebagToolTest, SignedContainerVerifiesAndShowsTheBag) {
   unstamped.erase("issue_time");
   EXPECT_EQ(Value(unstamped), bag_);
 
-  const ToolRun verify = run("verify --public publicKey.der --in container");
+  const test::CommandResult verify = run("verify --public publicKey.der --in container");
   EXPECT_EQ(verify.status, 0);
   EXPECT_EQ(verify.output.rfind("verified: " + std::to_string(signedBag.size()) + " bag bytes, version 3.0.1, issued ", 0),
             0u)
       << verify.output;
 
-  const ToolRun show = run("show --public publicKey.der --in container");
+  const test::CommandResult show = run("show --public publicKey.der --in container");
   EXPECT_EQ(show.status, 0);
   EXPECT_EQ(show.output, plist::encodeXml(stamped));
 }
@@ -136,7 +123,7 @@ TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
       {"sign --key key.pem --in junk --out x", "zerith-storebag: 'junk' is not a property list: "},
   };
   for (const auto& c : cases) {
-    const ToolRun r = run(c.arguments);
+    const test::CommandResult r = run(c.arguments);
     EXPECT_EQ(r.status, 1) << c.arguments;
     EXPECT_EQ(r.output.substr(0, c.message.size()), c.message) << c.arguments;
   }

@@ -3,8 +3,8 @@
 // The sender code of each client type: a short code that names the sending
 // component in HTTPS event records ("_sender", "X-ZTH-Sender"), in the
 // datagram backend's local log lines and in the per-sender keys of health
-// reports. Header-only, so that backends can share it without linking the
-// daemon library.
+// reports. It sits with the client types, below both of its users (the
+// backends and the agent).
 
 #include <array>
 #include <cstdint>
