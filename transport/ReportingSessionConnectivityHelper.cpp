@@ -148,16 +148,16 @@ void ReportingSessionConnectivityHelper::startTask(const std::shared_ptr<URLSess
   task->resume();
 }
 
-void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {
+bool ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {
   if (mode_ == kDataPOSTMode) {
     startTask(privateURLSession_->dataTaskWithRequest(request), "postURLRequestWithCompletionHandler", std::move(completion));
-    return;
+    return true;
   }
   if (mode_ == POSTRequestMode()) {
     const fs::path container = composeUniqueContainerURL();
     file::UniqueFd body = writeBodyFile(container, request.body);
     if (!body) {
-      return;  // no task and no completion
+      return false;  // no task, no completion: the caller counts the loss
     }
     URLRequest copy = request;
     copy.body.clear();
@@ -165,9 +165,10 @@ void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(con
               std::move(completion));
     // The open descriptor carries the upload from here on.
     deleteContainerAtURL(container);
-    return;
+    return true;
   }
   logger().error("postURLRequestWithCompletionHandler: wrong mode for POST operation detected {}", mode_);
+  return false;
 }
 
 void ReportingSessionConnectivityHelper::getURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {

@@ -5,6 +5,7 @@
 #include <semaphore>
 
 #include "transport/ReportingSessionConnectivityInterface.h"
+#include "transport/URLSession.h"
 
 namespace zerith {
 
@@ -51,12 +52,15 @@ URLAnswer postURLRequestAndWait(ReportingSessionConnectivityInterface& transport
     URLAnswer answer;
   };
   auto waiter = std::make_shared<Waiter>();
-  transport.postURLRequestWithCompletionHandler(
+  const bool taken = transport.postURLRequestWithCompletionHandler(
       request, [waiter](const Data& data, const std::optional<HTTPURLResponse>& response,
                         const std::optional<Error>& error) {
         waiter->answer = URLAnswer{data, response, error};
         waiter->done.release();
       });
+  if (!taken) {
+    return URLAnswer{{}, std::nullopt, Error{kURLErrorDomain, kURLErrorCannotCreateFile, "the request's body could not be written"}};
+  }
   waiter->done.acquire();
   return std::move(waiter->answer);
 }

@@ -39,6 +39,7 @@ namespace zerith {
 inline constexpr const char* kURLErrorDomain = "com.velmar.zerith.URLError";
 inline constexpr std::int64_t kURLErrorCancelled = -999;
 inline constexpr std::int64_t kURLErrorSessionInvalidated = -998;
+inline constexpr std::int64_t kURLErrorCannotCreateFile = -3000;
 
 // The process's main operation queue: the delegate queue of the
 // connectivity helpers' sessions. Runs on the transport pool.
