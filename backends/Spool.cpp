@@ -1041,7 +1041,7 @@ void Spool::commitWriteAhead() {
       write.onDisk();
     }
     if (write.then) {
-      write.then(std::move(name));
+      postQueue_.async([then = std::move(write.then), name = std::move(name)]() mutable { then(std::move(name)); });
     }
   }
 }

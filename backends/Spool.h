@@ -270,12 +270,14 @@ class Spool : public std::enable_shared_from_this<Spool> {
   void collectorAnswered();
 
   // Write-ahead: keeps the request of a batch about to be posted. `then`
-  // runs on the spool's queue once the batch is on disk, with its file's
+  // runs on a queue of the spool's own (never its state queue) once the
+  // batch is on disk, with its file's
   // name (the batch is pinned until liveAnswered), or with nullopt when it
   // could not be written (the caller posts it without the spool). With a
   // commit interval of 0 the caller waits, at most kWriteAheadWait, until
-  // then. False, and `then` never runs, when the spool folder is not usable.
-  static constexpr std::chrono::seconds kWriteAheadWait{30};
+  // then (a short bound: the flush may queue behind threads that wait too).
+  // False, and `then` never runs, when the spool folder is not usable.
+  static constexpr std::chrono::seconds kWriteAheadWait{2};
   bool writeAhead(URLRequest request, std::uint32_t records, std::shared_ptr<BackendCounters> counters,
                   std::function<void(std::optional<std::string> name)> then);
   enum class LiveAnswer {
@@ -339,6 +341,10 @@ class Spool : public std::enable_shared_from_this<Spool> {
   };
   std::vector<PendingWrite> pending_;
   bool commitScheduled_ = false;
+  // Where a written-ahead batch's post starts: starting a post may wait for
+  // the transport's queue, whose thread may itself be a writer waiting for
+  // this spool's queue, so the spool's queue never starts one.
+  SerialQueue postQueue_{"com.velmar.zerithd.spool.posts"};
   SerialQueue::Timer commitTimer_;
 };
 

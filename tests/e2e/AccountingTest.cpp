@@ -23,6 +23,7 @@
 
 #include "backends/BackendCounters.h"
 #include "ipc/DaemonStatus.h"
+#include "tests/e2e/BehavingCollector.h"
 #include "tests/e2e/E2eFixture.h"
 #include "tests/support/CollectorProcess.h"
 #include "tools/zerith/ZerithCli.h"
@@ -106,22 +107,14 @@ class AccountingTest : public E2eTest {
     const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     behaviourFile = root.path() / "collector/behaviour";
-    fs::create_directories(behaviourFile.parent_path());
-    behave("answer");
-    collector = std::make_unique<CollectorProcess>(
-        ZERITH_COLLECTOR_TOOL, std::vector<std::string>{"--generate-cert", certs.string(), "--serve", www.string(),
-                                                        "--behaviour-file", behaviourFile.string(),
-                                                        "--drop-duplicates"});
+    collector = startBehavingCollector(root.path(), behaviourFile);
     ASSERT_GT(collector->port(), 0) << collector->said();
     publishSignedStorebag(collectorStorebag(collector->url("/post"), clientEntry), www, collector->url("/zerith"));
     reader = std::make_unique<CollectorReader>(*collector);
     startDaemon(collectorDaemonOptions(certs));
   }
 
-  void behave(const std::string& text) {
-    ASSERT_TRUE(file::writeAtomically(behaviourFile, std::span<const std::uint8_t>(
-                                                         reinterpret_cast<const std::uint8_t*>(text.data()), text.size())));
-  }
+  void behave(const std::string& text) { ASSERT_TRUE(writeBehaviour(behaviourFile, text)); }
 
   static Value event(int n) {
     return Value(Dictionary{{kZerithMessageParametersCategory, Value(3)},

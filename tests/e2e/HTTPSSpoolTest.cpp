@@ -18,6 +18,7 @@
 
 #include "config/StorebagSigner.h"
 #include "ipc/DaemonStatus.h"
+#include "tests/e2e/BehavingCollector.h"
 #include "tests/e2e/E2eFixture.h"
 #include "tests/support/CollectorProcess.h"
 #include "tools/zerith/ZerithCli.h"
@@ -39,12 +40,7 @@ class HTTPSSpoolTest : public E2eTest {
     const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     behaviourFile = root.path() / "collector/behaviour";
-    fs::create_directories(behaviourFile.parent_path());
-    behave("answer");
-    collector = std::make_unique<CollectorProcess>(
-        ZERITH_COLLECTOR_TOOL, std::vector<std::string>{"--generate-cert", certs.string(), "--serve", www.string(),
-                                                        "--behaviour-file", behaviourFile.string(),
-                                                        "--drop-duplicates"});
+    collector = startBehavingCollector(root.path(), behaviourFile);
     ASSERT_GT(collector->port(), 0) << collector->said();
 
     // Events wait for the flush: one post per batch.
@@ -59,10 +55,7 @@ class HTTPSSpoolTest : public E2eTest {
     return Dictionary{{"spoolEnabled", true}, {"spoolRetryInitialSeconds", 0.2}, {"spoolRetryMaxSeconds", 1.0}};
   }
 
-  void behave(const std::string& text) {
-    ASSERT_TRUE(file::writeAtomically(behaviourFile, std::span<const std::uint8_t>(
-                                                         reinterpret_cast<const std::uint8_t*>(text.data()), text.size())));
-  }
+  void behave(const std::string& text) { ASSERT_TRUE(writeBehaviour(behaviourFile, text)); }
 
   std::unique_ptr<Zerith> startSession(std::uint32_t sessionID) {
     ZerithReply started;
