@@ -5,7 +5,12 @@
 #include <algorithm>
 #include <cctype>
 #include <cmath>
+#include <chrono>
 #include <cstdio>
+#include <deque>
+#include <map>
+#include <mutex>
+#include <utility>
 
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
@@ -171,17 +176,230 @@ std::optional<nlohmann::ordered_json> wireValue(const std::string& key, const Va
   return std::nullopt;
 }
 
-// A post that failed (no answer, or a 5xx): the spool keeps its batch when
-// it is on, otherwise the batch is gone and counted so.
-void postFailed(const std::shared_ptr<BackendCounters>& counters, const std::shared_ptr<const URLRequest>& kept,
-                std::uint32_t records) {
-  if (kept) {
-    if (auto spool = Spool::shared()) {
-      spool->keep(*kept, records, counters);
+// An integer key of com.velmar.zerith within [low, high]; otherwise logged
+// and `fallback`.
+std::int32_t limitFromDefaults(const char* key, std::int32_t low, std::int32_t high, std::int32_t fallback) {
+  const Value v = Defaults("com.velmar.zerith").objectForKey(key);
+  if (v.isNil()) {
+    return fallback;
+  }
+  if (v.isNumber() && v.intValue() >= low && v.intValue() <= high) {
+    return static_cast<std::int32_t>(v.intValue());
+  }
+  backendsLogger().error("HTTPSPostBackend(initWithName): \"{}\" holds {}, not a number from {} to {}; using {}", key,
+                         v.description(), low, high, fallback);
+  return fallback;
+}
+
+// A line at most every kLossLogInterval for one kind of loss, saying how
+// many batches and records went since the last one.
+class LossLog {
+ public:
+  explicit LossLog(const char* what) : what_(what) {}
+  void lost(const std::string& backend, std::uint32_t records) {
+    const auto now = std::chrono::steady_clock::now();
+    std::uint64_t batches = 0;
+    std::uint64_t total = 0;
+    {
+      std::lock_guard lock(mutex_);
+      ++batches_;
+      records_ += records;
+      if (logged_ && now - *logged_ < kLossLogInterval) {
+        return;
+      }
+      logged_ = now;
+      batches = std::exchange(batches_, 0);
+      total = std::exchange(records_, 0);
+    }
+    backendsLogger().error("HTTPSPostBackend(postJsonMessage): {}: {} lost {} batches ({} records) since the last line",
+                           what_, backend, batches, total);
+  }
+
+ private:
+  static constexpr std::chrono::seconds kLossLogInterval{10};
+  const char* what_;
+  std::mutex mutex_;
+  std::optional<std::chrono::steady_clock::time_point> logged_;
+  std::uint64_t batches_ = 0;
+  std::uint64_t records_ = 0;
+};
+
+LossLog& noBodyFileLog() {
+  static auto* log = new LossLog("a post's body file could not be written");
+  return *log;
+}
+LossLog& busyLog() {
+  static auto* log = new LossLog("posts in flight and waiting at their limits, no spool");
+  return *log;
+}
+
+// One batch's post: what it needs from its backend, kept apart from it so
+// that the answer is counted after the session has ended.
+struct LivePost {
+  std::shared_ptr<ReportingSessionConnectivityInterface> transport;
+  URLRequest request;
+  std::uint32_t records = 0;
+  std::shared_ptr<BackendCounters> counters;
+  std::weak_ptr<ZerithBackend> backend;
+  std::string backendName;
+  HTTPSPostBackend::PostCompletion completion;
+  std::size_t limit = 0;         // posts in flight
+  std::size_t waitLimit = 0;     // posts waiting for a slot
+  std::shared_ptr<Spool> spool;           // on: failures are kept
+  std::optional<std::string> spoolName;   // written ahead: the spool holds it already
+};
+
+// Posts in flight per backend name, over every session: a stalled collector
+// holds at most the limit of sockets and body files per backend. A post
+// past the limit waits its turn in memory (up to its wait limit; it holds no
+// descriptor while it waits), unless the spool holds it already.
+class PostSlots {
+ public:
+  enum class Take { go, waiting, full };
+  Take take(const std::shared_ptr<LivePost>& post, bool mayWait) {
+    std::lock_guard lock(mutex_);
+    Backend& backend = backends_[post->backendName];
+    if (backend.inFlight < post->limit) {
+      ++backend.inFlight;
+      return Take::go;
+    }
+    if (!mayWait || backend.waiting.size() >= post->waitLimit) {
+      return Take::full;
+    }
+    backend.waiting.push_back(post);
+    return Take::waiting;
+  }
+  // A post ended: the slot goes to the next waiting post (returned) or is
+  // given back.
+  std::shared_ptr<LivePost> give(const std::string& name) {
+    std::lock_guard lock(mutex_);
+    Backend& backend = backends_[name];
+    if (!backend.waiting.empty()) {
+      auto next = std::move(backend.waiting.front());
+      backend.waiting.pop_front();
+      return next;
+    }
+    if (backend.inFlight > 0) {
+      --backend.inFlight;
+    }
+    return nullptr;
+  }
+
+ private:
+  struct Backend {
+    std::size_t inFlight = 0;
+    std::deque<std::shared_ptr<LivePost>> waiting;
+  };
+  std::mutex mutex_;
+  std::map<std::string, Backend> backends_;
+};
+
+PostSlots& postSlots() {
+  static auto* slots = new PostSlots;
+  return *slots;
+}
+
+// The batch was not posted: it stays in the spool that holds it, goes to the
+// spool when it is on, or is dropped as `reason` with a line of `log`.
+void notPosted(const std::shared_ptr<LivePost>& post, BackendCount reason, LossLog& log) {
+  if (post->spoolName) {
+    post->spool->liveAnswered(*post->spoolName, Spool::LiveAnswer::notPosted);
+    return;
+  }
+  if (post->spool && reason == BackendCount::droppedBusy) {
+    post->spool->keep(post->request, post->records, post->counters);
+    return;
+  }
+  post->counters->add(reason, post->records);
+  log.lost(post->backendName, post->records);
+}
+
+bool launchPost(const std::shared_ptr<LivePost>& post);
+
+// A post's slot is free: the waiting posts go, in order, until one starts.
+void freeSlot(const std::string& backendName) {
+  for (std::size_t i = 0; i <= static_cast<std::size_t>(HTTPSPostBackend::kMaxPostsWaiting); ++i) {
+    auto next = postSlots().give(backendName);
+    if (!next || launchPost(next)) {
       return;
     }
   }
-  counters->add(BackendCount::droppedTransportError, records);
+}
+
+// Posts with a slot already held; false when the transport did not take it
+// (no body file), which is counted and logged.
+bool launchPost(const std::shared_ptr<LivePost>& post) {
+  const bool taken = post->transport->postURLRequestWithCompletionHandler(
+      post->request, [post](const Data&, const std::optional<HTTPURLResponse>& response, const std::optional<Error>& error) {
+        freeSlot(post->backendName);
+        if (error) {
+          backendsLogger().error("HTTPSPostBackend(postJsonMessage): post error: {}", error->description);
+        }
+        const bool serverError = response && response->statusCode >= 500 && response->statusCode <= 599;
+        const bool delivered = !error && response && response->statusCode >= 200 && response->statusCode <= 299;
+        if (post->spoolName) {
+          post->spool->liveAnswered(*post->spoolName, error || serverError ? Spool::LiveAnswer::failed
+                                                      : delivered           ? Spool::LiveAnswer::delivered
+                                                                            : Spool::LiveAnswer::refused);
+        } else {
+          post->counters->remove(BackendCount::inFlight, post->records);
+          if ((error || serverError) && post->spool) {
+            post->spool->keep(post->request, post->records, post->counters);
+          } else if (delivered) {
+            post->counters->add(BackendCount::delivered, post->records);
+          } else {
+            post->counters->add(BackendCount::droppedTransportError, post->records);
+          }
+        }
+        if (delivered) {
+          if (Spool* spool = Spool::current()) {
+            spool->collectorAnswered();
+          }
+        }
+        if (serverError) {
+          const std::string text =
+              fmt::format("backend {} disabled by server {} return code", post->backendName, response->statusCode);
+          // The state is queued before the line is written, so whoever
+          // reads the line reads the disabled state too.
+          if (auto self = post->backend.lock()) {
+            self->setState(kBackendStateDisabled);
+          }
+          backendsLogger().info("postJSONMessage: {}", text);
+          if (post->completion) {
+            post->completion(Value(), makeZerithError(text, response->statusCode));
+          }
+          return;
+        }
+        if (post->completion) {
+          post->completion(Value(), error);
+        }
+      });
+  if (!taken) {
+    // As before, the caller hears nothing of it; the loss is counted and logged.
+    if (!post->spoolName) {
+      post->counters->remove(BackendCount::inFlight, post->records);
+    }
+    notPosted(post, BackendCount::droppedNoBodyFile, noBodyFileLog());
+  }
+  return taken;
+}
+
+void startLivePost(const std::shared_ptr<LivePost>& post) {
+  // A batch the spool holds needs no room in memory: it waits there.
+  const PostSlots::Take take = postSlots().take(post, !post->spoolName);
+  if (take == PostSlots::Take::full) {
+    notPosted(post, BackendCount::droppedBusy, busyLog());
+    if (post->completion) {
+      post->completion(Value(), makeZerithError("too many posts in flight", -1));
+    }
+    return;
+  }
+  if (!post->spoolName) {
+    post->counters->add(BackendCount::inFlight, post->records);
+  }
+  if (take == PostSlots::Take::go && !launchPost(post)) {
+    freeSlot(post->backendName);
+  }
 }
 
 }  // namespace
@@ -222,6 +440,8 @@ HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::
   f.forceEventLogging = force && (Value(*force).boolValue() || equalsIgnoringCase(*force, "true") ||
                                   equalsIgnoringCase(*force, "yes"));
   f.spoolEnabled = spoolEnabledInDefaults();
+  f.postsInFlight = limitFromDefaults("postsInFlightPerBackend", 1, kMaxPostsInFlight, kDefaultPostsInFlight);
+  f.postsWaiting = limitFromDefaults("postsWaitingPerBackend", 0, kMaxPostsWaiting, kDefaultPostsWaiting);
   fields_ = std::move(f);
 }
 
@@ -230,6 +450,7 @@ HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::
 HTTPSPostBackend::~HTTPSPostBackend() {
   if (batch_.batchedEvents && !batch_.batchedEvents->empty()) {
     counters().add(BackendCount::droppedDisabled, batch_.batchedEvents->size());
+    counters().remove(BackendCount::inBatch, batch_.batchedEvents->size());
   }
 }
 
@@ -331,6 +552,7 @@ std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
     createBatch();
     batch.batchedEvents->push_back(std::move(event));
     counters().add(BackendCount::batched);
+    counters().add(BackendCount::inBatch);
     for (auto& [m, n] : batch.eventMethodCounts) {
       if (m == method) {
         n = count + 1;
@@ -508,6 +730,7 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
   one.push_back(std::move(event));
   const auto body = createMessageForPostAndLogging(std::move(one), &pretty);
   if (!body) {
+    counters().add(BackendCount::droppedUnencodable);
     return std::nullopt;
   }
   std::optional<std::string> text = pretty;
@@ -620,50 +843,33 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
   if (!transport) {
     return;
   }
-  std::weak_ptr<ZerithBackend> weak = weak_from_this();
-  const std::string backendName = name();
-  const std::uint32_t records = countEnvelopeRecords(json);
-  // With the spool on, the request is kept for the answer: a failure hands
-  // it to the spool as it was sent.
-  std::shared_ptr<const URLRequest> kept = f.spoolEnabled ? std::make_shared<const URLRequest>(request) : nullptr;
-  // The answer is counted even when it comes after the session has ended:
-  // the agent's totals of ended sessions read the same counters.
-  std::shared_ptr<BackendCounters> counts = sharedCounters();
-  transport->postURLRequestWithCompletionHandler(
-      request, [weak, counts, backendName, completion, records, kept](
-                   const Data&, const std::optional<HTTPURLResponse>& response, const std::optional<Error>& error) {
-        if (error) {
-          backendsLogger().error("HTTPSPostBackend(postJsonMessage): post error: {}", error->description);
-        }
-        const bool serverError = response && response->statusCode >= 500 && response->statusCode <= 599;
-        if (error || serverError) {
-          postFailed(counts, kept, records);
-        } else if (response && response->statusCode >= 200 && response->statusCode <= 299) {
-          counts->add(BackendCount::delivered, records);
-          if (Spool* spool = Spool::current()) {
-            spool->collectorAnswered();
-          }
-        } else {
-          counts->add(BackendCount::droppedTransportError, records);
-        }
-        if (serverError) {
-          const std::string text =
-              fmt::format("backend {} disabled by server {} return code", backendName, response->statusCode);
-          // The state is queued before the line is written, so whoever
-          // reads the line reads the disabled state too.
-          if (auto self = weak.lock()) {
-            self->setState(kBackendStateDisabled);
-          }
-          backendsLogger().info("postJSONMessage: {}", text);
-          if (completion) {
-            completion(Value(), makeZerithError(text, response->statusCode));
-          }
-          return;
-        }
-        if (completion) {
-          completion(Value(), error);
-        }
-      });
+  auto post = std::make_shared<LivePost>();
+  post->transport = std::move(transport);
+  post->records = countEnvelopeRecords(json);
+  post->counters = sharedCounters();
+  post->backend = weak_from_this();
+  post->backendName = name();
+  post->completion = std::move(completion);
+  post->limit = static_cast<std::size_t>(f.postsInFlight);
+  post->waitLimit = static_cast<std::size_t>(f.postsWaiting);
+  if (f.spoolEnabled) {
+    post->spool = Spool::shared();
+  }
+  if (post->spool) {
+    // Written ahead: on disk before the post starts, so a crash loses it not.
+    URLRequest ahead = request;
+    post->request = std::move(request);
+    if (post->spool->writeAhead(std::move(ahead), post->records, post->counters,
+                                [post](std::optional<std::string> name) {
+                                  post->spoolName = std::move(name);
+                                  startLivePost(post);
+                                })) {
+      return;
+    }
+  } else {
+    post->request = std::move(request);
+  }
+  startLivePost(post);
 }
 
 namespace {
@@ -716,12 +922,13 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
     outcome.error = "Nothing to flush";
     return outcome;
   }
+  const std::size_t taken = batch_.batchedEvents->size();
   if (const std::int32_t state = stateOnQueue(); state != kBackendStateEnabled) {
     // A batch that may not go is dropped: kept back by the sampling draw
     // (sampled out, or disabled by the override threshold) or not reporting.
     const bool sampled = state == kBackendStateSampledOut || (state == kBackendStateDisabled && disabledBySampling());
-    counters().add(sampled ? BackendCount::droppedSampledOut : BackendCount::droppedDisabled,
-                   batch_.batchedEvents->size());
+    counters().add(sampled ? BackendCount::droppedSampledOut : BackendCount::droppedDisabled, taken);
+    counters().remove(BackendCount::inBatch, taken);
     batch_ = Batch{};
     outcome.error = "Nothing to flush";
     return outcome;
@@ -755,9 +962,12 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
     kept.push_back(std::move(event));
   }
   batch_ = Batch{};
+  counters().remove(BackendCount::inBatch, taken);
   outcome.events = kept.size();
   outcome.body = kept.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(kept), &outcome.pretty);
   if (!outcome.body) {
+    counters().add(BackendCount::droppedUnencodable, outcome.events);
+    outcome.events = 0;
     outcome.error = "Nothing to flush: batched events were completely filtered out";
   }
   return outcome;
@@ -967,6 +1177,13 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
     return state();
   }
   disabledBySampling_.store(false);
+  // The override value is only taken when the draw is not below the
+  // threshold; every other outcome (an earlier return, a plain or
+  // per-country threshold that enables) leaves none, reported as -1.
+  {
+    std::lock_guard lock(fieldsMutex_);
+    fields_.overrideSampling = Value();
+  }
   const Value clients = profile()["clients"];
   if (!clients.isArray()) {
     if (!clients.isNil()) {
@@ -1086,8 +1303,9 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
 
     const double factor = samplingFactor();
     std::int32_t result;
-    const Value overrideSampling = numberOf(entry, "override_sampling");
-    {
+    Value overrideSampling;
+    if (!threshold.isNil() && factor >= threshold.doubleValue()) {
+      overrideSampling = numberOf(entry, "override_sampling");
       std::lock_guard lock(fieldsMutex_);
       fields_.overrideSampling = overrideSampling;
     }

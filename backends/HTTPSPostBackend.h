@@ -45,6 +45,14 @@ class HTTPSPostBackend : public ZerithBackend {
   static constexpr std::int32_t kFilterSHA256 = 2;
 
   static constexpr std::int32_t kDefaultEventThreshold = 49;
+  // Posts under way at once per backend name, over every session (the
+  // defaults key "postsInFlightPerBackend"). A batch past it waits in the
+  // spool when on, otherwise in memory, up to "postsWaitingPerBackend"
+  // batches; past that it is dropped (droppedBusy).
+  static constexpr std::int32_t kDefaultPostsInFlight = 16;
+  static constexpr std::int32_t kMaxPostsInFlight = 4096;
+  static constexpr std::int32_t kDefaultPostsWaiting = 1024;
+  static constexpr std::int32_t kMaxPostsWaiting = 65536;
 
   // Completion of a post: a result object (always nil) and an error.
   using PostCompletion = FlushCompletion;
@@ -145,7 +153,9 @@ class HTTPSPostBackend : public ZerithBackend {
     std::optional<std::string> uuidCustom;
     bool forceEventLogging = false;
     bool immutable = false;
-    bool spoolEnabled = false;  // "spoolEnabled": records carry "_recordID", failed posts are spooled
+    bool spoolEnabled = false;  // "spoolEnabled": records carry "_recordID", batches are written ahead to the spool
+    std::int32_t postsInFlight = kDefaultPostsInFlight;
+    std::int32_t postsWaiting = kDefaultPostsWaiting;
   };
   Fields fields() const;
   void setImmutable();

@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <cmath>
 #include <cstring>
+#include <future>
+#include <iterator>
 
 #include <fmt/format.h>
 
@@ -103,6 +105,13 @@ class FieldReader {
 
 std::string textOf(std::span<const std::uint8_t> bytes) { return std::string(bytes.begin(), bytes.end()); }
 
+// Errors of the moment: the file is fine, this process cannot read it now.
+bool isPassingError(int error) {
+  return error == EMFILE || error == ENFILE || error == ENOMEM || error == EAGAIN || error == EINTR ||
+         error == ENOBUFS;
+}
+
+
 // A 64-bit seed from the kernel's random source.
 std::uint64_t randomSeed() {
   std::random_device device;
@@ -187,6 +196,7 @@ SpoolConfig SpoolConfig::fromDictionary(const Value& values) {
   numberKey<std::int64_t>(values, "spoolMaxAgeSeconds", 1, kMaxMaxAgeSeconds, config.maxAgeSeconds);
   numberKey<double>(values, "spoolRetryInitialSeconds", 0.01, 3600, config.retryInitialSeconds);
   numberKey<double>(values, "spoolRetryMaxSeconds", 0.01, 86400, config.retryMaxSeconds);
+  numberKey<double>(values, "spoolCommitIntervalSeconds", 0.0, kMaxCommitIntervalSeconds, config.commitIntervalSeconds);
   if (config.retryMaxSeconds < config.retryInitialSeconds) {
     backendsLogger().error("Spool: \"spoolRetryMaxSeconds\" {} is below \"spoolRetryInitialSeconds\" {}; using the latter for both",
                            config.retryMaxSeconds, config.retryInitialSeconds);
@@ -403,6 +413,10 @@ bool SpoolStore::open(std::string* why) {
     file::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
     std::uint8_t head[kSpoolHeaderSize];
     const ssize_t n = fd ? ::pread(fd.get(), head, sizeof head, 0) : -1;
+    if (n < 0 && isPassingError(errno)) {
+      backendsLogger().error("Spool: cannot read {} now ({}); left for the next start", name, std::strerror(errno));
+      continue;
+    }
     std::string reason;
     const auto header = n < 0 ? std::nullopt : decodeSpoolHeader(std::span<const std::uint8_t>(head, static_cast<std::size_t>(n)), &reason);
     if (!header) {
@@ -435,68 +449,148 @@ std::string SpoolStore::nextName(std::int64_t nowMillis) {
   return name;
 }
 
-SpoolStore::WriteOutcome SpoolStore::write(const SpoolBatch& batch) {
-  WriteOutcome outcome;
-  const std::int64_t now = clock();
-  outcome.dropped = dropExpired(now);
-  const Data bytes = encodeSpoolFile(batch);
-  if (bytes.size() > maxBytes_) {
-    return outcome;  // alone larger than the whole spool
-  }
-  while (!index_.empty() && totalBytes_ + bytes.size() > maxBytes_) {
-    Entry oldest = index_.begin()->second;
-    remove(oldest.name);
-    outcome.dropped.push_back({std::move(oldest), DropReason::size});
-  }
+namespace {
 
-  const std::string name = nextName(now);
-  const fs::path path = folder_ / name;
-  std::string tmpl = (folder_ / (std::string(kTemporaryPrefix) + name + ".XXXXXX")).string();
-  file::UniqueFd fd(::mkostemp(tmpl.data(), O_CLOEXEC));
-  if (!fd) {
-    outcome.error = errno;
-    return outcome;
+// Whether the reader takes every field of `batch` back; the cause otherwise.
+bool readerTakes(const SpoolBatch& batch, std::string* why) {
+  if (batch.url.size() > kSpoolMaxURLSize) {
+    *why = fmt::format("its URL of {} bytes is past the spool's {}", batch.url.size(), kSpoolMaxURLSize);
+    return false;
   }
-  const auto fail = [&] {
-    outcome.error = errno != 0 ? errno : EIO;
-    ::unlink(tmpl.c_str());
-    return outcome;
-  };
-  ::fchmod(fd.get(), 0600);
+  if (batch.headers.size() > kSpoolMaxHeaders) {
+    *why = fmt::format("its {} request headers are past the spool's {}", batch.headers.size(), kSpoolMaxHeaders);
+    return false;
+  }
+  for (const auto& [name, value] : batch.headers) {
+    if (name.size() > kSpoolMaxHeaderSize || value.size() > kSpoolMaxHeaderSize) {
+      *why = fmt::format("its request header {:.64} is past the spool's {} bytes", name, kSpoolMaxHeaderSize);
+      return false;
+    }
+  }
+  if (batch.body.size() > kSpoolMaxBodySize) {
+    *why = fmt::format("its body of {} bytes is past the spool's {}", batch.body.size(), kSpoolMaxBodySize);
+    return false;
+  }
+  return true;
+}
+
+bool writeWhole(int fd, const Data& bytes) {
   std::size_t done = 0;
   while (done < bytes.size()) {
-    const ssize_t n = ::write(fd.get(), bytes.data() + done, bytes.size() - done);
+    const ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
     if (n < 0) {
       if (errno == EINTR) {
         continue;
       }
-      return fail();
+      return false;
     }
     if (n == 0) {
       errno = EIO;
-      return fail();
+      return false;
     }
     done += static_cast<std::size_t>(n);
   }
-  if (::fsync(fd.get()) != 0) {
-    return fail();
+  return true;
+}
+
+}  // namespace
+
+SpoolStore::WriteOutcome SpoolStore::write(const SpoolBatch& batch) { return std::move(writeMany({&batch}).front()); }
+
+std::vector<SpoolStore::WriteOutcome> SpoolStore::writeMany(const std::vector<const SpoolBatch*>& batches) {
+  std::vector<WriteOutcome> outcomes(batches.size());
+  if (batches.empty()) {
+    return outcomes;
   }
-  if (::close(fd.release()) != 0) {
-    return fail();
+  const std::int64_t now = clock();
+  outcomes.front().dropped = dropExpired(now);
+
+  // Each batch under a temporary name, not yet flushed.
+  struct Staged {
+    std::size_t index;
+    std::string name;
+    std::string temporary;
+    file::UniqueFd fd;
+    Entry entry;
+  };
+  std::vector<Staged> staged;
+  std::uint64_t reserved = 0;  // bytes of staged batches, not yet in totalBytes_
+  for (std::size_t i = 0; i < batches.size(); ++i) {
+    const SpoolBatch& batch = *batches[i];
+    WriteOutcome& outcome = outcomes[i];
+    if (!readerTakes(batch, &outcome.why)) {
+      continue;
+    }
+    const Data bytes = encodeSpoolFile(batch);
+    if (bytes.size() > maxBytes_) {
+      outcome.why = fmt::format("larger than the size limit of {} bytes", maxBytes_);
+      continue;
+    }
+    while (totalBytes_ + reserved + bytes.size() > maxBytes_) {
+      auto victim = std::find_if(index_.begin(), index_.end(), [&](const auto& e) { return !isPinned(e.first); });
+      if (victim == index_.end()) {
+        break;
+      }
+      Entry oldest = victim->second;
+      remove(oldest.name);
+      outcome.dropped.push_back({std::move(oldest), DropReason::size});
+    }
+    if (totalBytes_ + reserved + bytes.size() > maxBytes_) {
+      outcome.why = fmt::format("the size limit of {} bytes is taken by batches being posted", maxBytes_);
+      continue;
+    }
+    Staged s;
+    s.index = i;
+    s.name = nextName(now);
+    s.temporary = (folder_ / (std::string(kTemporaryPrefix) + s.name + ".XXXXXX")).string();
+    s.fd = file::UniqueFd(::mkostemp(s.temporary.data(), O_CLOEXEC));
+    if (!s.fd) {
+      outcome.error = errno;
+      outcome.why = std::strerror(errno);
+      continue;
+    }
+    ::fchmod(s.fd.get(), 0600);
+    if (!writeWhole(s.fd.get(), bytes)) {
+      outcome.error = errno != 0 ? errno : EIO;
+      outcome.why = std::strerror(outcome.error);
+      ::unlink(s.temporary.c_str());
+      continue;
+    }
+    s.entry = Entry{s.name, bytes.size(), batch.recordCount, batch.createdMillis};
+    reserved += bytes.size();
+    staged.push_back(std::move(s));
   }
-  if (::rename(tmpl.c_str(), path.c_str()) != 0) {
-    return fail();
+  if (staged.empty()) {
+    return outcomes;
   }
-  file::UniqueFd dirFd(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (dirFd) {
-    ::fsync(dirFd.get());
+
+  // One flush for the group: the file itself when alone, its file system
+  // when several.
+  const int synced = staged.size() == 1 ? ::fsync(staged.front().fd.get()) : ::syncfs(staged.front().fd.get());
+  const int syncError = synced != 0 ? errno : 0;
+  std::size_t renamed = 0;
+  for (Staged& s : staged) {
+    WriteOutcome& outcome = outcomes[s.index];
+    const int closed = ::close(s.fd.release());
+    if (syncError != 0 || closed != 0 || ::rename(s.temporary.c_str(), (folder_ / s.name).c_str()) != 0) {
+      outcome.error = syncError != 0 ? syncError : (errno != 0 ? errno : EIO);
+      outcome.why = std::strerror(outcome.error);
+      ::unlink(s.temporary.c_str());
+      continue;
+    }
+    totalBytes_ += s.entry.bytes;
+    index_.emplace(s.name, s.entry);
+    outcome.written = true;
+    outcome.name = s.name;
+    ++renamed;
   }
-  Entry entry{name, bytes.size(), batch.recordCount, batch.createdMillis};
-  totalBytes_ += entry.bytes;
-  index_.emplace(name, std::move(entry));
-  outcome.written = true;
-  outcome.name = name;
-  return outcome;
+  if (renamed > 0) {
+    file::UniqueFd dirFd(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (dirFd) {
+      ::fsync(dirFd.get());
+    }
+  }
+  return outcomes;
 }
 
 std::vector<SpoolStore::Entry> SpoolStore::entries() const {
@@ -515,6 +609,22 @@ std::optional<SpoolStore::Entry> SpoolStore::oldest() const {
   return index_.begin()->second;
 }
 
+std::optional<SpoolStore::Entry> SpoolStore::find(const std::string& name) const {
+  if (auto it = index_.find(name); it != index_.end()) {
+    return it->second;
+  }
+  return std::nullopt;
+}
+
+std::optional<SpoolStore::Entry> SpoolStore::oldestUnpinned() const {
+  for (const auto& [name, entry] : index_) {
+    if (!isPinned(name)) {
+      return entry;
+    }
+  }
+  return std::nullopt;
+}
+
 std::uint64_t SpoolStore::totalRecords() const {
   std::uint64_t n = 0;
   for (const auto& [name, entry] : index_) {
@@ -523,22 +633,66 @@ std::uint64_t SpoolStore::totalRecords() const {
   return n;
 }
 
-std::optional<SpoolBatch> SpoolStore::read(const std::string& name) {
+std::optional<SpoolBatch> SpoolStore::read(const std::string& name, bool* later) {
   const fs::path path = folder_ / name;
-  const auto bytes = file::readAll(path, kSpoolHeaderSize + kSpoolMaxBodySize + 2 * kSpoolMaxURLSize +
-                                             kSpoolMaxHeaders * (2 * kSpoolMaxHeaderSize + 8));
-  if (!bytes) {
-    std::error_code ec;
-    if (fs::exists(path, ec)) {
-      moveAside(name, "unreadable or too large");
-    } else if (auto it = index_.find(name); it != index_.end()) {
+  const auto forget = [&] {
+    if (auto it = index_.find(name); it != index_.end()) {
       totalBytes_ -= it->second.bytes;
       index_.erase(it);
     }
+  };
+  // Only what the file holds can make it bad: an error of this process (no
+  // descriptor, no memory) leaves it for a later read.
+  const auto cannotNow = [&](int error) -> std::optional<SpoolBatch> {
+    if (error == ENOENT) {
+      forget();
+    } else if (isPassingError(error)) {
+      backendsLogger().error("Spool: cannot read {} now ({}); read again later", name, std::strerror(error));
+      if (later) {
+        *later = true;
+      }
+    } else {
+      moveAside(name, fmt::format("unreadable: {}", std::strerror(error)));
+    }
+    return std::nullopt;
+  };
+  file::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
+  if (!fd) {
+    return cannotNow(errno);
+  }
+  struct stat st {};
+  if (::fstat(fd.get(), &st) != 0) {
+    return cannotNow(errno);
+  }
+  const std::uint64_t limit = kSpoolHeaderSize + kSpoolMaxBodySize + kSpoolMaxURLSize +
+                              kSpoolMaxHeaders * (2 * kSpoolMaxHeaderSize + 8) + 12;
+  if (!S_ISREG(st.st_mode) || static_cast<std::uint64_t>(st.st_size) > limit) {
+    moveAside(name, fmt::format("not a regular file or {} bytes, past {}", st.st_size, limit));
     return std::nullopt;
   }
+  Data bytes;
+  try {
+    bytes.resize(static_cast<std::size_t>(st.st_size));
+  } catch (const std::bad_alloc&) {
+    return cannotNow(ENOMEM);
+  }
+  std::size_t done = 0;
+  while (done < bytes.size()) {
+    const ssize_t n = ::pread(fd.get(), bytes.data() + done, bytes.size() - done, static_cast<off_t>(done));
+    if (n < 0 && errno == EINTR) {
+      continue;
+    }
+    if (n < 0) {
+      return cannotNow(errno);
+    }
+    if (n == 0) {
+      break;  // shorter than it was: the checks below say so
+    }
+    done += static_cast<std::size_t>(n);
+  }
+  bytes.resize(done);
   std::string why;
-  auto batch = decodeSpoolFile(*bytes, &why);
+  auto batch = decodeSpoolFile(bytes, &why);
   if (!batch) {
     moveAside(name, why);
     return std::nullopt;
@@ -565,7 +719,9 @@ std::vector<SpoolStore::Dropped> SpoolStore::dropExpired(std::int64_t nowMillis)
     if (entry.createdMillis >= oldestKept) {
       break;
     }
-    expired.push_back(name);
+    if (!isPinned(name)) {
+      expired.push_back(name);
+    }
   }
   for (const std::string& name : expired) {
     Entry entry = index_.at(name);
@@ -656,6 +812,8 @@ void Spool::start() {
     }
     backendsLogger().info("Spool: on in {} (limits {} bytes, {} seconds)", folder_.string(), config_.maxBytes,
                           config_.maxAgeSeconds);
+    usable_ = true;
+    counters_.add(BackendCount::inSpool, store_->totalRecords());
     countDrops(store_->dropExpired(store_->clock()));
     if (store_->size() > 0) {
       backendsLogger().info("Spool: {} batches ({} records) found from an earlier run; draining", store_->size(),
@@ -699,6 +857,7 @@ void Spool::keep(URLRequest request, std::uint32_t records, std::shared_ptr<Back
         kept = true;
         self->owners_[outcome.name] = backend;
         countBoth(BackendCount::spooled, records);
+        countBoth(BackendCount::inSpool, records);
         self->hasBacklog_ = true;
         backendsLogger().info("Spool: kept batch {} ({} records); {} batches ({} bytes) waiting", outcome.name, records,
                               self->store_->size(), self->store_->totalBytes());
@@ -711,14 +870,8 @@ void Spool::keep(URLRequest request, std::uint32_t records, std::shared_ptr<Back
       } else {
         self->droppedRecords_ += records;
         countBoth(BackendCount::droppedSpoolFull, records);
-        if (outcome.error != 0) {
-          backendsLogger().error("Spool: cannot keep a batch of {} records: {}; {} records dropped so far", records,
-                                 std::strerror(outcome.error), self->droppedRecords_);
-        } else {
-          backendsLogger().error(
-              "Spool: cannot keep a batch of {} records: larger than the size limit of {} bytes; {} records dropped so far",
-              records, self->config_.maxBytes, self->droppedRecords_);
-        }
+        backendsLogger().error("Spool: cannot keep a batch of {} records: {}; {} records dropped so far", records,
+                               outcome.why, self->droppedRecords_);
       }
     }
     if (done) {
@@ -749,6 +902,7 @@ void Spool::countDrops(const std::vector<SpoolStore::Dropped>& dropped) {
   for (const auto& drop : dropped) {
     droppedRecords_ += drop.entry.records;
     countOn(drop.entry.name, BackendCount::droppedSpoolFull, drop.entry.records);
+    uncountOn(drop.entry.name, BackendCount::inSpool, drop.entry.records);
     owners_.erase(drop.entry.name);
     if (drop.reason == SpoolStore::DropReason::size) {
       backendsLogger().error(
@@ -768,6 +922,173 @@ void Spool::countOn(const std::string& name, BackendCount what, std::uint64_t n)
       it->second->add(what, n);
     }
   }
+}
+
+void Spool::uncountOn(const std::string& name, BackendCount what, std::uint64_t n) {
+  counters_.remove(what, n);
+  if (auto it = owners_.find(name); it != owners_.end()) {
+    if (it->second) {
+      it->second->remove(what, n);
+    }
+  }
+}
+
+void Spool::retryLater() {
+  if (retryActive_ || !store_ || store_->size() == 0) {
+    return;
+  }
+  scheduleRetry(backoffWithJitter());
+}
+
+bool Spool::writeAhead(URLRequest request, std::uint32_t records, std::shared_ptr<BackendCounters> counters,
+                       std::function<void(std::optional<std::string> name)> then) {
+  if (!usable_.load()) {
+    return false;
+  }
+  PendingWrite write;
+  write.batch.createdMillis = wallMillis();
+  write.batch.recordCount = records;
+  write.batch.url = std::move(request.url);
+  write.batch.headers = std::move(request.headers);
+  write.batch.body = std::move(request.body);
+  write.counters = std::move(counters);
+  write.then = std::move(then);
+  // With no interval the writer waits for its batch's flush: what it formed
+  // is on disk before it goes on.
+  std::shared_ptr<std::promise<void>> onDisk;
+  std::future<void> waited;
+  if (config_.commitIntervalSeconds <= 0) {
+    onDisk = std::make_shared<std::promise<void>>();
+    waited = onDisk->get_future();
+    write.onDisk = [onDisk] { onDisk->set_value(); };
+  }
+  std::weak_ptr<Spool> weak = weak_from_this();
+  queue_.async([weak, write = std::move(write)]() mutable {
+    auto self = weak.lock();
+    if (!self) {
+      return;
+    }
+    self->pending_.push_back(std::move(write));
+    if (self->commitScheduled_) {
+      return;
+    }
+    self->commitScheduled_ = true;
+    auto commit = [weak] {
+      if (auto again = weak.lock()) {
+        again->commitWriteAhead();
+      }
+    };
+    if (self->config_.commitIntervalSeconds <= 0) {
+      // Writers that arrive while this group is written join the next one.
+      self->queue_.async(std::move(commit));
+    } else {
+      self->commitTimer_ = self->queue_.after(
+          std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+              std::chrono::duration<double>(self->config_.commitIntervalSeconds)),
+          std::move(commit));
+    }
+  });
+  if (waited.valid()) {
+    (void)waited.wait_for(kWriteAheadWait);
+  }
+  return true;
+}
+
+void Spool::commitWriteAhead() {
+  commitScheduled_ = false;
+  // A group holds a descriptor per batch until its flush: at most this many.
+  constexpr std::size_t kMaxGroup = 64;
+  std::vector<PendingWrite> group;
+  const std::size_t n = std::min(pending_.size(), kMaxGroup);
+  group.reserve(n);
+  std::move(pending_.begin(), pending_.begin() + static_cast<std::ptrdiff_t>(n), std::back_inserter(group));
+  pending_.erase(pending_.begin(), pending_.begin() + static_cast<std::ptrdiff_t>(n));
+  if (!pending_.empty()) {
+    commitScheduled_ = true;
+    std::weak_ptr<Spool> weak = weak_from_this();
+    queue_.async([weak] {
+      if (auto self = weak.lock()) {
+        self->commitWriteAhead();
+      }
+    });
+  }
+  std::vector<SpoolStore::WriteOutcome> outcomes(group.size());
+  if (store_) {
+    std::vector<const SpoolBatch*> batches;
+    batches.reserve(group.size());
+    for (const PendingWrite& write : group) {
+      batches.push_back(&write.batch);
+    }
+    outcomes = store_->writeMany(batches);
+  }
+  for (std::size_t i = 0; i < group.size(); ++i) {
+    PendingWrite& write = group[i];
+    const SpoolStore::WriteOutcome& outcome = outcomes[i];
+    countDrops(outcome.dropped);
+    std::optional<std::string> name;
+    if (outcome.written) {
+      name = outcome.name;
+      owners_[outcome.name] = write.counters;
+      store_->pin(outcome.name);
+      countOn(outcome.name, BackendCount::spooled, write.batch.recordCount);
+      countOn(outcome.name, BackendCount::inSpool, write.batch.recordCount);
+      hasBacklog_ = true;
+    } else {
+      backendsLogger().error("Spool: cannot write a batch of {} records ahead of its post: {}; posted without the spool",
+                             write.batch.recordCount, outcome.why.empty() ? "the spool folder is not usable" : outcome.why);
+    }
+    if (write.onDisk) {
+      write.onDisk();
+    }
+    if (write.then) {
+      postQueue_.async([then = std::move(write.then), name = std::move(name)]() mutable { then(std::move(name)); });
+    }
+  }
+}
+
+void Spool::liveAnswered(const std::string& name, LiveAnswer answer) {
+  std::weak_ptr<Spool> weak = weak_from_this();
+  queue_.async([weak, name, answer] {
+    auto self = weak.lock();
+    if (!self || !self->store_) {
+      return;
+    }
+    SpoolStore& store = *self->store_;
+    store.unpin(name);
+    const auto entry = store.find(name);
+    const std::uint32_t records = entry ? entry->records : 0;
+    if (records == 0 && answer != LiveAnswer::failed && answer != LiveAnswer::notPosted) {
+      self->owners_.erase(name);  // already gone (dropped while its post ran): counted then
+      return;
+    }
+    switch (answer) {
+      case LiveAnswer::delivered:
+        self->countOn(name, BackendCount::delivered, records);
+        self->uncountOn(name, BackendCount::inSpool, records);
+        store.remove(name);
+        self->owners_.erase(name);
+        break;
+      case LiveAnswer::refused:
+        self->countOn(name, BackendCount::droppedTransportError, records);
+        self->uncountOn(name, BackendCount::inSpool, records);
+        store.remove(name);
+        self->owners_.erase(name);
+        break;
+      case LiveAnswer::failed:
+        backendsLogger().info("Spool: kept batch {} ({} records) after its post failed; {} batches ({} bytes) waiting",
+                              name, records, store.size(), store.totalBytes());
+        self->retryLater();
+        break;
+      case LiveAnswer::notPosted:
+        backendsLogger().debug("Spool: kept batch {} ({} records) without a post; {} batches waiting", name, records,
+                               store.size());
+        self->retryLater();
+        break;
+    }
+    if (store.size() == 0) {
+      self->hasBacklog_ = false;
+    }
+  });
 }
 
 void Spool::scheduleRetry(std::chrono::steady_clock::duration delay) {
@@ -806,17 +1127,27 @@ void Spool::retryNext() {
   countDrops(store_->dropExpired(store_->clock()));
   std::optional<SpoolBatch> batch;
   std::optional<SpoolStore::Entry> entry;
-  while ((entry = store_->oldest())) {
-    batch = store_->read(entry->name);  // a bad file is moved aside and the next one read
+  while ((entry = store_->oldestUnpinned())) {
+    bool later = false;
+    batch = store_->read(entry->name, &later);  // a bad file is moved aside and the next one read
     if (batch) {
       break;
     }
+    if (later) {
+      scheduleRetry(backoffWithJitter());
+      return;
+    }
+    // Moved aside or gone: what it held is lost.
+    countOn(entry->name, BackendCount::droppedSpoolFull, entry->records);
+    uncountOn(entry->name, BackendCount::inSpool, entry->records);
     owners_.erase(entry->name);
   }
   if (!batch) {
-    hasBacklog_ = false;
+    if (store_->size() == 0) {
+      hasBacklog_ = false;
+    }
     backoffSeconds_ = 0;
-    return;  // empty: nothing stays scheduled
+    return;  // empty, or only batches whose live post is under way: nothing stays scheduled
   }
   URLRequest request;
   request.httpMethod = "POST";
@@ -827,11 +1158,13 @@ void Spool::retryNext() {
   request.allowsCellularAccess = false;
   retryActive_ = true;
   postInFlight_ = true;
+  // Kept from the size and age limits while its post is under way.
+  store_->pin(entry->name);
   countOn(entry->name, BackendCount::retried, entry->records);
   std::weak_ptr<Spool> weak = weak_from_this();
   const std::string name = entry->name;
   const std::uint32_t records = entry->records;
-  transport_->postURLRequestWithCompletionHandler(
+  const bool taken = transport_->postURLRequestWithCompletionHandler(
       request, [weak, name, records](const Data&, const std::optional<HTTPURLResponse>& response,
                                      const std::optional<Error>& error) {
         const long status = response ? response->statusCode : 0;
@@ -843,6 +1176,16 @@ void Spool::retryNext() {
           });
         }
       });
+  if (!taken) {
+    // No body file could be written: the batch stays, tried again later.
+    store_->unpin(name);
+    postInFlight_ = false;
+    retryActive_ = false;
+    const auto wait = backoffWithJitter();
+    backendsLogger().error("Spool: retry of batch {} not sent: its body file could not be written; next try in {} ms", name,
+                           std::chrono::duration_cast<std::chrono::milliseconds>(wait).count());
+    scheduleRetry(wait);
+  }
 }
 
 void Spool::retryAnswered(const std::string& name, std::uint32_t records, long status, const std::optional<Error>& error) {
@@ -851,8 +1194,10 @@ void Spool::retryAnswered(const std::string& name, std::uint32_t records, long s
   if (!store_) {
     return;
   }
+  store_->unpin(name);
   if (!error && status >= 200 && status <= 299) {
     countOn(name, BackendCount::delivered, records);
+    uncountOn(name, BackendCount::inSpool, records);
     store_->remove(name);
     owners_.erase(name);
     backoffSeconds_ = 0;
@@ -869,6 +1214,7 @@ void Spool::retryAnswered(const std::string& name, std::uint32_t records, long s
     // The collector answered and will not take it: posting again changes
     // nothing.
     countOn(name, BackendCount::droppedTransportError, records);
+    uncountOn(name, BackendCount::inSpool, records);
     store_->remove(name);
     owners_.erase(name);
     backendsLogger().error("Spool: the collector refused batch {} ({} records) with status {}; dropped", name, records,

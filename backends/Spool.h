@@ -1,7 +1,10 @@
 #pragma once
 
-// The spool: batches that a failed HTTPS post would have lost, kept on disk
-// and posted again until a collector takes them.
+// The spool: batches kept on disk and posted again until a collector takes
+// them. A batch is written ahead of its post (flushed to disk before the post
+// starts, and removed when a collector took it), so a crash loses no batch
+// that was formed; a batch whose live post failed, found no free post slot or
+// no body file stays for the retry.
 //
 // Off unless the defaults key "spoolEnabled" is true. When on, every record
 // carries "_recordID" (a per-daemon random prefix and a counter, 32 hex
@@ -23,14 +26,21 @@
 //                they were posted, each a 32-bit length and the bytes
 //                (headers: a 32-bit count of name/value pairs first)
 //
-// Files are written under a temporary name in the same folder, fsynced and
-// renamed, so a crash leaves either the whole file or a temporary that the
-// next start removes. A file whose header or checksum does not hold, or of
-// another version, is moved into bad/ with a log line and never parsed
-// further.
+// Files are written under a temporary name in the same folder, flushed to
+// disk and renamed, so a crash leaves either the whole file or a temporary
+// that the next start removes. Batches written together share one flush (one
+// fsync for a lone batch, one syncfs for several) and one fsync of the
+// folder; "spoolCommitIntervalSeconds" above 0 gathers the batches of that
+// interval into one such group. A file whose header or checksum does not
+// hold, or of another version, is moved into bad/ with a log line and never
+// parsed further; a file that cannot be opened or read for a passing reason
+// (no descriptor left, no memory) stays where it is and is read again later.
+// A batch that the reader would refuse (a field past its bound) is never
+// written.
 //
 // Limits: "spoolMaxBytes" (total file bytes) and "spoolMaxAgeSeconds". A
-// batch that does not fit drops the oldest batches first; batches past the
+// batch that does not fit drops the oldest batches first (never one whose
+// live post is under way); batches past the
 // age are dropped before every write and every retry. Each drop is logged and
 // counted (droppedSpoolFull), as is a batch that cannot be written (full
 // disk, quota, I/O error): spooling stops for that batch, the daemon goes on.
@@ -54,6 +64,7 @@
 #include <mutex>
 #include <optional>
 #include <random>
+#include <set>
 #include <span>
 #include <string>
 #include <string_view>
@@ -79,12 +90,16 @@ struct SpoolConfig {
   static constexpr std::int64_t kMaxMaxAgeSeconds = 365ll * 24 * 3600;
   static constexpr double kDefaultRetryInitialSeconds = 1;
   static constexpr double kDefaultRetryMaxSeconds = 300;
+  static constexpr double kMaxCommitIntervalSeconds = 1;
 
   bool enabled = false;
   std::uint64_t maxBytes = kDefaultMaxBytes;
   std::int64_t maxAgeSeconds = kDefaultMaxAgeSeconds;
   double retryInitialSeconds = kDefaultRetryInitialSeconds;
   double retryMaxSeconds = kDefaultRetryMaxSeconds;
+  // 0: a batch is on disk before its writer goes on; above 0: batches of
+  // this interval share one flush, and a crash loses up to this interval's.
+  double commitIntervalSeconds = 0;
 
   // From the defaults domain com.velmar.zerith. Values of the wrong kind or
   // out of range are logged and replaced by the default.
@@ -158,7 +173,8 @@ class SpoolStore {
   struct WriteOutcome {
     bool written = false;
     std::string name;       // when written
-    int error = 0;          // errno of a failed write; 0 when the batch alone exceeds the size limit
+    int error = 0;          // errno of a failed write; 0 when the batch cannot be kept at all
+    std::string why;        // when not written: the cause, for the log
     std::vector<Dropped> dropped;  // older batches dropped to make room
   };
 
@@ -174,16 +190,30 @@ class SpoolStore {
   std::filesystem::path badFolder() const { return folder_ / "bad"; }
 
   WriteOutcome write(const SpoolBatch& batch);
+  // Several batches with one flush to disk and one fsync of the folder; an
+  // outcome per batch, in order (older batches dropped for room are in the
+  // outcome of the batch that needed it).
+  std::vector<WriteOutcome> writeMany(const std::vector<const SpoolBatch*>& batches);
   // Oldest first.
   std::vector<Entry> entries() const;
   std::optional<Entry> oldest() const;
+  std::optional<Entry> find(const std::string& name) const;
+  // The oldest batch that is not pinned.
+  std::optional<Entry> oldestUnpinned() const;
+  // A pinned batch (its live post is under way) is neither dropped for room
+  // or age nor picked for a retry.
+  void pin(const std::string& name) { pinned_.insert(name); }
+  void unpin(const std::string& name) { pinned_.erase(name); }
+  bool isPinned(const std::string& name) const { return pinned_.count(name) != 0; }
   std::size_t size() const { return index_.size(); }
   std::uint64_t totalBytes() const { return totalBytes_; }
   std::uint64_t totalRecords() const;
 
   // The batch in a file; a file that fails the checks is moved into bad/
-  // (logged) and nullopt comes back, as it does for a file that has gone.
-  std::optional<SpoolBatch> read(const std::string& name);
+  // (logged) and nullopt comes back, as it does for a file that has gone. A
+  // file that cannot be read now (no descriptor, no memory) stays, nullopt
+  // comes back and `later` (when given) is set.
+  std::optional<SpoolBatch> read(const std::string& name, bool* later = nullptr);
   void remove(const std::string& name);
   std::vector<Dropped> dropExpired(std::int64_t nowMillis);
 
@@ -198,6 +228,7 @@ class SpoolStore {
   std::uint64_t maxBytes_;
   std::int64_t maxAgeSeconds_;
   std::map<std::string, Entry> index_;  // names sort oldest first
+  std::set<std::string> pinned_;
   std::uint64_t totalBytes_ = 0;
   std::uint32_t sequence_ = 0;
 };
@@ -238,6 +269,25 @@ class Spool : public std::enable_shared_from_this<Spool> {
   // A collector answered a live post with 2xx: a waiting retry goes now.
   void collectorAnswered();
 
+  // Write-ahead: keeps the request of a batch about to be posted. `then`
+  // runs on a queue of the spool's own (never its state queue) once the
+  // batch is on disk, with its file's
+  // name (the batch is pinned until liveAnswered), or with nullopt when it
+  // could not be written (the caller posts it without the spool). With a
+  // commit interval of 0 the caller waits, at most kWriteAheadWait, until
+  // then (a short bound: the flush may queue behind threads that wait too).
+  // False, and `then` never runs, when the spool folder is not usable.
+  static constexpr std::chrono::seconds kWriteAheadWait{2};
+  bool writeAhead(URLRequest request, std::uint32_t records, std::shared_ptr<BackendCounters> counters,
+                  std::function<void(std::optional<std::string> name)> then);
+  enum class LiveAnswer {
+    delivered,  // a 2xx: the file goes
+    refused,    // another status that is not 5xx: the collector never takes it, the file goes
+    failed,     // no answer or a 5xx: the batch stays for the retry
+    notPosted,  // no post slot or no body file: the batch stays for the retry
+  };
+  void liveAnswered(const std::string& name, LiveAnswer answer);
+
   // Every spool's own counts: spooled, retried, delivered, droppedSpoolFull,
   // droppedTransportError (batches a collector refused for good).
   const BackendCounters& counters() const { return counters_; }
@@ -258,6 +308,11 @@ class Spool : public std::enable_shared_from_this<Spool> {
   std::chrono::steady_clock::duration backoffWithJitter();
   void countDrops(const std::vector<SpoolStore::Dropped>& dropped);
   void countOn(const std::string& name, BackendCount what, std::uint64_t n);
+  // Takes `n` back from a gauge, on the spool's counts and the batch's backend's.
+  void uncountOn(const std::string& name, BackendCount what, std::uint64_t n);
+  void commitWriteAhead();
+  // A retry when none is pending, after the current back-off.
+  void retryLater();
 
   std::filesystem::path folder_;
   SpoolConfig config_;
@@ -275,6 +330,22 @@ class Spool : public std::enable_shared_from_this<Spool> {
   std::map<std::string, std::shared_ptr<BackendCounters>> owners_;  // a batch's backend's counts
   std::mt19937_64 random_;
   std::atomic<bool> hasBacklog_{false};
+  std::atomic<bool> usable_{false};  // the folder opened
+
+  // Write-ahead batches waiting for their group's flush (queue only).
+  struct PendingWrite {
+    SpoolBatch batch;
+    std::shared_ptr<BackendCounters> counters;
+    std::function<void(std::optional<std::string>)> then;
+    std::function<void()> onDisk;  // wakes a waiting writer
+  };
+  std::vector<PendingWrite> pending_;
+  bool commitScheduled_ = false;
+  // Where a written-ahead batch's post starts: starting a post may wait for
+  // the transport's queue, whose thread may itself be a writer waiting for
+  // this spool's queue, so the spool's queue never starts one.
+  SerialQueue postQueue_{"com.velmar.zerithd.spool.posts"};
+  SerialQueue::Timer commitTimer_;
 };
 
 }  // namespace zerith

@@ -83,11 +83,15 @@ bool listHolds(const Value& list, std::uint16_t category) {
 
 std::string_view backendCountName(BackendCount what) {
   switch (what) {
+    case BackendCount::accepted: return "accepted";
     case BackendCount::sent: return "sent";
     case BackendCount::batched: return "batched";
     case BackendCount::spooled: return "spooled";
     case BackendCount::retried: return "retried";
     case BackendCount::delivered: return "delivered";
+    case BackendCount::inBatch: return "inBatch";
+    case BackendCount::inFlight: return "inFlight";
+    case BackendCount::inSpool: return "inSpool";
     case BackendCount::droppedSampledOut: return "droppedSampledOut";
     case BackendCount::droppedFiltered: return "droppedFiltered";
     case BackendCount::droppedBlacklisted: return "droppedBlacklisted";
@@ -96,6 +100,9 @@ std::string_view backendCountName(BackendCount what) {
     case BackendCount::droppedTransportError: return "droppedTransportError";
     case BackendCount::droppedQueueFull: return "droppedQueueFull";
     case BackendCount::droppedUnsupported: return "droppedUnsupported";
+    case BackendCount::droppedNoBodyFile: return "droppedNoBodyFile";
+    case BackendCount::droppedBusy: return "droppedBusy";
+    case BackendCount::droppedUnencodable: return "droppedUnencodable";
     case BackendCount::count_: break;
   }
   return "unknown";

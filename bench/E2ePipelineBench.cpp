@@ -63,6 +63,7 @@ struct Settings {
   std::chrono::milliseconds stall{30000};
   bool smoke = false;
   bool spoolOutage = false;
+  double writeAhead = -1;  // >= 0: the zerithd run has the spool on, with this commit interval
   std::string collector = "zerith-collector";
 };
 
@@ -160,7 +161,14 @@ Report runPeer(const Settings& s, Collector& collector, const std::filesystem::p
 
 Report runZerithd(const Settings& s, Collector& collector) {
   Report r{.pipeline = "zerithd", .expected = s.events};
-  ZerithdPipeline daemon({.postURL = collector.url("/zerithd")});
+  Dictionary defaults;
+  if (s.writeAhead >= 0) {
+    // Every batch written ahead to the spool (and removed once taken).
+    defaults = Dictionary{{"spoolEnabled", Value(true)},
+                          {"spoolMaxBytes", Value(16ull << 30)},
+                          {"spoolCommitIntervalSeconds", Value(s.writeAhead)}};
+  }
+  ZerithdPipeline daemon({.postURL = collector.url("/zerithd"), .defaults = std::move(defaults)});
   if (!daemon.ready()) {
     r.error = daemon.error();
     return r;
@@ -443,6 +451,9 @@ int main(int argc, char** argv) {
       ->check(CLI::IsMember({"zerith-collector", "test-server"}));
   app.add_flag("--spool-outage", s.spoolOutage,
                "also run zerithd with the spool on and the collector down while sending, then up");
+  app.add_option("--write-ahead", s.writeAhead,
+                 "the zerithd run with the spool on and this commit interval in seconds (every batch written ahead)")
+      ->check(CLI::Range(0.0, 1.0));
   app.add_flag("--smoke", s.smoke, "exit 1 unless every pipeline delivered every event exactly once");
   CLI11_PARSE(app, argc, argv);
   s.load.replies = replies == "each";

@@ -626,6 +626,7 @@ Value ZerithdSession::sendMessageWithDictionary(const Value& message) {
 
   std::optional<std::string> chosen;
   for (const auto& [name, backend] : *set) {
+    backend->counters().add(BackendCount::accepted);
     if (!backend->isWhitelistedEvent(category)) {
       logger().debug("sendMessageWithDictionary: Dropping event with category {} as it is not whitelisted for backend {}",
                      category, backend->name());
@@ -853,6 +854,7 @@ void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const 
   for (const auto& [name, backend] : *backends) {
     backend->updateState();
     backend->setReportingSessionConnectivityDelegate(helper);
+    backend->counters().add(BackendCount::accepted);
     if (!backend->isWhitelistedEvent(category)) {
       logger().debug("sendMessageWithSessionInfo: Dropping event with category {} as it is not whitelisted for backend {}",
                      category, backend->name());

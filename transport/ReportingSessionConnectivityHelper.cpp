@@ -151,18 +151,19 @@ void ReportingSessionConnectivityHelper::startTask(const std::shared_ptr<URLSess
   task->resume();
 }
 
-void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {
+bool ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {
   if (mode_ == kDataPOSTMode) {
     startTask(privateURLSession_->dataTaskWithRequest(request), "postURLRequestWithCompletionHandler", std::move(completion));
-    return;
+    return true;
   }
   if (mode_ == POSTRequestMode()) {
     const fs::path container = composeUniqueContainerURL();
     file::UniqueFd body = writeBodyFile(container, request.body);
     if (!body) {
       // A full storage folder, the file size limit (EFBIG), no descriptor left.
+      // The caller logs the loss at a bounded rate (a full disk fails every post).
       const int err = errno;
-      logger().error("postURLRequestWithCompletionHandler: cannot write the body file {}: {}", container.string(),
+      logger().debug("postURLRequestWithCompletionHandler: cannot write the body file {}: {}", container.string(),
                      std::strerror(err));
       if (request.completesWhenBodyFails && completion) {
         stateQueue_.async([completion = std::move(completion), err] {
@@ -171,7 +172,7 @@ void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(con
                            fmt::format("the body file cannot be written ({})", std::strerror(err))});
         });
       }
-      return;  // else no task and no completion
+      return false;  // no task; the caller counts the loss (or hears it above)
     }
     URLRequest copy = request;
     copy.body.clear();
@@ -179,9 +180,10 @@ void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(con
               std::move(completion));
     // The open descriptor carries the upload from here on.
     deleteContainerAtURL(container);
-    return;
+    return true;
   }
   logger().error("postURLRequestWithCompletionHandler: wrong mode for POST operation detected {}", mode_);
+  return false;
 }
 
 void ReportingSessionConnectivityHelper::getURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {

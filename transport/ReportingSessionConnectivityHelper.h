@@ -58,7 +58,7 @@ class ReportingSessionConnectivityHelper final : public ReportingSessionConnecti
   // The session configuration of a mode; nullopt for unknown modes.
   static std::optional<URLSessionConfiguration> privateURLSessionConfigWithMode(std::uint32_t mode);
 
-  void postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) override;
+  bool postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) override;
   void getURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) override;
 
   // Registers a task: names it "Task_%08x" from the process-wide counter and

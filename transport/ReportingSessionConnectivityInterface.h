@@ -60,7 +60,9 @@ using URLCompletion =
 class ReportingSessionConnectivityInterface {
  public:
   virtual ~ReportingSessionConnectivityInterface() = default;
-  virtual void postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) = 0;
+  // False when the request was not taken (its body file could not be
+  // written, or the helper does not post): the completion never runs.
+  virtual bool postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) = 0;
   virtual void getURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) = 0;
 };
 
@@ -72,7 +74,8 @@ struct URLAnswer {
 };
 
 // Posts `request` and blocks the calling thread until its completion has run,
-// without a time limit of its own (uploads wait for their answer). Completions
+// without a time limit of its own (uploads wait for their answer). A request
+// the transport did not take is answered at once with an error. Completions
 // run on the helper's state queue, so never call this from one.
 URLAnswer postURLRequestAndWait(ReportingSessionConnectivityInterface& transport, const URLRequest& request);
 

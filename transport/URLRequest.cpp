@@ -7,6 +7,7 @@
 #include "platform/LockRank.h"
 #include "platform/ThreadPools.h"
 #include "transport/ReportingSessionConnectivityInterface.h"
+#include "transport/URLSession.h"
 
 namespace zerith {
 
@@ -53,12 +54,15 @@ URLAnswer postURLRequestAndWait(ReportingSessionConnectivityInterface& transport
     URLAnswer answer;
   };
   auto waiter = std::make_shared<Waiter>();
-  transport.postURLRequestWithCompletionHandler(
+  const bool taken = transport.postURLRequestWithCompletionHandler(
       request, [waiter](const Data& data, const std::optional<HTTPURLResponse>& response,
                         const std::optional<Error>& error) {
         waiter->answer = URLAnswer{data, response, error};
         waiter->done.release();
       });
+  if (!taken) {
+    return URLAnswer{{}, std::nullopt, Error{kURLErrorDomain, kURLErrorCannotWriteBody, "the request's body could not be written"}};
+  }
   lockrank::assertNoLockHeld("an HTTP answer");
   const PoolWait wait;
   waiter->done.acquire();

@@ -53,7 +53,7 @@ TEST_F(HTTPSCountsTest, BatchedEventsAreSentOrDroppedByTheEventListsAtTheFlush) 
   for (const std::uint16_t category : {1, 2, 3, 1}) {
     b->sendMessage(event(category), at(1001), category, 0, 0);
   }
-  expectOnly(*b, {{BackendCount::batched, 4}});
+  expectOnly(*b, {{BackendCount::batched, 4}, {BackendCount::inBatch, 4}});
   flush(*b);
   ASSERT_TRUE(server.waitForRequests(1));
   EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 2u);

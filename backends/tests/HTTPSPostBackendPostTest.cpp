@@ -408,7 +408,10 @@ TEST_F(HTTPSPostTest, CellularIsForbiddenForHapticsAndForBackendsWithoutUserInfo
   // does, so look at it through a transport that only records it.
   struct Recording : ReportingSessionConnectivityInterface {
     std::vector<URLRequest> requests;
-    void postURLRequestWithCompletionHandler(const URLRequest& r, URLCompletion) override { requests.push_back(r); }
+    bool postURLRequestWithCompletionHandler(const URLRequest& r, URLCompletion) override {
+      requests.push_back(r);
+      return true;
+    }
     void getURLRequestWithCompletionHandler(const URLRequest&, URLCompletion) override {}
   };
   auto recording = std::make_shared<Recording>();

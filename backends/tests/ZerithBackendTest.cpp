@@ -192,7 +192,7 @@ TEST(ZerithBackendTest, FlushCallsTheCompletionOnceWithNilAndNoError) {
 
 TEST(ZerithBackendTest, TransportReferenceIsWeak) {
   struct Transport : ReportingSessionConnectivityInterface {
-    void postURLRequestWithCompletionHandler(const URLRequest&, URLCompletion) override {}
+    bool postURLRequestWithCompletionHandler(const URLRequest&, URLCompletion) override { return true; }
     void getURLRequestWithCompletionHandler(const URLRequest&, URLCompletion) override {}
   };
   ProbeBackend b;

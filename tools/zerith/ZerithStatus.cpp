@@ -16,8 +16,12 @@ namespace zerith::cli {
 namespace {
 
 constexpr std::string_view kDropped = "dropped";
-// The counts with a column of their own, in this order.
-constexpr const char* kColumns[] = {"sent", "batched", "spooled", "retried", "delivered"};
+// The counts with a column of their own, in this order: what the backend
+// accepted, what it did, where events are now; DROPPED follows. For a
+// backend that posts, ACCEPTED = DELIVERED + INBATCH + INFLIGHT + INSPOOL +
+// DROPPED once nothing moves.
+constexpr const char* kColumns[] = {"accepted", "sent",    "batched",  "spooled", "retried",
+                                    "delivered", "inBatch", "inFlight", "inSpool"};
 
 std::string stateName(std::int64_t state) {
   switch (state) {

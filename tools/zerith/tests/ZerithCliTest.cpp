@@ -181,21 +181,21 @@ TEST(Cli, StatusTablesShowEachBackendsCountsAndWhyEventsWereDropped) {
   status.sessions.push_back(ipc::SessionStatus{
       12, "s", 7,
       {ipc::BackendStatus{"httpsPost", 2,
-                          {{"sent", 1200}, {"batched", 4}, {"droppedSampledOut", 0}, {"droppedFiltered", 3},
+                          {{"accepted", 1200}, {"sent", 1200}, {"inFlight", 6}, {"batched", 4}, {"droppedSampledOut", 0}, {"droppedFiltered", 3},
                            {"droppedBlacklisted", 1}, {"delivered", 1190}}},
        ipc::BackendStatus{"pellamlog", 3, {{"droppedUnsupported", 7}, {"droppedFutureReason", 2}}}}});
   status.sessions.push_back(ipc::SessionStatus{13, "t", 9, {}});
   status.ended.push_back(ipc::EndedTotals{7, "httpsPost", 2, {{"sent", 5}, {"retried", 2}}});
   EXPECT_EQ(cli::statusTable(status),
             "Live sessions: 2\n"
-            "SESSION  CLIENT  BACKEND    STATE        SENT  BATCHED  SPOOLED  RETRIED  DELIVERED  DROPPED  WHY\n"
-            "12       7       httpsPost  enabled      1200        4        0        0       1190        4  filtered 3, blacklisted 1\n"
-            "12       7       pellamlog  sampled out     0        0        0        0          0        9  unsupported 7, futureReason 2\n"
+            "SESSION  CLIENT  BACKEND    STATE        ACCEPTED  SENT  BATCHED  SPOOLED  RETRIED  DELIVERED  INBATCH  INFLIGHT  INSPOOL  DROPPED  WHY\n"
+            "12       7       httpsPost  enabled          1200  1200        4        0        0       1190        0         6        0        4  filtered 3, blacklisted 1\n"
+            "12       7       pellamlog  sampled out         0     0        0        0        0          0        0         0        0        9  unsupported 7, futureReason 2\n"
             "13       9       -          no backends\n"
             "\n"
             "Ended sessions, totals by client type and backend:\n"
-            "CLIENT  BACKEND    SESSIONS  SENT  BATCHED  SPOOLED  RETRIED  DELIVERED  DROPPED  WHY\n"
-            "7       httpsPost         2     5        0        0        2          0        0  -\n");
+            "CLIENT  BACKEND    SESSIONS  ACCEPTED  SENT  BATCHED  SPOOLED  RETRIED  DELIVERED  INBATCH  INFLIGHT  INSPOOL  DROPPED  WHY\n"
+            "7       httpsPost         2         0     5        0        0        2          0        0         0        0        0  -\n");
   EXPECT_EQ(cli::statusTable(ipc::DaemonStatus{}),
             "Live sessions: 0\n\nEnded sessions, totals by client type and backend:\n(none)\n");
 }
