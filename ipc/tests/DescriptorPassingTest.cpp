@@ -64,7 +64,7 @@ TEST_P(DescriptorPassingTest, TheCallGetsWhatItClaimedAndTheRestIsClosed) {
   for (const auto& p : pipes) {
     fds.push_back(p.write.get());
   }
-  sendWithDescriptors(peer.raw.get(), encodeCall("upload", 1, Dictionary(), c.claimed), fds);
+  sendWithDescriptors(peer.raw.fd(), encodeCall("upload", 1, Dictionary(), c.claimed), fds);
   ASSERT_TRUE(peer.object->received.waitFor(1));
   const auto calls = peer.object->calls();
   ASSERT_EQ(calls[0].descriptors.size(), c.received);

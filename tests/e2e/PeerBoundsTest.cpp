@@ -6,6 +6,8 @@
 
 #include <sys/fsuid.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 
 #include <fstream>
