@@ -223,9 +223,9 @@ TEST_F(ConnectivityHelperTest, UploadPostWhoseBodyCannotBeWrittenIsDropped) {
   root.write("/tmp/zthstorage", "not a folder");
   auto helper = Helper::initWithDelegate({}, Helper::POSTRequestMode());
   auto done = Completions::make();
-  helper->postURLRequestWithCompletionHandler(post(server.url("/upload"), "body"), done->handler());
+  EXPECT_FALSE(helper->postURLRequestWithCompletionHandler(post(server.url("/upload"), "body"), done->handler()));
   EXPECT_EQ(logs.count("createHelperForTask:"), 0u);
-  EXPECT_EQ(logs.count("postURLRequestWithCompletionHandler"), 0u);
+  EXPECT_EQ(logs.count("postURLRequestWithCompletionHandler: cannot write the body file"), 1u);
   EXPECT_EQ(server.requestCount(), 0u);
   EXPECT_EQ(done->count(), 0u);
 }

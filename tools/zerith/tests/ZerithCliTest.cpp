@@ -1,6 +1,7 @@
 #include "tools/zerith/ZerithCli.h"
 #include "tools/zerith/ZerithStatus.h"
 
+#include <fstream>
 #include <gtest/gtest.h>
 
 #include <sstream>
@@ -65,10 +66,13 @@ TEST_F(CliFixture, AScriptedSessionPrintsOneJsonLinePerStep) {
 }
 
 TEST_F(CliFixture, StepArgumentsReachTheSession) {
+  // The framework opens an upload's file itself: it has to exist.
+  const std::string upload = (root.path() / "f.log").string();
+  std::ofstream(upload) << "log";
   const auto r = runCli(session({"--step", R"(send={"category":3,"type":4,"payload":{}})", "--step",
                                  R"(one-shot={"category":5,"type":6,"payload":{"x":1}})", "--step", "shared-key=k=[1]",
                                  "--step", "shared-key=gone=null", "--step", "digest-key=AAH/:3", "--step",
-                                 "upload-file=/tmp/f.log"}));
+                                 "upload-file=" + upload}));
   EXPECT_EQ(r.status, 0) << r.err;
   const auto calls = daemon->waitForClient().session->log.calls();
   ASSERT_EQ(calls.size(), 7u);
