@@ -67,7 +67,7 @@ struct FdMessage {
 
 // A connection to the daemon made by a process running as `uid`, so that the
 // daemon sees that user at the other end.
-std::optional<RawClient> connectAs(uid_t uid) {
+std::optional<RawFrameSocket> connectAs(uid_t uid) {
   int pair[2];
   if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) {
     return std::nullopt;
@@ -102,7 +102,7 @@ std::optional<RawClient> connectAs(uid_t uid) {
   }
   int fd = -1;
   std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&message.m)), sizeof fd);
-  return RawClient::adopt(file::UniqueFd(fd));
+  return RawFrameSocket(file::UniqueFd(fd));
 }
 
 class PeerBoundsTest : public E2eTest {
@@ -116,7 +116,7 @@ class PeerBoundsTest : public E2eTest {
   }
 
   // A client answered within a second and a half.
-  static bool answered(RawClient& client, std::uint64_t number = 1) {
+  static bool answered(RawFrameSocket& client, std::uint64_t number = 1) {
     return client.call("fetchDisplayURL:", number) && client.replyTo(number, 1500ms).has_value();
   }
 
@@ -164,7 +164,7 @@ TEST_P(OversizedAnswerTest, IsCutAtTheLimitWhileItStreamsAndOthersAreServed) {
   session->finishSession(10s);
   ASSERT_TRUE(daemon->waitFor(GetParam().logged, 1, 20s)) << daemon->output();
 
-  auto other = RawClient::connect();
+  auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other);
   EXPECT_TRUE(answered(*other));
   EXPECT_LT(peakKiB(), idle + (24u << 10)) << "idle " << idle << " KiB";
@@ -188,16 +188,16 @@ TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
   Data start{static_cast<std::uint8_t>(length >> 24), static_cast<std::uint8_t>(length >> 16),
              static_cast<std::uint8_t>(length >> 8), static_cast<std::uint8_t>(length)};
   start.resize(kSent, 0);
-  std::vector<RawClient> clients;
+  std::vector<RawFrameSocket> clients;
   std::size_t cut = 0;
   for (std::size_t i = 0; i < kClients; ++i) {
-    auto client = RawClient::connect();
+    auto client = RawFrameSocket::connect();
     ASSERT_TRUE(client) << i;
     cut += client->write(start) ? 0 : 1;  // closed while it wrote
     clients.push_back(std::move(*client));
   }
   ASSERT_TRUE(daemon->waitFor("unfinished frames and waiting replies of all connections", 1, 20s)) << cut << " writes cut";
-  auto other = RawClient::connect();
+  auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other);
   EXPECT_TRUE(answered(*other));
   EXPECT_LT(peakKiB(), idle + (128u << 10) + (48u << 10)) << "idle " << idle << " KiB";
@@ -210,14 +210,14 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
   Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(12000));
   startQuietDaemon();
   const std::uint64_t idle = rssKiB();
-  std::vector<RawClient> clients;
+  std::vector<RawFrameSocket> clients;
   clients.reserve(10000);
   for (int i = 0; i < 10000; ++i) {
-    auto c = RawClient::connect();
+    auto c = RawFrameSocket::connect();
     ASSERT_TRUE(c) << i;
     clients.push_back(std::move(*c));
   }
-  auto other = RawClient::connect();
+  auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other);
   // Behind the 10,000 in the listener's backlog.
   EXPECT_TRUE(other->call("fetchDisplayURL:", 1) && other->replyTo(1, 10s));
@@ -244,13 +244,13 @@ TEST_F(PeerBoundsTest, AtTheConnectionLimitAcceptingWaitsUntilOneCloses) {
   Defaults("com.velmar.zerith").setObject("maxConnections", Value(20));
   Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(20));
   startQuietDaemon();
-  std::vector<RawClient> clients;
+  std::vector<RawFrameSocket> clients;
   for (int i = 0; i < 20; ++i) {
-    auto c = RawClient::connect();
+    auto c = RawFrameSocket::connect();
     ASSERT_TRUE(c && answered(*c)) << i;
     clients.push_back(std::move(*c));
   }
-  auto waiting = RawClient::connect();  // in the backlog
+  auto waiting = RawFrameSocket::connect();  // in the backlog
   ASSERT_TRUE(waiting);
   ASSERT_TRUE(waiting->call("fetchDisplayURL:", 1));
   EXPECT_FALSE(waiting->replyTo(1, 1s));
@@ -275,9 +275,9 @@ TEST_F(PeerBoundsTest, UnderTheUnitsDescriptorLimitOneUserCannotLockOthersOut) {
   ASSERT_TRUE(daemon->waitFor(fmt::format("at most {} client connections, {} per user", limits.total, limits.perUid)));
 
   // Root takes every connection it may, and then 100 more, each refused.
-  std::vector<RawClient> mine;
+  std::vector<RawFrameSocket> mine;
   for (std::size_t i = 0; i < limits.perUid + 100; ++i) {
-    auto c = RawClient::connect();
+    auto c = RawFrameSocket::connect();
     ASSERT_TRUE(c) << i;
     mine.push_back(std::move(*c));
   }
@@ -294,14 +294,14 @@ TEST_F(PeerBoundsTest, RefusedClientsAndBadCallsLeaveABoundedLog) {
   grant(Value());  // no entitlement: every client is refused
   startQuietDaemon();
   for (int i = 0; i < 100; ++i) {
-    auto c = RawClient::connect();
+    auto c = RawFrameSocket::connect();
     ASSERT_TRUE(c && c->waitClosed(5s)) << i;
   }
   EXPECT_EQ(daemon->count("it lacks the entitlement com.velmar.private.zerithd"), 1u);
   EXPECT_TRUE(daemon->waitFor("(and 99 more like it in the last 10 s)", 1, 15s)) << daemon->output();
 
   grant(Value(true));
-  auto flooder = RawClient::connect();
+  auto flooder = RawFrameSocket::connect();
   ASSERT_TRUE(flooder);
   Data calls;
   for (int i = 0; i < 20000; ++i) {
