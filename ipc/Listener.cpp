@@ -212,6 +212,9 @@ class SocketListener final : public Listener {
           ++open;
           peak = std::max(peak, open);
           struct Slot {
+            Slot(std::weak_ptr<State> owner, uid_t peerUid) : state(std::move(owner)), uid(peerUid) {}
+            Slot(const Slot&) = delete;
+            Slot& operator=(const Slot&) = delete;
             std::weak_ptr<State> state;
             uid_t uid;
             ~Slot() {

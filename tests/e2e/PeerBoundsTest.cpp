@@ -21,6 +21,15 @@
 namespace zerith::test {
 namespace {
 
+// The address sanitizer's shadow memory and quarantine hold what the daemon
+// gave back, so its resident size says nothing about the daemon's own
+// bounds: the memory figures are checked in the normal build only.
+#if defined(__SANITIZE_ADDRESS__)
+constexpr bool kResidentSizeMeansSomething = false;
+#else
+constexpr bool kResidentSizeMeansSomething = true;
+#endif
+
 // A field of /proc/<pid>/status in KiB ("VmRSS", "VmHWM").
 std::uint64_t statusKiB(pid_t pid, const std::string& field) {
   std::ifstream in("/proc/" + std::to_string(pid) + "/status");
@@ -167,7 +176,9 @@ TEST_P(OversizedAnswerTest, IsCutAtTheLimitWhileItStreamsAndOthersAreServed) {
   auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other);
   EXPECT_TRUE(answered(*other));
-  EXPECT_LT(peakKiB(), idle + (24u << 10)) << "idle " << idle << " KiB";
+  if (kResidentSizeMeansSomething) {
+    EXPECT_LT(peakKiB(), idle + (24u << 10)) << "idle " << idle << " KiB";
+  }
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -200,7 +211,9 @@ TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
   auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other);
   EXPECT_TRUE(answered(*other));
-  EXPECT_LT(peakKiB(), idle + (128u << 10) + (48u << 10)) << "idle " << idle << " KiB";
+  if (kResidentSizeMeansSomething) {
+    EXPECT_LT(peakKiB(), idle + (128u << 10) + (48u << 10)) << "idle " << idle << " KiB";
+  }
 }
 
 TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack) {
@@ -220,7 +233,7 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
   auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other);
   // Behind the 10,000 in the listener's backlog.
-  EXPECT_TRUE(other->call("fetchDisplayURL:", 1) && other->replyTo(1, 10s));
+  EXPECT_TRUE(other->call("fetchDisplayURL:", 1) && other->replyTo(1, 30s));
   const std::uint64_t held = rssKiB();
   clients.clear();
   other.reset();
@@ -229,14 +242,18 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
     const std::filesystem::path fds = "/proc/" + std::to_string(daemon->pid()) + "/fd";
     return std::distance(std::filesystem::directory_iterator(fds), std::filesystem::directory_iterator());
   };
-  const auto deadline = std::chrono::steady_clock::now() + 10s;
+  const auto deadline = std::chrono::steady_clock::now() + 60s;  // a sanitizer build closes slowly
   while (descriptors() > 64 && std::chrono::steady_clock::now() < deadline) {
     std::this_thread::sleep_for(100ms);
   }
   std::this_thread::sleep_for(2s);
   EXPECT_LE(descriptors(), 64);
-  EXPECT_LT(held, idle + (96u << 10)) << "idle " << idle << " KiB";
-  EXPECT_LE(rssKiB(), held) << "idle " << idle << " KiB, with 10,000 open " << held << " KiB";
+  if (kResidentSizeMeansSomething) {
+    EXPECT_LT(held, idle + (96u << 10)) << "idle " << idle << " KiB";
+  }
+  if (kResidentSizeMeansSomething) {
+    EXPECT_LE(rssKiB(), held) << "idle " << idle << " KiB, with 10,000 open " << held << " KiB";
+  }
 }
 
 TEST_F(PeerBoundsTest, AtTheConnectionLimitAcceptingWaitsUntilOneCloses) {
