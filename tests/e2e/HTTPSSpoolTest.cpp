@@ -304,8 +304,8 @@ TEST_F(HTTPSSpoolTest, TheSizeLimitDropsTheOldestBatchesAndCountsThem) {
 TEST_F(HTTPSSpoolTest, TheAgeLimitDropsBatchesBeforeTheirRetry) {
   Dictionary keys = spoolOn();
   keys.set("spoolMaxAgeSeconds", Value(1));
-  keys.set("spoolRetryInitialSeconds", Value(1.5));
-  keys.set("spoolRetryMaxSeconds", Value(1.5));
+  keys.set("spoolRetryInitialSeconds", Value(3));
+  keys.set("spoolRetryMaxSeconds", Value(3));
   startAll(keys);
   auto client = startSession(504);
   ASSERT_TRUE(client);
