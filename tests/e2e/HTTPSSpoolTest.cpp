@@ -37,7 +37,6 @@ class HTTPSSpoolTest : public E2eTest {
     for (const auto& [key, value] : spoolKeys) {
       Defaults("com.velmar.zerith").setObject(key, value);
     }
-    const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     behaviourFile = root.path() / "collector/behaviour";
     collector = startBehavingCollector(root.path(), behaviourFile);
