@@ -6,13 +6,9 @@
 
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <cstdlib>
-#include <cstring>
-#include <filesystem>
 #include <future>
 #include <memory>
 #include <thread>
@@ -20,6 +16,7 @@
 #include "ipc/SocketConnection.h"
 #include "ipc/tests/IpcTestSupport.h"
 #include "platform/Log.h"
+#include "tests/support/TempRoot.h"
 
 namespace zerith::ipc::test {
 namespace {
@@ -30,28 +27,18 @@ constexpr std::size_t kPad = 4000;
 
 Data eventArgsPad() { return Data(kPad, 0x65); }
 
-// A listener's socket in a folder of its own, the client end connected to it
+// A listening socket in a root of its own, the client end connected to it
 // with SocketConnection::connect, and the accepted daemon end as a raw
 // socket the test reads (or leaves unread) itself.
 struct ClientEnd {
-  std::filesystem::path folder;
-  file::UniqueFd listening;
+  zerith::test::TempRoot root;
+  file::UniqueFd listening = boundSocket((root / "/client.sock").string(), 1);
   std::optional<RawFrameSocket> raw;
   std::shared_ptr<SocketConnection> connection;
   Counter invalidated;
 
   ClientEnd() {
-    char folderTemplate[] = "/tmp/zerith-ipc-XXXXXX";
-    const char* made = ::mkdtemp(folderTemplate);
-    EXPECT_NE(made, nullptr);
-    folder = made ? made : "/tmp";
-    const std::string path = (folder / "socket").string();
-    listening.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
-    EXPECT_EQ(::listen(listening.get(), 1), 0);
+    const std::string path = (root / "/client.sock").string();
     Error error;
     connection = SocketConnection::connect(path, &error);
     EXPECT_TRUE(connection) << error.description;
@@ -68,8 +55,6 @@ struct ClientEnd {
       connection->invalidate();
       invalidated.waitFor(1);
     }
-    std::error_code ignored;
-    std::filesystem::remove_all(folder, ignored);
   }
 
   std::optional<IncomingMessage> readMessage() { return readIncoming(*raw); }

@@ -7,9 +7,11 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 
 #include <chrono>
 #include <condition_variable>
+#include <cstring>
 #include <functional>
 #include <future>
 #include <mutex>
@@ -169,6 +171,18 @@ inline CallResult callAndWait(Connection& connection, const std::string& op, Dic
     return CallResult{};
   }
   return future.get();
+}
+
+// A socket bound at `path` and listening with `backlog` (0: bound only, as a
+// listener that died leaves it).
+inline file::UniqueFd boundSocket(const std::string& path, int backlog) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
+  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  EXPECT_EQ(::bind(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0) << path;
+  EXPECT_TRUE(backlog == 0 || ::listen(fd.get(), backlog) == 0) << path;
+  return fd;
 }
 
 inline Data bytesOfText(const std::string& s) { return Data(s.begin(), s.end()); }
