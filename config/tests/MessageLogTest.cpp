@@ -71,31 +71,40 @@ TEST_F(MessageLogTest, MissingFolderIsCreatedAndANewFileStarted) {
   EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Saved log message to " + file.string()));
 }
 
-TEST_F(MessageLogTest, OfTwoCurrentFilesTheOlderIsDeletedAndTheNewerWritten) {
-  const std::string older = fileAged(20);
-  const std::string newer = fileAged(10);
-  byName().write("line");
-  EXPECT_EQ(namesIn(folder()), std::set<std::string>{newer});
-  EXPECT_EQ(linesOf(folder() / newer),
-            (std::vector<std::string>{"old line", "(2023-11-14 22:13:20 +0000) line"}));
-  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
-                                               (folder() / older).string() + " (2023-11-14 02:13:20 +0000)"));
-  EXPECT_EQ(capture_.count("Created new zerithd log file"), 0u);
-}
-
-TEST_F(MessageLogTest, FileOlderThanADayIsDeletedAndANewOneStarted) {
-  const std::string expired = fileAged(25);
-  byName().write("fresh");
-  EXPECT_EQ(namesIn(folder()), std::set<std::string>{newName_});
-  EXPECT_EQ(linesOf(folder() / newName_), std::vector<std::string>{"(2023-11-14 22:13:20 +0000) fresh"});
-  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
-                                               (folder() / expired).string() + " (2023-11-13 21:13:20 +0000)"));
-}
-
-TEST_F(MessageLogTest, ExactlyOneDayOldIsNotYetExpired) {
-  const std::string day = fileAged(24);
-  byName().write("still");
-  EXPECT_EQ(namesIn(folder()), std::set<std::string>{day});
+// Files of the given ages (hours) before a write: which one is written,
+// which are deleted as expired (with their dates), and whether a new one
+// is started. A day old is not yet expired.
+TEST_F(MessageLogTest, ExpiredFilesAreDeletedAndTheNewestCurrentOneIsWritten) {
+  const struct {
+    const char* name;
+    std::vector<double> ages;
+    int written;  // index into ages, or -1 for a new file
+    std::vector<std::pair<int, const char*>> deleted;
+  } rows[] = {
+      {"of two current files the older goes", {20, 10}, 1, {{0, "2023-11-14 02:13:20 +0000"}}},
+      {"older than a day", {25}, -1, {{0, "2023-11-13 21:13:20 +0000"}}},
+      {"exactly a day", {24}, 0, {}},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    fs::remove_all(folder());
+    capture_.clear();
+    std::vector<std::string> names;
+    for (const double age : row.ages) names.push_back(fileAged(age));
+    byName().write("line");
+    const std::string written = row.written < 0 ? newName_ : names[static_cast<std::size_t>(row.written)];
+    EXPECT_EQ(namesIn(folder()), std::set<std::string>{written});
+    std::vector<std::string> lines{"(2023-11-14 22:13:20 +0000) line"};
+    if (row.written >= 0) lines.insert(lines.begin(), "old line");
+    EXPECT_EQ(linesOf(folder() / written), lines);
+    for (const auto& [index, date] : row.deleted) {
+      EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
+                                                   (folder() / names[static_cast<std::size_t>(index)]).string() + " (" +
+                                                   date + ")"));
+    }
+    EXPECT_EQ(capture_.count("Deleted expired"), row.deleted.size());
+    EXPECT_EQ(capture_.count("Created new zerithd log file"), row.written < 0 ? 1u : 0u);
+  }
 }
 
 TEST_F(MessageLogTest, ForeignNamesAreLeftAlone) {
