@@ -89,10 +89,8 @@ TEST_F(DeviceInfoTest, OperatorFileWinsOverLinuxSourcesAndIsReReadWhenChanged) {
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
   EXPECT_EQ(answer(kDeviceKeyProductType), "Tarvix");
   EXPECT_EQ(answer(kDeviceKeyReleaseType), std::nullopt);
-}
 
-TEST_F(DeviceInfoTest, NonStringEntryOfTheOperatorFileFallsBackToLinux) {
-  root_.write("/etc/os-release", "VERSION_ID=12\n");
+  // An entry that is not a string falls back to Linux.
   writeDeviceFile({{"ProductVersion", Value(17)}});
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
 }
@@ -161,35 +159,32 @@ TEST_F(DeviceInfoTest, UninitialisedMachineIDGivesNoIdentifier) {
             Value(*device::uniqueDeviceIDFromMachineID(kMachineID)));
 }
 
+// The 40 characters and their NUL go only into a buffer that holds them
+// (a wider one also gets a NUL at its end); without an answer the buffer
+// is left alone.
 TEST_F(DeviceInfoTest, CopyUniqueDeviceIDFillsOnlyABufferThatHoldsIt) {
-  root_.write("/etc/machine-id", kMachineID);
   const std::string id = *device::uniqueDeviceIDFromMachineID(kMachineID);
-
-  char exact[41];
-  std::memset(exact, 'x', sizeof(exact));
-  copyUniqueDeviceID(exact, sizeof(exact));
-  EXPECT_EQ(std::string(exact), id);
-
-  char wide[48];
-  std::memset(wide, 'x', sizeof(wide));
-  copyUniqueDeviceID(wide, sizeof(wide));
-  EXPECT_EQ(std::string(wide), id);
-  EXPECT_EQ(wide[41], 'x');
-  EXPECT_EQ(wide[47], '\0');
-
-  char small[40];
-  std::memset(small, 'x', sizeof(small));
-  copyUniqueDeviceID(small, sizeof(small));
-  EXPECT_EQ(std::string(small, sizeof(small)), std::string(40, 'x'));
-  copyUniqueDeviceID(small, 0);
+  const std::string none(48, 'x');
+  const struct {
+    bool machineID;
+    std::size_t size;
+    std::string expected;
+  } rows[] = {
+      {false, 41, none},
+      {true, 41, id + '\0' + std::string(7, 'x')},
+      {true, 48, id + '\0' + std::string(6, 'x') + '\0'},
+      {true, 40, none},
+      {true, 0, none},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(testing::Message() << row.size << (row.machineID ? " with" : " without") << " a machine id");
+    if (row.machineID) root_.write("/etc/machine-id", kMachineID);
+    char buffer[48];
+    std::memset(buffer, 'x', sizeof(buffer));
+    copyUniqueDeviceID(buffer, row.size);
+    EXPECT_EQ(std::string(buffer, sizeof(buffer)), row.expected);
+  }
   copyUniqueDeviceID(nullptr, 41);
-}
-
-TEST_F(DeviceInfoTest, CopyUniqueDeviceIDWithoutAnAnswerLeavesTheBuffer) {
-  char buffer[41];
-  std::memset(buffer, 'x', sizeof(buffer));
-  copyUniqueDeviceID(buffer, sizeof(buffer));
-  EXPECT_EQ(std::string(buffer, sizeof(buffer)), std::string(41, 'x'));
 }
 
 TEST(DeviceParsersTest, OsReleaseQuotingEscapesAndJunkLines) {
