@@ -135,10 +135,18 @@ struct RawPeer {
   }
 };
 
-// Two real connections joined by a socket pair.
+// Two real connections joined by a socket pair; serve() exports `object` on
+// b and resumes both.
 struct ConnectedPair {
   std::shared_ptr<SocketConnection> a;
   std::shared_ptr<SocketConnection> b;
+  std::shared_ptr<RecordingObject> object = std::make_shared<RecordingObject>();
+
+  void serve() {
+    b->setExportedObject(object);
+    a->resume();
+    b->resume();
+  }
 
   ConnectedPair() {
     int fds[2];

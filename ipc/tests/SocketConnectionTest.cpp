@@ -201,9 +201,7 @@ TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
       it->second->send(Dictionary{{"caller", it->first.args.get("caller")}, {"n", it->first.args.get("n")}});
     }
   };
-  pair.b->setExportedObject(object);
-  pair.a->resume();
-  pair.b->resume();
+  pair.serve();
 
   std::atomic<int> matched{0};
   std::atomic<int> wrong{0};
@@ -242,11 +240,8 @@ TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOw
   std::vector<std::unique_ptr<ConnectedPair>> pairs;
   for (int p = 0; p < kPairs; ++p) {
     pairs.push_back(std::make_unique<ConnectedPair>());
-    auto object = std::make_shared<RecordingObject>();
-    object->quick = [](const Message& m) { return m.args.get("n").intValue() % 3 != 0; };
-    pairs.back()->b->setExportedObject(object);
-    pairs.back()->a->resume();
-    pairs.back()->b->resume();
+    pairs.back()->object->quick = [](const Message& m) { return m.args.get("n").intValue() % 3 != 0; };
+    pairs.back()->serve();
   }
   std::atomic<int> matched{0};
   std::atomic<int> wrong{0};
@@ -273,11 +268,9 @@ TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOw
 
 TEST(SocketConnectionCalls, AWaitedCallEndsWithTheConnectionOrAtItsTimeOut) {
   ConnectedPair pair;
-  auto object = std::make_shared<RecordingObject>();
+  auto& object = pair.object;
   object->answer = [](const Message&, std::shared_ptr<Reply>) {};  // never answers
-  pair.b->setExportedObject(object);
-  pair.a->resume();
-  pair.b->resume();
+  pair.serve();
   const auto late = pair.a->callAndWait("silence", Dictionary{}, 100ms);
   EXPECT_TRUE(late.timedOut);
   EXPECT_FALSE(late.args);
@@ -345,14 +338,12 @@ TEST(SocketConnectionCalls, PendingAndLaterCallsFailWhenThePeerGoesAway) {
 
 TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
   ConnectedPair pair;
-  auto object = std::make_shared<RecordingObject>();
+  auto& object = pair.object;
   object->answer = [](const Message&, std::shared_ptr<Reply> r) {
     r->fail(Error{"test.domain", 12, "no such thing"});
     r->send(Dictionary{{"late", true}});  // a second answer is dropped
   };
-  pair.b->setExportedObject(object);
-  pair.a->resume();
-  pair.b->resume();
+  pair.serve();
   const auto first = callAndWait(*pair.a, "x", Dictionary{});
   ASSERT_TRUE(first.error);
   EXPECT_EQ(*first.error, (Error{"test.domain", 12, "no such thing"}));
