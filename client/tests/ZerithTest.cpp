@@ -127,19 +127,36 @@ TEST_F(ZerithFixture, TheDaemonsMessagesReachTheMessageHandler) {
   EXPECT_EQ(p, Value(Dictionary{{"b", "c"}}));
 }
 
+// Each pending completion fails in its own way: nil, nil and the error,
+// false; the session answering late, after its client is gone, harms
+// nothing.
 TEST_F(ZerithFixture, DaemonClosingTheSessionRunsTheInvalidationHandlerOnceAndFailsPendingCalls) {
   daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
   auto z = open();
   Counter invalidated;
   z->setInvalidationHandler([&] { invalidated.hit(); });
   std::promise<Value> url;
+  std::promise<std::pair<Value, std::optional<Error>>> flushed;
+  std::promise<bool> uploaded;
   z->fetchDisplayURL([&](Value v) { url.set_value(v); });
+  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
+  z->uploadFileAtPath(Value("/dev/null"), Value(), [&](bool ok) { uploaded.set_value(ok); });
   auto client = daemon->waitForClient();
-  ASSERT_TRUE(client.session->log.waitFor(1));
+  ASSERT_TRUE(client.session->log.waitFor(3));
   client.connection->invalidate();
   auto f = url.get_future();
+  auto f2 = flushed.get_future();
+  auto f3 = uploaded.get_future();
   ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
   EXPECT_EQ(f.get(), Value());
+  ASSERT_EQ(f2.wait_for(ipc::test::kWait), std::future_status::ready);
+  EXPECT_EQ(f2.get(), std::make_pair(Value(), std::optional<Error>(
+                                      Error{kZerithErrorDomain, -1, "The connection was invalidated"})));
+  ASSERT_EQ(f3.wait_for(ipc::test::kWait), std::future_status::ready);
+  EXPECT_FALSE(f3.get());
+  for (auto& late : client.session->takeHeld(3)) {
+    late();
+  }
   ASSERT_TRUE(invalidated.waitFor(1));
   EXPECT_FALSE(z->isValid());
   const auto after = z->fetchDisplayURL(5s);

@@ -130,31 +130,6 @@ TEST(ClientSessionWire, NilArgumentsArriveAsNilAndBooleanDefaultsToFalse) {
   EXPECT_FALSE(calls[1].hasCompletion);
 }
 
-TEST(ClientSessionWire, FailedCallsCompleteWithNilFalseAndTheError) {
-  SessionLink link;
-  link.session->answer = false;
-  std::promise<Value> url;
-  std::promise<std::pair<Value, std::optional<Error>>> flushed;
-  std::promise<bool> uploaded;
-  link.proxy.fetchDisplayURL([&](Value v) { url.set_value(v); });
-  link.proxy.flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
-  link.proxy.uploadFileAtPath(Value("/dev/null"), Value(), [&](bool ok) { uploaded.set_value(ok); });
-  ASSERT_TRUE(link.session->log.waitFor(3));
-  link.pair.b->invalidate();  // the daemon end goes away mid-call
-  auto f1 = url.get_future();
-  auto f2 = flushed.get_future();
-  auto f3 = uploaded.get_future();
-  EXPECT_EQ(wait(f1), Value());
-  const auto flush = wait(f2);
-  EXPECT_EQ(flush.first, Value());
-  EXPECT_EQ(flush.second, (Error{kErrorDomain, -1, "The connection was invalidated"}));
-  EXPECT_FALSE(wait(f3));
-  // The session answering late, after its client is gone, harms nothing.
-  for (auto& late : link.session->takeHeld(3)) {
-    late();
-  }
-}
-
 TEST(ClientSessionWire, ACompletionCalledLaterFromAnotherThreadStillReachesTheClient) {
   SessionLink link;
   link.session->answer = false;
@@ -168,14 +143,6 @@ TEST(ClientSessionWire, ACompletionCalledLaterFromAnotherThreadStillReachesTheCl
   }).join();
   auto f = url.get_future();
   EXPECT_EQ(wait(f), Value("https://display.example/session"));
-}
-
-TEST(ClientSessionWire, OperationsWithoutCompletionAnswerAnEmptyReplyOnceTheSessionHasTheCall) {
-  SessionLink link;
-  const auto result = callAndWait(*link.pair.a, wire::kFinishSession, Dictionary{});
-  ASSERT_TRUE(result.args);
-  EXPECT_TRUE(result.args->empty());
-  EXPECT_EQ(link.session->log.size(), 1u);
 }
 
 TEST(ClientSessionWireRefusal, UnknownOperationIsLoggedAnsweredWithAnErrorAndTheConnectionGoesOn) {
