@@ -76,11 +76,9 @@ TEST_F(ZerithFixture, BlockingCallsReturnTheCompletionsArguments) {
 
 TEST_F(ZerithFixture, AsynchronousCompletionsRunOnceWithTheAnswer) {
   auto z = open();
-  std::promise<std::pair<Value, std::optional<Error>>> flushed;
-  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
-  auto f = flushed.get_future();
-  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
-  EXPECT_EQ(f.get().first, Value("flushed"));
+  ipc::test::Answer<std::pair<Value, std::optional<Error>>> flushed;
+  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set({v, e}); });
+  EXPECT_EQ(flushed.get(), std::make_pair(Value("flushed"), std::optional<Error>()));
 }
 
 TEST_F(ZerithFixture, ABlockingCallTimesOutWithAClearError) {
@@ -99,27 +97,23 @@ TEST_F(ZerithFixture, ABlockingCallTimesOutWithAClearError) {
 
 TEST_F(ZerithFixture, ABlockingCallInsideACallbackFailsInsteadOfDeadlocking) {
   auto z = open();
-  std::promise<ZerithReply> inner;
-  z->fetchDisplayURL([&](Value) { inner.set_value(z->startConfig(5s)); });
-  auto f = inner.get_future();
-  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
-  const auto reply = f.get();
+  ipc::test::Answer<ZerithReply> inner;
+  z->fetchDisplayURL([&](Value) { inner.set(z->startConfig(5s)); });
+  const auto reply = inner.get();
   ASSERT_TRUE(reply.error);
   EXPECT_EQ(reply.error->description, "startConfigWithCompletionHandler: cannot wait inside a callback of its own session");
 }
 
 TEST_F(ZerithFixture, TheDaemonsMessagesReachTheMessageHandler) {
   auto z = open();
-  std::promise<std::tuple<Value, double, std::uint16_t, std::uint16_t, Value>> got;
+  ipc::test::Answer<std::tuple<Value, double, std::uint16_t, std::uint16_t, Value>> got;
   z->setMessageHandler([&](const Value& m, double t, std::uint16_t c, std::uint16_t ty, const Value& p) {
-    got.set_value({m, t, c, ty, p});
+    got.set({m, t, c, ty, p});
   });
   ASSERT_TRUE(z->finishSession(5s));  // the daemon knows the client by now
   daemon->waitForClient().toClient->sendMessageToClient(Value(Dictionary{{"a", 1}}), 99.25, 12, 34,
                                                         Value(Dictionary{{"b", "c"}}));
-  auto f = got.get_future();
-  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
-  const auto [m, t, c, ty, p] = f.get();
+  const auto [m, t, c, ty, p] = got.get();
   EXPECT_EQ(m, Value(Dictionary{{"a", 1}}));
   EXPECT_EQ(t, 99.25);
   EXPECT_EQ(c, 12);
@@ -135,25 +129,19 @@ TEST_F(ZerithFixture, DaemonClosingTheSessionRunsTheInvalidationHandlerOnceAndFa
   auto z = open();
   Counter invalidated;
   z->setInvalidationHandler([&] { invalidated.hit(); });
-  std::promise<Value> url;
-  std::promise<std::pair<Value, std::optional<Error>>> flushed;
-  std::promise<bool> uploaded;
-  z->fetchDisplayURL([&](Value v) { url.set_value(v); });
-  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set_value({v, e}); });
-  z->uploadFileAtPath(Value("/dev/null"), Value(), [&](bool ok) { uploaded.set_value(ok); });
+  ipc::test::Answer<Value> url;
+  ipc::test::Answer<std::pair<Value, std::optional<Error>>> flushed;
+  ipc::test::Answer<bool> uploaded;
+  z->fetchDisplayURL([&](Value v) { url.set(v); });
+  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set({v, e}); });
+  z->uploadFileAtPath(Value("/dev/null"), Value(), [&](bool ok) { uploaded.set(ok); });
   auto client = daemon->waitForClient();
   ASSERT_TRUE(client.session->log.waitFor(3));
   client.connection->invalidate();
-  auto f = url.get_future();
-  auto f2 = flushed.get_future();
-  auto f3 = uploaded.get_future();
-  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
-  EXPECT_EQ(f.get(), Value());
-  ASSERT_EQ(f2.wait_for(ipc::test::kWait), std::future_status::ready);
-  EXPECT_EQ(f2.get(), std::make_pair(Value(), std::optional<Error>(
-                                      Error{kZerithErrorDomain, -1, "The connection was invalidated"})));
-  ASSERT_EQ(f3.wait_for(ipc::test::kWait), std::future_status::ready);
-  EXPECT_FALSE(f3.get());
+  EXPECT_EQ(url.get(), Value());
+  EXPECT_EQ(flushed.get(),
+            std::make_pair(Value(), std::optional<Error>(Error{kZerithErrorDomain, -1, "The connection was invalidated"})));
+  EXPECT_FALSE(uploaded.get());
   for (auto& late : client.session->takeHeld(3)) {
     late();
   }

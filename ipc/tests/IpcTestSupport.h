@@ -53,6 +53,25 @@ class Counter {
   int count_ = 0;
 };
 
+// The value a completion was called with, waited for with a bounded wait
+// (a default value and a failure when it never comes).
+template <typename T>
+class Answer {
+ public:
+  void set(T value) { promise_.set_value(std::move(value)); }
+  T get() {
+    if (future_.wait_for(kWait) != std::future_status::ready) {
+      ADD_FAILURE() << "no completion";
+      return T{};
+    }
+    return future_.get();
+  }
+
+ private:
+  std::promise<T> promise_;
+  std::future<T> future_ = promise_.get_future();
+};
+
 // Records the calls an exported object receives and answers them through a
 // test-supplied function (default: echo the arguments back).
 class RecordingObject : public ExportedObject {
