@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <fstream>
+#include <functional>
 #include <regex>
 #include <set>
 #include <thread>
@@ -153,33 +154,41 @@ TEST_F(MessageLogTest, BirthTimeWinsOverTheTimeInTheName) {
       << lines[0];
 }
 
-TEST_F(MessageLogTest, UnlistableFolderIsReportedAndNothingCrashes) {
-  root_.write("/var/log/faultkeep/retired", "a file where the folder should be");
-  byName().write("lost");
-  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Error reading from log directory: Not a directory"));
-  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Failed to create new zerithd log file " +
-                                             (folder() / newName_).string()));
-  EXPECT_EQ(capture_.count("Saved log message"), 0u);
-}
-
-TEST_F(MessageLogTest, FolderThatCannotBeCreatedStopsTheWrite) {
-  // The folder's name is a dangling link: the folder does not exist, and
-  // making it fails because the name is taken.
-  fs::create_directories(folder().parent_path());
-  fs::create_symlink(root_ / "/missing/retired", folder());
-  byName().write("lost");
-  EXPECT_TRUE(capture_.contains("writeToLogFile: Creating zerithd log directory at"));
-  EXPECT_TRUE(capture_.contains("writeToLogFile: Failed to create new zerithd log file"));
-  EXPECT_EQ(capture_.count("Saved log message"), 0u);
-}
-
-TEST_F(MessageLogTest, UnwritableCurrentFileIsReportedNotSaved) {
-  // A folder under a log file's name cannot be opened for writing.
-  fs::create_directories(folder() / newName_);
-  byName().write("lost");
-  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Failed to write log message to " +
-                                             (folder() / newName_).string() + ": Is a directory"));
-  EXPECT_EQ(capture_.count("Saved log message"), 0u);
+// A folder that cannot be listed (a file in its place) or made (a dangling
+// link under its name), or a current file that cannot be opened (a folder
+// under its name): reported, nothing saved, nothing crashes.
+TEST_F(MessageLogTest, FailuresToListMakeOrWriteAreReportedAndNothingIsSaved) {
+  const struct {
+    const char* name;
+    std::function<void()> spoil;
+    std::vector<std::string> errors;
+    const char* note = "";  // another line the write logs first
+  } rows[] = {
+      {"file instead of the folder", [&] { root_.write("/var/log/faultkeep/retired", "a file"); },
+       {"writeToLogFile: Error reading from log directory: Not a directory",
+        "writeToLogFile: Failed to create new zerithd log file " + (folder() / newName_).string()}},
+      {"dangling link instead of the folder",
+       [&] {
+         fs::create_directories(folder().parent_path());
+         fs::create_symlink(root_ / "/missing/retired", folder());
+       },
+       {"writeToLogFile: Failed to create new zerithd log file " + (folder() / newName_).string()},
+       "writeToLogFile: Creating zerithd log directory at"},
+      {"folder instead of the file", [&] { fs::create_directories(folder() / newName_); },
+       {"writeToLogFile: Failed to write log message to " + (folder() / newName_).string() + ": Is a directory"}},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    fs::remove_all(folder().parent_path());
+    capture_.clear();
+    row.spoil();
+    byName().write("lost");
+    for (const auto& error : row.errors) {
+      EXPECT_TRUE(capture_.has(Level::Error, error)) << error;
+    }
+    EXPECT_TRUE(capture_.contains(row.note));
+    EXPECT_EQ(capture_.count("Saved log message"), 0u);
+  }
 }
 
 TEST_F(MessageLogTest, ConcurrentAppendsNeverInterleaveInsideALine) {
