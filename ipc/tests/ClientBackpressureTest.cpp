@@ -143,24 +143,6 @@ TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAnd
   EXPECT_FALSE(held.capture.contains("closing connection"));
 }
 
-TEST_F(ClientBackpressure, ABlockOfTheConnectionsQueueNeverWaits) {
-  HeldBackWriter held;
-  ASSERT_TRUE(held.held());
-  ClientEnd& end = held.end;
-  // Over the mark, nothing read: a block of the connection's own queue still
-  // gets its frame queued and goes on.
-  Counter fromQueue;
-  end.connection->queue().async([&] {
-    end.connection->send("fromQueue", Dictionary{});
-    fromQueue.hit();
-  });
-  EXPECT_TRUE(fromQueue.waitFor(1)) << "a block of the connection's queue waited for the outbox";
-  // Its frame is queued behind the writer's, past the mark by one frame.
-  EXPECT_GT(end.connection->queuedBytes(), kPause);
-  end.connection->invalidate();
-  ASSERT_TRUE(end.invalidated.waitFor(1));
-}
-
 TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
   // A daemon that waits for its replies to be read before it reads on, and a
   // client that would read them only once its own outbox drained, would wait
@@ -189,7 +171,7 @@ TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
 // daemon goes away.
 class ClientBackpressureRelease : public ClientBackpressure, public ::testing::WithParamInterface<bool> {};
 
-TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtOnce) {
+TEST_P(ClientBackpressureRelease, QueueBlocksNeverWaitAndTheEndOfTheConnectionReleasesAWaitingWriterAtOnce) {
   HeldBackWriter held;
   ASSERT_TRUE(held.held());
   ClientEnd& end = held.end;
@@ -197,6 +179,15 @@ TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtO
   constexpr int kEvents = kHeldBackEvents;
   const int before = writer.sent.load();
   ASSERT_LT(before, kEvents);
+  // Over the mark, nothing read: a block of the connection's own queue still
+  // gets its frame queued (past the mark) and goes on.
+  Counter fromQueue;
+  end.connection->queue().async([&] {
+    end.connection->send("fromQueue", Dictionary{});
+    fromQueue.hit();
+  });
+  EXPECT_TRUE(fromQueue.waitFor(1)) << "a block of the connection's queue waited for the outbox";
+  EXPECT_GT(end.connection->queuedBytes(), kPause);
   if (GetParam()) {
     end.connection->invalidate();
   } else {
