@@ -685,12 +685,5 @@ TEST(SocketConnectionIdentity, PeerCredentialsComeFromTheSocketAndTheDescription
   EXPECT_EQ(text.back(), '>');
 }
 
-TEST(SocketConnectionIdentity, ConnectingToNothingFailsWithAClearError) {
-  Error error;
-  EXPECT_EQ(SocketConnection::connect("/nonexistent-zerith/socket", &error), nullptr);
-  EXPECT_EQ(error.domain, kErrorDomain);
-  EXPECT_EQ(error.description, "Cannot connect to /nonexistent-zerith/socket: No such file or directory");
-}
-
 }  // namespace
 }  // namespace zerith::ipc::test
