@@ -29,14 +29,7 @@ struct SessionDeleter {
 };
 using SessionPtr = std::unique_ptr<zerith_session, SessionDeleter>;
 
-struct CApiFixture : ::testing::Test {
-  TempRoot root;
-  std::unique_ptr<TestDaemon> daemon;
-
-  void SetUp() override {
-    grantEntitlement(root);
-    daemon = std::make_unique<TestDaemon>();
-  }
+struct CApiFixture : DaemonFixture {
   SessionPtr open(zerith_format format = ZERITH_FORMAT_JSON) {
     SessionPtr s(zerith_create(format));
     EXPECT_EQ(zerith_connect(s.get(), nullptr), 0) << zerith_last_error();

@@ -29,14 +29,7 @@ bool isUpperCaseUuid(const std::string& s) {
   return true;
 }
 
-struct ZerithFixture : ::testing::Test {
-  TempRoot root;
-  std::unique_ptr<TestDaemon> daemon;
-
-  void SetUp() override {
-    grantEntitlement(root);
-    daemon = std::make_unique<TestDaemon>();
-  }
+struct ZerithFixture : DaemonFixture {
   std::unique_ptr<Zerith> open() {
     Error error;
     auto z = Zerith::connect({}, &error);
