@@ -111,27 +111,28 @@ TEST_F(DeviceInfoTest, BrokenDeviceFileIsLoggedOnceAndIgnored) {
   EXPECT_EQ(capture_.count("Device facts: ignoring device file"), 2u);
 }
 
-TEST_F(DeviceInfoTest, BinaryDeviceFileWithANulInsideAStringIsRefusedNotFatal) {
-  // {"ProductVersion": "a\0b"}: libplist would abort the process on it.
-  const std::uint8_t bytes[] = {
+// A device file that cannot be used leaves the system's own facts: one
+// whose binary form holds a NUL inside a string (which libplist would abort
+// the process on), and a folder in its place (which not even the superuser
+// can read).
+TEST_F(DeviceInfoTest, UnusableDeviceFileIsLoggedAndIgnoredNotFatal) {
+  // {"ProductVersion": "a\0b"}
+  const std::uint8_t nul[] = {
       0x62, 0x70, 0x6c, 0x69, 0x73, 0x74, 0x30, 0x30, 0xd1, 0x01, 0x02, 0x5e, 0x50, 0x72, 0x6f, 0x64, 0x75,
       0x63, 0x74, 0x56, 0x65, 0x72, 0x73, 0x69, 0x6f, 0x6e, 0x53, 0x61, 0x00, 0x62, 0x08, 0x0b, 0x1a, 0x00,
       0x00, 0x00, 0x00, 0x00, 0x00, 0x01, 0x01, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x03, 0x00, 0x00,
       0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x1e};
+  const std::string path = (root_ / "/etc/zerithd/device.plist").string();
   root_.write("/etc/os-release", "VERSION_ID=12\n");
-  root_.write("/etc/zerithd/device.plist", std::string(reinterpret_cast<const char*>(bytes), sizeof(bytes)));
+  root_.write("/etc/zerithd/device.plist", std::string(reinterpret_cast<const char*>(nul), sizeof(nul)));
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
   EXPECT_TRUE(capture_.contains("string holds a NUL character"));
-}
 
-TEST_F(DeviceInfoTest, UnreadableDeviceFileIsLoggedAndIgnored) {
-  // A folder where the file should be cannot be read, even by the superuser.
-  root_.write("/etc/os-release", "VERSION_ID=12\n");
-  std::filesystem::create_directories(root_ / "/etc/zerithd/device.plist");
+  std::filesystem::remove(path);
+  std::filesystem::create_directories(path);
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_TRUE(capture_.has(Level::Error, "Device facts: cannot read device file " +
-                                             (root_ / "/etc/zerithd/device.plist").string() +
-                                             "; using the system's own facts"));
+  EXPECT_TRUE(capture_.has(Level::Error,
+                           "Device facts: cannot read device file " + path + "; using the system's own facts"));
 }
 
 TEST_F(DeviceInfoTest, UniqueDeviceIDIsKeyedAndNeverTheRawMachineID) {
