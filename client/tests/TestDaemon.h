@@ -5,6 +5,9 @@
 // "com.velmar.private.zerithd" from the entitlements policy), each served
 // by the real exporter in front of a recording session.
 
+#include <gtest/gtest.h>
+
+#include <memory>
 #include <mutex>
 #include <vector>
 
@@ -87,6 +90,17 @@ class TestDaemon : public ipc::ListenerDelegate {
   std::unique_ptr<ipc::Listener> listener_;
   std::mutex mutex_;
   std::vector<Client> clients_;
+};
+
+// A fresh root whose policy admits this user, and a TestDaemon serving it.
+struct DaemonFixture : ::testing::Test {
+  TempRoot root;
+  std::unique_ptr<TestDaemon> daemon;
+
+  void SetUp() override {
+    grantEntitlement(root);
+    daemon = std::make_unique<TestDaemon>();
+  }
 };
 
 }  // namespace zerith::test

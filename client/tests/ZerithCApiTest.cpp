@@ -17,17 +17,10 @@ struct CallbackResult {
   std::optional<std::string> error;
 };
 
-struct Catcher {
-  std::promise<CallbackResult> promise;
+struct Catcher : ipc::test::Answer<CallbackResult> {
   static void callback(void* context, const char* reply, const char* error) {
-    auto* self = static_cast<Catcher*>(context);
-    self->promise.set_value(CallbackResult{reply ? std::optional<std::string>(reply) : std::nullopt,
-                                           error ? std::optional<std::string>(error) : std::nullopt});
-  }
-  CallbackResult get() {
-    auto f = promise.get_future();
-    EXPECT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready) << "callback never ran";
-    return f.get();
+    static_cast<Catcher*>(context)->set(CallbackResult{reply ? std::optional<std::string>(reply) : std::nullopt,
+                                                       error ? std::optional<std::string>(error) : std::nullopt});
   }
 };
 
@@ -36,14 +29,7 @@ struct SessionDeleter {
 };
 using SessionPtr = std::unique_ptr<zerith_session, SessionDeleter>;
 
-struct CApiFixture : ::testing::Test {
-  TempRoot root;
-  std::unique_ptr<TestDaemon> daemon;
-
-  void SetUp() override {
-    grantEntitlement(root);
-    daemon = std::make_unique<TestDaemon>();
-  }
+struct CApiFixture : DaemonFixture {
   SessionPtr open(zerith_format format = ZERITH_FORMAT_JSON) {
     SessionPtr s(zerith_create(format));
     EXPECT_EQ(zerith_connect(s.get(), nullptr), 0) << zerith_last_error();
@@ -160,22 +146,18 @@ TEST_F(CApiFixture, FailedCallReportsTheErrorAndInvalidationCallbackRuns) {
 
 TEST_F(CApiFixture, MessagesFromTheDaemonArriveAsText) {
   auto s = open();
-  struct Got {
-    std::promise<std::string> promise;
-  } got;
+  ipc::test::Answer<std::string> got;
   zerith_set_message_callback(
       s.get(),
       [](void* context, const char* message, double timestamp, uint16_t category, uint16_t type, const char* payload) {
-        static_cast<Got*>(context)->promise.set_value(std::string(message ? message : "NULL") + " " +
+        static_cast<ipc::test::Answer<std::string>*>(context)->set(std::string(message ? message : "NULL") + " " +
                                                       std::to_string(timestamp) + " " + std::to_string(category) + " " +
                                                       std::to_string(type) + " " + (payload ? payload : "NULL"));
       },
       &got);
   ASSERT_EQ(zerith_finish_session(s.get()), 0);
   daemon->waitForClient().toClient->sendMessageToClient(Value(), 1.5, 7, 8, Value(Dictionary{{"x", 1}}));
-  auto f = got.promise.get_future();
-  ASSERT_EQ(f.wait_for(ipc::test::kWait), std::future_status::ready);
-  EXPECT_EQ(f.get(), R"(NULL 1.500000 7 8 {"x":1})");
+  EXPECT_EQ(got.get(), R"(NULL 1.500000 7 8 {"x":1})");
 }
 
 TEST(CApi, UnconnectedOrUnreachableSessionsSayWhy) {

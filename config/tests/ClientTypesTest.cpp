@@ -13,32 +13,23 @@ namespace {
 
 using log::Level;
 
-TEST(ClientTypesTest, TypesWithoutStorebagHaveNoName) {
-  for (ZerithClientType type : {0u, 1u, 2u, 3u, 4u, 24u, 25u, 0xFFFFFFFFu}) {
-    EXPECT_EQ(storebagNameForClientType(type), std::nullopt) << type;
-  }
-}
-
-TEST(ClientTypesTest, SharedStorebagNamesPointToOneBag) {
-  const std::pair<ZerithClientType, const char*> table[] = {
-      {5, "ambrel"},  {6, "bostin"},  {7, "dravon"},  {8, "elquin"},  {9, "farrow"},  {10, "gelmo"},
-      {11, "dravon"}, {12, "hestra"}, {13, "dravon"}, {14, "bostin"}, {15, "bostin"}, {16, "ivolt"},
-      {17, "jarnel"}, {18, "kesto"},  {19, "lumira"}, {20, "dravon"}, {21, "morvah"}, {22, "nelvin"},
-      {23, "orrin"},
+// Types without a storebag have no name; shared names point to one bag.
+TEST(ClientTypesTest, StorebagNamesAndEnvironmentSectionsWithTheirGaps) {
+  const std::pair<ZerithClientType, std::optional<std::string>> bags[] = {
+      {0, {}},        {1, {}},        {2, {}},        {3, {}},        {4, {}},        {24, {}},
+      {25, {}},       {~0u, {}},      {5, "ambrel"},  {6, "bostin"},  {7, "dravon"},  {8, "elquin"},
+      {9, "farrow"},  {10, "gelmo"},  {11, "dravon"}, {12, "hestra"}, {13, "dravon"}, {14, "bostin"},
+      {15, "bostin"}, {16, "ivolt"},  {17, "jarnel"}, {18, "kesto"},  {19, "lumira"}, {20, "dravon"},
+      {21, "morvah"}, {22, "nelvin"}, {23, "orrin"},
   };
-  for (const auto& [type, name] : table) {
+  for (const auto& [type, name] : bags) {
     EXPECT_EQ(storebagNameForClientType(type), name) << type;
   }
-}
-
-TEST(ClientTypesTest, EnvironmentSectionNamesAndTheirGaps) {
-  EXPECT_EQ(environmentNameForType(0), std::nullopt);
-  EXPECT_EQ(environmentNameForType(1), "development");
-  EXPECT_EQ(environmentNameForType(2), "velmar_internal");
-  EXPECT_EQ(environmentNameForType(3), "seed");
-  EXPECT_EQ(environmentNameForType(4), "release");
-  EXPECT_EQ(environmentNameForType(5), std::nullopt);
-  EXPECT_EQ(environmentNameForType(0xFFFFFFFFu), std::nullopt);
+  const std::pair<ZerithEnvironmentType, std::optional<std::string>> sections[] = {
+      {0, {}}, {1, "development"}, {2, "velmar_internal"}, {3, "seed"}, {4, "release"}, {5, {}}, {~0u, {}}};
+  for (const auto& [type, name] : sections) {
+    EXPECT_EQ(environmentNameForType(type), name) << type;
+  }
 }
 
 class EnvironmentTest : public ::testing::Test {
@@ -55,27 +46,34 @@ TEST_F(EnvironmentTest, AbsentValueOnACustomerBuildResolvesToSeed) {
   EXPECT_EQ(lastResolvedEnvironmentType(), kEnvironmentSeed);
 }
 
-TEST_F(EnvironmentTest, OutOfRangeValuesAreCorrectedToInternalAndLoggedUnsigned) {
-  const std::pair<long long, const char*> cases[] = {
-      {5, "userDefaultsEnvironment: Invalid environment type 5"},
-      {100, "userDefaultsEnvironment: Invalid environment type 100"},
-      {-1, "userDefaultsEnvironment: Invalid environment type 4294967295"},
-      {-4, "userDefaultsEnvironment: Invalid environment type 4294967292"},
+// Stored values as read: out of range is corrected to internal and logged
+// unsigned; zero is accepted and selects no section; a numeric string is
+// its integer.
+TEST_F(EnvironmentTest, StoredValuesResolveOrAreCorrected) {
+  const struct {
+    Value stored;
+    ZerithEnvironmentType expected;
+    const char* error;
+  } rows[] = {
+      {Value(5), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 5"},
+      {Value(100), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 100"},
+      {Value(-1), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 4294967295"},
+      {Value(-4), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 4294967292"},
+      {Value(0), kEnvironmentNone, nullptr},
+      {Value("4"), kEnvironmentRelease, nullptr},
   };
-  for (const auto& [stored, message] : cases) {
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.stored.description());
     capture_.clear();
-    setStored(Value(stored));
-    EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentInternal) << stored;
-    EXPECT_TRUE(capture_.has(Level::Error, message)) << message;
-    EXPECT_TRUE(capture_.has(Level::Default, "userDefaultsEnvironment: Environment type 2"));
+    setStored(row.stored);
+    EXPECT_EQ(userDefaultsEnvironment(), row.expected);
+    EXPECT_TRUE(
+        capture_.has(Level::Default, "userDefaultsEnvironment: Environment type " + std::to_string(row.expected)));
+    EXPECT_EQ(capture_.count("Invalid environment type"), row.error ? 1u : 0u);
+    if (row.error) {
+      EXPECT_TRUE(capture_.has(Level::Error, row.error));
+    }
   }
-}
-
-TEST_F(EnvironmentTest, ZeroIsAcceptedAndSelectsNoSection) {
-  setStored(Value(0));
-  EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentNone);
-  EXPECT_EQ(capture_.count("Invalid environment type"), 0u);
-  EXPECT_EQ(environmentNameForType(userDefaultsEnvironment()), std::nullopt);
 }
 
 TEST_F(EnvironmentTest, ChangedDefaultsTakeEffectAtTheNextCallWithoutRestart) {
@@ -86,11 +84,6 @@ TEST_F(EnvironmentTest, ChangedDefaultsTakeEffectAtTheNextCallWithoutRestart) {
               plist::encodeXml(Value(Dictionary{{"environmentType", Value(4)}})));
   EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentRelease);
   EXPECT_EQ(lastResolvedEnvironmentType(), kEnvironmentRelease);
-}
-
-TEST_F(EnvironmentTest, NumericStringIsReadAsItsIntegerValue) {
-  setStored(Value("4"));
-  EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentRelease);
 }
 
 TEST_F(EnvironmentTest, CorruptDefaultsFileCountsAsAbsent) {
@@ -111,25 +104,14 @@ void writeReleaseType(const test::TempRoot& root, const char* releaseType) {
              plist::encodeXml(Value(Dictionary{{"ReleaseType", Value(releaseType)}})));
 }
 
-TEST_F(InternalBuildDeathTest, AbsentValueOnAnInternalBuildResolvesToInternal) {
+TEST_F(InternalBuildDeathTest, AbsentValueResolvesToInternalAndTheFlagIsKeptWhenTheDeviceFileChanges) {
   EXPECT_EXIT(
       {
         test::TempRoot root;
         writeReleaseType(root, "Internal");
-        std::exit(static_cast<int>(userDefaultsEnvironment()));
-      },
-      ::testing::ExitedWithCode(2), "");
-}
-
-TEST_F(InternalBuildDeathTest, FlagIsComputedOnceAndKeptWhenTheDeviceFileChanges) {
-  EXPECT_EXIT(
-      {
-        test::TempRoot root;
-        writeReleaseType(root, "Internal");
-        const bool first = isInternalBuild();
+        const bool internal = userDefaultsEnvironment() == kEnvironmentInternal;
         writeReleaseType(root, "Customer");
-        const bool second = isInternalBuild();
-        std::exit(first && second ? 0 : 1);
+        std::exit(internal && isInternalBuild() ? 0 : 1);
       },
       ::testing::ExitedWithCode(0), "");
 }

@@ -13,11 +13,7 @@ namespace zerith {
 namespace {
 
 TEST(ConversionsTest, ErrorCarriesTheZerithDomainCodeAndDescription) {
-  const Error e = makeZerithError("Nothing to flush", -1);
-  EXPECT_EQ(e.domain, kZerithErrorDomain);
-  EXPECT_EQ(e.code, -1);
-  EXPECT_EQ(e.description, "Nothing to flush");
-  EXPECT_EQ(makeZerithError("backend x disabled by server 503 return code", 503).code, 503);
+  EXPECT_EQ(makeZerithError("Nothing to flush", 503), (Error{kZerithErrorDomain, 503, "Nothing to flush"}));
 }
 
 TEST(ConversionsTest, TimevalKeepsTheMicrosecondFraction) {
@@ -74,17 +70,12 @@ TEST(ConversionsTest, SocketAddressReadsNoMoreThanSixteenCharacters) {
   makeIPv4SocketAddress("10.0.0.1", 1, nullptr);
 }
 
-TEST(ConversionsTest, MemoryEstimateOfAScalarIsItsAllocation) {
+TEST(ConversionsTest, MemoryEstimateIsAScalarsAllocationAndCountsLeavesInContainersTwice) {
   EXPECT_EQ(estimatedPlistMemorySize(Value()), 0u);
-  const Value number(42);
-  EXPECT_GT(number.allocationSize(), 0u);
-  EXPECT_EQ(estimatedPlistMemorySize(number), number.allocationSize());
-  const Value text(std::string(200, 'x'));
-  EXPECT_GE(estimatedPlistMemorySize(text), 200u);
-}
-
-TEST(ConversionsTest, MemoryEstimateCountsLeavesInContainersTwice) {
+  EXPECT_GT(Value(42).allocationSize(), 0u);
+  EXPECT_EQ(estimatedPlistMemorySize(Value(42)), Value(42).allocationSize());
   const Value a(std::string(100, 'a'));
+  EXPECT_GE(estimatedPlistMemorySize(a), 100u);
   const Value b(7);
   const Value array(Array{a, b});
   EXPECT_EQ(estimatedPlistMemorySize(array),

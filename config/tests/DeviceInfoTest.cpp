@@ -89,10 +89,8 @@ TEST_F(DeviceInfoTest, OperatorFileWinsOverLinuxSourcesAndIsReReadWhenChanged) {
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
   EXPECT_EQ(answer(kDeviceKeyProductType), "Tarvix");
   EXPECT_EQ(answer(kDeviceKeyReleaseType), std::nullopt);
-}
 
-TEST_F(DeviceInfoTest, NonStringEntryOfTheOperatorFileFallsBackToLinux) {
-  root_.write("/etc/os-release", "VERSION_ID=12\n");
+  // An entry that is not a string falls back to Linux.
   writeDeviceFile({{"ProductVersion", Value(17)}});
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
 }
@@ -113,27 +111,28 @@ TEST_F(DeviceInfoTest, BrokenDeviceFileIsLoggedOnceAndIgnored) {
   EXPECT_EQ(capture_.count("Device facts: ignoring device file"), 2u);
 }
 
-TEST_F(DeviceInfoTest, BinaryDeviceFileWithANulInsideAStringIsRefusedNotFatal) {
-  // {"ProductVersion": "a\0b"}: libplist would abort the process on it.
-  const std::uint8_t bytes[] = {
+// A device file that cannot be used leaves the system's own facts: one
+// whose binary form holds a NUL inside a string (which libplist would abort
+// the process on), and a folder in its place (which not even the superuser
+// can read).
+TEST_F(DeviceInfoTest, UnusableDeviceFileIsLoggedAndIgnoredNotFatal) {
+  // {"ProductVersion": "a\0b"}
+  const std::uint8_t nul[] = {
       0x62, 0x70, 0x6c, 0x69, 0x73, 0x74, 0x30, 0x30, 0xd1, 0x01, 0x02, 0x5e, 0x50, 0x72, 0x6f, 0x64, 0x75,
       0x63, 0x74, 0x56, 0x65, 0x72, 0x73, 0x69, 0x6f, 0x6e, 0x53, 0x61, 0x00, 0x62, 0x08, 0x0b, 0x1a, 0x00,
       0x00, 0x00, 0x00, 0x00, 0x00, 0x01, 0x01, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x03, 0x00, 0x00,
       0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x1e};
+  const std::string path = (root_ / "/etc/zerithd/device.plist").string();
   root_.write("/etc/os-release", "VERSION_ID=12\n");
-  root_.write("/etc/zerithd/device.plist", std::string(reinterpret_cast<const char*>(bytes), sizeof(bytes)));
+  root_.write("/etc/zerithd/device.plist", std::string(reinterpret_cast<const char*>(nul), sizeof(nul)));
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
   EXPECT_TRUE(capture_.contains("string holds a NUL character"));
-}
 
-TEST_F(DeviceInfoTest, UnreadableDeviceFileIsLoggedAndIgnored) {
-  // A folder where the file should be cannot be read, even by the superuser.
-  root_.write("/etc/os-release", "VERSION_ID=12\n");
-  std::filesystem::create_directories(root_ / "/etc/zerithd/device.plist");
+  std::filesystem::remove(path);
+  std::filesystem::create_directories(path);
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_TRUE(capture_.has(Level::Error, "Device facts: cannot read device file " +
-                                             (root_ / "/etc/zerithd/device.plist").string() +
-                                             "; using the system's own facts"));
+  EXPECT_TRUE(capture_.has(Level::Error,
+                           "Device facts: cannot read device file " + path + "; using the system's own facts"));
 }
 
 TEST_F(DeviceInfoTest, UniqueDeviceIDIsKeyedAndNeverTheRawMachineID) {
@@ -161,35 +160,32 @@ TEST_F(DeviceInfoTest, UninitialisedMachineIDGivesNoIdentifier) {
             Value(*device::uniqueDeviceIDFromMachineID(kMachineID)));
 }
 
+// The 40 characters and their NUL go only into a buffer that holds them
+// (a wider one also gets a NUL at its end); without an answer the buffer
+// is left alone.
 TEST_F(DeviceInfoTest, CopyUniqueDeviceIDFillsOnlyABufferThatHoldsIt) {
-  root_.write("/etc/machine-id", kMachineID);
   const std::string id = *device::uniqueDeviceIDFromMachineID(kMachineID);
-
-  char exact[41];
-  std::memset(exact, 'x', sizeof(exact));
-  copyUniqueDeviceID(exact, sizeof(exact));
-  EXPECT_EQ(std::string(exact), id);
-
-  char wide[48];
-  std::memset(wide, 'x', sizeof(wide));
-  copyUniqueDeviceID(wide, sizeof(wide));
-  EXPECT_EQ(std::string(wide), id);
-  EXPECT_EQ(wide[41], 'x');
-  EXPECT_EQ(wide[47], '\0');
-
-  char small[40];
-  std::memset(small, 'x', sizeof(small));
-  copyUniqueDeviceID(small, sizeof(small));
-  EXPECT_EQ(std::string(small, sizeof(small)), std::string(40, 'x'));
-  copyUniqueDeviceID(small, 0);
+  const std::string none(48, 'x');
+  const struct {
+    bool machineID;
+    std::size_t size;
+    std::string expected;
+  } rows[] = {
+      {false, 41, none},
+      {true, 41, id + '\0' + std::string(7, 'x')},
+      {true, 48, id + '\0' + std::string(6, 'x') + '\0'},
+      {true, 40, none},
+      {true, 0, none},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(testing::Message() << row.size << (row.machineID ? " with" : " without") << " a machine id");
+    if (row.machineID) root_.write("/etc/machine-id", kMachineID);
+    char buffer[48];
+    std::memset(buffer, 'x', sizeof(buffer));
+    copyUniqueDeviceID(buffer, row.size);
+    EXPECT_EQ(std::string(buffer, sizeof(buffer)), row.expected);
+  }
   copyUniqueDeviceID(nullptr, 41);
-}
-
-TEST_F(DeviceInfoTest, CopyUniqueDeviceIDWithoutAnAnswerLeavesTheBuffer) {
-  char buffer[41];
-  std::memset(buffer, 'x', sizeof(buffer));
-  copyUniqueDeviceID(buffer, sizeof(buffer));
-  EXPECT_EQ(std::string(buffer, sizeof(buffer)), std::string(41, 'x'));
 }
 
 TEST(DeviceParsersTest, OsReleaseQuotingEscapesAndJunkLines) {

@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <fstream>
+#include <functional>
 #include <regex>
 #include <set>
 #include <thread>
@@ -71,31 +72,40 @@ TEST_F(MessageLogTest, MissingFolderIsCreatedAndANewFileStarted) {
   EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Saved log message to " + file.string()));
 }
 
-TEST_F(MessageLogTest, OfTwoCurrentFilesTheOlderIsDeletedAndTheNewerWritten) {
-  const std::string older = fileAged(20);
-  const std::string newer = fileAged(10);
-  byName().write("line");
-  EXPECT_EQ(namesIn(folder()), std::set<std::string>{newer});
-  EXPECT_EQ(linesOf(folder() / newer),
-            (std::vector<std::string>{"old line", "(2023-11-14 22:13:20 +0000) line"}));
-  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
-                                               (folder() / older).string() + " (2023-11-14 02:13:20 +0000)"));
-  EXPECT_EQ(capture_.count("Created new zerithd log file"), 0u);
-}
-
-TEST_F(MessageLogTest, FileOlderThanADayIsDeletedAndANewOneStarted) {
-  const std::string expired = fileAged(25);
-  byName().write("fresh");
-  EXPECT_EQ(namesIn(folder()), std::set<std::string>{newName_});
-  EXPECT_EQ(linesOf(folder() / newName_), std::vector<std::string>{"(2023-11-14 22:13:20 +0000) fresh"});
-  EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
-                                               (folder() / expired).string() + " (2023-11-13 21:13:20 +0000)"));
-}
-
-TEST_F(MessageLogTest, ExactlyOneDayOldIsNotYetExpired) {
-  const std::string day = fileAged(24);
-  byName().write("still");
-  EXPECT_EQ(namesIn(folder()), std::set<std::string>{day});
+// Files of the given ages (hours) before a write: which one is written,
+// which are deleted as expired (with their dates), and whether a new one
+// is started. A day old is not yet expired.
+TEST_F(MessageLogTest, ExpiredFilesAreDeletedAndTheNewestCurrentOneIsWritten) {
+  const struct {
+    const char* name;
+    std::vector<double> ages;
+    int written;  // index into ages, or -1 for a new file
+    std::vector<std::pair<int, const char*>> deleted;
+  } rows[] = {
+      {"of two current files the older goes", {20, 10}, 1, {{0, "2023-11-14 02:13:20 +0000"}}},
+      {"older than a day", {25}, -1, {{0, "2023-11-13 21:13:20 +0000"}}},
+      {"exactly a day", {24}, 0, {}},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    fs::remove_all(folder());
+    capture_.clear();
+    std::vector<std::string> names;
+    for (const double age : row.ages) names.push_back(fileAged(age));
+    byName().write("line");
+    const std::string written = row.written < 0 ? newName_ : names[static_cast<std::size_t>(row.written)];
+    EXPECT_EQ(namesIn(folder()), std::set<std::string>{written});
+    std::vector<std::string> lines{"(2023-11-14 22:13:20 +0000) line"};
+    if (row.written >= 0) lines.insert(lines.begin(), "old line");
+    EXPECT_EQ(linesOf(folder() / written), lines);
+    for (const auto& [index, date] : row.deleted) {
+      EXPECT_TRUE(capture_.has(Level::Default, "writeToLogFile: Deleted expired zerithd log file " +
+                                                   (folder() / names[static_cast<std::size_t>(index)]).string() + " (" +
+                                                   date + ")"));
+    }
+    EXPECT_EQ(capture_.count("Deleted expired"), row.deleted.size());
+    EXPECT_EQ(capture_.count("Created new zerithd log file"), row.written < 0 ? 1u : 0u);
+  }
 }
 
 TEST_F(MessageLogTest, ForeignNamesAreLeftAlone) {
@@ -144,33 +154,41 @@ TEST_F(MessageLogTest, BirthTimeWinsOverTheTimeInTheName) {
       << lines[0];
 }
 
-TEST_F(MessageLogTest, UnlistableFolderIsReportedAndNothingCrashes) {
-  root_.write("/var/log/faultkeep/retired", "a file where the folder should be");
-  byName().write("lost");
-  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Error reading from log directory: Not a directory"));
-  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Failed to create new zerithd log file " +
-                                             (folder() / newName_).string()));
-  EXPECT_EQ(capture_.count("Saved log message"), 0u);
-}
-
-TEST_F(MessageLogTest, FolderThatCannotBeCreatedStopsTheWrite) {
-  // The folder's name is a dangling link: the folder does not exist, and
-  // making it fails because the name is taken.
-  fs::create_directories(folder().parent_path());
-  fs::create_symlink(root_ / "/missing/retired", folder());
-  byName().write("lost");
-  EXPECT_TRUE(capture_.contains("writeToLogFile: Creating zerithd log directory at"));
-  EXPECT_TRUE(capture_.contains("writeToLogFile: Failed to create new zerithd log file"));
-  EXPECT_EQ(capture_.count("Saved log message"), 0u);
-}
-
-TEST_F(MessageLogTest, UnwritableCurrentFileIsReportedNotSaved) {
-  // A folder under a log file's name cannot be opened for writing.
-  fs::create_directories(folder() / newName_);
-  byName().write("lost");
-  EXPECT_TRUE(capture_.has(Level::Error, "writeToLogFile: Failed to write log message to " +
-                                             (folder() / newName_).string() + ": Is a directory"));
-  EXPECT_EQ(capture_.count("Saved log message"), 0u);
+// A folder that cannot be listed (a file in its place) or made (a dangling
+// link under its name), or a current file that cannot be opened (a folder
+// under its name): reported, nothing saved, nothing crashes.
+TEST_F(MessageLogTest, FailuresToListMakeOrWriteAreReportedAndNothingIsSaved) {
+  const struct {
+    const char* name;
+    std::function<void()> spoil;
+    std::vector<std::string> errors;
+    const char* note = "";  // another line the write logs first
+  } rows[] = {
+      {"file instead of the folder", [&] { root_.write("/var/log/faultkeep/retired", "a file"); },
+       {"writeToLogFile: Error reading from log directory: Not a directory",
+        "writeToLogFile: Failed to create new zerithd log file " + (folder() / newName_).string()}},
+      {"dangling link instead of the folder",
+       [&] {
+         fs::create_directories(folder().parent_path());
+         fs::create_symlink(root_ / "/missing/retired", folder());
+       },
+       {"writeToLogFile: Failed to create new zerithd log file " + (folder() / newName_).string()},
+       "writeToLogFile: Creating zerithd log directory at"},
+      {"folder instead of the file", [&] { fs::create_directories(folder() / newName_); },
+       {"writeToLogFile: Failed to write log message to " + (folder() / newName_).string() + ": Is a directory"}},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    fs::remove_all(folder().parent_path());
+    capture_.clear();
+    row.spoil();
+    byName().write("lost");
+    for (const auto& error : row.errors) {
+      EXPECT_TRUE(capture_.has(Level::Error, error)) << error;
+    }
+    EXPECT_TRUE(capture_.contains(row.note));
+    EXPECT_EQ(capture_.count("Saved log message"), 0u);
+  }
 }
 
 TEST_F(MessageLogTest, ConcurrentAppendsNeverInterleaveInsideALine) {

@@ -146,55 +146,50 @@ TEST_F(StorebagFetchTest, ServerURLComesFromTheDefaultsAtEveryCall) {
 
 // --- Sections, versions and max age from a fresh cached copy ----------------
 
-TEST_F(StorebagFetchTest, EachEnvironmentGetsItsSection) {
-  cacheFresh(sampleStorebag());
-  for (int environment : {1, 2, 3, 4}) {
-    setEnvironment(environment);
+// A fresh cached copy answers each environment with its section, its
+// version and the max age; a seed device without a seed section gets the
+// release one; a missing or malformed section fails naming the environment.
+TEST_F(StorebagFetchTest, EachEnvironmentGetsItsSectionOrAnErrorNamingIt) {
+  const Value noSeed = withoutKey(sampleStorebag(), "seed");
+  const std::string notFound = "fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type 5 with ";
+  const std::string seedMissing = "fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag.";
+  const struct {
+    const char* name;
+    Value bag;
+    int environment;
+    Value section;
+    std::string error;  // the one error line, if any
+  } rows[] = {
+      {"development", sampleStorebag(), 1, sampleStorebag()["development"], ""},
+      {"internal", sampleStorebag(), 2, sampleStorebag()["velmar_internal"], ""},
+      {"seed", sampleStorebag(), 3, sampleStorebag()["seed"], ""},
+      {"release", sampleStorebag(), 4, releaseSection(), ""},
+      {"seed without a seed section", noSeed, 3, releaseSection(), seedMissing},
+      {"seed without seed or release", withoutKey(noSeed, "release"), 3, Value(), notFound + "release environment"},
+      {"development missing", withoutKey(sampleStorebag(), "development"), 1, Value(), notFound + "development environment"},
+      {"release not a section", withEntry(sampleStorebag(), "release", "not a section"), 4, Value(),
+       notFound + "release environment"},
+      {"no environment selected", sampleStorebag(), 0, Value(), notFound + "(null) environment"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    cacheFresh(row.bag);
+    setEnvironment(row.environment);
+    logs_.clear();
     const auto r = fetch(5);
-    const char* names[] = {"", "development", "velmar_internal", "seed", "release"};
-    EXPECT_EQ(r.section, sampleStorebag()[names[environment]]);
-    EXPECT_EQ(r.version, Value("2.4.0"));
-    EXPECT_EQ(r.maxAge, 86400);
-    EXPECT_FALSE(r.unchanged);
+    EXPECT_EQ(r.section, row.section);
+    if (!row.section.isNil()) {
+      EXPECT_EQ(r.version, Value("2.4.0"));
+      EXPECT_EQ(r.maxAge, 86400);
+      EXPECT_FALSE(r.unchanged);
+      EXPECT_TRUE(logs_.has(Level::Default, "fetchStorebagWithName: storebag 'ambrel' loaded from disk cache. Disk "
+                                            "cache is valid and will not be refreshed"));
+    }
+    EXPECT_EQ(logs_.count("Seed section is missing"), row.environment == 3 && !row.error.empty() ? 1u : 0u);
+    if (!row.error.empty()) {
+      EXPECT_TRUE(logs_.has(Level::Error, row.error));
+    }
   }
-  EXPECT_TRUE(logs_.has(Level::Default,
-                        "fetchStorebagWithName: storebag 'ambrel' loaded from disk cache. Disk cache is valid and "
-                        "will not be refreshed"));
-}
-
-TEST_F(StorebagFetchTest, SeedWithoutSeedSectionFallsBackToRelease) {
-  cacheFresh(withoutKey(sampleStorebag(), "seed"));
-  setEnvironment(3);
-  EXPECT_EQ(fetch(5).section, releaseSection());
-  EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag."));
-
-  cacheFresh(withoutKey(withoutKey(sampleStorebag(), "seed"), "release"));
-  logs_.clear();
-  EXPECT_TRUE(fetch(5).section.isNil());
-  EXPECT_TRUE(logs_.has(Level::Error,
-                        "fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type 5 with "
-                        "release environment"));
-}
-
-TEST_F(StorebagFetchTest, MissingOrMalformedSectionFailsNamingTheEnvironment) {
-  cacheFresh(withoutKey(sampleStorebag(), "development"));
-  setEnvironment(1);
-  EXPECT_TRUE(fetch(5).section.isNil());
-  EXPECT_TRUE(logs_.has(Level::Error,
-                        "fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type 5 with "
-                        "development environment"));
-  EXPECT_FALSE(logs_.contains("Seed section is missing"));
-
-  cacheFresh(withEntry(sampleStorebag(), "release", "not a section"));
-  setEnvironment(4);
-  logs_.clear();
-  EXPECT_TRUE(fetch(5).section.isNil());
-  EXPECT_TRUE(logs_.contains("Could not find storebag for client type 5 with release environment"));
-
-  setEnvironment(0);  // selects no section at all
-  logs_.clear();
-  EXPECT_TRUE(fetch(5).section.isNil());
-  EXPECT_TRUE(logs_.contains("Could not find storebag for client type 5 with (null) environment"));
 }
 
 TEST_F(StorebagFetchTest, RefreshCycleReplacesTheMaxAgeUpTo86400) {
@@ -409,15 +404,16 @@ TEST_F(StorebagNginxTest, FirstFetchKeepsTheServersMaxAgeAndLastModified) {
   EXPECT_FALSE(logs_.contains("fetchNetworkStorebag"));
 }
 
-TEST_F(StorebagNginxTest, RefreshOfAnUnchangedFileIsA304ThatChangesNothing) {
+TEST_F(StorebagNginxTest, RefreshOfAnUnchangedFileIsA304AndAChangedFileIsSavedForTheNextFetch) {
   start("max-age=0");
-  const fs::path file = publish("ambrel", signedContainer(sampleStorebag()));
-  ASSERT_EQ(fetch(5).section, releaseSection());
+  const fs::path file = publish("ambrel", signedContainer(sampleStorebag("1.0")));
+  ASSERT_EQ(fetch(5).version, Value("1.0"));
   const auto savedAt = storebagCacheModificationDate("ambrel");
   const Value lastModified = metric("ambrel", "Last-Modified");
 
+  // Unchanged: a 304 that changes nothing.
   logs_.clear();
-  EXPECT_EQ(fetch(5).section, releaseSection());
+  EXPECT_EQ(fetch(5).version, Value("1.0"));
   EXPECT_TRUE(logs_.contains("Disk cache expired and will be refreshed"));
   ASSERT_TRUE(logs_.waitFor("does not need update as its content has not changed"));
   EXPECT_TRUE(nginx_->waitForAccessLog("GET /bags/ambrel?version=8.0 304 ims=\"" + httpDate(file) + "\""))
@@ -425,13 +421,8 @@ TEST_F(StorebagNginxTest, RefreshOfAnUnchangedFileIsA304ThatChangesNothing) {
   EXPECT_EQ(storebagCacheModificationDate("ambrel"), savedAt);
   EXPECT_EQ(metric("ambrel", "Last-Modified"), lastModified);
   EXPECT_EQ(metric("ambrel", "max-age"), Value(0));
-}
 
-TEST_F(StorebagNginxTest, ChangedFileIsSavedByTheRefreshAndServedByTheNextFetch) {
-  start("max-age=0");
-  const fs::path file = publish("ambrel", signedContainer(sampleStorebag("1.0")));
-  ASSERT_EQ(fetch(5).version, Value("1.0"));
-
+  // Changed: saved by the refresh, served by the next fetch.
   const Data newer = signedContainer(sampleStorebag("2.0"));
   publish("ambrel", newer);
   fs::last_write_time(file, fs::last_write_time(file) + std::chrono::seconds(10));
@@ -440,8 +431,9 @@ TEST_F(StorebagNginxTest, ChangedFileIsSavedByTheRefreshAndServedByTheNextFetch)
   ASSERT_TRUE(logs_.waitFor("has been saved to disk cache"));
   EXPECT_EQ(cached("ambrel"), newer);
   EXPECT_EQ(metric("ambrel", "Last-Modified"), Value(httpDate(file)));
+  logs_.clear();
   EXPECT_EQ(fetch(5).version, Value("2.0"));
-  ASSERT_TRUE(logs_.waitFor("does not need update"));  // the third call's refresh: 304
+  ASSERT_TRUE(logs_.waitFor("does not need update"));  // this call's refresh: 304
 }
 
 }  // namespace

@@ -135,31 +135,42 @@ TEST_F(StorebagVerifyTest, OversizedOrDeeplyNestedContainerNeverReachesTheParser
   EXPECT_FALSE(cached("ambrel"));
 }
 
-TEST_F(StorebagVerifyTest, ContainerWithoutSignatureStringIsRefused) {
-  const Value fields = containerFields(signedContainer(sampleStorebag()));
-  EXPECT_TRUE(verify(encode(test::withoutKey(fields, "signature"))).isNil());
-  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature is missing"));
-  logs_.clear();
-  // A signature as data instead of base64 text is no signature either.
-  EXPECT_TRUE(verify(encode(test::withEntry(fields, "signature", Data{1, 2, 3}))).isNil());
-  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature is missing"));
-  logs_.clear();
-  EXPECT_TRUE(verify(encode(Value(Array{fields}))).isNil());  // root is not a dictionary
-  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature is missing"));
-}
-
-TEST_F(StorebagVerifyTest, ContainerWithoutBagIsRefused) {
-  const Value fields = containerFields(signedContainer(sampleStorebag()));
-  EXPECT_TRUE(verify(encode(test::withoutKey(fields, "bag"))).isNil());
-  EXPECT_TRUE(onlyError("fetchStorebagWithName: Storebag can not be decoded"));
-}
-
-TEST_F(StorebagVerifyTest, SignatureOverOtherBytesIsRefused) {
-  const Value good = containerFields(signedContainer(sampleStorebag("1.0")));
-  const Value other = containerFields(signedContainer(sampleStorebag("6.6.6")));
-  EXPECT_TRUE(verify(encode(test::withEntry(good, "bag", *other["bag"].string()))).isNil());
-  EXPECT_TRUE(logs_.contains(notVerified("bad signature")));
-  EXPECT_EQ(logs_.count("fetchStorebagWithName"), 1u);
+// A container whose fields are missing, of the wrong kind, cut short or
+// swapped: refused with exactly one error line, which names the reason.
+TEST_F(StorebagVerifyTest, BrokenContainersAreRefusedWithTheirReason) {
+  const Value fields = containerFields(signedContainer(sampleStorebag("1.0")));
+  const std::string signature = *fields["signature"].string();
+  const std::string bag = *fields["bag"].string();
+  const std::string otherBag = *containerFields(signedContainer(sampleStorebag("6.6.6")))["bag"].string();
+  const std::string missing = "fetchStorebagWithName: Signature is missing";
+  const struct {
+    const char* name;
+    Value container;
+    std::string error;
+  } rows[] = {
+      {"no signature", test::withoutKey(fields, "signature"), missing},
+      {"signature as data, not base64 text", test::withEntry(fields, "signature", Data{1, 2, 3}), missing},
+      {"root is not a dictionary", Value(Array{fields}), missing},
+      {"no bag", test::withoutKey(fields, "bag"), "fetchStorebagWithName: Storebag can not be decoded"},
+      {"signature over other bytes", test::withEntry(fields, "bag", otherBag), notVerified("bad signature")},
+      // One stray symbol after the last whole group cannot be decoded at all.
+      {"signature cut to a stray symbol", test::withEntry(fields, "signature", signature.substr(0, 341)),
+       "fetchStorebagWithName: Signature can not be decoded"},
+      {"bag cut to a stray symbol", test::withEntry(fields, "bag", bag.substr(0, (bag.size() / 4) * 4 - 4) + "Q"),
+       "fetchStorebagWithName: Storebag can not be decoded"},
+      // Cut at a group boundary the text decodes, to bytes the signature
+      // does not cover.
+      {"bag cut at a group", test::withEntry(fields, "bag", bag.substr(0, bag.size() - 8)), notVerified("bad signature")},
+      {"signature cut at a group", test::withEntry(fields, "signature", signature.substr(0, 300)),
+       notVerified("wrong signature length")},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    logs_.clear();
+    EXPECT_TRUE(verify(encode(row.container)).isNil());
+    EXPECT_TRUE(onlyError(row.error)) << row.error;
+    EXPECT_EQ(logs_.count("fetchStorebagWithName"), 1u);
+  }
 }
 
 TEST_F(StorebagVerifyTest, ContainerSignedWithAnotherKeyIsRefused) {
@@ -168,28 +179,6 @@ TEST_F(StorebagVerifyTest, ContainerSignedWithAnotherKeyIsRefused) {
   // the other key's modulus: both keys are random.
   EXPECT_TRUE(logs_.contains(notVerified("invalid padding")) ||
               logs_.contains(notVerified("data too large for modulus")));
-}
-
-TEST_F(StorebagVerifyTest, TruncatedBase64IsRefused) {
-  const Value fields = containerFields(signedContainer(sampleStorebag()));
-  const std::string signature = *fields["signature"].string();
-  const std::string bag = *fields["bag"].string();
-
-  // One stray symbol after the last whole group cannot be decoded at all.
-  EXPECT_TRUE(verify(encode(test::withEntry(fields, "signature", signature.substr(0, 341)))).isNil());
-  EXPECT_TRUE(onlyError("fetchStorebagWithName: Signature can not be decoded"));
-  logs_.clear();
-  const std::string cutBag = bag.substr(0, (bag.size() / 4) * 4 - 4) + "Q";
-  EXPECT_TRUE(verify(encode(test::withEntry(fields, "bag", cutBag))).isNil());
-  EXPECT_TRUE(onlyError("fetchStorebagWithName: Storebag can not be decoded"));
-  logs_.clear();
-  // Cut at a group boundary the text decodes, to bytes the signature does
-  // not cover.
-  EXPECT_TRUE(verify(encode(test::withEntry(fields, "bag", bag.substr(0, bag.size() - 8)))).isNil());
-  EXPECT_TRUE(logs_.contains(notVerified("bad signature")));
-  logs_.clear();
-  EXPECT_TRUE(verify(encode(test::withEntry(fields, "signature", signature.substr(0, 300)))).isNil());
-  EXPECT_TRUE(logs_.contains(notVerified("wrong signature length")));
 }
 
 TEST_F(StorebagVerifyTest, SignedBagThatIsNotADictionaryGivesNothing) {

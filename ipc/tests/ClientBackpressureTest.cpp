@@ -6,13 +6,9 @@
 
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <cstdlib>
-#include <cstring>
-#include <filesystem>
 #include <future>
 #include <memory>
 #include <thread>
@@ -20,6 +16,7 @@
 #include "ipc/SocketConnection.h"
 #include "ipc/tests/IpcTestSupport.h"
 #include "platform/Log.h"
+#include "tests/support/TempRoot.h"
 
 namespace zerith::ipc::test {
 namespace {
@@ -30,28 +27,18 @@ constexpr std::size_t kPad = 4000;
 
 Data eventArgsPad() { return Data(kPad, 0x65); }
 
-// A listener's socket in a folder of its own, the client end connected to it
+// A listening socket in a root of its own, the client end connected to it
 // with SocketConnection::connect, and the accepted daemon end as a raw
 // socket the test reads (or leaves unread) itself.
 struct ClientEnd {
-  std::filesystem::path folder;
-  file::UniqueFd listening;
+  zerith::test::TempRoot root;
+  file::UniqueFd listening = boundSocket((root / "/client.sock").string(), 1);
   std::optional<RawFrameSocket> raw;
   std::shared_ptr<SocketConnection> connection;
   Counter invalidated;
 
   ClientEnd() {
-    char folderTemplate[] = "/tmp/zerith-ipc-XXXXXX";
-    const char* made = ::mkdtemp(folderTemplate);
-    EXPECT_NE(made, nullptr);
-    folder = made ? made : "/tmp";
-    const std::string path = (folder / "socket").string();
-    listening.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
-    EXPECT_EQ(::listen(listening.get(), 1), 0);
+    const std::string path = (root / "/client.sock").string();
     Error error;
     connection = SocketConnection::connect(path, &error);
     EXPECT_TRUE(connection) << error.description;
@@ -68,8 +55,6 @@ struct ClientEnd {
       connection->invalidate();
       invalidated.waitFor(1);
     }
-    std::error_code ignored;
-    std::filesystem::remove_all(folder, ignored);
   }
 
   std::optional<IncomingMessage> readMessage() { return readIncoming(*raw); }
@@ -158,24 +143,6 @@ TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAnd
   EXPECT_FALSE(held.capture.contains("closing connection"));
 }
 
-TEST_F(ClientBackpressure, ABlockOfTheConnectionsQueueNeverWaits) {
-  HeldBackWriter held;
-  ASSERT_TRUE(held.held());
-  ClientEnd& end = held.end;
-  // Over the mark, nothing read: a block of the connection's own queue still
-  // gets its frame queued and goes on.
-  Counter fromQueue;
-  end.connection->queue().async([&] {
-    end.connection->send("fromQueue", Dictionary{});
-    fromQueue.hit();
-  });
-  EXPECT_TRUE(fromQueue.waitFor(1)) << "a block of the connection's queue waited for the outbox";
-  // Its frame is queued behind the writer's, past the mark by one frame.
-  EXPECT_GT(end.connection->queuedBytes(), kPause);
-  end.connection->invalidate();
-  ASSERT_TRUE(end.invalidated.waitFor(1));
-}
-
 TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
   // A daemon that waits for its replies to be read before it reads on, and a
   // client that would read them only once its own outbox drained, would wait
@@ -204,7 +171,7 @@ TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
 // daemon goes away.
 class ClientBackpressureRelease : public ClientBackpressure, public ::testing::WithParamInterface<bool> {};
 
-TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtOnce) {
+TEST_P(ClientBackpressureRelease, QueueBlocksNeverWaitAndTheEndOfTheConnectionReleasesAWaitingWriterAtOnce) {
   HeldBackWriter held;
   ASSERT_TRUE(held.held());
   ClientEnd& end = held.end;
@@ -212,6 +179,15 @@ TEST_P(ClientBackpressureRelease, TheEndOfTheConnectionReleasesAWaitingWriterAtO
   constexpr int kEvents = kHeldBackEvents;
   const int before = writer.sent.load();
   ASSERT_LT(before, kEvents);
+  // Over the mark, nothing read: a block of the connection's own queue still
+  // gets its frame queued (past the mark) and goes on.
+  Counter fromQueue;
+  end.connection->queue().async([&] {
+    end.connection->send("fromQueue", Dictionary{});
+    fromQueue.hit();
+  });
+  EXPECT_TRUE(fromQueue.waitFor(1)) << "a block of the connection's queue waited for the outbox";
+  EXPECT_GT(end.connection->queuedBytes(), kPause);
   if (GetParam()) {
     end.connection->invalidate();
   } else {

@@ -29,13 +29,19 @@ Value changed(const std::function<void(Dictionary&)>& change) {
   return Value(std::move(top));
 }
 
-Dictionary firstSession(const Dictionary& top) { return top.get("sessions").at(0).dictCopy(); }
-
-void replaceFirstSession(Dictionary& top, Dictionary session) {
-  Array sessions = top.get("sessions").arrayCopy();
-  sessions[0] = Value(std::move(session));
-  top.set("sessions", Value(std::move(sessions)));
+// `sample()` with one entry of its first session set to `value`.
+Value sessionWith(const char* key, Value value) {
+  return changed([&](Dictionary& top) {
+    Array sessions = top.get("sessions").arrayCopy();
+    Dictionary session = sessions[0].dictCopy();
+    session.set(key, std::move(value));
+    sessions[0] = Value(std::move(session));
+    top.set("sessions", Value(std::move(sessions)));
+  });
 }
+
+// `sample()` whose first session has the one backend `backend`.
+Value backendWith(Dictionary backend) { return sessionWith("backends", Value(Array{Value(std::move(backend))})); }
 
 TEST(DaemonStatusTest, WhatTheDaemonWritesReadsBackThroughAFrameUnchanged) {
   const Value written = sample().toValue();
@@ -88,48 +94,20 @@ TEST(DaemonStatusTest, ElementsOfTheWrongShapeAreRefusedWithWhereAndWhy) {
        "status.ended is a string, not an array"},
       {"session not a dictionary", changed([](Dictionary& d) { d.set("sessions", Value(Array{Value(1)})); }),
        "status.sessions[0] is an integer, not a dictionary"},
-      {"session ID beyond 32 bits", changed([](Dictionary& d) {
-         Dictionary s = firstSession(d);
-         s.set("sessionID", Value(1ull << 32));
-         replaceFirstSession(d, std::move(s));
-       }),
+      {"session ID beyond 32 bits", sessionWith("sessionID", Value(1ull << 32)),
        "status.sessions[0].sessionID is 4294967296, not an integer from 0 to 4294967295"},
-      {"session ID as a real", changed([](Dictionary& d) {
-         Dictionary s = firstSession(d);
-         s.set("sessionID", Value(1.5));
-         replaceFirstSession(d, std::move(s));
-       }),
+      {"session ID as a real", sessionWith("sessionID", Value(1.5)),
        "status.sessions[0].sessionID is 1.5, not an integer from 0 to 4294967295"},
-      {"client type beyond 64 signed bits", changed([](Dictionary& d) {
-         Dictionary s = firstSession(d);
-         s.set("clientType", Value(static_cast<unsigned long long>(INT64_MAX) + 1));
-         replaceFirstSession(d, std::move(s));
-       }),
-       "not a signed 64-bit integer"},
-      {"backend name too long", changed([&](Dictionary& d) {
-         Dictionary s = firstSession(d);
-         s.set("backends", Value(Array{Value(Dictionary{{"name", longName}, {"state", 2}, {"counts", Dictionary{}}})}));
-         replaceFirstSession(d, std::move(s));
-       }),
+      {"client type beyond 64 signed bits",
+       sessionWith("clientType", Value(static_cast<unsigned long long>(INT64_MAX) + 1)), "not a signed 64-bit integer"},
+      {"backend name too long", backendWith(Dictionary{{"name", longName}, {"state", 2}, {"counts", Dictionary{}}}),
        "status.sessions[0].backends[0].name is 257 bytes long, more than 256"},
-      {"negative count", changed([](Dictionary& d) {
-         Dictionary s = firstSession(d);
-         s.set("backends", Value(Array{Value(Dictionary{{"name", "b"}, {"state", 2}, {"counts", Dictionary{{"sent", -1}}}})}));
-         replaceFirstSession(d, std::move(s));
-       }),
+      {"negative count", backendWith(Dictionary{{"name", "b"}, {"state", 2}, {"counts", Dictionary{{"sent", -1}}}}),
        "status.sessions[0].backends[0].counts.sent is -1, not an integer from 0 to 9223372036854775807"},
-      {"count beyond what the wire carries", changed([](Dictionary& d) {
-         Dictionary s = firstSession(d);
-         s.set("backends", Value(Array{Value(Dictionary{
-                               {"name", "b"}, {"state", 2}, {"counts", Dictionary{{"sent", Value(1ull << 63)}}}})}));
-         replaceFirstSession(d, std::move(s));
-       }),
+      {"count beyond what the wire carries",
+       backendWith(Dictionary{{"name", "b"}, {"state", 2}, {"counts", Dictionary{{"sent", Value(1ull << 63)}}}}),
        "counts.sent is 9223372036854775808, not an integer from 0 to 9223372036854775807"},
-      {"counts missing", changed([](Dictionary& d) {
-         Dictionary s = firstSession(d);
-         s.set("backends", Value(Array{Value(Dictionary{{"name", "b"}, {"state", 2}})}));
-         replaceFirstSession(d, std::move(s));
-       }),
+      {"counts missing", backendWith(Dictionary{{"name", "b"}, {"state", 2}}),
        "status.sessions[0].backends[0].counts is missing"},
       {"too many counts", changed([&](Dictionary& d) {
          Array ended{Value(Dictionary{{"clientType", 7}, {"backend", "b"}, {"sessions", 1}, {"counts", manyCounts}})};

@@ -100,10 +100,8 @@ TEST(DescriptorPassing, FrameClaimingMoreThanAFrameMayCarryEndsTheConnection) {
 
 TEST(DescriptorPassing, ConnectionCallCarriesItsDescriptors) {
   ConnectedPair pair;
-  auto object = std::make_shared<RecordingObject>();
-  pair.b->setExportedObject(object);
-  pair.a->resume();
-  pair.b->resume();
+  auto& object = pair.object;
+  pair.serve();
   Pipe pipe;
   std::vector<file::UniqueFd> fds;
   fds.emplace_back(::dup(pipe.write.get()));

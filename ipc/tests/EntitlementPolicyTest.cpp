@@ -88,6 +88,8 @@ TEST_F(EntitlementPolicyTest, BrokenFilesAreLoggedAndGrantNothingWhileGoodOnesSt
   write("5-no-entitlements.plist",
         "<?xml version=\"1.0\"?><plist><dict><key>users</key><array><integer>41001</integer></array></dict></plist>");
   write("6-good.plist", xmlPolicy("<integer>41001</integer>", "", "<key>good</key><true/>"));
+  // The peer's group 1 is listed, but an unknown group name spoils the file.
+  write("7-unknown-group.plist", xmlPolicy("", "<integer>1</integer><string>no-such-zerith-group</string>", kAdmit));
 
   EXPECT_EQ(policy.entitlementsFor(peer(41001, 1)), (Dictionary{{"good", true}}));
   EXPECT_TRUE(capture.contains("EntitlementPolicy: " + dir + "/1-corrupt.plist: not a property list: "));
@@ -99,13 +101,7 @@ TEST_F(EntitlementPolicyTest, BrokenFilesAreLoggedAndGrantNothingWhileGoodOnesSt
       << "got: " << (capture.lines().size() > 3 ? capture.lines()[3].text : "");
   EXPECT_TRUE(capture.has(log::Level::Error, "EntitlementPolicy: " + dir +
                                                  "/5-no-entitlements.plist: \"entitlements\" is missing or not a dictionary; the file grants nothing"));
-}
-
-TEST_F(EntitlementPolicyTest, UnknownGroupNameSpoilsOnlyItsFile) {
-  log::LogCapture capture;
-  write("a.plist", xmlPolicy("", "<integer>42001</integer><string>no-such-zerith-group</string>", kAdmit));
-  EXPECT_TRUE(policy.entitlementsFor(peer(kUser, kGroup)).empty());
-  EXPECT_TRUE(capture.contains("unknown group \"no-such-zerith-group\"; the file grants nothing"));
+  EXPECT_TRUE(capture.contains("/7-unknown-group.plist: unknown group \"no-such-zerith-group\"; the file grants nothing"));
 }
 
 TEST_F(EntitlementPolicyTest, MissingFolderGrantsNothingAndAnUnreadableOneIsLogged) {

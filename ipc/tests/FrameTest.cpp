@@ -127,27 +127,23 @@ TEST(FrameDecoderTest, FramesCutAtEveryPossiblePlaceComeOutWholeAndInOrder) {
   EXPECT_EQ(decoder.buffered(), 0u);
 }
 
-TEST(FrameDecoderTest, LengthOverTheLimitIsRefusedFromTheHeaderAloneAndStaysRefused) {
+TEST(FrameDecoderTest, ExactlyTheLimitPassesOneMoreIsRefusedFromTheHeaderAloneAndStaysRefused) {
+  FrameDecoder exact(10);
+  const Data frame{0, 0, 0, 10, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10};
+  exact.append(frame.data(), frame.size());
+  plist::Bytes body;
+  std::string why;
+  ASSERT_EQ(exact.next(body, why), FrameDecoder::Status::Frame);
+  EXPECT_EQ(body.size(), 10u);
+
   FrameDecoder decoder(100);
   const Data header{0, 0, 0, 101};
   decoder.append(header.data(), header.size());
-  plist::Bytes body;
-  std::string why;
   EXPECT_EQ(decoder.next(body, why), FrameDecoder::Status::Invalid);
   EXPECT_EQ(why, "frame of 101 bytes exceeds the limit of 100");
   const Data ok = encodeCall("x", std::nullopt, {});
   decoder.append(ok.data(), ok.size());
   EXPECT_EQ(decoder.next(body, why), FrameDecoder::Status::Invalid);
-}
-
-TEST(FrameDecoderTest, ExactlyTheLimitPasses) {
-  FrameDecoder decoder(10);
-  const Data frame{0, 0, 0, 10, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10};
-  decoder.append(frame.data(), frame.size());
-  plist::Bytes body;
-  std::string why;
-  ASSERT_EQ(decoder.next(body, why), FrameDecoder::Status::Frame);
-  EXPECT_EQ(body.size(), 10u);
 }
 
 TEST(MessageShape, RepliesAndCallsThatBreakTheShapeAreRefusedWithTheReason) {

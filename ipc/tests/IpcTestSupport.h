@@ -7,9 +7,11 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 
 #include <chrono>
 #include <condition_variable>
+#include <cstring>
 #include <functional>
 #include <future>
 #include <mutex>
@@ -49,6 +51,25 @@ class Counter {
   mutable std::mutex mutex_;
   std::condition_variable changed_;
   int count_ = 0;
+};
+
+// The value a completion was called with, waited for with a bounded wait
+// (a default value and a failure when it never comes).
+template <typename T>
+class Answer {
+ public:
+  void set(T value) { promise_.set_value(std::move(value)); }
+  T get() {
+    if (future_.wait_for(kWait) != std::future_status::ready) {
+      ADD_FAILURE() << "no completion";
+      return T{};
+    }
+    return future_.get();
+  }
+
+ private:
+  std::promise<T> promise_;
+  std::future<T> future_ = promise_.get_future();
 };
 
 // Records the calls an exported object receives and answers them through a
@@ -133,10 +154,18 @@ struct RawPeer {
   }
 };
 
-// Two real connections joined by a socket pair.
+// Two real connections joined by a socket pair; serve() exports `object` on
+// b and resumes both.
 struct ConnectedPair {
   std::shared_ptr<SocketConnection> a;
   std::shared_ptr<SocketConnection> b;
+  std::shared_ptr<RecordingObject> object = std::make_shared<RecordingObject>();
+
+  void serve() {
+    b->setExportedObject(object);
+    a->resume();
+    b->resume();
+  }
 
   ConnectedPair() {
     int fds[2];
@@ -169,6 +198,18 @@ inline CallResult callAndWait(Connection& connection, const std::string& op, Dic
     return CallResult{};
   }
   return future.get();
+}
+
+// A socket bound at `path` and listening with `backlog` (0: bound only, as a
+// listener that died leaves it).
+inline file::UniqueFd boundSocket(const std::string& path, int backlog) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
+  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  EXPECT_EQ(::bind(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0) << path;
+  EXPECT_TRUE(backlog == 0 || ::listen(fd.get(), backlog) == 0) << path;
+  return fd;
 }
 
 inline Data bytesOfText(const std::string& s) { return Data(s.begin(), s.end()); }

@@ -36,18 +36,6 @@ TEST(SocketConnectionFraming, CallSentOneByteAtATimeIsDeliveredWholeAndAnswered)
   EXPECT_EQ(peer.object->calls()[0].operation, "echo");
 }
 
-TEST(SocketConnectionFraming, SeveralFramesInOneWriteArriveInOrder) {
-  RawPeer peer;
-  peer.write(concat({callFrame("a", std::nullopt), callFrame("b", 1), callFrame("c", std::nullopt)}));
-  ASSERT_TRUE(peer.object->received.waitFor(3));
-  const auto calls = peer.object->calls();
-  EXPECT_EQ(calls[0].operation, "a");
-  EXPECT_FALSE(calls[0].call);
-  EXPECT_EQ(calls[1].operation, "b");
-  EXPECT_EQ(calls[1].call, 1u);
-  EXPECT_EQ(calls[2].operation, "c");
-}
-
 // A binary property list {key: value} with both as 8-bit "ASCII" strings,
 // written by hand because libplist's writer would repair the bytes.
 Data oneEntryBinaryDictionary(const std::string& key, const std::string& value) {
@@ -127,15 +115,20 @@ TEST_P(SocketConnectionBadFrame, ClosesThatConnectionWithAnErrorLogAndDeliversNo
 
 INSTANTIATE_TEST_SUITE_P(Inputs, SocketConnectionBadFrame, ::testing::Range(0, 12));
 
-TEST(SocketConnectionFraming, CallsBeforeABadFrameAreDeliveredThoseAfterItAreNot) {
+TEST(SocketConnectionFraming, FramesOfOneWriteArriveInOrderUpToABadFrameAndNoneAfterIt) {
   log::LogCapture capture;
   RawPeer peer;
-  peer.write(concat({callFrame("first", 1), Data{0, 0, 0, 0}, callFrame("after", 2)}));
+  peer.write(concat({callFrame("a", std::nullopt), callFrame("b", 1), callFrame("c", std::nullopt), Data{0, 0, 0, 0},
+                     callFrame("after", 2)}));
   EXPECT_TRUE(peer.seesEof());
   ASSERT_TRUE(peer.invalidated.waitFor(1));
   const auto calls = peer.object->calls();
-  ASSERT_EQ(calls.size(), 1u);
-  EXPECT_EQ(calls[0].operation, "first");
+  ASSERT_EQ(calls.size(), 3u);
+  EXPECT_EQ(calls[0].operation, "a");
+  EXPECT_FALSE(calls[0].call);
+  EXPECT_EQ(calls[1].operation, "b");
+  EXPECT_EQ(calls[1].call, 1u);
+  EXPECT_EQ(calls[2].operation, "c");
 }
 
 TEST(SocketConnectionFraming, PeerEndingInsideAFrameIsLoggedAndInvalidatesOnce) {
@@ -208,9 +201,7 @@ TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
       it->second->send(Dictionary{{"caller", it->first.args.get("caller")}, {"n", it->first.args.get("n")}});
     }
   };
-  pair.b->setExportedObject(object);
-  pair.a->resume();
-  pair.b->resume();
+  pair.serve();
 
   std::atomic<int> matched{0};
   std::atomic<int> wrong{0};
@@ -249,11 +240,8 @@ TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOw
   std::vector<std::unique_ptr<ConnectedPair>> pairs;
   for (int p = 0; p < kPairs; ++p) {
     pairs.push_back(std::make_unique<ConnectedPair>());
-    auto object = std::make_shared<RecordingObject>();
-    object->quick = [](const Message& m) { return m.args.get("n").intValue() % 3 != 0; };
-    pairs.back()->b->setExportedObject(object);
-    pairs.back()->a->resume();
-    pairs.back()->b->resume();
+    pairs.back()->object->quick = [](const Message& m) { return m.args.get("n").intValue() % 3 != 0; };
+    pairs.back()->serve();
   }
   std::atomic<int> matched{0};
   std::atomic<int> wrong{0};
@@ -280,11 +268,9 @@ TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOw
 
 TEST(SocketConnectionCalls, AWaitedCallEndsWithTheConnectionOrAtItsTimeOut) {
   ConnectedPair pair;
-  auto object = std::make_shared<RecordingObject>();
+  auto& object = pair.object;
   object->answer = [](const Message&, std::shared_ptr<Reply>) {};  // never answers
-  pair.b->setExportedObject(object);
-  pair.a->resume();
-  pair.b->resume();
+  pair.serve();
   const auto late = pair.a->callAndWait("silence", Dictionary{}, 100ms);
   EXPECT_TRUE(late.timedOut);
   EXPECT_FALSE(late.args);
@@ -328,7 +314,7 @@ TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
   }
 }
 
-TEST(SocketConnectionCalls, PendingCallsFailWhenThePeerGoesAway) {
+TEST(SocketConnectionCalls, PendingAndLaterCallsFailWhenThePeerGoesAway) {
   RawPeer peer;
   auto promise = std::make_shared<std::promise<CallResult>>();
   auto future = promise->get_future();
@@ -342,29 +328,22 @@ TEST(SocketConnectionCalls, PendingCallsFailWhenThePeerGoesAway) {
   EXPECT_FALSE(result.args);
   ASSERT_TRUE(result.error);
   EXPECT_EQ(*result.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
-  EXPECT_TRUE(peer.invalidated.waitFor(1));
-}
-
-TEST(SocketConnectionCalls, ACallMadeAfterInvalidationFailsInsteadOfWaitingForever) {
-  RawPeer peer;
-  peer.connection->invalidate();
   ASSERT_TRUE(peer.invalidated.waitFor(1));
-  const auto result = callAndWait(*peer.connection, "late", Dictionary{});
-  ASSERT_TRUE(result.arrived);
-  ASSERT_TRUE(result.error);
-  EXPECT_EQ(result.error->description, "The connection was invalidated");
+  // A call made afterwards fails at once instead of waiting for ever.
+  const auto late = callAndWait(*peer.connection, "late", Dictionary{});
+  ASSERT_TRUE(late.arrived);
+  ASSERT_TRUE(late.error);
+  EXPECT_EQ(late.error->description, "The connection was invalidated");
 }
 
 TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
   ConnectedPair pair;
-  auto object = std::make_shared<RecordingObject>();
+  auto& object = pair.object;
   object->answer = [](const Message&, std::shared_ptr<Reply> r) {
     r->fail(Error{"test.domain", 12, "no such thing"});
     r->send(Dictionary{{"late", true}});  // a second answer is dropped
   };
-  pair.b->setExportedObject(object);
-  pair.a->resume();
-  pair.b->resume();
+  pair.serve();
   const auto first = callAndWait(*pair.a, "x", Dictionary{});
   ASSERT_TRUE(first.error);
   EXPECT_EQ(*first.error, (Error{"test.domain", 12, "no such thing"}));
@@ -376,36 +355,6 @@ TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
 }
 
 // ---- ordering, queue and invalidation -------------------------------------------
-
-TEST(SocketConnectionDelivery, CallsRunInOrderOnTheConnectionsQueueOneAtATime) {
-  RawPeer peer;
-  std::atomic<int> inside{0};
-  std::atomic<bool> overlapped{false};
-  std::atomic<bool> offQueue{false};
-  peer.object->answer = [&](const Message&, std::shared_ptr<Reply>) {
-    if (++inside > 1) {
-      overlapped = true;
-    }
-    if (!peer.connection->queue().isCurrent()) {
-      offQueue = true;
-    }
-    std::this_thread::yield();
-    --inside;
-  };
-  Data all;
-  for (int n = 0; n < 200; ++n) {
-    const Data f = callFrame("n" + std::to_string(n), std::nullopt);
-    all.insert(all.end(), f.begin(), f.end());
-  }
-  peer.write(all, 333);
-  ASSERT_TRUE(peer.object->received.waitFor(200));
-  const auto calls = peer.object->calls();
-  for (int n = 0; n < 200; ++n) {
-    EXPECT_EQ(calls[static_cast<std::size_t>(n)].operation, "n" + std::to_string(n));
-  }
-  EXPECT_FALSE(overlapped);
-  EXPECT_FALSE(offQueue);
-}
 
 // Holds the queues of peers[i..] (nested syncs need no pool thread) while
 // `whileHeld` runs.
@@ -468,19 +417,6 @@ TEST(SocketConnectionDelivery, InvalidationHandlerRunsExactlyOnceWhenEofAndInval
   }
 }
 
-TEST(SocketConnectionDelivery, InterruptionHandlerIsNeverCalled) {
-  Counter interrupted;
-  {
-    RawPeer peer;
-    peer.connection->setInterruptionHandler([&] { interrupted.hit(); });
-    peer.write(callFrame("x", 1));
-    ASSERT_TRUE(peer.readMessage());
-    peer.raw.close();
-    ASSERT_TRUE(peer.invalidated.waitFor(1));
-  }
-  EXPECT_EQ(interrupted.count(), 0);
-}
-
 TEST(SocketConnectionDelivery, NothingIsDeliveredBeforeResume) {
   int fds[2];
   ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
@@ -496,12 +432,14 @@ TEST(SocketConnectionDelivery, NothingIsDeliveredBeforeResume) {
   connection->invalidate();
 }
 
-TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHandler) {
+TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHandlerAndNeverInterrupts) {
   std::weak_ptr<RecordingObject> weak;
   Counter handlerSawObject;
+  Counter interrupted;
   {
     RawPeer peer;
     weak = peer.object;
+    peer.connection->setInterruptionHandler([&] { interrupted.hit(); });
     peer.connection->setInvalidationHandler([&] {
       if (!weak.expired()) {
         handlerSawObject.hit();
@@ -515,6 +453,7 @@ TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHand
     EXPECT_TRUE(weak.expired()) << "the connection still holds its exported object";
   }
   EXPECT_EQ(handlerSawObject.count(), 1);
+  EXPECT_EQ(interrupted.count(), 0);
 }
 
 // ---- the socket threads ------------------------------------------------------------
@@ -728,37 +667,22 @@ TEST(SocketConnectionGatheredWrites, AHandlerThatMayWaitHoldsNoFrameBack) {
 
 // ---- identity ---------------------------------------------------------------------
 
-TEST(SocketConnectionIdentity, PeerCredentialsComeFromTheSocket) {
-  int fds[2];
-  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
-  file::UniqueFd a(fds[0]);
-  file::UniqueFd b(fds[1]);
-  const auto peer = readPeerCredentials(a.get());
-  ASSERT_TRUE(peer);
-  EXPECT_EQ(peer->pid, ::getpid());
-  EXPECT_EQ(peer->uid, ::getuid());
-  EXPECT_EQ(peer->gid, ::getgid());
+TEST(SocketConnectionIdentity, PeerCredentialsComeFromTheSocketAndTheDescriptionNamesThem) {
+  RawPeer raw;
+  const auto& p = raw.connection->peer();
+  EXPECT_EQ(p.pid, ::getpid());
+  EXPECT_EQ(p.uid, ::getuid());
+  EXPECT_EQ(p.gid, ::getgid());
   std::vector<gid_t> groups(static_cast<std::size_t>(::getgroups(0, nullptr)));
   groups.resize(static_cast<std::size_t>(::getgroups(static_cast<int>(groups.size()), groups.data())));
   std::sort(groups.begin(), groups.end());
-  auto got = peer->groups;
+  auto got = p.groups;
   std::sort(got.begin(), got.end());
   EXPECT_EQ(got, groups);
-}
-
-TEST(SocketConnectionIdentity, DescriptionNamesPidUidAndDescriptor) {
-  RawPeer peer;
-  const auto& p = peer.connection->peer();
-  const std::string text = peer.connection->description();
-  EXPECT_EQ(text.rfind("<connection pid=" + std::to_string(p.pid) + " uid=" + std::to_string(p.uid) + " fd=", 0), 0u) << text;
+  const std::string text = raw.connection->description();
+  EXPECT_EQ(text.rfind("<connection pid=" + std::to_string(p.pid) + " uid=" + std::to_string(p.uid) + " fd=", 0), 0u)
+      << text;
   EXPECT_EQ(text.back(), '>');
-}
-
-TEST(SocketConnectionIdentity, ConnectingToNothingFailsWithAClearError) {
-  Error error;
-  EXPECT_EQ(SocketConnection::connect("/nonexistent-zerith/socket", &error), nullptr);
-  EXPECT_EQ(error.domain, kErrorDomain);
-  EXPECT_EQ(error.description, "Cannot connect to /nonexistent-zerith/socket: No such file or directory");
 }
 
 }  // namespace

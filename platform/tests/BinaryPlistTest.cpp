@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/BinaryPlist.h"
+#include "platform/PropertyList.h"
 
 namespace zerith {
 namespace {
@@ -181,17 +182,24 @@ struct Refused {
   const char* name;
   Data bytes;
   std::string why;
+  bool checked = true;  // refused by plist::checkBinary as well
 };
 
 class BinaryPlistRefuses : public testing::TestWithParam<Refused> {};
 
 const plist::Limits kSmall{1u << 16, 8, 1000};
 
+// Our reader and the check in front of libplist enforce the same bounds;
+// rows only our reader refuses (libplist reads them its own way) say so.
 TEST_P(BinaryPlistRefuses, WithTheReasonAsLibplistDoesOrMore) {
   const Refused& row = GetParam();
   std::string why;
   EXPECT_FALSE(bplist::decode(plist::bytesOf(row.bytes), kSmall, &why));
   EXPECT_NE(why.find(row.why), std::string::npos) << why;
+  if (row.checked) {
+    EXPECT_TRUE(plist::checkBinary(plist::bytesOf(row.bytes), kSmall)) << "plist::checkBinary let it through";
+    EXPECT_FALSE(plist::decodeBinary(plist::bytesOf(row.bytes), kSmall));
+  }
 }
 
 const Data kPair = listOf({{0xA2, 1, 2}, {0x51, 'a'}, {0x09}});
@@ -238,18 +246,21 @@ INSTANTIATE_TEST_SUITE_P(
             listOf({{0xA1, 1}, {0xA1, 2}, {0xA1, 3}, {0xA1, 4}, {0xA1, 5}, {0xA1, 6}, {0xA1, 7}, {0xA1, 8}, {0x09}}),
             "nesting deeper than 8"},
         Refused{"NodeBomb", bomb(), "expands to more than 1000 nodes"},
-        Refused{"SharedTextBomb", keyBomb(), "text and data expand to more than 65536 bytes"},
+        Refused{"SharedTextBomb", keyBomb(), "text and data expand to more than 65536 bytes", false},
         Refused{"KeyNotString", listOf({{0xD1, 1, 2}, {0x09}, {0x09}}), "key is not a string"},
         Refused{"NulInString", listOf({{0xA1, 1}, {0x53, 'a', 0, 'b'}}), "NUL"},
-        Refused{"EmptyUtf16", listOf({{0xA1, 1}, {0x60}}), "empty UTF-16"},
+        Refused{"EmptyUtf16", listOf({{0xA1, 1}, {0x60}}), "empty UTF-16", false},
         Refused{"LengthNotInteger", listOf({{0xA1, 1}, {0x5F, 0x23, 0, 0, 0, 0, 0, 0, 0, 1, 'a'}}), "small integer"},
-        Refused{"Null", listOf({{0xA1, 1}, {0x00}}), "null and fill"},
-        Refused{"Uid", listOf({{0xA1, 1}, {0x80, 5}}), "no UIDs"},
-        Refused{"Set", listOf({{0xC1, 1}, {0x09}}), "no sets"},
+        Refused{"Null", listOf({{0xA1, 1}, {0x00}}), "null and fill", false},
+        Refused{"Uid", listOf({{0xA1, 1}, {0x80, 5}}), "no UIDs", false},
+        Refused{"Set", listOf({{0xC1, 1}, {0x09}}), "no sets", false},
         Refused{"DateBeyond32Bits", listOf({{0xA1, 1}, {0x33, 0x41, 0xF2, 0xA0, 0x5F, 0x20, 0, 0, 0}}),
-                "date out of range"},
+                "date out of range", false},
         Refused{"RealOfOneByte", listOf({{0xA1, 1}, {0x20, 0}}), "real of unsupported size"},
-        Refused{"UnknownType", listOf({{0xA1, 1}, {0x70}}), "unknown object type 0x7"}),
+        Refused{"UnknownType", listOf({{0xA1, 1}, {0x70}}), "unknown object type 0x7"},
+        // A string that claims 2^63 bytes.
+        Refused{"LengthPastAnyList", listOf({{0xA1, 1}, {0x5F, 0x13, 0x7F, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF}}),
+                "past the object area"}),
     [](const auto& info) { return std::string(info.param.name); });
 
 TEST(BinaryPlistReader, SharedObjectsAreBuiltOnceAtEveryReferenceWidth) {
@@ -278,11 +289,16 @@ TEST(BinaryPlistReader, SharedObjectsAreBuiltOnceAtEveryReferenceWidth) {
   }
 }
 
-}  // namespace
-}  // namespace zerith
-
-namespace zerith {
-namespace {
+TEST(BinaryPlistReader, ARepeatedKeyKeepsTheLastValueAtTheFirstPlace) {
+  // {a: 1, b: 2, a: 3}: one entry "a", the later value, where the key first
+  // stood; libplist's reading through plist::decodeBinary agrees.
+  const Data bytes = listOf({{0xD3, 1, 2, 1, 3, 4, 5}, {0x51, 'a'}, {0x51, 'b'}, {0x10, 1}, {0x10, 2}, {0x10, 3}});
+  for (const auto& back : {bplist::decode(plist::bytesOf(bytes)), plist::decodeBinary(plist::bytesOf(bytes))}) {
+    ASSERT_TRUE(back);
+    EXPECT_EQ(keysOf(*back), (std::vector<std::string>{"a", "b"}));
+    EXPECT_EQ(*back, Value(Dictionary{{"a", 3}, {"b", 2}}));
+  }
+}
 
 // A random tree of every kind the frames carry, from `random`; `asLibplist`
 // leaves out what libplist reads otherwise (unsigned numbers above 2^63 - 1,

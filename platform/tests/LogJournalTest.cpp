@@ -59,33 +59,28 @@ class StderrToFile {
   int saved_ = -1;
 };
 
-TEST(LogJournal, LevelsCarryTheJournalPrioritiesErrInfoAndDebug) {
-  StderrToFile out("match");
-  configure({.debug = true, .journal = std::nullopt});
-  const Logger logger("journaltest");
-  logger.error("the disk is full");
-  logger.info("listening");
-  logger.debug("a detail");
-  EXPECT_EQ(out.text(),
-            "<3>journaltest: the disk is full\n"
-            "<6>journaltest: listening\n"
-            "<7>journaltest: a detail\n");
-}
-
-TEST(LogJournal, DebugStaysOutUnlessAskedFor) {
-  StderrToFile out("match");
-  configure({.debug = false, .journal = std::nullopt});
-  const Logger logger("journaltest");
-  logger.debug("a detail");
-  logger.info("listening");
-  EXPECT_EQ(out.text(), "<6>journaltest: listening\n");
-}
-
-TEST(LogJournal, EveryLineOfAMessageKeepsItsPriority) {
-  StderrToFile out("match");
-  configure({.debug = false, .journal = std::nullopt});
-  Logger("journaltest").error("first\nsecond");
-  EXPECT_EQ(out.text(), "<3>journaltest: first\n<3>journaltest: second\n");
+// Each line carries its journal priority (err, info, debug); debug lines
+// only when asked for; every line of a message keeps its priority.
+TEST(LogJournal, LinesCarryTheirJournalPriorities) {
+  const struct {
+    const char* name;
+    bool debug;
+    const char* expected;
+  } rows[] = {
+      {"debug on", true, "<3>journaltest: the disk\n<3>journaltest: is full\n<6>journaltest: listening\n"
+                         "<7>journaltest: a detail\n"},
+      {"debug off", false, "<3>journaltest: the disk\n<3>journaltest: is full\n<6>journaltest: listening\n"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    StderrToFile out("match");
+    configure({.debug = row.debug, .journal = std::nullopt});
+    const Logger logger("journaltest");
+    logger.error("the disk\nis full");
+    logger.info("listening");
+    logger.debug("a detail");
+    EXPECT_EQ(out.text(), row.expected);
+  }
 }
 
 // A variable inherited from a service by a process whose standard error goes
