@@ -468,17 +468,5 @@ TEST_F(HTTPSPostTest, CorrelatedSessionIDRewritesTheBatch) {
   EXPECT_EQ(server.requests()[0].header("X-ZTH-Sender"), "YB");
 }
 
-TEST(HTTPSBackendFactory, HttpsNamesMakeHttpsBackends) {
-  TempRoot root;
-  const Value profile = profileWith({});
-  for (const char* name : {kZerithBackendHTTPPost, kZerithBackendHTTPPost2, kZerithBackendQRS}) {
-    auto b = ZerithBackend::newBackendWithName(name, profile, std::string("F"), 7);
-    ASSERT_TRUE(b) << name;
-    EXPECT_TRUE(std::dynamic_pointer_cast<HTTPSPostBackend>(b)) << name;
-    EXPECT_EQ(b->name(), name);
-  }
-  EXPECT_FALSE(ZerithBackend::newBackendWithName(kZerithBackendHTTPPost, Value(Dictionary{}), std::string("F"), 7));
-}
-
 }  // namespace
 }  // namespace zerith::test
