@@ -53,6 +53,8 @@ TEST(BackendFactoryTest, NamesMakeTheirKindsAndEveryRefusalSaysWho) {
       {"digest https post", kZerithBackendQRS, isA<HTTPSPostBackend>},
       {"https post without a client list", kZerithBackendHTTPPost, nullptr,
        "HTTPSPostBackend(initWithName): can't find the client list.", 7, nullptr, "F", Value(Dictionary{})},
+      {"upload server without a post URL", kZerithBackendUploadServer, nullptr,
+       "UploadBackend(initWithName): can't resolve upload post URL.", 0, nullptr, "F", Value(Dictionary{})},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.label);

@@ -16,7 +16,6 @@ namespace {
 
 class HTTPSCountsTest : public HTTPSBackendTest {
  protected:
-  static Value event(int n) { return Value(Dictionary{{"ClientData", Dictionary{{"n", n}}}}); }
 
   // Every count but the ones named is 0.
   static void expectOnly(const ZerithBackend& b, std::initializer_list<std::pair<BackendCount, std::uint64_t>> wanted) {
@@ -74,14 +73,14 @@ TEST_F(HTTPSCountsTest, BatchedEventsAreSentOrDroppedByTheEventListsAtTheFlush) 
   auto b = backend(profileWith({client}), userInfo(), true, true);
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   for (const std::uint16_t category : {1, 2, 3, 1}) {
-    b->sendMessage(event(category), at(1001), category, 0, 0);
+    b->sendMessage(clientEvent(category), at(1001), category, 0, 0);
   }
   expectOnly(*b, {{BackendCount::batched, 4}, {BackendCount::inBatch, 4}});
   flush(*b);
   ASSERT_TRUE(server.waitForRequests(1));
   EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 2u);
   // A realtime event passes the batch and goes at once.
-  b->sendMessage(event(9), at(1002), 1, 0, 1);
+  b->sendMessage(clientEvent(9), at(1002), 1, 0, 1);
   ASSERT_TRUE(server.waitForRequests(2));
   ASSERT_TRUE(waitForCount(*b, BackendCount::delivered, 3));
   expectOnly(*b, {{BackendCount::batched, 4},
@@ -124,8 +123,8 @@ TEST_F(HTTPSCountsTest, EventsThatMayNotGoCountTheReasonThatKeptThem) {
     }
     auto b = backend(profileWith({client}), c.withUserInfo ? userInfo() : Value(), true, false);
     ASSERT_EQ(b->state(), c.state);
-    b->sendMessage(event(1), at(1001), 1, 0, 0);
-    b->sendMessage(event(2), at(1001), 1, 0, 0);
+    b->sendMessage(clientEvent(1), at(1001), 1, 0, 0);
+    b->sendMessage(clientEvent(2), at(1001), 1, 0, 0);
     flush(*b);
     if (c.batchedFirst) {
       expectOnly(*b, {{BackendCount::batched, 2}, {c.reason, 2}});
@@ -139,10 +138,10 @@ TEST_F(HTTPSCountsTest, EventsThatMayNotGoCountTheReasonThatKeptThem) {
 TEST_F(HTTPSCountsTest, ServerRefusalAndAGoneTransportCountTheirDrops) {
   server.on("/post", Reply{.status = 503});
   auto b = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, true);
-  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(1), at(1001), 1, 0, 0);
   flush(*b);  // answered 503: disabled by the server
   ASSERT_EQ(b->state(), kBackendStateDisabled);
-  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(2), at(1001), 1, 0, 0);
   // The refused batch is gone (no spool): lost to the answer.
   expectOnly(*b, {{BackendCount::batched, 1},
                   {BackendCount::sent, 1},
@@ -151,7 +150,7 @@ TEST_F(HTTPSCountsTest, ServerRefusalAndAGoneTransportCountTheirDrops) {
 
   auto orphan = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, false);
   orphan->setReportingSessionConnectivityDelegate({});
-  orphan->sendMessage(event(3), at(1001), 1, 0, 0);
+  orphan->sendMessage(clientEvent(3), at(1001), 1, 0, 0);
   expectOnly(*orphan, {{BackendCount::droppedTransportError, 1}});
   EXPECT_EQ(server.requestCount(), 1u);
 }
@@ -161,8 +160,8 @@ TEST_F(HTTPSCountsTest, BatchStillHeldWhenTheBackendGoesIsCountedAsDropped) {
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   // User info taken away again: the batch may not be flushed, and stays.
   b->setUserInfoDict(Value());
-  b->sendMessage(event(1), at(1001), 1, 0, 0);
-  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(1), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(2), at(1001), 1, 0, 0);
   flush(*b);
   EXPECT_EQ(b->batchedEventCount(), 2u);
   const auto counters = b->sharedCounters();
@@ -187,6 +186,7 @@ TEST_F(HTTPSCountsTest, RecordsCarryADistinctIDOnlyWithTheKey) {
     for (const auto& record : envelope["events"]) {
       const std::string id = record.value("_recordID", std::string());
       EXPECT_EQ(id.size(), 32u) << record;
+      EXPECT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
       EXPECT_TRUE(ids.insert(id).second) << id;
     }
   }

@@ -75,7 +75,7 @@ TEST_F(HTTPSBackendTest, LocaleRefusalAfterAnOverrideDecisionReportsNone) {
   b->updateState();
   ASSERT_EQ(b->state(), kBackendStateSampledOut);
   ASSERT_EQ(b->overrideSampling(), Value(0.9));
-  ScopedLocale france{"fr_FR.UTF-8"};
+  ScopedEnv france{"LC_ALL", "fr_FR.UTF-8"};
   b->updateState();
   EXPECT_EQ(b->state(), kBackendStateDisabled);
   EXPECT_TRUE(b->overrideSampling().isNil());

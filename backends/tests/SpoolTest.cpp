@@ -142,16 +142,6 @@ TEST(SpoolFileTest, RecordsAreCountedOutsideStrings) {
   EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1})"), 0u);
 }
 
-TEST(SpoolFileTest, RecordIDsAreDistinctHex) {
-  std::set<std::string> seen;
-  for (int i = 0; i < 1000; ++i) {
-    const std::string id = newRecordID();
-    ASSERT_EQ(id.size(), 32u);
-    ASSERT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
-    ASSERT_TRUE(seen.insert(id).second) << id;
-  }
-}
-
 TEST(SpoolConfigTest, BadValuesFallBackToTheDefaults) {
   const SpoolConfig bad = SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", "maybe"},
                                                                        {"spoolMaxBytes", -5},
