@@ -59,17 +59,15 @@ class CreateBackendsTest : public ::testing::Test {
                                       {kZerithSessionInfoBatchEvent, Value(true)}}};
 };
 
-TEST_F(CreateBackendsTest, NilSectionOrSessionInfoGivesNilWithItsError) {
+TEST_F(CreateBackendsTest, NilSectionOrSessionInfoGivesNilWithItsErrorAndAnEmptySectionNoBackends) {
   EXPECT_EQ(createBackends(Value(), sessionInfo_, userInfo_, udid_), std::nullopt);
   EXPECT_TRUE(capture_.has(Level::Error, "createBackends: Attempted to create backends with nil storebag"));
   EXPECT_EQ(createBackends(Value(Dictionary{}), Value(), userInfo_, udid_), std::nullopt);
   EXPECT_TRUE(capture_.has(Level::Error, "createBackends: Attempted to create backends with nil session info"));
-}
-
-TEST_F(CreateBackendsTest, EmptySectionGivesAnEmptyDictionaryNotNil) {
-  const auto backends = createBackends(Value(Dictionary{}), sessionInfo_, userInfo_, udid_);
-  ASSERT_TRUE(backends);
-  EXPECT_TRUE(backends->empty());
+  // An empty section gives an empty set, not nil.
+  const auto none = createBackends(Value(Dictionary{}), sessionInfo_, userInfo_, udid_);
+  ASSERT_TRUE(none);
+  EXPECT_TRUE(none->empty());
 }
 
 TEST_F(CreateBackendsTest, UnknownKindsAreSkippedAndKnownOnesKeepTheSectionOrder) {
@@ -120,14 +118,7 @@ TEST_F(CreateBackendsTest, EveryBackendCarriesTheSessionIdentityAndDeviceFacts) 
   EXPECT_EQ(startOf(*(*backends)[0].second), startOf(*(*backends)[1].second));
 }
 
-TEST_F(CreateBackendsTest, FrameworkWithoutBundleVersionReportsEightZero) {
-  const auto backends =
-      createBackends(Value(Dictionary{{kZerithBackendPellamlog, Value()}}), sessionInfo_, userInfo_, udid_);
-  ASSERT_TRUE(backends && backends->size() == 1);
-  EXPECT_EQ(selfVersionOf(*(*backends)[0].second), "8.0.0");
-}
-
-TEST_F(CreateBackendsTest, MissingDeviceFactsAndFlagsStayEmpty) {
+TEST_F(CreateBackendsTest, MissingDeviceFactsFlagsAndFrameworkVersionStayEmptyOrDefault) {
   std::filesystem::remove(root_ / "/etc/zerithd/device.plist");
   const Value sparse(Dictionary{{kZerithSessionInfoClientType, Value(8)}});
   const auto backends = createBackends(Value(Dictionary{{kZerithBackendPellamlog, Value()}}), sparse, Value(), nullptr);
@@ -141,6 +132,8 @@ TEST_F(CreateBackendsTest, MissingDeviceFactsAndFlagsStayEmpty) {
   EXPECT_FALSE(b->batchEvents());
   EXPECT_TRUE(b->userInfoDict().isNil());
   EXPECT_EQ(b->udid(), nullptr);
+  // A framework bundle without a version reports 8.0.
+  EXPECT_EQ(selfVersionOf(*b), "8.0.0");
 }
 
 }  // namespace

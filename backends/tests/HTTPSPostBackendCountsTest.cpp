@@ -1,7 +1,12 @@
 // What the HTTPS backend counts for each event: sent, batched, and dropped
-// by the reason that decided it, against a real HTTPS server on loopback.
+// by the reason that decided it, against a real HTTPS server on loopback;
+// and its side of the spool: record IDs only when "spoolEnabled" is on, and
+// what the answer to a post counts (delivered, or lost when no spool keeps
+// the batch). The spool itself: SpoolTest.cpp; the whole road with a failing
+// collector: the e2e tests.
 
 #include <chrono>
+#include <set>
 #include <thread>
 
 #include "backends/tests/HTTPSPostBackendTestSupport.h"
@@ -11,7 +16,6 @@ namespace {
 
 class HTTPSCountsTest : public HTTPSBackendTest {
  protected:
-  static Value event(int n) { return Value(Dictionary{{"ClientData", Dictionary{{"n", n}}}}); }
 
   // Every count but the ones named is 0.
   static void expectOnly(const ZerithBackend& b, std::initializer_list<std::pair<BackendCount, std::uint64_t>> wanted) {
@@ -41,6 +45,24 @@ class HTTPSCountsTest : public HTTPSBackendTest {
     b.flushMessagesWithCompletion(results->handler());
     ASSERT_TRUE(results->waitFor(1));
   }
+  std::shared_ptr<HTTPSPostBackend> enabled(const std::string& url) {
+    return backend(profileWith({enablingClient(url)}), userInfo(), true, true);
+  }
+  static std::vector<Dictionary> records(int n) {
+    std::vector<Dictionary> out;
+    for (int i = 0; i < n; ++i) {
+      out.push_back(Dictionary{{"n", i}, {"text", "{\"not\":[a record]}"}});
+    }
+    return out;
+  }
+  // Posts an envelope of `n` records and waits for its completion.
+  void post(HTTPSPostBackend& b, int n) {
+    const auto body = b.createMessageForPostAndLogging(records(n), nullptr);
+    ASSERT_TRUE(body);
+    auto results = ResultLog::make();
+    b.postJSONMessage(*body, 0, std::nullopt, std::nullopt, results->handler());
+    ASSERT_TRUE(results->waitFor(1));
+  }
 };
 
 TEST_F(HTTPSCountsTest, BatchedEventsAreSentOrDroppedByTheEventListsAtTheFlush) {
@@ -51,14 +73,14 @@ TEST_F(HTTPSCountsTest, BatchedEventsAreSentOrDroppedByTheEventListsAtTheFlush) 
   auto b = backend(profileWith({client}), userInfo(), true, true);
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   for (const std::uint16_t category : {1, 2, 3, 1}) {
-    b->sendMessage(event(category), at(1001), category, 0, 0);
+    b->sendMessage(clientEvent(category), at(1001), category, 0, 0);
   }
   expectOnly(*b, {{BackendCount::batched, 4}, {BackendCount::inBatch, 4}});
   flush(*b);
   ASSERT_TRUE(server.waitForRequests(1));
   EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 2u);
   // A realtime event passes the batch and goes at once.
-  b->sendMessage(event(9), at(1002), 1, 0, 1);
+  b->sendMessage(clientEvent(9), at(1002), 1, 0, 1);
   ASSERT_TRUE(server.waitForRequests(2));
   ASSERT_TRUE(waitForCount(*b, BackendCount::delivered, 3));
   expectOnly(*b, {{BackendCount::batched, 4},
@@ -101,8 +123,8 @@ TEST_F(HTTPSCountsTest, EventsThatMayNotGoCountTheReasonThatKeptThem) {
     }
     auto b = backend(profileWith({client}), c.withUserInfo ? userInfo() : Value(), true, false);
     ASSERT_EQ(b->state(), c.state);
-    b->sendMessage(event(1), at(1001), 1, 0, 0);
-    b->sendMessage(event(2), at(1001), 1, 0, 0);
+    b->sendMessage(clientEvent(1), at(1001), 1, 0, 0);
+    b->sendMessage(clientEvent(2), at(1001), 1, 0, 0);
     flush(*b);
     if (c.batchedFirst) {
       expectOnly(*b, {{BackendCount::batched, 2}, {c.reason, 2}});
@@ -116,10 +138,10 @@ TEST_F(HTTPSCountsTest, EventsThatMayNotGoCountTheReasonThatKeptThem) {
 TEST_F(HTTPSCountsTest, ServerRefusalAndAGoneTransportCountTheirDrops) {
   server.on("/post", Reply{.status = 503});
   auto b = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, true);
-  b->sendMessage(event(1), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(1), at(1001), 1, 0, 0);
   flush(*b);  // answered 503: disabled by the server
   ASSERT_EQ(b->state(), kBackendStateDisabled);
-  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(2), at(1001), 1, 0, 0);
   // The refused batch is gone (no spool): lost to the answer.
   expectOnly(*b, {{BackendCount::batched, 1},
                   {BackendCount::sent, 1},
@@ -128,7 +150,7 @@ TEST_F(HTTPSCountsTest, ServerRefusalAndAGoneTransportCountTheirDrops) {
 
   auto orphan = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, false);
   orphan->setReportingSessionConnectivityDelegate({});
-  orphan->sendMessage(event(3), at(1001), 1, 0, 0);
+  orphan->sendMessage(clientEvent(3), at(1001), 1, 0, 0);
   expectOnly(*orphan, {{BackendCount::droppedTransportError, 1}});
   EXPECT_EQ(server.requestCount(), 1u);
 }
@@ -138,8 +160,8 @@ TEST_F(HTTPSCountsTest, BatchStillHeldWhenTheBackendGoesIsCountedAsDropped) {
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   // User info taken away again: the batch may not be flushed, and stays.
   b->setUserInfoDict(Value());
-  b->sendMessage(event(1), at(1001), 1, 0, 0);
-  b->sendMessage(event(2), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(1), at(1001), 1, 0, 0);
+  b->sendMessage(clientEvent(2), at(1001), 1, 0, 0);
   flush(*b);
   EXPECT_EQ(b->batchedEventCount(), 2u);
   const auto counters = b->sharedCounters();
@@ -147,6 +169,58 @@ TEST_F(HTTPSCountsTest, BatchStillHeldWhenTheBackendGoesIsCountedAsDropped) {
   EXPECT_EQ(counters->get(BackendCount::batched), 2u);
   EXPECT_EQ(counters->get(BackendCount::droppedDisabled), 2u);
   EXPECT_EQ(counters->get(BackendCount::sent), 0u);
+}
+
+TEST_F(HTTPSCountsTest, RecordsCarryADistinctIDOnlyWithTheKey) {
+  auto without = enabled(server.url("/post"));
+  auto envelope = nlohmann::ordered_json::parse(*without->createMessageForPostAndLogging(records(3), nullptr));
+  for (const auto& record : envelope["events"]) {
+    EXPECT_FALSE(record.contains("_recordID")) << record;
+  }
+
+  Defaults("com.velmar.zerith").setObject("spoolEnabled", Value(true));
+  auto with = enabled(server.url("/post"));
+  std::set<std::string> ids;
+  for (int round = 0; round < 2; ++round) {
+    envelope = nlohmann::ordered_json::parse(*with->createMessageForPostAndLogging(records(3), nullptr));
+    for (const auto& record : envelope["events"]) {
+      const std::string id = record.value("_recordID", std::string());
+      EXPECT_EQ(id.size(), 32u) << record;
+      EXPECT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
+      EXPECT_TRUE(ids.insert(id).second) << id;
+    }
+  }
+  EXPECT_EQ(ids.size(), 6u);
+}
+
+TEST_F(HTTPSCountsTest, AnswersCountDeliveredOrLostRecordsWithoutTheSpool) {
+  server.on("/ok", Reply{.status = 200});
+  server.on("/unavailable", Reply{.status = 503});
+  server.on("/bad", Reply{.status = 400});
+
+  auto ok = enabled(server.url("/ok"));
+  post(*ok, 3);
+  EXPECT_EQ(ok->counters().get(BackendCount::delivered), 3u);
+  EXPECT_EQ(ok->counters().get(BackendCount::droppedTransportError), 0u);
+
+  RefusingPort refusing;
+  auto refused = enabled(refusing.url("/post"));
+  post(*refused, 4);
+  EXPECT_EQ(refused->counters().get(BackendCount::droppedTransportError), 4u);
+  EXPECT_EQ(refused->counters().get(BackendCount::spooled), 0u);
+
+  auto unavailable = enabled(server.url("/unavailable"));
+  post(*unavailable, 2);
+  EXPECT_EQ(unavailable->counters().get(BackendCount::droppedTransportError), 2u);
+  EXPECT_EQ(unavailable->state(), kBackendStateDisabled);
+
+  auto bad = enabled(server.url("/bad"));
+  post(*bad, 5);
+  EXPECT_EQ(bad->counters().get(BackendCount::droppedTransportError), 5u);
+  EXPECT_EQ(bad->counters().get(BackendCount::delivered), 0u);
+  EXPECT_EQ(bad->state(), kBackendStateEnabled);
+  // No spool was asked for anything.
+  EXPECT_FALSE(logs.contains("Spool:"));
 }
 
 }  // namespace

@@ -10,7 +10,6 @@
 #include <zlib.h>
 
 #include <condition_variable>
-#include <cstdlib>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -22,6 +21,7 @@
 #include "backends/HTTPSPostBackend.h"
 #include "config/ClientTypes.h"
 #include "config/DeviceInfo.h"
+#include "config/tests/ScopedEnv.h"
 #include "platform/Defaults.h"
 #include "platform/Log.h"
 #include "tests/support/HttpsTestServer.h"
@@ -84,26 +84,6 @@ inline std::string independentDigest(const std::string& key, const std::string& 
   return text + ">";
 }
 
-class ScopedLocale {
- public:
-  explicit ScopedLocale(const char* value) {
-    if (const char* old = std::getenv("LC_ALL")) {
-      old_ = old;
-    }
-    ::setenv("LC_ALL", value, 1);
-  }
-  ~ScopedLocale() {
-    if (old_) {
-      ::setenv("LC_ALL", old_->c_str(), 1);
-    } else {
-      ::unsetenv("LC_ALL");
-    }
-  }
-
- private:
-  std::optional<std::string> old_;
-};
-
 // Completions of flushes and posts, in order.
 class ResultLog : public std::enable_shared_from_this<ResultLog> {
  public:
@@ -131,6 +111,9 @@ class ResultLog : public std::enable_shared_from_this<ResultLog> {
   mutable std::condition_variable changed_;
   std::vector<std::optional<Error>> errors_;
 };
+
+// An event as the session hands it on: the client's payload {"n": n}.
+inline Value clientEvent(int n) { return Value(Dictionary{{"ClientData", Dictionary{{"n", n}}}}); }
 
 inline Value userInfo(const std::string& client = "demo", const std::string& service = "cli") {
   return Value(Dictionary{{"clientName", client}, {"serviceName", service}});
@@ -195,7 +178,7 @@ class HTTPSBackendTest : public ::testing::Test {
   static timeval at(long seconds, long micros = 0) { return timeval{seconds, micros}; }
 
   TempRoot root;
-  ScopedLocale locale{"en_GB.UTF-8"};
+  ScopedEnv locale{"LC_ALL", "en_GB.UTF-8"};
   log::LogCapture logs;
   HttpsTestServer server;
   std::shared_ptr<ReportingSessionConnectivityHelper> transport;

@@ -1,6 +1,8 @@
-// The end report's "OverrideSampling": the override value only when the
-// draw was not below the threshold (so the override decided), -1 otherwise,
-// whichever path set the threshold.
+// The sampling decision (a draw below the threshold enables, the threshold
+// itself is out; an override decides what is not below it) and the end
+// report's "OverrideSampling": the override value only when the draw was not
+// below the threshold (so the override decided), -1 otherwise, whichever
+// path set the threshold.
 
 #include "backends/tests/HTTPSPostBackendTestSupport.h"
 
@@ -12,7 +14,7 @@ struct OverrideRow {
   double factor;
   Value threshold;          // "sampling_threshold"; nil: absent
   Value perCountryGB;       // a per-country threshold for GB; nil: none
-  double override;
+  Value override;           // "override_sampling"; nil: absent
   std::int32_t state;
   Value reported;           // what the end report carries
 };
@@ -30,7 +32,9 @@ TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
     client.set("per_country_sampling_thresholds",
                Array{Value(Dictionary{{"country", Array{Value("GB")}}, {"threshold", row.perCountryGB}})});
   }
-  client.set("override_sampling", row.override);
+  if (!row.override.isNil()) {
+    client.set("override_sampling", row.override);
+  }
   auto b = backend(profileWith({client}));
   b->setSamplingFactor(row.factor);
   b->updateState();
@@ -41,15 +45,22 @@ TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
 INSTANTIATE_TEST_SUITE_P(
     Paths, OverrideSamplingTest,
     ::testing::Values(
-        OverrideRow{"PlainThresholdEnables", 0.3, Value(1.0), Value(), 0.5, kBackendStateEnabled, Value(-1)},
-        OverrideRow{"PlainDrawAtThresholdKeptByOverride", 0.5, Value(0.5), Value(), 0.9, kBackendStateSampledOut,
-                    Value(0.9)},
-        OverrideRow{"PlainDrawPastOverrideDisables", 0.95, Value(0.5), Value(), 0.9, kBackendStateDisabled,
-                    Value(0.9)},
-        OverrideRow{"NoThresholdDisablesWithoutOverride", 0.1, Value(), Value(), 0.5, kBackendStateDisabled,
+        OverrideRow{"DrawBelowThresholdEnables", 0.1, Value(0.25), Value(), Value(), kBackendStateEnabled, Value(-1)},
+        OverrideRow{"DrawAboveThresholdSamplesOut", 0.3, Value(0.25), Value(), Value(), kBackendStateSampledOut,
                     Value(-1)},
-        OverrideRow{"PerCountryThresholdEnables", 0.3, Value(0.0), Value(1.0), 0.0, kBackendStateEnabled, Value(-1)},
-        OverrideRow{"PerCountryThresholdSamplesOut", 0.6, Value(1.0), Value(0.5), 0.8, kBackendStateSampledOut,
+        OverrideRow{"DrawAtThresholdSamplesOut", 0.25, Value(0.25), Value(), Value(), kBackendStateSampledOut,
+                    Value(-1)},
+        OverrideRow{"DrawPastThresholdBelowOverrideSamplesOut", 0.3, Value(0.25), Value(), Value(0.5),
+                    kBackendStateSampledOut, Value(0.5)},
+        OverrideRow{"PlainThresholdEnables", 0.3, Value(1.0), Value(), Value(0.5), kBackendStateEnabled, Value(-1)},
+        OverrideRow{"PlainDrawAtThresholdKeptByOverride", 0.5, Value(0.5), Value(), Value(0.9), kBackendStateSampledOut,
+                    Value(0.9)},
+        OverrideRow{"PlainDrawPastOverrideDisables", 0.95, Value(0.5), Value(), Value(0.9), kBackendStateDisabled,
+                    Value(0.9)},
+        OverrideRow{"NoThresholdDisablesWithoutOverride", 0.1, Value(), Value(), Value(0.5), kBackendStateDisabled,
+                    Value(-1)},
+        OverrideRow{"PerCountryThresholdEnables", 0.3, Value(0.0), Value(1.0), Value(0.0), kBackendStateEnabled, Value(-1)},
+        OverrideRow{"PerCountryThresholdSamplesOut", 0.6, Value(1.0), Value(0.5), Value(0.8), kBackendStateSampledOut,
                     Value(0.8)}),
     [](const ::testing::TestParamInfo<OverrideRow>& info) { return std::string(info.param.name); });
 
@@ -64,7 +75,7 @@ TEST_F(HTTPSBackendTest, LocaleRefusalAfterAnOverrideDecisionReportsNone) {
   b->updateState();
   ASSERT_EQ(b->state(), kBackendStateSampledOut);
   ASSERT_EQ(b->overrideSampling(), Value(0.9));
-  ScopedLocale france{"fr_FR.UTF-8"};
+  ScopedEnv france{"LC_ALL", "fr_FR.UTF-8"};
   b->updateState();
   EXPECT_EQ(b->state(), kBackendStateDisabled);
   EXPECT_TRUE(b->overrideSampling().isNil());

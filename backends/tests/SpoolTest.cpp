@@ -19,14 +19,11 @@
 #include <zlib.h>
 
 #include "backends/Spool.h"
-#include "platform/FileUtil.h"
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/TempRoot.h"
 #include "tests/support/TestCA.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 #include "transport/URLSession.h"
-
-extern "C" int spoolFileFuzzOneInput(const std::uint8_t* data, std::size_t size);
 
 namespace zerith::test {
 namespace {
@@ -143,31 +140,6 @@ TEST(SpoolFileTest, RecordsAreCountedOutsideStrings) {
   EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1,"clientId":"{[","events":[{"s":"}\"{"},{"t":"]"}]})"), 2u);
   EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1,"clientId":"a","events":[]})"), 0u);
   EXPECT_EQ(countEnvelopeRecords(R"({"postTime":1})"), 0u);
-}
-
-TEST(SpoolFileTest, RecordIDsAreDistinctHex) {
-  std::set<std::string> seen;
-  for (int i = 0; i < 1000; ++i) {
-    const std::string id = newRecordID();
-    ASSERT_EQ(id.size(), 32u);
-    ASSERT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
-    ASSERT_TRUE(seen.insert(id).second) << id;
-  }
-}
-
-// Every kept input of the spool file fuzz target goes through the readers
-// again (the target aborts on a broken invariant).
-TEST(SpoolFileTest, EveryCorpusInputIsReadWithItsInvariants) {
-  const auto corpus = sourceDir() / "fuzz/corpus/spool_file_fuzz";
-  ASSERT_TRUE(fs::is_directory(corpus)) << corpus;
-  std::size_t count = 0;
-  for (const auto& entry : fs::directory_iterator(corpus)) {
-    const auto bytes = file::readAll(entry.path(), 1u << 20);
-    ASSERT_TRUE(bytes.has_value()) << entry.path();
-    spoolFileFuzzOneInput(bytes->data(), bytes->size());
-    ++count;
-  }
-  EXPECT_GE(count, 7u);
 }
 
 TEST(SpoolConfigTest, BadValuesFallBackToTheDefaults) {

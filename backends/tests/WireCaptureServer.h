@@ -88,10 +88,6 @@ class WireCaptureServer {
     std::lock_guard lock(mutex_);
     return requests_;
   }
-  int failedHandshakes() const {
-    std::lock_guard lock(mutex_);
-    return failedHandshakes_;
-  }
   std::size_t requestBytes() const {
     std::lock_guard lock(mutex_);
     return requestBytes_;

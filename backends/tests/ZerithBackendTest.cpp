@@ -1,6 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <cmath>
 #include <semaphore>
 #include <vector>
 
@@ -74,22 +73,6 @@ TEST(ZerithBackendTest, FirstEventIsNumberOneAndTheNumberWrapsAt16Bits) {
   EXPECT_EQ(b->seen.back(), 1);
 }
 
-TEST(ZerithBackendTest, SamplingDrawIsInTenThousandthsBetweenZeroAnd9999) {
-  double lowest = 1, highest = 0;
-  for (int i = 0; i < 2000; ++i) {
-    const double f = ProbeBackend().samplingFactor();
-    ASSERT_GE(f, 0.0);
-    ASSERT_LE(f, 0.9999);
-    const double steps = f * 10000.0;
-    ASSERT_NEAR(steps, std::round(steps), 1e-6) << f;
-    lowest = std::min(lowest, f);
-    highest = std::max(highest, f);
-  }
-  // 2000 uniform draws all above 0.1 (or all below 0.9) would be 0.9^2000.
-  EXPECT_LT(lowest, 0.1);
-  EXPECT_GT(highest, 0.9);
-}
-
 TEST(ZerithBackendTest, Sha256HashesAsManyBytesAsUtf16Units) {
   EXPECT_EQ(ZerithBackend::convertIntoSHA256("abc"),
             "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad");
@@ -105,26 +88,24 @@ TEST(ZerithBackendTest, Sha256HashesAsManyBytesAsUtf16Units) {
             "e3b0c44298fc1c149afbf4c8996fb92427ae41e4649b934ca495991b7852b855");
 }
 
-TEST(ZerithBackendTest, WhitelistAbsentAdmitsAllEmptyAdmitsNone) {
+// An absent whitelist admits all, an empty one none; an absent or empty
+// blacklist refuses nothing.
+TEST(ZerithBackendTest, EventListsAdmitAndRefuseByCategory) {
   ProbeBackend b;
   EXPECT_TRUE(b.isWhitelistedEvent(0));
   EXPECT_TRUE(b.isWhitelistedEvent(65535));
+  EXPECT_FALSE(b.isBlacklistedEvent(7));
   b.setEventWhitelist(Value(Array{}));
+  b.setEventBlacklist(Value(Array{}));
   EXPECT_FALSE(b.isWhitelistedEvent(0));
   EXPECT_FALSE(b.isWhitelistedEvent(7));
+  EXPECT_FALSE(b.isBlacklistedEvent(7));
   b.setEventWhitelist(Value(Array{Value(7), Value("9"), Value(65536 + 5)}));
+  b.setEventBlacklist(Value(Array{Value(7)}));
   EXPECT_TRUE(b.isWhitelistedEvent(7));
   EXPECT_TRUE(b.isWhitelistedEvent(9));
   EXPECT_FALSE(b.isWhitelistedEvent(5));  // no 16-bit wrap of list entries
   EXPECT_FALSE(b.isWhitelistedEvent(8));
-}
-
-TEST(ZerithBackendTest, BlacklistAbsentOrEmptyRefusesNothing) {
-  ProbeBackend b;
-  EXPECT_FALSE(b.isBlacklistedEvent(7));
-  b.setEventBlacklist(Value(Array{}));
-  EXPECT_FALSE(b.isBlacklistedEvent(7));
-  b.setEventBlacklist(Value(Array{Value(7)}));
   EXPECT_TRUE(b.isBlacklistedEvent(7));
   EXPECT_FALSE(b.isBlacklistedEvent(8));
 }
@@ -164,22 +145,11 @@ TEST(ZerithBackendDeathTest, ReadingTheStateFromItsOwnQueueAborts) {
       "would deadlock");
 }
 
-TEST(ZerithBackendTest, NoOpDefaultsAnswerNilAndNo) {
+TEST(ZerithBackendTest, NoOpDefaultsAnswerNilAndNoAndCompleteTheFlushOnce) {
   ZerithBackend b("base", Value(), std::nullopt);
   const timeval now{5, 0};
   EXPECT_EQ(b.sendMessage(Value(Dictionary{{"a", 1}}), now, 1, 2, 3, 0), std::nullopt);
   EXPECT_EQ(b.sendMessage(Value(Dictionary{{"a", 1}}), now, 1, 2, 0), std::nullopt);
-  EXPECT_EQ(b.flushMessagesWithCompletion(nullptr), std::nullopt);
-  bool taken = true;
-  b.uploadFileAtPath(UploadRequest{}, [&](bool t, bool) { taken = t; });
-  EXPECT_FALSE(taken);
-  EXPECT_FALSE(b.uploadLogData(Value(Array{Value("line")})));
-  EXPECT_EQ(b.batchedEventsSize(), 0u);
-  b.cleanup();
-}
-
-TEST(ZerithBackendTest, FlushCallsTheCompletionOnceWithNilAndNoError) {
-  ZerithBackend b("base", Value(), std::nullopt);
   int calls = 0;
   EXPECT_EQ(b.flushMessagesWithCompletion([&](const Value& result, const std::optional<Error>& error) {
     ++calls;
@@ -188,6 +158,13 @@ TEST(ZerithBackendTest, FlushCallsTheCompletionOnceWithNilAndNoError) {
   }),
             std::nullopt);
   EXPECT_EQ(calls, 1);
+  EXPECT_EQ(b.flushMessagesWithCompletion(nullptr), std::nullopt);
+  bool taken = true;
+  b.uploadFileAtPath(UploadRequest{}, [&](bool t, bool) { taken = t; });
+  EXPECT_FALSE(taken);
+  EXPECT_FALSE(b.uploadLogData(Value(Array{Value("line")})));
+  EXPECT_EQ(b.batchedEventsSize(), 0u);
+  b.cleanup();
 }
 
 TEST(ZerithBackendTest, TransportReferenceIsWeak) {

@@ -145,12 +145,15 @@ TEST_F(StorebagCacheTest, FreshEntryAnswersUntilItsMaxAgeAndIsSharedByClientType
   EXPECT_EQ(cache_.count(), 1u);
 }
 
-TEST_F(StorebagCacheTest, MaxAgeZeroFetchesOnEveryRequest) {
-  results_ = {FetchResult{section("a"), 0, "1"}, FetchResult{section("b"), 0, "1"}, FetchResult{section("c"), 0, "1"}};
+TEST_F(StorebagCacheTest, MaxAgeZeroFetchesOnEveryRequestAndAStorebagWithoutVersionClearsTheOlderOne) {
+  results_ = {FetchResult{section("a"), 0, "1"}, FetchResult{section("b"), 0, "1"},
+              FetchResult{section("c"), 0, Value()}};
   EXPECT_EQ(cache_.storebagForClientType(5, 1), section("a"));
   EXPECT_EQ(cache_.storebagForClientType(5, 1), section("b"));
+  EXPECT_EQ(*cache_.storebagVersionForClientType(5).string(), "1");
   EXPECT_EQ(cache_.storebagForClientType(5, 1), section("c"));
   EXPECT_EQ(fetchedTypes_.size(), 3u);
+  EXPECT_TRUE(cache_.storebagVersionForClientType(5).isNil());
 }
 
 TEST_F(StorebagCacheTest, UnchangedStorebagKeepsOlderDataAndCountsAsSuccess) {
@@ -207,16 +210,9 @@ TEST_F(StorebagCacheTest, ClientTypeWithoutStorebagIsRejectedWithoutFetch) {
   EXPECT_EQ(cache_.count(), 0u);
 }
 
-TEST_F(StorebagCacheTest, StorebagWithoutVersionClearsTheOlderVersion) {
-  results_ = {FetchResult{section("a"), 0, "1.0"}, FetchResult{section("b"), 0, Value()}};
-  cache_.storebagForClientType(5, 1);
-  EXPECT_EQ(*cache_.storebagVersionForClientType(5).string(), "1.0");
-  cache_.storebagForClientType(5, 1);
-  EXPECT_TRUE(cache_.storebagVersionForClientType(5).isNil());
-}
-
-TEST_F(StorebagCacheTest, FetchLogsItsStepsAndRecordsTheEntry) {
-  results_ = {FetchResult{section("a"), 1234, "3.1"}};
+TEST_F(StorebagCacheTest, FetchLogsItsStepsRecordsTheEntryAndGrowsTheEstimatedSize) {
+  results_ = {FetchResult{section("a"), 1234, "3.1"}, FetchResult{section("b"), 60, "1"}};
+  const std::size_t empty = cache_.estimatedSize();
   cache_.storebagForClientType(8, 4000000000u);
   EXPECT_TRUE(logs_.has(Level::Debug, "storebagForSession: Retrieving storebag for session 4000000000 with client type 8"));
   EXPECT_TRUE(logs_.has(Level::Debug, "fetchAndCacheStorebag: Fetching storebag for client type 8"));
@@ -226,14 +222,9 @@ TEST_F(StorebagCacheTest, FetchLogsItsStepsAndRecordsTheEntry) {
   EXPECT_EQ(*e["StorebagVersion"].string(), "3.1");
   EXPECT_EQ(e["StorebagFetchTime"].date(), now_);
   EXPECT_EQ(e["StorebagMaxAge"].intValue(), 1234);
-}
 
-TEST_F(StorebagCacheTest, EstimatedSizeGrowsWithTheCachedStorebags) {
-  results_ = {FetchResult{section("a"), 60, "1"}, FetchResult{section("b"), 60, "1"}};
-  const std::size_t empty = cache_.estimatedSize();
-  cache_.storebagForClientType(5, 1);
   const std::size_t one = cache_.estimatedSize();
-  cache_.storebagForClientType(8, 1);
+  cache_.storebagForClientType(5, 1);
   EXPECT_LT(empty, one);
   EXPECT_LT(one, cache_.estimatedSize());
   EXPECT_EQ(cache_.count(), 2u);

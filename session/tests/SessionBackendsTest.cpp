@@ -352,7 +352,7 @@ TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSaf
 
 // --- States and identifiers in a hierarchy ---------------------------------------------------
 
-TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifier) {
+TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifierOrphansTheirOwn) {
   useStorebag({{"recA", Value(Dictionary{{"state", Value(2)}, {"threshold", Value(0.25)}})},
                {"recB", Value(Dictionary{{"state", Value(1)}})}});
   auto root = started(hierarchyInfo(1, "call", 0));
@@ -381,15 +381,13 @@ TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTh
                                          "' for session 3 backends"));
   // The root keeps its own identifier and states.
   EXPECT_EQ(rec(root, "recA")->combinedSessionIDString(), root.session->sessionIDString());
-}
 
-TEST_F(SessionBackendsTest, ChildWithoutItsParentKeepsItsStatesAndSaysSo) {
-  useStorebag({{"recA", Value(Dictionary{{"state", Value(2)}})}});
-  auto child = started(hierarchyInfo(2, "orphan", 1));
-  EXPECT_EQ(rec(child, "recA")->state(), kBackendStateEnabled);
+  // A child without its parent keeps its own states and identifier, and says so.
+  auto orphan = started(hierarchyInfo(4, "orphan", 1));
+  EXPECT_EQ(rec(orphan, "recA")->state(), kBackendStateEnabled);
   EXPECT_TRUE(logs.has(Level::Default,
-                       "syncReportingStates: child session 2 (backend recA) with hierarchy 1 is missing its parent"));
-  EXPECT_EQ(rec(child, "recA")->combinedSessionIDString(), child.session->sessionIDString());
+                       "syncReportingStates: child session 4 (backend recA) with hierarchy 1 is missing its parent"));
+  EXPECT_EQ(rec(orphan, "recA")->combinedSessionIDString(), orphan.session->sessionIDString());
 }
 
 TEST_F(SessionBackendsTest, UserInfoReachesEveryBackendAndTheDigestKeyOnlyTheDigestBackend) {

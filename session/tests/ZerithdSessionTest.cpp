@@ -109,9 +109,9 @@ TEST_F(ZerithdSessionTest, NilUserInfoIsIgnoredWhileUserInfoIsRequired) {
   EXPECT_TRUE(logs.has(Level::Debug, "receivedUserInfo: Received new user info for session 6"));
 }
 
-TEST_F(ZerithdSessionTest, NoStorebagCompletesTheStartWithNil) {
+TEST_F(ZerithdSessionTest, NoStorebagCompletesTheStartWithNilAndSendsNoEndMessage) {
   storebag = Value();
-  auto s = newSession(sessionInfo(5));
+  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
   std::optional<Value> result;
   s.session->startConfigWithCompletionHandler([&](Value v) { result = v; });
   ASSERT_TRUE(result.has_value());
@@ -120,6 +120,13 @@ TEST_F(ZerithdSessionTest, NoStorebagCompletesTheStartWithNil) {
   EXPECT_TRUE(logs.has(Level::Debug, "startConfigWithCompletionHandler: Starting configuration for session 5"));
   EXPECT_FALSE(logs.contains("createBackendsWithStorebag"));
   s.session->startConfigWithCompletionHandler(nullptr);  // a nil completion is allowed
+  auto connection = s.connection;
+  endSession(s);
+  // Only the end of aggregation.
+  const auto sent = aggregated(*connection);
+  ASSERT_EQ(sent.size(), 1u);
+  EXPECT_EQ(sent[0].get("payload"), Value());
+  EXPECT_FALSE(logs.contains("internalSendMessage"));
 }
 
 TEST_F(ZerithdSessionTest, StorebagConfiguresTheSessionWithNoEnabledBackend) {
@@ -140,42 +147,39 @@ TEST_F(ZerithdSessionTest, StorebagConfiguresTheSessionWithNoEnabledBackend) {
 }
 
 TEST_F(ZerithdSessionTest, StartMessageCarriesLocaleAndAutomaticTimeOnCustomerBuilds) {
-  ::setenv("LC_ALL", "de_DE.UTF-8", 1);
-  Defaults("com.velmar.timed").setObject("AutomaticTimeZoneEnabled", Value(false));
-  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-  s.session->startConfigWithCompletionHandler(nullptr);
-  ::unsetenv("LC_ALL");
-
-  const auto sent = aggregated(*s.connection);
-  ASSERT_EQ(sent.size(), 1u);
-  EXPECT_EQ(sent[0].get("message"), sessionInfo(5));
-  EXPECT_EQ(sent[0].get("category"), Value(0u));
-  EXPECT_EQ(sent[0].get("type"), Value(0u));
-  EXPECT_EQ(sent[0].get("payload"), Value(Dictionary{{"AutomaticTimeSet", Value(false)}, {"Locale", Value("DE")}}));
-}
-
-TEST_F(ZerithdSessionTest, AutomaticTimeIsAssumedWhenTheSettingIsAbsent) {
-  ::setenv("LC_ALL", "C", 1);
-  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-  s.session->startConfigWithCompletionHandler(nullptr);
-  ::unsetenv("LC_ALL");
-  const auto sent = aggregated(*s.connection);
-  ASSERT_EQ(sent.size(), 1u);
-  EXPECT_EQ(sent[0].get("payload"), Value(Dictionary{{"AutomaticTimeSet", Value(true)}, {"Locale", Value("Unknown")}}));
+  struct Row {
+    const char* locale;
+    std::optional<bool> automaticTime;  // the setting; absent: assumed on
+    Dictionary payload;
+  };
+  const Row rows[] = {{"C", std::nullopt, {{"AutomaticTimeSet", Value(true)}, {"Locale", Value("Unknown")}}},
+                      {"de_DE.UTF-8", false, {{"AutomaticTimeSet", Value(false)}, {"Locale", Value("DE")}}}};
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.locale);
+    if (row.automaticTime) {
+      Defaults("com.velmar.timed").setObject("AutomaticTimeZoneEnabled", Value(*row.automaticTime));
+    }
+    ::setenv("LC_ALL", row.locale, 1);
+    auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+    s.session->startConfigWithCompletionHandler(nullptr);
+    ::unsetenv("LC_ALL");
+    const auto sent = aggregated(*s.connection);
+    ASSERT_EQ(sent.size(), 1u);
+    EXPECT_EQ(sent[0].get("message"), sessionInfo(5));
+    EXPECT_EQ(sent[0].get("category"), Value(0u));
+    EXPECT_EQ(sent[0].get("type"), Value(0u));
+    EXPECT_EQ(sent[0].get("payload"), Value(row.payload));
+  }
 }
 
 // --- Client operations without backends ---------------------------------------------
 
-TEST_F(ZerithdSessionTest, DisplayURLIsNotAvailableWithoutBackends) {
+TEST_F(ZerithdSessionTest, FlushAndDisplayURLBeforeConfigurationFailWithoutBackends) {
   auto s = newSession(sessionInfo(5));
   std::optional<Value> url;
   s.session->fetchDisplayURL([&](Value v) { url = v; });
   EXPECT_EQ(url, Value("URL not available"));
   EXPECT_TRUE(logs.has(Level::Debug, "fetchDisplayURL: Fetching display URL for session 5"));
-}
-
-TEST_F(ZerithdSessionTest, FlushBeforeConfigurationFailsWithTheNoBackendsError) {
-  auto s = newSession(sessionInfo(5));
   int calls = 0;
   s.session->flushMessagesWithCompletion([&](Value text, std::optional<Error> error) {
     ++calls;
@@ -240,51 +244,34 @@ TEST_F(ZerithdSessionTest, UploadsAreRefusedWithoutAnUploadBackend) {
   EXPECT_TRUE(logs.has(Level::Error, "uploadLogData: Log data array upload failed"));
 }
 
-TEST_F(ZerithdSessionTest, FinishingGracefullyIsReportedAtTheEnd) {
-  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-  s.session->startConfigWithCompletionHandler(nullptr);
-  s.session->finishSessionGracefully();
-  EXPECT_TRUE(logs.has(Level::Debug, "finishSessionGracefully: Session 5 has been finished gracefully"));
-  auto connection = s.connection;
-  endSession(s);
+TEST_F(ZerithdSessionTest, EndMessageSaysWhetherTheSessionFinishedGracefully) {
+  for (const bool graceful : {true, false}) {
+    SCOPED_TRACE(graceful ? "finished gracefully" : "ended without finishing");
+    logs.clear();
+    auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+    s.session->startConfigWithCompletionHandler(nullptr);
+    if (graceful) {
+      s.session->finishSessionGracefully();
+      EXPECT_TRUE(logs.has(Level::Debug, "finishSessionGracefully: Session 5 has been finished gracefully"));
+    }
+    auto connection = s.connection;
+    endSession(s);
 
-  // The start message, the end message with the health figures, then the end of aggregation.
-  const auto sent = aggregated(*connection);
-  ASSERT_EQ(sent.size(), 3u);
-  EXPECT_EQ(sent[1].get("category"), Value(0u));
-  EXPECT_EQ(sent[1].get("type"), Value(1u));
-  const Value payload = sent[1].get("payload");
-  EXPECT_EQ(payload["StorebagVersion"], Value("42"));
-  EXPECT_EQ(payload["GracefulTermination"], Value(true));
-  EXPECT_EQ(payload["SessionsCount_YJ"], Value(1ull));
-  EXPECT_EQ(payload["StorebagsCount"], Value(1ull));
-  EXPECT_FALSE(payload["ProcessMemoryUsage"].isNil());
-  EXPECT_EQ(sent[2].get("payload"), Value());
-  EXPECT_EQ(sent[2].get("category"), Value(0u));
-  EXPECT_TRUE(logs.has(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 5"));
-}
-
-TEST_F(ZerithdSessionTest, SessionEndedWithoutFinishingReportsNoGracefulTermination) {
-  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-  s.session->startConfigWithCompletionHandler(nullptr);
-  auto connection = s.connection;
-  endSession(s);
-  const auto sent = aggregated(*connection);
-  ASSERT_EQ(sent.size(), 3u);
-  EXPECT_EQ(sent[1].get("payload")["GracefulTermination"], Value(false));
-}
-
-TEST_F(ZerithdSessionTest, SessionWithoutStorebagSendsNoEndMessage) {
-  storebag = Value();
-  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-  s.session->startConfigWithCompletionHandler(nullptr);
-  auto connection = s.connection;
-  endSession(s);
-  // Only the end of aggregation.
-  const auto sent = aggregated(*connection);
-  ASSERT_EQ(sent.size(), 1u);
-  EXPECT_EQ(sent[0].get("payload"), Value());
-  EXPECT_FALSE(logs.contains("internalSendMessage"));
+    // The start message, the end message with the health figures, then the end of aggregation.
+    const auto sent = aggregated(*connection);
+    ASSERT_EQ(sent.size(), 3u);
+    EXPECT_EQ(sent[1].get("category"), Value(0u));
+    EXPECT_EQ(sent[1].get("type"), Value(1u));
+    const Value payload = sent[1].get("payload");
+    EXPECT_EQ(payload["StorebagVersion"], Value("42"));
+    EXPECT_EQ(payload["GracefulTermination"], Value(graceful));
+    EXPECT_EQ(payload["SessionsCount_YJ"], Value(1ull));
+    EXPECT_EQ(payload["StorebagsCount"], Value(1ull));
+    EXPECT_FALSE(payload["ProcessMemoryUsage"].isNil());
+    EXPECT_EQ(sent[2].get("payload"), Value());
+    EXPECT_EQ(sent[2].get("category"), Value(0u));
+    EXPECT_TRUE(logs.has(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 5"));
+  }
 }
 
 // --- Aggregation -------------------------------------------------------------------------
@@ -320,12 +307,9 @@ TEST_F(ZerithdSessionTest, EventsOfADescendantGoOnlyToTheAggregatingAncestor) {
   EXPECT_EQ(atParent[1].get("message"), hierarchyInfo(2, "call", 1));
   EXPECT_EQ(atParent[1].get("category"), Value(9u));
   EXPECT_TRUE(aggregated(*child.connection).empty());
-}
-
-TEST_F(ZerithdSessionTest, EndingAggregationWithoutAnAggregatorSendsNothing) {
-  auto s = newSession(sessionInfo(5));
-  s.session->shutdownSessionAggregation();
-  EXPECT_TRUE(aggregated(*s.connection).empty());
+  // Ending aggregation where there is none sends nothing.
+  child.session->shutdownSessionAggregation();
+  EXPECT_TRUE(aggregated(*child.connection).empty());
 }
 
 // --- One-shot messages -------------------------------------------------------------------

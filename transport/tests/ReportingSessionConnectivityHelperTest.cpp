@@ -115,49 +115,45 @@ TEST_F(ConnectivityHelperTest, LargeChunkedBodyArrivesWholeAndInOrder) {
   EXPECT_GE(logs.count("didReceiveData: received "), 2u) << "expected the body in several deliveries";
 }
 
-TEST_F(ConnectivityHelperTest, WrongModeRequestsAreLoggedAndNeverComplete) {
+// A helper takes only the requests of its mode; helpers of unknown modes
+// (0, 3) have no configuration and take none. Refused requests are logged,
+// never registered, never sent and never completed.
+TEST_F(ConnectivityHelperTest, RequestsOfTheWrongModeAreLoggedAndNeverComplete) {
+  auto events = std::make_shared<EventLog>();
+  auto agent = std::make_shared<ReleaseCountingAgent>(events);
   auto done = Completions::make();
-  auto postHelper = Helper::initWithDelegate({}, Helper::POSTRequestMode());
-  auto getHelper = Helper::initWithDelegate({}, Helper::GETRequestMode());
-  auto dataPost = Helper::initWithDelegate({}, 4);
-  auto dataGet = Helper::initWithDelegate({}, 8);
-  postHelper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
-  getHelper->postURLRequestWithCompletionHandler(post(server.url("/"), "b"), done->handler());
-  dataPost->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
-  dataGet->postURLRequestWithCompletionHandler(post(server.url("/"), "b"), done->handler());
-
-  EXPECT_TRUE(logs.has(Level::Error, "getURLRequestWithCompletionHandler: wrong mode for GET operation detected 1"));
-  EXPECT_TRUE(logs.has(Level::Error, "postURLRequestWithCompletionHandler: wrong mode for POST operation detected 2"));
-  EXPECT_TRUE(logs.has(Level::Error, "getURLRequestWithCompletionHandler: wrong mode for GET operation detected 4"));
-  EXPECT_TRUE(logs.has(Level::Error, "postURLRequestWithCompletionHandler: wrong mode for POST operation detected 8"));
+  struct Row {
+    std::uint32_t mode;
+    bool refusesGet, refusesPost;
+  };
+  for (const Row row : {Row{Helper::POSTRequestMode(), true, false}, Row{Helper::GETRequestMode(), false, true},
+                        Row{4, true, false}, Row{8, false, true}, Row{0, true, true}, Row{3, true, true}}) {
+    const std::string m = std::to_string(row.mode);
+    SCOPED_TRACE("mode " + m);
+    const bool unknown = row.refusesGet && row.refusesPost;
+    EXPECT_EQ(Helper::privateURLSessionConfigWithMode(row.mode).has_value(), !unknown);
+    auto helper = Helper::initWithDelegate(agent, row.mode);
+    EXPECT_TRUE(isUUIDString(helper->sessionDescription()));
+    if (row.refusesGet) {
+      helper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
+      EXPECT_TRUE(logs.has(Level::Error, "getURLRequestWithCompletionHandler: wrong mode for GET operation detected " + m));
+    }
+    if (row.refusesPost) {
+      helper->postURLRequestWithCompletionHandler(post(server.url("/"), "b"), done->handler());
+      EXPECT_TRUE(logs.has(Level::Error, "postURLRequestWithCompletionHandler: wrong mode for POST operation detected " + m));
+    }
+    if (unknown) {
+      EXPECT_TRUE(logs.has(Level::Debug, "QFURLSession created with ID <" + helper->sessionDescription() + ">, delegate 0"));
+      helper->invalidate();
+      EXPECT_TRUE(logs.has(Level::Debug, "ReportingSessionConnectivityHelper:invalidate: QFURLSession with ID <" +
+                                             helper->sessionDescription() + ">"));
+    }
+  }
   // Completions come only from registered tasks, and none was registered.
   EXPECT_EQ(logs.count("createHelperForTask:"), 0u);
   EXPECT_EQ(server.requestCount(), 0u);
   EXPECT_EQ(done->count(), 0u);
   EXPECT_EQ(filesIn(Helper::storageRootFolder()), 0u);
-}
-
-TEST_F(ConnectivityHelperTest, HelpersOfUnknownModesHaveNoSessionAndCarryNothing) {
-  auto events = std::make_shared<EventLog>();
-  auto agent = std::make_shared<ReleaseCountingAgent>(events);
-  auto done = Completions::make();
-  for (const std::uint32_t mode : {0u, 3u}) {
-    EXPECT_FALSE(Helper::privateURLSessionConfigWithMode(mode).has_value());
-    auto helper = Helper::initWithDelegate(agent, mode);
-    EXPECT_TRUE(isUUIDString(helper->sessionDescription()));
-    EXPECT_TRUE(logs.has(Level::Debug, "QFURLSession created with ID <" + helper->sessionDescription() + ">, delegate 0"));
-    helper->postURLRequestWithCompletionHandler(post(server.url("/"), "b"), done->handler());
-    helper->getURLRequestWithCompletionHandler(get(server.url("/")), done->handler());
-    const std::string m = std::to_string(mode);
-    EXPECT_TRUE(logs.has(Level::Error, "postURLRequestWithCompletionHandler: wrong mode for POST operation detected " + m));
-    EXPECT_TRUE(logs.has(Level::Error, "getURLRequestWithCompletionHandler: wrong mode for GET operation detected " + m));
-    helper->invalidate();
-    EXPECT_TRUE(logs.has(Level::Debug, "ReportingSessionConnectivityHelper:invalidate: QFURLSession with ID <" +
-                                           helper->sessionDescription() + ">"));
-  }
-  EXPECT_EQ(logs.count("createHelperForTask:"), 0u);
-  EXPECT_EQ(server.requestCount(), 0u);
-  EXPECT_EQ(done->count(), 0u);
 }
 
 TEST_F(ConnectivityHelperTest, ModesGetTheirConfigurations) {
