@@ -34,7 +34,13 @@ URLSessionTask::URLSessionTask(Token, std::shared_ptr<URLSession> session, URLRe
   transfer_->bodyFile = std::move(bodyFile);
 }
 
-URLSessionTask::~URLSessionTask() = default;
+URLSessionTask::~URLSessionTask() {
+  // A task made but never started ends here; one that ran ended in the
+  // transfer engine.
+  if (state_ == State::Suspended) {
+    session_->taskFinished();
+  }
+}
 
 std::string URLSessionTask::taskDescription() const {
   std::lock_guard lock(mutex_);
@@ -79,7 +85,6 @@ void URLSessionTask::resume() {
   if (!markRunning()) {
     return;
   }
-  session_->taskStarted();
   TransferEngine::instance().start(shared_from_this());
 }
 
@@ -92,9 +97,7 @@ void URLSessionTask::cancel() {
   }
   // A suspended task is started so that it completes (with the cancellation)
   // exactly like any other.
-  if (markRunning()) {
-    session_->taskStarted();
-  }
+  (void)markRunning();
   TransferEngine::instance().cancel(shared_from_this());
 }
 
@@ -132,6 +135,10 @@ std::shared_ptr<URLSessionTask> URLSession::makeTask(const URLRequest& request, 
     if (invalidating_) {
       return nullptr;
     }
+    // Counted from here, not from its start: an invalidation that comes
+    // between the two waits for this task's completion instead of dropping
+    // the delegate the task is about to report to.
+    ++running_;
     identifier = ++nextTaskIdentifier_;
   }
   return std::make_shared<URLSessionTask>(URLSessionTask::Token{}, shared_from_this(), request, identifier,
@@ -173,11 +180,6 @@ void URLSession::finishTasksAndInvalidate() {
     delegate_.reset();
   }
   postInvalidation(std::move(delegate));
-}
-
-void URLSession::taskStarted() {
-  std::lock_guard lock(mutex_);
-  ++running_;
 }
 
 void URLSession::taskFinished() {

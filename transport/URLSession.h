@@ -206,8 +206,8 @@ class URLSession : public std::enable_shared_from_this<URLSession> {
   friend class TransferEngine;
   friend class URLSessionTask;
 
-  // A task was resumed / has delivered its completion.
-  void taskStarted();
+  // A task made by this session has delivered its completion, or was
+  // dropped without being started.
   void taskFinished();
   void postInvalidation(std::shared_ptr<URLSessionDelegate> delegate);
   // The delegate for a starting task (empty when gone).
@@ -221,7 +221,7 @@ class URLSession : public std::enable_shared_from_this<URLSession> {
   std::weak_ptr<URLSessionDelegate> delegate_;
   std::shared_ptr<URLSessionDelegate> retainedDelegate_;  // until the invalidation is delivered
   std::string description_;
-  std::size_t running_ = 0;
+  std::size_t running_ = 0;  // tasks made and not yet finished
   std::uint64_t nextTaskIdentifier_ = 0;
   bool invalidating_ = false;
   bool invalidated_ = false;
