@@ -11,25 +11,6 @@
 namespace zerith::ipc::test {
 namespace {
 
-// Sends `frame` with `fds` attached to its first byte.
-void sendWithDescriptors(int socket, const Data& frame, const std::vector<int>& fds) {
-  iovec part{const_cast<std::uint8_t*>(frame.data()), frame.size()};
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * 8)] = {};
-  msghdr m{};
-  m.msg_iov = &part;
-  m.msg_iovlen = 1;
-  if (!fds.empty()) {
-    m.msg_control = control;
-    m.msg_controllen = CMSG_SPACE(sizeof(int) * fds.size());
-    cmsghdr* c = CMSG_FIRSTHDR(&m);
-    c->cmsg_level = SOL_SOCKET;
-    c->cmsg_type = SCM_RIGHTS;
-    c->cmsg_len = CMSG_LEN(sizeof(int) * fds.size());
-    std::memcpy(CMSG_DATA(c), fds.data(), sizeof(int) * fds.size());
-  }
-  ASSERT_EQ(::sendmsg(socket, &m, MSG_NOSIGNAL), static_cast<ssize_t>(frame.size()));
-}
-
 // A pipe whose write end is sent: once every copy of it is closed, its read
 // end sees end of file.
 struct Pipe {
@@ -64,7 +45,7 @@ TEST_P(DescriptorPassingTest, TheCallGetsWhatItClaimedAndTheRestIsClosed) {
   for (const auto& p : pipes) {
     fds.push_back(p.write.get());
   }
-  sendWithDescriptors(peer.raw.fd(), encodeCall("upload", 1, Dictionary(), c.claimed), fds);
+  ASSERT_TRUE(zerith::test::sendWithDescriptors(peer.raw.fd(), encodeCall("upload", 1, Dictionary(), c.claimed), fds));
   ASSERT_TRUE(peer.object->received.waitFor(1));
   const auto calls = peer.object->calls();
   ASSERT_EQ(calls[0].descriptors.size(), c.received);

@@ -6,138 +6,34 @@
 // every event whose send the daemon answered arrives, once, after restarts.
 
 #include <dirent.h>
+#include <fmt/format.h>
 
 #include <algorithm>
 #include <atomic>
 #include <csignal>
-#include <iostream>
 #include <filesystem>
-#include <map>
-#include <mutex>
+#include <iostream>
 #include <random>
 #include <set>
-#include <sstream>
 #include <thread>
 
-#include <fmt/format.h>
-
 #include "backends/BackendCounters.h"
-#include "ipc/DaemonStatus.h"
 #include "tests/e2e/BehavingCollector.h"
-#include "tests/e2e/E2eFixture.h"
-#include "tests/support/CollectorProcess.h"
-#include "tools/zerith/ZerithCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
 namespace {
 
-namespace fs = std::filesystem;
 using Json = nlohmann::ordered_json;
 
-// The collector's lines, read on a thread of their own so that its output
-// pipe never fills while the test floods: record IDs by event number.
-class CollectorReader {
- public:
-  explicit CollectorReader(CollectorProcess& collector)
-      : thread_([this, &collector] {
-          while (!stop_) {
-            if (auto line = collector.nextLine({}, 200ms)) {
-              absorb(*line);
-            }
-          }
-        }) {}
-  ~CollectorReader() {
-    stop_ = true;
-    thread_.join();
-  }
-  std::size_t recordsTaken() const {
-    std::lock_guard lock(mutex_);
-    return records_;
-  }
-  std::map<int, std::set<std::string>> idsByNumber() const {
-    std::lock_guard lock(mutex_);
-    return ids_;
-  }
-  // Waits (bounded) until every number in `wanted` was taken.
-  bool waitFor(const std::set<int>& wanted, std::chrono::seconds timeout) const {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    while (std::chrono::steady_clock::now() < deadline) {
-      {
-        std::lock_guard lock(mutex_);
-        if (std::all_of(wanted.begin(), wanted.end(), [&](int n) { return ids_.count(n) != 0; })) {
-          return true;
-        }
-      }
-      std::this_thread::sleep_for(100ms);
-    }
-    return false;
-  }
-
- private:
-  void absorb(const Json& line) {
-    if (line.value("kind", "") != "record" || line.value("status", 0) != 200) {
-      return;
-    }
-    std::lock_guard lock(mutex_);
-    ++records_;
-    const auto& record = line["record"];
-    if (record.value("_method", 0) == 3) {
-      ids_[record.value("n", -1)].insert(record.value("_recordID", std::string("none")));
-    }
-  }
-
-  mutable std::mutex mutex_;
-  std::size_t records_ = 0;
-  std::map<int, std::set<std::string>> ids_;
-  std::atomic<bool> stop_{false};
-  std::thread thread_;
-};
-
-class AccountingTest : public E2eTest {
+class AccountingTest : public BehavingCollectorTest {
  protected:
-  void startAll(const Dictionary& keys, const Dictionary& clientEntry) {
-    const Value policy(Dictionary{
-        {"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
-        {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", true}, {ipc::kDaemonStatusEntitlement, true}})}});
-    root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
-    for (const auto& [key, value] : keys) {
-      Defaults("com.velmar.zerith").setObject(key, value);
-    }
-    const fs::path certs = root.path() / "collector/certs";
-    const fs::path www = root.path() / "collector/www";
-    behaviourFile = root.path() / "collector/behaviour";
-    collector = startBehavingCollector(root.path(), behaviourFile);
-    ASSERT_GT(collector->port(), 0) << collector->said();
-    publishSignedStorebag(collectorStorebag(collector->url("/post"), clientEntry), www, collector->url("/zerith"));
-    reader = std::make_unique<CollectorReader>(*collector);
-    startDaemon(collectorDaemonOptions(certs));
-  }
-
-  void behave(const std::string& text) { ASSERT_TRUE(writeBehaviour(behaviourFile, text)); }
-
-  static Value event(int n) {
-    return Value(Dictionary{{kZerithMessageParametersCategory, Value(3)},
-                            {kZerithMessageParametersType, Value(4)},
-                            {kZerithMessageParametersPayload, Value(Dictionary{{"n", n}, {"pad", std::string(300, 'p')}})}});
-  }
-
-  Json status() {
-    const std::string rootPath = root.path().string();
-    std::vector<const char*> argv = {"zerith", "--root", rootPath.c_str(), "status", "--json"};
-    std::ostringstream out;
-    std::ostringstream err;
-    EXPECT_EQ(cli::run(static_cast<int>(argv.size()), argv.data(), out, err), 0) << err.str();
-    return Json::parse(out.str(), nullptr, false);
-  }
-
   // The ended sessions' totals of the HTTPS backend once nothing is in a
   // batch, in flight or in the spool (bounded wait).
   Json settledTotals(std::size_t sessions) {
     Json counts;
     for (int i = 0; i < 600; ++i) {
-      const Json s = status();
-      for (const auto& total : s.value("ended", Json::array())) {
+      for (const auto& total : statusJson().value("ended", Json::array())) {
         if (total.value("backend", "") == "httpsPost" && total.value("sessions", 0u) == sessions) {
           counts = total["counts"];
         }
@@ -161,10 +57,6 @@ class AccountingTest : public E2eTest {
     }
     return n;
   }
-
-  std::unique_ptr<CollectorProcess> collector;
-  std::unique_ptr<CollectorReader> reader;
-  fs::path behaviourFile;
 };
 
 struct FloodRow {
@@ -177,13 +69,11 @@ class AccountingFloodTest : public AccountingTest, public ::testing::WithParamIn
 TEST_P(AccountingFloodTest, EveryAcceptedEventIsDeliveredSpooledOrDroppedWithAReason) {
   constexpr int kClients = 4;
   constexpr int kEvents = 250;
-  Dictionary keys{{"postsInFlightPerBackend", 4}, {"postsWaitingPerBackend", 8}};
-  if (GetParam().spool) {
-    keys.set("spoolEnabled", true);
-    keys.set("spoolRetryInitialSeconds", 0.2);
-    keys.set("spoolRetryMaxSeconds", 1.0);
-  }
-  startAll(keys, Dictionary{{"expedite", 0}, {"event_threshold", 9}});
+  Dictionary keys = GetParam().spool ? spoolOn() : Dictionary{};
+  keys.set("postsInFlightPerBackend", 4);
+  keys.set("postsWaitingPerBackend", 8);
+  startAll(keys, Dictionary{{"expedite", 0}, {"event_threshold", 9}},
+           /*status=*/true);
 
   std::vector<std::unique_ptr<Zerith>> clients;
   for (int c = 0; c < kClients; ++c) {
@@ -197,7 +87,7 @@ TEST_P(AccountingFloodTest, EveryAcceptedEventIsDeliveredSpooledOrDroppedWithARe
   for (int c = 0; c < kClients; ++c) {
     threads.emplace_back([&, c] {
       for (int i = 0; i < kEvents; ++i) {
-        if (clients[c]->sendMessage(event(c * kEvents + i), 10s)) {
+        if (clients[c]->sendMessage(numbered(c * kEvents + i, 300), 10s)) {
           ++sent;
         }
       }
@@ -221,7 +111,7 @@ TEST_P(AccountingFloodTest, EveryAcceptedEventIsDeliveredSpooledOrDroppedWithARe
   EXPECT_EQ(sent, kClients * kEvents);
 
   const Json counts = settledTotals(kClients);
-  ASSERT_FALSE(counts.is_null()) << status().dump();
+  ASSERT_FALSE(counts.is_null()) << statusJson().dump();
   BackendCountsSnapshot snapshot{};
   for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
     snapshot[i] = counts.value(std::string(backendCountName(static_cast<BackendCount>(i))), 0ull);
@@ -257,8 +147,7 @@ INSTANTIATE_TEST_SUITE_P(Spool, AccountingFloodTest,
                          [](const ::testing::TestParamInfo<FloodRow>& info) { return std::string(info.param.name); });
 
 TEST_F(AccountingTest, AKillAtRandomMomentsLosesNoAnsweredEventAndDeliversEachOnce) {
-  startAll(Dictionary{{"spoolEnabled", true}, {"spoolRetryInitialSeconds", 0.2}, {"spoolRetryMaxSeconds", 1.0}},
-           Dictionary{{"expedite", 1}});  // every event is a batch of its own
+  startAll(spoolOn(), Dictionary{{"expedite", 1}});  // every event is a batch of its own
   std::mt19937 random(std::random_device{}());
   std::set<int> answered;
   int next = 0;
@@ -266,7 +155,7 @@ TEST_F(AccountingTest, AKillAtRandomMomentsLosesNoAnsweredEventAndDeliversEachOn
   for (int round = 0; round < kRounds; ++round) {
     if (round > 0) {
       behave("answer");
-      startDaemon(collectorDaemonOptions(root.path() / "collector/certs"));
+      startDaemon(daemonOptions());
     }
     auto client = startDemoSession(static_cast<std::uint32_t>(800 + round));
     ASSERT_TRUE(client) << daemon->output();
@@ -277,7 +166,7 @@ TEST_F(AccountingTest, AKillAtRandomMomentsLosesNoAnsweredEventAndDeliversEachOn
     std::thread sender([&] {
       for (int i = 0; i < 5000 && !stop; ++i) {
         const int n = next + i;
-        if (!client->sendMessage(event(n), 5s)) {
+        if (!client->sendMessage(numbered(n, 300), 5s)) {
           return;
         }
         acked.push_back(n);
@@ -294,7 +183,7 @@ TEST_F(AccountingTest, AKillAtRandomMomentsLosesNoAnsweredEventAndDeliversEachOn
     daemon.reset();
   }
   behave("answer");
-  startDaemon(collectorDaemonOptions(root.path() / "collector/certs"));
+  startDaemon(daemonOptions());
   ASSERT_FALSE(answered.empty());
   EXPECT_TRUE(reader->waitFor(answered, 60s)) << daemon->output();
   const auto ids = reader->idsByNumber();

@@ -1,17 +1,16 @@
 // What became of a session's events, end to end: a real client sends events
-// that one HTTPS backend posts, filters out and refuses by its blacklist and
-// that a sampled-out second backend drops; the collector reads the counts in
-// the session's final report, and `zerith status` reads the totals of the
-// ended session from the daemon (and is refused without its entitlement).
+// that one HTTPS backend posts (the collector sees the record with the
+// sender code, the session ID and the filtered payload), filters out and
+// refuses by its blacklist and that a sampled-out second backend drops; the
+// collector reads the counts in the session's final report, and `zerith
+// status` reads the totals of the ended session from the daemon (and is
+// refused without its entitlement).
 
 #include <filesystem>
-#include <sstream>
 
-#include "config/StorebagSigner.h"
-#include "ipc/DaemonStatus.h"
+#include "backends/ZerithBackend.h"
 #include "tests/e2e/E2eFixture.h"
 #include "tests/support/CollectorProcess.h"
-#include "tools/zerith/ZerithCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -21,19 +20,8 @@ namespace fs = std::filesystem;
 
 class BackendCountsTest : public E2eTest {
  protected:
-  // The session entitlement, and the status one when `status` is set.
-  void entitle(bool status) {
-    Dictionary entitlements{{"com.velmar.private.zerithd", true}};
-    if (status) {
-      entitlements.set(ipc::kDaemonStatusEntitlement, true);
-    }
-    const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
-                                  {"entitlements", Value(std::move(entitlements))}});
-    root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
-  }
-
   void startAll() {
-    entitle(false);
+    grant(Value(true));
     const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
     collector = std::make_unique<CollectorProcess>(
@@ -41,48 +29,16 @@ class BackendCountsTest : public E2eTest {
         std::vector<std::string>{"--generate-cert", certs.string(), "--serve", www.string(), "--status", "200"});
     ASSERT_GT(collector->port(), 0) << collector->said();
 
-    Dictionary posting{{"client", "demo"},
-                       {"service", "cli"},
-                       {"override_dnu", 1},
-                       {"locale_whitelist", Array{Value("GB")}},
-                       {"filters", Array{Value(Dictionary{{"key", "none"}, {"action", "keep"}})}},
-                       {"sampling_threshold", 1.0},
-                       {"event_whitelist", Array{Value(0), Value(3), Value(6)}},
-                       {"event_blacklist", Array{Value(6)}},
-                       {"post_url", collector->url("/post")}};
+    Dictionary posting{{"event_whitelist", Array{Value(0), Value(3), Value(6)}}, {"event_blacklist", Array{Value(6)}}};
     // No draw is below 0: this one is sampled out and batches what it gets.
-    Dictionary sampled = posting;
-    sampled.set("sampling_threshold", 0.0);
-    sampled.erase("event_whitelist");
-    sampled.erase("event_blacklist");
-    const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{Value(posting)}}}},
-                                   {"httpsPost2", Dictionary{{"clients", Array{Value(sampled)}}}}});
-    const Value bag(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
-    publishSignedStorebag(bag, www, collector->url("/zerith"));
+    const Value sampled = collectorStorebag(collector->url("/post"), Dictionary{{"sampling_threshold", 0.0}});
+    Value bag = collectorStorebag(collector->url("/post"), posting);
+    Dictionary section = bag["seed"].dictCopy();
+    section.set("httpsPost2", sampled["seed"]["httpsPost"]);
+    publishSignedStorebag(
+        Value(Dictionary{{"version", "8.1.0"}, {"seed", Value(section)}, {"release", Value(section)}}), www,
+        collector->url("/zerith"));
     startDaemon(collectorDaemonOptions(certs));
-  }
-
-  struct Run {
-    int status;
-    std::string out;
-    std::string err;
-  };
-  Run zerithStatus(bool json) {
-    const std::string rootPath = root.path().string();
-    std::vector<const char*> argv = {"zerith", "--root", rootPath.c_str(), "status"};
-    if (json) {
-      argv.push_back("--json");
-    }
-    std::ostringstream out;
-    std::ostringstream err;
-    const int status = cli::run(static_cast<int>(argv.size()), argv.data(), out, err);
-    return {status, out.str(), err.str()};
-  }
-
-  static Value event(int category) {
-    return Value(Dictionary{{kZerithMessageParametersCategory, Value(category)},
-                            {kZerithMessageParametersType, Value(1)},
-                            {kZerithMessageParametersPayload, Value(Dictionary{{"n", category}})}});
   }
 
   std::unique_ptr<CollectorProcess> collector;
@@ -97,7 +53,8 @@ TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
     ASSERT_TRUE(started) << daemon->output();
     EXPECT_EQ(started["backends"], Value(Array{Value("httpsPost"), Value("httpsPost2")})) << daemon->output();
     for (const int category : {3, 5, 6}) {  // posted, not whitelisted, blacklisted
-      ASSERT_TRUE(client->sendMessage(event(category), 10s));
+      ASSERT_TRUE(
+          client->sendMessage(event(category, 1, Value(Dictionary{{"n", category}, {"udid", "device-7"}})), 10s));
     }
     client->flushMessages(10s);  // the sampled-out batch goes
     ASSERT_TRUE(client->finishSession(10s));
@@ -106,13 +63,27 @@ TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
   ASSERT_TRUE(daemon->waitFor(kTransactionEnded)) << daemon->output();
 
   std::optional<nlohmann::ordered_json> report;
+  std::optional<nlohmann::ordered_json> posted;
   while (!report) {
     const auto line = collector->nextLine("record");
     ASSERT_TRUE(line) << daemon->output();
     if ((*line)["record"]["_method"] == 0 && (*line)["record"]["_status"] == 1) {
       report = (*line)["record"];
+    } else if ((*line)["record"]["_method"] == 3) {
+      ASSERT_FALSE(posted) << "one event posted twice: " << *line;
+      posted = *line;
     }
   }
+  // The posted event arrived as a record with the sender code, the session
+  // ID, the user info and its device identifier hashed by the filter.
+  ASSERT_TRUE(posted);
+  EXPECT_EQ((*posted)["_sender"], "YJ");
+  EXPECT_EQ((*posted)["_sessionID"], 515);
+  EXPECT_EQ((*posted)["path"], "/post");
+  EXPECT_EQ((*posted)["record"]["clientName"], "demo");
+  EXPECT_EQ((*posted)["record"]["_status"], 1);
+  EXPECT_EQ((*posted)["record"]["n"], 3);
+  EXPECT_EQ((*posted)["record"]["udid"], ZerithBackend::convertIntoSHA256("device-7"));
   // As the report was made: the start message and category 3 posted, 5 and
   // 6 refused by the lists; the second backend's four events (start, 3, 5,
   // 6) batched and dropped at the flush.
@@ -126,13 +97,13 @@ TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
   EXPECT_TRUE(report->contains("SessionsCount_YJ"));
 
   // Without its own entitlement the status is refused, the connection kept.
-  const Run refused = zerithStatus(true);
+  const CliRun refused = zerith({"status", "--json"});
   EXPECT_EQ(refused.status, cli::kExitRefused) << refused.err;
   EXPECT_NE(refused.err.find(ipc::kDaemonStatusEntitlement), std::string::npos) << refused.err;
   EXPECT_TRUE(daemon->waitFor("refusing the status to")) << daemon->output();
 
-  entitle(true);
-  const Run json = zerithStatus(true);
+  grant(Value(true), /*status=*/true);
+  const CliRun json = zerith({"status", "--json"});
   ASSERT_EQ(json.status, 0) << json.err;
   const auto parsed = nlohmann::ordered_json::parse(json.out);
   // The asking connection is not listed; the refused one may still be, on
@@ -156,7 +127,7 @@ TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
   EXPECT_EQ(sampled["counts"]["droppedSampledOut"], 5);
   EXPECT_EQ(sampled["counts"]["sent"], 0);
 
-  const Run table = zerithStatus(false);
+  const CliRun table = zerith({"status"});
   ASSERT_EQ(table.status, 0) << table.err;
   EXPECT_NE(table.out.find("Ended sessions, totals by client type and backend:"), std::string::npos) << table.out;
   EXPECT_NE(table.out.find("sampledOut 5"), std::string::npos) << table.out;

@@ -21,30 +21,12 @@ class ClientSessionTest : public E2eTest {
     options.arguments = {"--stop-timeout", "10"};
     startDaemon(options);
   }
-
-  static std::unique_ptr<Zerith> connect() {
-    Error error;
-    auto client = Zerith::connect({}, &error);
-    EXPECT_NE(client, nullptr) << error.description;
-    return client;
-  }
-
-  static Value info(std::uint32_t sessionID) {
-    return Value(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)}, {kZerithSessionInfoClientType, Value(7)}});
-  }
-  static Value hierarchy(std::uint32_t sessionID, std::int64_t level) {
-    Dictionary d = info(sessionID).dictCopy();
-    d.set(kZerithSessionInfoHierarchyToken,
-          Value(Dictionary{{kZerithHierarchyTokenTokenID, Value("call-1")},
-                           {kZerithHierarchyTokenLevel, Value(static_cast<long long>(level))}}));
-    return Value(std::move(d));
-  }
 };
 
 TEST_F(ClientSessionTest, LifecycleOperationsAnswerAsASessionWithoutBackends) {
   auto client = connect();
   ASSERT_TRUE(client);
-  ASSERT_TRUE(client->setSessionInfo(info(42), Value(), Value(), false, 10s));
+  ASSERT_TRUE(client->setSessionInfo(sessionInfo(42), Value(), Value(), false, 10s));
   EXPECT_TRUE(daemon->waitForExact(Level::Debug, "setSessionInfo: Configuring session 42"));
 
   // No storebag server answers: the start completes with nil.
@@ -54,8 +36,7 @@ TEST_F(ClientSessionTest, LifecycleOperationsAnswerAsASessionWithoutBackends) {
   // The error line ends with the cause (the storebag server is unreachable).
   EXPECT_TRUE(daemon->waitFor("fetchAndCacheStorebag: Unable to fetch storebag for client type 7: "));
 
-  const auto states =
-      client->fetchStates(Value(Dictionary{{kZerithUserInfoClientName, Value("mail")}}), 10s);
+  const auto states = client->fetchStates(Value(Dictionary{{kZerithUserInfoClientName, Value("mail")}}), 10s);
   ASSERT_TRUE(states);
   EXPECT_TRUE(states["backends"].isNil());
   EXPECT_TRUE(daemon->waitForExact(Level::Debug, "receivedUserInfo: Received new user info for session 42"));
@@ -64,8 +45,7 @@ TEST_F(ClientSessionTest, LifecycleOperationsAnswerAsASessionWithoutBackends) {
   ASSERT_TRUE(url);
   EXPECT_EQ(url["url"], Value("URL not available"));
 
-  const auto sent = client->sendMessage(
-      Value(Dictionary{{kZerithMessageParametersCategory, Value(1)}, {kZerithMessageParametersType, Value(2)}}), 10s);
+  const auto sent = client->sendMessage(event(1, 2), 10s);
   ASSERT_TRUE(sent);
   EXPECT_TRUE(sent["result"].isNil());
   EXPECT_TRUE(daemon->waitForExact(Level::Debug, "sendMessageWithDictionary: No backends available to send message"));
@@ -88,8 +68,7 @@ TEST_F(ClientSessionTest, LifecycleOperationsAnswerAsASessionWithoutBackends) {
   EXPECT_EQ(oneShot["result"], Value("Could not retrieve identifiers from sessionInfo"));
 
   ASSERT_TRUE(client->finishSession(10s));
-  EXPECT_TRUE(
-      daemon->waitForExact(Level::Debug, "finishSessionGracefully: Session 42 has been finished gracefully"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "finishSessionGracefully: Session 42 has been finished gracefully"));
 
   client->invalidate();
   EXPECT_TRUE(daemon->waitForExact(Level::Debug, "dealloc: ZerithdSession dealloc: 42"));
@@ -102,12 +81,16 @@ TEST_F(ClientSessionTest, KeepAliveCountFollowsBothTransportsAndEndsOnce) {
   ASSERT_TRUE(first && second);
   ASSERT_TRUE(first->fetchDisplayURL(10s));
   ASSERT_TRUE(second->fetchDisplayURL(10s));
-  EXPECT_TRUE(
-      daemon->waitForExact(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 1"));
-  EXPECT_TRUE(
-      daemon->waitForExact(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 2"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Default,
+                                   "createReportingSessionWithDelegate: "
+                                   "retained VeskTransaction. Ref count is 1"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Default,
+                                   "createReportingSessionWithDelegate: "
+                                   "retained VeskTransaction. Ref count is 2"));
   EXPECT_TRUE(daemon->waitFor("as it has proper entitlement, 1(0) connections."));
-  EXPECT_EQ(daemon->count("createReportingSessionWithDelegate: Vesk transaction started with session"), 1u);
+  EXPECT_EQ(daemon->count("createReportingSessionWithDelegate: Vesk "
+                          "transaction started with session"),
+            1u);
 
   first.reset();
   ASSERT_TRUE(daemon->waitForExact(Level::Default, "releaseVeskTransaction: Vesk transaction ref count is 1"));
@@ -130,7 +113,9 @@ TEST_F(ClientSessionTest, SessionsArrivingWhileAnEndedTransportClosesKeepThePair
   // each session releases once, and there is one end each time the count
   // reaches 0.
   constexpr const char* kRelease = "releaseVeskTransaction: Vesk transaction ref count is ";
-  constexpr const char* kBegin = "createReportingSessionWithDelegate: Vesk transaction started with session";
+  constexpr const char* kBegin =
+      "createReportingSessionWithDelegate: Vesk "
+      "transaction started with session";
   int secondTransactions = 0;
   for (std::size_t round = 1; round <= 20; ++round) {
     const std::size_t beginsBefore = daemon->count(kBegin);
@@ -165,19 +150,20 @@ TEST_F(ClientSessionTest, AggregatingRootEndsItsChildsAggregationOverTheChildsCo
   auto root = connect();
   auto child = connect();
   ASSERT_TRUE(root && child);
-  child->setMessageHandler([&](const Value& message, double timestamp, std::uint16_t category, std::uint16_t type,
-                               const Value& payload) {
-    if (messages++ == 0) {
-      received.set_value(Dictionary{{"message", message},
-                                    {"timestamp", Value(timestamp)},
-                                    {"category", Value(unsigned{category})},
-                                    {"type", Value(unsigned{type})},
-                                    {"payload", payload}});
-    }
-  });
-  ASSERT_TRUE(root->setSessionInfo(hierarchy(1, 0), Value(), Value(), true, 10s));
-  ASSERT_TRUE(child->setSessionInfo(hierarchy(2, 1), Value(), Value(), true, 10s));
-  // New user info makes the child re-derive its place below the aggregating root.
+  child->setMessageHandler(
+      [&](const Value& message, double timestamp, std::uint16_t category, std::uint16_t type, const Value& payload) {
+        if (messages++ == 0) {
+          received.set_value(Dictionary{{"message", message},
+                                        {"timestamp", Value(timestamp)},
+                                        {"category", Value(unsigned{category})},
+                                        {"type", Value(unsigned{type})},
+                                        {"payload", payload}});
+        }
+      });
+  ASSERT_TRUE(root->setSessionInfo(hierarchy(1, "call-1", 0), Value(), Value(), true, 10s));
+  ASSERT_TRUE(child->setSessionInfo(hierarchy(2, "call-1", 1), Value(), Value(), true, 10s));
+  // New user info makes the child re-derive its place below the aggregating
+  // root.
   ASSERT_TRUE(child->fetchStates(Value(Dictionary{{kZerithUserInfoClientName, Value("facetime")}}), 10s));
 
   auto future = received.get_future();
@@ -187,17 +173,19 @@ TEST_F(ClientSessionTest, AggregatingRootEndsItsChildsAggregationOverTheChildsCo
                                       {"category", Value(0u)},
                                       {"type", Value(0u)},
                                       {"payload", Value()}}));
-  // The daemon's log arrives through a pipe of its own, maybe after the message.
+  // The daemon's log arrives through a pipe of its own, maybe after the
+  // message.
   EXPECT_TRUE(
       daemon->waitForExact(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 2"));
-  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "updateCorrelatedSessions: Adding session 2 to list for hierarchyToken "
-                                        "call-1 with hierarchyLevel 1"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug,
+                                   "updateCorrelatedSessions: Adding session 2 to list for hierarchyToken "
+                                   "call-1 with hierarchyLevel 1"));
 }
 
 TEST_F(ClientSessionTest, SharedDataOfAHierarchyOutlivesItsLastSession) {
   auto client = connect();
   ASSERT_TRUE(client);
-  ASSERT_TRUE(client->setSessionInfo(hierarchy(1, 0), Value(), Value(), false, 10s));
+  ASSERT_TRUE(client->setSessionInfo(hierarchy(1, "call-1", 0), Value(), Value(), false, 10s));
   ASSERT_TRUE(client->updateSharedData(Value(Dictionary{{"codec", Value("opus")}}), 10s));
   ASSERT_TRUE(client->updateSharedDataForKey(Value("codec"), Value(), 10s));
   client.reset();

@@ -20,7 +20,8 @@ void expectServing(RawFrameSocket& client, std::uint64_t number) {
   EXPECT_EQ((*reply)["args"]["url"], Value("URL not available"));
 }
 
-// --- Admission ----------------------------------------------------------------
+// --- Admission
+// ----------------------------------------------------------------
 
 TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
   for (const Value& entitlement : {Value(), Value(false), Value("yes")}) {
@@ -44,9 +45,10 @@ TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
   EXPECT_TRUE(daemon->waitFor("as it has proper entitlement, 0(0) connections."));
 }
 
-// --- Hostile and broken input ------------------------------------------------------
+// --- Hostile and broken input
+// ------------------------------------------------------
 
-TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnection) {
+TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnectionAndWrongCallsAreAnswered) {
   grant(Value(true));
   startDaemon();
   auto bystander = RawFrameSocket::connect();
@@ -61,7 +63,8 @@ TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnection) {
          return Data(xml.begin(), xml.end());
        }())},
       {"array root", frameWithBody(plist::encodeBinary(Value(Array{Value(1)})))},
-      {"truncated plist", [] {
+      {"truncated plist",
+       [] {
          Data body = plist::encodeBinary(Value(Dictionary{{"op", Value(kDisplayURL)}, {"call", Value(1)}}));
          body.resize(body.size() / 2);
          return frameWithBody(body);
@@ -76,29 +79,21 @@ TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnection) {
     EXPECT_TRUE(attacker->waitClosed());
     expectServing(*bystander, n++);
   }
-  EXPECT_TRUE(daemon->running());
-}
 
-TEST_F(E2eTest, WrongCallsAreAnsweredWithErrorsAndTheConnectionGoesOn) {
-  grant(Value(true));
-  startDaemon();
-  auto client = RawFrameSocket::connect();
-  ASSERT_TRUE(client.has_value());
-
-  ASSERT_TRUE(client->call("noSuchOperation:", 1));
-  auto reply = client->replyTo(1);
+  // Wrong calls are answered with errors and the connection goes on.
+  ASSERT_TRUE(bystander->call("noSuchOperation:", n));
+  auto reply = bystander->replyTo(n++);
   ASSERT_TRUE(reply.has_value());
   EXPECT_EQ((*reply)["error"]["code"], Value(-1));
-
   // A session info that is not a dictionary never reaches the session.
-  ASSERT_TRUE(client->call("setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock:", 2,
-                           Dictionary{{"sessionInfo", Value("not a dictionary")}}));
-  reply = client->replyTo(2);
+  ASSERT_TRUE(bystander->call("setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock:", n,
+                              Dictionary{{"sessionInfo", Value("not a dictionary")}}));
+  reply = bystander->replyTo(n++);
   ASSERT_TRUE(reply.has_value());
   EXPECT_FALSE((*reply)["error"].isNil());
   EXPECT_EQ(daemon->count("setSessionInfo: Configuring session"), 0u);
-
-  expectServing(*client, 3);
+  expectServing(*bystander, n);
+  EXPECT_TRUE(daemon->running());
 }
 
 TEST_F(E2eTest, ClientVanishingMidCallEndsItsSessionAndTheTransaction) {
@@ -123,7 +118,8 @@ TEST_F(E2eTest, ClientVanishingMidCallEndsItsSessionAndTheTransaction) {
   expectServing(*next, 1);
 }
 
-// --- Stopping --------------------------------------------------------------------------
+// --- Stopping
+// --------------------------------------------------------------------------
 
 TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
   grant(Value(true));
@@ -173,7 +169,8 @@ TEST_F(E2eTest, StopTimeOutEndsTheDrainOfASessionThatStaysOpen) {
   expectServing(*client, 1);
   EXPECT_EQ(daemon->stop(10s), 0) << daemon->output();
   EXPECT_TRUE(daemon->has(Level::Error,
-                          "main: Stop time-out passed with the keep-alive transaction still open, exiting"));
+                          "main: Stop time-out passed with the "
+                          "keep-alive transaction still open, exiting"));
 }
 
 TEST_F(E2eTest, SocketThatCannotBeCreatedFailsTheStartWithAClearMessage) {

@@ -5,16 +5,19 @@
 // it; raw socket clients are tests/support/RawFrameSocket.h.
 
 #include <gtest/gtest.h>
-
 #include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
 #include <memory>
+#include <nlohmann/json.hpp>
 #include <optional>
+#include <sstream>
 #include <string>
+#include <vector>
 
 #include "config/StorebagSigner.h"
+#include "ipc/DaemonStatus.h"
 #include "ipc/Frame.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
@@ -24,6 +27,8 @@
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/RawFrameSocket.h"
 #include "tests/support/TempRoot.h"
+#include "tests/support/TestCA.h"
+#include "tools/zerith/ZerithCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -37,11 +42,15 @@ class E2eTest : public ::testing::Test {
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value("https://127.0.0.1:1/zerith"));
   }
 
-  // The test's own user may (or may not) report.
-  void grant(const Value& entitlement) {
+  // The test's own user may (or may not) report, and read the daemon's
+  // status when `status` is set.
+  void grant(const Value& entitlement, bool status = false) {
     Dictionary entitlements;
     if (!entitlement.isNil()) {
       entitlements.set("com.velmar.private.zerithd", entitlement);
+    }
+    if (status) {
+      entitlements.set(ipc::kDaemonStatusEntitlement, true);
     }
     const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
                                   {"entitlements", Value(std::move(entitlements))}});
@@ -67,8 +76,9 @@ class E2eTest : public ::testing::Test {
     return container.value_or(Data());
   }
 
-  // Signs `bag` (signedStorebag), writes it where a collector serving `www` hands out the storebag
-  // "dravon", and points the daemon's storebag URL at `storebagURL`.
+  // Signs `bag` (signedStorebag), writes it where a collector serving `www`
+  // hands out the storebag "dravon", and points the daemon's storebag URL at
+  // `storebagURL`.
   void publishSignedStorebag(const Value& bag, const std::filesystem::path& www, const std::string& storebagURL) {
     std::filesystem::create_directories(www / "zerith");
     ASSERT_TRUE(file::writeAtomically(www / "zerith/dravon", signedStorebag(bag), std::filesystem::perms(0644)));
@@ -133,6 +143,82 @@ class E2eTest : public ::testing::Test {
     options.arguments = {"--stop-timeout", "5", "--ca-file", (certs / "ca.pem").string()};
     options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
     return options;
+  }
+
+  // A daemon that trusts the test CA (TestCA::shared, what HttpsTestServer
+  // serves with) and reads its locale from `locale` when given.
+  static DaemonProcess::Options testCAOptions(const char* locale = "en_GB.UTF-8") {
+    DaemonProcess::Options options;
+    options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
+    if (locale) {
+      options.environment = {{"LC_ALL", locale}};
+    }
+    return options;
+  }
+
+  static std::unique_ptr<Zerith> connect() {
+    Error error;
+    auto client = Zerith::connect({}, &error);
+    EXPECT_NE(client, nullptr) << error.description;
+    return client;
+  }
+
+  static Value sessionInfo(std::uint32_t sessionID, long long clientType = 7) {
+    return Value(
+        Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)}, {kZerithSessionInfoClientType, Value(clientType)}});
+  }
+  // The session info of a member of the hierarchy `token` at `level`.
+  static Value hierarchy(std::uint32_t sessionID, const std::string& token, long long level) {
+    Dictionary d = sessionInfo(sessionID).dictCopy();
+    d.set(kZerithSessionInfoHierarchyToken,
+          Value(Dictionary{{kZerithHierarchyTokenTokenID, Value(token)}, {kZerithHierarchyTokenLevel, Value(level)}}));
+    return Value(std::move(d));
+  }
+  // An event's message parameters; no payload when `payload` is nil.
+  static Value event(long long category, long long type, const Value& payload = Value()) {
+    Dictionary d{{kZerithMessageParametersCategory, Value(category)}, {kZerithMessageParametersType, Value(type)}};
+    if (!payload.isNil()) {
+      d.set(kZerithMessageParametersPayload, payload);
+    }
+    return Value(std::move(d));
+  }
+
+  // The backends a new session `sessionID` of client type 7 starts with;
+  // nil when the daemon has no storebag for it.
+  Value startedBackends(std::uint32_t sessionID) {
+    auto client = connect();
+    if (!client) {
+      return Value();
+    }
+    EXPECT_TRUE(client->setSessionInfo(sessionInfo(sessionID), Value(), Value(), false, std::chrono::seconds(10)));
+    const auto started = client->startConfig(std::chrono::seconds(20));
+    EXPECT_TRUE(started);
+    return started["backends"];
+  }
+
+  // `zerith --root <root> args...`, run in this process.
+  struct CliRun {
+    int status;
+    std::string out;
+    std::string err;
+  };
+  CliRun zerith(std::vector<std::string> args) const {
+    args.insert(args.begin(), {"zerith", "--root", root.path().string()});
+    std::vector<const char*> argv;
+    for (const auto& a : args) {
+      argv.push_back(a.c_str());
+    }
+    std::ostringstream out;
+    std::ostringstream err;
+    const int status = cli::run(static_cast<int>(argv.size()), argv.data(), out, err);
+    return {status, out.str(), err.str()};
+  }
+  // `zerith status --json`, parsed (discarded when it fails).
+  nlohmann::ordered_json statusJson() const {
+    const CliRun run = zerith({"status", "--json"});
+    EXPECT_EQ(run.status, 0) << run.err;
+    return nlohmann::ordered_json::parse(run.out, nullptr,
+                                         /*allow_exceptions=*/false);
   }
 
   DaemonProcess& startDaemon(DaemonProcess::Options options = {}) {

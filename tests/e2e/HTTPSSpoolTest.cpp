@@ -13,14 +13,10 @@
 #include <fstream>
 #include <map>
 #include <set>
-
 #include <sstream>
 
-#include "config/StorebagSigner.h"
 #include "ipc/DaemonStatus.h"
 #include "tests/e2e/BehavingCollector.h"
-#include "tests/e2e/E2eFixture.h"
-#include "tests/support/CollectorProcess.h"
 #include "tools/zerith/ZerithCli.h"
 #include "zerith/Zerith.h"
 
@@ -30,34 +26,16 @@ namespace {
 namespace fs = std::filesystem;
 using Json = nlohmann::ordered_json;
 
-class HTTPSSpoolTest : public E2eTest {
+class HTTPSSpoolTest : public BehavingCollectorTest {
  protected:
-  void startAll(Dictionary spoolKeys) {
-    grant(Value(true));
-    for (const auto& [key, value] : spoolKeys) {
-      Defaults("com.velmar.zerith").setObject(key, value);
-    }
-    const fs::path www = root.path() / "collector/www";
-    behaviourFile = root.path() / "collector/behaviour";
-    collector = startBehavingCollector(root.path(), behaviourFile);
-    ASSERT_GT(collector->port(), 0) << collector->said();
-
-    // Events wait for the flush: one post per batch.
-    const Value bag = collectorStorebag(collector->url("/post"), Dictionary{{"expedite", 0}, {"event_threshold", 100}});
-    publishSignedStorebag(bag, www, collector->url("/zerith"));
-    startDaemon(daemonOptions());
+  // Events wait for the flush: one post per batch.
+  void startAll(const Dictionary& keys) {
+    BehavingCollectorTest::startAll(keys, Dictionary{{"expedite", 0}, {"event_threshold", 100}});
   }
-
-  DaemonProcess::Options daemonOptions() const { return collectorDaemonOptions(root.path() / "collector/certs"); }
-
-  static Dictionary spoolOn() {
-    return Dictionary{{"spoolEnabled", true}, {"spoolRetryInitialSeconds", 0.2}, {"spoolRetryMaxSeconds", 1.0}};
-  }
-
-  void behave(const std::string& text) { ASSERT_TRUE(writeBehaviour(behaviourFile, text)); }
 
   std::unique_ptr<Zerith> startSession(std::uint32_t sessionID) {
     ZerithReply started;
+    const std::size_t before = reader->recordsTaken();
     auto client = startDemoSession(sessionID, &started);
     if (!client) {
       return nullptr;
@@ -66,68 +44,31 @@ class HTTPSSpoolTest : public E2eTest {
     // The session's start record goes out while the collector answers, so
     // that every later batch holds only the test's events.
     EXPECT_TRUE(client->flushMessages(10s));
-    EXPECT_TRUE(collector->nextLine("record")) << daemon->output();
+    EXPECT_TRUE(reader->waitForRecords(before + 1, 10s)) << daemon->output();
     return client;
   }
 
   // Events numbered [first, first + count) as one batch, posted by a flush.
   void sendBatch(Zerith& client, int first, int count) {
     for (int n = first; n < first + count; ++n) {
-      ASSERT_TRUE(client.sendMessage(
-          Value(Dictionary{{kZerithMessageParametersCategory, Value(3)},
-                           {kZerithMessageParametersType, Value(4)},
-                           {kZerithMessageParametersPayload, Value(Dictionary{{"n", n}, {"pad", std::string(200, 'p')}})}}),
-          10s));
+      ASSERT_TRUE(client.sendMessage(numbered(n, 200), 10s));
     }
     ASSERT_TRUE(client.flushMessages(10s));
   }
 
-  // What the collector took of our events: record ID by event number, every
-  // ID seen per number, and the duplicates it dropped.
-  struct Taken {
-    std::map<int, std::set<std::string>> idsByNumber;
-    std::size_t duplicates = 0;
-  };
-  // Reads records until every number in `wanted` was taken, or `quiet`
-  // passes without a line.
-  Taken readTaken(const std::set<int>& wanted, std::chrono::milliseconds quiet = 8s) {
-    Taken taken;
-    auto complete = [&] {
-      return std::all_of(wanted.begin(), wanted.end(), [&](int n) { return taken.idsByNumber.count(n) != 0; });
-    };
-    while (!complete()) {
-      const auto line = collector->nextLine({}, quiet);
-      if (!line) {
-        break;
-      }
-      absorb(*line, taken);
+  // What the collector took of events [first, last]: record IDs by event
+  // number, once all arrived or `timeout` passed.
+  std::map<int, std::set<std::string>> taken(int first, int last, std::chrono::seconds timeout = 30s) {
+    std::set<int> wanted;
+    for (int n = first; n <= last; ++n) {
+      wanted.insert(n);
     }
-    return taken;
-  }
-  static void absorb(const Json& line, Taken& taken) {
-    const std::string kind = line.value("kind", "");
-    if (kind == "duplicate") {
-      ++taken.duplicates;
-    }
-    if (kind != "record" || line.value("status", 0) != 200 || line["record"].value("_method", 0) != 3) {
-      return;
-    }
-    taken.idsByNumber[line["record"].value("n", -1)].insert(line["record"].value("_recordID", std::string("none")));
+    reader->waitFor(wanted, timeout);
+    return reader->idsByNumber();
   }
 
   fs::path spoolFolder() const { return root.path() / "var/lib/zerithd/spool"; }
-
-  std::unique_ptr<CollectorProcess> collector;
-  fs::path behaviourFile;
 };
-
-std::set<int> range(int first, int last) {
-  std::set<int> out;
-  for (int n = first; n <= last; ++n) {
-    out.insert(n);
-  }
-  return out;
-}
 
 TEST_F(HTTPSSpoolTest, EventsSentWhileTheCollectorClosesStallsAndFailsArriveOnceAfterItRecovers) {
   startAll(spoolOn());
@@ -143,17 +84,18 @@ TEST_F(HTTPSSpoolTest, EventsSentWhileTheCollectorClosesStallsAndFailsArriveOnce
   behave("status 503");
   sendBatch(*client, 11, 5);
   // The 503 still disables the backend; its batch is kept all the same.
-  ASSERT_TRUE(daemon->waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code")) << daemon->output();
+  ASSERT_TRUE(daemon->waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"))
+      << daemon->output();
   ASSERT_TRUE(daemon->waitFor("Spool: kept batch", 3)) << daemon->output();
   struct stat st {};
   ASSERT_EQ(::stat(spoolFolder().c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0700u);
 
   behave("answer");
-  const Taken taken = readTaken(range(1, 15));
+  const auto ids15 = taken(1, 15);
   for (int n = 1; n <= 15; ++n) {
-    ASSERT_EQ(taken.idsByNumber.count(n), 1u) << "event " << n << " never arrived\n" << daemon->output();
-    const auto& ids = taken.idsByNumber.at(n);
+    ASSERT_EQ(ids15.count(n), 1u) << "event " << n << " never arrived\n" << daemon->output();
+    const auto& ids = ids15.at(n);
     EXPECT_EQ(ids.size(), 1u) << "event " << n;
     EXPECT_EQ(ids.begin()->size(), 32u) << *ids.begin();
   }
@@ -246,15 +188,15 @@ TEST_F(HTTPSSpoolTest, SpooledBatchesSurviveAKillAndBadFilesAreMovedAside) {
   startDaemon(daemonOptions());
   ASSERT_TRUE(daemon->waitFor("Spool: empty", 1, 20s)) << daemon->output();
 
-  const Taken taken = readTaken(range(1, 10));
+  const auto ids = taken(1, 10);
   for (int n = 1; n <= 10; ++n) {
-    ASSERT_EQ(taken.idsByNumber.count(n), 1u) << "event " << n << " lost\n" << daemon->output();
-    EXPECT_EQ(taken.idsByNumber.at(n).size(), 1u) << "event " << n;
+    ASSERT_EQ(ids.count(n), 1u) << "event " << n << " lost\n" << daemon->output();
+    EXPECT_EQ(ids.at(n).size(), 1u) << "event " << n;
   }
   // The batch the kill may have cut arrives whole or not at all.
   std::size_t third = 0;
   for (int n = 11; n <= 15; ++n) {
-    third += taken.idsByNumber.count(n);
+    third += ids.count(n);
   }
   EXPECT_TRUE(third == 0 || third == 5) << third;
 
@@ -292,10 +234,10 @@ TEST_F(HTTPSSpoolTest, TheSizeLimitDropsTheOldestBatchesAndCountsThem) {
   behave("answer");
   ASSERT_TRUE(daemon->waitFor("Spool: empty", 1, 20s)) << daemon->output();
   const int firstKept = static_cast<int>(droppedBatches) * 5 + 1;
-  const Taken taken = readTaken(range(firstKept, 40));
+  const auto ids = taken(firstKept, 40);
   for (int n = 1; n <= 40; ++n) {
     // The oldest batches went first; every later one arrived once.
-    EXPECT_EQ(taken.idsByNumber.count(n), n >= firstKept ? 1u : 0u) << "event " << n;
+    EXPECT_EQ(ids.count(n), n >= firstKept ? 1u : 0u) << "event " << n;
   }
   client->finishSession(10s);
 }
@@ -314,13 +256,12 @@ TEST_F(HTTPSSpoolTest, TheAgeLimitDropsBatchesBeforeTheirRetry) {
   behave("answer");
   ASSERT_TRUE(daemon->waitFor("older than 1 seconds; 5 records dropped so far")) << daemon->output();
   EXPECT_EQ(daemon->count("Spool: delivered batch"), 0u);
-  const Taken taken = readTaken(range(1, 5), 2s);
-  EXPECT_TRUE(taken.idsByNumber.empty());
+  EXPECT_TRUE(taken(1, 5, 2s).empty());
   client->finishSession(10s);
 }
 
 TEST_F(HTTPSSpoolTest, WithoutTheKeyAFailedBatchIsGoneAndRecordsCarryNoID) {
-  startAll({});
+  startAll(Dictionary{});
   auto client = startSession(505);
   ASSERT_TRUE(client);
   behave("close");
@@ -328,11 +269,11 @@ TEST_F(HTTPSSpoolTest, WithoutTheKeyAFailedBatchIsGoneAndRecordsCarryNoID) {
   ASSERT_TRUE(daemon->waitFor("HTTPSPostBackend(postJsonMessage): post error:")) << daemon->output();
   behave("answer");
   sendBatch(*client, 6, 1);
-  const Taken taken = readTaken(range(6, 6));
-  ASSERT_EQ(taken.idsByNumber.count(6), 1u) << daemon->output();
-  EXPECT_EQ(*taken.idsByNumber.at(6).begin(), "none");
+  const auto ids = taken(6, 6);
+  ASSERT_EQ(ids.count(6), 1u) << daemon->output();
+  EXPECT_EQ(*ids.at(6).begin(), "none");
   for (int n = 1; n <= 5; ++n) {
-    EXPECT_EQ(taken.idsByNumber.count(n), 0u) << "event " << n;
+    EXPECT_EQ(ids.count(n), 0u) << "event " << n;
   }
   EXPECT_EQ(daemon->count("Spool:"), 0u);
   EXPECT_FALSE(fs::exists(spoolFolder()));

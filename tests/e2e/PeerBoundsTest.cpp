@@ -60,20 +60,6 @@ class DescriptorLimit {
   rlim_t granted_ = 0;
 };
 
-// A one-byte message with room for one descriptor (SCM_RIGHTS).
-struct FdMessage {
-  char byte = 0;
-  iovec io{&byte, 1};
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-  msghdr m{};
-  FdMessage() {
-    m.msg_iov = &io;
-    m.msg_iovlen = 1;
-    m.msg_control = control;
-    m.msg_controllen = sizeof control;
-  }
-};
-
 // A connection to the daemon made by a process running as `uid`, so that the
 // daemon sees that user at the other end.
 std::optional<RawFrameSocket> connectAs(uid_t uid) {
@@ -84,7 +70,6 @@ std::optional<RawFrameSocket> connectAs(uid_t uid) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   std::strncpy(address.sun_path, paths::socketPath().c_str(), sizeof(address.sun_path) - 1);
-  FdMessage message;
   const pid_t child = ::fork();
   if (child == 0) {  // system calls only until _exit
     const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
@@ -94,33 +79,25 @@ std::optional<RawFrameSocket> connectAs(uid_t uid) {
         ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
       ::_exit(1);
     }
-    cmsghdr* c = CMSG_FIRSTHDR(&message.m);
-    c->cmsg_level = SOL_SOCKET;
-    c->cmsg_type = SCM_RIGHTS;
-    c->cmsg_len = CMSG_LEN(sizeof(int));
-    std::memcpy(CMSG_DATA(c), &fd, sizeof fd);
-    ::_exit(::sendmsg(pair[1], &message.m, 0) == 1 ? 0 : 1);
+    ::_exit(sendDescriptor(pair[1], fd) ? 0 : 1);
   }
   ::close(pair[1]);
   file::UniqueFd parent(pair[0]);
-  const bool got = ::recvmsg(parent.get(), &message.m, MSG_CMSG_CLOEXEC) == 1 && CMSG_FIRSTHDR(&message.m);
+  file::UniqueFd connection = receiveDescriptor(parent.get());
   int status = 0;
   ::waitpid(child, &status, 0);
-  if (!got) {
+  if (!connection) {
     return std::nullopt;
   }
-  int fd = -1;
-  std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&message.m)), sizeof fd);
-  return RawFrameSocket(file::UniqueFd(fd));
+  return RawFrameSocket(std::move(connection));
 }
 
 class PeerBoundsTest : public E2eTest {
  protected:
   // The test's own user and "nobody" may report.
   void grantRootAndNobody() {
-    const Value policy(Dictionary{
-        {"users", Array{Value(0ull), Value(65534ull)}},
-        {"entitlements", Dictionary{{"com.velmar.private.zerithd", true}}}});
+    const Value policy(Dictionary{{"users", Array{Value(0ull), Value(65534ull)}},
+                                  {"entitlements", Dictionary{{"com.velmar.private.zerithd", true}}}});
     root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
   }
 
@@ -146,8 +123,8 @@ class PeerBoundsTest : public E2eTest {
 // limit is passed, logs it, and serves the next client.
 struct OversizedAnswer {
   const char* name;
-  const char* path;           // where the server sends 64 MiB
-  const char* logged;         // the cut's line
+  const char* path;    // where the server sends 64 MiB
+  const char* logged;  // the cut's line
 };
 
 class OversizedAnswerTest : public PeerBoundsTest, public ::testing::WithParamInterface<OversizedAnswer> {};
@@ -158,18 +135,12 @@ TEST_P(OversizedAnswerTest, IsCutAtTheLimitWhileItStreamsAndOthersAreServed) {
   serveSignedStorebag(server, collectorStorebag(server.url("/post")));
   const std::string huge(64u << 20, 'x');
   server.on(GetParam().path, {.status = 200, .body = huge, .chunkSize = 256u << 10});
-  DaemonProcess::Options options;
-  options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
-  options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-  startQuietDaemon(options);
+  startQuietDaemon(testCAOptions());
   const std::uint64_t idle = rssKiB();
 
   auto session = startDemoSession(1);
   ASSERT_TRUE(session);
-  session->sendMessage(Value(Dictionary{{kZerithMessageParametersCategory, Value(1)},
-                                         {kZerithMessageParametersType, Value(2)},
-                                         {kZerithMessageParametersPayload, Value(Dictionary{{"k", "v"}})}}),
-                       10s);
+  session->sendMessage(event(1, 2, Value(Dictionary{{"k", "v"}})), 10s);
   session->finishSession(10s);
   ASSERT_TRUE(daemon->waitFor(GetParam().logged, 1, 20s)) << daemon->output();
 
@@ -207,7 +178,8 @@ TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
     cut += client->write(start) ? 0 : 1;  // closed while it wrote
     clients.push_back(std::move(*client));
   }
-  ASSERT_TRUE(daemon->waitFor("unfinished frames and waiting replies of all connections", 1, 20s)) << cut << " writes cut";
+  ASSERT_TRUE(daemon->waitFor("unfinished frames and waiting replies of all connections", 1, 20s))
+      << cut << " writes cut";
   auto other = RawFrameSocket::connect();
   ASSERT_TRUE(other);
   EXPECT_TRUE(answered(*other));
@@ -272,7 +244,9 @@ TEST_F(PeerBoundsTest, AtTheConnectionLimitAcceptingWaitsUntilOneCloses) {
   ASSERT_TRUE(waiting->call("fetchDisplayURL:", 1));
   EXPECT_FALSE(waiting->replyTo(1, 1s));
   EXPECT_FALSE(waiting->closed());
-  EXPECT_EQ(daemon->count("connections are open, the limit of 20; new clients wait until one closes"), 1u);
+  EXPECT_EQ(daemon->count("connections are open, the limit of 20; new clients "
+                          "wait until one closes"),
+            1u);
   clients.front().close();
   EXPECT_TRUE(waiting->replyTo(1, 5s));
 }

@@ -11,13 +11,9 @@
 #include <sstream>
 #include <thread>
 
-#include "config/StorebagSigner.h"
 #include "ipc/ClientSessionWire.h"
 #include "platform/Json.h"
 #include "tests/e2e/E2eFixture.h"
-#include "tests/support/HttpsTestServer.h"
-#include "tests/support/TestCA.h"
-#include "tools/zerith/ZerithCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -35,12 +31,12 @@ class Aggregated {
     Value payload;
   };
   void attach(Zerith& client) {
-    client.setMessageHandler([this](const Value& info, double, std::uint16_t category, std::uint16_t type,
-                                    const Value& payload) {
-      std::lock_guard lock(mutex_);
-      messages_.push_back({info, category, type, payload});
-      changed_.notify_all();
-    });
+    client.setMessageHandler(
+        [this](const Value& info, double, std::uint16_t category, std::uint16_t type, const Value& payload) {
+          std::lock_guard lock(mutex_);
+          messages_.push_back({info, category, type, payload});
+          changed_.notify_all();
+        });
   }
   // Waits until a message of that category arrives; nullopt on time-out.
   std::optional<Message> waitFor(unsigned category, std::chrono::milliseconds timeout = 10s) {
@@ -72,10 +68,9 @@ class SessionsTogetherTest : public E2eTest {
  protected:
   void SetUp() override {
     grant(Value(true));
-    const Value bag(Dictionary{
-        {"version", Value("6.1.0")},
-        {"seed", Value(Dictionary{{kZerithBackendKovu, Value(Dictionary{})},
-                                  {kZerithBackendPellamlog, Value(Dictionary{})}})}});
+    const Value bag(Dictionary{{"version", Value("6.1.0")},
+                               {"seed", Value(Dictionary{{kZerithBackendKovu, Value(Dictionary{})},
+                                                         {kZerithBackendPellamlog, Value(Dictionary{})}})}});
     serveSignedStorebag(server, bag);
 
     const auto plugin = paths::adaptorPluginPath();
@@ -84,33 +79,9 @@ class SessionsTogetherTest : public E2eTest {
     adaptorOutput = root / "/var/tmp/kovu.jsonl";
     std::filesystem::create_directories(adaptorOutput.parent_path());
 
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
-    options.environment = {{"KOVU_EXAMPLE_OUTPUT", adaptorOutput.string()}, {"LC_ALL", "C"}};
+    DaemonProcess::Options options = testCAOptions("C");
+    options.environment.emplace_back("KOVU_EXAMPLE_OUTPUT", adaptorOutput.string());
     startDaemon(options);
-  }
-
-  static std::unique_ptr<Zerith> connect() {
-    auto client = Zerith::connect();
-    EXPECT_TRUE(client);
-    return client;
-  }
-
-  static Value info(std::uint32_t sessionID) {
-    return Value(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)}, {kZerithSessionInfoClientType, Value(7)}});
-  }
-  static Value hierarchy(std::uint32_t sessionID, const std::string& token, long long level) {
-    Dictionary d = info(sessionID).dictCopy();
-    d.set(kZerithSessionInfoHierarchyToken, Value(Dictionary{{kZerithHierarchyTokenTokenID, Value(token)},
-                                                             {kZerithHierarchyTokenLevel, Value(level)}}));
-    return Value(std::move(d));
-  }
-  static Value event(unsigned category, unsigned type, const Value& payload = Value()) {
-    Dictionary d{{kZerithMessageParametersCategory, Value(category)}, {kZerithMessageParametersType, Value(type)}};
-    if (!payload.isNil()) {
-      d.set(kZerithMessageParametersPayload, payload);
-    }
-    return Value(std::move(d));
   }
 
   // A started session: its reporting backends are the storebag's two.
@@ -146,8 +117,10 @@ class SessionsTogetherTest : public E2eTest {
 
   // The combined identifier the daemon logged for a session.
   std::string combinedIDOf(std::uint32_t sessionID) const {
-    const std::regex line("updateCombinedSessionID: Updating combined session ID '([^']+)' for session " +
-                          std::to_string(sessionID) + " backends");
+    const std::regex line(
+        "updateCombinedSessionID: Updating combined session "
+        "ID '([^']+)' for session " +
+        std::to_string(sessionID) + " backends");
     std::smatch m;
     const std::string out = daemon->output();
     std::string last;
@@ -179,10 +152,13 @@ TEST_F(SessionsTogetherTest, ThreeLevelsShareStatesIdentifiersDataAndTheRootsAgg
 
   // Children take their states from the same-named backend one level up.
   EXPECT_TRUE(daemon->waitForExact(Level::Debug,
-                                   "HTTPSPostBackend(syncReportingStates): kovu: state and sampling rate updated to 2, 0.00%",
+                                   "HTTPSPostBackend(syncReportingStates): kovu: state "
+                                   "and sampling rate updated to 2, 0.00%",
                                    2));
-  EXPECT_TRUE(daemon->waitForExact(
-      Level::Debug, "HTTPSPostBackend(syncReportingStates): pellamlog: state and sampling rate updated to 2, 0.00%", 2));
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug,
+                                   "HTTPSPostBackend(syncReportingStates): pellamlog: "
+                                   "state and sampling rate updated to 2, 0.00%",
+                                   2));
   // "root.parent.own": the grandchild's identifier extends the child's.
   const std::string childID = combinedIDOf(2);
   const std::string grandchildID = combinedIDOf(3);
@@ -192,7 +168,8 @@ TEST_F(SessionsTogetherTest, ThreeLevelsShareStatesIdentifiersDataAndTheRootsAgg
   EXPECT_EQ(grandchildID.size(), 3 * 24 + 2);
 
   // The grandchild's own aggregator was ended: the root's wins.
-  EXPECT_TRUE(daemon->waitForExact(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 3"));
+  EXPECT_TRUE(
+      daemon->waitForExact(Level::Debug, "shutdownSessionAggregation: Disable aggregation module for session 3"));
 
   const auto sent = grandchild->sendMessage(event(20, 3, Value(Dictionary{{"x", Value(1)}})), 10s);
   ASSERT_TRUE(sent);
@@ -219,18 +196,21 @@ TEST_F(SessionsTogetherTest, GapsTokenChangesAndParentsLeavingFirstLeaveTheOther
   start(*root, hierarchy(1, "call-2", 0));
   // Level 2 without a level 1: a gap, so no combined identifier.
   start(*orphan, hierarchy(5, "call-2", 2));
-  EXPECT_TRUE(daemon->waitFor(
-      "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is"));
-  EXPECT_TRUE(daemon->waitForExact(
-      Level::Default, "syncReportingStates: child session 5 (backend kovu) with hierarchy 2 is missing its parent"));
+  EXPECT_TRUE(
+      daemon->waitFor("parentSessionIDStringForSession: Found a gap in hierarchy (one of "
+                      "parents missing): incomplete parentSessionID is"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Default,
+                                   "syncReportingStates: child session 5 (backend kovu) "
+                                   "with hierarchy 2 is missing its parent"));
   EXPECT_EQ(combinedIDOf(5), "");
 
   // The orphan moves to another token; the first token's shared data no
   // longer reaches it.
   ASSERT_TRUE(root->updateSharedData(Value(Dictionary{{"room", Value("red")}}), 10s));
   ASSERT_TRUE(orphan->setSessionInfo(hierarchy(5, "call-3", 0), Value(), Value(), false, 10s));
-  EXPECT_TRUE(daemon->waitForExact(
-      Level::Debug, "updateCorrelatedSessions: Adding session 5 to list for hierarchyToken call-3 with hierarchyLevel 0"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Debug,
+                                   "updateCorrelatedSessions: Adding session 5 to list for "
+                                   "hierarchyToken call-3 with hierarchyLevel 0"));
   ASSERT_TRUE(orphan->sendMessage(event(31, 1, Value(Dictionary{{"k", Value(1)}})), 10s));
   ASSERT_TRUE(root->sendMessage(event(32, 1), 10s));
   ASSERT_EQ(adaptorLinesOf(31, 1).size(), 1u);
@@ -245,8 +225,9 @@ TEST_F(SessionsTogetherTest, GapsTokenChangesAndParentsLeavingFirstLeaveTheOther
   ASSERT_TRUE(daemon->waitForExact(Level::Debug, "dealloc: ZerithdSession dealloc: 1"));
   ASSERT_TRUE(child->sendMessage(event(33, 1), 10s));
   ASSERT_TRUE(child->fetchStates(Value(Dictionary{{kZerithUserInfoClientName, Value("after")}}), 10s));
-  EXPECT_TRUE(daemon->waitForExact(
-      Level::Default, "syncReportingStates: child session 6 (backend kovu) with hierarchy 1 is missing its parent"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Default,
+                                   "syncReportingStates: child session 6 (backend kovu) "
+                                   "with hierarchy 1 is missing its parent"));
   EXPECT_EQ(adaptorLinesOf(33, 1).size(), 1u);
 }
 
@@ -264,8 +245,9 @@ TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWo
   ASSERT_TRUE(child->sendMessage(Value(Dictionary{{kZerithMessageParametersCategory, Value(1)}}), 10s));
   EXPECT_TRUE(daemon->waitForExact(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'type'"));
   ASSERT_TRUE(child->sendMessage(event(70, 1, Value("not a dictionary")), 10s));
-  EXPECT_TRUE(daemon->waitForExact(
-      Level::Error, "sendMessageWithDictionary: Dropping event with category 70 as its payload is not a dictionary"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Error,
+                                   "sendMessageWithDictionary: Dropping event with category "
+                                   "70 as its payload is not a dictionary"));
   // Shared data that is not a dictionary is refused at the connection.
   const auto shared = child->updateSharedData(Value(Array{Value(1)}), 10s);
   ASSERT_FALSE(shared);
@@ -275,7 +257,7 @@ TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWo
   auto raw = RawFrameSocket::connect();
   ASSERT_TRUE(raw);
   ASSERT_TRUE(raw->call(ipc::wire::kSetSessionInfo, 1,
-                        Dictionary{{"sessionInfo", info(63)}, {"hasAggregationBlock", Value(false)}}));
+                        Dictionary{{"sessionInfo", sessionInfo(63)}, {"hasAggregationBlock", Value(false)}}));
   ASSERT_TRUE(raw->call(ipc::wire::kStartConfig, 2));
   ASSERT_TRUE(raw->call(ipc::wire::kFlushMessages, 3));
   raw->close();
@@ -293,7 +275,8 @@ TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWo
 }
 
 TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
-  root.write("/var/tmp/script.jsonl", R"(# a call with one stream, a shared room, and a one-shot report
+  root.write("/var/tmp/script.jsonl",
+             R"(# a call with one stream, a shared room, and a one-shot report
 {"session":"call","step":"open","clientType":7,"sessionID":81,"hierarchyToken":"cli","hierarchyLevel":0,"aggregation":true}
 {"session":"call","step":"start"}
 {"session":"call","step":"shared-data","dictionary":{"room":"green"}}
@@ -306,15 +289,11 @@ TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
 {"session":"stream","step":"close"}
 {"session":"call","step":"finish"}
 )");
-  const std::string script = (root / "/var/tmp/script.jsonl").string();
-  const std::string rootPath = root.path().string();
-  const char* argv[] = {"zerith", "--root", rootPath.c_str(), "sessions", "--script", script.c_str()};
-  std::ostringstream out;
-  std::ostringstream err;
-  ASSERT_EQ(cli::run(6, argv, out, err), 0) << err.str() << out.str();
+  const CliRun run = zerith({"sessions", "--script", (root / "/var/tmp/script.jsonl").string()});
+  ASSERT_EQ(run.status, 0) << run.err << run.out;
 
   std::vector<nlohmann::json> lines;
-  std::istringstream in(out.str());
+  std::istringstream in(run.out);
   for (std::string l; std::getline(in, l);) {
     lines.push_back(nlohmann::json::parse(l));
   }
@@ -327,14 +306,14 @@ TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
     return nlohmann::json();
   };
   EXPECT_EQ(stepLine("call", "start")["backends"], nlohmann::json::parse(R"(["kovu","pellamlog"])"));
-  EXPECT_EQ(stepLine("stream", "flush").count("failure"), 0u) << out.str();
+  EXPECT_EQ(stepLine("stream", "flush").count("failure"), 0u) << run.out;
   EXPECT_EQ(stepLine("solo", "one-shot")["result"], "finished");
   // The stream's event reached the call's aggregation block.
   bool aggregated = false;
   for (const auto& l : lines) {
     aggregated |= l.value("session", "") == "call" && l.value("event", "") == "message" && l["category"] == 90;
   }
-  EXPECT_TRUE(aggregated) << out.str();
+  EXPECT_TRUE(aggregated) << run.out;
   ASSERT_EQ(adaptorLinesOf(90, 1).size(), 1u);
   EXPECT_EQ(adaptorLinesOf(90, 1)[0]["dict"],
             nlohmann::json::parse(R"({"SharedData":{"room":"green"},"ClientData":{"jitter":4}})"));
@@ -342,12 +321,9 @@ TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
 
   // A line that cannot run ends the script with status 2 and says which.
   root.write("/var/tmp/bad.jsonl", "{\"session\":\"x\",\"step\":\"send\",\"category\":1,\"type\":1}\n");
-  const std::string bad = (root / "/var/tmp/bad.jsonl").string();
-  const char* badArgv[] = {"zerith", "--root", rootPath.c_str(), "sessions", "--script", bad.c_str()};
-  std::ostringstream badOut;
-  std::ostringstream badErr;
-  EXPECT_EQ(cli::run(6, badArgv, badOut, badErr), 2);
-  EXPECT_NE(badErr.str().find("line 1: no open session \"x\""), std::string::npos) << badErr.str();
+  const CliRun bad = zerith({"sessions", "--script", (root / "/var/tmp/bad.jsonl").string()});
+  EXPECT_EQ(bad.status, 2);
+  EXPECT_NE(bad.err.find("line 1: no open session \"x\""), std::string::npos) << bad.err;
 }
 
 }  // namespace

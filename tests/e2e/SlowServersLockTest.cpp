@@ -11,8 +11,6 @@
 #include <vector>
 
 #include "tests/e2e/E2eFixture.h"
-#include "tests/support/HttpsTestServer.h"
-#include "tests/support/TestCA.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -30,10 +28,7 @@ class SlowServersLockTest : public E2eTest {
     for (const char* name : {"bostin", "elquin", "farrow", "gelmo", "hestra"}) {
       server.on(std::string("/zerith/") + name, {.status = 404, .delay = 5000ms});
     }
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
-    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-    startDaemon(options);
+    startDaemon(testCAOptions());
   }
 
   // A type-7 session that sends one event and ends: its end report is
@@ -41,10 +36,7 @@ class SlowServersLockTest : public E2eTest {
   void endSessionWithSlowPost(std::uint32_t id) {
     auto client = startDemoSession(id);
     ASSERT_TRUE(client);
-    const Value event(Dictionary{{kZerithMessageParametersCategory, Value(3u)},
-                                 {kZerithMessageParametersType, Value(4u)},
-                                 {kZerithMessageParametersPayload, Value(Dictionary{{"n", Value(id)}})}});
-    ASSERT_TRUE(client->sendMessage(event, 10s));
+    ASSERT_TRUE(client->sendMessage(event(3, 4, Value(Dictionary{{"n", Value(id)}})), 10s));
   }
 
   // Starts a session of `clientType` on its own thread; the future holds
@@ -55,9 +47,7 @@ class SlowServersLockTest : public E2eTest {
       if (!client) {
         return false;
       }
-      const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(id)},
-                                  {kZerithSessionInfoClientType, Value(clientType)}});
-      if (!client->setSessionInfo(info, Value(), Value(), false, 20s)) {
+      if (!client->setSessionInfo(sessionInfo(id, clientType), Value(), Value(), false, 20s)) {
         return false;
       }
       return static_cast<bool>(client->startConfig(20s));
@@ -102,7 +92,8 @@ TEST_F(SlowServersLockTest, ManySessionsStartingDuringFirstFetchesAreAllAnswered
     SCOPED_TRACE(round);
     std::vector<std::future<void>> ending;
     for (std::uint32_t i = 0; i < 4; ++i) {
-      ending.push_back(std::async(std::launch::async, [this, id = 100 * round + i + 1] { endSessionWithSlowPost(id); }));
+      ending.push_back(
+          std::async(std::launch::async, [this, id = 100 * round + i + 1] { endSessionWithSlowPost(id); }));
     }
     std::vector<std::future<bool>> starts;
     for (std::uint32_t i = 0; i < 26; ++i) {

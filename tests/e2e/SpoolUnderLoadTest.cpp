@@ -5,9 +5,8 @@
 // reader would refuse is never written. The collector is a process of its
 // own, so that only this process runs short of descriptors.
 
-#include <gtest/gtest.h>
-
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -18,8 +17,7 @@
 #include <vector>
 
 #include "backends/Spool.h"
-#include "platform/FileUtil.h"
-#include "tests/support/CollectorProcess.h"
+#include "tests/e2e/BehavingCollector.h"
 #include "tests/support/TempRoot.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 #include "transport/URLSession.h"
@@ -60,7 +58,8 @@ TEST(SpoolUnderLoadTest, AFileThatCannotBeOpenedNowStaysAndIsReadLater) {
     }
     bool later = false;
     const bool read = store.read(written.name, &later).has_value();
-    ::_exit(!read && later && fs::exists(root.path() / "spool" / written.name) && !fs::exists(store.badFolder()) ? 0 : 1);
+    ::_exit(!read && later && fs::exists(root.path() / "spool" / written.name) && !fs::exists(store.badFolder()) ? 0
+                                                                                                                 : 1);
   }
   int status = 0;
   ASSERT_EQ(::waitpid(child, &status, 0), child);
@@ -75,13 +74,9 @@ TEST(SpoolUnderLoadTest, ConcurrentWritesAndReadsNeverMoveAGoodFile) {
   const fs::path certs = root.path() / "collector/certs";
   const fs::path behaviour = root.path() / "collector/behaviour";
   fs::create_directories(behaviour.parent_path());
-  const auto behave = [&](const std::string& text) {
-    ASSERT_TRUE(file::writeAtomically(
-        behaviour, std::span<const std::uint8_t>(reinterpret_cast<const std::uint8_t*>(text.data()), text.size())));
-  };
-  behave("status 503");
-  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, {"--generate-cert", certs.string(), "--behaviour-file",
-                                                     behaviour.string()});
+  ASSERT_TRUE(writeBehaviour(behaviour, "status 503"));
+  CollectorProcess collector(ZERITH_COLLECTOR_TOOL,
+                             {"--generate-cert", certs.string(), "--behaviour-file", behaviour.string()});
   ASSERT_GT(collector.port(), 0) << collector.said();
   ASSERT_TRUE(URLSession::setExtraCAFile((certs / "ca.pem").string()));
   // Its lines are read all along, so that its output never fills.
@@ -96,10 +91,10 @@ TEST(SpoolUnderLoadTest, ConcurrentWritesAndReadsNeverMoveAGoodFile) {
   config.retryInitialSeconds = 0.02;
   config.retryMaxSeconds = 0.1;
   config.commitIntervalSeconds = 0.005;
-  auto spool = Spool::create(root.path() / "spool", config,
-                             ReportingSessionConnectivityHelper::initWithDelegate(
-                                 std::weak_ptr<ConnectivityHelperDelegate>(),
-                                 ReportingSessionConnectivityHelper::POSTRequestMode()));
+  auto spool = Spool::create(
+      root.path() / "spool", config,
+      ReportingSessionConnectivityHelper::initWithDelegate(std::weak_ptr<ConnectivityHelperDelegate>(),
+                                                           ReportingSessionConnectivityHelper::POSTRequestMode()));
   const auto request = [&](int writer, int n, std::size_t headerBytes) {
     URLRequest r;
     r.httpMethod = "POST";
@@ -125,13 +120,14 @@ TEST(SpoolUnderLoadTest, ConcurrentWritesAndReadsNeverMoveAGoodFile) {
             continue;
           }
           // Written ahead; its live post then fails.
-          const bool usable = spool->writeAhead(request(w, n, header), 1, nullptr, [&, spool](std::optional<std::string> name) {
-            if (name) {
-              spool->liveAnswered(*name, Spool::LiveAnswer::failed);
-            } else {
-              ++refusedAhead;
-            }
-          });
+          const bool usable =
+              spool->writeAhead(request(w, n, header), 1, nullptr, [&, spool](std::optional<std::string> name) {
+                if (name) {
+                  spool->liveAnswered(*name, Spool::LiveAnswer::failed);
+                } else {
+                  ++refusedAhead;
+                }
+              });
           EXPECT_TRUE(usable);
         }
       });
@@ -140,7 +136,7 @@ TEST(SpoolUnderLoadTest, ConcurrentWritesAndReadsNeverMoveAGoodFile) {
       t.join();
     }
   }
-  behave("answer");
+  ASSERT_TRUE(writeBehaviour(behaviour, "answer"));
   const auto deadline = std::chrono::steady_clock::now() + 30s;
   while (spool->pendingBatches() > 0 && std::chrono::steady_clock::now() < deadline) {
     std::this_thread::sleep_for(20ms);

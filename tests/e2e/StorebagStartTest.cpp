@@ -8,8 +8,6 @@
 
 #include "config/StorebagSigner.h"
 #include "tests/e2e/E2eFixture.h"
-#include "tests/support/HttpsTestServer.h"
-#include "tests/support/TestCA.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -27,32 +25,15 @@ class StorebagStartTest : public E2eTest {
   }
 
   DaemonProcess& start(bool trustTestCA) {
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5"};
-    if (trustTestCA) {
-      options.arguments.push_back("--ca-file");
-      options.arguments.push_back(TestCA::shared().caFile().string());
+    DaemonProcess::Options options = testCAOptions("fr_FR.UTF-8");
+    if (!trustTestCA) {
+      options.arguments.resize(2);  // no --ca-file
     }
-    options.environment = {{"LC_ALL", "fr_FR.UTF-8"}};
     return startDaemon(options);
   }
 
-  // One session's start: its backends, nil when the daemon has no storebag.
-  Value startSession() {
-    auto client = Zerith::connect();
-    EXPECT_TRUE(client);
-    if (!client) {
-      return Value();
-    }
-    EXPECT_TRUE(client->setSessionInfo(info(), Value(), Value(), false, 10s));
-    const auto started = client->startConfig(20s);
-    EXPECT_TRUE(started);
-    return started["backends"];
-  }
-
-  static Value info() {
-    return Value(Dictionary{{kZerithSessionInfoSessionID, Value(31)}, {kZerithSessionInfoClientType, Value(7)}});
-  }
+  Value startSession() { return startedBackends(31); }
+  static Value info() { return sessionInfo(31); }
 
   HttpsTestServer server;
 };
@@ -62,18 +43,19 @@ TEST_F(StorebagStartTest, SignedStorebagStartsTheSessionAndItsStartMessageReache
   // What the message handler touches outlives the client.
   std::promise<Dictionary> startMessage;
   std::atomic<int> messages{0};
-  auto client = Zerith::connect();
+  auto client = connect();
   ASSERT_TRUE(client);
-  client->setMessageHandler([&](const Value& message, double, std::uint16_t category, std::uint16_t type,
-                                const Value& payload) {
-    if (messages++ == 0) {
-      startMessage.set_value(Dictionary{{"message", message},
-                                        {"category", Value(unsigned{category})},
-                                        {"type", Value(unsigned{type})},
-                                        {"payload", payload}});
-    }
-  });
-  ASSERT_TRUE(client->setSessionInfo(info(), Value(), Value(), /*hasAggregationBlock=*/true, 10s));
+  client->setMessageHandler(
+      [&](const Value& message, double, std::uint16_t category, std::uint16_t type, const Value& payload) {
+        if (messages++ == 0) {
+          startMessage.set_value(Dictionary{{"message", message},
+                                            {"category", Value(unsigned{category})},
+                                            {"type", Value(unsigned{type})},
+                                            {"payload", payload}});
+        }
+      });
+  ASSERT_TRUE(client->setSessionInfo(info(), Value(), Value(),
+                                     /*hasAggregationBlock=*/true, 10s));
   const auto started = client->startConfig(20s);
   ASSERT_TRUE(started) << started.error->description;
   // The seed section's adaptor backend is made (client type 7 may have one)
@@ -84,11 +66,11 @@ TEST_F(StorebagStartTest, SignedStorebagStartsTheSessionAndItsStartMessageReache
   EXPECT_EQ(server.requests()[0].path, "/zerith/dravon");
   auto future = startMessage.get_future();
   ASSERT_EQ(future.wait_for(10s), std::future_status::ready);
-  EXPECT_EQ(future.get(), (Dictionary{{"message", info()},
-                                      {"category", Value(0u)},
-                                      {"type", Value(0u)},
-                                      {"payload", Value(Dictionary{{"AutomaticTimeSet", Value(true)},
-                                                                   {"Locale", Value("FR")}})}}));
+  EXPECT_EQ(future.get(),
+            (Dictionary{{"message", info()},
+                        {"category", Value(0u)},
+                        {"type", Value(0u)},
+                        {"payload", Value(Dictionary{{"AutomaticTimeSet", Value(true)}, {"Locale", Value("FR")}})}}));
   EXPECT_TRUE(daemon->waitForExact(Level::Debug, "createBackendsWithStorebag: Creating backends for session 31"));
 
   // A second start is answered from the agent's cache.
@@ -99,24 +81,20 @@ TEST_F(StorebagStartTest, SignedStorebagStartsTheSessionAndItsStartMessageReache
 
 TEST_F(StorebagStartTest, StorebagServerOutsideTheTrustedAuthoritiesLeavesTheSessionUnstarted) {
   start(/*trustTestCA=*/false);
-  auto client = Zerith::connect();
-  ASSERT_TRUE(client);
-  ASSERT_TRUE(client->setSessionInfo(info(), Value(), Value(), false, 10s));
-  const auto started = client->startConfig(20s);
-  ASSERT_TRUE(started);
-  EXPECT_TRUE(started["backends"].isNil());
+  EXPECT_TRUE(startSession().isNil());
   // The error line carries the TLS cause, not only the info line before it.
   const std::string cause = "SSL certificate problem: unable to get local issuer certificate from " +
                             server.url("/zerith/dravon?version=8.0");
-  EXPECT_TRUE(daemon->waitForExact(Level::Default, "fetchNetworkStorebag: Error resolving with lookup server " +
-                                                    server.url("/zerith/dravon?version=8.0") +
-                                                    ", sendSynchronousRequest error SSL certificate problem: unable to "
-                                                    "get local issuer certificate"))
+  EXPECT_TRUE(
+      daemon->waitForExact(Level::Default, "fetchNetworkStorebag: Error resolving with lookup server " +
+                                               server.url("/zerith/dravon?version=8.0") +
+                                               ", sendSynchronousRequest error SSL certificate problem: unable to "
+                                               "get local issuer certificate"))
       << daemon->output();
-  EXPECT_TRUE(daemon->waitForExact(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 7: " +
-                                                     cause +
-                                                     "; the built-in fallback storebag was loaded; the storebag's "
-                                                     "signature is missing"))
+  EXPECT_TRUE(
+      daemon->waitForExact(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 7: " + cause +
+                                             "; the built-in fallback storebag was loaded; the storebag's "
+                                             "signature is missing"))
       << daemon->output();
 }
 
@@ -133,13 +111,15 @@ TEST_F(StorebagStartTest, SighupDropsTheCachedStorebagsAndTheWaitAfterAFailure) 
   // A corrected URL alone waits out the 900 seconds.
   Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
   EXPECT_TRUE(startSession().isNil());
-  EXPECT_TRUE(daemon->waitForExact(
-      Level::Default, "storebagForSession: Not fetching storebag for client type 7 - must wait 900 seconds between attempts"));
+  EXPECT_TRUE(daemon->waitForExact(Level::Default,
+                                   "storebagForSession: Not fetching storebag for client "
+                                   "type 7 - must wait 900 seconds between attempts"));
   EXPECT_EQ(server.requestCount(), 0u);
 
   daemon->signal(SIGHUP);
-  ASSERT_TRUE(daemon->waitForExact(
-      Level::Default, "main: Received SIGHUP, dropped 1 cached storebag(s) and their waits; the next session fetches again"));
+  ASSERT_TRUE(daemon->waitForExact(Level::Default,
+                                   "main: Received SIGHUP, dropped 1 cached storebag(s) and "
+                                   "their waits; the next session fetches again"));
   EXPECT_EQ(startSession(), Value(Array{Value("kovu")})) << daemon->output();
   EXPECT_EQ(server.requestCount(), 1u);
 

@@ -6,19 +6,11 @@
 #include <signal.h>
 
 #include <filesystem>
-#include <functional>
-#include <sstream>
 
 #include "config/StorebagIssueTimes.h"
 #include "config/StorebagSigner.h"
 #include "config/StorebagVerify.h"
-#include <nlohmann/json.hpp>
-
-#include "ipc/DaemonStatus.h"
 #include "tests/e2e/E2eFixture.h"
-#include "tests/support/HttpsTestServer.h"
-#include "tests/support/TestCA.h"
-#include "tools/zerith/ZerithCli.h"
 
 namespace zerith::test {
 namespace {
@@ -32,11 +24,7 @@ constexpr double kNewer = 1'800'000'000;  // 2027-01-15 08:00:00
 class StorebagTrustTest : public E2eTest {
  protected:
   void SetUp() override {
-    // Sessions, and the status for the refusal counts.
-    const Value policy(Dictionary{
-        {"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
-        {"entitlements", Value(Dictionary{{"com.velmar.private.zerithd", true}, {ipc::kDaemonStatusEntitlement, true}})}});
-    root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
+    grant(Value(true), /*status=*/true);  // the status tells the refusal counts
     rsa = *generateStorebagKeyPair(2048);
     installPublicKey(rsa.publicKeyDER);
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
@@ -45,7 +33,8 @@ class StorebagTrustTest : public E2eTest {
   // A bag whose one backend tells which bag a session got.
   static Data bag(const char* backend, std::optional<double> issued) {
     const Value section(Dictionary{{backend, Value(Dictionary{})}});
-    const Data plain = plist::encodeBinary(Value(Dictionary{{"version", backend}, {"seed", section}, {"release", section}}));
+    const Data plain =
+        plist::encodeBinary(Value(Dictionary{{"version", backend}, {"seed", section}, {"release", section}}));
     return issued ? *stampStorebagIssueTime(plain, Date{*issued}) : plain;
   }
   Data sign(const Data& bagBytes, const std::optional<std::string>& ed25519PEM = std::nullopt) const {
@@ -58,25 +47,8 @@ class StorebagTrustTest : public E2eTest {
                                  .body = std::string(container.begin(), container.end())});
   }
 
-  void start() {
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
-    startDaemon(options);
-  }
-
-  // The backends of a new session of client type 7; nil without a storebag.
-  Value backends() {
-    auto client = Zerith::connect();
-    EXPECT_TRUE(client);
-    if (!client) {
-      return Value();
-    }
-    const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(5)}, {kZerithSessionInfoClientType, Value(7)}});
-    EXPECT_TRUE(client->setSessionInfo(info, Value(), Value(), false, 10s));
-    const auto started = client->startConfig(20s);
-    EXPECT_TRUE(started);
-    return started["backends"];
-  }
+  void start() { startDaemon(testCAOptions(nullptr)); }
+  Value backends() { return startedBackends(5); }
 
   // A fresh first fetch: no in-memory entry, no disk copy.
   void forgetStorebags(std::size_t hangups) {
@@ -86,13 +58,9 @@ class StorebagTrustTest : public E2eTest {
   }
 
   std::uint64_t refusedCount(const char* name) {
-    const std::string rootPath = root.path().string();
-    std::vector<const char*> argv = {"zerith", "--root", rootPath.c_str(), "status", "--json"};
-    std::ostringstream out, err;
-    EXPECT_EQ(cli::run(static_cast<int>(argv.size()), argv.data(), out, err), 0) << err.str();
-    const auto parsed = nlohmann::ordered_json::parse(out.str(), nullptr, /*allow_exceptions=*/false);
+    auto parsed = statusJson();
     const auto count = parsed.is_object() ? parsed["storebags"]["counts"][name] : nlohmann::ordered_json();
-    EXPECT_TRUE(count.is_number_unsigned()) << out.str();
+    EXPECT_TRUE(count.is_number_unsigned()) << parsed;
     return count.is_number_unsigned() ? count.get<std::uint64_t>() : 0;
   }
 
@@ -111,7 +79,8 @@ TEST_F(StorebagTrustTest, AnOlderBagIsRefusedAcrossARestartUntilTheOperatorForge
   EXPECT_EQ(backends(), only("kovu"));
   const std::string rollback = "fetchStorebagWithName: storebag 'dravon' from " +
                                server.url("/zerith/dravon?version=8.0") +
-                               " was issued at 2023-11-14 22:13:20 +0000, before 2027-01-15 08:00:00 +0000, the newest "
+                               " was issued at 2023-11-14 22:13:20 +0000, before 2027-01-15 08:00:00 "
+                               "+0000, the newest "
                                "issue time accepted for it: refused as a rollback";
   ASSERT_TRUE(daemon->waitForExact(Level::Error, rollback)) << daemon->output();
   EXPECT_EQ(backends(), only("kovu"));
@@ -141,8 +110,9 @@ TEST_F(StorebagTrustTest, AnInstalledEd25519KeyRequiresBothSignatures) {
   const Data good = bag("kovu", kNewer);
   const auto strongOver = [&](const Data& signedBytes, const StorebagKeyPair& keys) {
     const Data rsaSignature = *signStorebagBytes(rsa.privateKeyPEM, good);
-    return plist::encodeBinary(makeStorebagContainer(
-        rsaSignature, good, *signStorebagBytes(keys.privateKeyPEM, signedBytes, nullptr, /*ed25519=*/true)));
+    return plist::encodeBinary(makeStorebagContainer(rsaSignature, good,
+                                                     *signStorebagBytes(keys.privateKeyPEM, signedBytes, nullptr,
+                                                                        /*ed25519=*/true)));
   };
   // Without the key, either container verifies as it always has.
   serve(sign(good));
@@ -152,7 +122,8 @@ TEST_F(StorebagTrustTest, AnInstalledEd25519KeyRequiresBothSignatures) {
   serve(strongOver(bag("other", kNewer), strong));
   EXPECT_EQ(backends(), only("kovu")) << daemon->output();
 
-  root.write("/usr/share/zerith/publicKeyEd25519.der", std::string(strong.publicKeyDER.begin(), strong.publicKeyDER.end()));
+  root.write("/usr/share/zerith/publicKeyEd25519.der",
+             std::string(strong.publicKeyDER.begin(), strong.publicKeyDER.end()));
   const struct {
     Data container;
     const char* cause;
@@ -167,7 +138,8 @@ TEST_F(StorebagTrustTest, AnInstalledEd25519KeyRequiresBothSignatures) {
     forgetStorebags(++hangups);
     serve(r.container);
     EXPECT_TRUE(backends().isNil());
-    EXPECT_TRUE(daemon->waitFor(std::string("fetchAndCacheStorebag: Unable to fetch storebag for client type 7: ") +
+    EXPECT_TRUE(daemon->waitFor(std::string("fetchAndCacheStorebag: Unable to fetch "
+                                            "storebag for client type 7: ") +
                                 r.cause))
         << daemon->output();
     EXPECT_FALSE(fs::exists(paths::storebagCacheDir() / "dravon"));

@@ -4,7 +4,6 @@
 // responsive while an upload server stalls.
 
 #include <fcntl.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -30,13 +29,14 @@ constexpr uid_t kNobody = 65534;
 // process keeps its identity: the raw system call changes one thread only).
 template <typename F>
 auto asUser(uid_t uid, F&& work) {
-  return std::async(std::launch::async, [uid, work = std::forward<F>(work)]() mutable {
-           // Saved user stays root so that the thread could go back; the
-           // effective and file-system user is `uid`.
-           EXPECT_EQ(::syscall(SYS_setresgid, uid, uid, 0), 0);
-           EXPECT_EQ(::syscall(SYS_setresuid, uid, uid, 0), 0);
-           return work();
-         })
+  return std::async(std::launch::async,
+                    [uid, work = std::forward<F>(work)]() mutable {
+                      // Saved user stays root so that the thread could go back;
+                      // the effective and file-system user is `uid`.
+                      EXPECT_EQ(::syscall(SYS_setresgid, uid, uid, 0), 0);
+                      EXPECT_EQ(::syscall(SYS_setresuid, uid, uid, 0), 0);
+                      return work();
+                    })
       .get();
 }
 
@@ -52,15 +52,15 @@ class UploadByDescriptorTest : public E2eTest {
 
   // A daemon whose demo client type has an upload backend posting to `postURL`.
   void startWithUploadServer(const std::string& postURL) {
-    Dictionary client{{"client", "demo"},       {"service", "cli"},          {"override_dnu", 1},
-                      {"sampling_threshold", 1.0}, {"locale_whitelist", Array{Value("GB")}},
+    Dictionary client{{"client", "demo"},
+                      {"service", "cli"},
+                      {"override_dnu", 1},
+                      {"sampling_threshold", 1.0},
+                      {"locale_whitelist", Array{Value("GB")}},
                       {"post_url", postURL}};
     const Value section(Dictionary{{"uploadServer", Dictionary{{"clients", Array{Value(std::move(client))}}}}});
     serveSignedStorebag(https, Value(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}}));
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
-    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-    startDaemon(std::move(options));
+    startDaemon(testCAOptions());
   }
 
   static void rootOnly(const fs::path& path) {
@@ -83,7 +83,8 @@ TEST_F(UploadByDescriptorTest, ClientRightsDecideWhatCanBeUploaded) {
   fs::create_directories(files / "closed");
   std::ofstream(files / "closed" / "theirs.log") << "theirs";
   ::chown((files / "closed" / "theirs.log").c_str(), kNobody, kNobody);
-  ::chmod((files / "closed").c_str(), 0700);  // root's folder: nobody cannot search it
+  ::chmod((files / "closed").c_str(),
+          0700);  // root's folder: nobody cannot search it
 
   auto client = startDemoSession(1);
   ASSERT_TRUE(client);
@@ -105,61 +106,18 @@ TEST_F(UploadByDescriptorTest, ClientRightsDecideWhatCanBeUploaded) {
   file::UniqueFd sender(pair[0]), receiver(pair[1]);
   file::UniqueFd connection = connectToDaemonSocket();
   ASSERT_TRUE(connection);
-  {
-    char byte = 'c';
-    iovec part{&byte, 1};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    msghdr m{};
-    m.msg_iov = &part;
-    m.msg_iovlen = 1;
-    m.msg_control = control;
-    m.msg_controllen = sizeof control;
-    cmsghdr* c = CMSG_FIRSTHDR(&m);
-    c->cmsg_level = SOL_SOCKET;
-    c->cmsg_type = SCM_RIGHTS;
-    c->cmsg_len = CMSG_LEN(sizeof(int));
-    const int fd = connection.get();
-    std::memcpy(CMSG_DATA(c), &fd, sizeof fd);
-    ASSERT_EQ(::sendmsg(sender.get(), &m, 0), 1);
-  }
+  ASSERT_TRUE(sendDescriptor(sender.get(), connection.get()));
   const bool refusedToOpen = asUser(kNobody, [&] {
-    char byte = 0;
-    iovec part{&byte, 1};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    msghdr m{};
-    m.msg_iov = &part;
-    m.msg_iovlen = 1;
-    m.msg_control = control;
-    m.msg_controllen = sizeof control;
-    if (::recvmsg(receiver.get(), &m, MSG_CMSG_CLOEXEC) != 1 || CMSG_FIRSTHDR(&m) == nullptr) {
-      return false;
-    }
-    int fd = -1;
-    std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&m)), sizeof fd);
-    const file::UniqueFd handed(fd);
+    const file::UniqueFd handed = receiveDescriptor(receiver.get());
     const bool denied = ::open((files / "secret.log").c_str(), O_RDONLY | O_CLOEXEC) < 0 && errno == EACCES;
     // What the new holder can still do: name the path without a descriptor.
     const Data call = ipc::encodeCall(ipc::wire::kUploadFile, 1,
                                       ipc::wire::uploadFileArgs(Value((files / "secret.log").string()), Value()));
-    return denied && ::send(handed.get(), call.data(), call.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(call.size());
+    return handed && denied &&
+           ::send(handed.get(), call.data(), call.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(call.size());
   });
   EXPECT_TRUE(refusedToOpen);
-  ipc::FrameDecoder decoder;
-  std::optional<Value> answer;
-  for (int i = 0; i < 100 && !answer; ++i) {
-    pollfd p{connection.get(), POLLIN, 0};
-    std::uint8_t buf[4096];
-    ssize_t n = 0;
-    if (::poll(&p, 1, 100) <= 0 || (n = ::recv(connection.get(), buf, sizeof buf, 0)) <= 0) {
-      continue;
-    }
-    decoder.append(buf, static_cast<std::size_t>(n));
-    plist::Bytes body;
-    std::string why;
-    if (decoder.next(body, why) == ipc::FrameDecoder::Status::Frame) {
-      answer = plist::decodeBinary(body);
-    }
-  }
+  const auto answer = RawFrameSocket(std::move(connection)).replyTo(1);
   ASSERT_TRUE(answer);
   EXPECT_EQ((*answer)["args"]["success"], Value(false));
   EXPECT_TRUE(daemon->waitFor("Refusing to upload " + (files / "secret.log").string() +

@@ -17,9 +17,8 @@ class WatchdogTest : public E2eTest {
  protected:
   std::size_t pings() const {
     const auto all = daemon->notifications();
-    return static_cast<std::size_t>(std::count_if(all.begin(), all.end(), [](const std::string& m) {
-      return m.find("WATCHDOG=1") != std::string::npos;
-    }));
+    return static_cast<std::size_t>(std::count_if(
+        all.begin(), all.end(), [](const std::string& m) { return m.find("WATCHDOG=1") != std::string::npos; }));
   }
 };
 
@@ -42,11 +41,9 @@ TEST_F(WatchdogTest, PingsWhileServingAndStopsOnceAQueueIsWedged) {
   std::this_thread::sleep_for(2s);  // six ping periods
   EXPECT_EQ(pings(), atStall) << daemon->output();
   // Only the one queue is wedged: the daemon still answers and stops.
-  auto client = Zerith::connect();
+  auto client = connect();
   ASSERT_TRUE(client);
-  EXPECT_TRUE(client->setSessionInfo(
-      Value(Dictionary{{kZerithSessionInfoSessionID, Value(9)}, {kZerithSessionInfoClientType, Value(7)}}), Value(),
-      Value(), false, 10s));
+  EXPECT_TRUE(client->setSessionInfo(sessionInfo(9), Value(), Value(), false, 10s));
 }
 
 }  // namespace

@@ -11,8 +11,6 @@
 #include <string>
 
 #include "tests/e2e/E2eFixture.h"
-#include "tests/support/HttpsTestServer.h"
-#include "tests/support/TestCA.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -44,10 +42,7 @@ TEST_P(WriteLimitTest, AWriteBeyondTheLimitFailsAndTheDaemonServesOn) {
   HttpsTestServer server;
   server.on("/post", {.status = 200});
   serveSignedStorebag(server, collectorStorebag(server.url("/post")));
-  DaemonProcess::Options options;
-  options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
-  options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-  startDaemon(options);
+  startDaemon(testCAOptions());
   // The limit holds before the first HTTPS request (which makes the CA
   // bundle) and before any post.
   const rlimit limit{c.limit, c.limit};
@@ -56,20 +51,15 @@ TEST_P(WriteLimitTest, AWriteBeyondTheLimitFailsAndTheDaemonServesOn) {
   auto client = startDemoSession(1);
   ASSERT_TRUE(client);
   if (c.eventSize != 0) {
-    const Value event(Dictionary{{kZerithMessageParametersCategory, Value(3u)},
-                                 {kZerithMessageParametersType, Value(4u)},
-                                 {kZerithMessageParametersPayload, Value(Dictionary{{"blob", randomHex(c.eventSize)}})}});
-    ASSERT_TRUE(client->sendMessage(event, 10s));
+    ASSERT_TRUE(client->sendMessage(event(3, 4, Value(Dictionary{{"blob", randomHex(c.eventSize)}})), 10s));
   }
   ASSERT_TRUE(daemon->waitFor(c.failedWrite)) << daemon->output();
   EXPECT_NE(daemon->output().find("File too large"), std::string::npos) << daemon->output();
 
   // Still alive and answering: another client's session is set up.
-  auto other = Zerith::connect();
+  auto other = connect();
   ASSERT_TRUE(other);
-  EXPECT_TRUE(other->setSessionInfo(Value(Dictionary{{kZerithSessionInfoSessionID, Value(2)},
-                                                     {kZerithSessionInfoClientType, Value(7)}}),
-                                    Value(), Value(), false, 10s));
+  EXPECT_TRUE(other->setSessionInfo(sessionInfo(2), Value(), Value(), false, 10s));
   EXPECT_TRUE(daemon->running());
 }
 

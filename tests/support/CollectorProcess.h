@@ -1,8 +1,9 @@
 #pragma once
 
-// The zerith-collector executable as a child process of a test, its JSON
-// lines read from a pipe: ready once it says where it listens, each line
-// waited for with a deadline, and the rest read to the end once it stops.
+// A tool that prints JSON lines (zerith-collector, zerith-dashboard) as a
+// child process of a test, its lines read from a pipe: ready once it says
+// on standard error where it listens, each line waited for with a deadline,
+// and the rest read to the end once it stops.
 //
 //   test::CollectorProcess collector(ZERITH_COLLECTOR_TOOL, {"--generate-cert", dir, "--status", "503"});
 //   auto line = collector.nextLine("record");

@@ -245,17 +245,19 @@ std::string DaemonProcess::output() const {
   return output_;
 }
 
+template <typename Match>
+std::size_t DaemonProcess::countLines(Match match) const {
+  return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), match));
+}
+
 std::size_t DaemonProcess::count(std::string_view needle) const {
   std::lock_guard lock(mutex_);
-  return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {
-    return l.text.find(needle) != std::string::npos;
-  }));
+  return countLines([&](const Line& l) { return l.text.find(needle) != std::string::npos; });
 }
 
 std::size_t DaemonProcess::countExact(log::Level level, std::string_view text) const {
   std::lock_guard lock(mutex_);
-  return static_cast<std::size_t>(
-      std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) { return l.level == level && l.text == text; }));
+  return countLines([&](const Line& l) { return l.level == level && l.text == text; });
 }
 
 bool DaemonProcess::has(log::Level level, std::string_view text) const { return countExact(level, text) > 0; }
@@ -263,9 +265,7 @@ bool DaemonProcess::has(log::Level level, std::string_view text) const { return 
 bool DaemonProcess::waitFor(std::string_view needle, std::size_t occurrences, std::chrono::milliseconds timeout) const {
   std::unique_lock lock(mutex_);
   return changed_.wait_for(lock, timeout, [&] {
-    return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {
-             return l.text.find(needle) != std::string::npos;
-           })) >= occurrences;
+    return countLines([&](const Line& l) { return l.text.find(needle) != std::string::npos; }) >= occurrences;
   });
 }
 
@@ -273,9 +273,7 @@ bool DaemonProcess::waitForExact(log::Level level, std::string_view text, std::s
                                  std::chrono::milliseconds timeout) const {
   std::unique_lock lock(mutex_);
   return changed_.wait_for(lock, timeout, [&] {
-    return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {
-             return l.level == level && l.text == text;
-           })) >= occurrences;
+    return countLines([&](const Line& l) { return l.level == level && l.text == text; }) >= occurrences;
   });
 }
 

@@ -81,6 +81,9 @@ class DaemonProcess {
   void start(const TempRoot& root, const Options& options);
   void readLoop();
   void consumeOutput(std::string_view bytes);
+  // Lines that `match` (mutex_ held).
+  template <typename Match>
+  std::size_t countLines(Match match) const;
 
   pid_t pid_ = -1;
   std::optional<int> exitStatus_;

@@ -10,7 +10,9 @@
 #include <sys/socket.h>
 
 #include <chrono>
+#include <cstring>
 #include <optional>
+#include <span>
 #include <string>
 
 #include "ipc/Frame.h"
@@ -26,6 +28,55 @@ inline Data frameWithBody(const Data& body) {
              static_cast<std::uint8_t>(body.size() >> 8), static_cast<std::uint8_t>(body.size())};
   frame.insert(frame.end(), body.begin(), body.end());
   return frame;
+}
+
+// Sends `bytes` (at least one) over the stream socket `socket` with up to
+// eight descriptors `fds` attached (SCM_RIGHTS) to its first byte; true when
+// all of it went. System calls only: safe in a child between fork and _exit.
+inline bool sendWithDescriptors(int socket, std::span<const std::uint8_t> bytes, std::span<const int> fds) {
+  iovec part{const_cast<std::uint8_t*>(bytes.data()), bytes.size()};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * 8)] = {};
+  msghdr m{};
+  m.msg_iov = &part;
+  m.msg_iovlen = 1;
+  if (fds.size() > 8) {
+    return false;
+  }
+  if (!fds.empty()) {
+    m.msg_control = control;
+    m.msg_controllen = CMSG_SPACE(sizeof(int) * fds.size());
+    cmsghdr* c = CMSG_FIRSTHDR(&m);
+    c->cmsg_level = SOL_SOCKET;
+    c->cmsg_type = SCM_RIGHTS;
+    c->cmsg_len = CMSG_LEN(sizeof(int) * fds.size());
+    std::memcpy(CMSG_DATA(c), fds.data(), sizeof(int) * fds.size());
+  }
+  return ::sendmsg(socket, &m, MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
+}
+
+// One descriptor on a byte of its own, as receiveDescriptor takes it.
+inline bool sendDescriptor(int socket, int fd) {
+  static constexpr std::uint8_t kByte[1] = {'d'};
+  return sendWithDescriptors(socket, kByte, std::span<const int>(&fd, 1));
+}
+
+// The descriptor that came with the next byte on `socket`; empty when the
+// byte came without one or nothing came.
+inline file::UniqueFd receiveDescriptor(int socket) {
+  char byte = 0;
+  iovec part{&byte, 1};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+  msghdr m{};
+  m.msg_iov = &part;
+  m.msg_iovlen = 1;
+  m.msg_control = control;
+  m.msg_controllen = sizeof control;
+  if (::recvmsg(socket, &m, MSG_CMSG_CLOEXEC) != 1 || CMSG_FIRSTHDR(&m) == nullptr) {
+    return file::UniqueFd();
+  }
+  int fd = -1;
+  std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&m)), sizeof fd);
+  return file::UniqueFd(fd);
 }
 
 class RawFrameSocket {
@@ -115,7 +166,8 @@ class RawFrameSocket {
     if (closed_) {
       return false;
     }
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    const auto left =
+        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
     pollfd p{fd_.get(), POLLIN, 0};
     if (left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
       return false;

@@ -2,25 +2,25 @@
 // executable receiving what a real HTTPS backend, libcurl uploads and
 // static-file GETs send it.
 
+#include <curl/curl.h>
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <zlib.h>
 
-#include <curl/curl.h>
-#include <gtest/gtest.h>
-
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "backends/HTTPSPostBackend.h"
-#include "platform/Defaults.h"
 #include "config/DeviceInfo.h"
+#include "platform/Defaults.h"
 #include "platform/FileUtil.h"
 #include "platform/Log.h"
 #include "tests/support/CollectorProcess.h"
@@ -188,8 +188,10 @@ struct CurlAnswer {
   std::string body;
 };
 
-CurlAnswer curlPost(const std::string& url, const fs::path& ca, const std::string& body,
-                    const std::vector<std::string>& headers) {
+// A POST of `body` with libcurl trusting `ca`, or a GET without a body
+// (its path sent as it is, "/../" included).
+CurlAnswer curlRequest(const std::string& url, const fs::path& ca, const std::optional<std::string>& body,
+                       const std::vector<std::string>& headers) {
   CURL* curl = curl_easy_init();
   CurlAnswer answer;
   curl_slist* list = nullptr;
@@ -198,14 +200,18 @@ CurlAnswer curlPost(const std::string& url, const fs::path& ca, const std::strin
   }
   curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
   curl_easy_setopt(curl, CURLOPT_CAINFO, ca.c_str());
-  curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body.data());
-  curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
+  if (body) {
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body->data());
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body->size()));
+  }
+  curl_easy_setopt(curl, CURLOPT_PATH_AS_IS, 1L);
   curl_easy_setopt(curl, CURLOPT_HTTPHEADER, list);
   curl_easy_setopt(curl, CURLOPT_TIMEOUT, 20L);
-  curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, +[](char* p, size_t s, size_t n, void* u) {
-    static_cast<std::string*>(u)->append(p, s * n);
-    return s * n;
-  });
+  curl_easy_setopt(
+      curl, CURLOPT_WRITEFUNCTION, +[](char* p, size_t s, size_t n, void* u) {
+        static_cast<std::string*>(u)->append(p, s * n);
+        return s * n;
+      });
   curl_easy_setopt(curl, CURLOPT_WRITEDATA, &answer.body);
   if (curl_easy_perform(curl) == CURLE_OK) {
     curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &answer.status);
@@ -221,8 +227,9 @@ TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLoc
   args.insert(args.end(), {"--store", store.string(), "--log-data-path", "/logs"});
   CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
   const std::string file = "diagnostic log\n" + std::string(5000, 'z');
-  const auto upload = curlPost(collector.url("/upload?uuid=abc&sequence=3&filename=x.log.gz&raw=true"), certs / "ca.pem",
-                               gzipOf(file), {"Content-Type: application/octet-stream", "Content-Encoding: gzip"});
+  const auto upload =
+      curlRequest(collector.url("/upload?uuid=abc&sequence=3&filename=x.log.gz&raw=true"), certs / "ca.pem",
+                  gzipOf(file), {"Content-Type: application/octet-stream", "Content-Encoding: gzip"});
   EXPECT_EQ(upload.status, 200);
   EXPECT_EQ(upload.body, "success");
   auto line = collector.nextLine();
@@ -235,7 +242,7 @@ TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLoc
   ASSERT_TRUE(stored);
   EXPECT_EQ(std::string(stored->begin(), stored->end()), file);
 
-  const auto logData = curlPost(collector.url("/logs"), certs / "ca.pem", "archived log data", {});
+  const auto logData = curlRequest(collector.url("/logs"), certs / "ca.pem", "archived log data", {});
   line = collector.nextLine();
   ASSERT_TRUE(line);
   EXPECT_EQ((*line)["kind"], "logdata");
@@ -247,20 +254,20 @@ TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
   auto args = baseArgs();
   args.insert(args.end(), {"--max-body", "100000", "--max-inflated", "200000"});
   CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
-  const auto bomb = curlPost(collector.url("/post"), certs / "ca.pem", gzipOf(std::string(4 << 20, 'a')),
-                             {"Content-Encoding: gzip"});
+  const auto bomb = curlRequest(collector.url("/post"), certs / "ca.pem", gzipOf(std::string(4 << 20, 'a')),
+                                {"Content-Encoding: gzip"});
   EXPECT_EQ(bomb.status, 413);
   auto line = collector.nextLine();
   ASSERT_TRUE(line);
   EXPECT_EQ((*line)["kind"], "refused");
-  const auto big = curlPost(collector.url("/post"), certs / "ca.pem", std::string(100001, 'a'), {});
+  const auto big = curlRequest(collector.url("/post"), certs / "ca.pem", std::string(100001, 'a'), {});
   EXPECT_EQ(big.status, 413);
   ASSERT_TRUE(collector.nextLine());
-  const auto broken = curlPost(collector.url("/post"), certs / "ca.pem", "\x1f\x8bnot gzip", {});
+  const auto broken = curlRequest(collector.url("/post"), certs / "ca.pem", "\x1f\x8bnot gzip", {});
   EXPECT_EQ(broken.status, 415);
   ASSERT_TRUE(collector.nextLine());
   // Still answering.
-  const auto fine = curlPost(collector.url("/post"), certs / "ca.pem", "{\"postTime\":1}", {});
+  const auto fine = curlRequest(collector.url("/post"), certs / "ca.pem", "{\"postTime\":1}", {});
   EXPECT_EQ(fine.status, 200);
   line = collector.nextLine();
   ASSERT_TRUE(line);
@@ -276,26 +283,7 @@ TEST_F(CollectorToolTest, ServesStaticFilesWithLastModifiedAndNothingOutsideItsF
   args.insert(args.end(), {"--serve", www.string()});
   CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
   const auto get = [&](const std::string& path, const std::vector<std::string>& headers) {
-    CURL* curl = curl_easy_init();
-    CurlAnswer answer;
-    curl_slist* list = nullptr;
-    for (const auto& h : headers) {
-      list = curl_slist_append(list, h.c_str());
-    }
-    curl_easy_setopt(curl, CURLOPT_URL, collector.url(path).c_str());
-    curl_easy_setopt(curl, CURLOPT_CAINFO, (certs / "ca.pem").c_str());
-    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, list);
-    curl_easy_setopt(curl, CURLOPT_PATH_AS_IS, 1L);
-    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, +[](char* p, size_t s, size_t n, void* u) {
-      static_cast<std::string*>(u)->append(p, s * n);
-      return s * n;
-    });
-    curl_easy_setopt(curl, CURLOPT_WRITEDATA, &answer.body);
-    curl_easy_perform(curl);
-    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &answer.status);
-    curl_slist_free_all(list);
-    curl_easy_cleanup(curl);
-    return answer;
+    return curlRequest(collector.url(path), certs / "ca.pem", std::nullopt, headers);
   };
   const auto bag = get("/dravon?version=8.1", {});
   EXPECT_EQ(bag.status, 200);

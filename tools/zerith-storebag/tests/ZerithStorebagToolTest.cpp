@@ -1,9 +1,14 @@
+// zerith-storebag as an operator runs it: key pairs, signing with one key
+// or both, verification, display, and the way back past the anti-rollback
+// check.
+
 #include <gtest/gtest.h>
 
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 
+#include "config/StorebagIssueTimes.h"
 #include "platform/Crypto.h"
 #include "platform/FileUtil.h"
 #include "platform/PropertyList.h"
@@ -36,8 +41,8 @@ class ZerithStorebagToolTest : public ::testing::Test {
   }
 
   test::TempRoot root_;
-  const Value bag_ = Value(Dictionary{{"release", Value(Dictionary{{"kovu", Value(Dictionary{{"active", true}})}})},
-                                      {"version", "3.0.1"}});
+  const Value bag_ = Value(
+      Dictionary{{"release", Value(Dictionary{{"kovu", Value(Dictionary{{"active", true}})}})}, {"version", "3.0.1"}});
 };
 
 TEST_F(ZerithStorebagToolTest, SignedContainerVerifiesAndShowsTheBag) {
@@ -60,8 +65,9 @@ TEST_F(ZerithStorebagToolTest, SignedContainerVerifiesAndShowsTheBag) {
 
   const test::CommandResult verify = run("verify --public publicKey.der --in container");
   EXPECT_EQ(verify.status, 0);
-  EXPECT_EQ(verify.output.rfind("verified: " + std::to_string(signedBag.size()) + " bag bytes, version 3.0.1, issued ", 0),
-            0u)
+  EXPECT_EQ(
+      verify.output.rfind("verified: " + std::to_string(signedBag.size()) + " bag bytes, version 3.0.1, issued ", 0),
+      0u)
       << verify.output;
 
   const test::CommandResult show = run("show --public publicKey.der --in container");
@@ -87,8 +93,8 @@ TEST_F(ZerithStorebagToolTest, SignatureIsPlainRsaSha1AsOpenSslMakesIt) {
   ASSERT_EQ(run("sign --key key.pem --in bag.plist --out container").status, 0);
   const Value fields = *plist::decode(plist::bytesOf(read("container")));
   const Data signature = *crypto::base64Decode(*fields["signature"].string());
-  std::ofstream(at("sig"), std::ios::binary).write(reinterpret_cast<const char*>(signature.data()),
-                                                    static_cast<std::streamsize>(signature.size()));
+  std::ofstream(at("sig"), std::ios::binary)
+      .write(reinterpret_cast<const char*>(signature.data()), static_cast<std::streamsize>(signature.size()));
   const Data signedBag = *crypto::base64Decode(*fields["bag"].string());
   write("signed-bag", std::string(signedBag.begin(), signedBag.end()));
   const std::string command = "cd '" + root_.path().string() +
@@ -118,7 +124,8 @@ TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
       {"show --public key.pem --in container",
        "zerith-storebag: 'container' refused: the public key is not an RSA public key in DER form\n"},
       {"verify --public publicKey.der --in missing", "zerith-storebag: cannot read 'missing': no such file\n"},
-      {"sign --key key.pem --in array.plist --out x", "zerith-storebag: 'array.plist' is not a property list dictionary\n"},
+      {"sign --key key.pem --in array.plist --out x",
+       "zerith-storebag: 'array.plist' is not a property list dictionary\n"},
       {"sign --key publicKey.der --in bag.plist --out x", "zerith-storebag: cannot sign with 'publicKey.der': "},
       {"sign --key key.pem --in junk --out x", "zerith-storebag: 'junk' is not a property list: "},
   };
@@ -130,6 +137,55 @@ TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
   EXPECT_FALSE(fs::exists(at("x")));
   EXPECT_NE(run("sign --key key.pem --in bag.plist").status, 0);  // --out is required
   EXPECT_NE(run("").status, 0);
+}
+
+TEST_F(ZerithStorebagToolTest, OneCommandSignsWithBothAndVerifyNeedsBothWhenGivenTheSecondKey) {
+  prepare();
+  ASSERT_EQ(run("keygen --type ed25519 --private ed.pem --public ed.der").status, 0);
+  const auto signing = run("sign --key key.pem --ed25519-key ed.pem --in bag.plist --out both");
+  ASSERT_EQ(signing.status, 0) << signing.output;
+  EXPECT_NE(signing.output.find("(RSA and Ed25519)"), std::string::npos) << signing.output;
+  ASSERT_EQ(run("sign --key key.pem --in bag.plist --out rsa-only").status, 0);
+
+  struct Case {
+    const char* arguments;
+    int status;
+    const char* output;  // its beginning
+  } cases[] = {
+      {"verify --public publicKey.der --ed25519-public ed.der --in both", 0, "verified (RSA and Ed25519): "},
+      {"verify --public publicKey.der --in both", 0, "verified: "},
+      {"verify --public publicKey.der --ed25519-public ed.der --in rsa-only", 1,
+       "zerith-storebag: 'rsa-only' refused: the container has no \"signature_ed25519\" string"},
+      {"sign --key key.pem --ed25519-key key.pem --in bag.plist --out x", 1,
+       "zerith-storebag: cannot sign with 'key.pem': the private key is not an Ed25519 key"},
+  };
+  for (const auto& c : cases) {
+    const auto r = run(c.arguments);
+    EXPECT_EQ(r.status, c.status) << c.arguments << "\n" << r.output;
+    EXPECT_EQ(r.output.rfind(c.output, 0), 0u) << c.arguments << "\n" << r.output;
+  }
+  EXPECT_FALSE(fs::exists(at("x")));
+}
+
+TEST_F(ZerithStorebagToolTest, ForgetIssueTimeDropsOnlyTheNamedStorebag) {
+  ASSERT_TRUE(rememberStorebagIssueTime("dravon", Date{1'800'000'000}));
+  ASSERT_TRUE(rememberStorebagIssueTime("ambrel", Date{1'700'000'000}));
+  const std::string rootOption = "--root '" + root_.path().string() + "' ";
+
+  const auto forgot = run(rootOption + "forget-issue-time --name dravon");
+  EXPECT_EQ(forgot.status, 0);
+  EXPECT_EQ(forgot.output, "forgot issue time 2027-01-15 08:00:00 +0000 of storebag dravon in " +
+                               storebagIssueTimesFile().string() + "\n");
+  EXPECT_EQ(rememberedStorebagIssueTime("dravon"), std::nullopt);
+  EXPECT_EQ(rememberedStorebagIssueTime("ambrel"), Date{1'700'000'000});
+  EXPECT_EQ(run(rootOption + "forget-issue-time --name dravon").output,
+            "no issue time remembered for storebag dravon\n");
+
+  // A damaged file is not silently replaced by the operator's step.
+  std::ofstream(storebagIssueTimesFile(), std::ios::trunc) << "garbage";
+  const auto damaged = run(rootOption + "forget-issue-time --name ambrel");
+  EXPECT_EQ(damaged.status, 1);
+  EXPECT_NE(damaged.output.find("is unusable"), std::string::npos) << damaged.output;
 }
 
 }  // namespace

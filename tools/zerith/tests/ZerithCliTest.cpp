@@ -273,21 +273,19 @@ TEST_F(CliFixture, TheDaemonsMessagesPrintAsEventLines) {
             std::string::npos) << r.out;
 }
 
-TEST(Cli, WithoutRootTheDaemonsDefaultRootIsUsed) {
-  TempRoot root;
-  ASSERT_EQ(setenv("ZERITHD_ROOT", root.path().c_str(), 1), 0);
-  const auto v = runCli({"version"});
-  unsetenv("ZERITHD_ROOT");
-  EXPECT_EQ(v.out, "{\"version\":\"8.0\",\"publicKey\":\"" + (root / "/usr/share/zerith/publicKey.der").string() + "\"}\n");
-}
-
-TEST(Cli, IdentifierAndVersion) {
+TEST(Cli, IdentifierAndVersionUnderTheGivenRootOrTheDefaultOne) {
   TempRoot root;
   const auto id = runCli({"--root", root.path().string(), "identifier", "--dnu"});
   EXPECT_EQ(id.status, 0);
   EXPECT_EQ(id.out, "{\"identifier\":\"" + Zerith::getPersistentIdentifierForDNU(true) + "\",\"dnu\":true}\n");
-  const auto v = runCli({"--root", root.path().string(), "version"});
-  EXPECT_EQ(v.out, "{\"version\":\"8.0\",\"publicKey\":\"" + (root / "/usr/share/zerith/publicKey.der").string() + "\"}\n");
+  const std::string version =
+      "{\"version\":\"8.0\",\"publicKey\":\"" + (root / "/usr/share/zerith/publicKey.der").string() + "\"}\n";
+  EXPECT_EQ(runCli({"--root", root.path().string(), "version"}).out, version);
+  // Without --root the daemon's default root is used.
+  ASSERT_EQ(setenv("ZERITHD_ROOT", root.path().c_str(), 1), 0);
+  const auto v = runCli({"version"});
+  unsetenv("ZERITHD_ROOT");
+  EXPECT_EQ(v.out, version);
 }
 
 }  // namespace
