@@ -108,6 +108,22 @@ TEST_F(URLSessionTest, CallbacksArriveInWireOrderAndInvalidationComesLast) {
   EXPECT_FALSE(session->hasDelegate());  // released once invalid
 }
 
+// An invalidation between a task's creation and its start (a session ending
+// while its last batch is handed to the transport) waits for that task.
+TEST_F(URLSessionTest, ATaskMadeBeforeTheInvalidationCompletesFirst) {
+  server.on("/post", Reply{.status = 204});
+  auto session = makeSession(URLSessionConfiguration::defaultSessionConfiguration());
+  auto started = session->dataTaskWithRequest(post(server.url("/post"), "late"));
+  auto dropped = session->dataTaskWithRequest(post(server.url("/post"), "never"));
+  ASSERT_TRUE(started && dropped);
+  session->finishTasksAndInvalidate();
+  started->resume();
+  dropped.reset();  // never started: it holds the invalidation no longer
+  ASSERT_TRUE(events->waitFor("invalid"));
+  EXPECT_EQ(events->events(), (std::vector<std::string>{"sent 4/4", "response 204", "complete", "invalid"}));
+  EXPECT_EQ(server.requestCount(), 1u);
+}
+
 // Twenty posts at once to one server that holds its answers: at most six
 // connections open, the other posts wait for one of them and then go out on
 // it, so twenty requests arrive over no more than six connections (without
