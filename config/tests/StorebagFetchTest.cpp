@@ -109,8 +109,6 @@ TEST_F(StorebagFetchTest, EachEnvironmentGetsItsSectionOrAnErrorNamingIt) {
     Value section;
     std::string error;  // the one error line, if any
   } rows[] = {
-      {"development", sampleStorebag(), 1, sampleStorebag()["development"], ""},
-      {"internal", sampleStorebag(), 2, sampleStorebag()["velmar_internal"], ""},
       {"seed", sampleStorebag(), 3, sampleStorebag()["seed"], ""},
       {"release", sampleStorebag(), 4, releaseSection(), ""},
       {"seed without a seed section", noSeed, 3, releaseSection(), seedMissing},

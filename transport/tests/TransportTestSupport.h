@@ -1,9 +1,7 @@
 #pragma once
 
-// Scenario helpers shared by the transport tests: a recorder for helper
-// completions, a recording URLSession delegate, an agent that counts
-// keep-alive releases, and a fixture with a temporary root, a log capture,
-// the shared test CA trusted and a loopback HTTPS server.
+// Recorders, an agent that counts keep-alive releases, and a fixture with a
+// temporary root, a log capture, the test CA trusted and an HTTPS server.
 
 #include <gtest/gtest.h>
 
