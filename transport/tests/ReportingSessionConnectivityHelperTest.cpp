@@ -319,25 +319,7 @@ TEST_F(ConnectivityHelperTest, CompletionMaySendTheNextRequest) {
   EXPECT_EQ(text(done->calls()[1].data), "2");
 }
 
-TEST_F(ConnectivityHelperTest, CleanupRemovesStaleBodyFilesOfAnyCaseAndKeepsOthers) {
-  const std::string dir = "/tmp/zthstorage/";
-  for (const char* name : {"A.zthdiag", "b.ZTHDIAG", "c.ZthDiag", "sub/d.zthdiag", "sub/deeper/e.zthdiag", "f.zthdiag/inner.txt"}) {
-    root.write(dir + name, "stale");
-  }
-  for (const char* name : {"keep.txt", "zthdiag", "x.zthdiag.bak", "xzthdiag", "sub/keep.log", "sub/deeper/keep"}) {
-    root.write(dir + name, "keep");
-  }
-  Helper::cleanupStorageRootFolder();
-  std::vector<std::string> left;
-  for (fs::recursive_directory_iterator it(Helper::storageRootFolder()), end; it != end; ++it) {
-    left.push_back(it->path().lexically_relative(Helper::storageRootFolder()).generic_string());
-  }
-  std::sort(left.begin(), left.end());
-  EXPECT_EQ(left, (std::vector<std::string>{"keep.txt", "sub", "sub/deeper", "sub/deeper/keep", "sub/keep.log", "x.zthdiag.bak",
-                                            "xzthdiag", "zthdiag"}));
-}
-
-TEST_F(ConnectivityHelperTest, CleanupMakesTheStorageFolderAndBodyFilesLandInIt) {
+TEST_F(ConnectivityHelperTest, CleanupMakesTheStorageFolderAndRemovesOnlyStaleBodyFilesOfAnyCase) {
   EXPECT_FALSE(fs::exists(Helper::storageRootFolder()));
   Helper::cleanupStorageRootFolder();
   EXPECT_TRUE(fs::is_directory(Helper::storageRootFolder()));
@@ -353,6 +335,21 @@ TEST_F(ConnectivityHelperTest, CleanupMakesTheStorageFolderAndBodyFilesLandInIt)
   Helper::deleteContainerAtURL(a);
   Helper::deleteContainerAtURL(a);  // already gone: ignored
   EXPECT_FALSE(fs::exists(a));
+
+  for (const char* name : {"A.zthdiag", "b.ZTHDIAG", "c.ZthDiag", "sub/d.zthdiag", "sub/deeper/e.zthdiag", "f.zthdiag/inner.txt"}) {
+    root.write(std::string("/tmp/zthstorage/") + name, "stale");
+  }
+  for (const char* name : {"keep.txt", "zthdiag", "x.zthdiag.bak", "xzthdiag", "sub/keep.log", "sub/deeper/keep"}) {
+    root.write(std::string("/tmp/zthstorage/") + name, "keep");
+  }
+  Helper::cleanupStorageRootFolder();
+  std::vector<std::string> left;
+  for (fs::recursive_directory_iterator it(Helper::storageRootFolder()), end; it != end; ++it) {
+    left.push_back(it->path().lexically_relative(Helper::storageRootFolder()).generic_string());
+  }
+  std::sort(left.begin(), left.end());
+  EXPECT_EQ(left, (std::vector<std::string>{"keep.txt", "sub", "sub/deeper", "sub/deeper/keep", "sub/keep.log", "x.zthdiag.bak",
+                                            "xzthdiag", "zthdiag"}));
 }
 
 }  // namespace
