@@ -39,6 +39,11 @@ TEST_F(IdentifiersTest, EachSuffixHasItsOwnIdentifier) {
   EXPECT_NE(a, b);
   EXPECT_EQ(defaults_.objectForKey("uuid:mail:sync"), Value(a));
   EXPECT_EQ(defaults_.objectForKey("uuid:mail:fetch"), Value(b));
+  // A stored value that is no string is replaced.
+  ASSERT_TRUE(defaults_.setObject("uuid:x:y", Value(5)));
+  const std::string id = getPersistentIdentifierForCustomClientIDSuffix("x", "y");
+  EXPECT_EQ(id.size(), 36u);
+  EXPECT_EQ(defaults_.objectForKey("uuid:x:y"), Value(id));
 }
 
 TEST_F(IdentifiersTest, ConcurrentFirstRequestsAgreeOnOneIdentifier) {
@@ -52,13 +57,6 @@ TEST_F(IdentifiersTest, ConcurrentFirstRequestsAgreeOnOneIdentifier) {
   }
   EXPECT_EQ(std::set<std::string>(seen.begin(), seen.end()).size(), 1u);
   EXPECT_EQ(defaults_.objectForKey("uuid:a:b"), Value(seen[0]));
-}
-
-TEST_F(IdentifiersTest, NonStringIdentifierIsReplaced) {
-  ASSERT_TRUE(defaults_.setObject("uuid:x:y", Value(5)));
-  const std::string id = getPersistentIdentifierForCustomClientIDSuffix("x", "y");
-  EXPECT_EQ(id.size(), 36u);
-  EXPECT_EQ(defaults_.objectForKey("uuid:x:y"), Value(id));
 }
 
 TEST_F(IdentifiersTest, DefaultsStringsForEachKindOfValue) {

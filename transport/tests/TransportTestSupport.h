@@ -1,9 +1,7 @@
 #pragma once
 
-// Scenario helpers shared by the transport tests: a recorder for helper
-// completions, a recording URLSession delegate, an agent that counts
-// keep-alive releases, and a fixture with a temporary root, a log capture,
-// the shared test CA trusted and a loopback HTTPS server.
+// Recorders, an agent that counts keep-alive releases, and a fixture with a
+// temporary root, a log capture, the test CA trusted and an HTTPS server.
 
 #include <gtest/gtest.h>
 
@@ -44,78 +42,70 @@ inline std::string patternBody(std::size_t size) {
   return body;
 }
 
-// Every completion call, in order; shared so that a late call never touches
-// a finished test's stack.
-class Completions : public std::enable_shared_from_this<Completions> {
+// Items appended from several threads, in order, with a bounded wait.
+template <typename T>
+class Recorder {
  public:
-  struct Call {
-    Data data;
-    std::optional<HTTPURLResponse> response;
-    std::optional<Error> error;
-  };
+  void add(T item) {
+    {
+      std::lock_guard lock(mutex_);
+      items_.push_back(std::move(item));
+    }
+    changed_.notify_all();
+  }
+  std::vector<T> items() const {
+    std::lock_guard lock(mutex_);
+    return items_;
+  }
+  template <typename Done>
+  bool waitUntil(Done done, std::chrono::milliseconds timeout) const {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, timeout, [&] { return done(items_); });
+  }
 
+ private:
+  mutable std::mutex mutex_;
+  mutable std::condition_variable changed_;
+  std::vector<T> items_;
+};
+
+struct CompletionCall {
+  Data data;
+  std::optional<HTTPURLResponse> response;
+  std::optional<Error> error;
+};
+
+// Every completion call; shared so that a late call never touches a
+// finished test's stack.
+class Completions : public Recorder<CompletionCall>, public std::enable_shared_from_this<Completions> {
+ public:
+  using Call = CompletionCall;
   static std::shared_ptr<Completions> make() { return std::make_shared<Completions>(); }
 
   URLCompletion handler(std::function<void(const Call&)> also = nullptr) {
     return [self = shared_from_this(), also](const Data& data, const std::optional<HTTPURLResponse>& response,
                                              const std::optional<Error>& error) {
       Call call{data, response, error};
-      if (also) {
-        also(call);
-      }
-      {
-        std::lock_guard lock(self->mutex_);
-        self->calls_.push_back(std::move(call));
-      }
-      self->changed_.notify_all();
+      if (also) also(call);
+      self->add(std::move(call));
     };
   }
-
   bool waitFor(std::size_t count, std::chrono::milliseconds timeout = kWait) const {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, timeout, [&] { return calls_.size() >= count; });
+    return waitUntil([&](const std::vector<Call>& calls) { return calls.size() >= count; }, timeout);
   }
-  std::vector<Call> calls() const {
-    std::lock_guard lock(mutex_);
-    return calls_;
-  }
-  std::size_t count() const {
-    std::lock_guard lock(mutex_);
-    return calls_.size();
-  }
-
- private:
-  mutable std::mutex mutex_;
-  mutable std::condition_variable changed_;
-  std::vector<Call> calls_;
+  std::vector<Call> calls() const { return items(); }
+  std::size_t count() const { return items().size(); }
 };
 
-// An ordered list of events that tests append to from several threads.
-class EventLog {
+class EventLog : public Recorder<std::string> {
  public:
-  void add(std::string event) {
-    {
-      std::lock_guard lock(mutex_);
-      events_.push_back(std::move(event));
-    }
-    changed_.notify_all();
-  }
-  std::vector<std::string> events() const {
-    std::lock_guard lock(mutex_);
-    return events_;
-  }
+  std::vector<std::string> events() const { return items(); }
   bool waitFor(const std::string& event, std::chrono::milliseconds timeout = kWait) const { return waitForCount(event, 1, timeout); }
   bool waitForCount(const std::string& event, std::size_t count, std::chrono::milliseconds timeout = kWait) const {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, timeout, [&] {
-      return static_cast<std::size_t>(std::count(events_.begin(), events_.end(), event)) >= count;
-    });
+    return waitUntil([&](const std::vector<std::string>& events) {
+      return static_cast<std::size_t>(std::count(events.begin(), events.end(), event)) >= count;
+    }, timeout);
   }
-
- private:
-  mutable std::mutex mutex_;
-  mutable std::condition_variable changed_;
-  std::vector<std::string> events_;
 };
 
 // The agent as a connectivity helper sees it: only the keep-alive release
