@@ -1,8 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <future>
-#include <thread>
-
 #include "ipc/ClientSessionExporter.h"
 #include "ipc/ClientSessionProxy.h"
 #include "ipc/ClientSessionReplyExporter.h"
