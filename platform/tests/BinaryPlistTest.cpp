@@ -1,10 +1,7 @@
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <climits>
-#include <cmath>
 #include <cstring>
-#include <random>
 #include <string>
 #include <vector>
 
@@ -84,8 +81,8 @@ const Value kUnicode(Dictionary{{"ascii", "plain"},
 INSTANTIATE_TEST_SUITE_P(
     Kinds, BinaryPlistRoundTrip,
     testing::Values(
-        RoundTrip{"EmptyDictionary", Value(Dictionary{}), RoundTrip::SameBytes},
-        RoundTrip{"EmptyArrayStringData", Value(Array{Value(Array{}), Value(""), Value(Data{})}), RoundTrip::SameBytes},
+        RoundTrip{"Empties", Value(Array{Value(Dictionary{}), Value(Array{}), Value(""), Value(Data{})}),
+                  RoundTrip::SameBytes},
         RoundTrip{"IntegersAtEveryWidth",
                   Value(Array{0, 255, 256, 65535, 65536, 0xffffffffLL, 1LL << 32, LLONG_MAX, -1, LLONG_MIN}),
                   RoundTrip::SameBytes},
@@ -138,14 +135,6 @@ TEST(BinaryPlistWriter, KeepsWhatLibplistWouldLoseOrRefuse) {
   Data none;
   EXPECT_EQ(bplist::encode(Value(), none), 0u);
   EXPECT_TRUE(none.empty());
-}
-
-TEST(BinaryPlistWriter, AppendsBehindWhatTheBufferHolds) {
-  Data out{1, 2, 3};
-  const std::size_t n = bplist::encode(Value(Dictionary{{"op", "x"}}), out);
-  EXPECT_EQ(out.size(), 3 + n);
-  EXPECT_EQ(std::string(out.begin() + 3, out.begin() + 11), "bplist00");
-  EXPECT_EQ(*bplist::decode(plist::Bytes(out.data() + 3, n)), Value(Dictionary{{"op", "x"}}));
 }
 
 // ---- refused input
@@ -297,85 +286,6 @@ TEST(BinaryPlistReader, ARepeatedKeyKeepsTheLastValueAtTheFirstPlace) {
     ASSERT_TRUE(back);
     EXPECT_EQ(keysOf(*back), (std::vector<std::string>{"a", "b"}));
     EXPECT_EQ(*back, Value(Dictionary{{"a", 3}, {"b", 2}}));
-  }
-}
-
-// A random tree of every kind the frames carry, from `random`; `asLibplist`
-// leaves out what libplist reads otherwise (unsigned numbers above 2^63 - 1,
-// which it reads as the same 64 bits signed, and dates before 2001 with a
-// fraction, whose fraction it reads with the wrong sign).
-Value randomTree(std::mt19937& random, int depth, bool asLibplist) {
-  const auto pick = std::uniform_int_distribution<int>(0, depth > 3 ? 7 : 9)(random);
-  static const char* const kTexts[] = {
-      "", "a", "caf\u00e9", "\u20ac\u4e2d", "\U0001F600", "fifteen chars!!", "a key that is longer than fifteen bytes"};
-  auto text = [&] { return std::string(kTexts[random() % std::size(kTexts)]) + std::to_string(random() % 1000); };
-  switch (pick) {
-    case 0:
-      return Value(random() % 2 == 0);
-    case 1:
-      return Value(static_cast<long long>(random()) - (1LL << 31) * static_cast<long long>(random() % 3));
-    case 2:
-      return Value((static_cast<unsigned long long>(random()) << 32 | random()) >> (asLibplist ? 1 : 0));
-    case 3:
-      return Value(std::ldexp(static_cast<double>(random()), static_cast<int>(random() % 200) - 100));
-    case 4:
-      return Value(Date{978307200.0 + static_cast<double>(random() % 2000000000) - (asLibplist ? 0 : 1e9) +
-                        (random() % 1000) / 8.0});
-    case 5:
-      return Value(Data(random() % 40, static_cast<std::uint8_t>(random())));
-    case 6:
-    case 7:
-      return Value(text());
-    case 8: {
-      Array a;
-      for (auto n = random() % 20; n > 0; --n) a.push_back(randomTree(random, depth + 1, asLibplist));
-      return Value(std::move(a));
-    }
-    default: {
-      Dictionary d;
-      for (auto n = random() % 20; n > 0; --n) d.set(text(), randomTree(random, depth + 1, asLibplist));
-      return Value(std::move(d));
-    }
-  }
-}
-
-// Dates are kept to the microsecond by each write and read: compared so.
-bool sameWithin(const Value& a, const Value& b) {
-  if (a.isDate() && b.isDate()) {
-    return std::fabs(a.date()->secondsSince1970 - b.date()->secondsSince1970) < 3e-6;
-  }
-  if (a.isArray() && b.isArray()) {
-    return std::equal(a.array()->begin(), a.array()->end(), b.array()->begin(), b.array()->end(), sameWithin);
-  }
-  if (a.isDict() && b.isDict()) {
-    const auto& x = a.dict()->entries();
-    const auto& y = b.dict()->entries();
-    return std::equal(x.begin(), x.end(), y.begin(), y.end(), [](const auto& p, const auto& q) {
-      return p.first == q.first && sameWithin(p.second, q.second);
-    });
-  }
-  return a == b;
-}
-
-TEST(BinaryPlistRandomTrees, ReadBackInOrderByUsAndByLibplistAndRewriteStable) {
-  std::mt19937 random(21);
-  for (int i = 0; i < 400; ++i) {
-    const bool asLibplist = i % 2 == 0;
-    const Value tree(Dictionary{{"root", randomTree(random, 0, asLibplist)}});
-    const Data bytes = encoded(tree);
-    const auto ours = bplist::decode(plist::bytesOf(bytes));
-    ASSERT_TRUE(ours) << i;
-    EXPECT_TRUE(sameWithin(*ours, tree)) << i << ": " << tree.description();
-    // Written again from what was read, the bytes read the same: no drift
-    // of dates from hop to hop beyond the microsecond.
-    const auto again = bplist::decode(plist::bytesOf(encoded(*ours)));
-    ASSERT_TRUE(again) << i;
-    EXPECT_TRUE(sameWithin(*again, *ours)) << i;
-    if (asLibplist) {
-      const auto theirs = plist::decodeBinary(plist::bytesOf(bytes));
-      ASSERT_TRUE(theirs) << i;
-      EXPECT_TRUE(sameWithin(*theirs, *ours)) << i << ": " << tree.description();
-    }
   }
 }
 

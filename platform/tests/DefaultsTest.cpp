@@ -9,20 +9,18 @@
 namespace zerith {
 namespace {
 
-TEST(DefaultsTest, WritesAreAtomicAndSeenByAFreshReader) {
+// Writes, reads and deletes are checked through zerith-defaults
+// (DefaultsToolTest); here what the tool cannot show: a reader that caches.
+TEST(DefaultsTest, AFileAnotherProcessRewritesIsSeenByTheNextRead) {
   test::TempRoot root;
   Defaults d("com.velmar.zerith");
-  EXPECT_TRUE(d.objectForKey("environmentType").isNil());
   ASSERT_TRUE(d.setObject("environmentType", 1));
   ASSERT_TRUE(d.setObject("zerith_storebag_url", "https://127.0.0.1:1/bags"));
-  EXPECT_EQ(Defaults("com.velmar.zerith").objectForKey("environmentType").intValue(), 1);
-  // Another process rewrites the file: the next read sees it.
+  EXPECT_EQ(d.objectForKey("environmentType").intValue(), 1);
   root.write("/var/lib/zerithd/defaults/com.velmar.zerith.plist",
              "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>environmentType</key><integer>-1</integer></dict></plist>");
   EXPECT_EQ(d.objectForKey("environmentType").intValue(), -1);
   EXPECT_TRUE(d.objectForKey("zerith_storebag_url").isNil());
-  ASSERT_TRUE(d.removeObject("environmentType"));
-  EXPECT_TRUE(d.objectForKey("environmentType").isNil());
 }
 
 TEST(DefaultsTest, CorruptFileReadsEmptyAndIsMovedAsideOnWrite) {

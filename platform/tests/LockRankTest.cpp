@@ -44,10 +44,7 @@ TEST_P(LockOrderTest, SecondLockIsCheckedAgainstTheFirst) {
 INSTANTIATE_TEST_SUITE_P(
     Ranks, LockOrderTest,
     ::testing::Values(OrderCase{"AgentThenKeepAlive", LockRank::Agent, LockRank::KeepAlive, false},
-                      OrderCase{"AgentThenStorebagCache", LockRank::Agent, LockRank::StorebagCache, false},
                       OrderCase{"KeepAliveThenAgent", LockRank::KeepAlive, LockRank::Agent, true},
-                      OrderCase{"StorebagCacheThenAgent", LockRank::StorebagCache, LockRank::Agent, true},
-                      OrderCase{"SessionClassThenAgent", LockRank::SessionClass, LockRank::Agent, true},
                       OrderCase{"TwoOfOneRank", LockRank::SessionClass, LockRank::SessionClass, true}),
     [](const auto& info) { return std::string(info.param.name); });
 
