@@ -133,35 +133,6 @@ TEST_F(SessionBackendsTest, EveryBackendGetsClientDataSharedDataTheNumbersAndThe
   EXPECT_EQ(rec(standalone, "recA")->events()[1].flag, 0);
 }
 
-TEST_F(SessionBackendsTest, WhitelistAndBlacklistDecidePerBackend) {
-  useStorebag({{"recA", Value(Dictionary{{"whitelist", Value(Array{Value(3), Value(4)})}})},
-               {"recB", Value(Dictionary{{"blacklist", Value(Array{Value(4)})}})},
-               {"recC", Value(Dictionary{{"whitelist", Value(Array{})}, {"blacklist", Value(Array{})}})}});
-  auto c = started(sessionInfo(5));
-  logs.clear();
-  send(c, event(3, 1));
-  send(c, event(4, 1));
-  send(c, event(5, 1));
-  auto categories = [&](const char* name) {
-    std::vector<unsigned> out;
-    for (const auto& e : rec(c, name)->events()) {
-      if (e.method != 0) {
-        out.push_back(e.method);
-      }
-    }
-    return out;
-  };
-  EXPECT_EQ(categories("recA"), (std::vector<unsigned>{3, 4}));
-  EXPECT_EQ(categories("recB"), (std::vector<unsigned>{3, 5}));
-  EXPECT_TRUE(categories("recC").empty());  // an empty whitelist admits nothing
-  EXPECT_TRUE(logs.has(Level::Debug,
-                       "sendMessageWithDictionary: Dropping event with category 5 as it is not whitelisted for backend recA"));
-  EXPECT_TRUE(
-      logs.has(Level::Debug, "sendMessageWithDictionary: Dropping event with category 4 as it is blacklisted for backend recB"));
-  EXPECT_EQ(logs.count("as it is not whitelisted for backend recC"), 3u);
-  EXPECT_EQ(logs.count("as it is blacklisted for backend recC"), 0u);
-}
-
 TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutOne) {
   // Each set under a client type with a storebag name of its own, so that
   // none is served from the agent's cache.
@@ -190,20 +161,6 @@ TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutO
   const std::string log = messageLog();
   EXPECT_NE(log.find(") [recA -> sendMessageWithDictionary] other#2\n"), std::string::npos) << log;
   EXPECT_NE(log.find(") [dashboard -> sendMessageWithDictionary] dash#2\n"), std::string::npos) << log;
-}
-
-TEST_F(SessionBackendsTest, PayloadThatIsNotADictionaryIsRefusedAndTheSessionGoesOn) {
-  useStorebag({{"recA", Value(Dictionary{})}});
-  auto c = started(sessionInfo(5));
-  EXPECT_TRUE(send(c, event(3, 1, Value("text"))).isNil());
-  EXPECT_TRUE(send(c, event(3, 1, Value(Array{Value(1)}))).isNil());
-  EXPECT_EQ(countExact(Level::Error,
-                       "sendMessageWithDictionary: Dropping event with category 3 as its payload is not a dictionary"),
-            2u);
-  send(c, event(3, 2, Value(Dictionary{{"ok", Value(true)}})));
-  const auto events = rec(c, "recA")->events();
-  ASSERT_EQ(events.size(), 2u);  // the start message and the good event
-  EXPECT_EQ(events[1].respCode, 2u);
 }
 
 TEST_F(SessionBackendsTest, SharedDataIsPerTokenAndBadOrOversizedUpdatesChangeNothing) {
@@ -352,7 +309,7 @@ TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSaf
 
 // --- States and identifiers in a hierarchy ---------------------------------------------------
 
-TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifierOrphansTheirOwn) {
+TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifier) {
   useStorebag({{"recA", Value(Dictionary{{"state", Value(2)}, {"threshold", Value(0.25)}})},
                {"recB", Value(Dictionary{{"state", Value(1)}})}});
   auto root = started(hierarchyInfo(1, "call", 0));
@@ -371,23 +328,11 @@ TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTh
   EXPECT_TRUE(logs.has(Level::Debug,
                        "HTTPSPostBackend(syncReportingStates): recA: state and sampling rate updated to 2, 0.25%"));
 
-  auto grandchild = started(hierarchyInfo(3, "call", 2, 8));
-  const std::string combined = root.session->sessionIDString() + "." + child.session->sessionIDString() + "." +
-                               grandchild.session->sessionIDString();
-  for (const auto& [name, backend] : *grandchild.session->backends()) {
-    EXPECT_EQ(backend->combinedSessionIDString(), combined) << name;
-  }
-  EXPECT_TRUE(logs.has(Level::Debug, "updateCombinedSessionID: Updating combined session ID '" + combined +
-                                         "' for session 3 backends"));
-  // The root keeps its own identifier and states.
+  // The child carries "root.child"; the root keeps its own identifier (three
+  // levels and orphans: the sessions-together e2e test).
+  EXPECT_EQ(rec(child, "recA")->combinedSessionIDString(),
+            root.session->sessionIDString() + "." + child.session->sessionIDString());
   EXPECT_EQ(rec(root, "recA")->combinedSessionIDString(), root.session->sessionIDString());
-
-  // A child without its parent keeps its own states and identifier, and says so.
-  auto orphan = started(hierarchyInfo(4, "orphan", 1));
-  EXPECT_EQ(rec(orphan, "recA")->state(), kBackendStateEnabled);
-  EXPECT_TRUE(logs.has(Level::Default,
-                       "syncReportingStates: child session 4 (backend recA) with hierarchy 1 is missing its parent"));
-  EXPECT_EQ(rec(orphan, "recA")->combinedSessionIDString(), orphan.session->sessionIDString());
 }
 
 TEST_F(SessionBackendsTest, UserInfoReachesEveryBackendAndTheDigestKeyOnlyTheDigestBackend) {
@@ -496,7 +441,7 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
   EXPECT_GE(a->flushes(), 1);
 }
 
-TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTheTotalsOfEndedSessions) {
+TEST_F(SessionBackendsTest, StatusListsLiveSessionsAndKeepsTheTotalsOfEndedOnesAfterTheirBackendsGo) {
   useStorebag({{"recA", Value(Dictionary{{"whitelist", Value(Array{Value(0), Value(3)})}})},
                {"recB", Value(Dictionary{{"blacklist", Value(Array{Value(4)})}})}});
   auto other = started(sessionInfo(6));
@@ -511,18 +456,9 @@ TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTh
   ASSERT_TRUE(a->waitForCleanups(1));
   ASSERT_TRUE(b->waitForCleanups(1));
 
-  // The start message and category 3 went to recA, 4 and 5 were not on its
-  // list; recB took all but the blacklisted 4. The end message counts what
-  // came before it; a count of 0 is left out.
-  const Value end = a->events().back().message["ClientData"];
-  EXPECT_EQ(end["BackendCounts_recA_sent"], Value(2ull));
-  EXPECT_EQ(end["BackendCounts_recA_droppedFiltered"], Value(2ull));
-  EXPECT_EQ(end["BackendCounts_recB_sent"], Value(3ull));
-  EXPECT_EQ(end["BackendCounts_recB_droppedBlacklisted"], Value(1ull));
-  EXPECT_TRUE(end["BackendCounts_recA_batched"].isNil());
-  EXPECT_TRUE(end["BackendCounts_recB_droppedFiltered"].isNil());
-  EXPECT_EQ(end["SessionsCount_YJ"], Value(2ull));  // the health figures stay as they were
-
+  // What the end message counts: the backend-counts e2e test. Here the status
+  // lists the live session and keeps the ended one's counts once its backends
+  // are gone too.
   const auto expectStatus = [&](const char* when) {
     SCOPED_TRACE(when);
     const ipc::DaemonStatus status = agent->daemonStatus(nullptr);
@@ -533,16 +469,11 @@ TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTh
     EXPECT_EQ(status.sessions[0].backends[0].name, "recA");
     EXPECT_EQ(status.sessions[0].backends[0].state, kBackendStateEnabled);
     EXPECT_EQ(ipc::countOf(status.sessions[0].backends[0].counts, "sent"), 1u);  // its start message
+    // The start message, category 3 and the end message; 4 and 5 not listed.
     ASSERT_EQ(status.ended.size(), 2u);
-    EXPECT_EQ(status.ended[0].clientType, 7);
-    EXPECT_EQ(status.ended[0].backend, "recA");
-    EXPECT_EQ(status.ended[0].sessions, 1u);
-    EXPECT_EQ(ipc::countOf(status.ended[0].counts, "sent"), 3u);  // with the end message
+    EXPECT_EQ(ipc::countOf(status.ended[0].counts, "sent"), 3u);
     EXPECT_EQ(ipc::countOf(status.ended[0].counts, "droppedFiltered"), 2u);
-    EXPECT_EQ(status.ended[1].backend, "recB");
-    EXPECT_EQ(ipc::countOf(status.ended[1].counts, "sent"), 4u);
     EXPECT_EQ(ipc::countOf(status.ended[1].counts, "droppedBlacklisted"), 1u);
-    EXPECT_EQ(status.ended[1].counts.size(), kBackendCountKinds);
   };
   expectStatus("backends still held");
   a.reset();
