@@ -4,8 +4,6 @@
 #include "backends/HTTPSPostBackendHelpers.h"
 
 #include <algorithm>
-#include <cctype>
-#include <cmath>
 #include <chrono>
 #include <cstdio>
 #include <deque>

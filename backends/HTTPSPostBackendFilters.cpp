@@ -3,32 +3,23 @@
 // to each record.
 
 #include "backends/HTTPSPostBackend.h"
-#include "backends/HTTPSPostBackendHelpers.h"
 #include "backends/BackendsLog.h"
-#include "backends/Spool.h"
+#include "backends/HTTPSPostBackendHelpers.h"
 
 #include <algorithm>
 #include <cctype>
-#include <cmath>
-#include <chrono>
-#include <cstdio>
-#include <deque>
-#include <map>
+#include <cstdint>
 #include <mutex>
 #include <utility>
 
 #include <fmt/format.h>
-#include <nlohmann/json.hpp>
 
 #include "config/ClientTypes.h"
-#include "config/Compression.h"
 #include "config/Conversions.h"
 #include "config/DeviceInfo.h"
 #include "config/Identifiers.h"
-#include "config/SenderCodes.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
-#include "platform/Log.h"
 #include "zerith/Zerith.h"
 #include "zerith/ZerithConstants.h"
 

@@ -2,32 +2,22 @@
 // waits in, and the JSON envelope a batch is posted in.
 
 #include "backends/HTTPSPostBackend.h"
-#include "backends/HTTPSPostBackendHelpers.h"
 #include "backends/BackendsLog.h"
+#include "backends/HTTPSPostBackendHelpers.h"
 #include "backends/Spool.h"
 
 #include <algorithm>
-#include <cctype>
 #include <cmath>
-#include <chrono>
-#include <cstdio>
-#include <deque>
-#include <map>
-#include <mutex>
-#include <utility>
+#include <exception>
 
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
 
 #include "config/ClientTypes.h"
-#include "config/Compression.h"
 #include "config/Conversions.h"
 #include "config/DeviceInfo.h"
 #include "config/Identifiers.h"
 #include "config/SenderCodes.h"
-#include "platform/Crypto.h"
-#include "platform/Defaults.h"
-#include "platform/Log.h"
 #include "zerith/Zerith.h"
 #include "zerith/ZerithConstants.h"
 

@@ -3,26 +3,12 @@
 
 #include "backends/Spool.h"
 
-#include <dirent.h>
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-#include <zlib.h>
-
 #include <algorithm>
-#include <cerrno>
 #include <cmath>
-#include <cstring>
-#include <future>
-#include <iterator>
 
 #include <fmt/format.h>
 
 #include "backends/BackendsLog.h"
-#include "backends/ZerithBackend.h"
-#include "platform/Defaults.h"
-#include "platform/FileUtil.h"
-#include "platform/Paths.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 
 namespace zerith {

@@ -6,8 +6,6 @@
 
 #include <sys/time.h>
 
-#include <set>
-
 #include <fmt/format.h>
 
 #include "backends/CreateBackends.h"
@@ -15,16 +13,10 @@
 #include "config/Conversions.h"
 #include "config/DeviceInfo.h"
 #include "config/MessageLog.h"
-#include "backends/UploadBackend.h"
 #include "ipc/ClientSessionReplyProxy.h"
 #include "ipc/ClientSessionWire.h"
-#include "ipc/Connection.h"
-#include "platform/Crypto.h"
 #include "platform/Defaults.h"
-#include "platform/Log.h"
-#include "platform/SandboxExtension.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
-#include "zerith/ZerithBundle.h"
 #include "zerith/ZerithConstants.h"
 
 namespace zerith {

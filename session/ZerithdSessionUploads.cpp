@@ -4,27 +4,15 @@
 #include "session/ZerithdSession.h"
 #include "session/ZerithdSessionHelpers.h"
 
-#include <sys/time.h>
-
-#include <set>
-
 #include <fmt/format.h>
 
-#include "backends/CreateBackends.h"
-#include "config/ClientTypes.h"
-#include "config/Conversions.h"
-#include "config/DeviceInfo.h"
-#include "config/MessageLog.h"
 #include "backends/UploadBackend.h"
+#include "config/MessageLog.h"
 #include "ipc/ClientSessionReplyProxy.h"
 #include "ipc/ClientSessionWire.h"
 #include "ipc/Connection.h"
-#include "platform/Crypto.h"
 #include "platform/Defaults.h"
-#include "platform/Log.h"
 #include "platform/SandboxExtension.h"
-#include "transport/ReportingSessionConnectivityHelper.h"
-#include "zerith/ZerithBundle.h"
 #include "zerith/ZerithConstants.h"
 
 namespace zerith {
