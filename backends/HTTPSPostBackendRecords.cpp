@@ -1,0 +1,249 @@
+// The HTTPS backend's records: a record made from a payload, the batch it
+// waits in, and the JSON envelope a batch is posted in.
+
+#include "backends/HTTPSPostBackend.h"
+#include "backends/BackendsLog.h"
+#include "backends/HTTPSPostBackendHelpers.h"
+#include "backends/Spool.h"
+
+#include <algorithm>
+#include <cmath>
+#include <exception>
+
+#include <fmt/format.h>
+#include <nlohmann/json.hpp>
+
+#include "config/ClientTypes.h"
+#include "config/Conversions.h"
+#include "config/DeviceInfo.h"
+#include "config/Identifiers.h"
+#include "config/SenderCodes.h"
+#include "zerith/Zerith.h"
+#include "zerith/ZerithConstants.h"
+
+namespace zerith {
+
+using https_post_detail::kRecordKeys;
+using https_post_detail::recordInteger;
+
+namespace {
+
+// The value of a record entry on the wire, or nullopt when JSON cannot carry
+// it (logged). Dates become seconds since 1970.
+std::optional<nlohmann::ordered_json> wireValue(const std::string& key, const Value& v) {
+  switch (v.type()) {
+    case Value::Type::Bool: return nlohmann::ordered_json(v.boolValue());
+    case Value::Type::Int: return nlohmann::ordered_json(v.intValue());
+    case Value::Type::UInt: return nlohmann::ordered_json(v.unsignedValue());
+    case Value::Type::Real:
+      if (std::isfinite(v.doubleValue())) {
+        return nlohmann::ordered_json(v.doubleValue());
+      }
+      break;
+    case Value::Type::String: return nlohmann::ordered_json(*v.string());
+    case Value::Type::Date: return nlohmann::ordered_json(sanitizeDouble(v.date()->secondsSince1970));
+    default: break;
+  }
+  backendsLogger().error("HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable to handle key: {}, value: {}",
+                 key, v.description());
+  return std::nullopt;
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------
+// Records, batch and envelope
+
+Dictionary HTTPSPostBackend::newEventDictfromPayload(const Value& payload, const timeval& timestamp,
+                                                     std::uint16_t method, std::uint16_t respCode,
+                                                     std::uint16_t eventID) const {
+  const std::size_t capacity = payload.count() + kRecordKeys + userInfoDict().count();
+  Dictionary event = payload.isDict() ? Dictionary(*payload.dict(), capacity) : Dictionary(Dictionary(), capacity);
+  return completeRecord(std::move(event), timestamp, method, respCode, eventID);
+}
+
+Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& timestamp, std::uint16_t method,
+                                            std::uint16_t respCode, std::uint16_t) const {
+  const double start = startTimeStamp();
+  const std::int64_t startTS = roundDownToMinute(static_cast<std::int64_t>(start));
+  event.set("_startTS", Value(static_cast<long long>(startTS)));
+  event.set("_sender", Value(senderCode(static_cast<std::uint32_t>(compType()))));
+  event.set("_clientVersion", Value(static_cast<unsigned>(clientVersion())));
+  if (auto combined = combinedSessionIDString()) {
+    event.set("_sessionID", Value(*combined));
+  }
+  const std::int32_t type = compType();
+  if (type == 7 || (isInternal() && (type == 11 || type == 13))) {
+    event.set("_sessionID", Value(static_cast<unsigned>(sessionID())));
+  }
+  event.set("_eventNumber", Value(static_cast<unsigned>(eventID())));
+  event.set("_method", Value(static_cast<unsigned>(method)));
+  event.set("_status", Value(static_cast<unsigned>(respCode)));
+  const double clientTS = sanitizeDouble(static_cast<double>(startTS) + (timevalToSeconds(timestamp) - start));
+  event.set("_clientTS", Value(clientTS));
+  event.set("eventTime", Value(clientTS));
+  // Absent product facts leave no entry rather than a null on the wire (an
+  // entry of the payload by that name goes too).
+  if (auto family = productFamily()) {
+    event.set("_productFamily", Value(std::move(*family)));
+  } else {
+    event.erase("_productFamily");
+  }
+  if (auto model = hardwareType()) {
+    event.set("_productModel", Value(std::move(*model)));
+  } else {
+    event.erase("_productModel");
+  }
+  if (auto version = productVersion()) {
+    event.set("_osVersion", Value(*version));
+  }
+  if (auto build = buildVersion()) {
+    event.set("_build", Value(*build));
+  }
+  event.set("_internal", Value(isInternalBuild() ? 3u : 2u));
+  const std::string minor = selfVersionMinor() != 0 ? fmt::format(".{}", selfVersionMinor()) : std::string();
+  event.set("_reportVers", Value(fmt::format("{}.{}{}", selfVersionMajor(), selfVersionMiddle(), minor)));
+  event.set("_timezoneOffset", Value(static_cast<long long>(timeZoneOffsetSeconds())));
+  return event;
+}
+
+void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Value& frameworkData) const {
+  const Value userInfo = userInfoDict();
+  if (const Dictionary* entries = userInfo.dict()) {
+    for (const auto& [key, value] : *entries) {
+      event.set(key, value);
+    }
+  }
+  if (const Dictionary* data = frameworkData.dict()) {
+    for (const auto& [key, value] : *data) {
+      event.set(key, value);
+    }
+  }
+  filterEvent(event);
+}
+
+std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
+  const auto method = static_cast<std::uint16_t>(recordInteger(event, "_method").value_or(0));
+  const std::int32_t threshold = eventThreshold();
+  // Creates the batch when there is none, with room for a method's full
+  // batch; on the state queue.
+  const auto createBatch = [&] {
+    if (!batch_.batchedEvents) {
+      batch_.batchedEvents.emplace();
+      batch_.batchedEvents->reserve(static_cast<std::size_t>(std::clamp<std::int32_t>(threshold, 0, 255)) + 1);
+    }
+  };
+  // Appends the record and stores the method's new count; on the state queue.
+  const auto append = [&](std::int64_t count) {
+    Batch& batch = batch_;
+    createBatch();
+    batch.batchedEvents->push_back(std::move(event));
+    counters().add(BackendCount::batched);
+    counters().add(BackendCount::inBatch);
+    for (auto& [m, n] : batch.eventMethodCounts) {
+      if (m == method) {
+        n = count + 1;
+        return;
+      }
+    }
+    batch.eventMethodCounts.emplace_back(method, count + 1);
+  };
+  // One turn on the state queue reads the method's count and, when it does
+  // not force a flush, appends the record at once. The append may join the
+  // read because all that the batch's users rely on is that a later turn on
+  // the queue (a flush, a size or count read) sees every record whose
+  // batchEvent has returned; one turn gives that as well as two. The turn
+  // runs on this thread, so no pool thread is woken per record.
+  std::int64_t count = 0;
+  const bool appended = stateQueue().sync([&] {
+    createBatch();
+    for (const auto& [m, n] : batch_.eventMethodCounts) {
+      if (m == method) {
+        count = n;
+        break;
+      }
+    }
+    if (count > threshold) {
+      return false;
+    }
+    append(count);
+    return true;
+  });
+  if (appended) {
+    return std::nullopt;
+  }
+  backendsLogger().debug("HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method {}",
+                 method);
+  std::optional<std::string> result = flushMessagesWithCompletion(nullptr);
+  // The record that forced the flush is appended in a turn of its own after
+  // it, so it is never part of what it flushed; it starts the method's new
+  // count.
+  stateQueue().sync([&] { append(0); });
+  return result;
+}
+
+std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
+    std::vector<Dictionary> events, std::optional<std::string>* prettyJsonString) const {
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  const Fields f = fields();
+
+  auto records = nlohmann::ordered_json::array();
+  auto& recordList = records.get_ref<nlohmann::ordered_json::array_t&>();
+  recordList.reserve(events.size());
+  for (const Dictionary& event : events) {
+    auto record = nlohmann::ordered_json::object();
+    auto& entries = record.get_ref<nlohmann::ordered_json::object_t&>();
+    entries.reserve(event.size());
+    for (const auto& [key, value] : event) {
+      if (auto wire = wireValue(key, value)) {
+        // A record's keys are unique already: appended without the ordered
+        // map's search for an equal key.
+        entries.emplace_back(key, std::move(*wire));
+      }
+    }
+    if (f.spoolEnabled) {
+      // Set once, here: a spooled batch is posted again byte for byte, so
+      // the collector sees the same ID on every copy of the record.
+      entries.emplace_back("_recordID", newRecordID());
+    }
+    recordList.push_back(std::move(record));
+  }
+
+  std::optional<std::string> clientId = f.uuidCustom ? f.uuidCustom : (f.dnuType != 0 ? f.uuidOverrideDnu : f.uuidRespectDnu);
+  if (f.extrasOnInternal != 0 && isInternal()) {
+    const char* device = udid();
+    clientId = device ? std::optional<std::string>(device) : std::nullopt;
+  }
+
+  // The three keys go in as one list that ends at the first absent value.
+  auto envelope = nlohmann::ordered_json::object();
+  envelope["postTime"] = sanitizeDouble(timevalToSeconds(now));
+  if (clientId) {
+    envelope["clientId"] = *clientId;
+    envelope["events"] = std::move(records);
+  }
+
+  std::string compact;
+  try {
+    // Text that is not UTF-8 is carried with replacement characters rather
+    // than breaking the JSON.
+    compact = envelope.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+  } catch (const std::exception& e) {
+    backendsLogger().error("HTTPSPostBackend(createMessageForPostAndLogging): cannot serialise the envelope: {}", e.what());
+    return std::nullopt;
+  }
+
+  if (prettyJsonString) {
+    const ZerithEnvironmentType environment =
+        lastResolvedEnvironmentType() != kEnvironmentNone ? lastResolvedEnvironmentType() : userDefaultsEnvironment();
+    const bool forced = (environment == kEnvironmentDevelopment || environment == kEnvironmentInternal) && f.forceEventLogging;
+    const bool consented = f.dnuType == 0 && f.dnuEnabled;
+    if (forced || consented) {
+      *prettyJsonString = envelope.dump(4, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+    }
+  }
+  return compact;
+}
+
+}  // namespace zerith
