@@ -92,16 +92,6 @@ class CollectorProcess {
     }
   }
 
-  // Stops it (SIGTERM) and returns every line it had not been asked for.
-  std::vector<nlohmann::ordered_json> stopAndReadRest(const std::string& kind = {}) {
-    stop();
-    std::vector<nlohmann::ordered_json> rest;
-    while (auto line = nextLine(kind)) {
-      rest.push_back(std::move(*line));
-    }
-    return rest;
-  }
-
   void stop() {
     if (pid_ > 0) {
       ::kill(pid_, SIGTERM);

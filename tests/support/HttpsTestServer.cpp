@@ -302,14 +302,4 @@ std::string RefusingPort::url(std::string_view path) const {
   return "https://127.0.0.1:" + std::to_string(port_) + std::string(path);
 }
 
-int unusedLoopbackPort() {
-  int port = 0;
-  const int fd = bindLoopback(port);
-  if (fd < 0) {
-    throw std::runtime_error("unusedLoopbackPort: cannot bind a loopback port");
-  }
-  ::close(fd);
-  return port;
-}
-
 }  // namespace zerith::test

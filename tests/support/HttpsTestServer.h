@@ -128,8 +128,4 @@ class RefusingPort {
   int port_ = 0;
 };
 
-// A loopback port that was free a moment ago, for servers started as child
-// processes that must be told their port.
-int unusedLoopbackPort();
-
 }  // namespace zerith::test

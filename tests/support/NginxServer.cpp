@@ -99,7 +99,6 @@ std::string NginxServer::url(std::string_view path) const {
   return "https://127.0.0.1:" + std::to_string(port_) + std::string(path);
 }
 
-std::string NginxServer::errorLog() const { return readText(options_.workDir / "error.log"); }
 
 std::string NginxServer::accessLog() const { return readText(options_.workDir / "access.log"); }
 

@@ -53,8 +53,6 @@ class NginxServer {
   // "https://127.0.0.1:<port><path>"
   std::string url(std::string_view path = "/") const;
 
-  // nginx's error log so far, for failure messages.
-  std::string errorLog() const;
   // The access log so far, one line per answered request:
   //   GET /bags/dravon?version=8.0 304 ims="Tue, 14 Nov 2023 22:13:20 GMT"
   std::string accessLog() const;

@@ -22,7 +22,6 @@
 #include "config/DeviceInfo.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
-#include "platform/Log.h"
 #include "tests/support/CollectorProcess.h"
 #include "tests/support/Command.h"
 #include "tests/support/TempRoot.h"
@@ -167,20 +166,6 @@ TEST_F(CollectorToolTest, BackendRecordsArriveOneLinePerRecordWithSenderSessionA
   const auto line = collector.nextLine();
   ASSERT_TRUE(line);
   EXPECT_EQ((*line)["digest"], "invalid");
-}
-
-TEST_F(CollectorToolTest, ChosenServerErrorDisablesTheBackend) {
-  auto args = baseArgs();
-  args.insert(args.end(), {"--status", "503"});
-  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
-  auto b = backendFor(collector.url("/post"));
-  timeval now{};
-  gettimeofday(&now, nullptr);
-  log::LogCapture logs;
-  b->sendMessage(Value(Dictionary{}), now, 1, 1, 1);
-  ASSERT_TRUE(collector.nextLine());
-  ASSERT_TRUE(logs.waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"));
-  EXPECT_EQ(b->state(), kBackendStateDisabled);
 }
 
 struct CurlAnswer {
