@@ -1,6 +1,7 @@
 // zerith-storebag as an operator runs it: key pairs, signing with one key
 // or both, verification, display, and the way back past the anti-rollback
-// check.
+// check. (That the RSA signature is a plain SHA-1 one that other tools
+// verify is checked by the storebag verification's unit tests.)
 
 #include <gtest/gtest.h>
 
@@ -73,34 +74,14 @@ TEST_F(ZerithStorebagToolTest, SignedContainerVerifiesAndShowsTheBag) {
   const test::CommandResult show = run("show --public publicKey.der --in container");
   EXPECT_EQ(show.status, 0);
   EXPECT_EQ(show.output, plist::encodeXml(stamped));
-}
 
-TEST_F(ZerithStorebagToolTest, XmlContainerHoldsTheTwoBase64Strings) {
-  prepare();
+  // The XML form holds the same two base64 strings and verifies as well.
   ASSERT_EQ(run("sign --key key.pem --in bag.plist --out container.xml --format xml").status, 0);
   const Data xml = read("container.xml");
   EXPECT_FALSE(plist::looksBinary(plist::bytesOf(xml)));
-  const Value fields = *plist::decode(plist::bytesOf(xml));
-  ASSERT_EQ(fields.count(), 2u);
-  EXPECT_TRUE(crypto::base64Decode(*fields["bag"].string()));
+  EXPECT_EQ(plist::decode(plist::bytesOf(xml))->count(), 2u);
   EXPECT_EQ(crypto::base64Decode(*fields["signature"].string())->size(), 256u);  // RSA 2048
   EXPECT_EQ(run("verify --public publicKey.der --in container.xml").status, 0);
-}
-
-TEST_F(ZerithStorebagToolTest, SignatureIsPlainRsaSha1AsOpenSslMakesIt) {
-  if (std::system("openssl version >/dev/null 2>&1") != 0) GTEST_SKIP() << "no openssl command";
-  prepare();
-  ASSERT_EQ(run("sign --key key.pem --in bag.plist --out container").status, 0);
-  const Value fields = *plist::decode(plist::bytesOf(read("container")));
-  const Data signature = *crypto::base64Decode(*fields["signature"].string());
-  std::ofstream(at("sig"), std::ios::binary)
-      .write(reinterpret_cast<const char*>(signature.data()), static_cast<std::streamsize>(signature.size()));
-  const Data signedBag = *crypto::base64Decode(*fields["bag"].string());
-  write("signed-bag", std::string(signedBag.begin(), signedBag.end()));
-  const std::string command = "cd '" + root_.path().string() +
-                              "' && openssl pkey -pubin -inform DER -in publicKey.der -out pub.pem && "
-                              "openssl dgst -sha1 -verify pub.pem -signature sig signed-bag >/dev/null";
-  EXPECT_EQ(std::system(command.c_str()), 0);
 }
 
 TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
