@@ -1,7 +1,6 @@
 // Uploads through the real daemon and client framework: the framework opens
 // the file with the client's own rights and passes the descriptor; the
-// daemon reads only through it, deletes nothing itself, and stays
-// responsive while an upload server stalls.
+// daemon reads only through it and deletes nothing itself.
 
 #include <fcntl.h>
 #include <sys/stat.h>
