@@ -98,7 +98,9 @@ TEST_F(StorebagTrustTest, AnOlderBagIsRefusedAcrossARestartUntilTheOperatorForge
   std::string error;
   ASSERT_TRUE(forgetStorebagIssueTime("dravon", forgotten, &error)) << error;
   EXPECT_EQ(forgotten, Date{kNewer});
-  EXPECT_EQ(backends(), only("kovu"));
+  // This session's fetch is the refresh or comes before it: it may see either
+  // bag. What counts is that the older one is saved and served from now on.
+  backends();
   ASSERT_TRUE(daemon->waitFor("fetchStorebagWithName: storebag 'dravon' has been saved to disk cache"))
       << daemon->output();
   EXPECT_EQ(backends(), only("pellamlog")) << daemon->output();
