@@ -5,6 +5,7 @@
 #include <deque>
 #include <map>
 
+#include "config/StorebagVerify.h"
 #include "platform/Log.h"
 
 namespace zerith {
@@ -36,6 +37,9 @@ class StorebagCacheTest : public ::testing::Test {
                  }
                  FetchResult r = results_.front();
                  results_.pop_front();
+                 if (r.storebag.isNil() && !cause_.empty()) {
+                   noteStorebagFailure(cause_);
+                 }
                  maxAge = r.maxAge;
                  version = r.version;
                  unchanged = r.unchanged;
@@ -52,10 +56,65 @@ class StorebagCacheTest : public ::testing::Test {
   log::LogCapture logs_;
   Date now_{1700000000};  // 2023-11-14 22:13:20 UTC
   std::deque<FetchResult> results_;
+  std::string cause_;  // what the scripted fetch notes as its failure
   std::vector<std::int32_t> fetchedTypes_;
   std::map<std::string, Date> diskDates_;
   StorebagCache cache_;
 };
+
+TEST_F(StorebagCacheTest, FailedFetchIsNotRetriedWithin900Seconds) {
+  results_ = {FetchResult{}, FetchResult{section("second"), 600, "2.0"}};
+
+  EXPECT_TRUE(cache_.storebagForClientType(5, 1).isNil());
+  EXPECT_TRUE(logs_.has(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 5"));
+  EXPECT_EQ(*entry("ambrel")["StorebagFetchState"].string(), "Fetch Failure");
+
+  advance(899);
+  EXPECT_TRUE(cache_.storebagForClientType(5, 2).isNil());
+  EXPECT_TRUE(logs_.has(Level::Default,
+                        "storebagForSession: Not fetching storebag for client type 5 - must wait 900 seconds between "
+                        "attempts"));
+  EXPECT_EQ(fetchedTypes_.size(), 1u);
+
+  advance(1);  // 900 seconds: the wait is over
+  EXPECT_EQ(cache_.storebagForClientType(5, 3), section("second"));
+  EXPECT_EQ(fetchedTypes_.size(), 2u);
+  EXPECT_EQ(*entry("ambrel")["StorebagFetchState"].string(), "Fetch Successful");
+}
+
+TEST_F(StorebagCacheTest, TheFailureLineEndsWithTheFetchsCause) {
+  results_ = {FetchResult{}, FetchResult{}};
+  cause_ = "HTTP status 404 from https://bags.example/ambrel?version=8.0";
+  EXPECT_TRUE(cache_.storebagForClientType(5, 1).isNil());
+  EXPECT_TRUE(logs_.has(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 5: HTTP status "
+                                      "404 from https://bags.example/ambrel?version=8.0"));
+  // A cause from an earlier fetch is not repeated for the next one.
+  logs_.clear();
+  cause_.clear();
+  advance(900);
+  EXPECT_TRUE(cache_.storebagForClientType(5, 2).isNil());
+  EXPECT_TRUE(logs_.has(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 5"));
+}
+
+TEST_F(StorebagCacheTest, DropForgetsEntriesAndTheWaitAfterAFailure) {
+  results_ = {FetchResult{}, FetchResult{section("good"), 86400, "1.0"}, FetchResult{section("newer"), 86400, "2.0"},
+              FetchResult{section("other"), 86400, "3.0"}};
+  EXPECT_TRUE(cache_.storebagForClientType(5, 1).isNil());
+  EXPECT_EQ(cache_.drop(), 1u);
+  EXPECT_EQ(cache_.count(), 0u);
+  // At once, not 900 seconds later.
+  EXPECT_EQ(cache_.storebagForClientType(5, 2), section("good"));
+  EXPECT_EQ(cache_.storebagForClientType(13, 3), section("newer"));
+  EXPECT_EQ(fetchedTypes_, (std::vector<std::int32_t>{5, 5, 13}));
+
+  // A fresh entry is fetched again too; every name goes.
+  EXPECT_EQ(cache_.drop(), 2u);
+  EXPECT_TRUE(cache_.storebagVersionForClientType(5).isNil());
+  EXPECT_EQ(cache_.storebagForClientType(5, 4), section("other"));
+  EXPECT_EQ(*cache_.storebagVersionForClientType(5).string(), "3.0");
+  EXPECT_EQ(cache_.drop(), 1u);
+  EXPECT_EQ(cache_.drop(), 0u);
+}
 
 TEST_F(StorebagCacheTest, FailureAfterSuccessKeepsServingTheOlderStorebag) {
   results_ = {FetchResult{section("old"), 60, "1.0"}, FetchResult{}};

@@ -33,6 +33,56 @@ class ZerithdAgentTest : public AgentFixture {
 
 // --- Acceptance --------------------------------------------------------------
 
+TEST_F(ZerithdAgentTest, RefusesEveryEntitlementThatIsNotExactlyTrue) {
+  const std::vector<Dictionary> grants = {
+      {},                                                       // missing
+      {{"com.velmar.private.zerithd", Value(false)}},           // false
+      {{"com.velmar.private.zerithd", Value("true")}},          // a string
+      {{"com.velmar.private.zerithd", Value(1)}},               // a number
+      {{"com.velmar.private.zerithdx", Value(true)}},           // another entitlement
+  };
+  for (const auto& grant : grants) {
+    auto connection = std::make_shared<FakeConnection>(grant);
+    EXPECT_FALSE(accept(connection));
+    EXPECT_TRUE(logs.has(Level::Default, "listener: refusing a client (uid 0, gid 0, pid 0 at connect): it lacks the "
+                                         "entitlement com.velmar.private.zerithd"));
+    EXPECT_EQ(connection->exported(), nullptr);
+    EXPECT_EQ(connection->resumed(), 0);
+    EXPECT_FALSE(connection->hasInvalidationHandler());
+  }
+  EXPECT_EQ(agent->sessionCount(), 0u);
+  EXPECT_EQ(agent->veskTransactionReference(), 0);
+  EXPECT_EQ(transaction->beginCount(), 0u);
+  EXPECT_FALSE(logs.contains("createReportingSessionWithDelegate"));
+}
+
+TEST_F(ZerithdAgentTest, AcceptedConnectionsAreSetUpListedAndCounted) {
+  auto first = FakeConnection::entitled();
+  auto second = FakeConnection::entitled();
+  ASSERT_TRUE(accept(first));
+  ASSERT_TRUE(accept(second));
+
+  // The counts in the acceptance message are read before the session exists.
+  EXPECT_TRUE(logs.has(Level::Debug, "listener: Accepting new Vesk connection " + first->description() +
+                                         " as it has proper entitlement, 0(0) connections."));
+  EXPECT_TRUE(logs.has(Level::Debug, "listener: Accepting new Vesk connection " + second->description() +
+                                         " as it has proper entitlement, 1(0) connections."));
+  for (const auto& c : {first, second}) {
+    EXPECT_NE(c->exported(), nullptr);
+    EXPECT_EQ(c->resumed(), 1);
+    EXPECT_TRUE(c->hasInvalidationHandler());
+    EXPECT_TRUE(c->hasInterruptionHandler());
+  }
+  EXPECT_EQ(agent->sessionCount(), 2u);
+  EXPECT_EQ(agent->veskTransactionReference(), 2);
+  EXPECT_TRUE(logs.has(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 1"));
+  EXPECT_TRUE(logs.has(Level::Default, "createReportingSessionWithDelegate: retained VeskTransaction. Ref count is 2"));
+  // Only the first session, arriving at an empty list, begins a transaction.
+  EXPECT_EQ(transaction->beginCount(), 1u);
+  EXPECT_EQ(logs.count("createReportingSessionWithDelegate: Vesk transaction started with session <ZerithdSession: "),
+            1u);
+}
+
 TEST_F(ZerithdAgentTest, InterruptionNeverEndsTheSession) {
   auto connection = FakeConnection::entitled();
   ASSERT_TRUE(accept(connection));
@@ -67,6 +117,38 @@ TEST_F(ZerithdAgentTest, SessionArrivingBeforeThePreviousTransportClosedBeginsAS
 }
 
 // --- Hierarchy -----------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, ParentIdentifierJoinsAncestorsRootFirst) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0));
+  auto mid = newSession(hierarchyInfo(2, "call", 1));
+  auto leaf = newSession(hierarchyInfo(3, "call", 2));
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*leaf.session),
+            Value(root0.session->sessionIDString() + "." + mid.session->sessionIDString()));
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*mid.session), Value(root0.session->sessionIDString()));
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*root0.session).isNil());
+  EXPECT_EQ(agent->parentSessionForChild(*leaf.session), mid.session);
+  EXPECT_TRUE(logs.has(Level::Debug, "updateCorrelatedSessions: Adding session 3 to list for hierarchyToken call with "
+                                     "hierarchyLevel 2"));
+}
+
+TEST_F(ZerithdAgentTest, MissingParentLevelGivesNilParentIdentifier) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0));
+  auto orphan = newSession(hierarchyInfo(2, "call", 2));  // level 1 never connected
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*orphan.session).isNil());
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete "
+                       "parentSessionID is '(null)'"));
+
+  // Levels 0 and 1 present, 2 missing: the walk stops at level 2.
+  auto zero = newSession(hierarchyInfo(3, "media", 0));
+  auto one = newSession(hierarchyInfo(4, "media", 1));
+  auto three = newSession(hierarchyInfo(5, "media", 3));
+  EXPECT_TRUE(agent->parentSessionIDStringForSession(*three.session).isNil());
+
+  EXPECT_EQ(agent->parentSessionForChild(*three.session), nullptr);
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "parentSessionForChild: Unable to find session with hierarchy of 2 for hierarchyToken 'media'"));
+}
 
 TEST_F(ZerithdAgentTest, GapNearTheRootKeepsTheIdentifierBuiltSoFar) {
   auto one = newSession(hierarchyInfo(1, "call", 1));  // the root never connected
@@ -120,6 +202,52 @@ TEST_F(ZerithdAgentTest, StandaloneSessionIsNotCorrelated) {
   EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*s.session), nullptr);
 }
 
+TEST_F(ZerithdAgentTest, AncestorWithAggregatorNearestTheRootWins) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  auto mid = newSession(hierarchyInfo(2, "call", 1), /*aggregator=*/true);
+  auto leaf = newSession(hierarchyInfo(3, "call", 2));
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*root0.session), nullptr);  // level 0 never has one
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*leaf.session), root0.session);
+
+  auto other0 = newSession(hierarchyInfo(4, "media", 0));
+  auto other1 = newSession(hierarchyInfo(5, "media", 1), /*aggregator=*/true);
+  auto other2 = newSession(hierarchyInfo(6, "media", 2));
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*other2.session), other1.session);
+}
+
+TEST_F(ZerithdAgentTest, AggregatingAncestorShutsDownItsDescendantsAggregation) {
+  auto root0 = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  // The child's own update already finds the aggregating root and ends its own aggregation.
+  auto child = newSession(hierarchyInfo(2, "call", 1), /*aggregator=*/true);
+  child.session->fetchStatesWithUserInfo(Value(Dictionary{{kZerithUserInfoClientName, Value("mail")}}), nullptr);
+  EXPECT_FALSE(child.session->hasAggregator());
+  ASSERT_EQ(aggregated(*child.connection).size(), 1u);
+  EXPECT_EQ(aggregated(*child.connection)[0],
+            (Dictionary{{"message", Value()}, {"timestamp", Value(0.0)}, {"category", Value(0u)}, {"type", Value(0u)},
+                        {"payload", Value()}}));
+
+  // A later descendant with an aggregator is shut down when the root updates.
+  auto grandchild = newSession(hierarchyInfo(3, "call", 2), /*aggregator=*/true);
+  root0.session->fetchStatesWithUserInfo(Value(Dictionary{{kZerithUserInfoClientName, Value("mail")}}), nullptr);
+  EXPECT_TRUE(logs.has(Level::Debug,
+                       "updateDownstreamSessions: Updating combined session ID and syncing reporting states for "
+                       "session 3"));
+  EXPECT_FALSE(grandchild.session->hasAggregator());
+  EXPECT_EQ(aggregated(*grandchild.connection).size(), 1u);
+  EXPECT_TRUE(root0.session->hasAggregator());
+  EXPECT_TRUE(aggregated(*root0.connection).empty());
+}
+
+TEST_F(ZerithdAgentTest, LastSessionOfATokenLeavesItsEmptyListAndSharedDataInPlace) {
+  auto a = newSession(hierarchyInfo(1, "call", 0));
+  a.session->updateSharedDataForKey(Value("k"), Value("v"));
+  agent->invalidateReportingSession(a.session);
+  ASSERT_TRUE(agent->correlatedSessions("call").has_value());
+  EXPECT_TRUE(agent->correlatedSessions("call")->empty());
+  EXPECT_TRUE(agent->hasSharedDataForToken("call"));
+  EXPECT_TRUE(logs.contains("invalidateReportingSession: ZerithdSession <ZerithdSession: "));
+}
+
 // --- Shared data -----------------------------------------------------------------
 
 TEST_F(ZerithdAgentTest, SharedDataIsSeenAtOnceByEverySessionOfTheHierarchy) {
@@ -146,6 +274,30 @@ TEST_F(ZerithdAgentTest, SharedDataIsSeenAtOnceByEverySessionOfTheHierarchy) {
 
 // --- Health ------------------------------------------------------------------------
 
+TEST_F(ZerithdAgentTest, HealthFiguresCountListedSessionsPlusTheEndingOnePerSender) {
+  storebag = Value(Dictionary{{"httpPost", Value(Dictionary{{"enabled", Value(true)}})}});
+  storebagVersion = Value("17");
+  auto a = newSession(sessionInfo(1, 7));
+  auto a2 = newSession(sessionInfo(4, 7));
+  auto b = newSession(sessionInfo(2, 7));
+  auto c = newSession(sessionInfo(3, 2));
+  ASSERT_FALSE(agent->storebagForSession(*a.session).isNil());
+
+  agent->invalidateReportingSession(b.session);  // b ends
+  Dictionary payload;
+  agent->addAgentHealthInfoForSession(*b.session, payload);  // gathered with no lock held
+  EXPECT_EQ(payload.get("SessionsCount_YJ"), Value(3ull));
+  EXPECT_EQ(payload.get("SessionsCount_Unknown"), Value(1ull));
+  EXPECT_EQ(payload.get("BatchSize_YJ"), Value(0u));
+  EXPECT_EQ(payload.get("BatchSize_Unknown"), Value(0u));
+  EXPECT_EQ(payload.get("StorebagsCount"), Value(1ull));
+  const auto storebagsSize = payload.get("StorebagsSize").unsignedValue();
+  EXPECT_GT(storebagsSize, 0u);
+  EXPECT_EQ(payload.get("CalculatedMemoryUsage"), Value(static_cast<unsigned long long>(storebagsSize)));
+  EXPECT_GT(payload.get("ProcessMemoryUsage").unsignedValue(), 0u);
+  EXPECT_EQ(payload.size(), 8u);
+}
+
 TEST_F(ZerithdAgentTest, ProcessMemoryUsageIsAnonymousResidentBytes) {
   const std::uint32_t before = ZerithdAgent::processMemoryUsage();
   constexpr std::size_t kSize = 64u << 20;
@@ -170,6 +322,24 @@ TEST(SenderCodes, HealthUsesTheTableOnlyForClientTypesFiveToTwentyThree) {
   EXPECT_EQ(healthSenderCode(-1), "Unknown");
   EXPECT_EQ(senderCode(0), "ZP");
   EXPECT_EQ(senderCode(16), "XMORDAL");
+}
+
+// --- Storebags ---------------------------------------------------------------------
+
+TEST_F(ZerithdAgentTest, StorebagIsFetchedForTheSessionsClientTypeAndThenServedFromTheCache) {
+  storebag = Value(Dictionary{{"httpPost", Value(Dictionary{})}});
+  storebagVersion = Value("42");
+  auto a = newSession(sessionInfo(1, 7));
+  auto b = newSession(sessionInfo(2, 11));  // the same storebag name as type 7
+  EXPECT_EQ(agent->storebagForSession(*a.session), storebag);
+  EXPECT_EQ(agent->storebagForSession(*b.session), storebag);
+  EXPECT_EQ(fetchedClientTypes, std::vector<std::int32_t>{7});
+  EXPECT_EQ(agent->storebagVersionForSession(*b.session), Value("42"));
+  // A client type without a storebag has neither (the cache's own test
+  // covers every such type).
+  auto invalid = newSession(sessionInfo(3, 2));
+  EXPECT_TRUE(agent->storebagForSession(*invalid.session).isNil());
+  EXPECT_TRUE(agent->storebagVersionForSession(*invalid.session).isNil());
 }
 
 }  // namespace

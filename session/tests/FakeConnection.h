@@ -1,9 +1,9 @@
 #pragma once
 
 // A client connection without a socket, for the agent's and the session's
-// unit tests: it grants the entitlements it was given, keeps what the agent
-// installs, records every message the daemon sends to the client, and can
-// play the connection's interruption and invalidation.
+// unit tests: it grants the entitlements it was given, records what the
+// agent installs (exported object, handlers, resume) and every message the
+// daemon sends to the client, and can play the connection's invalidation.
 
 #include <functional>
 #include <memory>
@@ -44,7 +44,10 @@ class FakeConnection final : public ipc::Connection {
     std::lock_guard lock(mutex_);
     invalidation_ = std::move(handler);
   }
-  void resume() override {}
+  void resume() override {
+    std::lock_guard lock(mutex_);
+    ++resumed_;
+  }
   // Like a closing socket: the invalidation handler runs once, then the
   // connection lets go of what it held.
   void invalidate() override {
@@ -92,6 +95,22 @@ class FakeConnection final : public ipc::Connection {
   const SerialQueue& queue() const override { return queue_; }
   std::string description() const override { return "<fake connection " + std::to_string(id_) + ">"; }
 
+  std::shared_ptr<ipc::ExportedObject> exported() const {
+    std::lock_guard lock(mutex_);
+    return exported_;
+  }
+  bool hasInvalidationHandler() const {
+    std::lock_guard lock(mutex_);
+    return static_cast<bool>(invalidation_);
+  }
+  bool hasInterruptionHandler() const {
+    std::lock_guard lock(mutex_);
+    return static_cast<bool>(interruption_);
+  }
+  int resumed() const {
+    std::lock_guard lock(mutex_);
+    return resumed_;
+  }
   std::vector<Sent> sent() const {
     std::lock_guard lock(mutex_);
     return sent_;
@@ -106,6 +125,7 @@ class FakeConnection final : public ipc::Connection {
   std::function<void()> interruption_;
   std::function<void()> invalidation_;
   bool invalidated_ = false;
+  int resumed_ = 0;
   int id_ = 0;
   std::vector<Sent> sent_;
 };

@@ -352,7 +352,7 @@ TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSaf
 
 // --- States and identifiers in a hierarchy ---------------------------------------------------
 
-TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifier) {
+TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifierOrphansTheirOwn) {
   useStorebag({{"recA", Value(Dictionary{{"state", Value(2)}, {"threshold", Value(0.25)}})},
                {"recB", Value(Dictionary{{"state", Value(1)}})}});
   auto root = started(hierarchyInfo(1, "call", 0));
@@ -371,11 +371,23 @@ TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTh
   EXPECT_TRUE(logs.has(Level::Debug,
                        "HTTPSPostBackend(syncReportingStates): recA: state and sampling rate updated to 2, 0.25%"));
 
-  // The child carries "root.child"; the root keeps its own identifier (three
-  // levels and orphans: the sessions-together e2e test).
-  EXPECT_EQ(rec(child, "recA")->combinedSessionIDString(),
-            root.session->sessionIDString() + "." + child.session->sessionIDString());
+  auto grandchild = started(hierarchyInfo(3, "call", 2, 8));
+  const std::string combined = root.session->sessionIDString() + "." + child.session->sessionIDString() + "." +
+                               grandchild.session->sessionIDString();
+  for (const auto& [name, backend] : *grandchild.session->backends()) {
+    EXPECT_EQ(backend->combinedSessionIDString(), combined) << name;
+  }
+  EXPECT_TRUE(logs.has(Level::Debug, "updateCombinedSessionID: Updating combined session ID '" + combined +
+                                         "' for session 3 backends"));
+  // The root keeps its own identifier and states.
   EXPECT_EQ(rec(root, "recA")->combinedSessionIDString(), root.session->sessionIDString());
+
+  // A child without its parent keeps its own states and identifier, and says so.
+  auto orphan = started(hierarchyInfo(4, "orphan", 1));
+  EXPECT_EQ(rec(orphan, "recA")->state(), kBackendStateEnabled);
+  EXPECT_TRUE(logs.has(Level::Default,
+                       "syncReportingStates: child session 4 (backend recA) with hierarchy 1 is missing its parent"));
+  EXPECT_EQ(rec(orphan, "recA")->combinedSessionIDString(), orphan.session->sessionIDString());
 }
 
 TEST_F(SessionBackendsTest, UserInfoReachesEveryBackendAndTheDigestKeyOnlyTheDigestBackend) {
@@ -484,7 +496,7 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
   EXPECT_GE(a->flushes(), 1);
 }
 
-TEST_F(SessionBackendsTest, StatusListsLiveSessionsAndKeepsTheTotalsOfEndedOnesAfterTheirBackendsGo) {
+TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTheTotalsOfEndedSessions) {
   useStorebag({{"recA", Value(Dictionary{{"whitelist", Value(Array{Value(0), Value(3)})}})},
                {"recB", Value(Dictionary{{"blacklist", Value(Array{Value(4)})}})}});
   auto other = started(sessionInfo(6));
@@ -499,9 +511,18 @@ TEST_F(SessionBackendsTest, StatusListsLiveSessionsAndKeepsTheTotalsOfEndedOnesA
   ASSERT_TRUE(a->waitForCleanups(1));
   ASSERT_TRUE(b->waitForCleanups(1));
 
-  // What the end message counts: the backend-counts e2e test. Here the status
-  // lists the live session and keeps the ended one's counts once its backends
-  // are gone too.
+  // The start message and category 3 went to recA, 4 and 5 were not on its
+  // list; recB took all but the blacklisted 4. The end message counts what
+  // came before it; a count of 0 is left out.
+  const Value end = a->events().back().message["ClientData"];
+  EXPECT_EQ(end["BackendCounts_recA_sent"], Value(2ull));
+  EXPECT_EQ(end["BackendCounts_recA_droppedFiltered"], Value(2ull));
+  EXPECT_EQ(end["BackendCounts_recB_sent"], Value(3ull));
+  EXPECT_EQ(end["BackendCounts_recB_droppedBlacklisted"], Value(1ull));
+  EXPECT_TRUE(end["BackendCounts_recA_batched"].isNil());
+  EXPECT_TRUE(end["BackendCounts_recB_droppedFiltered"].isNil());
+  EXPECT_EQ(end["SessionsCount_YJ"], Value(2ull));  // the health figures stay as they were
+
   const auto expectStatus = [&](const char* when) {
     SCOPED_TRACE(when);
     const ipc::DaemonStatus status = agent->daemonStatus(nullptr);
@@ -512,11 +533,16 @@ TEST_F(SessionBackendsTest, StatusListsLiveSessionsAndKeepsTheTotalsOfEndedOnesA
     EXPECT_EQ(status.sessions[0].backends[0].name, "recA");
     EXPECT_EQ(status.sessions[0].backends[0].state, kBackendStateEnabled);
     EXPECT_EQ(ipc::countOf(status.sessions[0].backends[0].counts, "sent"), 1u);  // its start message
-    // The start message, category 3 and the end message; 4 and 5 not listed.
     ASSERT_EQ(status.ended.size(), 2u);
-    EXPECT_EQ(ipc::countOf(status.ended[0].counts, "sent"), 3u);
+    EXPECT_EQ(status.ended[0].clientType, 7);
+    EXPECT_EQ(status.ended[0].backend, "recA");
+    EXPECT_EQ(status.ended[0].sessions, 1u);
+    EXPECT_EQ(ipc::countOf(status.ended[0].counts, "sent"), 3u);  // with the end message
     EXPECT_EQ(ipc::countOf(status.ended[0].counts, "droppedFiltered"), 2u);
+    EXPECT_EQ(status.ended[1].backend, "recB");
+    EXPECT_EQ(ipc::countOf(status.ended[1].counts, "sent"), 4u);
     EXPECT_EQ(ipc::countOf(status.ended[1].counts, "droppedBlacklisted"), 1u);
+    EXPECT_EQ(status.ended[1].counts.size(), kBackendCountKinds);
   };
   expectStatus("backends still held");
   a.reset();

@@ -1,7 +1,7 @@
 // The session's side of file uploads: the daemon reads only through the
 // descriptor that came with the call, refuses anything but a readable
-// regular file before a backend is asked. Client text in its log lines: the
-// uploads-under-stall e2e test.
+// regular file before a backend is asked, and keeps client text out of its
+// log lines' structure.
 
 #include <gtest/gtest.h>
 #include <fcntl.h>
@@ -87,6 +87,14 @@ TEST_F(SessionUploadTest, AcceptableFileWithoutAnUploadBackendIsNotUploaded) {
   EXPECT_FALSE(logs.contains("Refusing to upload"));
   EXPECT_TRUE(logs.has(Level::Error, "uploadFileWithURL: File upload failed for " + files.string() + "/a b.log"));
   EXPECT_TRUE(fs::exists(files / "a b.log"));
+}
+
+TEST_F(SessionUploadTest, ClientTextInTheLogIsEscaped) {
+  // A name that would end the line and forge another, and a backslash.
+  const auto answer = upload("/tmp/x\n<ERROR> forged\\line", nullptr);
+  ASSERT_TRUE(answer);
+  EXPECT_TRUE(logs.has(Level::Error, "uploadFileWithURL: File upload failed for /tmp/x\\n<ERROR> forged\\\\line"));
+  EXPECT_FALSE(logs.contains("\n<ERROR> forged"));
 }
 
 }  // namespace

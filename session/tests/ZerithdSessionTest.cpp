@@ -49,6 +49,9 @@ TEST_F(ZerithdSessionTest, EverySessionGetsItsOwnBase64UUIDAndTheDeviceIdentifie
   const std::string device = a.session->deviceID();
   EXPECT_EQ(device.size(), 40u);
   EXPECT_EQ(device.find_first_not_of("0123456789abcdef"), std::string::npos);
+  EXPECT_TRUE(logs.has(Level::Debug, "initWithSessionDelegate: Initialized session with UUID " + id));
+  EXPECT_TRUE(logs.has(Level::Debug, "initWithSessionDelegate: ZerithdSession initWithSessionDelegate:" +
+                                         agent->description()));
 }
 
 // --- Configuration -------------------------------------------------------------------
@@ -144,37 +147,101 @@ TEST_F(ZerithdSessionTest, StorebagConfiguresTheSessionWithNoEnabledBackend) {
 }
 
 TEST_F(ZerithdSessionTest, StartMessageCarriesLocaleAndAutomaticTimeOnCustomerBuilds) {
-  // The "C" locale has no country; the time setting is read (absent it is
-  // taken as on: the storebag-start e2e test).
-  Defaults("com.velmar.timed").setObject("AutomaticTimeZoneEnabled", Value(false));
-  ::setenv("LC_ALL", "C", 1);
-  auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-  s.session->startConfigWithCompletionHandler(nullptr);
-  ::unsetenv("LC_ALL");
-  const auto sent = aggregated(*s.connection);
-  ASSERT_EQ(sent.size(), 1u);
-  EXPECT_EQ(sent[0], (Dictionary{{"message", sessionInfo(5)},
-                                 {"timestamp", sent[0].get("timestamp")},
-                                 {"category", Value(0u)},
-                                 {"type", Value(0u)},
-                                 {"payload", Value(Dictionary{{"AutomaticTimeSet", Value(false)},
-                                                              {"Locale", Value("Unknown")}})}}));
+  struct Row {
+    const char* locale;
+    std::optional<bool> automaticTime;  // the setting; absent: assumed on
+    Dictionary payload;
+  };
+  const Row rows[] = {{"C", std::nullopt, {{"AutomaticTimeSet", Value(true)}, {"Locale", Value("Unknown")}}},
+                      {"de_DE.UTF-8", false, {{"AutomaticTimeSet", Value(false)}, {"Locale", Value("DE")}}}};
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.locale);
+    if (row.automaticTime) {
+      Defaults("com.velmar.timed").setObject("AutomaticTimeZoneEnabled", Value(*row.automaticTime));
+    }
+    ::setenv("LC_ALL", row.locale, 1);
+    auto s = newSession(sessionInfo(5), /*aggregator=*/true);
+    s.session->startConfigWithCompletionHandler(nullptr);
+    ::unsetenv("LC_ALL");
+    const auto sent = aggregated(*s.connection);
+    ASSERT_EQ(sent.size(), 1u);
+    EXPECT_EQ(sent[0].get("message"), sessionInfo(5));
+    EXPECT_EQ(sent[0].get("category"), Value(0u));
+    EXPECT_EQ(sent[0].get("type"), Value(0u));
+    EXPECT_EQ(sent[0].get("payload"), Value(row.payload));
+  }
 }
 
 // --- Client operations without backends ---------------------------------------------
 
-// Unconfigured, the flush fails (the client-session e2e test checks that
-// answer); configured with an empty set it completes at once, without an error.
-TEST_F(ZerithdSessionTest, FlushOfAnEmptyBackendSetCompletesWithoutAnError) {
+TEST_F(ZerithdSessionTest, FlushAndDisplayURLBeforeConfigurationFailWithoutBackends) {
   auto s = newSession(sessionInfo(5));
-  s.session->startConfigWithCompletionHandler(nullptr);
+  std::optional<Value> url;
+  s.session->fetchDisplayURL([&](Value v) { url = v; });
+  EXPECT_EQ(url, Value("URL not available"));
+  EXPECT_TRUE(logs.has(Level::Debug, "fetchDisplayURL: Fetching display URL for session 5"));
   int calls = 0;
+  s.session->flushMessagesWithCompletion([&](Value text, std::optional<Error> error) {
+    ++calls;
+    EXPECT_TRUE(text.isNil());
+    ASSERT_TRUE(error.has_value());
+    EXPECT_EQ(*error, (Error{kZerithErrorDomain, -1, "No backends available to send message"}));
+  });
+  EXPECT_EQ(calls, 1);
+  EXPECT_TRUE(logs.has(Level::Debug, "flushMessagesWithCompletion: Flushing messages for session 5"));
+  EXPECT_TRUE(logs.has(Level::Debug, "internalFlushMessagesWithCompletion: No backends available to send message"));
+
+  // Configured with an empty backend set the flush completes at once, without an error.
+  s.session->startConfigWithCompletionHandler(nullptr);
   s.session->flushMessagesWithCompletion([&](Value text, std::optional<Error> error) {
     ++calls;
     EXPECT_TRUE(text.isNil());
     EXPECT_FALSE(error.has_value());
   });
-  EXPECT_EQ(calls, 1);
+  EXPECT_EQ(calls, 2);
+}
+
+TEST_F(ZerithdSessionTest, MessagesAreCheckedForCategoryFirstThenType) {
+  auto s = newSession(sessionInfo(5));
+  std::vector<Value> replies;
+  auto reply = [&](Value v) { replies.push_back(v); };
+
+  s.session->sendMessageWithDictionary(Value(Dictionary{}), reply);
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: No backends available to send message"));
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Sending message for session 5"));
+
+  s.session->startConfigWithCompletionHandler(nullptr);
+  logs.clear();
+  s.session->sendMessageWithDictionary(Value(Dictionary{}), reply);
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'category'"));
+  EXPECT_FALSE(logs.contains("Missing mandatory parameter 'type'"));
+  s.session->sendMessageWithDictionary(Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}}), reply);
+  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'type'"));
+  s.session->sendMessageWithDictionary(
+      Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}, {kZerithMessageParametersType, Value(4)}}), reply);
+  ASSERT_EQ(replies.size(), 4u);
+  for (const auto& r : replies) {
+    EXPECT_TRUE(r.isNil());
+  }
+}
+
+TEST_F(ZerithdSessionTest, UploadsAreRefusedWithoutAnUploadBackend) {
+  auto s = newSession(sessionInfo(5));
+  std::optional<bool> uploaded;
+  s.session->uploadFileAtPath(Value("file:///var/tmp/report.log"), Value(), [&](bool ok) { uploaded = ok; });
+  EXPECT_EQ(uploaded, false);
+  EXPECT_TRUE(logs.has(Level::Debug, "uploadFileAtPath: Uploading file for session 5"));
+  EXPECT_TRUE(logs.has(Level::Error, "uploadFileWithURL: File upload failed for /var/tmp/report.log"));
+  const std::string retired = messageLog();
+  EXPECT_NE(retired.find(") [uploadFileWithURL] Upload failed for file file:///var/tmp/report.log\n"), std::string::npos)
+      << retired;
+
+  std::optional<std::pair<bool, std::optional<Error>>> logData;
+  s.session->uploadLogData(Value(Array{Value("line")}), [&](bool ok, std::optional<Error> e) { logData = {ok, e}; });
+  ASSERT_TRUE(logData.has_value());
+  EXPECT_FALSE(logData->first);
+  EXPECT_FALSE(logData->second.has_value());
+  EXPECT_TRUE(logs.has(Level::Error, "uploadLogData: Log data array upload failed"));
 }
 
 TEST_F(ZerithdSessionTest, EndMessageSaysWhetherTheSessionFinishedGracefully) {
@@ -228,7 +295,40 @@ TEST_F(ZerithdSessionTest, UserInfoEntriesReplacePayloadEntriesOnTheWayToTheAggr
   EXPECT_TRUE(sent[2].get("payload").isNil());  // a nil payload stays nil
 }
 
+TEST_F(ZerithdSessionTest, EventsOfADescendantGoOnlyToTheAggregatingAncestor) {
+  auto parent = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
+  auto child = newSession(hierarchyInfo(2, "call", 1));
+  child.session->startConfigWithCompletionHandler(nullptr);
+  child.session->sendMessageWithDictionary(
+      Value(Dictionary{{kZerithMessageParametersCategory, Value(9)}, {kZerithMessageParametersType, Value(1)}}),
+      nullptr);
+  const auto atParent = aggregated(*parent.connection);
+  ASSERT_EQ(atParent.size(), 2u);  // the child's start message and its event
+  EXPECT_EQ(atParent[1].get("message"), hierarchyInfo(2, "call", 1));
+  EXPECT_EQ(atParent[1].get("category"), Value(9u));
+  EXPECT_TRUE(aggregated(*child.connection).empty());
+  // Ending aggregation where there is none sends nothing.
+  child.session->shutdownSessionAggregation();
+  EXPECT_TRUE(aggregated(*child.connection).empty());
+}
+
 // --- One-shot messages -------------------------------------------------------------------
+
+TEST_F(ZerithdSessionTest, OneShotWithoutIdentifiersIsRefusedBeforeAnyStorebagLookup) {
+  auto s = newSession();
+  std::vector<Value> replies;
+  s.session->sendMessageWithSessionInfo(Value(Dictionary{{kZerithSessionInfoClientType, Value(7)}}), Value(), 1, 2,
+                                        Value(), [&](Value v) { replies.push_back(v); });
+  s.session->sendMessageWithSessionInfo(Value(Dictionary{{kZerithSessionInfoSessionID, Value(7)}}), Value(), 1, 2,
+                                        Value(), [&](Value v) { replies.push_back(v); });
+  ASSERT_EQ(replies.size(), 2u);
+  EXPECT_EQ(replies[0], Value("Could not retrieve identifiers from sessionInfo"));
+  EXPECT_EQ(replies[1], Value("Could not retrieve identifiers from sessionInfo"));
+  EXPECT_EQ(countExact(Level::Error, "sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo"),
+            2u);
+  EXPECT_TRUE(fetchedClientTypes.empty());
+  EXPECT_EQ(s.session->sessionID(), 0u);
+}
 
 TEST_F(ZerithdSessionTest, OneShotConfiguresTheSessionAndAnswersByStorebag) {
   auto s = newSession();
