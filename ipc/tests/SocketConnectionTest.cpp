@@ -274,6 +274,28 @@ TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
   }
 }
 
+TEST(SocketConnectionCalls, PendingAndLaterCallsFailWhenThePeerGoesAway) {
+  RawPeer peer;
+  auto promise = std::make_shared<std::promise<CallResult>>();
+  auto future = promise->get_future();
+  peer.connection->call("never-answered", Dictionary{}, [promise](std::optional<Dictionary> a, std::optional<Error> e) {
+    promise->set_value(CallResult{true, std::move(a), std::move(e)});
+  });
+  ASSERT_TRUE(peer.readMessage());  // the call went out
+  peer.raw.close();                 // the peer disconnects mid-call
+  ASSERT_EQ(future.wait_for(kWait), std::future_status::ready);
+  const auto result = future.get();
+  EXPECT_FALSE(result.args);
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(*result.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
+  ASSERT_TRUE(peer.invalidated.waitFor(1));
+  // A call made afterwards fails at once instead of waiting for ever.
+  const auto late = callAndWait(*peer.connection, "late", Dictionary{});
+  ASSERT_TRUE(late.arrived);
+  ASSERT_TRUE(late.error);
+  EXPECT_EQ(late.error->description, "The connection was invalidated");
+}
+
 TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
   ConnectedPair pair;
   auto& object = pair.object;
