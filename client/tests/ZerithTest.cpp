@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <future>
-#include <regex>
 
 #include "client/tests/TestDaemon.h"
 #include "ipc/Frame.h"
@@ -17,7 +16,17 @@ using ipc::test::Counter;
 
 // 8-4-4-4-12 upper-case hexadecimal.
 bool isUpperCaseUuid(const std::string& s) {
-  return std::regex_match(s, std::regex("[0-9A-F]{8}(-[0-9A-F]{4}){3}-[0-9A-F]{12}"));
+  if (s.size() != 36) {
+    return false;
+  }
+  for (std::size_t i = 0; i < s.size(); ++i) {
+    const bool dash = i == 8 || i == 13 || i == 18 || i == 23;
+    const char c = s[i];
+    if (dash ? c != '-' : !((c >= '0' && c <= '9') || (c >= 'A' && c <= 'F'))) {
+      return false;
+    }
+  }
+  return true;
 }
 
 struct ZerithFixture : DaemonFixture {
@@ -28,6 +37,35 @@ struct ZerithFixture : DaemonFixture {
     return z;
   }
 };
+
+TEST_F(ZerithFixture, BlockingCallsReturnTheCompletionsArguments) {
+  auto z = open();
+  const Value info(Dictionary{{kZerithSessionInfoSessionID, 5}, {kZerithSessionInfoClientType, 7}});
+  const auto set = z->setSessionInfo(info, Value(), Value(), false, 5s);
+  ASSERT_TRUE(set) << set.error->description;
+  // The blocking form returns only once the daemon has taken the call.
+  auto client = daemon->waitForClient();
+  ASSERT_EQ(client.session->log.size(), 1u);
+
+  const auto started = z->startConfig(5s);
+  ASSERT_TRUE(started);
+  EXPECT_EQ(started["backends"], client.session->backends);
+  EXPECT_EQ(z->fetchDisplayURL(5s)["url"], Value("https://display.example/session"));
+  const auto sent = z->sendMessage(Value(Dictionary{{"category", 1}, {"type", 2}}), 5s);
+  EXPECT_EQ(sent["result"], Value("sent"));
+  const auto upload = z->uploadLogData(Value(Array{}), 5s);
+  EXPECT_EQ(upload["success"], Value(false));
+  EXPECT_EQ(upload["error"], (Error{kZerithErrorDomain, -1, "no upload backend"}.toValue()));
+  EXPECT_TRUE(z->finishSession(5s));
+  EXPECT_EQ(client.session->log.calls().back().operation, "finishSession");
+}
+
+TEST_F(ZerithFixture, AsynchronousCompletionsRunOnceWithTheAnswer) {
+  auto z = open();
+  ipc::test::Answer<std::pair<Value, std::optional<Error>>> flushed;
+  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set({v, e}); });
+  EXPECT_EQ(flushed.get(), std::make_pair(Value("flushed"), std::optional<Error>()));
+}
 
 TEST_F(ZerithFixture, ABlockingCallTimesOutWithAClearError) {
   daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
@@ -50,6 +88,23 @@ TEST_F(ZerithFixture, ABlockingCallInsideACallbackFailsInsteadOfDeadlocking) {
   const auto reply = inner.get();
   ASSERT_TRUE(reply.error);
   EXPECT_EQ(reply.error->description, "startConfigWithCompletionHandler: cannot wait inside a callback of its own session");
+}
+
+TEST_F(ZerithFixture, TheDaemonsMessagesReachTheMessageHandler) {
+  auto z = open();
+  ipc::test::Answer<std::tuple<Value, double, std::uint16_t, std::uint16_t, Value>> got;
+  z->setMessageHandler([&](const Value& m, double t, std::uint16_t c, std::uint16_t ty, const Value& p) {
+    got.set({m, t, c, ty, p});
+  });
+  ASSERT_TRUE(z->finishSession(5s));  // the daemon knows the client by now
+  daemon->waitForClient().toClient->sendMessageToClient(Value(Dictionary{{"a", 1}}), 99.25, 12, 34,
+                                                        Value(Dictionary{{"b", "c"}}));
+  const auto [m, t, c, ty, p] = got.get();
+  EXPECT_EQ(m, Value(Dictionary{{"a", 1}}));
+  EXPECT_EQ(t, 99.25);
+  EXPECT_EQ(c, 12);
+  EXPECT_EQ(ty, 34);
+  EXPECT_EQ(p, Value(Dictionary{{"b", "c"}}));
 }
 
 // Each pending completion fails in its own way: nil, nil and the error,
@@ -100,6 +155,33 @@ TEST_F(ZerithFixture, ClientGoingAwayMidCallEndsItsDaemonSideAndNoHandlerRunsAft
     late();  // answering a client that left
   }
   EXPECT_EQ(invalidated.count(), 0);
+}
+
+// The listener closes a connection its delegate refuses; the client's
+// pending call fails and its handler runs.
+TEST_F(ZerithFixture, ARefusedClientLearnsOnItsFirstCall) {
+  grantEntitlement(root, "<false/>");
+  auto z = open();
+  Counter invalidated;
+  z->setInvalidationHandler([&] { invalidated.hit(); });
+  const auto reply = z->startConfig(5s);
+  ASSERT_TRUE(reply.error);
+  EXPECT_EQ(reply.error->description, "The connection was invalidated");
+  EXPECT_TRUE(invalidated.waitFor(1));
+  EXPECT_TRUE(daemon->clients().empty());
+}
+
+TEST(ZerithConnect, NothingListeningGivesNullAndTheReason) {
+  TempRoot root;
+  Error error;
+  EXPECT_EQ(Zerith::connect({}, &error), nullptr);
+  EXPECT_EQ(error.domain, kZerithErrorDomain);
+  EXPECT_EQ(error.description,
+            "Cannot connect to " + (root / "/run/zerithd/com.velmar.zerithd").string() + ": No such file or directory");
+}
+
+TEST(ZerithVocabulary, TheIpcLayersErrorDomainIsTheFrameworks) {
+  EXPECT_STREQ(ipc::kErrorDomain, kZerithErrorDomain);
 }
 
 TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaults) {

@@ -204,5 +204,19 @@ TEST_P(ClientBackpressureRelease, QueueBlocksNeverWaitAndTheEndOfTheConnectionRe
 INSTANTIATE_TEST_SUITE_P(ByClientOrDaemon, ClientBackpressureRelease, ::testing::Bool(),
                          [](const auto& info) { return info.param ? "ClientInvalidates" : "DaemonGoesAway"; });
 
+TEST_F(ClientBackpressure, TheDaemonsEndNeverWaits) {
+  // A connection the daemon adopted goes on queueing past the mark (and is
+  // closed at its limit) instead of holding the daemon's thread.
+  RawPeer peer;
+  constexpr int kEvents = 400;  // 1.6 MB: past the 1 MiB limit of this test
+  auto done = std::async(std::launch::async, [&] {
+    for (int n = 0; n < kEvents; ++n) {
+      peer.connection->send("event", Dictionary{{"n", n}, {"pad", Value(eventArgsPad())}});
+    }
+  });
+  ASSERT_EQ(done.wait_for(kWait), std::future_status::ready) << "the daemon's end waited for its peer";
+  EXPECT_TRUE(peer.invalidated.waitFor(1)) << "the outbox limit no longer closes a peer that never reads";
+}
+
 }  // namespace
 }  // namespace zerith::ipc::test

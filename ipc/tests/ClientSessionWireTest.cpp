@@ -29,6 +29,75 @@ struct SessionLink {
   }
 };
 
+TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) {
+  SessionLink link;
+  const Value sessionInfo(Dictionary{{"sessionID", 3}, {"clientType", 7}});
+  const Value userInfo(Dictionary{{"clientName", "mail"}});
+  const Value frameworks(Array{Value("Foo")});
+  const Value message(Dictionary{{"category", 1}, {"type", 2}, {"payload", Dictionary{{"k", "v"}}}});
+  const Value payload(Dictionary{{"p", 1.5}});
+
+  link.proxy.setSessionInfo(sessionInfo, userInfo, frameworks, true);
+
+  Answer<Value> started, states, url, sent, oneShot;
+  Answer<std::pair<Value, std::optional<Error>>> flushed;
+  Answer<bool> uploaded;
+  Answer<std::pair<bool, std::optional<Error>>> logUploaded;
+  link.proxy.startConfigWithCompletionHandler([&](Value v) { started.set(v); });
+  link.proxy.fetchStatesWithUserInfo(userInfo, [&](Value v) { states.set(v); });
+  link.proxy.fetchDisplayURL([&](Value v) { url.set(v); });
+  link.proxy.sendMessageWithDictionary(message, [&](Value v) { sent.set(v); });
+  link.proxy.flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set({v, e}); });
+  link.proxy.finishSessionGracefully();
+  link.proxy.uploadFileAtPath(Value("file:///dev/null"), Value("token"), [&](bool ok) { uploaded.set(ok); });
+  link.proxy.uploadLogData(Value(Array{Value("line")}), [&](bool ok, std::optional<Error> e) { logUploaded.set({ok, e}); });
+  link.proxy.sendMessageWithSessionInfo(sessionInfo, userInfo, 65535, 9, payload, [&](Value v) { oneShot.set(v); });
+  link.proxy.updateSharedDataWithDictionary(Value(Dictionary{{"shared", 1}}));
+  link.proxy.updateSharedDataForKey(Value("key"), Value(Array{Value(1)}));
+  link.proxy.setDigestKey(Value(Data{1, 2, 3}), -7);
+
+  EXPECT_EQ(started.get(), link.session->backends);
+  EXPECT_EQ(states.get(), link.session->backends);
+  EXPECT_EQ(url.get(), Value("https://display.example/session"));
+  EXPECT_EQ(sent.get(), Value("sent"));
+  EXPECT_EQ(flushed.get(), std::make_pair(Value("flushed"), std::optional<Error>()));
+  EXPECT_TRUE(uploaded.get());
+  EXPECT_EQ(logUploaded.get(),
+            std::make_pair(false, std::optional<Error>(Error{"com.velmar.zerith.ErrorDomain", -1, "no upload backend"})));
+  EXPECT_EQ(oneShot.get(), Value("one-shot"));
+
+  ASSERT_TRUE(link.session->log.waitFor(13));
+  const auto calls = link.session->log.calls();
+  const std::vector<std::pair<std::string, Dictionary>> expected = {
+      {"setSessionInfo", {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"frameworksToCheck", frameworks},
+                          {"hasAggregationBlock", true}}},
+      {"startConfig", {}},
+      {"fetchStates", {{"userInfo", userInfo}}},
+      {"fetchDisplayURL", {}},
+      {"sendMessage", {{"message", message}}},
+      {"flushMessages", {}},
+      {"finishSession", {}},
+      {"uploadFile", {{"fileURL", "file:///dev/null"}, {"descriptor", true}}},
+      {"uploadLogData", {{"logData", Array{Value("line")}}}},
+      {"sendMessageWithSessionInfo", {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"category", 65535u},
+                                      {"type", 9u}, {"payload", payload}}},
+      {"updateSharedData", {{"dictionary", Dictionary{{"shared", 1}}}}},
+      {"updateSharedDataForKey", {{"key", "key"}, {"value", Array{Value(1)}}}},
+      {"setDigestKey", {{"digestKey", Data{1, 2, 3}}, {"algorithm", -7}}},
+  };
+  ASSERT_EQ(calls.size(), expected.size());
+  for (std::size_t i = 0; i < expected.size(); ++i) {
+    EXPECT_EQ(calls[i].operation, expected[i].first);
+    EXPECT_EQ(Value(calls[i].args), Value(expected[i].second)) << expected[i].first << ": " << Value(calls[i].args).description();
+  }
+
+  link.toClient.sendMessageToClient(Value(Dictionary{{"m", 1}}), 1234.5, 3, 4, Value(Dictionary{{"x", "y"}}));
+  ASSERT_TRUE(link.client->log.waitFor(1));
+  EXPECT_EQ(Value(link.client->log.calls()[0].args),
+            Value(Dictionary{{"message", Dictionary{{"m", 1}}}, {"timestamp", 1234.5}, {"category", 3u}, {"type", 4u},
+                             {"payload", Dictionary{{"x", "y"}}}}));
+}
+
 TEST(ClientSessionWire, NilArgumentsArriveAsNilAndBooleanDefaultsToFalse) {
   SessionLink link;
   link.proxy.setSessionInfo(Value(), Value(), Value(), false);
@@ -39,6 +108,20 @@ TEST(ClientSessionWire, NilArgumentsArriveAsNilAndBooleanDefaultsToFalse) {
                                                    {"frameworksToCheck", Value()}, {"hasAggregationBlock", false}}));
   // No completion asked for: the session gets none and nothing is answered.
   EXPECT_FALSE(calls[1].hasCompletion);
+}
+
+TEST(ClientSessionWire, ACompletionCalledLaterFromAnotherThreadStillReachesTheClient) {
+  SessionLink link;
+  link.session->answer = false;
+  Answer<Value> url;
+  link.proxy.fetchDisplayURL([&](Value v) { url.set(v); });
+  ASSERT_TRUE(link.session->log.waitFor(1));
+  std::thread([&] {
+    for (auto& late : link.session->takeHeld(1)) {
+      late();
+    }
+  }).join();
+  EXPECT_EQ(url.get(), Value("https://display.example/session"));
 }
 
 TEST(ClientSessionWireRefusal, UnknownOperationIsLoggedAnsweredWithAnErrorAndTheConnectionGoesOn) {

@@ -7,6 +7,7 @@
 #include <string>
 
 #include "ipc/DaemonStatus.h"
+#include "ipc/Frame.h"
 
 namespace zerith::ipc {
 namespace {
@@ -42,15 +43,25 @@ Value sessionWith(const char* key, Value value) {
 // `sample()` whose first session has the one backend `backend`.
 Value backendWith(Dictionary backend) { return sessionWith("backends", Value(Array{Value(std::move(backend))})); }
 
-TEST(DaemonStatusTest, WhatTheDaemonWritesReadsBackUnchanged) {
-  // Counts this side does not know are kept; the largest count the wire
-  // carries survives.
+TEST(DaemonStatusTest, WhatTheDaemonWritesReadsBackThroughAFrameUnchanged) {
   const Value written = sample().toValue();
+  const Data frame = encodeReply(3, Dictionary{{kStatusArgument, written}});
+  const auto message = decodeMessage(plist::Bytes(frame.data() + kFrameHeaderBytes, frame.size() - kFrameHeaderBytes));
+  ASSERT_TRUE(message);
   std::string why;
-  const auto read = DaemonStatus::fromValue(written, &why);
+  const auto read = DaemonStatus::fromValue(message->replyArgs.get(kStatusArgument), &why);
   ASSERT_TRUE(read) << why;
   EXPECT_EQ(read->toValue(), written);
+  ASSERT_EQ(read->sessions.size(), 2u);
+  EXPECT_EQ(read->sessions[0].backends[0].name, "httpsPost");
+  EXPECT_EQ(countOf(read->sessions[0].backends[0].counts, "droppedFiltered"), 1u);
   EXPECT_EQ(countOf(read->sessions[0].backends[0].counts, "batched"), 0u);  // absent reads as 0
+  EXPECT_EQ(read->sessions[1].sessionID, UINT32_MAX);
+  EXPECT_EQ(read->sessions[1].clientType, -1);
+  // Counts this side does not know are kept; the largest count the wire
+  // carries survives.
+  EXPECT_EQ(countOf(read->ended[0].counts, "aCountOfLaterDaemons"), 2u);
+  EXPECT_EQ(countOf(read->ended[0].counts, "sent"), static_cast<std::uint64_t>(INT64_MAX));
 
   // The daemon never writes more than the wire carries.
   DaemonStatus huge;

@@ -79,5 +79,24 @@ TEST(DescriptorPassing, FrameClaimingMoreThanAFrameMayCarryEndsTheConnection) {
   EXPECT_EQ(peer.object->received.count(), 0);
 }
 
+TEST(DescriptorPassing, ConnectionCallCarriesItsDescriptors) {
+  ConnectedPair pair;
+  auto& object = pair.object;
+  pair.serve();
+  Pipe pipe;
+  std::vector<file::UniqueFd> fds;
+  fds.emplace_back(::dup(pipe.write.get()));
+  std::promise<void> answered;
+  pair.a->call("upload", Dictionary(), std::move(fds),
+               [&](std::optional<Dictionary>, std::optional<Error>) { answered.set_value(); });
+  ASSERT_EQ(answered.get_future().wait_for(kWait), std::future_status::ready);
+  const auto calls = object->calls();
+  ASSERT_EQ(calls.size(), 1u);
+  ASSERT_EQ(calls[0].descriptors.size(), 1u);
+  EXPECT_EQ(::write(calls[0].descriptors[0]->get(), "x", 1), 1);
+  char byte = 0;
+  EXPECT_EQ(::read(pipe.read.get(), &byte, 1), 1);
+}
+
 }  // namespace
 }  // namespace zerith::ipc::test

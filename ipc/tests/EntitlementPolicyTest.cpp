@@ -52,6 +52,15 @@ TEST_F(EntitlementPolicyTest, PrimaryOrSupplementaryGroupIsGranted) {
   EXPECT_TRUE(policy.entitlementsFor(peer(kUser, kGroup, {7, 8})).empty());
 }
 
+TEST_F(EntitlementPolicyTest, ValuesArePassedAsWrittenSoFalseAndNonBooleansReachTheDecision) {
+  write("a.plist", xmlPolicy("<integer>41001</integer>", "", "<key>com.velmar.private.zerithd</key><false/>"));
+  write("b.plist", xmlPolicy("<integer>41002</integer>", "", "<key>com.velmar.private.zerithd</key><string>true</string>"));
+  write("c.plist", xmlPolicy("<integer>41003</integer>", "", "<key>com.velmar.private.zerithd</key><integer>1</integer>"));
+  EXPECT_EQ(policy.entitlementsFor(peer(41001, 1)).get(kZerithdEntitlement), Value(false));
+  EXPECT_EQ(policy.entitlementsFor(peer(41002, 1)).get(kZerithdEntitlement), Value("true"));
+  EXPECT_EQ(policy.entitlementsFor(peer(41003, 1)).get(kZerithdEntitlement), Value(1));
+}
+
 TEST_F(EntitlementPolicyTest, UnionOfFilesWithLaterFilesReplacingEarlierValues) {
   write("10-base.plist", xmlPolicy("<integer>41001</integer>", "", kAdmit + "<key>level</key><integer>1</integer>"));
   write("20-group.plist", xmlPolicy("", "<integer>42001</integer>", "<key>level</key><integer>2</integer><key>extra</key><true/>"));
@@ -102,6 +111,13 @@ TEST_F(EntitlementPolicyTest, MissingFolderGrantsNothingAndAnUnreadableOneIsLogg
   root.write("/etc/zerithd/entitlements.d", "not a folder");
   EXPECT_TRUE(policy.entitlementsFor(peer(0, 0)).empty());
   EXPECT_TRUE(capture.contains("EntitlementPolicy: cannot read the policy folder"));
+}
+
+TEST_F(EntitlementPolicyTest, EditsApplyToTheNextCheck) {
+  write("a.plist", xmlPolicy("<integer>41001</integer>", "", kAdmit));
+  EXPECT_FALSE(policy.entitlementsFor(peer(41001, 1)).empty());
+  write("a.plist", xmlPolicy("<integer>41002</integer>", "", kAdmit));
+  EXPECT_TRUE(policy.entitlementsFor(peer(41001, 1)).empty());
 }
 
 }  // namespace

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <climits>
+#include <random>
 #include <vector>
 
 namespace zerith::ipc {
@@ -33,6 +34,30 @@ TEST(FrameCodec, AFrameIsABigEndianLengthAndABinaryPropertyList) {
   EXPECT_EQ(*decoded, Value(Dictionary{{"op", "fetchDisplayURL:"}, {"call", 3}, {"args", Dictionary{}}}));
 }
 
+TEST(FrameCodec, CallsAndRepliesSurviveTheRoundTrip) {
+  FrameDecoder decoder;
+  const Dictionary args{{"payload", Dictionary{{"d", Data{0, 255}}, {"r", -2.5}, {"big", 1LL << 62}}}};
+  for (const Data& f : {encodeCall("op:", std::nullopt, args), encodeCall("op:", 1ull << 40, args), encodeReply(9, args),
+                        encodeErrorReply(10, Error{"dom", -3, "why"})}) {
+    decoder.append(f.data(), f.size());
+  }
+  const auto bodies = drain(decoder);
+  ASSERT_EQ(bodies.size(), 4u);
+  auto m0 = decodeMessage(plist::bytesOf(bodies[0]));
+  auto m1 = decodeMessage(plist::bytesOf(bodies[1]));
+  auto m2 = decodeMessage(plist::bytesOf(bodies[2]));
+  auto m3 = decodeMessage(plist::bytesOf(bodies[3]));
+  ASSERT_TRUE(m0 && m1 && m2 && m3);
+  EXPECT_FALSE(m0->call.call);
+  EXPECT_EQ(m0->call.args, args);
+  EXPECT_EQ(m1->call.call, 1ull << 40);
+  EXPECT_EQ(m2->kind, IncomingMessage::Kind::Reply);
+  EXPECT_EQ(m2->replyTo, 9u);
+  EXPECT_EQ(m2->replyArgs, args);
+  EXPECT_FALSE(m2->replyError);
+  EXPECT_EQ(m3->replyError, (Error{"dom", -3, "why"}));
+}
+
 TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
   // Every number must read back as itself, whatever width it is written in.
   const std::uint64_t wide = 0x1234567890abcdefull;
@@ -60,6 +85,11 @@ TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
   const Dictionary nils{{"result", Value()}, {"error", Value()}};
   EXPECT_EQ(encodeReply(wide, nils),
             encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(wide))}, {"args", Value(nils)}})));
+  // Replies with arguments are still written whole.
+  const Data frame = encodeReply(7, Dictionary{{"result", "r"}});
+  const auto withArgs = decodeMessage(plist::Bytes(frame.data() + 4, frame.size() - 4));
+  ASSERT_TRUE(withArgs);
+  EXPECT_EQ(withArgs->replyArgs, (Dictionary{{"result", "r"}}));
 }
 
 TEST(FrameCodec, DatesBeyondThirtyTwoBitSecondsAreClampedNotOverflowed) {
@@ -69,6 +99,32 @@ TEST(FrameCodec, DatesBeyondThirtyTwoBitSecondsAreClampedNotOverflowed) {
   ASSERT_TRUE(message);
   EXPECT_EQ(message->replyArgs.get("late").date()->secondsSince1970, 2147483647.0 + 978307200.0);
   EXPECT_EQ(message->replyArgs.get("early").date()->secondsSince1970, -2147483648.0 + 978307200.0);
+}
+
+TEST(FrameDecoderTest, FramesCutAtEveryPossiblePlaceComeOutWholeAndInOrder) {
+  // Many frames of varied sizes, appended in random cuts (including cuts
+  // inside the length header), so the buffer compacts while frames are
+  // half-read.
+  std::mt19937 random(7);
+  Data stream;
+  std::vector<Data> expected;
+  for (int i = 0; i < 300; ++i) {
+    const Data f = encodeCall("n", static_cast<std::uint64_t>(i), Dictionary{{"pad", Value(Data(random() % 3000, 1))}});
+    expected.emplace_back(f.begin() + 4, f.end());
+    stream.insert(stream.end(), f.begin(), f.end());
+  }
+  FrameDecoder decoder;
+  std::vector<Data> got;
+  for (std::size_t off = 0; off < stream.size();) {
+    const std::size_t n = std::min<std::size_t>(1 + random() % 5000, stream.size() - off);
+    decoder.append(stream.data() + off, n);
+    off += n;
+    for (auto& b : drain(decoder)) {
+      got.push_back(std::move(b));
+    }
+  }
+  EXPECT_EQ(got, expected);
+  EXPECT_EQ(decoder.buffered(), 0u);
 }
 
 TEST(FrameDecoderTest, ExactlyTheLimitPassesOneMoreIsRefusedFromTheHeaderAloneAndStaysRefused) {

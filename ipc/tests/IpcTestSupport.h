@@ -8,7 +8,6 @@
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <unistd.h>
 
 #include <chrono>
 #include <condition_variable>
@@ -21,7 +20,6 @@
 #include "ipc/Frame.h"
 #include "ipc/SocketConnection.h"
 #include "tests/support/RawFrameSocket.h"
-#include "tests/support/TempRoot.h"
 
 namespace zerith::ipc::test {
 
@@ -225,15 +223,3 @@ inline Data concat(std::initializer_list<Data> parts) {
 }
 
 }  // namespace zerith::ipc::test
-
-namespace zerith::test {
-
-// A policy in `root` that gives this user "com.velmar.private.zerithd" = `value`.
-inline void grantEntitlement(const TempRoot& root, const std::string& value = "<true/>") {
-  root.write("/etc/zerithd/entitlements.d/test.plist",
-             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict><key>users</key><array><integer>" +
-                 std::to_string(::getuid()) + "</integer></array><key>entitlements</key><dict>"
-                 "<key>com.velmar.private.zerithd</key>" + value + "</dict></dict></plist>\n");
-}
-
-}  // namespace zerith::test

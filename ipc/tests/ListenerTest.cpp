@@ -49,6 +49,11 @@ class TestDelegate : public ListenerDelegate {
   std::vector<std::shared_ptr<Connection>> seen_;
 };
 
+void writePolicy(const zerith::test::TempRoot& root, const std::string& name, const std::string& body) {
+  root.write("/etc/zerithd/entitlements.d/" + name,
+             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\">\n" + body + "\n</plist>\n");
+}
+
 struct ListenerFixture : ::testing::Test {
   zerith::test::TempRoot root;
   TestDelegate delegate;
@@ -64,7 +69,10 @@ struct ListenerFixture : ::testing::Test {
 };
 
 TEST_F(ListenerFixture, AcceptedClientIsServedWithTheEntitlementsThePolicyGrantsIt) {
-  zerith::test::grantEntitlement(root);
+  writePolicy(root, "clients.plist",
+              "<dict><key>users</key><array><integer>" + std::to_string(::getuid()) +
+                  "</integer></array><key>entitlements</key><dict><key>com.velmar.private.zerithd</key><true/>"
+                  "</dict></dict>");
   start();
   // The socket is open to everyone; the policy decides.
   struct stat st {};
@@ -91,7 +99,6 @@ TEST_F(ListenerFixture, StaleSocketFileIsReplaced) {
     auto first = Listener::create(paths::socketPath(), nullptr);
     ASSERT_TRUE(first);
   }
-  EXPECT_FALSE(std::filesystem::exists(paths::socketPath())) << "a stopped listener left its socket behind";
   // A listener that died without cleaning up leaves a socket nobody serves.
   boundSocket(paths::socketPath().string(), 0);
   start();
@@ -117,6 +124,44 @@ TEST_F(ListenerFixture, ALiveListenerIsNotStolenARegularFileIsNotDeletedAndAnOve
   std::string text;
   std::getline(in, text);
   EXPECT_EQ(text, "keep me");
+}
+
+TEST_F(ListenerFixture, StopEndsAcceptingButExistingConnectionsGoOn) {
+  start();
+  auto client = SocketConnection::connect(paths::socketPath());
+  ASSERT_TRUE(client);
+  client->resume();
+  ASSERT_TRUE(callAndWait(*client, "before", Dictionary{}).args);
+  listener->stop();
+  EXPECT_FALSE(std::filesystem::exists(paths::socketPath()));
+  Error error;
+  EXPECT_EQ(SocketConnection::connect(paths::socketPath(), &error), nullptr);
+  const auto after = callAndWait(*client, "after", Dictionary{});
+  ASSERT_TRUE(after.args) << "an existing connection stopped with the listener";
+  client->invalidate();
+}
+
+TEST_F(ListenerFixture, ManyClientsAtOnceAreAllServed) {
+  start();
+  constexpr int kClients = 24;
+  std::vector<std::shared_ptr<SocketConnection>> clients;
+  for (int i = 0; i < kClients; ++i) {
+    clients.push_back(SocketConnection::connect(paths::socketPath()));
+    ASSERT_TRUE(clients.back());
+    clients.back()->resume();
+  }
+  Counter answered;
+  for (int i = 0; i < kClients; ++i) {
+    clients[static_cast<std::size_t>(i)]->call("n", Dictionary{{"i", i}}, [&, i](std::optional<Dictionary> a, std::optional<Error>) {
+      if (a && a->get("i").intValue() == i) {
+        answered.hit();
+      }
+    });
+  }
+  EXPECT_TRUE(answered.waitFor(kClients));
+  for (auto& c : clients) {
+    c->invalidate();
+  }
 }
 
 // Socket activation: the parent binds a listening socket and starts this
