@@ -1,7 +1,6 @@
-// The spool's file format, its folder of files (limits, a full disk by
-// RLIMIT_FSIZE in a child) and what its retries drop. Round trips, bad files
-// moved aside, reopening after a kill and retries until the collector
-// recovers: the HTTPS spool e2e tests, through the real daemon.
+// The spool's file format, its folder of files (limits, bad files, a full
+// disk by RLIMIT_FSIZE in a child) and its retries against a real HTTPS
+// server that fails and then recovers.
 
 #include <gtest/gtest.h>
 
@@ -12,6 +11,7 @@
 #include <unistd.h>
 
 #include <condition_variable>
+#include <fstream>
 #include <mutex>
 #include <set>
 #include <thread>
@@ -43,6 +43,16 @@ SpoolBatch batchOf(std::uint32_t records, std::size_t bodyBytes, std::int64_t cr
   return batch;
 }
 
+std::string slurp(const fs::path& path) {
+  std::ifstream in(path, std::ios::binary);
+  return std::string((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+}
+
+void spit(const fs::path& path, std::string_view bytes) {
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  out.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
+}
+
 mode_t modeOf(const fs::path& path) {
   struct stat st {};
   ::stat(path.c_str(), &st);
@@ -62,6 +72,18 @@ std::set<std::string> namesIn(const fs::path& folder) {
 
 // ---------------------------------------------------------------------------
 // The file format
+
+TEST(SpoolFileTest, RoundTripKeepsEveryField) {
+  const SpoolBatch batch = batchOf(7, 300);
+  std::string why;
+  const auto back = decodeSpoolFile(encodeSpoolFile(batch), &why);
+  ASSERT_TRUE(back) << why;
+  EXPECT_EQ(back->createdMillis, batch.createdMillis);
+  EXPECT_EQ(back->recordCount, 7u);
+  EXPECT_EQ(back->url, batch.url);
+  EXPECT_EQ(back->headers, batch.headers);
+  EXPECT_EQ(back->body, batch.body);
+}
 
 TEST(SpoolFileTest, EveryTruncationAndEveryFlippedByteIsRefused) {
   const Data bytes = encodeSpoolFile(batchOf(2, 40));
@@ -172,6 +194,64 @@ TEST_F(SpoolStoreTest, FolderAndFilesKeepOtherUsersOut) {
   ASSERT_TRUE(outcome.written);
   EXPECT_EQ(modeOf(folder() / outcome.name), 0600u);
   EXPECT_EQ(namesIn(folder()), std::set<std::string>{outcome.name});
+}
+
+TEST_F(SpoolStoreTest, EntriesSurviveReopeningOldestFirst) {
+  std::vector<std::string> names;
+  {
+    SpoolStore s = store();
+    for (std::uint32_t i = 1; i <= 4; ++i) {
+      now += 1000;
+      const auto outcome = s.write(batchOf(i, 50, now));
+      ASSERT_TRUE(outcome.written);
+      names.push_back(outcome.name);
+    }
+  }
+  SpoolStore again = store();
+  const auto entries = again.entries();
+  ASSERT_EQ(entries.size(), 4u);
+  for (std::size_t i = 0; i < entries.size(); ++i) {
+    EXPECT_EQ(entries[i].name, names[i]);
+    EXPECT_EQ(entries[i].records, i + 1);
+  }
+  EXPECT_EQ(again.totalRecords(), 10u);
+  const auto batch = again.read(names[2]);
+  ASSERT_TRUE(batch);
+  EXPECT_EQ(batch->recordCount, 3u);
+  again.remove(names[2]);
+  EXPECT_EQ(again.size(), 3u);
+  EXPECT_FALSE(fs::exists(folder() / names[2]));
+}
+
+TEST_F(SpoolStoreTest, BadFilesAreMovedAsideNeverRead) {
+  std::string good, corrupt, shortened;
+  {
+    SpoolStore s = store();
+    good = s.write(batchOf(1, 80, now)).name;
+    corrupt = s.write(batchOf(2, 80, now)).name;
+    shortened = s.write(batchOf(3, 80, now)).name;
+  }
+  // A flipped body byte keeps the size: found only by the checksum on read.
+  std::string bytes = slurp(folder() / corrupt);
+  bytes[bytes.size() - 5] ^= 1;
+  spit(folder() / corrupt, bytes);
+  bytes = slurp(folder() / shortened);
+  spit(folder() / shortened, bytes.substr(0, bytes.size() - 10));
+  Data other = encodeSpoolFile(batchOf(4, 10, now));
+  other[8] = 9;
+  spit(folder() / "0000000000000001-00000000.zspool", std::string(other.begin(), other.end()));
+  spit(folder() / "notes.txt", "hello");
+  // A write that a kill cut short.
+  spit(folder() / (".tmp-" + good + ".Ab12Cd"), "ZTHSPOOL half");
+
+  SpoolStore s = store();
+  EXPECT_EQ(namesIn(s.badFolder()),
+            (std::set<std::string>{shortened, "0000000000000001-00000000.zspool", "notes.txt"}));
+  EXPECT_EQ(namesIn(folder()), (std::set<std::string>{good, corrupt}));
+  EXPECT_FALSE(s.read(corrupt));
+  EXPECT_TRUE(fs::exists(s.badFolder() / corrupt));
+  EXPECT_EQ(s.size(), 1u);
+  EXPECT_TRUE(s.read(good));
 }
 
 TEST_F(SpoolStoreTest, SizeLimitDropsTheOldestFirst) {
@@ -306,6 +386,59 @@ class SpoolRetryTest : public ::testing::Test {
 
   TempRoot root;
 };
+
+TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
+  HttpsTestServer server;
+  std::mutex m;
+  int answered = 0;
+  server.on("/post", [&](const RecordedRequest&) {
+    std::lock_guard lock(m);
+    // Two 503s, then the collector takes everything.
+    return Reply{.status = ++answered <= 2 ? 503 : 200};
+  });
+  SpoolConfig config;
+  config.retryInitialSeconds = 0.05;
+  config.retryMaxSeconds = 0.2;
+  auto spool = makeSpool(config);
+  ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), R"({"events":[{"a":1}]})"), 1));
+  ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), R"({"events":[{"b":2},{"c":3}]})"), 2));
+  ASSERT_TRUE(waitDrained(*spool));
+  const auto requests = server.requests();
+  ASSERT_EQ(requests.size(), 4u);
+  // Oldest first; the failed one is posted again unchanged.
+  EXPECT_EQ(requests[0].body, R"({"events":[{"a":1}]})");
+  EXPECT_EQ(requests[1].body, requests[0].body);
+  EXPECT_EQ(requests[2].body, requests[0].body);
+  EXPECT_EQ(requests[3].body, R"({"events":[{"b":2},{"c":3}]})");
+  EXPECT_EQ(requests[3].header("X-Test"), "kept");
+  EXPECT_EQ(spool->counters().get(BackendCount::spooled), 3u);
+  EXPECT_EQ(spool->counters().get(BackendCount::delivered), 3u);
+  EXPECT_EQ(spool->counters().get(BackendCount::retried), 5u);  // 1 + 1 + 1 + 2
+  EXPECT_TRUE(namesIn(root.path() / "spool").empty());
+}
+
+TEST_F(SpoolRetryTest, WhatAnEarlierRunLeftIsDeliveredAtStart) {
+  HttpsTestServer server;
+  server.on("/post", Reply{.status = 200});
+  {
+    SpoolStore store(root.path() / "spool", 1 << 20, 3600);
+    std::string why;
+    ASSERT_TRUE(store.open(&why)) << why;
+    SpoolBatch batch = batchOf(4, 0);
+    batch.createdMillis = std::chrono::duration_cast<std::chrono::milliseconds>(
+                              std::chrono::system_clock::now().time_since_epoch())
+                              .count();
+    batch.url = server.url("/post");
+    const std::string body = R"({"events":[{},{},{},{}]})";
+    batch.body.assign(body.begin(), body.end());
+    ASSERT_TRUE(store.write(batch).written);
+  }
+  auto spool = makeSpool({});
+  ASSERT_TRUE(server.waitForRequests(1));
+  ASSERT_TRUE(waitDrained(*spool));
+  EXPECT_EQ(server.requests()[0].body, R"({"events":[{},{},{},{}]})");
+  EXPECT_EQ(spool->counters().get(BackendCount::delivered), 4u);
+}
 
 TEST_F(SpoolRetryTest, AClientErrorDropsTheBatchForGood) {
   HttpsTestServer server;

@@ -135,12 +135,29 @@ TEST_F(UploadBackendTest, EmptyOrChangedFilesAreRefused) {
   EXPECT_EQ(https.requestCount(), 0u);
 }
 
-// http:// is upgraded (the uploads-under-stall e2e test); other schemes are refused.
-TEST_F(UploadBackendTest, UploadAddressThatIsNotHttpIsRefused) {
+TEST_F(UploadBackendTest, PlainHttpUploadAddressIsUpgradedAsEventPostsAre) {
+  https.on("/upload", Reply{.body = "success"});
+  // The server speaks only TLS: the file arrives only when the scheme was
+  // upgraded.
+  backend->setUploadURL("http://127.0.0.1:" + std::to_string(https.port()) + "/upload");
   writeFile(files / "report.log", "data");
+  EXPECT_EQ(upload(files / "report.log"), std::make_pair(true, true));
+  EXPECT_EQ(https.requestCount(), 1u);
   backend->setUploadURL("ftp-only-address");
   EXPECT_EQ(upload(files / "report.log"), std::make_pair(false, false));
   EXPECT_TRUE(logs.contains("is not an http(s) URL"));
+}
+
+TEST_F(UploadBackendTest, StalledServerEndsWithNoAtTheTimeLimit) {
+  https.on("/upload", Reply{.body = "success"});
+  https.holdAnswers();
+  writeFile(files / "report.log", "data");
+  const auto began = std::chrono::steady_clock::now();
+  auto f = start(files / "report.log", 1000, std::chrono::milliseconds(1500));
+  EXPECT_EQ(wait(f, std::chrono::seconds(10)), std::make_pair(false, false));
+  EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(8));
+  EXPECT_EQ(uploadLoad().running, 0u);
+  https.releaseAnswers();
 }
 
 TEST_F(UploadBackendTest, UploadsBeyondTheLimitsWaitWithoutAThreadOrAreRefused) {
@@ -168,6 +185,20 @@ TEST_F(UploadBackendTest, UploadsBeyondTheLimitsWaitWithoutAThreadOrAreRefused) 
   EXPECT_EQ(wait(theirs), std::make_pair(true, true));
   EXPECT_EQ(https.requestCount(), 11u);
   EXPECT_EQ(uploadLoad().running + uploadLoad().waiting, 0u);
+}
+
+TEST_F(UploadBackendTest, BodyFileThatCannotBeWrittenEndsWithNo) {
+  https.on("/upload", Reply{.body = "success"});
+  writeFile(files / "report.log", "data");
+  // A file where the storage folder should be: no body file can be made.
+  const fs::path storage = ReportingSessionConnectivityHelper::storageRootFolder();
+  fs::remove_all(storage);
+  fs::create_directories(storage.parent_path());
+  writeFile(storage, "in the way");
+  EXPECT_EQ(upload(files / "report.log"), std::make_pair(false, false));
+  EXPECT_TRUE(logs.contains("the body file cannot be written"));
+  EXPECT_EQ(https.requestCount(), 0u);
+  fs::remove(storage);
 }
 
 TEST_F(UploadBackendTest, QueryEncodingKeepsTheQueryCharactersAndEscapesTheRest) {
