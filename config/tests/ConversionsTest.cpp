@@ -12,6 +12,10 @@
 namespace zerith {
 namespace {
 
+TEST(ConversionsTest, ErrorCarriesTheZerithDomainCodeAndDescription) {
+  EXPECT_EQ(makeZerithError("Nothing to flush", 503), (Error{kZerithErrorDomain, 503, "Nothing to flush"}));
+}
+
 TEST(ConversionsTest, TimevalKeepsTheMicrosecondFraction) {
   EXPECT_DOUBLE_EQ(timevalToSeconds(timeval{1000, 500000}), 1000.5);
   EXPECT_DOUBLE_EQ(timevalToSeconds(timeval{1700000000, 1}), 1700000000.000001);

@@ -2,7 +2,11 @@
 
 #include <sys/stat.h>
 
+#include <cstdio>
+#include <cstdlib>
 #include <ctime>
+#include <future>
+#include <thread>
 
 #include "config/StorebagServers.h"
 #include "config/StorebagVerify.h"
@@ -293,6 +297,27 @@ TEST_F(StorebagServerTest, RefreshKeepsTheLastGoodCopyUntilAGoodAnswerReplacesIt
   EXPECT_EQ(cached("ambrel"), newer);
   EXPECT_EQ(fetch(5).version, Value("2.0"));
 }
+
+TEST_F(StorebagServerTest, SynchronousWaitReleasesTheCacheLockForTheCompletion) {
+  server_.on("/bags/ambrel",
+             test::Reply{.status = 200, .headers = {}, .body = test::text(signedContainer(sampleStorebag()))});
+  server_.holdAnswers();
+  auto done = std::make_shared<std::promise<FetchResult>>();
+  auto result = done->get_future();
+  std::thread([done] { done->set_value(fetch(5)); }).detach();
+  ASSERT_TRUE(server_.waitForRequests(1));
+  // The fetch is blocked in its wait; the lock must be free meanwhile.
+  const bool lockFree = ZerithdUtil::lock().try_lock();
+  if (lockFree) ZerithdUtil::lock().unlock();
+  server_.releaseAnswers();
+  EXPECT_TRUE(lockFree);
+  if (result.wait_for(std::chrono::seconds(30)) != std::future_status::ready) {
+    // The completion could not take the lock: the process is wedged.
+    ADD_FAILURE() << "the synchronous fetch never returned";
+    std::fprintf(stderr, "storebag fetch deadlocked on ZerithdUtil's lock\n");
+    std::_Exit(1);
+  }
+  EXPECT_EQ(result.get().section, releaseSection());
 
 // --- A real static server: nginx's Last-Modified, If-Modified-Since, 304 ----
 

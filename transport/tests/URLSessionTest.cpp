@@ -306,7 +306,7 @@ TEST_F(URLSessionTest, WithoutARouteTheRequestWaitsUntilItsOwnTimeoutButARefusal
   EXPECT_EQ(logs.count("has no route to its server"), noRoute);
 }
 
-TEST_F(URLSessionTest, TransfersRequiringExternalPowerWaitWhileOnBatteryUntilTheirTimeout) {
+TEST_F(URLSessionTest, TransfersRequiringExternalPowerWaitWhileOnBattery) {
   server.on("/p", Reply{.body = "powered"});
   writePowerSupply("BAT0", "Battery", "status", "Discharging");
   writePowerSupply("AC", "Mains", "online", "0");
@@ -316,11 +316,6 @@ TEST_F(URLSessionTest, TransfersRequiringExternalPowerWaitWhileOnBatteryUntilThe
   configuration.powerCheckInterval = std::chrono::milliseconds(10);
   configuration.discretionaryMaxDelay = std::chrono::milliseconds(0);  // not enough without external power
   auto session = makeSession(configuration);
-  URLRequest timed = get(server.url("/p"));
-  timed.timeoutSeconds = 0.1;
-  session->dataTaskWithRequest(timed)->resume();
-  ASSERT_TRUE(events->waitFor("complete 28"));
-  EXPECT_EQ(delegate->lastError()->description, "Timeout was reached while waiting for external power");
   auto task = session->dataTaskWithRequest(get(server.url("/p")));
   task->setTaskDescription("power");
   task->resume();
@@ -334,7 +329,7 @@ TEST_F(URLSessionTest, TransfersRequiringExternalPowerWaitWhileOnBatteryUntilThe
   EXPECT_EQ(server.requestCount(), 1u);
 }
 
-TEST_F(URLSessionTest, DiscretionaryTransfersOnBatteryGoAfterTheirMaximumDelay) {
+TEST_F(URLSessionTest, DiscretionaryTransfersOnBatteryGoAfterTheirMaximumDelayOrTimeOut) {
   server.on("/d", Reply{.body = "eventually"});
   writePowerSupply("BAT0", "Battery", "status", "Discharging");
   auto configuration = URLSessionConfiguration::backgroundSessionConfigurationWithIdentifier("discretionary");
@@ -346,6 +341,15 @@ TEST_F(URLSessionTest, DiscretionaryTransfersOnBatteryGoAfterTheirMaximumDelay) 
   ASSERT_TRUE(events->waitFor("complete"));
   EXPECT_EQ(text(delegate->received()), "eventually");
   EXPECT_EQ(logs.count("waits while the device runs on battery"), 1u);
+
+  configuration.requiresPowerPluggedIn = true;
+  auto strict = makeSession(configuration);
+  URLRequest request = get(server.url("/d"));
+  request.timeoutSeconds = 0.1;
+  strict->dataTaskWithRequest(request)->resume();
+  ASSERT_TRUE(events->waitFor("complete 28"));
+  EXPECT_EQ(delegate->lastError()->description, "Timeout was reached while waiting for external power");
+  EXPECT_EQ(server.requestCount(), 1u);
 }
 
 // The socket of this process connected from `localPort` to `remotePort`.
