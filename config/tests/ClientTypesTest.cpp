@@ -56,7 +56,9 @@ TEST_F(EnvironmentTest, StoredValuesResolveOrAreCorrected) {
     const char* error;
   } rows[] = {
       {Value(5), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 5"},
+      {Value(100), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 100"},
       {Value(-1), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 4294967295"},
+      {Value(-4), kEnvironmentInternal, "userDefaultsEnvironment: Invalid environment type 4294967292"},
       {Value(0), kEnvironmentNone, nullptr},
       {Value("4"), kEnvironmentRelease, nullptr},
   };

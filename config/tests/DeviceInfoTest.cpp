@@ -9,7 +9,6 @@
 
 #include "config/DeviceInfo.h"
 #include "platform/Defaults.h"
-#include "platform/FileUtil.h"
 #include "platform/Log.h"
 #include "platform/PropertyList.h"
 #include "config/tests/ScopedEnv.h"
@@ -113,14 +112,19 @@ TEST_F(DeviceInfoTest, BrokenDeviceFileIsLoggedOnceAndIgnored) {
 }
 
 // A device file that cannot be used leaves the system's own facts: one
-// whose binary form holds a NUL inside a string (kept in the fuzz corpus),
-// and a folder in its place (which not even the superuser can read).
+// whose binary form holds a NUL inside a string (which libplist would abort
+// the process on), and a folder in its place (which not even the superuser
+// can read).
 TEST_F(DeviceInfoTest, UnusableDeviceFileIsLoggedAndIgnoredNotFatal) {
-  const auto nul = file::readAll(test::sourceDir() / "fuzz/corpus/device_file_fuzz/crash-binary-string-with-nul", 4096);
-  ASSERT_TRUE(nul);
+  // {"ProductVersion": "a\0b"}
+  const std::uint8_t nul[] = {
+      0x62, 0x70, 0x6c, 0x69, 0x73, 0x74, 0x30, 0x30, 0xd1, 0x01, 0x02, 0x5e, 0x50, 0x72, 0x6f, 0x64, 0x75,
+      0x63, 0x74, 0x56, 0x65, 0x72, 0x73, 0x69, 0x6f, 0x6e, 0x53, 0x61, 0x00, 0x62, 0x08, 0x0b, 0x1a, 0x00,
+      0x00, 0x00, 0x00, 0x00, 0x00, 0x01, 0x01, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x03, 0x00, 0x00,
+      0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x1e};
   const std::string path = (root_ / "/etc/zerithd/device.plist").string();
   root_.write("/etc/os-release", "VERSION_ID=12\n");
-  root_.write("/etc/zerithd/device.plist", std::string(nul->begin(), nul->end()));
+  root_.write("/etc/zerithd/device.plist", std::string(reinterpret_cast<const char*>(nul), sizeof(nul)));
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
   EXPECT_TRUE(capture_.contains("string holds a NUL character"));
 
@@ -208,8 +212,19 @@ TEST(DeviceParsersTest, CountryOfLocaleNames) {
   EXPECT_EQ(device::countryFromLocale("pt_br"), "BR");
   EXPECT_EQ(device::countryFromLocale("es_419.UTF-8"), "419");
   EXPECT_EQ(device::countryFromLocale("C"), std::nullopt);
+  EXPECT_EQ(device::countryFromLocale("C.UTF-8"), std::nullopt);
+  EXPECT_EQ(device::countryFromLocale("POSIX"), std::nullopt);
   EXPECT_EQ(device::countryFromLocale("en_.UTF-8"), std::nullopt);
   EXPECT_EQ(device::countryFromLocale("en_G/B"), std::nullopt);
+}
+
+TEST(DeviceParsersTest, DeviceFileMustBeADictionary) {
+  std::string why;
+  EXPECT_TRUE(device::parseDeviceFile(plist::bytesOf(plist::encodeXml(Value(Dictionary{}))), &why));
+  EXPECT_FALSE(device::parseDeviceFile(plist::bytesOf(plist::encodeXml(Value("x"))), &why));
+  EXPECT_EQ(why, "the root is not a dictionary");
+  EXPECT_FALSE(device::parseDeviceFile(plist::bytesOf(std::string("bplist00")), &why));
+  EXPECT_FALSE(why.empty());
 }
 
 using test::ScopedEnv;

@@ -120,6 +120,13 @@ TEST_F(StorebagDiskCacheTest, SavedContainerIsReadBackWithItsModificationDate) {
   EXPECT_EQ(files, 1u);
 }
 
+TEST_F(StorebagDiskCacheTest, FormingTheFileURLCreatesTheCacheFolder) {
+  std::filesystem::remove_all(paths::storebagCacheDir());
+  const auto url = storebagCacheFileURL("dravon");
+  EXPECT_TRUE(std::filesystem::is_directory(url.parent_path()));
+  EXPECT_FALSE(std::filesystem::exists(url));
+}
+
 TEST_F(StorebagDiskCacheTest, MissingOrOversizedCacheFileIsALoggedLoadFailure) {
   EXPECT_FALSE(loadStorebagFromDisk("ambrel"));
   const std::string path = (paths::storebagCacheDir() / "ambrel").string();

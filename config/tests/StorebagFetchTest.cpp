@@ -36,12 +36,24 @@ using test::sampleStorebag;
 using test::signedContainer;
 using test::withEntry;
 using test::withoutKey;
+namespace fs = std::filesystem;
 
 // OpenSSL's reason for a signature that does not match the bag.
 constexpr const char* kBadSignature = "bad signature";
 
 // The release section of sampleStorebag().
 Value releaseSection() { return sampleStorebag()["release"]; }
+
+// A file's modification time as an HTTP date, as a static server sends it.
+std::string httpDate(const fs::path& path) {
+  struct stat st {};
+  ::stat(path.c_str(), &st);
+  std::tm tm{};
+  gmtime_r(&st.st_mtim.tv_sec, &tm);
+  char buf[64];
+  std::strftime(buf, sizeof buf, "%a, %d %b %Y %H:%M:%S GMT", &tm);
+  return buf;
+}
 
 struct FetchResult {
   Value section;
@@ -77,12 +89,42 @@ TEST_F(StorebagFetchTest, FirstFetchWithoutCacheOrServerFailsAndSavesNothing) {
   EXPECT_FALSE(r.unchanged);
   EXPECT_TRUE(logs_.contains("fetchNetworkStorebag: Error resolving with lookup server " +
                              refusing.url("/bags/ambrel?version=8.0") + ", sendSynchronousRequest error "));
-  // The cause and URL formatting of this line is guarded end to end (StorebagStartTest).
-  EXPECT_EQ(logs_.count("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type 5: "), 1u);
+  // The error line ends with the connection's failure and the URL.
+  const std::string prefix = "fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type 5: ";
+  const std::string suffix = " from " + refusing.url("/bags/ambrel?version=8.0");
+  std::size_t withCause = 0;
+  for (const auto& line : logs_.lines()) {
+    if (line.level == Level::Error && line.text.starts_with(prefix) && line.text.ends_with(suffix) &&
+        line.text.size() > prefix.size() + suffix.size()) {
+      ++withCause;
+    }
+  }
+  EXPECT_EQ(withCause, 1u);
   EXPECT_FALSE(logs_.contains("Loading default storebag"));
   EXPECT_FALSE(logs_.contains("Signature is missing"));
   EXPECT_FALSE(cached("ambrel"));
   EXPECT_TRUE(metric("ambrel", "max-age").isNil());
+}
+
+TEST_F(StorebagFetchTest, UnreachableServerForDravonLoadsTheUnsignedFallbackWhichVerificationRefuses) {
+  test::RefusingPort refusing;
+  setServer(refusing.url("/bags"));
+  EXPECT_TRUE(fetch(11).section.isNil());
+  std::vector<std::string> sequence;
+  for (const auto& line : logs_.lines()) {
+    if (line.text.rfind("fetchNetworkStorebag: Error", 0) == 0 || line.text.rfind("fetchNetworkStorebag: Loading", 0) == 0 ||
+        line.text == "fetchStorebagWithName: Signature is missing" ||
+        line.text.rfind("fetchStorebagForEnvironmentAndClientType", 0) == 0) {
+      sequence.push_back(line.text.substr(0, 60));
+    }
+  }
+  ASSERT_EQ(sequence.size(), 4u);
+  EXPECT_EQ(sequence[1], "fetchNetworkStorebag: Loading default storebag 'dravon'");
+  EXPECT_EQ(sequence[2], "fetchStorebagWithName: Signature is missing");
+  EXPECT_TRUE(logs_.contains("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type 11: "));
+  EXPECT_TRUE(logs_.contains(" from " + refusing.url("/bags/dravon?version=8.0") +
+                             "; the built-in fallback storebag was loaded; the storebag's signature is missing"));
+  EXPECT_FALSE(cached("dravon"));
 }
 
 TEST_F(StorebagFetchTest, FallbackStorebagIsTheBuiltInUnsignedList) {
@@ -206,13 +248,18 @@ class StorebagServerTest : public StorebagFetchTest {
 };
 
 TEST_F(StorebagServerTest, AnAnswerOtherThan200NamesItsStatusAsTheCause) {
-  server_.on("/bags/ambrel", test::Reply{.status = 404, .headers = {}, .body = "no storebag here"});
-  EXPECT_TRUE(fetch(5).section.isNil());
-  const std::string url = server_.url("/bags/ambrel?version=8.0");
-  EXPECT_TRUE(logs_.has(Level::Default, "fetchNetworkStorebag: Error resolving with lookup server " + url +
-                                            ", sendSynchronousRequest error HTTP status 404"));
-  EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client "
-                                      "type 5: HTTP status 404 from " + url));
+  for (const int status : {404, 503}) {
+    logs_.clear();
+    server_.on("/bags/ambrel", test::Reply{.status = status, .headers = {}, .body = "no storebag here"});
+    EXPECT_TRUE(fetch(5).section.isNil());
+    const std::string url = server_.url("/bags/ambrel?version=8.0");
+    EXPECT_TRUE(logs_.has(Level::Default, "fetchNetworkStorebag: Error resolving with lookup server " + url +
+                                              ", sendSynchronousRequest error HTTP status " + std::to_string(status)))
+        << status;
+    EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client "
+                                        "type 5: HTTP status " + std::to_string(status) + " from " + url));
+    EXPECT_FALSE(logs_.contains("sendSynchronousRequest error (null)"));
+  }
 }
 
 TEST_F(StorebagServerTest, FirstFetchIsAPlainGetOfTheVersionedURL) {
@@ -234,6 +281,20 @@ TEST_F(StorebagServerTest, FirstFetchIsAPlainGetOfTheVersionedURL) {
   EXPECT_TRUE(logs_.has(Level::Default, "fetchStorebagWithName: storebag 'ambrel' has been saved to disk cache"));
   EXPECT_EQ(cached("ambrel"), signedContainer(sampleStorebag()));
   EXPECT_EQ(metric("ambrel", "Last-Modified"), Value("Tue, 14 Nov 2023 22:13:20 GMT"));
+}
+
+TEST_F(StorebagServerTest, CacheControlWithoutUsableMaxAgeStores86400) {
+  const std::pair<std::int32_t, std::optional<std::string>> cases[] = {
+      {5, "no-cache"}, {8, std::nullopt}, {9, "public, max-age"}};
+  const char* names[] = {"ambrel", "elquin", "farrow"};
+  for (std::size_t i = 0; i < 3; ++i) {
+    test::Reply reply{.status = 200, .headers = {}, .body = test::text(signedContainer(sampleStorebag()))};
+    if (cases[i].second) reply.headers.emplace_back("Cache-Control", *cases[i].second);
+    server_.on(std::string("/bags/") + names[i], reply);
+    EXPECT_EQ(fetch(cases[i].first).maxAge, 86400) << names[i];
+    EXPECT_EQ(metric(names[i], "max-age"), Value(86400));
+    EXPECT_TRUE(metric(names[i], "Last-Modified").isNil());
+  }
 }
 
 TEST_F(StorebagServerTest, ExpiredCopyIsUsedWhileAnEmptyAnswerChangesOnlyTheMetrics) {
@@ -262,7 +323,7 @@ TEST_F(StorebagServerTest, ExpiredCopyIsUsedWhileAnEmptyAnswerChangesOnlyTheMetr
   EXPECT_EQ(storebagCacheModificationDate("ambrel"), before);
 }
 
-TEST_F(StorebagServerTest, RefreshKeepsTheLastGoodCopyUntilAGoodAnswerReplacesIt) {
+TEST_F(StorebagServerTest, FailedOrTamperedRefreshKeepsTheLastGoodCopy) {
   const Data container = signedContainer(sampleStorebag("1.0"));
   cache("ambrel", container, 0, "Mon, 01 Jan 2024 00:00:00 GMT");
 
@@ -286,16 +347,6 @@ TEST_F(StorebagServerTest, RefreshKeepsTheLastGoodCopyUntilAGoodAnswerReplacesIt
   // disk now counts as fresh for a day, and it is still the good one.
   EXPECT_EQ(fetch(5).version, Value("1.0"));
   EXPECT_EQ(server_.requestCount(), 2u);
-
-  // A good answer to an expired copy is saved behind this fetch and served by the next.
-  cache("ambrel", container, 0, "Mon, 01 Jan 2024 00:00:00 GMT");
-  const Data newer = signedContainer(sampleStorebag("2.0"));
-  server_.on("/bags/ambrel", test::Reply{.status = 200, .headers = {}, .body = test::text(newer)});
-  logs_.clear();
-  EXPECT_EQ(fetch(5).version, Value("1.0"));
-  ASSERT_TRUE(logs_.waitFor("has been saved to disk cache"));
-  EXPECT_EQ(cached("ambrel"), newer);
-  EXPECT_EQ(fetch(5).version, Value("2.0"));
 }
 
 TEST_F(StorebagServerTest, SynchronousWaitReleasesTheCacheLockForTheCompletion) {
@@ -342,6 +393,82 @@ class StorebagNginxTest : public StorebagFetchTest {
   }
   std::unique_ptr<test::NginxServer> nginx_;
 };
+
+TEST_F(StorebagNginxTest, RefreshOfAnUnchangedFileIsA304AndAChangedFileIsSavedForTheNextFetch) {
+  start("max-age=0");
+  const fs::path file = publish("ambrel", signedContainer(sampleStorebag("1.0")));
+  ASSERT_EQ(fetch(5).version, Value("1.0"));
+  const auto savedAt = storebagCacheModificationDate("ambrel");
+  const Value lastModified = metric("ambrel", "Last-Modified");
+
+  // Unchanged: a 304 that changes nothing.
+  logs_.clear();
+  EXPECT_EQ(fetch(5).version, Value("1.0"));
+  EXPECT_TRUE(logs_.contains("Disk cache expired and will be refreshed"));
+  ASSERT_TRUE(logs_.waitFor("does not need update as its content has not changed"));
+  EXPECT_TRUE(nginx_->waitForAccessLog("GET /bags/ambrel?version=8.0 304 ims=\"" + httpDate(file) + "\""))
+      << nginx_->accessLog();
+  EXPECT_EQ(storebagCacheModificationDate("ambrel"), savedAt);
+  EXPECT_EQ(metric("ambrel", "Last-Modified"), lastModified);
+  EXPECT_EQ(metric("ambrel", "max-age"), Value(0));
+
+  // Changed: saved by the refresh, served by the next fetch.
+  const Data newer = signedContainer(sampleStorebag("2.0"));
+  publish("ambrel", newer);
+  fs::last_write_time(file, fs::last_write_time(file) + std::chrono::seconds(10));
+  logs_.clear();
+  EXPECT_EQ(fetch(5).version, Value("1.0"));  // the refresh runs behind this answer
+  ASSERT_TRUE(logs_.waitFor("has been saved to disk cache"));
+  EXPECT_EQ(cached("ambrel"), newer);
+  EXPECT_EQ(metric("ambrel", "Last-Modified"), Value(httpDate(file)));
+  logs_.clear();
+  EXPECT_EQ(fetch(5).version, Value("2.0"));
+  ASSERT_TRUE(logs_.waitFor("does not need update"));  // this call's refresh: 304
+}
+
+// --- A real static server: nginx's Last-Modified, If-Modified-Since, 304 ----
+
+class StorebagNginxTest : public StorebagFetchTest {
+ protected:
+  void start(const std::string& cacheControl) {
+    if (!test::NginxServer::available()) {
+      GTEST_SKIP() << "nginx is not installed";
+    }
+    nginx_ = std::make_unique<test::NginxServer>(test::NginxServer::Options{
+        .workDir = root_ / "/nginx",
+        .documentRoot = root_ / "/www",
+        .serverDirectives = "add_header Cache-Control \"" + cacheControl + "\";"});
+    ASSERT_TRUE(nginx_->started()) << nginx_->error();
+    setServer(nginx_->url("/bags"));
+  }
+  fs::path publish(const std::string& name, const Data& container) {
+    const fs::path path = root_ / ("/www/bags/" + name);
+    fs::create_directories(path.parent_path());
+    EXPECT_TRUE(file::writeAtomically(path, container));
+    return path;
+  }
+  std::unique_ptr<test::NginxServer> nginx_;
+};
+
+TEST_F(StorebagNginxTest, FirstFetchKeepsTheServersMaxAgeAndLastModified) {
+  start("max-age=600");
+  const Data container = signedContainer(sampleStorebag());
+  const fs::path file = publish("ambrel", container);
+  const auto r = fetch(5);
+  EXPECT_EQ(r.section, releaseSection());
+  EXPECT_EQ(r.maxAge, 600);
+  EXPECT_EQ(r.version, Value("2.4.0"));
+  EXPECT_EQ(cached("ambrel"), container);
+  EXPECT_EQ(metric("ambrel", "max-age"), Value(600));
+  EXPECT_EQ(metric("ambrel", "Last-Modified"), Value(httpDate(file)));
+  EXPECT_TRUE(nginx_->waitForAccessLog("GET /bags/ambrel?version=8.0 200 ims=\"-\""));
+
+  // Within the max age the disk copy answers without asking the server.
+  logs_.clear();
+  EXPECT_EQ(fetch(5).section, releaseSection());
+  EXPECT_TRUE(logs_.contains("Disk cache is valid and will not be refreshed"));
+  EXPECT_FALSE(logs_.contains("fetchNetworkStorebag"));
+}
 
 TEST_F(StorebagNginxTest, RefreshOfAnUnchangedFileIsA304AndAChangedFileIsSavedForTheNextFetch) {
   start("max-age=0");

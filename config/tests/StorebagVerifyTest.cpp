@@ -72,7 +72,6 @@ TEST_F(StorebagVerifyTest, SignedContainerYieldsTheStorebagInBinaryAndXmlForm) {
   const std::string xml = plist::encodeXml(containerFields(container));
   EXPECT_EQ(verify(bytes(xml)), sampleStorebag());
   EXPECT_FALSE(logs_.contains("fetchStorebagWithName"));
-  EXPECT_FALSE(cached("ambrel"));  // saved only when asked
 }
 
 TEST_F(StorebagVerifyTest, Base64WithLineBreaksAndForeignCharactersStillVerifies) {
@@ -104,9 +103,18 @@ TEST_F(StorebagVerifyTest, SignatureOfAPrecomputedSha1DigestVerifiesAndSha256Doe
   EXPECT_TRUE(logs_.contains(notVerified("bad signature")));
 }
 
-// What is no property list, is too large or is nested far deeper than any
-// storebag never reaches the parser as a container: refused as unsigned.
-TEST_F(StorebagVerifyTest, WhatIsNotAUsablePropertyListIsRefusedAsMissingSignature) {
+TEST_F(StorebagVerifyTest, WhatIsNotAPropertyListIsRefusedAsMissingSignature) {
+  for (const std::string& junk : {std::string(), std::string("not a property list"), std::string("bplist00\x01\x02", 10)}) {
+    logs_.clear();
+    EXPECT_TRUE(verify(bytes(junk)).isNil());
+    EXPECT_EQ(logs_.count("fetchStorebagWithName: propertyListWithData error "), 1u) << junk;
+    EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagWithName: Signature is missing"));
+  }
+}
+
+TEST_F(StorebagVerifyTest, OversizedOrDeeplyNestedContainerNeverReachesTheParser) {
+  // Five megabytes of text, and a container nested far deeper than any
+  // storebag.
   const Value fields = containerFields(signedContainer(sampleStorebag()));
   const Value huge(Dictionary{{"signature", *fields["signature"].string()},
                               {"bag", *fields["bag"].string()},
@@ -115,15 +123,12 @@ TEST_F(StorebagVerifyTest, WhatIsNotAUsablePropertyListIsRefusedAsMissingSignatu
   for (int i = 0; i < 200; ++i) nested += "<array>";
   for (int i = 0; i < 200; ++i) nested += "</array>";
   nested += "</plist>";
-  const std::pair<Data, std::string> cases[] = {{Data(), ""},
-                                                {bytes("not a property list"), ""},
-                                                {bytes(std::string("bplist00\x01\x02", 10)), ""},
-                                                {encode(huge), "exceeds the limit of 4194304"},
+  const std::pair<Data, std::string> cases[] = {{encode(huge), "exceeds the limit of 4194304"},
                                                 {bytes(nested), "nesting deeper than 8"}};
   for (const auto& [container, why] : cases) {
     logs_.clear();
     EXPECT_TRUE(verify(container, true).isNil());
-    EXPECT_EQ(logs_.count("fetchStorebagWithName: propertyListWithData error "), 1u) << container.size();
+    EXPECT_TRUE(logs_.contains("fetchStorebagWithName: propertyListWithData error ")) << why;
     EXPECT_TRUE(logs_.contains(why));
     EXPECT_TRUE(logs_.has(Level::Error, "fetchStorebagWithName: Signature is missing"));
   }
@@ -176,6 +181,14 @@ TEST_F(StorebagVerifyTest, ContainerSignedWithAnotherKeyIsRefused) {
               logs_.contains(notVerified("data too large for modulus")));
 }
 
+TEST_F(StorebagVerifyTest, SignedBagThatIsNotADictionaryGivesNothing) {
+  const Data array = plist::encodeBinary(Value(Array{Value("release")}));
+  EXPECT_TRUE(verify(*signStorebagContainer(storebagKeys().privateKeyPEM, array)).isNil());
+  const Data notAList = bytes("release = yes");
+  EXPECT_TRUE(verify(*signStorebagContainer(storebagKeys().privateKeyPEM, notAList)).isNil());
+  EXPECT_FALSE(logs_.contains("Signature"));
+}
+
 TEST_F(StorebagVerifyTest, PublicKeyIsReadAfreshAtEveryVerification) {
   const Data signedByFirst = signedContainer(sampleStorebag());
   const Data signedBySecond = signedContainer(sampleStorebag(), test::otherStorebagKeys());
@@ -223,6 +236,21 @@ TEST_F(StorebagVerifyTest, MissingCorruptOrNonRsaPublicKeyRefusesEverything) {
   EXPECT_TRUE(verify(container).isNil());
   EXPECT_TRUE(onlyError(expected));
   EXPECT_FALSE(cached("ambrel"));
+}
+
+TEST_F(StorebagVerifyTest, SavingKeepsTheWholeContainerAndARefusedOneChangesNothing) {
+  const Data container = signedContainer(sampleStorebag("1.0"));
+  EXPECT_FALSE(verify(container, true).isNil());
+  EXPECT_TRUE(logs_.has(Level::Default, "fetchStorebagWithName: storebag 'ambrel' has been saved to disk cache"));
+  EXPECT_EQ(cached("ambrel"), container);
+
+  // Not saved unless asked.
+  EXPECT_FALSE(parseAndVerifyStorebag("bostin", container, false).isNil());
+  EXPECT_FALSE(cached("bostin"));
+
+  const Data forged = signedContainer(sampleStorebag("9.9"), test::otherStorebagKeys());
+  EXPECT_TRUE(verify(forged, true).isNil());
+  EXPECT_EQ(cached("ambrel"), container);
 }
 
 }  // namespace
