@@ -18,19 +18,6 @@
 namespace zerith {
 namespace {
 
-namespace fs = std::filesystem;
-
-// The Last-Modified text a static server gives for a file.
-std::string httpDate(const fs::path& path) {
-  struct stat st {};
-  ::stat(path.c_str(), &st);
-  std::tm tm{};
-  gmtime_r(&st.st_mtim.tv_sec, &tm);
-  char buf[64];
-  std::strftime(buf, sizeof buf, "%a, %d %b %Y %H:%M:%S GMT", &tm);
-  return buf;
-}
-
 using log::Level;
 using test::sampleStorebag;
 using test::signedContainer;
@@ -370,60 +357,6 @@ TEST_F(StorebagServerTest, SynchronousWaitReleasesTheCacheLockForTheCompletion) 
   }
   EXPECT_EQ(result.get().section, releaseSection());
 
-// --- A real static server: nginx's Last-Modified, If-Modified-Since, 304 ----
-
-class StorebagNginxTest : public StorebagFetchTest {
- protected:
-  void start(const std::string& cacheControl) {
-    if (!test::NginxServer::available()) {
-      GTEST_SKIP() << "nginx is not installed";
-    }
-    nginx_ = std::make_unique<test::NginxServer>(test::NginxServer::Options{
-        .workDir = root_ / "/nginx",
-        .documentRoot = root_ / "/www",
-        .serverDirectives = "add_header Cache-Control \"" + cacheControl + "\";"});
-    ASSERT_TRUE(nginx_->started()) << nginx_->error();
-    setServer(nginx_->url("/bags"));
-  }
-  fs::path publish(const std::string& name, const Data& container) {
-    const fs::path path = root_ / ("/www/bags/" + name);
-    fs::create_directories(path.parent_path());
-    EXPECT_TRUE(file::writeAtomically(path, container));
-    return path;
-  }
-  std::unique_ptr<test::NginxServer> nginx_;
-};
-
-TEST_F(StorebagNginxTest, RefreshOfAnUnchangedFileIsA304AndAChangedFileIsSavedForTheNextFetch) {
-  start("max-age=0");
-  const fs::path file = publish("ambrel", signedContainer(sampleStorebag("1.0")));
-  ASSERT_EQ(fetch(5).version, Value("1.0"));
-  const auto savedAt = storebagCacheModificationDate("ambrel");
-  const Value lastModified = metric("ambrel", "Last-Modified");
-
-  // Unchanged: a 304 that changes nothing.
-  logs_.clear();
-  EXPECT_EQ(fetch(5).version, Value("1.0"));
-  EXPECT_TRUE(logs_.contains("Disk cache expired and will be refreshed"));
-  ASSERT_TRUE(logs_.waitFor("does not need update as its content has not changed"));
-  EXPECT_TRUE(nginx_->waitForAccessLog("GET /bags/ambrel?version=8.0 304 ims=\"" + httpDate(file) + "\""))
-      << nginx_->accessLog();
-  EXPECT_EQ(storebagCacheModificationDate("ambrel"), savedAt);
-  EXPECT_EQ(metric("ambrel", "Last-Modified"), lastModified);
-  EXPECT_EQ(metric("ambrel", "max-age"), Value(0));
-
-  // Changed: saved by the refresh, served by the next fetch.
-  const Data newer = signedContainer(sampleStorebag("2.0"));
-  publish("ambrel", newer);
-  fs::last_write_time(file, fs::last_write_time(file) + std::chrono::seconds(10));
-  logs_.clear();
-  EXPECT_EQ(fetch(5).version, Value("1.0"));  // the refresh runs behind this answer
-  ASSERT_TRUE(logs_.waitFor("has been saved to disk cache"));
-  EXPECT_EQ(cached("ambrel"), newer);
-  EXPECT_EQ(metric("ambrel", "Last-Modified"), Value(httpDate(file)));
-  logs_.clear();
-  EXPECT_EQ(fetch(5).version, Value("2.0"));
-  ASSERT_TRUE(logs_.waitFor("does not need update"));  // this call's refresh: 304
 }
 
 // --- A real static server: nginx's Last-Modified, If-Modified-Since, 304 ----
