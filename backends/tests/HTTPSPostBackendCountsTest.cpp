@@ -1,13 +1,15 @@
-// What the HTTPS backend counts for each event: dropped by the reason that
-// decided it, against a real HTTPS server on loopback, and what the answer to
-// a post counts (delivered, or lost when no spool keeps the batch). Event
-// lists at the flush, record IDs and the spool's road: the e2e tests.
+// What the HTTPS backend counts for each event: sent, batched, and dropped
+// by the reason that decided it, against a real HTTPS server on loopback;
+// and its side of the spool: record IDs only when "spoolEnabled" is on, and
+// what the answer to a post counts (delivered, or lost when no spool keeps
+// the batch). The spool itself: SpoolTest.cpp; the whole road with a failing
+// collector: the e2e tests.
 
 #include <chrono>
+#include <set>
 #include <thread>
 
 #include "backends/tests/HTTPSPostBackendTestSupport.h"
-#include "config/Conversions.h"
 
 namespace zerith::test {
 namespace {
@@ -38,12 +40,10 @@ class HTTPSCountsTest : public HTTPSBackendTest {
     return b.counters().get(kind) == n;
   }
 
-  // Flushes and waits for the completion; its error, if any.
-  static std::optional<Error> flush(HTTPSPostBackend& b) {
+  void flush(HTTPSPostBackend& b) {
     auto results = ResultLog::make();
     b.flushMessagesWithCompletion(results->handler());
-    EXPECT_TRUE(results->waitFor(1));
-    return results->errors().empty() ? std::nullopt : results->errors()[0];
+    ASSERT_TRUE(results->waitFor(1));
   }
   std::shared_ptr<HTTPSPostBackend> enabled(const std::string& url) {
     return backend(profileWith({enablingClient(url)}), userInfo(), true, true);
@@ -64,6 +64,31 @@ class HTTPSCountsTest : public HTTPSBackendTest {
     ASSERT_TRUE(results->waitFor(1));
   }
 };
+
+TEST_F(HTTPSCountsTest, BatchedEventsAreSentOrDroppedByTheEventListsAtTheFlush) {
+  server.on("/post", Reply{});
+  Dictionary client = enablingClient(server.url("/post"));
+  client.set("event_whitelist", Array{Value(1), Value(2)});
+  client.set("event_blacklist", Array{Value(2)});
+  auto b = backend(profileWith({client}), userInfo(), true, true);
+  ASSERT_EQ(b->state(), kBackendStateEnabled);
+  for (const std::uint16_t category : {1, 2, 3, 1}) {
+    b->sendMessage(clientEvent(category), at(1001), category, 0, 0);
+  }
+  expectOnly(*b, {{BackendCount::batched, 4}, {BackendCount::inBatch, 4}});
+  flush(*b);
+  ASSERT_TRUE(server.waitForRequests(1));
+  EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 2u);
+  // A realtime event passes the batch and goes at once.
+  b->sendMessage(clientEvent(9), at(1002), 1, 0, 1);
+  ASSERT_TRUE(server.waitForRequests(2));
+  ASSERT_TRUE(waitForCount(*b, BackendCount::delivered, 3));
+  expectOnly(*b, {{BackendCount::batched, 4},
+                  {BackendCount::sent, 3},
+                  {BackendCount::delivered, 3},
+                  {BackendCount::droppedFiltered, 1},
+                  {BackendCount::droppedBlacklisted, 1}});
+}
 
 TEST_F(HTTPSCountsTest, EventsThatMayNotGoCountTheReasonThatKeptThem) {
   server.on("/post", Reply{});
@@ -114,8 +139,7 @@ TEST_F(HTTPSCountsTest, ServerRefusalAndAGoneTransportCountTheirDrops) {
   server.on("/post", Reply{.status = 503});
   auto b = backend(profileWith({enablingClient(server.url("/post"))}), userInfo(), true, true);
   b->sendMessage(clientEvent(1), at(1001), 1, 0, 0);
-  // Answered 503: disabled by the server, and the flush says so.
-  EXPECT_EQ(flush(*b), makeZerithError("backend httpsPost disabled by server 503 return code", 503));
+  flush(*b);  // answered 503: disabled by the server
   ASSERT_EQ(b->state(), kBackendStateDisabled);
   b->sendMessage(clientEvent(2), at(1001), 1, 0, 0);
   // The refused batch is gone (no spool): lost to the answer.
@@ -145,6 +169,28 @@ TEST_F(HTTPSCountsTest, BatchStillHeldWhenTheBackendGoesIsCountedAsDropped) {
   EXPECT_EQ(counters->get(BackendCount::batched), 2u);
   EXPECT_EQ(counters->get(BackendCount::droppedDisabled), 2u);
   EXPECT_EQ(counters->get(BackendCount::sent), 0u);
+}
+
+TEST_F(HTTPSCountsTest, RecordsCarryADistinctIDOnlyWithTheKey) {
+  auto without = enabled(server.url("/post"));
+  auto envelope = nlohmann::ordered_json::parse(*without->createMessageForPostAndLogging(records(3), nullptr));
+  for (const auto& record : envelope["events"]) {
+    EXPECT_FALSE(record.contains("_recordID")) << record;
+  }
+
+  Defaults("com.velmar.zerith").setObject("spoolEnabled", Value(true));
+  auto with = enabled(server.url("/post"));
+  std::set<std::string> ids;
+  for (int round = 0; round < 2; ++round) {
+    envelope = nlohmann::ordered_json::parse(*with->createMessageForPostAndLogging(records(3), nullptr));
+    for (const auto& record : envelope["events"]) {
+      const std::string id = record.value("_recordID", std::string());
+      EXPECT_EQ(id.size(), 32u) << record;
+      EXPECT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
+      EXPECT_TRUE(ids.insert(id).second) << id;
+    }
+  }
+  EXPECT_EQ(ids.size(), 6u);
 }
 
 TEST_F(HTTPSCountsTest, AnswersCountDeliveredOrLostRecordsWithoutTheSpool) {

@@ -38,30 +38,34 @@ TEST_F(HTTPSPostTest, HeadersGoOutInTheirOrderWithAnIndependentlyCheckedDigest) 
   const auto request = wire.requests().at(0);
   EXPECT_EQ(request.requestLine, "POST /post HTTP/1.1");
 
-  std::vector<std::pair<std::string, std::string>> ours;
-  for (const auto& header : request.headers) {
-    if (header.first != "Host" && header.first != "X-ZTH-Source-Application") {  // the transport's own
-      ours.push_back(header);
+  std::vector<std::string> ours;
+  for (const auto& [name, value] : request.headers) {
+    if (name != "Host" && name != "X-ZTH-Source-Application") {  // the transport's own
+      ours.push_back(name);
     }
   }
+  const std::vector<std::string> expected = {"X-ZTH-Client-Name", "X-ZTH-Service-Name", "X-ZTH-Internal-Build",
+                                             "User-Agent",        "X-ZTH-Client-Version", "X-ZTH-Sender",
+                                             "X-ZTH-Event-Map",   "Accept",              "Content-Type",
+                                             "Content-Length",    "Content-Encoding",    "X-ZTH-DIGEST"};
+  EXPECT_EQ(ours, expected);
+  std::map<std::string, std::string> h(request.headers.begin(), request.headers.end());
+  EXPECT_EQ(h["X-ZTH-Client-Name"], "demo");
+  EXPECT_EQ(h["X-ZTH-Service-Name"], "cli");
+  EXPECT_EQ(h["X-ZTH-Internal-Build"], "1");
+  EXPECT_EQ(h["User-Agent"], "Zerith/8.1 (Board9,1; 12.4)");
+  EXPECT_EQ(h["X-ZTH-Client-Version"], "12");
+  EXPECT_EQ(h["X-ZTH-Sender"], "YJ");
+  EXPECT_EQ(h["X-ZTH-Event-Map"], "3 4");
+  EXPECT_EQ(h["Accept"], "application/json");
+  EXPECT_EQ(h["Content-Type"], "application/json");
+  EXPECT_EQ(h["Content-Length"], std::to_string(request.body.size()));
+  EXPECT_EQ(h["Content-Encoding"], "gzip");
   const std::string json = inflateGzip(request.body);
   ASSERT_FALSE(json.empty());
   EXPECT_LT(request.body.size(), json.size());
-  // In wire order; the digest covers the JSON before compression.
-  const std::vector<std::pair<std::string, std::string>> expected = {
-      {"X-ZTH-Client-Name", "demo"},
-      {"X-ZTH-Service-Name", "cli"},
-      {"X-ZTH-Internal-Build", "1"},
-      {"User-Agent", "Zerith/8.1 (Board9,1; 12.4)"},
-      {"X-ZTH-Client-Version", "12"},
-      {"X-ZTH-Sender", "YJ"},
-      {"X-ZTH-Event-Map", "3 4"},
-      {"Accept", "application/json"},
-      {"Content-Type", "application/json"},
-      {"Content-Length", std::to_string(request.body.size())},
-      {"Content-Encoding", "gzip"},
-      {"X-ZTH-DIGEST", independentDigest(key, json)}};
-  EXPECT_EQ(ours, expected);
+  // The digest covers the JSON before compression.
+  EXPECT_EQ(h["X-ZTH-DIGEST"], independentDigest(key, json));
   EXPECT_EQ(nlohmann::ordered_json::parse(json)["events"][0]["n"], 1);
 }
 
@@ -308,6 +312,26 @@ TEST_F(HTTPSPostTest, SessionEndMessageCarriesConsentAndSamplingFigures) {
   EXPECT_EQ(record["SamplingThreshold"], 1.0);
   EXPECT_EQ(record["OverrideSampling"], -1);
   EXPECT_EQ(record["Batch"], 0);
+}
+
+TEST_F(HTTPSPostTest, ServerErrorDisablesTheBackendAndLaterEventsStopAtOnce) {
+  server.on("/post", Reply{.status = 503});
+  auto b = immediate(server.url("/post"));
+  auto results = ResultLog::make();
+  b->sendMessage(clientEvent(1), at(1001), 1, 0, 1);
+  ASSERT_TRUE(logs.waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"));
+  EXPECT_EQ(b->state(), kBackendStateDisabled);
+  EXPECT_FALSE(b->sendMessage(clientEvent(2), at(1001), 1, 0, 1));
+  EXPECT_EQ(server.requestCount(), 1u);
+
+  // The error reaches a flush's completion with the status as its code.
+  auto batched = batching(server.url("/post"));
+  batched->sendMessage(clientEvent(3), at(1001), 1, 0, 0);
+  batched->flushMessagesWithCompletion(results->handler());
+  ASSERT_TRUE(results->waitFor(1));
+  ASSERT_TRUE(results->errors()[0]);
+  EXPECT_EQ(results->errors()[0]->code, 503);
+  EXPECT_EQ(results->errors()[0]->description, "backend httpsPost disabled by server 503 return code");
 }
 
 TEST_F(HTTPSPostTest, SlowCollectorNeverHoldsUpTheSender) {

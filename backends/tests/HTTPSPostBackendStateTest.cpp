@@ -20,26 +20,33 @@ TEST_F(HTTPSRecordTest, RecordCountsFromTheStartMinuteAndCarriesEveryKeyInOrder)
   Dictionary payload{{"_method", "overwritten"}, {"bytes", 17}};
   const Dictionary record = b->newEventDictfromPayload(Value(payload), at(1010, 250000), 5, 6, 99);
 
+  std::vector<std::string> keys;
+  for (const auto& [key, value] : record) {
+    keys.push_back(key);
+  }
   // Payload keys keep their place; the backend's keys follow in their order.
-  // The event number is the backend's counter, not the argument.
-  const Dictionary expected{{"_method", 5u},
-                            {"bytes", 17},
-                            {"_startTS", 960},
-                            {"_sender", "YJ"},
-                            {"_clientVersion", 12u},
-                            {"_sessionID", 42u},
-                            {"_eventNumber", 0u},
-                            {"_status", 6u},
-                            {"_clientTS", 969.75},
-                            {"eventTime", 969.75},
-                            {"_productFamily", "TestFamily"},
-                            {"_productModel", "Board9,1"},
-                            {"_osVersion", "12.4"},
-                            {"_build", "Z1234"},
-                            {"_internal", 2u},
-                            {"_reportVers", "8.1"},
-                            {"_timezoneOffset", static_cast<long long>(timeZoneOffsetSeconds())}};
-  EXPECT_EQ(record.entries(), expected.entries()) << Value(record).description();
+  const std::vector<std::string> expected = {"_method",        "bytes",       "_startTS",       "_sender",
+                                             "_clientVersion", "_sessionID",  "_eventNumber",   "_status",
+                                             "_clientTS",      "eventTime",   "_productFamily", "_productModel",
+                                             "_osVersion",     "_build",      "_internal",      "_reportVers",
+                                             "_timezoneOffset"};
+  EXPECT_EQ(keys, expected);
+  EXPECT_EQ(record.get("_startTS"), Value(960));
+  EXPECT_EQ(record.get("_sender"), Value("YJ"));
+  EXPECT_EQ(record.get("_clientVersion"), Value(12u));
+  EXPECT_EQ(record.get("_sessionID"), Value(42u));
+  EXPECT_EQ(record.get("_eventNumber"), Value(0u));  // the backend's counter, not the argument
+  EXPECT_EQ(record.get("_method"), Value(5u));
+  EXPECT_EQ(record.get("_status"), Value(6u));
+  EXPECT_DOUBLE_EQ(record.get("_clientTS").doubleValue(), 969.75);
+  EXPECT_EQ(record.get("eventTime"), record.get("_clientTS"));
+  EXPECT_EQ(record.get("_productFamily"), Value("TestFamily"));
+  EXPECT_EQ(record.get("_productModel"), Value("Board9,1"));
+  EXPECT_EQ(record.get("_osVersion"), Value("12.4"));
+  EXPECT_EQ(record.get("_build"), Value("Z1234"));
+  EXPECT_EQ(record.get("_internal"), Value(2u));
+  EXPECT_EQ(record.get("_reportVers"), Value("8.1"));
+  EXPECT_EQ(record.get("_timezoneOffset"), Value(static_cast<long long>(timeZoneOffsetSeconds())));
 }
 
 TEST_F(HTTPSRecordTest, AbsentHardwareTypeLeavesNoModelEvenWhenThePayloadNamedOne) {
@@ -222,6 +229,18 @@ TEST_F(HTTPSStateTest, UserInfoDecidesBetweenUndecidedAndTheCheckedPath) {
   EXPECT_TRUE(logs.contains("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL 'https://x/'"));
   // No entry for this client at all.
   EXPECT_EQ(backend(profileWith({client}), userInfo("mail", "sync"), true)->state(), kBackendStateDisabled);
+}
+
+TEST_F(HTTPSStateTest, PerCountryThresholdReplacesTheGeneralOneForListedCountries) {
+  auto client = enablingClient("https://x/");
+  client.set("sampling_threshold", 0.0);
+  client.set("per_country_sampling_thresholds",
+             Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}),
+                   Value(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", 1.0}})});
+  auto b = backend(profileWith({client}));
+  EXPECT_EQ(b->state(), kBackendStateEnabled);
+  EXPECT_TRUE(logs.contains("HTTPSPostBackend(updateBackendState): sampling threshold for GB changed from 0.00 to 1.00"));
+  EXPECT_EQ(b->samplingThreshold(), Value(1.0));
 }
 
 TEST_F(HTTPSStateTest, SamplingDrawOverManyBackendsStaysWithinBinomialBounds) {
