@@ -195,36 +195,45 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
   Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(12000));
   startQuietDaemon();
   const std::uint64_t idle = rssKiB();
-  std::vector<RawFrameSocket> clients;
-  clients.reserve(10000);
-  for (int i = 0; i < 10000; ++i) {
-    auto c = RawFrameSocket::connect();
-    ASSERT_TRUE(c) << i;
-    clients.push_back(std::move(*c));
-  }
-  auto other = RawFrameSocket::connect();
-  ASSERT_TRUE(other);
-  // Behind the 10,000 in the listener's backlog.
-  EXPECT_TRUE(other->call("fetchDisplayURL:", 1) && other->replyTo(1, 30s));
-  const std::uint64_t held = rssKiB();
-  clients.clear();
-  other.reset();
-  // Every descriptor is given back, and the memory they took is trimmed.
   const auto descriptors = [&] {
     const std::filesystem::path fds = "/proc/" + std::to_string(daemon->pid()) + "/fd";
     return std::distance(std::filesystem::directory_iterator(fds), std::filesystem::directory_iterator());
   };
-  const auto deadline = std::chrono::steady_clock::now() + 60s;  // a sanitizer build closes slowly
-  while (descriptors() > 64 && std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(100ms);
-  }
-  std::this_thread::sleep_for(2s);
-  EXPECT_LE(descriptors(), 64);
-  if (kResidentSizeMeansSomething) {
-    EXPECT_LT(held, idle + (96u << 10)) << "idle " << idle << " KiB";
-  }
-  if (kResidentSizeMeansSomething) {
-    EXPECT_LE(rssKiB(), held) << "idle " << idle << " KiB, with 10,000 open " << held << " KiB";
+  // Twice: the second burst reuses what the first left, and gives it back too.
+  for (int burst = 1; burst <= 2; ++burst) {
+    std::vector<RawFrameSocket> clients;
+    clients.reserve(10000);
+    for (int i = 0; i < 10000; ++i) {
+      auto c = RawFrameSocket::connect();
+      ASSERT_TRUE(c) << i;
+      clients.push_back(std::move(*c));
+    }
+    auto other = RawFrameSocket::connect();
+    ASSERT_TRUE(other);
+    // Behind the 10,000 in the listener's backlog.
+    EXPECT_TRUE(other->call("fetchDisplayURL:", 1) && other->replyTo(1, 30s));
+    const std::uint64_t held = rssKiB();
+    if (kResidentSizeMeansSomething) {
+      EXPECT_LT(held, idle + (96u << 10)) << "idle " << idle << " KiB";
+    }
+    clients.clear();
+    other.reset();
+    // Every descriptor is given back, and the memory they took is trimmed
+    // down to a little above idle (the sessions' last teardown can lag).
+    const auto closing = std::chrono::steady_clock::now() + 60s;  // a sanitizer build closes slowly
+    while (descriptors() > 64 && std::chrono::steady_clock::now() < closing) {
+      std::this_thread::sleep_for(100ms);
+    }
+    const auto trimmed = std::chrono::steady_clock::now() + 15s;
+    const std::uint64_t enough = idle + (16u << 10);
+    while (kResidentSizeMeansSomething && rssKiB() > enough && std::chrono::steady_clock::now() < trimmed) {
+      std::this_thread::sleep_for(100ms);
+    }
+    EXPECT_LE(descriptors(), 64) << "burst " << burst;
+    if (kResidentSizeMeansSomething) {
+      EXPECT_LE(rssKiB(), enough) << "burst " << burst << ": idle " << idle << " KiB, with 10,000 open " << held
+                                  << " KiB";
+    }
   }
 }
 
