@@ -25,6 +25,7 @@
 #include "platform/Executors.h"
 #include "platform/Log.h"
 #include "platform/RateLimitedLog.h"
+#include "platform/ThreadPools.h"
 
 namespace zerith::ipc {
 
@@ -82,14 +83,20 @@ void reserveSocketStates(std::size_t count) {
   if (!placeholder) {
     return;  // without one, states are allocated as connections come
   }
+  // Each socket thread's context has a pool of its own, and connections are
+  // spread over them in turn.
+  const auto contexts = socketContexts();
+  const std::size_t each = (count + contexts.size() - 1) / contexts.size();
   std::vector<asio::posix::stream_descriptor> held;
-  held.reserve(count);
-  for (std::size_t n = 0; n < count; ++n) {
-    std::error_code ec;
-    held.emplace_back(socketContext()).assign(placeholder.get(), ec);
-    if (ec) {
-      held.pop_back();
-      break;
+  held.reserve(each * contexts.size());
+  for (asio::io_context* context : contexts) {
+    for (std::size_t n = 0; n < each; ++n) {
+      std::error_code ec;
+      held.emplace_back(*context).assign(placeholder.get(), ec);
+      if (ec) {
+        held.pop_back();
+        break;
+      }
     }
   }
   for (auto& descriptor : held) {
