@@ -42,11 +42,11 @@ TEST_F(CApiFixture, JsonInAndOut) {
   ASSERT_EQ(zerith_set_session_info(s.get(), R"({"sessionID": 1, "clientType": 7})", nullptr, R"(["A"])", 1), 0);
   Catcher started;
   ASSERT_EQ(zerith_start_config(s.get(), &Catcher::callback, &started), 0);
-  EXPECT_EQ(started.get().reply, std::optional<std::string>(R"({"backends":["httpsPost","dashboard"]})"));
+  EXPECT_EQ(started.get().reply, R"({"backends":["httpsPost","dashboard"]})");
   Catcher sent;
   ASSERT_EQ(zerith_send_message(s.get(), R"({"category": 3, "type": 4, "payload": {"k": [1, 2.5, "x"]}})",
                                 &Catcher::callback, &sent), 0);
-  EXPECT_EQ(sent.get().reply, std::optional<std::string>(R"({"result":"sent"})"));
+  EXPECT_EQ(sent.get().reply, R"({"result":"sent"})");
 
   const auto calls = daemon->waitForClient().session->log.calls();
   ASSERT_GE(calls.size(), 3u);
@@ -74,14 +74,13 @@ TEST_F(CApiFixture, EveryOperationWithACompletionAnswersThroughItsCallback) {
   ASSERT_EQ(zerith_set_digest_key(s.get(), key, sizeof(key), 2), 0);
   ASSERT_EQ(zerith_finish_session(s.get()), 0);
 
-  EXPECT_EQ(states.get().reply, std::optional<std::string>(R"({"backends":["httpsPost","dashboard"]})"));
-  EXPECT_EQ(url.get().reply, std::optional<std::string>(R"({"url":"https://display.example/session"})"));
-  EXPECT_EQ(flush.get().reply, std::optional<std::string>(R"({"result":"flushed"})"));
-  EXPECT_EQ(upload.get().reply, std::optional<std::string>(R"({"success":true,"removeFile":false})"));
-  EXPECT_EQ(uploadLog.get().reply,
-            std::optional<std::string>(
-                R"({"success":false,"error":{"domain":"com.velmar.zerith.ErrorDomain","code":-1,"description":"no upload backend"}})"));
-  EXPECT_EQ(oneShot.get().reply, std::optional<std::string>(R"({"result":"one-shot"})"));
+  EXPECT_EQ(states.get().reply, R"({"backends":["httpsPost","dashboard"]})");
+  EXPECT_EQ(url.get().reply, R"({"url":"https://display.example/session"})");
+  EXPECT_EQ(flush.get().reply, R"({"result":"flushed"})");
+  EXPECT_EQ(upload.get().reply, R"({"success":true,"removeFile":false})");
+  EXPECT_EQ(uploadLog.get().reply, R"({"success":false,"error":{"domain":"com.velmar.zerith.ErrorDomain","code":-1,)"
+                                   R"("description":"no upload backend"}})");
+  EXPECT_EQ(oneShot.get().reply, R"({"result":"one-shot"})");
 
   auto session = daemon->waitForClient().session;
   ASSERT_TRUE(session->log.waitFor(10));
@@ -140,7 +139,7 @@ TEST_F(CApiFixture, FailedCallReportsTheErrorAndInvalidationCallbackRuns) {
   client.connection->invalidate();
   const auto result = url.get();
   EXPECT_FALSE(result.reply);
-  EXPECT_EQ(result.error, std::optional<std::string>("The connection was invalidated"));
+  EXPECT_EQ(result.error, "The connection was invalidated");
   EXPECT_EQ(invalidated.get_future().wait_for(ipc::test::kWait), std::future_status::ready);
 }
 
