@@ -80,7 +80,6 @@ class RecordingObject : public ExportedObject {
   std::function<void(const Message&, std::shared_ptr<Reply>)> answer = [](const Message& m, std::shared_ptr<Reply> r) {
     r->send(m.args);
   };
-  std::function<void()> onCall;  // runs after each recorded call
   // Which calls may be handled on the socket thread (default: none).
   std::function<bool(const Message&)> quick;
 
@@ -92,9 +91,6 @@ class RecordingObject : public ExportedObject {
       calls_.push_back(message);
     }
     answer(message, std::move(reply));
-    if (onCall) {
-      onCall();
-    }
     received.hit();
   }
   std::vector<Message> calls() const {
