@@ -167,7 +167,7 @@ TEST(ZerithConnect, NothingListeningGivesNullAndTheReason) {
             "Cannot connect to " + (root / "/run/zerithd/com.velmar.zerithd").string() + ": No such file or directory");
 }
 
-TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaults) {
+TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaultsReplacingWhatIsNotAString) {
   TempRoot root;
   const std::string yes = Zerith::getPersistentIdentifierForDNU(true);
   const std::string no = Zerith::getPersistentIdentifierForDNU(false);
@@ -179,15 +179,10 @@ TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaults)
   const Defaults defaults("com.velmar.zerith");
   EXPECT_EQ(defaults.objectForKey("PersistentIdentifierForDNU"), Value(yes));
   EXPECT_EQ(defaults.objectForKey("PersistentIdentifier"), Value(no));
-}
-
-TEST(ZerithPersistentIdentifier, AStoredValueThatIsNotAStringIsReplaced) {
-  TempRoot root;
-  const Defaults defaults("com.velmar.zerith");
   ASSERT_TRUE(defaults.setObject(kZerithPersistentIdentifierKey, Value(42)));
-  const std::string id = Zerith::getPersistentIdentifierForDNU(false);
-  EXPECT_TRUE(isUpperCaseUuid(id)) << id;
-  EXPECT_EQ(defaults.objectForKey(kZerithPersistentIdentifierKey), Value(id));
+  const std::string fresh = Zerith::getPersistentIdentifierForDNU(false);
+  EXPECT_TRUE(isUpperCaseUuid(fresh)) << fresh;
+  EXPECT_EQ(defaults.objectForKey(kZerithPersistentIdentifierKey), Value(fresh));
 }
 
 TEST(ZerithBundle, VersionComesFromTheBundleOrFallsBackTo80) {
