@@ -27,7 +27,6 @@ class TestDelegate : public ListenerDelegate {
       std::lock_guard lock(mutex_);
       seen_.push_back(connection);
     }
-    asked.hit();
     connection->setExportedObject(object);
     connection->resume();
     return true;
@@ -41,8 +40,6 @@ class TestDelegate : public ListenerDelegate {
       c->invalidate();
     }
   }
-
-  Counter asked;
 
  private:
   std::mutex mutex_;
