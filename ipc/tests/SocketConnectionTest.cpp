@@ -231,7 +231,7 @@ TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOw
   EXPECT_EQ(matched, kThreads * kCalls);
 }
 
-TEST(SocketConnectionCalls, AWaitedCallEndsWithTheConnectionOrAtItsTimeOut) {
+TEST(SocketConnectionCalls, CallsEndWithTheConnectionOrAtTheirTimeOutAndLaterOnesFailAtOnce) {
   ConnectedPair pair;
   pair.object->answer = [](const Message&, std::shared_ptr<Reply>) {};  // never answers
   pair.serve();
@@ -239,16 +239,26 @@ TEST(SocketConnectionCalls, AWaitedCallEndsWithTheConnectionOrAtItsTimeOut) {
   EXPECT_TRUE(late.timedOut);
   EXPECT_FALSE(late.args);
 
+  // A call waited for and one with a completion, both pending when the
+  // peer goes away.
+  auto pending = callLater(*pair.a, "never-answered", Dictionary{});
   std::thread closer([&] {
-    pair.object->received.waitFor(2);
+    pair.object->received.waitFor(3);
     pair.b->invalidate();
   });
   const auto gone = pair.a->callAndWait("silence", Dictionary{}, kWait);
   closer.join();
   EXPECT_FALSE(gone.timedOut);
   EXPECT_FALSE(gone.args);
-  ASSERT_TRUE(gone.error);
-  EXPECT_EQ(gone.error->description, "The connection was invalidated");
+  EXPECT_EQ(gone.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
+  ASSERT_EQ(pending.wait_for(kWait), std::future_status::ready);
+  const auto result = pending.get();
+  EXPECT_FALSE(result.args);
+  EXPECT_EQ(result.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
+  // A call made afterwards fails at once instead of waiting for ever.
+  const auto after = callAndWait(*pair.a, "after", Dictionary{});
+  ASSERT_TRUE(after.arrived);
+  EXPECT_EQ(after.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
 }
 
 TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
@@ -273,22 +283,6 @@ TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
     EXPECT_EQ(message->call.args.get("n").intValue(), next[static_cast<std::size_t>(t)]++) << "writer " << t << " out of order";
   }
   writers.join();
-}
-
-TEST(SocketConnectionCalls, PendingAndLaterCallsFailWhenThePeerGoesAway) {
-  RawPeer peer;
-  auto pending = callLater(*peer.connection, "never-answered", Dictionary{});
-  ASSERT_TRUE(peer.readMessage());  // the call went out
-  peer.raw.close();                 // the peer disconnects mid-call
-  ASSERT_EQ(pending.wait_for(kWait), std::future_status::ready);
-  const auto result = pending.get();
-  EXPECT_FALSE(result.args);
-  EXPECT_EQ(result.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
-  ASSERT_TRUE(peer.invalidated.waitFor(1));
-  // A call made afterwards fails at once instead of waiting for ever.
-  const auto late = callAndWait(*peer.connection, "late", Dictionary{});
-  ASSERT_TRUE(late.arrived);
-  EXPECT_EQ(late.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
 }
 
 TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
