@@ -43,6 +43,11 @@ Value sessionWith(const char* key, Value value) {
 // `sample()` whose first session has the one backend `backend`.
 Value backendWith(Dictionary backend) { return sessionWith("backends", Value(Array{Value(std::move(backend))})); }
 
+// `sample()` with the one ended total `totals`.
+Value endedWith(Dictionary totals) {
+  return changed([&](Dictionary& top) { top.set("ended", Value(Array{Value(std::move(totals))})); });
+}
+
 TEST(DaemonStatusTest, WhatTheDaemonWritesReadsBackThroughAFrameUnchanged) {
   const Value written = sample().toValue();
   const Data frame = encodeReply(3, Dictionary{{kStatusArgument, written}});
@@ -109,15 +114,9 @@ TEST(DaemonStatusTest, ElementsOfTheWrongShapeAreRefusedWithWhereAndWhy) {
        "counts.sent is 9223372036854775808, not an integer from 0 to 9223372036854775807"},
       {"counts missing", backendWith(Dictionary{{"name", "b"}, {"state", 2}}),
        "status.sessions[0].backends[0].counts is missing"},
-      {"too many counts", changed([&](Dictionary& d) {
-         Array ended{Value(Dictionary{{"clientType", 7}, {"backend", "b"}, {"sessions", 1}, {"counts", manyCounts}})};
-         d.set("ended", Value(std::move(ended)));
-       }),
+      {"too many counts", endedWith({{"clientType", 7}, {"backend", "b"}, {"sessions", 1}, {"counts", manyCounts}}),
        "status.ended[0].counts has 65 entries, more than 64"},
-      {"ended sessions as text", changed([](Dictionary& d) {
-         Array ended{Value(Dictionary{{"clientType", 7}, {"backend", "b"}, {"sessions", "1"}, {"counts", Dictionary{}}})};
-         d.set("ended", Value(std::move(ended)));
-       }),
+      {"ended sessions as text", endedWith({{"clientType", 7}, {"backend", "b"}, {"sessions", "1"}, {"counts", Dictionary{}}}),
        "status.ended[0].sessions is"},
   };
   for (const Case& c : cases) {

@@ -23,6 +23,23 @@ std::vector<Data> drain(FrameDecoder& decoder) {
   }
 }
 
+// The messages of `frames`, read back through one decoder.
+std::vector<IncomingMessage> readBack(std::initializer_list<Data> frames) {
+  FrameDecoder decoder;
+  for (const Data& f : frames) {
+    decoder.append(f.data(), f.size());
+  }
+  std::vector<IncomingMessage> out;
+  for (const Data& body : drain(decoder)) {
+    std::string why;
+    const auto m = decodeMessage(plist::bytesOf(body), &why);
+    EXPECT_TRUE(m) << why;
+    out.push_back(m.value_or(IncomingMessage{}));
+  }
+  EXPECT_EQ(out.size(), frames.size());
+  return out;
+}
+
 TEST(FrameCodec, AFrameIsABigEndianLengthAndABinaryPropertyList) {
   const Data frame = encodeCall("fetchDisplayURL:", 3, Dictionary{});
   ASSERT_GT(frame.size(), 12u);
@@ -35,27 +52,16 @@ TEST(FrameCodec, AFrameIsABigEndianLengthAndABinaryPropertyList) {
 }
 
 TEST(FrameCodec, CallsAndRepliesSurviveTheRoundTrip) {
-  FrameDecoder decoder;
   const Dictionary args{{"payload", Dictionary{{"d", Data{0, 255}}, {"r", -2.5}, {"big", 1LL << 62}}}};
-  for (const Data& f : {encodeCall("op:", std::nullopt, args), encodeCall("op:", 1ull << 40, args), encodeReply(9, args),
-                        encodeErrorReply(10, Error{"dom", -3, "why"})}) {
-    decoder.append(f.data(), f.size());
-  }
-  const auto bodies = drain(decoder);
-  ASSERT_EQ(bodies.size(), 4u);
-  auto m0 = decodeMessage(plist::bytesOf(bodies[0]));
-  auto m1 = decodeMessage(plist::bytesOf(bodies[1]));
-  auto m2 = decodeMessage(plist::bytesOf(bodies[2]));
-  auto m3 = decodeMessage(plist::bytesOf(bodies[3]));
-  ASSERT_TRUE(m0 && m1 && m2 && m3);
-  EXPECT_FALSE(m0->call.call);
-  EXPECT_EQ(m0->call.args, args);
-  EXPECT_EQ(m1->call.call, 1ull << 40);
-  EXPECT_EQ(m2->kind, IncomingMessage::Kind::Reply);
-  EXPECT_EQ(m2->replyTo, 9u);
-  EXPECT_EQ(m2->replyArgs, args);
-  EXPECT_FALSE(m2->replyError);
-  EXPECT_EQ(m3->replyError, (Error{"dom", -3, "why"}));
+  const auto m = readBack({encodeCall("op:", std::nullopt, args), encodeCall("op:", 1ull << 40, args),
+                           encodeReply(9, args), encodeErrorReply(10, Error{"dom", -3, "why"})});
+  ASSERT_EQ(m.size(), 4u);
+  EXPECT_FALSE(m[0].call.call);
+  EXPECT_EQ(m[0].call.args, args);
+  EXPECT_EQ(m[1].call.call, 1ull << 40);
+  EXPECT_EQ(std::make_tuple(m[2].kind, m[2].replyTo, m[2].replyArgs, m[2].replyError),
+            std::make_tuple(IncomingMessage::Kind::Reply, 9u, args, std::optional<Error>()));
+  EXPECT_EQ(m[3].replyError, (Error{"dom", -3, "why"}));
 }
 
 TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
@@ -63,42 +69,29 @@ TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
   const std::uint64_t wide = 0x1234567890abcdefull;
   EXPECT_EQ(encodeReply(wide, Dictionary{}),
             encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(wide))}, {"args", Dictionary{}}})));
-  FrameDecoder decoder;
-  const std::vector<std::uint64_t> numbers{0,           1,           255,        256,     65535, 65536, 0xffffffffull,
-                                           1ull << 32,  1ull << 40,  wide,       static_cast<std::uint64_t>(INT64_MAX)};
-  for (const std::uint64_t n : numbers) {
-    const Data frame = encodeReply(n, Dictionary{});
-    decoder.append(frame.data(), frame.size());
-  }
-  const auto bodies = drain(decoder);
-  ASSERT_EQ(bodies.size(), numbers.size());
-  for (std::size_t i = 0; i < numbers.size(); ++i) {
-    std::string why;
-    const auto m = decodeMessage(plist::bytesOf(bodies[i]), &why);
-    ASSERT_TRUE(m) << numbers[i] << ": " << why;
-    EXPECT_EQ(m->kind, IncomingMessage::Kind::Reply);
-    EXPECT_EQ(m->replyTo, numbers[i]);
-    EXPECT_TRUE(m->replyArgs.empty());
-    EXPECT_FALSE(m->replyError);
+  for (const std::uint64_t n : std::initializer_list<std::uint64_t>{0, 1, 255, 256, 65535, 65536, 0xffffffffull, 1ull << 32,
+                                                                     1ull << 40, wide, INT64_MAX}) {
+    const auto m = readBack({encodeReply(n, Dictionary{})});
+    ASSERT_EQ(m.size(), 1u);
+    EXPECT_EQ(std::make_tuple(m[0].kind, m[0].replyTo, m[0].replyArgs, m[0].replyError),
+              std::make_tuple(IncomingMessage::Kind::Reply, n, Dictionary{}, std::optional<Error>()));
   }
   // Arguments without a value are left out: a property list has no nil.
   const Dictionary nils{{"result", Value()}, {"error", Value()}};
   EXPECT_EQ(encodeReply(wide, nils),
             encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(wide))}, {"args", Value(nils)}})));
   // Replies with arguments are still written whole.
-  const Data frame = encodeReply(7, Dictionary{{"result", "r"}});
-  const auto withArgs = decodeMessage(plist::Bytes(frame.data() + 4, frame.size() - 4));
-  ASSERT_TRUE(withArgs);
-  EXPECT_EQ(withArgs->replyArgs, (Dictionary{{"result", "r"}}));
+  const auto withArgs = readBack({encodeReply(7, Dictionary{{"result", "r"}})});
+  ASSERT_EQ(withArgs.size(), 1u);
+  EXPECT_EQ(withArgs[0].replyArgs, (Dictionary{{"result", "r"}}));
 }
 
 TEST(FrameCodec, DatesBeyondThirtyTwoBitSecondsAreClampedNotOverflowed) {
   // A client can send any date; answering with it must not overflow.
-  const Data frame = encodeReply(1, Dictionary{{"late", Value(Date{1e15})}, {"early", Value(Date{-1e15})}});
-  const auto message = decodeMessage(plist::Bytes(frame.data() + 4, frame.size() - 4));
-  ASSERT_TRUE(message);
-  EXPECT_EQ(message->replyArgs.get("late").date()->secondsSince1970, 2147483647.0 + 978307200.0);
-  EXPECT_EQ(message->replyArgs.get("early").date()->secondsSince1970, -2147483648.0 + 978307200.0);
+  const auto m = readBack({encodeReply(1, Dictionary{{"late", Value(Date{1e15})}, {"early", Value(Date{-1e15})}})});
+  ASSERT_EQ(m.size(), 1u);
+  EXPECT_EQ(m[0].replyArgs, (Dictionary{{"late", Value(Date{2147483647.0 + 978307200.0})},
+                                        {"early", Value(Date{-2147483648.0 + 978307200.0})}}));
 }
 
 TEST(FrameDecoderTest, FramesCutAtEveryPossiblePlaceComeOutWholeAndInOrder) {

@@ -15,6 +15,7 @@
 #include <functional>
 #include <future>
 #include <mutex>
+#include <thread>
 #include <vector>
 
 #include "ipc/Frame.h"
@@ -79,7 +80,6 @@ class RecordingObject : public ExportedObject {
   std::function<void(const Message&, std::shared_ptr<Reply>)> answer = [](const Message& m, std::shared_ptr<Reply> r) {
     r->send(m.args);
   };
-  std::function<void()> onCall;  // runs after each recorded call
   // Which calls may be handled on the socket thread (default: none).
   std::function<bool(const Message&)> quick;
 
@@ -91,9 +91,6 @@ class RecordingObject : public ExportedObject {
       calls_.push_back(message);
     }
     answer(message, std::move(reply));
-    if (onCall) {
-      onCall();
-    }
     received.hit();
   }
   std::vector<Message> calls() const {
@@ -115,6 +112,12 @@ inline std::optional<IncomingMessage> readIncoming(RawFrameSocket& raw, std::chr
   return body ? decodeMessage(*body, &why) : std::nullopt;
 }
 
+inline std::pair<file::UniqueFd, file::UniqueFd> socketPair() {
+  int fds[2];
+  EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+  return {file::UniqueFd(fds[0]), file::UniqueFd(fds[1])};
+}
+
 // One end of a socket pair as a real connection, the other end raw.
 struct RawPeer {
   std::shared_ptr<SocketConnection> connection;
@@ -122,7 +125,8 @@ struct RawPeer {
   std::shared_ptr<RecordingObject> object = std::make_shared<RecordingObject>();
   Counter invalidated;
 
-  RawPeer() : RawPeer(socketPair()) {}
+  // Not resumed: nothing is delivered until the test resumes the connection.
+  explicit RawPeer(bool resume = true) : RawPeer(socketPair(), resume) {}
   ~RawPeer() {
     if (connection) {
       connection->invalidate();
@@ -136,21 +140,24 @@ struct RawPeer {
   std::optional<IncomingMessage> readMessage(std::chrono::milliseconds timeout = kWait) {
     return readIncoming(raw, timeout);
   }
+  // The call number the next frame answers; nullopt when none comes or it is
+  // not a reply.
+  std::optional<std::uint64_t> nextReplyTo() {
+    const auto m = readMessage();
+    return m && m->kind == IncomingMessage::Kind::Reply ? std::optional(m->replyTo) : std::nullopt;
+  }
   // True when the connection closed its end (EOF) before the time-out.
   bool seesEof(std::chrono::milliseconds timeout = kWait) { return raw.waitClosed(timeout); }
 
  private:
-  static std::pair<file::UniqueFd, file::UniqueFd> socketPair() {
-    int fds[2];
-    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
-    return {file::UniqueFd(fds[0]), file::UniqueFd(fds[1])};
-  }
-  explicit RawPeer(std::pair<file::UniqueFd, file::UniqueFd> ends) : raw(std::move(ends.second), 64u << 20) {
+  RawPeer(std::pair<file::UniqueFd, file::UniqueFd> ends, bool resume) : raw(std::move(ends.second), 64u << 20) {
     const PeerCredentials peer = *readPeerCredentials(ends.first.get());
     connection = SocketConnection::adopt(std::move(ends.first), peer, Dictionary());
     connection->setExportedObject(object);
     connection->setInvalidationHandler([this] { invalidated.hit(); });
-    connection->resume();
+    if (resume) {
+      connection->resume();
+    }
   }
 };
 
@@ -168,11 +175,10 @@ struct ConnectedPair {
   }
 
   ConnectedPair() {
-    int fds[2];
-    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
-    const PeerCredentials peer = *readPeerCredentials(fds[0]);
-    a = SocketConnection::adopt(file::UniqueFd(fds[0]), peer, Dictionary());
-    b = SocketConnection::adopt(file::UniqueFd(fds[1]), peer, Dictionary());
+    auto [ours, theirs] = socketPair();
+    const PeerCredentials peer = *readPeerCredentials(ours.get());
+    a = SocketConnection::adopt(std::move(ours), peer, Dictionary());
+    b = SocketConnection::adopt(std::move(theirs), peer, Dictionary());
   }
   ~ConnectedPair() {
     a->invalidate();
@@ -187,17 +193,18 @@ struct CallResult {
   std::optional<Error> error;
 };
 
-inline CallResult callAndWait(Connection& connection, const std::string& op, Dictionary args,
-                              std::chrono::milliseconds timeout = kWait) {
+inline std::future<CallResult> callLater(Connection& connection, const std::string& op, Dictionary args) {
   auto promise = std::make_shared<std::promise<CallResult>>();
-  auto future = promise->get_future();
   connection.call(op, std::move(args), [promise](std::optional<Dictionary> a, std::optional<Error> e) {
     promise->set_value(CallResult{true, std::move(a), std::move(e)});
   });
-  if (future.wait_for(timeout) != std::future_status::ready) {
-    return CallResult{};
-  }
-  return future.get();
+  return promise->get_future();
+}
+
+inline CallResult callAndWait(Connection& connection, const std::string& op, Dictionary args,
+                              std::chrono::milliseconds timeout = kWait) {
+  auto future = callLater(connection, op, std::move(args));
+  return future.wait_for(timeout) == std::future_status::ready ? future.get() : CallResult{};
 }
 
 // A socket bound at `path` and listening with `backlog` (0: bound only, as a
@@ -220,6 +227,27 @@ inline Data concat(std::initializer_list<Data> parts) {
     out.insert(out.end(), p.begin(), p.end());
   }
   return out;
+}
+
+// The frames make(0) .. make(n - 1) back to back, as one write.
+inline Data framesOf(int n, const std::function<Data(int)>& make) {
+  Data out;
+  for (int i = 0; i < n; ++i) {
+    const Data frame = make(i);
+    out.insert(out.end(), frame.begin(), frame.end());
+  }
+  return out;
+}
+
+// Runs fn(0) .. fn(n - 1) on n threads at once and joins them all.
+inline void onThreads(int n, const std::function<void(int)>& fn) {
+  std::vector<std::thread> threads;
+  for (int i = 0; i < n; ++i) {
+    threads.emplace_back(fn, i);
+  }
+  for (auto& t : threads) {
+    t.join();
+  }
 }
 
 }  // namespace zerith::ipc::test

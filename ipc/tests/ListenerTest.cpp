@@ -27,7 +27,6 @@ class TestDelegate : public ListenerDelegate {
       std::lock_guard lock(mutex_);
       seen_.push_back(connection);
     }
-    asked.hit();
     connection->setExportedObject(object);
     connection->resume();
     return true;
@@ -42,11 +41,28 @@ class TestDelegate : public ListenerDelegate {
     }
   }
 
-  Counter asked;
-
  private:
   std::mutex mutex_;
   std::vector<std::shared_ptr<Connection>> seen_;
+};
+
+// A resumed client connection to `path`, ended with the test.
+struct Client {
+  std::shared_ptr<SocketConnection> connection;
+  explicit Client(const std::filesystem::path& path = paths::socketPath()) : connection(SocketConnection::connect(path)) {
+    EXPECT_TRUE(connection) << path;
+    if (connection) {
+      connection->resume();
+    }
+  }
+  ~Client() {
+    if (connection) {
+      connection->invalidate();
+    }
+  }
+  CallResult call(const std::string& op, Dictionary args = {}, std::chrono::milliseconds timeout = kWait) {
+    return connection ? callAndWait(*connection, op, std::move(args), timeout) : CallResult{};
+  }
 };
 
 void writePolicy(const zerith::test::TempRoot& root, const std::string& name, const std::string& body) {
@@ -79,19 +95,15 @@ TEST_F(ListenerFixture, AcceptedClientIsServedWithTheEntitlementsThePolicyGrants
   ASSERT_EQ(::lstat(paths::socketPath().c_str(), &st), 0);
   EXPECT_TRUE(S_ISSOCK(st.st_mode));
   EXPECT_EQ(st.st_mode & 0777, 0666u);
-  auto client = SocketConnection::connect(paths::socketPath());
-  ASSERT_TRUE(client);
-  client->resume();
-  const auto result = callAndWait(*client, "hello", Dictionary{{"x", 1}});
-  ASSERT_TRUE(result.args);
-  EXPECT_EQ(*result.args, (Dictionary{{"x", 1}}));
+  Client client;
+  ASSERT_TRUE(client.connection);
+  EXPECT_EQ(client.call("hello", Dictionary{{"x", 1}}).args, (Dictionary{{"x", 1}}));
   auto server = delegate.last();
   ASSERT_TRUE(server);
   EXPECT_EQ(server->valueForEntitlement(kZerithdEntitlement), Value(true));
   EXPECT_EQ(server->peer().pid, ::getpid());
   // The client knows the listener's credentials too.
-  EXPECT_EQ(client->peer().pid, ::getpid());
-  client->invalidate();
+  EXPECT_EQ(client.connection->peer().pid, ::getpid());
 }
 
 TEST_F(ListenerFixture, StaleSocketFileIsReplaced) {
@@ -102,11 +114,7 @@ TEST_F(ListenerFixture, StaleSocketFileIsReplaced) {
   // A listener that died without cleaning up leaves a socket nobody serves.
   boundSocket(paths::socketPath().string(), 0);
   start();
-  auto client = SocketConnection::connect(paths::socketPath());
-  ASSERT_TRUE(client);
-  client->resume();
-  EXPECT_TRUE(callAndWait(*client, "x", Dictionary{}).args);
-  client->invalidate();
+  EXPECT_TRUE(Client().call("x").args);
 }
 
 TEST_F(ListenerFixture, ALiveListenerIsNotStolenARegularFileIsNotDeletedAndAnOverlongPathFails) {
@@ -128,39 +136,31 @@ TEST_F(ListenerFixture, ALiveListenerIsNotStolenARegularFileIsNotDeletedAndAnOve
 
 TEST_F(ListenerFixture, StopEndsAcceptingButExistingConnectionsGoOn) {
   start();
-  auto client = SocketConnection::connect(paths::socketPath());
-  ASSERT_TRUE(client);
-  client->resume();
-  ASSERT_TRUE(callAndWait(*client, "before", Dictionary{}).args);
+  Client client;
+  ASSERT_TRUE(client.call("before").args);
   listener->stop();
   EXPECT_FALSE(std::filesystem::exists(paths::socketPath()));
   Error error;
   EXPECT_EQ(SocketConnection::connect(paths::socketPath(), &error), nullptr);
-  const auto after = callAndWait(*client, "after", Dictionary{});
-  ASSERT_TRUE(after.args) << "an existing connection stopped with the listener";
-  client->invalidate();
+  EXPECT_TRUE(client.call("after").args) << "an existing connection stopped with the listener";
 }
 
 TEST_F(ListenerFixture, ManyClientsAtOnceAreAllServed) {
   start();
   constexpr int kClients = 24;
-  std::vector<std::shared_ptr<SocketConnection>> clients;
+  std::vector<std::unique_ptr<Client>> clients;
+  std::vector<std::future<CallResult>> calls;
   for (int i = 0; i < kClients; ++i) {
-    clients.push_back(SocketConnection::connect(paths::socketPath()));
-    ASSERT_TRUE(clients.back());
-    clients.back()->resume();
+    clients.push_back(std::make_unique<Client>());
+    ASSERT_TRUE(clients.back()->connection);
   }
-  Counter answered;
   for (int i = 0; i < kClients; ++i) {
-    clients[static_cast<std::size_t>(i)]->call("n", Dictionary{{"i", i}}, [&, i](std::optional<Dictionary> a, std::optional<Error>) {
-      if (a && a->get("i").intValue() == i) {
-        answered.hit();
-      }
-    });
+    calls.push_back(callLater(*clients[static_cast<std::size_t>(i)]->connection, "n", Dictionary{{"i", i}}));
   }
-  EXPECT_TRUE(answered.waitFor(kClients));
-  for (auto& c : clients) {
-    c->invalidate();
+  for (int i = 0; i < kClients; ++i) {
+    auto& call = calls[static_cast<std::size_t>(i)];
+    ASSERT_EQ(call.wait_for(kWait), std::future_status::ready) << i;
+    EXPECT_EQ(call.get().args, (Dictionary{{"i", i}}));
   }
 }
 
@@ -206,13 +206,8 @@ TEST(ListenerActivation, ServesTheSocketTheServiceManagerPassesIn) {
   }
   // Connecting works as soon as the socket listens; the call is answered
   // once the child has taken the socket over.
-  auto client = SocketConnection::connect(path);
-  ASSERT_TRUE(client);
-  client->resume();
-  const auto result = callAndWait(*client, "via-activation", Dictionary{{"n", 1}}, 30s);
-  ASSERT_TRUE(result.args) << "the activated listener did not answer";
-  EXPECT_EQ(*result.args, (Dictionary{{"n", 1}}));
-  client->invalidate();
+  EXPECT_EQ(Client(path).call("via-activation", Dictionary{{"n", 1}}, 30s).args, (Dictionary{{"n", 1}}))
+      << "the activated listener did not answer";
   int status = 0;
   ASSERT_EQ(::waitpid(child, &status, 0), child);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "child status " << status;

@@ -39,59 +39,33 @@ TEST(SocketConnectionFraming, CallSentOneByteAtATimeIsDeliveredWholeAndAnswered)
 // A binary property list {key: value} with both as 8-bit "ASCII" strings,
 // written by hand because libplist's writer would repair the bytes.
 Data oneEntryBinaryDictionary(const std::string& key, const std::string& value) {
-  Data d{'b', 'p', 'l', 'i', 's', 't', '0', '0'};
-  const std::uint8_t dictAt = static_cast<std::uint8_t>(d.size());
-  d.insert(d.end(), {0xd1, 0x01, 0x02});
-  const std::uint8_t keyAt = static_cast<std::uint8_t>(d.size());
+  Data d{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0xd1, 0x01, 0x02};
+  const auto keyAt = static_cast<std::uint8_t>(d.size());
   d.push_back(static_cast<std::uint8_t>(0x50 | key.size()));
   d.insert(d.end(), key.begin(), key.end());
-  const std::uint8_t valueAt = static_cast<std::uint8_t>(d.size());
+  const auto valueAt = static_cast<std::uint8_t>(d.size());
   d.push_back(static_cast<std::uint8_t>(0x50 | value.size()));
   d.insert(d.end(), value.begin(), value.end());
-  const std::uint8_t tableAt = static_cast<std::uint8_t>(d.size());
-  d.insert(d.end(), {dictAt, keyAt, valueAt});
-  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 1, 1});  // offset and reference sizes
-  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 0, 3});  // objects
-  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 0, 0});  // top object
-  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 0, tableAt});
+  const auto tableAt = static_cast<std::uint8_t>(d.size());
+  // The offset table, then the trailer: offset and reference sizes, three
+  // objects, the top one first, the table's place.
+  d.insert(d.end(), {8, keyAt, valueAt, 0, 0, 0, 0, 0, 0, 1, 1, 0, 0, 0, 0, 0, 0, 0, 3});
+  d.insert(d.end(), {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, tableAt});
   return d;
 }
 
 struct BadInput {
   const char* name;
   Data bytes;
-  std::string why;
+  std::string why;  // empty: libplist's own reason
 };
 
-class SocketConnectionBadFrame : public ::testing::TestWithParam<int> {};
+Data framed(const Value& v) { return frameWithBody(plist::encodeBinary(v)); }
 
-std::vector<BadInput> badInputs() {
-  const Data xml = bytesOfText(plist::encodeXml(Value(Dictionary{{"op", "echo"}})));
-  return {
-      {"oversized length", Data{0x00, 0x40, 0x00, 0x01, 'b', 'p'}, "frame of 4194305 bytes exceeds the limit of 4194304"},
-      {"zero length", Data{0, 0, 0, 0}, "empty frame"},
-      {"not a property list", frameWithBody(bytesOfText("hello, daemon")), "frame body is not a binary property list"},
-      {"XML body", frameWithBody(xml), "frame body is not a binary property list"},
-      {"array message", frameWithBody(plist::encodeBinary(Value(Array{Value("op")}))), "message is an array, not a dictionary"},
-      {"string op missing", frameWithBody(plist::encodeBinary(Value(Dictionary{{"call", 1}}))),
-       "message has neither \"op\" nor \"reply\""},
-      {"numeric op", frameWithBody(plist::encodeBinary(Value(Dictionary{{"op", 5}}))), "message \"op\" is an integer, not a string"},
-      {"negative call number", frameWithBody(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"call", -1}}))),
-       "message \"call\" is not an unsigned integer"},
-      {"args not a dictionary", frameWithBody(plist::encodeBinary(Value(Dictionary{{"op", "x"}, {"args", Array{}}}))),
-       "message \"args\" is an array, not a dictionary"},
-      {"truncated binary list", frameWithBody(Data{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x08}), ""},
-      // libplist would pass such text on cut short at the bad byte.
-      {"operation not UTF-8", frameWithBody(oneEntryBinaryDictionary("op", "se\xffSession:")),
-       "message holds text that is not valid UTF-8"},
-      {"key not UTF-8 (overlong form)", frameWithBody(oneEntryBinaryDictionary("o\xc0\xafp", "x")),
-       "message holds text that is not valid UTF-8"},
-  };
-}
+class SocketConnectionBadFrame : public ::testing::TestWithParam<BadInput> {};
 
 TEST_P(SocketConnectionBadFrame, ClosesThatConnectionWithAnErrorLogAndDeliversNothing) {
-  const BadInput input = badInputs()[static_cast<std::size_t>(GetParam())];
-  SCOPED_TRACE(input.name);
+  const BadInput& input = GetParam();
   log::LogCapture capture;
   RawPeer peer;
   RawPeer bystander;
@@ -99,21 +73,38 @@ TEST_P(SocketConnectionBadFrame, ClosesThatConnectionWithAnErrorLogAndDeliversNo
   EXPECT_TRUE(peer.seesEof()) << "the connection stayed open";
   ASSERT_TRUE(peer.invalidated.waitFor(1));
   EXPECT_TRUE(peer.object->calls().empty());
-  if (!input.why.empty()) {
-    EXPECT_TRUE(capture.has(log::Level::Error, closingLine(*peer.connection, input.why)))
-        << "expected: " << closingLine(*peer.connection, input.why);
-  } else {
-    EXPECT_TRUE(capture.contains(peer.connection->description() + ": closing connection: frame body does not parse"));
-  }
+  const std::string line = closingLine(*peer.connection, input.why.empty() ? "frame body does not parse" : input.why);
+  EXPECT_TRUE(input.why.empty() ? capture.contains(line) : capture.has(log::Level::Error, line)) << "expected: " << line;
   // Another connection goes on.
   bystander.write(callFrame("still-here", 1));
-  const auto reply = bystander.readMessage();
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->replyTo, 1u);
+  EXPECT_EQ(bystander.nextReplyTo(), 1u);
   EXPECT_EQ(bystander.invalidated.count(), 0);
 }
 
-INSTANTIATE_TEST_SUITE_P(Inputs, SocketConnectionBadFrame, ::testing::Range(0, 12));
+INSTANTIATE_TEST_SUITE_P(
+    Inputs, SocketConnectionBadFrame,
+    ::testing::Values(
+        BadInput{"OversizedLength", Data{0x00, 0x40, 0x00, 0x01, 'b', 'p'},
+                 "frame of 4194305 bytes exceeds the limit of 4194304"},
+        BadInput{"ZeroLength", Data{0, 0, 0, 0}, "empty frame"},
+        BadInput{"NotAPropertyList", frameWithBody(bytesOfText("hello, daemon")),
+                 "frame body is not a binary property list"},
+        BadInput{"XmlBody", frameWithBody(bytesOfText(plist::encodeXml(Value(Dictionary{{"op", "echo"}})))),
+                 "frame body is not a binary property list"},
+        BadInput{"ArrayMessage", framed(Value(Array{Value("op")})), "message is an array, not a dictionary"},
+        BadInput{"StringOpMissing", framed(Value(Dictionary{{"call", 1}})), "message has neither \"op\" nor \"reply\""},
+        BadInput{"NumericOp", framed(Value(Dictionary{{"op", 5}})), "message \"op\" is an integer, not a string"},
+        BadInput{"NegativeCallNumber", framed(Value(Dictionary{{"op", "x"}, {"call", -1}})),
+                 "message \"call\" is not an unsigned integer"},
+        BadInput{"ArgsNotADictionary", framed(Value(Dictionary{{"op", "x"}, {"args", Array{}}})),
+                 "message \"args\" is an array, not a dictionary"},
+        BadInput{"TruncatedBinaryList", frameWithBody(Data{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x08}), ""},
+        // libplist would pass such text on cut short at the bad byte.
+        BadInput{"OperationNotUtf8", frameWithBody(oneEntryBinaryDictionary("op", "se\xffSession:")),
+                 "message holds text that is not valid UTF-8"},
+        BadInput{"KeyNotUtf8OverlongForm", frameWithBody(oneEntryBinaryDictionary("o\xc0\xafp", "x")),
+                 "message holds text that is not valid UTF-8"}),
+    [](const auto& info) { return std::string(info.param.name); });
 
 TEST(SocketConnectionFraming, FramesOfOneWriteArriveInOrderUpToABadFrameAndNoneAfterIt) {
   log::LogCapture capture;
@@ -124,11 +115,9 @@ TEST(SocketConnectionFraming, FramesOfOneWriteArriveInOrderUpToABadFrameAndNoneA
   ASSERT_TRUE(peer.invalidated.waitFor(1));
   const auto calls = peer.object->calls();
   ASSERT_EQ(calls.size(), 3u);
-  EXPECT_EQ(calls[0].operation, "a");
+  EXPECT_EQ(calls[0].operation + calls[1].operation + calls[2].operation, "abc");
   EXPECT_FALSE(calls[0].call);
-  EXPECT_EQ(calls[1].operation, "b");
   EXPECT_EQ(calls[1].call, 1u);
-  EXPECT_EQ(calls[2].operation, "c");
 }
 
 TEST(SocketConnectionFraming, PeerEndingInsideAFrameIsLoggedAndInvalidatesOnce) {
@@ -159,9 +148,8 @@ TEST(SocketConnectionFraming, ABodyJustUnderTheLimitPassesAndTheConnectionWrites
 TEST(SocketConnectionFraming, AReplyWithAnUnknownCallNumberIsLoggedAndTheConnectionGoesOn) {
   log::LogCapture capture;
   RawPeer peer;
-  peer.write(encodeReply(4242, Dictionary{}));
-  peer.write(callFrame("after", 1));
-  ASSERT_TRUE(peer.readMessage());
+  peer.write(concat({encodeReply(4242, Dictionary{}), callFrame("after", 1)}));
+  EXPECT_EQ(peer.nextReplyTo(), 1u);
   EXPECT_TRUE(capture.has(log::Level::Error, peer.connection->description() + ": reply to unknown call 4242"));
   EXPECT_EQ(peer.invalidated.count(), 0);
 }
@@ -173,22 +161,24 @@ TEST(SocketConnectionFraming, ACallWithoutAnExportedObjectGetsAnErrorReply) {
   peer.write(callFrame("anything", 3));
   const auto reply = peer.readMessage();
   ASSERT_TRUE(reply);
-  ASSERT_TRUE(reply->replyError);
-  EXPECT_EQ(*reply->replyError, (Error{kErrorDomain, -1, "No object is exported on this connection"}));
+  EXPECT_EQ(reply->replyError, (Error{kErrorDomain, -1, "No object is exported on this connection"}));
   EXPECT_TRUE(capture.has(log::Level::Error, peer.connection->description() + ": no object is exported for \"anything\""));
 }
 
 // ---- calls, replies and writers ---------------------------------------------------
 
+bool answersCall(const std::optional<Dictionary>& args, int caller, int n) {
+  return args && args->get("caller").intValue() == caller && args->get("n").intValue() == n;
+}
+
 TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
   ConnectedPair pair;
   // The answering side keeps every reply and sends them back in reverse.
-  auto object = std::make_shared<RecordingObject>();
   std::mutex held;
   std::vector<std::pair<Message, std::shared_ptr<Reply>>> waiting;
   constexpr int kThreads = 8;
   constexpr int kCalls = 25;
-  object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
+  pair.object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
     std::vector<std::pair<Message, std::shared_ptr<Reply>>> all;
     {
       std::lock_guard lock(held);
@@ -198,35 +188,23 @@ TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
       }
     }
     for (auto it = all.rbegin(); it != all.rend(); ++it) {
-      it->second->send(Dictionary{{"caller", it->first.args.get("caller")}, {"n", it->first.args.get("n")}});
+      it->second->send(it->first.args);
     }
   };
   pair.serve();
 
   std::atomic<int> matched{0};
-  std::atomic<int> wrong{0};
   Counter done;
-  std::vector<std::thread> threads;
-  for (int t = 0; t < kThreads; ++t) {
-    threads.emplace_back([&, t] {
-      for (int n = 0; n < kCalls; ++n) {
-        pair.a->call("work", Dictionary{{"caller", t}, {"n", n}}, [&, t, n](std::optional<Dictionary> args, std::optional<Error>) {
-          if (args && args->get("caller").intValue() == t && args->get("n").intValue() == n) {
-            ++matched;
-          } else {
-            ++wrong;
-          }
-          done.hit();
-        });
-      }
-    });
-  }
-  for (auto& th : threads) {
-    th.join();
-  }
+  onThreads(kThreads, [&](int t) {
+    for (int n = 0; n < kCalls; ++n) {
+      pair.a->call("work", Dictionary{{"caller", t}, {"n", n}}, [&, t, n](std::optional<Dictionary> args, std::optional<Error>) {
+        matched += answersCall(args, t, n);
+        done.hit();
+      });
+    }
+  });
   ASSERT_TRUE(done.waitFor(kThreads * kCalls));
   EXPECT_EQ(matched, kThreads * kCalls);
-  EXPECT_EQ(wrong, 0);
   pair.b->queue().sync([] {});  // the answering turn has finished with the locals
 }
 
@@ -244,62 +222,57 @@ TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOw
     pairs.back()->serve();
   }
   std::atomic<int> matched{0};
-  std::atomic<int> wrong{0};
-  std::vector<std::thread> threads;
-  for (int t = 0; t < kThreads; ++t) {
-    threads.emplace_back([&, t] {
-      for (int n = 0; n < kCalls; ++n) {
-        auto& pair = *pairs[static_cast<std::size_t>((t + n) % kPairs)];
-        const auto reply = pair.a->callAndWait("work", Dictionary{{"caller", t}, {"n", n}}, kWait);
-        if (reply.args && reply.args->get("caller").intValue() == t && reply.args->get("n").intValue() == n) {
-          ++matched;
-        } else {
-          ++wrong;
-        }
-      }
-    });
-  }
-  for (auto& th : threads) {
-    th.join();
-  }
+  onThreads(kThreads, [&](int t) {
+    for (int n = 0; n < kCalls; ++n) {
+      auto& pair = *pairs[static_cast<std::size_t>((t + n) % kPairs)];
+      matched += answersCall(pair.a->callAndWait("work", Dictionary{{"caller", t}, {"n", n}}, kWait).args, t, n);
+    }
+  });
   EXPECT_EQ(matched, kThreads * kCalls);
-  EXPECT_EQ(wrong, 0);
 }
 
-TEST(SocketConnectionCalls, AWaitedCallEndsWithTheConnectionOrAtItsTimeOut) {
+TEST(SocketConnectionCalls, CallsEndWithTheConnectionOrAtTheirTimeOutAndLaterOnesFailAtOnce) {
   ConnectedPair pair;
-  auto& object = pair.object;
-  object->answer = [](const Message&, std::shared_ptr<Reply>) {};  // never answers
+  pair.object->answer = [](const Message&, std::shared_ptr<Reply>) {};  // never answers
   pair.serve();
   const auto late = pair.a->callAndWait("silence", Dictionary{}, 100ms);
   EXPECT_TRUE(late.timedOut);
   EXPECT_FALSE(late.args);
 
+  // A call waited for and one with a completion, both pending when the
+  // peer goes away.
+  auto pending = callLater(*pair.a, "never-answered", Dictionary{});
   std::thread closer([&] {
-    object->received.waitFor(2);
+    pair.object->received.waitFor(3);
     pair.b->invalidate();
   });
   const auto gone = pair.a->callAndWait("silence", Dictionary{}, kWait);
   closer.join();
   EXPECT_FALSE(gone.timedOut);
   EXPECT_FALSE(gone.args);
-  ASSERT_TRUE(gone.error);
-  EXPECT_EQ(gone.error->description, "The connection was invalidated");
+  EXPECT_EQ(gone.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
+  ASSERT_EQ(pending.wait_for(kWait), std::future_status::ready);
+  const auto result = pending.get();
+  EXPECT_FALSE(result.args);
+  EXPECT_EQ(result.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
+  // A call made afterwards fails at once instead of waiting for ever.
+  const auto after = callAndWait(*pair.a, "after", Dictionary{});
+  ASSERT_TRUE(after.arrived);
+  EXPECT_EQ(after.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
 }
 
 TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
   RawPeer peer;
   constexpr int kThreads = 6;
   constexpr int kFrames = 40;
-  std::vector<std::thread> threads;
-  for (int t = 0; t < kThreads; ++t) {
-    threads.emplace_back([&, t] {
+  std::thread writers([&] {
+    onThreads(kThreads, [&](int t) {
       for (int n = 0; n < kFrames; ++n) {
         // Sizes vary so that partial writes land mid-frame.
         peer.connection->send("note", Dictionary{{"t", t}, {"n", n}, {"pad", Value(Data(static_cast<std::size_t>(n * 997 % 20000), 1))}});
       }
     });
-  }
+  });
   std::vector<int> next(kThreads, 0);
   for (int i = 0; i < kThreads * kFrames; ++i) {
     const auto message = peer.readMessage();
@@ -309,49 +282,20 @@ TEST(SocketConnectionCalls, FramesFromManyWritersNeverInterleave) {
     ASSERT_LT(t, kThreads);
     EXPECT_EQ(message->call.args.get("n").intValue(), next[static_cast<std::size_t>(t)]++) << "writer " << t << " out of order";
   }
-  for (auto& th : threads) {
-    th.join();
-  }
-}
-
-TEST(SocketConnectionCalls, PendingAndLaterCallsFailWhenThePeerGoesAway) {
-  RawPeer peer;
-  auto promise = std::make_shared<std::promise<CallResult>>();
-  auto future = promise->get_future();
-  peer.connection->call("never-answered", Dictionary{}, [promise](std::optional<Dictionary> a, std::optional<Error> e) {
-    promise->set_value(CallResult{true, std::move(a), std::move(e)});
-  });
-  ASSERT_TRUE(peer.readMessage());  // the call went out
-  peer.raw.close();                 // the peer disconnects mid-call
-  ASSERT_EQ(future.wait_for(kWait), std::future_status::ready);
-  const auto result = future.get();
-  EXPECT_FALSE(result.args);
-  ASSERT_TRUE(result.error);
-  EXPECT_EQ(*result.error, (Error{kErrorDomain, -1, "The connection was invalidated"}));
-  ASSERT_TRUE(peer.invalidated.waitFor(1));
-  // A call made afterwards fails at once instead of waiting for ever.
-  const auto late = callAndWait(*peer.connection, "late", Dictionary{});
-  ASSERT_TRUE(late.arrived);
-  ASSERT_TRUE(late.error);
-  EXPECT_EQ(late.error->description, "The connection was invalidated");
+  writers.join();
 }
 
 TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
   ConnectedPair pair;
-  auto& object = pair.object;
-  object->answer = [](const Message&, std::shared_ptr<Reply> r) {
+  pair.object->answer = [](const Message&, std::shared_ptr<Reply> r) {
     r->fail(Error{"test.domain", 12, "no such thing"});
     r->send(Dictionary{{"late", true}});  // a second answer is dropped
   };
   pair.serve();
-  const auto first = callAndWait(*pair.a, "x", Dictionary{});
-  ASSERT_TRUE(first.error);
-  EXPECT_EQ(*first.error, (Error{"test.domain", 12, "no such thing"}));
+  EXPECT_EQ(callAndWait(*pair.a, "x", Dictionary{}).error, (Error{"test.domain", 12, "no such thing"}));
   // The dropped second answer did not turn into a reply for the next call.
-  object->answer = [](const Message&, std::shared_ptr<Reply> r) { r->send(Dictionary{{"ok", true}}); };
-  const auto second = callAndWait(*pair.a, "y", Dictionary{});
-  ASSERT_TRUE(second.args);
-  EXPECT_EQ(*second.args, (Dictionary{{"ok", true}}));
+  pair.object->answer = [](const Message&, std::shared_ptr<Reply> r) { r->send(Dictionary{{"ok", true}}); };
+  EXPECT_EQ(callAndWait(*pair.a, "y", Dictionary{}).args, (Dictionary{{"ok", true}}));
 }
 
 // ---- ordering, queue and invalidation -------------------------------------------
@@ -366,15 +310,19 @@ void holdQueues(std::vector<std::unique_ptr<RawPeer>>& peers, std::size_t i, con
   peers[i]->connection->queue().sync([&] { holdQueues(peers, i + 1, whileHeld); });
 }
 
+std::vector<std::unique_ptr<RawPeer>> rawPeers(std::size_t n) {
+  std::vector<std::unique_ptr<RawPeer>> peers;
+  for (std::size_t i = 0; i < n; ++i) {
+    peers.push_back(std::make_unique<RawPeer>());
+  }
+  return peers;
+}
+
 TEST(SocketConnectionDelivery, ReadsArrivingWhileManyQueuesAreBusyDoNotStarveThePool) {
   // More busy connections than the pool has threads: a reading thread that
   // waited for its busy queue would hold a pool thread, and enough of them
   // would leave none to run the queues' own work.
-  constexpr std::size_t kPeers = 48;
-  std::vector<std::unique_ptr<RawPeer>> peers;
-  for (std::size_t i = 0; i < kPeers; ++i) {
-    peers.push_back(std::make_unique<RawPeer>());
-  }
+  auto peers = rawPeers(48);
   bool poolAlive = false;
   holdQueues(peers, 0, [&] {
     for (auto& p : peers) {
@@ -399,15 +347,13 @@ TEST(SocketConnectionDelivery, InvalidationHandlerRunsExactlyOnceWhenEofAndInval
       onQueue = onQueue && peer.connection->queue().isCurrent();
       peer.invalidated.hit();
     });
-    std::thread closer([&] { peer.raw.close(); });
-    std::vector<std::thread> invalidators;
-    for (int i = 0; i < 4; ++i) {
-      invalidators.emplace_back([&] { peer.connection->invalidate(); });
-    }
-    closer.join();
-    for (auto& t : invalidators) {
-      t.join();
-    }
+    onThreads(5, [&](int i) {
+      if (i == 0) {
+        peer.raw.close();
+      } else {
+        peer.connection->invalidate();
+      }
+    });
     ASSERT_TRUE(peer.invalidated.waitFor(1));
     // Give a wrong second run every chance to show up.
     peer.connection->queue().sync([] {});
@@ -418,18 +364,11 @@ TEST(SocketConnectionDelivery, InvalidationHandlerRunsExactlyOnceWhenEofAndInval
 }
 
 TEST(SocketConnectionDelivery, NothingIsDeliveredBeforeResume) {
-  int fds[2];
-  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
-  file::UniqueFd raw(fds[1]);
-  auto connection = SocketConnection::adopt(file::UniqueFd(fds[0]), *readPeerCredentials(fds[0]), Dictionary());
-  auto object = std::make_shared<RecordingObject>();
-  connection->setExportedObject(object);
-  const Data frame = callFrame("early", std::nullopt);
-  ASSERT_EQ(::send(raw.get(), frame.data(), frame.size(), 0), static_cast<ssize_t>(frame.size()));
-  EXPECT_FALSE(object->received.waitFor(1, 100ms));
-  connection->resume();
-  EXPECT_TRUE(object->received.waitFor(1));
-  connection->invalidate();
+  RawPeer peer(false);
+  peer.write(callFrame("early", std::nullopt));
+  EXPECT_FALSE(peer.object->received.waitFor(1, 100ms));
+  peer.connection->resume();
+  EXPECT_TRUE(peer.object->received.waitFor(1));
 }
 
 TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHandlerAndNeverInterrupts) {
@@ -461,10 +400,7 @@ TEST(SocketConnectionDelivery, InvalidationReleasesTheExportedObjectAfterTheHand
 TEST(SocketConnectionSocketThreads, ACallThatMayWaitLeavesTheSocketThreadsToTheOtherConnections) {
   // More connections than socket threads: some share the blocked one's.
   constexpr std::size_t kPeers = 9;
-  std::vector<std::unique_ptr<RawPeer>> peers;
-  for (std::size_t i = 0; i < kPeers; ++i) {
-    peers.push_back(std::make_unique<RawPeer>());
-  }
+  auto peers = rawPeers(kPeers);
   std::promise<void> release;
   std::shared_future<void> released = release.get_future().share();
   Counter blocked;
@@ -479,9 +415,7 @@ TEST(SocketConnectionSocketThreads, ACallThatMayWaitLeavesTheSocketThreadsToTheO
   for (std::size_t i = 1; i < kPeers; ++i) {
     peers[i]->object->quick = [](const Message&) { return true; };
     peers[i]->object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
-      if (!onSocketThread()) {
-        ++quickOffSocketThread;
-      }
+      quickOffSocketThread += !onSocketThread();
       r->send(m.args);
     };
   }
@@ -497,77 +431,47 @@ TEST(SocketConnectionSocketThreads, ACallThatMayWaitLeavesTheSocketThreadsToTheO
     EXPECT_EQ(reply->replyArgs.get("i").intValue(), static_cast<std::int64_t>(i));
   }
   release.set_value();
-  const auto late = peers[0]->readMessage();
-  ASSERT_TRUE(late);
-  EXPECT_EQ(late->replyTo, 1u);
+  EXPECT_EQ(peers[0]->nextReplyTo(), 1u);
   EXPECT_FALSE(blockedOnSocketThread) << "a call that may wait ran on a socket thread";
   EXPECT_EQ(quickOffSocketThread, 0) << "calls that never wait were handed to the pool although the queue was free";
 }
 
-TEST(SocketConnectionSocketThreads, CallsThatMayWaitAndCallsThatNeverWaitStayInOrderOneAtATime) {
+// Many calls in one stream: whichever of them may wait, each is handled on
+// the connection's queue one at a time and answered in order. Replies vary
+// in size, some larger than a socket buffer takes at once; the stream is
+// written from a thread of its own, so the connection stops reading while
+// the test has not read the replies yet.
+struct CallStream {
+  const char* name;
+  bool (*neverWaits)(std::int64_t n);
+  bool slowSleeps;    // calls that may wait take a millisecond
+  std::size_t chunk;  // bytes per write (0: all at once)
+};
+
+class SocketConnectionCallStream : public ::testing::TestWithParam<CallStream> {};
+
+TEST_P(SocketConnectionCallStream, AllCallsAreHandledOneAtATimeOnTheQueueAndAnsweredInOrder) {
+  const CallStream& stream = GetParam();
   RawPeer peer;
   std::atomic<int> inside{0};
   std::atomic<bool> overlapped{false};
   std::atomic<bool> offQueue{false};
-  peer.object->quick = [](const Message& m) { return m.operation.back() != '0'; };
+  peer.object->quick = [&](const Message& m) { return stream.neverWaits(m.args.get("n").intValue()); };
   peer.object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
-    if (++inside > 1) {
-      overlapped = true;
-    }
-    if (!peer.connection->queue().isCurrent()) {
-      offQueue = true;
-    }
-    if (m.operation.back() == '0') {
-      std::this_thread::sleep_for(1ms);  // a call that waits a little
+    overlapped = ++inside > 1 || overlapped;
+    offQueue = !peer.connection->queue().isCurrent() || offQueue;
+    if (stream.slowSleeps && !stream.neverWaits(m.args.get("n").intValue())) {
+      std::this_thread::sleep_for(1ms);
     }
     --inside;
-    r->send(Dictionary{{"op", m.operation}});
-  };
-  constexpr int kCalls = 300;
-  Data all;
-  for (int n = 0; n < kCalls; ++n) {
-    const Data f = callFrame("n" + std::to_string(n), static_cast<std::uint64_t>(n + 1));
-    all.insert(all.end(), f.begin(), f.end());
-  }
-  std::thread writer([&] { peer.write(all, 1000); });
-  for (int n = 0; n < kCalls; ++n) {
-    const auto reply = peer.readMessage();
-    ASSERT_TRUE(reply) << "reply " << n << " missing";
-    EXPECT_EQ(reply->replyTo, static_cast<std::uint64_t>(n + 1));
-    EXPECT_EQ(reply->replyArgs.get("op"), Value("n" + std::to_string(n)));
-  }
-  writer.join();
-  const auto calls = peer.object->calls();
-  ASSERT_EQ(calls.size(), static_cast<std::size_t>(kCalls));
-  for (int n = 0; n < kCalls; ++n) {
-    EXPECT_EQ(calls[static_cast<std::size_t>(n)].operation, "n" + std::to_string(n));
-  }
-  EXPECT_FALSE(overlapped);
-  EXPECT_FALSE(offQueue);
-}
-
-// ---- writes gathered per chunk ------------------------------------------------------
-
-// Which calls of a chunk answer without waiting: all, none, or every other.
-class SocketConnectionGatheredReplies : public ::testing::TestWithParam<int> {};
-
-TEST_P(SocketConnectionGatheredReplies, ManyCallsInOneWriteAreAllAnsweredInOrder) {
-  RawPeer peer;
-  const int mode = GetParam();
-  peer.object->quick = [mode](const Message& m) {
-    return mode == 0 || (mode == 2 && m.args.get("n").intValue() % 2 == 0);
+    r->send(m.args);
   };
   constexpr int kCalls = 400;
-  Data all;
-  for (int n = 0; n < kCalls; ++n) {
-    // Replies of varied sizes, some larger than a socket buffer takes at once.
-    const Data f = callFrame("echo", static_cast<std::uint64_t>(n + 1),
-                             Dictionary{{"n", n}, {"pad", Value(Data(static_cast<std::size_t>(n * 331 % 9000), 7))}});
-    all.insert(all.end(), f.begin(), f.end());
-  }
-  // Written whole from a thread of its own: the connection stops reading
-  // while this test has not read the replies yet.
-  std::thread writer([&] { peer.write(all); });
+  const Data all = framesOf(kCalls, [](int n) {
+    return callFrame("echo", static_cast<std::uint64_t>(n + 1),
+                     Dictionary{{"n", n}, {"pad", Value(Data(static_cast<std::size_t>(n * 331 % 9000), 7))}});
+  });
+  std::thread writer([&] { peer.write(all, stream.chunk); });
   for (int n = 0; n < kCalls; ++n) {
     const auto reply = peer.readMessage();
     if (!reply || reply->replyTo != static_cast<std::uint64_t>(n + 1)) {
@@ -578,9 +482,24 @@ TEST_P(SocketConnectionGatheredReplies, ManyCallsInOneWriteAreAllAnsweredInOrder
     EXPECT_EQ(reply->replyArgs.get("n").intValue(), n);
   }
   writer.join();
+  const auto calls = peer.object->calls();
+  ASSERT_EQ(calls.size(), static_cast<std::size_t>(kCalls));
+  for (std::size_t n = 0; n < calls.size(); ++n) {
+    EXPECT_EQ(calls[n].args.get("n").intValue(), static_cast<std::int64_t>(n));
+  }
+  EXPECT_FALSE(overlapped);
+  EXPECT_FALSE(offQueue);
 }
 
-INSTANTIATE_TEST_SUITE_P(QuickCalls, SocketConnectionGatheredReplies, ::testing::Values(0, 1, 2));
+INSTANTIATE_TEST_SUITE_P(
+    WaitingOrNot, SocketConnectionCallStream,
+    ::testing::Values(CallStream{"NoneWait", [](std::int64_t) { return true; }, false, 0},
+                      CallStream{"AllMayWait", [](std::int64_t) { return false; }, false, 0},
+                      CallStream{"EveryOtherMayWait", [](std::int64_t n) { return n % 2 == 0; }, false, 0},
+                      CallStream{"EveryTenthWaitsInSmallWrites", [](std::int64_t n) { return n % 10 != 0; }, true, 1000}),
+    [](const auto& info) { return std::string(info.param.name); });
+
+// ---- writes gathered per chunk ------------------------------------------------------
 
 TEST(SocketConnectionGatheredWrites, AFrameAnotherThreadWritesDuringADeliveryKeepsItsPlace) {
   RawPeer peer;
@@ -597,12 +516,8 @@ TEST(SocketConnectionGatheredWrites, AFrameAnotherThreadWritesDuringADeliveryKee
   ASSERT_TRUE(first);
   EXPECT_EQ(first->kind, IncomingMessage::Kind::Call);
   EXPECT_EQ(first->call.operation, "aside");
-  const auto second = peer.readMessage();
-  ASSERT_TRUE(second);
-  EXPECT_EQ(second->replyTo, 1u);
-  const auto third = peer.readMessage();
-  ASSERT_TRUE(third);
-  EXPECT_EQ(third->replyTo, 2u);
+  EXPECT_EQ(peer.nextReplyTo(), 1u);
+  EXPECT_EQ(peer.nextReplyTo(), 2u);
 }
 
 TEST(SocketConnectionGatheredWrites, AReplyMadeLaterFromAnotherThreadLeavesAtOnceWhileNothingElseHappens) {
@@ -617,9 +532,7 @@ TEST(SocketConnectionGatheredWrites, AReplyMadeLaterFromAnotherThreadLeavesAtOnc
     r->send(m.args);
   };
   peer.write(concat({callFrame("later", 1), callFrame("now", 2)}));
-  const auto now = peer.readMessage();
-  ASSERT_TRUE(now);
-  EXPECT_EQ(now->replyTo, 2u);
+  EXPECT_EQ(peer.nextReplyTo(), 2u);
   auto future = kept.get_future();
   ASSERT_EQ(future.wait_for(kWait), std::future_status::ready);
   std::thread([reply = future.get()] { reply->send(Dictionary{{"late", true}}); }).join();
@@ -658,9 +571,7 @@ TEST(SocketConnectionGatheredWrites, AHandlerThatMayWaitHoldsNoFrameBack) {
     EXPECT_EQ(progress->call.args.get("n").intValue(), n);
     seen[n].set_value();
     for (const std::uint64_t call : repliesAfter[n]) {
-      const auto reply = peer.readMessage();
-      ASSERT_TRUE(reply) << "reply to call " << call << " missing";
-      EXPECT_EQ(reply->replyTo, call);
+      EXPECT_EQ(peer.nextReplyTo(), call) << "reply to call " << call << " missing";
     }
   }
 }
@@ -670,9 +581,7 @@ TEST(SocketConnectionGatheredWrites, AHandlerThatMayWaitHoldsNoFrameBack) {
 TEST(SocketConnectionIdentity, PeerCredentialsComeFromTheSocketAndTheDescriptionNamesThem) {
   RawPeer raw;
   const auto& p = raw.connection->peer();
-  EXPECT_EQ(p.pid, ::getpid());
-  EXPECT_EQ(p.uid, ::getuid());
-  EXPECT_EQ(p.gid, ::getgid());
+  EXPECT_EQ(std::make_tuple(p.pid, p.uid, p.gid), std::make_tuple(::getpid(), ::getuid(), ::getgid()));
   std::vector<gid_t> groups(static_cast<std::size_t>(::getgroups(0, nullptr)));
   groups.resize(static_cast<std::size_t>(::getgroups(static_cast<int>(groups.size()), groups.data())));
   std::sort(groups.begin(), groups.end());

@@ -17,6 +17,9 @@ Data encoded(const Value& v) {
   return out;
 }
 
+// `v` written by us, read back by us.
+std::optional<Value> back(const Value& v) { return bplist::decode(plist::bytesOf(encoded(v))); }
+
 std::vector<std::string> keysOf(const Value& v) {
   std::vector<std::string> keys;
   for (const auto& [k, e] : *v.dict()) keys.push_back(k);
@@ -110,17 +113,16 @@ INSTANTIATE_TEST_SUITE_P(
 TEST(BinaryPlistWriter, KeepsWhatLibplistWouldLoseOrRefuse) {
   // Unsigned above the signed range: the 128-bit form, read back unsigned
   // (libplist keeps the same 64 bits).
-  const Value big(0xfffffffffffffff0ull);
-  const auto back = bplist::decode(plist::bytesOf(encoded(Value(Array{big}))));
-  ASSERT_TRUE(back);
-  EXPECT_EQ(back->at(0).type(), Value::Type::UInt);
-  EXPECT_EQ(back->at(0).unsignedValue(), 0xfffffffffffffff0ull);
-  EXPECT_EQ(plist::decodeBinary(plist::bytesOf(encoded(Value(Array{big}))))->at(0).unsignedValue(),
-            0xfffffffffffffff0ull);
+  const Value big(Array{Value(0xfffffffffffffff0ull)});
+  const auto ours = back(big);
+  ASSERT_TRUE(ours);
+  EXPECT_EQ(ours->at(0).type(), Value::Type::UInt);
+  EXPECT_EQ(ours->at(0).unsignedValue(), 0xfffffffffffffff0ull);
+  EXPECT_EQ(plist::decodeBinary(plist::bytesOf(encoded(big)))->at(0).unsignedValue(), 0xfffffffffffffff0ull);
 
   // A date before 2001 with a fraction reads back as written.
-  const Value early(Date{978307200.0 - 3.75});
-  EXPECT_EQ(bplist::decode(plist::bytesOf(encoded(Value(Array{early}))))->at(0), early);
+  const Value early(Array{Value(Date{978307200.0 - 3.75})});
+  EXPECT_EQ(back(early), early);
 
   // nil is left out; text ends at a NUL; bytes that are not UTF-8 become
   // U+FFFD; nil alone writes nothing.
@@ -129,9 +131,7 @@ TEST(BinaryPlistWriter, KeepsWhatLibplistWouldLoseOrRefuse) {
                              {"bad",
                               "x\xff"
                               "y\xc3"}});
-  const auto read = bplist::decode(plist::bytesOf(encoded(odd)));
-  ASSERT_TRUE(read);
-  EXPECT_EQ(*read, Value(Dictionary{{"nul", "ab"}, {"bad", "x\uFFFDy\uFFFD"}}));
+  EXPECT_EQ(back(odd), Value(Dictionary{{"nul", "ab"}, {"bad", "x\uFFFDy\uFFFD"}}));
   Data none;
   EXPECT_EQ(bplist::encode(Value(), none), 0u);
   EXPECT_TRUE(none.empty());
@@ -255,21 +255,15 @@ INSTANTIATE_TEST_SUITE_P(
 TEST(BinaryPlistReader, SharedObjectsAreBuiltOnceAtEveryReferenceWidth) {
   // One dictionary referenced three times.
   for (const std::uint8_t width : {1, 2, 3, 4, 8}) {
-    auto refs = [&](std::initializer_list<std::uint8_t> to) {
-      Data out;
+    // A marker, then references of `width` bytes.
+    auto object = [&](Data out, std::initializer_list<std::uint8_t> to) {
       for (const std::uint8_t r : to) {
         out.insert(out.end(), width - 1u, 0);
         out.push_back(r);
       }
       return out;
     };
-    Data top{0xA3};
-    const Data topRefs = refs({1, 1, 1});
-    top.insert(top.end(), topRefs.begin(), topRefs.end());
-    Data dict{0xD1};
-    const Data dictRefs = refs({2, 3});
-    dict.insert(dict.end(), dictRefs.begin(), dictRefs.end());
-    const Data bytes = listOf({top, dict, {0x51, 'k'}, {0x10, 7}}, width);
+    const Data bytes = listOf({object({0xA3}, {1, 1, 1}), object({0xD1}, {2, 3}), {0x51, 'k'}, {0x10, 7}}, width);
     const auto v = bplist::decode(plist::bytesOf(bytes));
     ASSERT_TRUE(v) << int{width};
     EXPECT_EQ(*v, *plist::decodeBinary(plist::bytesOf(bytes)));
