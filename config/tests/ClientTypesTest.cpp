@@ -104,26 +104,21 @@ void writeReleaseType(const test::TempRoot& root, const char* releaseType) {
              plist::encodeXml(Value(Dictionary{{"ReleaseType", Value(releaseType)}})));
 }
 
-TEST_F(InternalBuildDeathTest, AbsentValueResolvesToInternalAndTheFlagIsKeptWhenTheDeviceFileChanges) {
-  EXPECT_EXIT(
-      {
-        test::TempRoot root;
-        writeReleaseType(root, "Internal");
-        const bool internal = userDefaultsEnvironment() == kEnvironmentInternal;
-        writeReleaseType(root, "Customer");
-        std::exit(internal && isInternalBuild() ? 0 : 1);
-      },
-      ::testing::ExitedWithCode(0), "");
-}
-
-TEST_F(InternalBuildDeathTest, OnlyTheExactTextInternalCounts) {
-  EXPECT_EXIT(
-      {
-        test::TempRoot root;
-        writeReleaseType(root, "internal");
-        std::exit(isInternalBuild() ? 1 : 0);
-      },
-      ::testing::ExitedWithCode(0), "");
+// Only the exact text "Internal" makes an internal build, where an absent
+// value resolves to internal; the flag stays as it was when the file changes.
+TEST_F(InternalBuildDeathTest, OnlyTheExactTextInternalCountsAndTheFlagIsKeptWhenTheDeviceFileChanges) {
+  for (const auto& [releaseType, internal] : {std::pair{"Internal", true}, std::pair{"internal", false}}) {
+    EXPECT_EXIT(
+        {
+          test::TempRoot root;
+          writeReleaseType(root, releaseType);
+          const bool resolved = userDefaultsEnvironment() == (internal ? kEnvironmentInternal : kEnvironmentSeed);
+          writeReleaseType(root, internal ? "Customer" : "Internal");
+          std::exit(resolved && isInternalBuild() == internal ? 0 : 1);
+        },
+        ::testing::ExitedWithCode(0), "")
+        << releaseType;
+  }
 }
 
 }  // namespace

@@ -59,10 +59,48 @@ class AgentFixture : public ::testing::Test {
     return Value(std::move(info));
   }
 
+  static Value user(const std::string& client, const std::string& service = "sync") {
+    return Value(Dictionary{{kZerithUserInfoClientName, Value(client)}, {kZerithUserInfoServiceName, Value(service)}});
+  }
+
+  // What a completion taking one value answered before `call` returned.
+  template <typename Call>
+  static std::optional<Value> answer(Call call) {
+    std::optional<Value> reply;
+    call([&](Value v) { reply = std::move(v); });
+    return reply;
+  }
+
+  static Value event(unsigned category, unsigned type, const Value& payload = Value(), const Value& flag = Value()) {
+    Dictionary d{{kZerithMessageParametersCategory, Value(category)}, {kZerithMessageParametersType, Value(type)}};
+    if (!payload.isNil()) {
+      d.set(kZerithMessageParametersPayload, payload);
+    }
+    if (!flag.isNil()) {
+      d.set(kZerithMessageParametersFlag, flag);
+    }
+    return Value(std::move(d));
+  }
+
+  // Every answer a flush gave before it returned.
+  using FlushAnswer = std::pair<Value, std::optional<Error>>;
+  static std::vector<FlushAnswer> flush(ZerithdSession& session) {
+    std::vector<FlushAnswer> answers;
+    session.flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { answers.emplace_back(v, e); });
+    return answers;
+  }
+
   struct Client {
     std::shared_ptr<FakeConnection> connection;
     std::shared_ptr<ZerithdSession> session;
   };
+
+  // The reply to one message; a call that does not reply at once fails the test.
+  static Value send(const Client& c, const Value& message) {
+    const auto reply = answer([&](auto done) { c.session->sendMessageWithDictionary(message, done); });
+    EXPECT_TRUE(reply.has_value());
+    return reply.value_or(Value());
+  }
 
   // A listed session on its own connection, configured with `info`.
   Client newSession(const Value& info = Value(), bool aggregator = false, const Value& userInfo = Value()) {

@@ -56,7 +56,7 @@ TEST_F(ZerithdAgentTest, RefusesEveryEntitlementThatIsNotExactlyTrue) {
   EXPECT_FALSE(logs.contains("createReportingSessionWithDelegate"));
 }
 
-TEST_F(ZerithdAgentTest, AcceptedConnectionsAreSetUpListedAndCounted) {
+TEST_F(ZerithdAgentTest, AcceptedConnectionsAreSetUpListedAndCountedAndOutliveAnInterruption) {
   auto first = FakeConnection::entitled();
   auto second = FakeConnection::entitled();
   ASSERT_TRUE(accept(first));
@@ -81,15 +81,12 @@ TEST_F(ZerithdAgentTest, AcceptedConnectionsAreSetUpListedAndCounted) {
   EXPECT_EQ(transaction->beginCount(), 1u);
   EXPECT_EQ(logs.count("createReportingSessionWithDelegate: Vesk transaction started with session <ZerithdSession: "),
             1u);
-}
 
-TEST_F(ZerithdAgentTest, InterruptionNeverEndsTheSession) {
-  auto connection = FakeConnection::entitled();
-  ASSERT_TRUE(accept(connection));
-  connection->interrupt();
+  // An interruption never ends the session.
+  first->interrupt();
   EXPECT_TRUE(logs.contains("listener: Vesk connection to <ZerithdSession: "));
   EXPECT_TRUE(logs.contains(" was interrupted"));
-  EXPECT_EQ(agent->sessionCount(), 1u);
+  EXPECT_EQ(agent->sessionCount(), 2u);
   EXPECT_FALSE(logs.contains("was invalidated"));
 }
 
@@ -118,53 +115,56 @@ TEST_F(ZerithdAgentTest, SessionArrivingBeforeThePreviousTransportClosedBeginsAS
 
 // --- Hierarchy -----------------------------------------------------------------
 
-TEST_F(ZerithdAgentTest, ParentIdentifierJoinsAncestorsRootFirst) {
-  auto root0 = newSession(hierarchyInfo(1, "call", 0));
-  auto mid = newSession(hierarchyInfo(2, "call", 1));
-  auto leaf = newSession(hierarchyInfo(3, "call", 2));
-  EXPECT_EQ(agent->parentSessionIDStringForSession(*leaf.session),
-            Value(root0.session->sessionIDString() + "." + mid.session->sessionIDString()));
-  EXPECT_EQ(agent->parentSessionIDStringForSession(*mid.session), Value(root0.session->sessionIDString()));
-  EXPECT_TRUE(agent->parentSessionIDStringForSession(*root0.session).isNil());
-  EXPECT_EQ(agent->parentSessionForChild(*leaf.session), mid.session);
-  EXPECT_TRUE(logs.has(Level::Debug, "updateCorrelatedSessions: Adding session 3 to list for hierarchyToken call with "
-                                     "hierarchyLevel 2"));
-}
-
-TEST_F(ZerithdAgentTest, MissingParentLevelGivesNilParentIdentifier) {
-  auto root0 = newSession(hierarchyInfo(1, "call", 0));
-  auto orphan = newSession(hierarchyInfo(2, "call", 2));  // level 1 never connected
-  EXPECT_TRUE(agent->parentSessionIDStringForSession(*orphan.session).isNil());
-  EXPECT_TRUE(logs.has(Level::Default,
-                       "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete "
-                       "parentSessionID is '(null)'"));
-
-  // Levels 0 and 1 present, 2 missing: the walk stops at level 2.
-  auto zero = newSession(hierarchyInfo(3, "media", 0));
-  auto one = newSession(hierarchyInfo(4, "media", 1));
-  auto three = newSession(hierarchyInfo(5, "media", 3));
-  EXPECT_TRUE(agent->parentSessionIDStringForSession(*three.session).isNil());
-
-  EXPECT_EQ(agent->parentSessionForChild(*three.session), nullptr);
-  EXPECT_TRUE(logs.has(Level::Default,
-                       "parentSessionForChild: Unable to find session with hierarchy of 2 for hierarchyToken 'media'"));
-}
-
-TEST_F(ZerithdAgentTest, GapNearTheRootKeepsTheIdentifierBuiltSoFar) {
-  auto one = newSession(hierarchyInfo(1, "call", 1));  // the root never connected
-  auto two = newSession(hierarchyInfo(2, "call", 2));
-  EXPECT_EQ(agent->parentSessionIDStringForSession(*two.session), Value(one.session->sessionIDString()));
-  EXPECT_TRUE(logs.has(Level::Default,
-                       "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete "
-                       "parentSessionID is '" + one.session->sessionIDString() + "'"));
-}
-
-TEST_F(ZerithdAgentTest, FirstSessionAddedAtALevelIsTheParentOfTheNext) {
-  auto first = newSession(hierarchyInfo(1, "call", 0));
-  auto second = newSession(hierarchyInfo(2, "call", 0));
-  auto child = newSession(hierarchyInfo(3, "call", 1));
-  EXPECT_EQ(agent->parentSessionForChild(*child.session), first.session);
-  EXPECT_EQ(agent->parentSessionIDStringForSession(*child.session), Value(first.session->sessionIDString()));
+// Sessions of one token at the given levels, listed in that order; the last
+// one asks for its parent and for its parent identifier.
+TEST_F(ZerithdAgentTest, ParentIsTheFirstSessionOneLevelUpAndTheIdentifierJoinsAncestorsRootFirstUpToAGap) {
+  const std::string gap =
+      "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID "
+      "is ";
+  const struct {
+    const char* name;
+    std::vector<std::int64_t> levels;
+    int parent;                   // the parent's index, or -1 for none
+    std::vector<int> identifier;  // the ancestors (indices) the identifier joins; none: nil
+    std::string logged;           // "#" stands for the identifier
+    Level level = Level::Default;
+  } rows[] = {
+      {"chain", {0, 1, 2}, 1, {0, 1},
+       "updateCorrelatedSessions: Adding session 3 to list for hierarchyToken call with hierarchyLevel 2",
+       Level::Debug},
+      {"child of the root", {0, 1}, 0, {0}, ""},
+      {"the root itself", {0}, -1, {}, ""},
+      {"two at the parent's level", {0, 0, 1}, 0, {0}, ""},
+      {"no parent", {0, 2}, -1, {}, gap + "'(null)'"},
+      {"no grandparent", {0, 1, 3}, -1, {},
+       "parentSessionForChild: Unable to find session with hierarchy of 2 for hierarchyToken 'call'"},
+      {"no root", {1, 2}, 0, {0}, gap + "'#'"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    logs.clear();
+    std::vector<Client> sessions;
+    for (const std::int64_t level : row.levels) {
+      sessions.push_back(newSession(hierarchyInfo(static_cast<std::uint32_t>(sessions.size() + 1), "call", level)));
+    }
+    ZerithdSession& child = *sessions.back().session;
+    EXPECT_EQ(agent->parentSessionForChild(child), row.parent < 0 ? nullptr : sessions[row.parent].session);
+    std::string identifier;
+    for (const int i : row.identifier) {
+      identifier += (identifier.empty() ? "" : ".") + sessions[i].session->sessionIDString();
+    }
+    EXPECT_EQ(agent->parentSessionIDStringForSession(child), identifier.empty() ? Value() : Value(identifier));
+    if (!row.logged.empty()) {
+      std::string line = row.logged;
+      if (const auto at = line.find('#'); at != std::string::npos) {
+        line.replace(at, 1, identifier);
+      }
+      EXPECT_TRUE(logs.has(row.level, line)) << line;
+    }
+    for (const auto& c : sessions) {
+      agent->invalidateReportingSession(c.session);
+    }
+  }
 }
 
 TEST_F(ZerithdAgentTest, UnlistedSessionFindsNoParent) {

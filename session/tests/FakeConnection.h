@@ -69,12 +69,7 @@ class FakeConnection final : public ipc::Connection {
     }
   }
   void interrupt() {
-    std::function<void()> handler;
-    {
-      std::lock_guard lock(mutex_);
-      handler = interruption_;
-    }
-    if (handler) {
+    if (const auto handler = read(interruption_)) {
       handler();
     }
   }
@@ -95,28 +90,19 @@ class FakeConnection final : public ipc::Connection {
   const SerialQueue& queue() const override { return queue_; }
   std::string description() const override { return "<fake connection " + std::to_string(id_) + ">"; }
 
-  std::shared_ptr<ipc::ExportedObject> exported() const {
-    std::lock_guard lock(mutex_);
-    return exported_;
-  }
-  bool hasInvalidationHandler() const {
-    std::lock_guard lock(mutex_);
-    return static_cast<bool>(invalidation_);
-  }
-  bool hasInterruptionHandler() const {
-    std::lock_guard lock(mutex_);
-    return static_cast<bool>(interruption_);
-  }
-  int resumed() const {
-    std::lock_guard lock(mutex_);
-    return resumed_;
-  }
-  std::vector<Sent> sent() const {
-    std::lock_guard lock(mutex_);
-    return sent_;
-  }
+  std::shared_ptr<ipc::ExportedObject> exported() const { return read(exported_); }
+  bool hasInvalidationHandler() const { return static_cast<bool>(read(invalidation_)); }
+  bool hasInterruptionHandler() const { return static_cast<bool>(read(interruption_)); }
+  int resumed() const { return read(resumed_); }
+  std::vector<Sent> sent() const { return read(sent_); }
 
  private:
+  template <typename T>
+  T read(const T& member) const {
+    std::lock_guard lock(mutex_);
+    return member;
+  }
+
   mutable std::mutex mutex_;
   Dictionary entitlements_;
   ipc::PeerCredentials peer_;

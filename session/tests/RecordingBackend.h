@@ -140,22 +140,10 @@ class RecordingBackend final : public ZerithBackend {
     changed_.notify_all();
   }
 
-  std::vector<Event> events() const {
-    std::lock_guard lock(mutex_);
-    return events_;
-  }
-  std::size_t count() const {
-    std::lock_guard lock(mutex_);
-    return count_;
-  }
-  int flushes() const {
-    std::lock_guard lock(mutex_);
-    return flushes_;
-  }
-  int cleanups() const {
-    std::lock_guard lock(mutex_);
-    return cleanups_;
-  }
+  std::vector<Event> events() const { return read(events_); }
+  std::size_t count() const { return read(count_); }
+  int flushes() const { return read(flushes_); }
+  int cleanups() const { return read(cleanups_); }
   // The session cleans its backends up last in its teardown, after its end
   // message and flush: wait for that rather than for the dealloc line.
   bool waitForCleanups(int n, std::chrono::milliseconds timeout = std::chrono::seconds(10)) const {
@@ -174,6 +162,12 @@ class RecordingBackend final : public ZerithBackend {
   }
 
  private:
+  template <typename T>
+  T read(const T& member) const {
+    std::lock_guard lock(mutex_);
+    return member;
+  }
+
   mutable std::mutex mutex_;
   mutable std::condition_variable changed_;
   bool sink_ = false;

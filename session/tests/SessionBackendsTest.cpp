@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <map>
 #include <thread>
 
 #include "daemon/tests/AgentFixture.h"
@@ -25,7 +26,14 @@ class SessionBackendsTest : public AgentFixture {
     storebagVersion = Value("7");
   }
 
-  void useStorebag(Dictionary section) { storebag = Value(std::move(section)); }
+  // A storebag of these backend sections, in this order.
+  void useStorebag(std::initializer_list<std::pair<std::string, Dictionary>> sections) {
+    Dictionary bag;
+    for (const auto& [name, profile] : sections) {
+      bag.set(name, Value(profile));
+    }
+    storebag = Value(std::move(bag));
+  }
 
   // A configured session on the current storebag.
   Client started(const Value& info, bool aggregator = false, const Value& userInfo = Value()) {
@@ -38,37 +46,16 @@ class SessionBackendsTest : public AgentFixture {
     return RecordingBackend::of(c.session->backendNamed(name));
   }
 
-  static Value event(unsigned category, unsigned type, const Value& payload = Value(), const Value& flag = Value()) {
-    Dictionary d{{kZerithMessageParametersCategory, Value(category)}, {kZerithMessageParametersType, Value(type)}};
-    if (!payload.isNil()) {
-      d.set(kZerithMessageParametersPayload, payload);
-    }
-    if (!flag.isNil()) {
-      d.set(kZerithMessageParametersFlag, flag);
-    }
-    return Value(std::move(d));
-  }
-
-  static Value send(Client& c, const Value& message) {
-    std::optional<Value> reply;
-    c.session->sendMessageWithDictionary(message, [&](Value v) { reply = v; });
-    EXPECT_TRUE(reply.has_value());
-    return reply.value_or(Value());
-  }
 };
 
 // --- The set --------------------------------------------------------------------------
 
 TEST_F(SessionBackendsTest, SetFollowsTheStorebagOrderAndEveryBackendGetsTheSessionsTransportAndIdentifier) {
-  useStorebag({{"recB", Value(Dictionary{})},
-               {"noSuchKind", Value(Dictionary{})},
-               {"recA", Value(Dictionary{{"state", Value(1)}})},
-               {"recC", Value(Dictionary{{"state", Value(3)}})}});
+  useStorebag({{"recB", {}}, {"noSuchKind", {}}, {"recA", {{"state", Value(1)}}}, {"recC", {{"state", Value(3)}}}});
   auto c = newSession(sessionInfo(5));
-  std::optional<Value> names;
-  c.session->startConfigWithCompletionHandler([&](Value v) { names = v; });
   // Disabled recA is not reporting; sampled-out-but-kept recC is.
-  EXPECT_EQ(names, Value(Array{Value("recB"), Value("recC")}));
+  EXPECT_EQ(answer([&](auto done) { c.session->startConfigWithCompletionHandler(done); }),
+            Value(Array{Value("recB"), Value("recC")}));
   EXPECT_TRUE(logs.has(Level::Error, "ZerithBackend(newBackendWithName): noSuchKind"));
 
   const auto set = c.session->backends();
@@ -91,10 +78,10 @@ TEST_F(SessionBackendsTest, SetFollowsTheStorebagOrderAndEveryBackendGetsTheSess
 }
 
 TEST_F(SessionBackendsTest, NewStorebagReplacesTheSetAndCleansUpTheOldOne) {
-  useStorebag({{"recA", Value(Dictionary{})}});
+  useStorebag({{"recA", {}}});
   auto c = started(sessionInfo(5));
   const auto first = rec(c, "recA");
-  useStorebag({{"recB", Value(Dictionary{})}});
+  useStorebag({{"recB", {}}});
   fetchedClientTypes.clear();
   // The agent's cache still answers with the first storebag for type 7; a
   // new session info under type 8 (another storebag name) fetches the second.
@@ -109,7 +96,7 @@ TEST_F(SessionBackendsTest, NewStorebagReplacesTheSetAndCleansUpTheOldOne) {
 // --- One event ------------------------------------------------------------------------
 
 TEST_F(SessionBackendsTest, EveryBackendGetsClientDataSharedDataTheNumbersAndTheFlag) {
-  useStorebag({{"recA", Value(Dictionary{})}, {"recB", Value(Dictionary{})}});
+  useStorebag({{"recA", {}}, {"recB", {}}});
   auto c = started(hierarchyInfo(5, "call", 0));
   c.session->updateSharedDataWithDictionary(Value(Dictionary{{"room", Value("blue")}}));
   const Value payload(Dictionary{{"rtt", Value(12)}});
@@ -134,9 +121,9 @@ TEST_F(SessionBackendsTest, EveryBackendGetsClientDataSharedDataTheNumbersAndThe
 }
 
 TEST_F(SessionBackendsTest, WhitelistAndBlacklistDecidePerBackend) {
-  useStorebag({{"recA", Value(Dictionary{{"whitelist", Value(Array{Value(3), Value(4)})}})},
-               {"recB", Value(Dictionary{{"blacklist", Value(Array{Value(4)})}})},
-               {"recC", Value(Dictionary{{"whitelist", Value(Array{})}, {"blacklist", Value(Array{})}})}});
+  useStorebag({{"recA", {{"whitelist", Value(Array{Value(3), Value(4)})}}},
+               {"recB", {{"blacklist", Value(Array{Value(4)})}}},
+               {"recC", {{"whitelist", Value(Array{})}, {"blacklist", Value(Array{})}}}});
   auto c = started(sessionInfo(5));
   logs.clear();
   send(c, event(3, 1));
@@ -163,37 +150,40 @@ TEST_F(SessionBackendsTest, WhitelistAndBlacklistDecidePerBackend) {
 }
 
 TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutOne) {
+  const std::map<std::string, std::string> results = {{kZerithBackendHTTPPost, "post#"},
+                                                      {kZerithBackendHTTPPost2, "post2#"},
+                                                      {kZerithBackendDashboard, "dash#"},
+                                                      {"recA", "other#"}};
   // Each set under a client type with a storebag name of its own, so that
   // none is served from the agent's cache.
-  const std::int64_t types[] = {12, 16, 17, 18, 19, 21};
-  std::size_t next = 0;
-  auto resultOf = [&](Dictionary section) {
-    useStorebag(std::move(section));
-    auto c = started(sessionInfo(5, types[next++]));
-    return send(c, event(3, 1));
+  const struct {
+    std::int64_t clientType;
+    std::vector<std::string> set;
+    Value result;
+  } rows[] = {
+      {12, {kZerithBackendHTTPPost2, kZerithBackendHTTPPost}, Value("post#2")},
+      {16, {kZerithBackendHTTPPost, kZerithBackendHTTPPost2}, Value("post2#2")},
+      {17, {"recA", kZerithBackendDashboard}, Value("dash#2")},
+      {18, {kZerithBackendDashboard, kZerithBackendHTTPPost}, Value("post#2")},
+      {19, {kZerithBackendHTTPPost, kZerithBackendDashboard}, Value("post#2")},
+      {21, {"recA"}, Value()},  // other kinds' results are logged, never returned
   };
-  Dictionary dash{{"result", Value("dash#")}};
-  Dictionary https{{"result", Value("post#")}};
-  Dictionary https2{{"result", Value("post2#")}};
-  EXPECT_EQ(resultOf({{kZerithBackendHTTPPost2, Value(https2)}, {kZerithBackendHTTPPost, Value(https)}}),
-            Value("post#2"));
-  EXPECT_EQ(resultOf({{kZerithBackendHTTPPost, Value(https)}, {kZerithBackendHTTPPost2, Value(https2)}}),
-            Value("post2#2"));
-  EXPECT_EQ(resultOf({{"recA", Value(Dictionary{{"result", Value("other#")}})}, {kZerithBackendDashboard, Value(dash)}}),
-            Value("dash#2"));
-  EXPECT_EQ(resultOf({{kZerithBackendDashboard, Value(dash)}, {kZerithBackendHTTPPost, Value(https)}}),
-            Value("post#2"));
-  EXPECT_EQ(resultOf({{kZerithBackendHTTPPost, Value(https)}, {kZerithBackendDashboard, Value(dash)}}),
-            Value("post#2"));
-  // Other kinds' results are logged, never returned.
-  EXPECT_TRUE(resultOf({{"recA", Value(Dictionary{{"result", Value("other#")}})}}).isNil());
+  for (const auto& row : rows) {
+    Dictionary bag;
+    for (const auto& name : row.set) {
+      bag.set(name, Value(Dictionary{{"result", Value(results.at(name))}}));
+    }
+    storebag = Value(std::move(bag));
+    auto c = started(sessionInfo(5, row.clientType));
+    EXPECT_EQ(send(c, event(3, 1)), row.result) << "client type " << row.clientType;
+  }
   const std::string log = messageLog();
   EXPECT_NE(log.find(") [recA -> sendMessageWithDictionary] other#2\n"), std::string::npos) << log;
   EXPECT_NE(log.find(") [dashboard -> sendMessageWithDictionary] dash#2\n"), std::string::npos) << log;
 }
 
 TEST_F(SessionBackendsTest, PayloadThatIsNotADictionaryIsRefusedAndTheSessionGoesOn) {
-  useStorebag({{"recA", Value(Dictionary{})}});
+  useStorebag({{"recA", {}}});
   auto c = started(sessionInfo(5));
   EXPECT_TRUE(send(c, event(3, 1, Value("text"))).isNil());
   EXPECT_TRUE(send(c, event(3, 1, Value(Array{Value(1)}))).isNil());
@@ -207,7 +197,7 @@ TEST_F(SessionBackendsTest, PayloadThatIsNotADictionaryIsRefusedAndTheSessionGoe
 }
 
 TEST_F(SessionBackendsTest, SharedDataIsPerTokenAndBadOrOversizedUpdatesChangeNothing) {
-  useStorebag({{"recA", Value(Dictionary{})}});
+  useStorebag({{"recA", {}}});
   auto a = started(hierarchyInfo(1, "call", 0));
   auto b = started(hierarchyInfo(2, "call", 1));
   auto other = started(hierarchyInfo(3, "meeting", 0));
@@ -222,18 +212,17 @@ TEST_F(SessionBackendsTest, SharedDataIsPerTokenAndBadOrOversizedUpdatesChangeNo
   a.session->updateSharedDataForKey(Value(7), Value("x"));  // a key that is not a string
   EXPECT_TRUE(logs.has(Level::Error, "updateSharedDataForKey: Ignoring shared data without a string key for session 1"));
 
-  for (auto* c : {&a, &b, &other, &alone}) {
+  std::vector<Value> seen;
+  for (const auto* c : {&a, &b, &other, &alone}) {
     send(*c, event(9, 9));
+    seen.push_back(rec(*c, "recA")->events().back().message);
   }
-  const Value shared(Dictionary{{"room", Value("blue")}});
-  EXPECT_EQ(rec(a, "recA")->events().back().message, Value(Dictionary{{"SharedData", shared}}));
-  EXPECT_EQ(rec(b, "recA")->events().back().message, Value(Dictionary{{"SharedData", shared}}));
-  EXPECT_EQ(rec(other, "recA")->events().back().message, Value(Dictionary{}));
-  EXPECT_EQ(rec(alone, "recA")->events().back().message, Value(Dictionary{}));
+  const Value shared(Dictionary{{"SharedData", Value(Dictionary{{"room", Value("blue")}})}});
+  EXPECT_EQ(seen, (std::vector<Value>{shared, shared, Value(Dictionary{}), Value(Dictionary{})}));
 }
 
 TEST_F(SessionBackendsTest, LevelsFarAboveTheOthersOrNegativeFindTheAggregatorWithoutWalkingEveryLevel) {
-  useStorebag({{"recA", Value(Dictionary{})}});
+  useStorebag({{"recA", {}}});
   auto root = started(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
   auto far = started(hierarchyInfo(2, "call", 4'000'000'000ll));
   auto negative = started(hierarchyInfo(3, "call", -1));
@@ -256,16 +245,12 @@ TEST_F(SessionBackendsTest, LevelsFarAboveTheOthersOrNegativeFindTheAggregatorWi
 // --- Flush --------------------------------------------------------------------------------
 
 TEST_F(SessionBackendsTest, FlushCompletesOnceAtTheFirstErrorOrAfterTheLastBackend) {
-  useStorebag({{"recA", Value(Dictionary{{"flushResult", Value("a flushed")}})},
-               {"recB", Value(Dictionary{{"flushError", Value("b failed")}, {"flushResult", Value("b text")}})},
-               {"recC", Value(Dictionary{{"flushResult", Value("c flushed")}})}});
+  useStorebag({{"recA", {{"flushResult", Value("a flushed")}}},
+               {"recB", {{"flushError", Value("b failed")}, {"flushResult", Value("b text")}}},
+               {"recC", {{"flushResult", Value("c flushed")}}}});
   auto c = started(sessionInfo(5));
-  std::vector<std::pair<Value, std::optional<Error>>> calls;
-  c.session->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { calls.emplace_back(v, e); });
-  ASSERT_EQ(calls.size(), 1u);
-  EXPECT_EQ(calls[0].first, Value("b text"));
-  ASSERT_TRUE(calls[0].second.has_value());
-  EXPECT_EQ(calls[0].second->description, "b failed");
+  EXPECT_EQ(flush(*c.session),
+            (std::vector<FlushAnswer>{{Value("b text"), Error{"com.velmar.zerith.test", 7, "b failed"}}}));
   EXPECT_EQ(rec(c, "recC")->flushes(), 1);  // every backend was asked all the same
   for (const char* name : {"recA", "recB", "recC"}) {
     EXPECT_TRUE(logs.has(Level::Debug, std::string("internalFlushMessagesWithCompletion: ") + name));
@@ -275,20 +260,15 @@ TEST_F(SessionBackendsTest, FlushCompletesOnceAtTheFirstErrorOrAfterTheLastBacke
   EXPECT_NE(log.find(") [recC -> flushMessages] c flushed\n"), std::string::npos) << log;
 
   // Without errors: the last backend's text, no error.
-  useStorebag({{"recA", Value(Dictionary{{"flushResult", Value("a")}})},
-               {"recB", Value(Dictionary{{"flushResult", Value("b")}})}});
+  useStorebag({{"recA", {{"flushResult", Value("a")}}}, {"recB", {{"flushResult", Value("b")}}}});
   auto quiet = started(sessionInfo(6, 8));
-  calls.clear();
-  quiet.session->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { calls.emplace_back(v, e); });
-  ASSERT_EQ(calls.size(), 1u);
-  EXPECT_EQ(calls[0].first, Value("b"));
-  EXPECT_FALSE(calls[0].second.has_value());
+  EXPECT_EQ(flush(*quiet.session), (std::vector<FlushAnswer>{{Value("b"), std::nullopt}}));
 }
 
 TEST_F(SessionBackendsTest, DeferredFlushesJoinAcrossThreadsAndAnErrorArrivingFirstWins) {
-  useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(true)}, {"flushResult", Value("a")}})},
-               {"recB", Value(Dictionary{{"flushDeferred", Value(true)}, {"flushError", Value("b failed")}})},
-               {"recC", Value(Dictionary{{"flushDeferred", Value(true)}, {"flushResult", Value("c")}})}});
+  useStorebag({{"recA", {{"flushDeferred", Value(true)}, {"flushResult", Value("a")}}},
+               {"recB", {{"flushDeferred", Value(true)}, {"flushError", Value("b failed")}}},
+               {"recC", {{"flushDeferred", Value(true)}, {"flushResult", Value("c")}}}});
   auto c = started(sessionInfo(5));
   std::atomic<int> calls{0};
   std::optional<Error> seen;
@@ -329,7 +309,7 @@ TEST_F(SessionBackendsTest, DeferredFlushesJoinAcrossThreadsAndAnErrorArrivingFi
 }
 
 TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSafely) {
-  useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(true)}})}});
+  useStorebag({{"recA", {{"flushDeferred", Value(true)}}}});
   auto c = started(sessionInfo(5));
   const auto a = rec(c, "recA");
   const std::string device = c.session->deviceID();
@@ -353,19 +333,15 @@ TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSaf
 // --- States and identifiers in a hierarchy ---------------------------------------------------
 
 TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTheCombinedIdentifierOrphansTheirOwn) {
-  useStorebag({{"recA", Value(Dictionary{{"state", Value(2)}, {"threshold", Value(0.25)}})},
-               {"recB", Value(Dictionary{{"state", Value(1)}})}});
+  useStorebag({{"recA", {{"state", Value(2)}, {"threshold", Value(0.25)}}}, {"recB", {{"state", Value(1)}}}});
   auto root = started(hierarchyInfo(1, "call", 0));
   // The child's storebag disagrees with its parent (a client type with
   // another storebag name).
-  useStorebag({{"recA", Value(Dictionary{{"state", Value(1)}})},
-               {"recB", Value(Dictionary{{"state", Value(3)}})},
-               {"recC", Value(Dictionary{{"state", Value(2)}})}});
+  useStorebag({{"recA", {{"state", Value(1)}}}, {"recB", {{"state", Value(3)}}}, {"recC", {{"state", Value(2)}}}});
   auto child = started(hierarchyInfo(2, "call", 1, 8));
-  std::optional<Value> states;
-  child.session->fetchStatesWithUserInfo(Value(), [&](Value v) { states = v; });
   // recA copied from the parent, recB kept (state 3), recC missing at the parent.
-  EXPECT_EQ(states, Value(Array{Value("recA"), Value("recB")}));
+  EXPECT_EQ(answer([&](auto done) { child.session->fetchStatesWithUserInfo(Value(), done); }),
+            Value(Array{Value("recA"), Value("recB")}));
   EXPECT_EQ(rec(child, "recA")->samplingThreshold(), Value(0.25));
   EXPECT_EQ(rec(child, "recC")->state(), kBackendStateDisabled);
   EXPECT_TRUE(logs.has(Level::Debug,
@@ -391,7 +367,7 @@ TEST_F(SessionBackendsTest, ChildrenTakeTheParentsStatesExceptAKeptOneAndCarryTh
 }
 
 TEST_F(SessionBackendsTest, UserInfoReachesEveryBackendAndTheDigestKeyOnlyTheDigestBackend) {
-  useStorebag({{"recA", Value(Dictionary{})}, {kZerithBackendQRS, Value(Dictionary{})}});
+  useStorebag({{"recA", {}}, {kZerithBackendQRS, {}}});
   auto c = started(sessionInfo(5));
   const Value key(Data{1, 2, 3});
   c.session->setDigestKey(key, 4);
@@ -399,10 +375,9 @@ TEST_F(SessionBackendsTest, UserInfoReachesEveryBackendAndTheDigestKeyOnlyTheDig
   EXPECT_EQ(rec(c, kZerithBackendQRS)->digestAlgorithm(), 4);
   EXPECT_EQ(rec(c, "recA")->digestKey(), std::nullopt);
 
-  const Value user(Dictionary{{kZerithUserInfoClientName, Value("mail")}});
-  c.session->fetchStatesWithUserInfo(user, nullptr);
-  EXPECT_EQ(rec(c, "recA")->userInfoDict(), user);
-  EXPECT_EQ(rec(c, kZerithBackendQRS)->userInfoDict(), user);
+  c.session->fetchStatesWithUserInfo(user("mail"), nullptr);
+  EXPECT_EQ(rec(c, "recA")->userInfoDict(), user("mail"));
+  EXPECT_EQ(rec(c, kZerithBackendQRS)->userInfoDict(), user("mail"));
   // The user-info update hands the session's key on again, with the
   // algorithm the session keeps (never the one setDigestKey was given).
   EXPECT_EQ(rec(c, kZerithBackendQRS)->digestKey(), Data({1, 2, 3}));
@@ -410,18 +385,15 @@ TEST_F(SessionBackendsTest, UserInfoReachesEveryBackendAndTheDigestKeyOnlyTheDig
 }
 
 TEST_F(SessionBackendsTest, DisplayURLComesFromTheFirstHttpsBackendThatHasOneThenTheDashboard) {
-  useStorebag({{kZerithBackendDashboard, Value(Dictionary{{"displayURL", Value("https://dash/1")}})},
-               {kZerithBackendHTTPPost, Value(Dictionary{})},
-               {kZerithBackendHTTPPost2, Value(Dictionary{{"displayURL", Value("https://post2/1")}})}});
+  useStorebag({{kZerithBackendDashboard, {{"displayURL", Value("https://dash/1")}}},
+               {kZerithBackendHTTPPost, {}},
+               {kZerithBackendHTTPPost2, {{"displayURL", Value("https://post2/1")}}}});
   auto c = started(sessionInfo(5));
-  std::optional<Value> url;
-  c.session->fetchDisplayURL([&](Value v) { url = v; });
-  EXPECT_EQ(url, Value("https://post2/1"));
+  EXPECT_EQ(answer([&](auto done) { c.session->fetchDisplayURL(done); }), Value("https://post2/1"));
 
-  useStorebag({{kZerithBackendDashboard, Value(Dictionary{{"displayURL", Value("https://dash/1")}})}});
+  useStorebag({{kZerithBackendDashboard, {{"displayURL", Value("https://dash/1")}}}});
   auto d = started(sessionInfo(6, 8));
-  d.session->fetchDisplayURL([&](Value v) { url = v; });
-  EXPECT_EQ(url, Value("https://dash/1"));
+  EXPECT_EQ(answer([&](auto done) { d.session->fetchDisplayURL(done); }), Value("https://dash/1"));
 }
 
 TEST_F(SessionBackendsTest, DispatchFlushesAndHierarchyChangesFromManyThreadsFinishTogether) {
@@ -429,7 +401,7 @@ TEST_F(SessionBackendsTest, DispatchFlushesAndHierarchyChangesFromManyThreadsFin
   // child dispatching and flushing while its root changes user info (which
   // walks the hierarchy under the agent lock and reads the child's backend
   // states), shares data, and a third session joins and leaves the token.
-  useStorebag({{"recA", Value(Dictionary{{"flushDeferred", Value(false)}})}, {"recB", Value(Dictionary{})}});
+  useStorebag({{"recA", {{"flushDeferred", Value(false)}}}, {"recB", {}}});
   auto root = started(hierarchyInfo(1, "busy", 0), /*aggregator=*/true);
   auto child = started(hierarchyInfo(2, "busy", 1));
   constexpr int kRounds = 300;
@@ -469,8 +441,7 @@ TEST_F(SessionBackendsTest, DispatchFlushesAndHierarchyChangesFromManyThreadsFin
 // --- Health and the end of a session -------------------------------------------------------------
 
 TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedUp) {
-  useStorebag({{"recA", Value(Dictionary{{"batchedBytes", Value(300)}})},
-               {"recB", Value(Dictionary{{"batchedBytes", Value(45)}})}});
+  useStorebag({{"recA", {{"batchedBytes", Value(300)}}}, {"recB", {{"batchedBytes", Value(45)}}}});
   auto other = started(sessionInfo(6));  // another type-7 session, still live
   auto c = started(sessionInfo(5));
   EXPECT_EQ(c.session->batchedEventsSize(), 345u);
@@ -497,8 +468,8 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
 }
 
 TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTheTotalsOfEndedSessions) {
-  useStorebag({{"recA", Value(Dictionary{{"whitelist", Value(Array{Value(0), Value(3)})}})},
-               {"recB", Value(Dictionary{{"blacklist", Value(Array{Value(4)})}})}});
+  useStorebag({{"recA", {{"whitelist", Value(Array{Value(0), Value(3)})}}},
+               {"recB", {{"blacklist", Value(Array{Value(4)})}}}});
   auto other = started(sessionInfo(6));
   auto c = started(sessionInfo(5));
   for (const unsigned category : {3u, 4u, 5u}) {
@@ -555,8 +526,7 @@ TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTh
 // --- One-shot messages ------------------------------------------------------------------------------
 
 TEST_F(SessionBackendsTest, OneShotHandsThePayloadItselfToAThrowAwaySet) {
-  useStorebag({{"recA", Value(Dictionary{{"result", Value("one#")}})},
-               {"recB", Value(Dictionary{{"whitelist", Value(Array{Value(9)})}})}});
+  useStorebag({{"recA", {{"result", Value("one#")}}}, {"recB", {{"whitelist", Value(Array{Value(9)})}}}});
   std::vector<std::shared_ptr<RecordingBackend>> made;
   RecordingBackend::registerBackendKind("recA", [&](std::string_view n, const Value& p,
                                                     const std::optional<std::string>& f, std::int32_t) {
@@ -564,10 +534,9 @@ TEST_F(SessionBackendsTest, OneShotHandsThePayloadItselfToAThrowAwaySet) {
     return made.back();
   });
   auto c = newSession();
-  std::optional<Value> reply;
   const Value payload(Dictionary{{"k", Value("v")}});
-  c.session->sendMessageWithSessionInfo(sessionInfo(8), Value(Dictionary{{kZerithUserInfoClientName, Value("x")}}), 4,
-                                        2, payload, [&](Value v) { reply = v; });
+  const auto reply =
+      answer([&](auto done) { c.session->sendMessageWithSessionInfo(sessionInfo(8), user("x"), 4, 2, payload, done); });
   EXPECT_EQ(reply, Value("finished"));
   ASSERT_EQ(made.size(), 1u);
   const auto events = made[0]->events();

@@ -28,8 +28,14 @@ class ZerithdSessionTest : public AgentFixture {
     ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
   }
 
-  static Value user(const std::string& client, const std::string& service = "sync") {
-    return Value(Dictionary{{kZerithUserInfoClientName, Value(client)}, {kZerithUserInfoServiceName, Value(service)}});
+  static std::optional<Value> oneShot(const Client& c, const Value& info, const Value& userInfo = Value()) {
+    return answer([&](auto done) { c.session->sendMessageWithSessionInfo(info, userInfo, 1, 2, Value(), done); });
+  }
+
+  static Value required(std::uint32_t sessionID) {
+    Dictionary info = sessionInfo(sessionID).dictCopy();
+    info.set(kZerithSessionInfoRequireUserInfo, Value(true));
+    return Value(std::move(info));
   }
 };
 
@@ -66,56 +72,41 @@ TEST_F(ZerithdSessionTest, HierarchyTokenThatIsNotADictionaryMakesAStandaloneSes
   EXPECT_TRUE(logs.has(Level::Debug, "setSessionInfo: Configuring session 5"));
 }
 
-TEST_F(ZerithdSessionTest, UserInfoGivenWithoutBeingRequiredIsLoggedAndKept) {
+TEST_F(ZerithdSessionTest, UserInfoGivenWithoutBeingRequiredIsLoggedAndANilOneIsIgnoredWhileRequired) {
   auto s = newSession(sessionInfo(5), false, user("mail"));
   EXPECT_TRUE(logs.has(Level::Error, "setSessionInfo: Configure session: user info provided without requiring it"));
   EXPECT_EQ(s.session->userInfo(), user("mail"));
-
-  Dictionary required = sessionInfo(6).dictCopy();
-  required.set(kZerithSessionInfoRequireUserInfo, Value(true));
   logs.clear();
-  s.session->setSessionInfo(Value(required), user("mail"), Value(), false);
+  s.session->setSessionInfo(required(6), user("mail"), Value(), false);
   EXPECT_FALSE(logs.contains("user info provided without requiring it"));
   EXPECT_EQ(s.session->sessionID(), 6u);  // a second call overwrites
+  s.session->receivedUserInfo(Value());
+  EXPECT_EQ(s.session->userInfo(), user("mail"));
 }
 
 TEST_F(ZerithdSessionTest, OnlyANameChangeInUserInfoRerunsTheStateUpdate) {
   auto s = newSession(sessionInfo(5));
-  const std::string changed = "receivedUserInfo: Received new user info for session 5";
-
+  const auto changes = [&] { return logs.count("receivedUserInfo: Received new user info for session 5"); };
   s.session->receivedUserInfo(Value());  // none before, none now: ignored
-  EXPECT_EQ(logs.count(changed), 0u);
+  EXPECT_EQ(changes(), 0u);
   s.session->receivedUserInfo(user("mail"));  // the first counts as changed
-  EXPECT_EQ(logs.count(changed), 1u);
+  EXPECT_EQ(changes(), 1u);
   Dictionary sameNames = user("mail").dictCopy();
   sameNames.set("extra", Value(1));
   s.session->receivedUserInfo(Value(sameNames));  // stored, but the names are the same
-  EXPECT_EQ(logs.count(changed), 1u);
+  EXPECT_EQ(changes(), 1u);
   EXPECT_EQ(s.session->userInfo(), Value(sameNames));
   s.session->receivedUserInfo(user("mail", "push"));
-  EXPECT_EQ(logs.count(changed), 2u);
-}
-
-TEST_F(ZerithdSessionTest, NilUserInfoIsIgnoredWhileUserInfoIsRequired) {
-  Dictionary required = sessionInfo(5).dictCopy();
-  required.set(kZerithSessionInfoRequireUserInfo, Value(true));
-  auto s = newSession(Value(required), false, user("mail"));
-  s.session->receivedUserInfo(Value());
-  EXPECT_EQ(s.session->userInfo(), user("mail"));
-
-  auto optional = newSession(sessionInfo(6), false, user("mail"));
-  optional.session->receivedUserInfo(Value());  // not required: the names changed to none
-  EXPECT_TRUE(optional.session->userInfo().isNil());
-  EXPECT_TRUE(logs.has(Level::Debug, "receivedUserInfo: Received new user info for session 6"));
+  EXPECT_EQ(changes(), 2u);
+  s.session->receivedUserInfo(Value());  // not required: the names changed to none
+  EXPECT_TRUE(s.session->userInfo().isNil());
+  EXPECT_EQ(changes(), 3u);
 }
 
 TEST_F(ZerithdSessionTest, NoStorebagCompletesTheStartWithNilAndSendsNoEndMessage) {
   storebag = Value();
   auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-  std::optional<Value> result;
-  s.session->startConfigWithCompletionHandler([&](Value v) { result = v; });
-  ASSERT_TRUE(result.has_value());
-  EXPECT_TRUE(result->isNil());
+  EXPECT_EQ(answer([&](auto done) { s.session->startConfigWithCompletionHandler(done); }), Value());
   EXPECT_TRUE(s.session->storebagVersion().isNil());
   EXPECT_TRUE(logs.has(Level::Debug, "startConfigWithCompletionHandler: Starting configuration for session 5"));
   EXPECT_FALSE(logs.contains("createBackendsWithStorebag"));
@@ -131,18 +122,12 @@ TEST_F(ZerithdSessionTest, NoStorebagCompletesTheStartWithNilAndSendsNoEndMessag
 
 TEST_F(ZerithdSessionTest, StorebagConfiguresTheSessionWithNoEnabledBackend) {
   auto s = newSession(sessionInfo(5));
-  std::optional<Value> result;
-  s.session->startConfigWithCompletionHandler([&](Value v) { result = v; });
-  ASSERT_TRUE(result.has_value());
-  EXPECT_EQ(*result, Value(Array{}));
+  EXPECT_EQ(answer([&](auto done) { s.session->startConfigWithCompletionHandler(done); }), Value(Array{}));
   EXPECT_EQ(s.session->storebagVersion(), Value("42"));
   EXPECT_TRUE(logs.has(Level::Debug, "createBackendsWithStorebag: Creating backends for session 5"));
   EXPECT_TRUE(logs.has(Level::Debug, "internalSendMessage: Sent internal message (method:0 respCode:0)"));
 
-  std::optional<Value> states;
-  s.session->fetchStatesWithUserInfo(Value(), [&](Value v) { states = v; });
-  ASSERT_TRUE(states.has_value());
-  EXPECT_EQ(*states, Value(Array{}));
+  EXPECT_EQ(answer([&](auto done) { s.session->fetchStatesWithUserInfo(Value(), done); }), Value(Array{}));
   EXPECT_TRUE(logs.has(Level::Debug, "fetchStatesWithUserInfo: Fetching states for session 5"));
 }
 
@@ -176,53 +161,32 @@ TEST_F(ZerithdSessionTest, StartMessageCarriesLocaleAndAutomaticTimeOnCustomerBu
 
 TEST_F(ZerithdSessionTest, FlushAndDisplayURLBeforeConfigurationFailWithoutBackends) {
   auto s = newSession(sessionInfo(5));
-  std::optional<Value> url;
-  s.session->fetchDisplayURL([&](Value v) { url = v; });
-  EXPECT_EQ(url, Value("URL not available"));
+  EXPECT_EQ(answer([&](auto done) { s.session->fetchDisplayURL(done); }), Value("URL not available"));
   EXPECT_TRUE(logs.has(Level::Debug, "fetchDisplayURL: Fetching display URL for session 5"));
-  int calls = 0;
-  s.session->flushMessagesWithCompletion([&](Value text, std::optional<Error> error) {
-    ++calls;
-    EXPECT_TRUE(text.isNil());
-    ASSERT_TRUE(error.has_value());
-    EXPECT_EQ(*error, (Error{kZerithErrorDomain, -1, "No backends available to send message"}));
-  });
-  EXPECT_EQ(calls, 1);
+  EXPECT_EQ(flush(*s.session), (std::vector<FlushAnswer>{
+                                   {Value(), Error{kZerithErrorDomain, -1, "No backends available to send message"}}}));
   EXPECT_TRUE(logs.has(Level::Debug, "flushMessagesWithCompletion: Flushing messages for session 5"));
   EXPECT_TRUE(logs.has(Level::Debug, "internalFlushMessagesWithCompletion: No backends available to send message"));
 
   // Configured with an empty backend set the flush completes at once, without an error.
   s.session->startConfigWithCompletionHandler(nullptr);
-  s.session->flushMessagesWithCompletion([&](Value text, std::optional<Error> error) {
-    ++calls;
-    EXPECT_TRUE(text.isNil());
-    EXPECT_FALSE(error.has_value());
-  });
-  EXPECT_EQ(calls, 2);
+  EXPECT_EQ(flush(*s.session), (std::vector<FlushAnswer>{{Value(), std::nullopt}}));
 }
 
 TEST_F(ZerithdSessionTest, MessagesAreCheckedForCategoryFirstThenType) {
   auto s = newSession(sessionInfo(5));
-  std::vector<Value> replies;
-  auto reply = [&](Value v) { replies.push_back(v); };
-
-  s.session->sendMessageWithDictionary(Value(Dictionary{}), reply);
+  EXPECT_TRUE(send(s, Value(Dictionary{})).isNil());
   EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: No backends available to send message"));
   EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Sending message for session 5"));
 
   s.session->startConfigWithCompletionHandler(nullptr);
   logs.clear();
-  s.session->sendMessageWithDictionary(Value(Dictionary{}), reply);
+  EXPECT_TRUE(send(s, Value(Dictionary{})).isNil());
   EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'category'"));
   EXPECT_FALSE(logs.contains("Missing mandatory parameter 'type'"));
-  s.session->sendMessageWithDictionary(Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}}), reply);
+  EXPECT_TRUE(send(s, Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}})).isNil());
   EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'type'"));
-  s.session->sendMessageWithDictionary(
-      Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}, {kZerithMessageParametersType, Value(4)}}), reply);
-  ASSERT_EQ(replies.size(), 4u);
-  for (const auto& r : replies) {
-    EXPECT_TRUE(r.isNil());
-  }
+  EXPECT_TRUE(send(s, event(3, 4)).isNil());
 }
 
 TEST_F(ZerithdSessionTest, UploadsAreRefusedWithoutAnUploadBackend) {
@@ -279,14 +243,8 @@ TEST_F(ZerithdSessionTest, EndMessageSaysWhetherTheSessionFinishedGracefully) {
 TEST_F(ZerithdSessionTest, UserInfoEntriesReplacePayloadEntriesOnTheWayToTheAggregator) {
   auto s = newSession(sessionInfo(5), /*aggregator=*/true, Value(Dictionary{{"a", Value(2)}}));
   s.session->startConfigWithCompletionHandler(nullptr);
-  s.session->sendMessageWithDictionary(
-      Value(Dictionary{{kZerithMessageParametersCategory, Value(3)},
-                       {kZerithMessageParametersType, Value(70000)},  // narrowed to 16 bits
-                       {kZerithMessageParametersPayload, Value(Dictionary{{"a", Value(1)}, {"b", Value(1)}})}}),
-      nullptr);
-  s.session->sendMessageWithDictionary(
-      Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}, {kZerithMessageParametersType, Value(4)}}),
-      nullptr);
+  send(s, event(3, 70000, Value(Dictionary{{"a", Value(1)}, {"b", Value(1)}})));  // the type narrowed to 16 bits
+  send(s, event(3, 4));
   const auto sent = aggregated(*s.connection);
   ASSERT_EQ(sent.size(), 3u);  // the start message and the two events
   EXPECT_EQ(sent[1].get("payload"), Value(Dictionary{{"a", Value(2)}, {"b", Value(1)}}));
@@ -299,9 +257,7 @@ TEST_F(ZerithdSessionTest, EventsOfADescendantGoOnlyToTheAggregatingAncestor) {
   auto parent = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
   auto child = newSession(hierarchyInfo(2, "call", 1));
   child.session->startConfigWithCompletionHandler(nullptr);
-  child.session->sendMessageWithDictionary(
-      Value(Dictionary{{kZerithMessageParametersCategory, Value(9)}, {kZerithMessageParametersType, Value(1)}}),
-      nullptr);
+  send(child, event(9, 1));
   const auto atParent = aggregated(*parent.connection);
   ASSERT_EQ(atParent.size(), 2u);  // the child's start message and its event
   EXPECT_EQ(atParent[1].get("message"), hierarchyInfo(2, "call", 1));
@@ -316,14 +272,10 @@ TEST_F(ZerithdSessionTest, EventsOfADescendantGoOnlyToTheAggregatingAncestor) {
 
 TEST_F(ZerithdSessionTest, OneShotWithoutIdentifiersIsRefusedBeforeAnyStorebagLookup) {
   auto s = newSession();
-  std::vector<Value> replies;
-  s.session->sendMessageWithSessionInfo(Value(Dictionary{{kZerithSessionInfoClientType, Value(7)}}), Value(), 1, 2,
-                                        Value(), [&](Value v) { replies.push_back(v); });
-  s.session->sendMessageWithSessionInfo(Value(Dictionary{{kZerithSessionInfoSessionID, Value(7)}}), Value(), 1, 2,
-                                        Value(), [&](Value v) { replies.push_back(v); });
-  ASSERT_EQ(replies.size(), 2u);
-  EXPECT_EQ(replies[0], Value("Could not retrieve identifiers from sessionInfo"));
-  EXPECT_EQ(replies[1], Value("Could not retrieve identifiers from sessionInfo"));
+  for (const char* only : {kZerithSessionInfoClientType, kZerithSessionInfoSessionID}) {
+    EXPECT_EQ(oneShot(s, Value(Dictionary{{only, Value(7)}})), Value("Could not retrieve identifiers from sessionInfo"))
+        << only;
+  }
   EXPECT_EQ(countExact(Level::Error, "sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo"),
             2u);
   EXPECT_TRUE(fetchedClientTypes.empty());
@@ -332,9 +284,7 @@ TEST_F(ZerithdSessionTest, OneShotWithoutIdentifiersIsRefusedBeforeAnyStorebagLo
 
 TEST_F(ZerithdSessionTest, OneShotConfiguresTheSessionAndAnswersByStorebag) {
   auto s = newSession();
-  std::vector<Value> replies;
-  s.session->sendMessageWithSessionInfo(hierarchyInfo(8, "call", 0), user("mail"), 1, 2, Value(),
-                                        [&](Value v) { replies.push_back(v); });
+  EXPECT_EQ(oneShot(s, hierarchyInfo(8, "call", 0), user("mail")), Value("finished"));
   EXPECT_EQ(s.session->sessionID(), 8u);
   EXPECT_EQ(s.session->hierarchyToken(), Value("call"));
   EXPECT_EQ(s.session->userInfo(), user("mail"));
@@ -344,11 +294,7 @@ TEST_F(ZerithdSessionTest, OneShotConfiguresTheSessionAndAnswersByStorebag) {
 
   storebag = Value();
   auto other = newSession();
-  other.session->sendMessageWithSessionInfo(sessionInfo(9, 2), Value(), 1, 2, Value(),
-                                            [&](Value v) { replies.push_back(v); });
-  ASSERT_EQ(replies.size(), 2u);
-  EXPECT_EQ(replies[0], Value("finished"));
-  EXPECT_EQ(replies[1], Value("storebag not available"));
+  EXPECT_EQ(oneShot(other, sessionInfo(9, 2)), Value("storebag not available"));
 }
 
 }  // namespace

@@ -239,24 +239,24 @@ TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
   auto args = baseArgs();
   args.insert(args.end(), {"--max-body", "100000", "--max-inflated", "200000"});
   CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
-  const auto bomb = curlRequest(collector.url("/post"), certs / "ca.pem", gzipOf(std::string(4 << 20, 'a')),
-                                {"Content-Encoding: gzip"});
-  EXPECT_EQ(bomb.status, 413);
-  auto line = collector.nextLine();
-  ASSERT_TRUE(line);
-  EXPECT_EQ((*line)["kind"], "refused");
-  const auto big = curlRequest(collector.url("/post"), certs / "ca.pem", std::string(100001, 'a'), {});
-  EXPECT_EQ(big.status, 413);
-  ASSERT_TRUE(collector.nextLine());
-  const auto broken = curlRequest(collector.url("/post"), certs / "ca.pem", "\x1f\x8bnot gzip", {});
-  EXPECT_EQ(broken.status, 415);
-  ASSERT_TRUE(collector.nextLine());
-  // Still answering.
-  const auto fine = curlRequest(collector.url("/post"), certs / "ca.pem", "{\"postTime\":1}", {});
-  EXPECT_EQ(fine.status, 200);
-  line = collector.nextLine();
-  ASSERT_TRUE(line);
-  EXPECT_EQ((*line)["kind"], "envelope");
+  const struct {
+    const char* name;
+    std::string body;
+    std::vector<std::string> headers;
+    long status;
+    const char* kind;
+  } requests[] = {
+      {"gzip bomb", gzipOf(std::string(4 << 20, 'a')), {"Content-Encoding: gzip"}, 413, "refused"},
+      {"too large", std::string(100001, 'a'), {}, 413, "refused"},
+      {"broken gzip", "\x1f\x8bnot gzip", {}, 415, "refused"},
+      {"fine, still answered", "{\"postTime\":1}", {}, 200, "envelope"},
+  };
+  for (const auto& r : requests) {
+    EXPECT_EQ(curlRequest(collector.url("/post"), certs / "ca.pem", r.body, r.headers).status, r.status) << r.name;
+    const auto line = collector.nextLine();
+    ASSERT_TRUE(line) << r.name;
+    EXPECT_EQ((*line)["kind"], r.kind) << r.name;
+  }
 }
 
 TEST_F(CollectorToolTest, ServesStaticFilesWithLastModifiedAndNothingOutsideItsFolder) {

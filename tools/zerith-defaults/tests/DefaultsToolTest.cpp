@@ -40,16 +40,16 @@ class DefaultsToolTest : public ::testing::Test {
 };
 
 TEST_F(DefaultsToolTest, TypedWritesAsTheExecutableParsesThem) {
-  EXPECT_EQ(runTool("write com.velmar.zerith environmentType -int -1").status, 0);
-  EXPECT_EQ(runTool("write com.velmar.zerith forceEventLogging -bool YES").status, 0);
-  EXPECT_EQ(runTool("write com.velmar.zerith ratio -real 0.25").status, 0);
-  EXPECT_EQ(runTool("write com.velmar.zerith httpsPostURL https://127.0.0.1:8443/post").status, 0);
-  EXPECT_EQ(runTool("write com.velmar.zerith label -string -int").status, 0);
-  EXPECT_EQ(domain_.objectForKey("environmentType"), Value(-1));
-  EXPECT_EQ(domain_.objectForKey("forceEventLogging"), Value(true));
-  EXPECT_EQ(domain_.objectForKey("ratio"), Value(0.25));
-  EXPECT_EQ(domain_.objectForKey("httpsPostURL"), Value("https://127.0.0.1:8443/post"));
-  EXPECT_EQ(domain_.objectForKey("label"), Value("-int"));
+  const std::pair<std::string, Value> writes[] = {
+      {"environmentType -int -1", Value(-1)},
+      {"forceEventLogging -bool YES", Value(true)},
+      {"ratio -real 0.25", Value(0.25)},
+      {"httpsPostURL https://127.0.0.1:8443/post", Value("https://127.0.0.1:8443/post")},
+      {"label -string -int", Value("-int")}};
+  for (const auto& [arguments, value] : writes) {
+    EXPECT_EQ(runTool("write com.velmar.zerith " + arguments).status, 0) << arguments;
+    EXPECT_EQ(domain_.objectForKey(arguments.substr(0, arguments.find(' '))), value) << arguments;
+  }
 
   const Result read = runTool("read com.velmar.zerith environmentType");
   EXPECT_EQ(read.status, 0);
