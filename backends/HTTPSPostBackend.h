@@ -89,9 +89,9 @@ class HTTPSPostBackend : public ZerithBackend {
                             std::uint16_t eventID) const;
   void prepareEventForMessage(Dictionary& event, const Value& frameworkData) const;
   std::optional<std::string> batchEvent(Dictionary event);
-  // The compact envelope, or nullopt when it cannot be serialised. When
-  // `prettyJsonString` is given and printing is allowed, it receives the
-  // pretty-printed copy.
+  // The compact envelope (entries JSON cannot carry left out and logged).
+  // When `prettyJsonString` is given and printing is allowed, it receives
+  // the pretty-printed copy.
   std::optional<std::string> createMessageForPostAndLogging(std::vector<Dictionary> events,
                                                             std::optional<std::string>* prettyJsonString) const;
   void postJSONMessage(const std::string& json, std::int32_t flag, std::optional<std::uint16_t> method,

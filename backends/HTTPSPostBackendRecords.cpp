@@ -4,11 +4,12 @@
 #include "backends/HTTPSPostBackend.h"
 #include "backends/BackendsLog.h"
 #include "backends/HTTPSPostBackendHelpers.h"
+#include "backends/RecordJson.h"
 #include "backends/Spool.h"
 
 #include <algorithm>
 #include <cmath>
-#include <exception>
+#include <functional>
 
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
@@ -25,31 +26,6 @@ namespace zerith {
 
 using https_post_detail::kRecordKeys;
 using https_post_detail::recordInteger;
-
-namespace {
-
-// The value of a record entry on the wire, or nullopt when JSON cannot carry
-// it (logged). Dates become seconds since 1970.
-std::optional<nlohmann::ordered_json> wireValue(const std::string& key, const Value& v) {
-  switch (v.type()) {
-    case Value::Type::Bool: return nlohmann::ordered_json(v.boolValue());
-    case Value::Type::Int: return nlohmann::ordered_json(v.intValue());
-    case Value::Type::UInt: return nlohmann::ordered_json(v.unsignedValue());
-    case Value::Type::Real:
-      if (std::isfinite(v.doubleValue())) {
-        return nlohmann::ordered_json(v.doubleValue());
-      }
-      break;
-    case Value::Type::String: return nlohmann::ordered_json(*v.string());
-    case Value::Type::Date: return nlohmann::ordered_json(sanitizeDouble(v.date()->secondsSince1970));
-    default: break;
-  }
-  backendsLogger().error("HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable to handle key: {}, value: {}",
-                 key, v.description());
-  return std::nullopt;
-}
-
-}  // namespace
 
 // ---------------------------------------------------------------------------
 // Records, batch and envelope
@@ -188,28 +164,6 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
   gettimeofday(&now, nullptr);
   const Fields f = fields();
 
-  auto records = nlohmann::ordered_json::array();
-  auto& recordList = records.get_ref<nlohmann::ordered_json::array_t&>();
-  recordList.reserve(events.size());
-  for (const Dictionary& event : events) {
-    auto record = nlohmann::ordered_json::object();
-    auto& entries = record.get_ref<nlohmann::ordered_json::object_t&>();
-    entries.reserve(event.size());
-    for (const auto& [key, value] : event) {
-      if (auto wire = wireValue(key, value)) {
-        // A record's keys are unique already: appended without the ordered
-        // map's search for an equal key.
-        entries.emplace_back(key, std::move(*wire));
-      }
-    }
-    if (f.spoolEnabled) {
-      // Set once, here: a spooled batch is posted again byte for byte, so
-      // the collector sees the same ID on every copy of the record.
-      entries.emplace_back("_recordID", newRecordID());
-    }
-    recordList.push_back(std::move(record));
-  }
-
   std::optional<std::string> clientId = f.uuidCustom ? f.uuidCustom : (f.dnuType != 0 ? f.uuidOverrideDnu : f.uuidRespectDnu);
   if (f.extrasOnInternal != 0 && isInternal()) {
     const char* device = udid();
@@ -217,22 +171,14 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
   }
 
   // The three keys go in as one list that ends at the first absent value.
-  auto envelope = nlohmann::ordered_json::object();
-  envelope["postTime"] = sanitizeDouble(timevalToSeconds(now));
-  if (clientId) {
-    envelope["clientId"] = *clientId;
-    envelope["events"] = std::move(records);
-  }
-
-  std::string compact;
-  try {
-    // Text that is not UTF-8 is carried with replacement characters rather
-    // than breaking the JSON.
-    compact = envelope.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
-  } catch (const std::exception& e) {
-    backendsLogger().error("HTTPSPostBackend(createMessageForPostAndLogging): cannot serialise the envelope: {}", e.what());
-    return std::nullopt;
-  }
+  // Set once, here: a spooled batch is posted again byte for byte, so the
+  // collector sees the same ID on every copy of a record.
+  const std::function<std::string()> recordID = f.spoolEnabled ? std::function<std::string()>(newRecordID) : nullptr;
+  std::string compact = envelopeJson(timevalToSeconds(now), clientId, events, recordID, [](const std::string& key, const Value& v) {
+    backendsLogger().error(
+        "HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable to handle key: {}, value: {}", key,
+        v.description());
+  });
 
   if (prettyJsonString) {
     const ZerithEnvironmentType environment =
@@ -240,7 +186,8 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
     const bool forced = (environment == kEnvironmentDevelopment || environment == kEnvironmentInternal) && f.forceEventLogging;
     const bool consented = f.dnuType == 0 && f.dnuEnabled;
     if (forced || consented) {
-      *prettyJsonString = envelope.dump(4, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+      // Read back from the text just written (valid JSON, UTF-8 already).
+      *prettyJsonString = nlohmann::ordered_json::parse(compact).dump(4);
     }
   }
   return compact;

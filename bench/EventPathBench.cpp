@@ -7,7 +7,10 @@
 // - the daemon's answer to an event (a reply frame with empty arguments);
 // - 50 events made records by the HTTPS backend (payload copy, its keys,
 //   user info, filters) and written as one envelope, beside nlohmann-json
-//   dumping an envelope of the same 50 records already built as its objects.
+//   dumping an envelope of the same 50 records already built as its objects;
+// - the envelope of those 50 records alone, written by the backend's
+//   streaming writer, beside the nlohmann tree per record and its dump that
+//   the backend used before (the same records, IDs and drops).
 // The event is the end-to-end pipeline benchmark's (bench/pipeline).
 
 #include <benchmark/benchmark.h>
@@ -21,6 +24,9 @@
 #include <nlohmann/json.hpp>
 
 #include "backends/HTTPSPostBackend.h"
+#include "backends/RecordJson.h"
+#include "backends/Spool.h"
+#include "backends/tests/RecordJsonReference.h"
 #include "bench/BenchBackend.h"
 #include "bench/pipeline/BenchEvent.h"
 #include "config/DeviceInfo.h"
@@ -199,6 +205,38 @@ void BM_ReferenceEnvelopeDump(benchmark::State& state) {
   state.SetItemsProcessed(state.iterations() * kBatch);
 }
 
+// The 50 records as the backend batches them, then their envelope alone,
+// written by `write` (the backend's writer or the tree it replaced).
+template <typename Write>
+void envelopeOf50(benchmark::State& state, Write write) {
+  test::TempRoot root;
+  auto b = makeBackend();
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  std::vector<Dictionary> records;
+  for (int i = 0; i < kBatch; ++i) {
+    Dictionary record = b->newEventDictfromPayload(message(static_cast<std::uint64_t>(i))[kZerithMessageParametersPayload],
+                                                   now, 42, 7, 1);
+    b->prepareEventForMessage(record, Value());
+    records.push_back(std::move(record));
+  }
+  const std::optional<std::string> clientId("E621E1F8-C36C-495A-93FC-0C247A3E6E5F");
+  const auto none = [](const std::string&, const Value&) {};
+  std::size_t bytes = 0;
+  const AllocationCount before;
+  for (auto _ : state) {
+    const std::string body = write(1.7e9, clientId, records, newRecordID, none);
+    bytes += body.size();
+    benchmark::DoNotOptimize(body);
+  }
+  countAllocations(state, before, state.iterations() * kBatch);
+  state.SetItemsProcessed(state.iterations() * kBatch);
+  state.counters["envelope bytes"] = static_cast<double>(bytes) / static_cast<double>(state.iterations());
+}
+
+void BM_EnvelopeWriteOf50(benchmark::State& state) { envelopeOf50(state, envelopeJson); }
+void BM_ReferenceTreeEnvelopeOf50(benchmark::State& state) { envelopeOf50(state, test::treeEnvelopeJson); }
+
 }  // namespace
 
 BENCHMARK(BM_EventFrameDecode);
@@ -206,5 +244,7 @@ BENCHMARK(BM_EventReplyEncode);
 BENCHMARK(BM_ReferenceJsonLineParse);
 BENCHMARK(BM_RecordsAndEnvelopeOf50);
 BENCHMARK(BM_ReferenceEnvelopeDump);
+BENCHMARK(BM_EnvelopeWriteOf50);
+BENCHMARK(BM_ReferenceTreeEnvelopeOf50);
 
 BENCHMARK_MAIN();

@@ -11,6 +11,7 @@
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size);  // the dashboard datagram's
 extern "C" int spoolFileFuzzOneInput(const std::uint8_t* data, std::size_t size);
+extern "C" int recordJsonFuzzOneInput(const std::uint8_t* data, std::size_t size);
 
 namespace zerith::test {
 namespace {
@@ -38,7 +39,8 @@ TEST_P(FuzzCorpusTest, EveryInputIsReadWithItsInvariants) {
 
 INSTANTIATE_TEST_SUITE_P(Targets, FuzzCorpusTest,
                          ::testing::Values(Corpus{"dashboard_datagram_fuzz", LLVMFuzzerTestOneInput, 6},
-                                           Corpus{"spool_file_fuzz", spoolFileFuzzOneInput, 7}),
+                                           Corpus{"spool_file_fuzz", spoolFileFuzzOneInput, 7},
+                                           Corpus{"record_json_fuzz", recordJsonFuzzOneInput, 4}),
                          [](const ::testing::TestParamInfo<Corpus>& info) { return std::string(info.param.name); });
 
 }  // namespace
