@@ -131,6 +131,9 @@ std::string envelopeJson(double postTime, const std::optional<std::string>& clie
     for (const Dictionary& record : records) {
       w.StartObject();
       for (const auto& [key, value] : record) {
+        if (recordID && key == "_recordID") {
+          continue;  // the spool's own identifier below takes its place: one key, not two
+        }
         if (carried(value)) {
           writeKey(w, key, scratch);
           writeValue(w, value, scratch);

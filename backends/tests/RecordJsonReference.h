@@ -26,6 +26,9 @@ inline std::string treeEnvelopeJson(double postTime, const std::optional<std::st
     json object = json::object();
     auto& entries = object.get_ref<json::object_t&>();
     for (const auto& [key, v] : record) {
+      if (recordID && key == "_recordID") {
+        continue;
+      }
       switch (v.type()) {
         case Value::Type::Bool: entries.emplace_back(key, v.boolValue()); break;
         case Value::Type::Int: entries.emplace_back(key, v.intValue()); break;

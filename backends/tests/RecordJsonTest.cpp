@@ -52,12 +52,20 @@ TEST(RecordJsonTest, WritesWhatTheTreeDumpedWithKeysInOrder) {
           const std::string text = writer(postTime, clientId, batch,
                                           ids ? std::function<std::string()>([&n] { return fmt::format("id{}", n++); }) : nullptr,
                                           [&](const std::string& key, const Value&) { dropped.push_back(key); });
-          return std::pair(nlohmann::ordered_json::parse(text), dropped);
+          // A payload's own "_recordID" gives way to the spool's: one key per record, never two.
+          std::size_t ids = 0;
+          for (auto at = text.find("\"_recordID\""); at != std::string::npos; at = text.find("\"_recordID\"", at + 1)) {
+            ++ids;
+          }
+          return std::tuple(nlohmann::ordered_json::parse(text), dropped, ids);
         };
-        const auto [ours, oursDropped] = written(envelopeJson);
-        const auto [tree, treeDropped] = written(treeEnvelopeJson);
+        const auto [ours, oursDropped, oursIds] = written(envelopeJson);
+        const auto [tree, treeDropped, treeIds] = written(treeEnvelopeJson);
         EXPECT_EQ(ours, tree) << "records " << batch.size() << ": " << ours.dump();
         EXPECT_EQ(oursDropped, treeDropped);
+        if (ids && clientId) {
+          EXPECT_EQ(oursIds, batch.size());
+        }
       }
     }
   }
