@@ -148,22 +148,18 @@ TEST(SpoolConfigTest, BadValuesFallBackToTheDefaults) {
                                                                        {"spoolMaxAgeSeconds", "forever"},
                                                                        {"spoolRetryInitialSeconds", Array{}},
                                                                        {"spoolRetryMaxSeconds", 1e12}}));
-  EXPECT_FALSE(bad.enabled);
-  EXPECT_EQ(bad.maxBytes, SpoolConfig::kDefaultMaxBytes);
-  EXPECT_EQ(bad.maxAgeSeconds, SpoolConfig::kDefaultMaxAgeSeconds);
-  EXPECT_EQ(bad.retryInitialSeconds, SpoolConfig::kDefaultRetryInitialSeconds);
-  EXPECT_EQ(bad.retryMaxSeconds, SpoolConfig::kDefaultRetryMaxSeconds);
+  const auto fields = [](const SpoolConfig& c) {
+    return std::tuple(c.enabled, c.maxBytes, c.maxAgeSeconds, c.retryInitialSeconds, c.retryMaxSeconds);
+  };
+  EXPECT_EQ(fields(bad), fields(SpoolConfig{}));
 
   const SpoolConfig good = SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", "YES"},
                                                                         {"spoolMaxBytes", "100000"},
                                                                         {"spoolMaxAgeSeconds", 60},
                                                                         {"spoolRetryInitialSeconds", 0.5},
                                                                         {"spoolRetryMaxSeconds", 0.25}}));
-  EXPECT_TRUE(good.enabled);
-  EXPECT_EQ(good.maxBytes, 100000u);
-  EXPECT_EQ(good.maxAgeSeconds, 60);
   // A ceiling below the first wait is raised to it.
-  EXPECT_EQ(good.retryMaxSeconds, 0.5);
+  EXPECT_EQ(fields(good), std::tuple(true, 100000u, 60, 0.5, 0.5));
   EXPECT_TRUE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", true}})).enabled);
   EXPECT_FALSE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", 2}})).enabled);
 }
@@ -385,10 +381,10 @@ class SpoolRetryTest : public ::testing::Test {
   }
 
   TempRoot root;
+  HttpsTestServer server;
 };
 
 TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
-  HttpsTestServer server;
   std::mutex m;
   int answered = 0;
   server.on("/post", [&](const RecordedRequest&) {
@@ -418,7 +414,6 @@ TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
 }
 
 TEST_F(SpoolRetryTest, WhatAnEarlierRunLeftIsDeliveredAtStart) {
-  HttpsTestServer server;
   server.on("/post", Reply{.status = 200});
   {
     SpoolStore store(root.path() / "spool", 1 << 20, 3600);
@@ -441,7 +436,6 @@ TEST_F(SpoolRetryTest, WhatAnEarlierRunLeftIsDeliveredAtStart) {
 }
 
 TEST_F(SpoolRetryTest, AClientErrorDropsTheBatchForGood) {
-  HttpsTestServer server;
   server.on("/post", Reply{.status = 400});
   SpoolConfig config;
   config.retryInitialSeconds = 0.02;
