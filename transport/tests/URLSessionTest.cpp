@@ -306,50 +306,43 @@ TEST_F(URLSessionTest, WithoutARouteTheRequestWaitsUntilItsOwnTimeoutButARefusal
   EXPECT_EQ(logs.count("has no route to its server"), noRoute);
 }
 
-TEST_F(URLSessionTest, TransfersRequiringExternalPowerWaitWhileOnBattery) {
+// On battery a discretionary transfer goes after its maximum delay; one that
+// requires external power waits (looking at the battery again and again)
+// until its own timeout, or until the power comes.
+TEST_F(URLSessionTest, TransfersOnBatteryWaitForTheirDelayOrForExternalPower) {
   server.on("/p", Reply{.body = "powered"});
   writePowerSupply("BAT0", "Battery", "status", "Discharging");
   writePowerSupply("AC", "Mains", "online", "0");
   auto configuration = URLSessionConfiguration::backgroundSessionConfigurationWithIdentifier("power");
   configuration.discretionary = true;
+  configuration.powerCheckInterval = std::chrono::hours(1);
+  configuration.discretionaryMaxDelay = std::chrono::milliseconds(50);
+  auto session = makeSession(configuration);
+  session->dataTaskWithRequest(get(server.url("/p")))->resume();
+  ASSERT_TRUE(events->waitFor("complete"));
+  EXPECT_EQ(text(delegate->received()), "powered");
+  EXPECT_EQ(logs.count("waits while the device runs on battery"), 1u);
+
   configuration.requiresPowerPluggedIn = true;
   configuration.powerCheckInterval = std::chrono::milliseconds(10);
   configuration.discretionaryMaxDelay = std::chrono::milliseconds(0);  // not enough without external power
-  auto session = makeSession(configuration);
+  session = makeSession(configuration);
+  URLRequest request = get(server.url("/p"));
+  request.timeoutSeconds = 0.1;
+  session->dataTaskWithRequest(request)->resume();
+  ASSERT_TRUE(events->waitFor("complete 28"));
+  EXPECT_EQ(delegate->lastError()->description, "Timeout was reached while waiting for external power");
+
   auto task = session->dataTaskWithRequest(get(server.url("/p")));
   task->setTaskDescription("power");
   task->resume();
   const std::string waiting = "URLSession: task <power> waits while the device runs on battery";
   ASSERT_TRUE(waitForLogCount(logs, waiting, 3));  // each look at the battery logs again
-  EXPECT_EQ(server.requestCount(), 0u);
-
+  EXPECT_EQ(server.requestCount(), 1u);
   writePowerSupply("AC", "Mains", "online", "1");
-  ASSERT_TRUE(events->waitFor("complete"));
+  ASSERT_TRUE(events->waitForCount("complete", 2));
   EXPECT_EQ(text(delegate->received()), "powered");
-  EXPECT_EQ(server.requestCount(), 1u);
-}
-
-TEST_F(URLSessionTest, DiscretionaryTransfersOnBatteryGoAfterTheirMaximumDelayOrTimeOut) {
-  server.on("/d", Reply{.body = "eventually"});
-  writePowerSupply("BAT0", "Battery", "status", "Discharging");
-  auto configuration = URLSessionConfiguration::backgroundSessionConfigurationWithIdentifier("discretionary");
-  configuration.discretionary = true;
-  configuration.powerCheckInterval = std::chrono::hours(1);
-  configuration.discretionaryMaxDelay = std::chrono::milliseconds(50);
-  auto session = makeSession(configuration);
-  session->dataTaskWithRequest(get(server.url("/d")))->resume();
-  ASSERT_TRUE(events->waitFor("complete"));
-  EXPECT_EQ(text(delegate->received()), "eventually");
-  EXPECT_EQ(logs.count("waits while the device runs on battery"), 1u);
-
-  configuration.requiresPowerPluggedIn = true;
-  auto strict = makeSession(configuration);
-  URLRequest request = get(server.url("/d"));
-  request.timeoutSeconds = 0.1;
-  strict->dataTaskWithRequest(request)->resume();
-  ASSERT_TRUE(events->waitFor("complete 28"));
-  EXPECT_EQ(delegate->lastError()->description, "Timeout was reached while waiting for external power");
-  EXPECT_EQ(server.requestCount(), 1u);
+  EXPECT_EQ(server.requestCount(), 2u);
 }
 
 // The socket of this process connected from `localPort` to `remotePort`.
