@@ -214,26 +214,23 @@ TEST_F(DashboardBackendTest, LossyNetworkStillGetsEveryDatagramAcknowledgedWithi
   for (std::uint16_t e = 1; e <= kEvents; ++e) {
     send(*b, Value(Dictionary{{"i", Value(static_cast<int>(e))}}), at(1, 0), 1, 2, e);
   }
-  ASSERT_TRUE(server.waitUntil([&](const std::vector<UdpDatagram>& arrivals) {
-    std::set<std::uint16_t> acked;
-    for (const auto& d : arrivals) {
-      if (d.acknowledged) {
-        acked.insert(be16(d.bytes, 60));
-      }
-    }
-    return acked.size() == kEvents;
-  }));
-  ASSERT_TRUE(watch.waitForCount(0));
-
+  // Copies sent and events acknowledged, per event number.
   std::map<std::uint16_t, int> sent;
   std::set<std::uint16_t> acknowledged;
-  for (const auto& d : server.arrivals()) {
-    const std::uint16_t event = be16(d.bytes, 60);
-    ++sent[event];
-    if (d.acknowledged) {
-      acknowledged.insert(event);
+  const auto tally = [&](const std::vector<UdpDatagram>& arrivals) {
+    sent.clear();
+    acknowledged.clear();
+    for (const auto& d : arrivals) {
+      ++sent[be16(d.bytes, 60)];
+      if (d.acknowledged) {
+        acknowledged.insert(be16(d.bytes, 60));
+      }
     }
-  }
+    return acknowledged.size() == kEvents;
+  };
+  ASSERT_TRUE(server.waitUntil(tally));
+  ASSERT_TRUE(watch.waitForCount(0));
+  tally(server.arrivals());
   std::uint64_t copiesSent = 0;
   for (std::uint16_t e = 1; e <= kEvents; ++e) {
     EXPECT_TRUE(acknowledged.contains(e)) << e;

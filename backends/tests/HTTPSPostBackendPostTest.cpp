@@ -283,10 +283,8 @@ TEST_F(HTTPSPostTest, SessionEndMessageCarriesConsentAndSamplingFigures) {
   b->sendMessage(Value(Dictionary{}), at(1001), 0, 1, 1);
   ASSERT_TRUE(server.waitForRequests(1));
   const auto record = envelopeOf(server.requests()[0])["events"][0];
-  EXPECT_EQ(record["Opt"], 2);
-  EXPECT_EQ(record["SamplingThreshold"], 1.0);
-  EXPECT_EQ(record["OverrideSampling"], -1);
-  EXPECT_EQ(record["Batch"], 0);
+  EXPECT_EQ((std::tuple(record["Opt"], record["SamplingThreshold"], record["OverrideSampling"], record["Batch"])),
+            (std::tuple(2, 1.0, -1, 0)));
 }
 
 TEST_F(HTTPSPostTest, SlowCollectorNeverHoldsUpTheSender) {
