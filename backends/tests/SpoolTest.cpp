@@ -381,10 +381,10 @@ class SpoolRetryTest : public ::testing::Test {
   }
 
   TempRoot root;
-  HttpsTestServer server;
 };
 
 TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
+  HttpsTestServer server;
   std::mutex m;
   int answered = 0;
   server.on("/post", [&](const RecordedRequest&) {
@@ -414,6 +414,7 @@ TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
 }
 
 TEST_F(SpoolRetryTest, WhatAnEarlierRunLeftIsDeliveredAtStart) {
+  HttpsTestServer server;
   server.on("/post", Reply{.status = 200});
   {
     SpoolStore store(root.path() / "spool", 1 << 20, 3600);
@@ -436,6 +437,7 @@ TEST_F(SpoolRetryTest, WhatAnEarlierRunLeftIsDeliveredAtStart) {
 }
 
 TEST_F(SpoolRetryTest, AClientErrorDropsTheBatchForGood) {
+  HttpsTestServer server;
   server.on("/post", Reply{.status = 400});
   SpoolConfig config;
   config.retryInitialSeconds = 0.02;
