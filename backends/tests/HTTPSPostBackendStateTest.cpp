@@ -17,36 +17,28 @@ class HTTPSRecordTest : public HTTPSBackendTest {};
 TEST_F(HTTPSRecordTest, RecordCountsFromTheStartMinuteAndCarriesEveryKeyInOrder) {
   auto b = backend(profileWith({enablingClient(server.url("/post"))}));
   ASSERT_TRUE(b);
-  Dictionary payload{{"_method", "overwritten"}, {"bytes", 17}};
+  const Dictionary payload{{"_method", "overwritten"}, {"bytes", 17}};
   const Dictionary record = b->newEventDictfromPayload(Value(payload), at(1010, 250000), 5, 6, 99);
-
-  std::vector<std::string> keys;
-  for (const auto& [key, value] : record) {
-    keys.push_back(key);
-  }
   // Payload keys keep their place; the backend's keys follow in their order.
-  const std::vector<std::string> expected = {"_method",        "bytes",       "_startTS",       "_sender",
-                                             "_clientVersion", "_sessionID",  "_eventNumber",   "_status",
-                                             "_clientTS",      "eventTime",   "_productFamily", "_productModel",
-                                             "_osVersion",     "_build",      "_internal",      "_reportVers",
-                                             "_timezoneOffset"};
-  EXPECT_EQ(keys, expected);
-  EXPECT_EQ(record.get("_startTS"), Value(960));
-  EXPECT_EQ(record.get("_sender"), Value("YJ"));
-  EXPECT_EQ(record.get("_clientVersion"), Value(12u));
-  EXPECT_EQ(record.get("_sessionID"), Value(42u));
-  EXPECT_EQ(record.get("_eventNumber"), Value(0u));  // the backend's counter, not the argument
-  EXPECT_EQ(record.get("_method"), Value(5u));
-  EXPECT_EQ(record.get("_status"), Value(6u));
-  EXPECT_DOUBLE_EQ(record.get("_clientTS").doubleValue(), 969.75);
-  EXPECT_EQ(record.get("eventTime"), record.get("_clientTS"));
-  EXPECT_EQ(record.get("_productFamily"), Value("TestFamily"));
-  EXPECT_EQ(record.get("_productModel"), Value("Board9,1"));
-  EXPECT_EQ(record.get("_osVersion"), Value("12.4"));
-  EXPECT_EQ(record.get("_build"), Value("Z1234"));
-  EXPECT_EQ(record.get("_internal"), Value(2u));
-  EXPECT_EQ(record.get("_reportVers"), Value("8.1"));
-  EXPECT_EQ(record.get("_timezoneOffset"), Value(static_cast<long long>(timeZoneOffsetSeconds())));
+  // The event number is the backend's counter, not the argument.
+  const Dictionary expected{{"_method", 5u},
+                            {"bytes", 17},
+                            {"_startTS", 960},
+                            {"_sender", "YJ"},
+                            {"_clientVersion", 12u},
+                            {"_sessionID", 42u},
+                            {"_eventNumber", 0u},
+                            {"_status", 6u},
+                            {"_clientTS", 969.75},
+                            {"eventTime", 969.75},
+                            {"_productFamily", "TestFamily"},
+                            {"_productModel", "Board9,1"},
+                            {"_osVersion", "12.4"},
+                            {"_build", "Z1234"},
+                            {"_internal", 2u},
+                            {"_reportVers", "8.1"},
+                            {"_timezoneOffset", static_cast<long long>(timeZoneOffsetSeconds())}};
+  EXPECT_EQ(record.entries(), expected.entries());
 }
 
 TEST_F(HTTPSRecordTest, AbsentHardwareTypeLeavesNoModelEvenWhenThePayloadNamedOne) {
@@ -231,18 +223,6 @@ TEST_F(HTTPSStateTest, UserInfoDecidesBetweenUndecidedAndTheCheckedPath) {
   EXPECT_EQ(backend(profileWith({client}), userInfo("mail", "sync"), true)->state(), kBackendStateDisabled);
 }
 
-TEST_F(HTTPSStateTest, PerCountryThresholdReplacesTheGeneralOneForListedCountries) {
-  auto client = enablingClient("https://x/");
-  client.set("sampling_threshold", 0.0);
-  client.set("per_country_sampling_thresholds",
-             Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}),
-                   Value(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", 1.0}})});
-  auto b = backend(profileWith({client}));
-  EXPECT_EQ(b->state(), kBackendStateEnabled);
-  EXPECT_TRUE(logs.contains("HTTPSPostBackend(updateBackendState): sampling threshold for GB changed from 0.00 to 1.00"));
-  EXPECT_EQ(b->samplingThreshold(), Value(1.0));
-}
-
 TEST_F(HTTPSStateTest, SamplingDrawOverManyBackendsStaysWithinBinomialBounds) {
   auto client = enablingClient("https://x/");
   client.set("sampling_threshold", 0.25);
@@ -355,21 +335,24 @@ TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndU
   ASSERT_TRUE(server.waitForRequests(1));
   const auto events = envelopeOf(server.requests()[0])["events"];
   ASSERT_EQ(events.size(), 2u);
-  const std::string hashedUdid = ZerithBackend::convertIntoSHA256("device-1");
-  // Method 5, status 9: everything applies.
-  EXPECT_EQ(events[0]["udid"], hashedUdid);
-  EXPECT_FALSE(events[0].contains("secret"));
-  EXPECT_EQ(events[0]["account"], ZerithBackend::convertIntoSHA256("a"));
-  EXPECT_EQ(events[0]["bytes"], 3);  // unknown action keeps
-  EXPECT_EQ(events[0]["clientName"], ZerithBackend::convertIntoSHA256("demo"));
-  // Nested containers never reach the wire, so nothing under them leaks.
-  EXPECT_FALSE(events[0].contains("nested"));
-  EXPECT_FALSE(events[0].contains("session"));
+  // The filtered keys of a record (nested containers never reach the wire,
+  // so nothing under them leaks).
+  const auto filtered = [](const nlohmann::ordered_json& event) {
+    nlohmann::ordered_json out = nlohmann::ordered_json::object();
+    for (const char* key : {"udid", "secret", "account", "bytes", "clientName", "nested", "session"}) {
+      if (event.contains(key)) {
+        out[key] = event[key];
+      }
+    }
+    return out;
+  };
+  const auto sha = [](const char* s) { return ZerithBackend::convertIntoSHA256(s); };
+  // Method 5, status 9: everything applies; an unknown action keeps.
+  EXPECT_EQ(filtered(events[0]), (nlohmann::ordered_json{{"udid", sha("device-1")}, {"account", sha("a")}, {"bytes", 3},
+                                                          {"clientName", sha("demo")}}));
   // Method 6, status 1: only the unconditional filters.
-  EXPECT_EQ(events[1]["udid"], hashedUdid);
-  EXPECT_EQ(events[1]["secret"], "s");
-  EXPECT_EQ(events[1]["account"], "a");
-  EXPECT_EQ(events[1]["clientName"], ZerithBackend::convertIntoSHA256("demo"));
+  EXPECT_EQ(filtered(events[1]), (nlohmann::ordered_json{{"udid", sha("device-1")}, {"secret", "s"}, {"account", "a"},
+                                                          {"bytes", 3}, {"clientName", sha("demo")}}));
   const std::string wire = jsonOf(server.requests()[0]);
   EXPECT_EQ(wire.find("device-1"), std::string::npos);
   EXPECT_EQ(wire.find("deep"), std::string::npos);
@@ -378,6 +361,85 @@ TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndU
   // An empty filter list keeps the old filters.
   b->createFiltersFromArray(Value(Array{}));
   EXPECT_EQ(b->numberOfFilters(), 6);
+}
+
+// The sampling decision (a draw below the threshold enables, the threshold
+// itself is out; an override decides what is not below it) and the end
+// report's "OverrideSampling": the override value only when the draw was not
+// below the threshold (so the override decided), -1 otherwise, whichever
+// path set the threshold.
+struct OverrideRow {
+  const char* name;
+  double factor;
+  Value threshold;          // "sampling_threshold"; nil: absent
+  Value perCountryGB;       // a per-country threshold for GB; nil: none
+  Value override;           // "override_sampling"; nil: absent
+  std::int32_t state;
+  Value reported;           // what the end report carries
+};
+
+class OverrideSamplingTest : public HTTPSBackendTest, public ::testing::WithParamInterface<OverrideRow> {};
+
+TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
+  const OverrideRow& row = GetParam();
+  auto client = enablingClient(server.url("/post"));
+  client.erase("sampling_threshold");
+  if (!row.threshold.isNil()) {
+    client.set("sampling_threshold", row.threshold);
+  }
+  if (!row.perCountryGB.isNil()) {
+    // Another country's entry first: only the device's own applies.
+    client.set("per_country_sampling_thresholds",
+               Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}),
+                     Value(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", row.perCountryGB}})});
+  }
+  if (!row.override.isNil()) {
+    client.set("override_sampling", row.override);
+  }
+  auto b = backend(profileWith({client}));
+  b->setSamplingFactor(row.factor);
+  b->updateState();
+  EXPECT_EQ(b->state(), row.state);
+  EXPECT_EQ(b->overrideSampling().isNil() ? Value(-1) : b->overrideSampling(), row.reported);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Paths, OverrideSamplingTest,
+    ::testing::Values(
+        OverrideRow{"DrawBelowThresholdEnables", 0.1, Value(0.25), Value(), Value(), kBackendStateEnabled, Value(-1)},
+        OverrideRow{"DrawAboveThresholdSamplesOut", 0.3, Value(0.25), Value(), Value(), kBackendStateSampledOut,
+                    Value(-1)},
+        OverrideRow{"DrawAtThresholdSamplesOut", 0.25, Value(0.25), Value(), Value(), kBackendStateSampledOut,
+                    Value(-1)},
+        OverrideRow{"DrawPastThresholdBelowOverrideSamplesOut", 0.3, Value(0.25), Value(), Value(0.5),
+                    kBackendStateSampledOut, Value(0.5)},
+        OverrideRow{"PlainThresholdEnables", 0.3, Value(1.0), Value(), Value(0.5), kBackendStateEnabled, Value(-1)},
+        OverrideRow{"PlainDrawAtThresholdKeptByOverride", 0.5, Value(0.5), Value(), Value(0.9), kBackendStateSampledOut,
+                    Value(0.9)},
+        OverrideRow{"PlainDrawPastOverrideDisables", 0.95, Value(0.5), Value(), Value(0.9), kBackendStateDisabled,
+                    Value(0.9)},
+        OverrideRow{"NoThresholdDisablesWithoutOverride", 0.1, Value(), Value(), Value(0.5), kBackendStateDisabled,
+                    Value(-1)},
+        OverrideRow{"PerCountryThresholdEnables", 0.3, Value(0.0), Value(1.0), Value(0.0), kBackendStateEnabled, Value(-1)},
+        OverrideRow{"PerCountryThresholdSamplesOut", 0.6, Value(1.0), Value(0.5), Value(0.8), kBackendStateSampledOut,
+                    Value(0.8)}),
+    [](const ::testing::TestParamInfo<OverrideRow>& info) { return std::string(info.param.name); });
+
+// A later decision that ends before the sampling step (here the locale)
+// leaves no override from the earlier one.
+TEST_F(HTTPSBackendTest, LocaleRefusalAfterAnOverrideDecisionReportsNone) {
+  auto client = enablingClient(server.url("/post"));
+  client.set("sampling_threshold", 0.5);
+  client.set("override_sampling", 0.9);
+  auto b = backend(profileWith({client}));
+  b->setSamplingFactor(0.6);
+  b->updateState();
+  ASSERT_EQ(b->state(), kBackendStateSampledOut);
+  ASSERT_EQ(b->overrideSampling(), Value(0.9));
+  ScopedEnv france{"LC_ALL", "fr_FR.UTF-8"};
+  b->updateState();
+  EXPECT_EQ(b->state(), kBackendStateDisabled);
+  EXPECT_TRUE(b->overrideSampling().isNil());
 }
 
 }  // namespace

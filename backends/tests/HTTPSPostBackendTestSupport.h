@@ -2,16 +2,16 @@
 
 // Scenario helpers of the HTTPS backend tests: a fixture with a temporary
 // root, the test CA trusted, a recording HTTPS server and a real
-// connectivity helper; profiles; gzip inflation and an independent HMAC.
+// connectivity helper; profiles; flushes and posts that wait for their
+// completion; what the backend counted; gzip inflation and an independent
+// HMAC.
 
 #include <gtest/gtest.h>
 #include <openssl/evp.h>
 #include <openssl/hmac.h>
 #include <zlib.h>
 
-#include <condition_variable>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -23,12 +23,19 @@
 #include "config/DeviceInfo.h"
 #include "config/tests/ScopedEnv.h"
 #include "platform/Defaults.h"
+#include "platform/Json.h"
 #include "platform/Log.h"
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/TempRoot.h"
 #include "tests/support/TestCA.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 #include "transport/URLSession.h"
+#include "transport/tests/TransportTestSupport.h"
+
+namespace zerith {
+// Values in failure messages as JSON text.
+inline void PrintTo(const Value& value, std::ostream* out) { *out << json::serialize(value); }
+}  // namespace zerith
 
 namespace zerith::test {
 
@@ -85,31 +92,16 @@ inline std::string independentDigest(const std::string& key, const std::string& 
 }
 
 // Completions of flushes and posts, in order.
-class ResultLog : public std::enable_shared_from_this<ResultLog> {
+class ResultLog : public Recorder<std::optional<Error>>, public std::enable_shared_from_this<ResultLog> {
  public:
   static std::shared_ptr<ResultLog> make() { return std::make_shared<ResultLog>(); }
   ZerithBackend::FlushCompletion handler() {
-    return [self = shared_from_this()](const Value&, const std::optional<Error>& error) {
-      {
-        std::lock_guard lock(self->mutex_);
-        self->errors_.push_back(error);
-      }
-      self->changed_.notify_all();
-    };
+    return [self = shared_from_this()](const Value&, const std::optional<Error>& error) { self->add(error); };
   }
   bool waitFor(std::size_t count) const {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, std::chrono::seconds(30), [&] { return errors_.size() >= count; });
+    return waitUntil([&](const auto& errors) { return errors.size() >= count; }, std::chrono::seconds(30));
   }
-  std::vector<std::optional<Error>> errors() const {
-    std::lock_guard lock(mutex_);
-    return errors_;
-  }
-
- private:
-  mutable std::mutex mutex_;
-  mutable std::condition_variable changed_;
-  std::vector<std::optional<Error>> errors_;
+  std::vector<std::optional<Error>> errors() const { return items(); }
 };
 
 // An event as the session hands it on: the client's payload {"n": n}.
@@ -175,7 +167,41 @@ class HTTPSBackendTest : public ::testing::Test {
     return b;
   }
 
+  // Enabled for `demo`/`cli`, posting each event at once or batching them.
+  std::shared_ptr<HTTPSPostBackend> immediate(const std::string& url) {
+    return backend(profileWith({enablingClient(url)}));
+  }
+  std::shared_ptr<HTTPSPostBackend> batching(const std::string& url) {
+    return backend(profileWith({enablingClient(url)}), userInfo(), true, true);
+  }
+
   static timeval at(long seconds, long micros = 0) { return timeval{seconds, micros}; }
+
+  // Every count but the ones named is 0.
+  static void expectOnly(const ZerithBackend& b, std::initializer_list<std::pair<BackendCount, std::uint64_t>> wanted) {
+    for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
+      const auto kind = static_cast<BackendCount>(i);
+      std::uint64_t expected = 0;
+      for (const auto& [k, n] : wanted) {
+        expected = k == kind ? n : expected;
+      }
+      EXPECT_EQ(b.counters().get(kind), expected) << backendCountName(kind);
+    }
+  }
+  // Flushes and waits for the completion; its error, if any.
+  static std::optional<Error> flush(HTTPSPostBackend& b) {
+    auto results = ResultLog::make();
+    b.flushMessagesWithCompletion(results->handler());
+    EXPECT_TRUE(results->waitFor(1));
+    return results->errors().empty() ? std::nullopt : results->errors()[0];
+  }
+  // Posts `json` as it is and waits for the completion; its error, if any.
+  static std::optional<Error> post(HTTPSPostBackend& b, const std::string& json) {
+    auto results = ResultLog::make();
+    b.postJSONMessage(json, 0, std::nullopt, std::nullopt, results->handler());
+    EXPECT_TRUE(results->waitFor(1));
+    return results->errors().empty() ? std::nullopt : results->errors()[0];
+  }
 
   TempRoot root;
   ScopedEnv locale{"LC_ALL", "en_GB.UTF-8"};

@@ -148,22 +148,18 @@ TEST(SpoolConfigTest, BadValuesFallBackToTheDefaults) {
                                                                        {"spoolMaxAgeSeconds", "forever"},
                                                                        {"spoolRetryInitialSeconds", Array{}},
                                                                        {"spoolRetryMaxSeconds", 1e12}}));
-  EXPECT_FALSE(bad.enabled);
-  EXPECT_EQ(bad.maxBytes, SpoolConfig::kDefaultMaxBytes);
-  EXPECT_EQ(bad.maxAgeSeconds, SpoolConfig::kDefaultMaxAgeSeconds);
-  EXPECT_EQ(bad.retryInitialSeconds, SpoolConfig::kDefaultRetryInitialSeconds);
-  EXPECT_EQ(bad.retryMaxSeconds, SpoolConfig::kDefaultRetryMaxSeconds);
+  const auto fields = [](const SpoolConfig& c) {
+    return std::tuple(c.enabled, c.maxBytes, c.maxAgeSeconds, c.retryInitialSeconds, c.retryMaxSeconds);
+  };
+  EXPECT_EQ(fields(bad), fields(SpoolConfig{}));
 
   const SpoolConfig good = SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", "YES"},
                                                                         {"spoolMaxBytes", "100000"},
                                                                         {"spoolMaxAgeSeconds", 60},
                                                                         {"spoolRetryInitialSeconds", 0.5},
                                                                         {"spoolRetryMaxSeconds", 0.25}}));
-  EXPECT_TRUE(good.enabled);
-  EXPECT_EQ(good.maxBytes, 100000u);
-  EXPECT_EQ(good.maxAgeSeconds, 60);
   // A ceiling below the first wait is raised to it.
-  EXPECT_EQ(good.retryMaxSeconds, 0.5);
+  EXPECT_EQ(fields(good), std::tuple(true, 100000u, 60, 0.5, 0.5));
   EXPECT_TRUE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", true}})).enabled);
   EXPECT_FALSE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", 2}})).enabled);
 }

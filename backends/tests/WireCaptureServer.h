@@ -22,11 +22,13 @@
 #include <openssl/pem.h>
 #include <openssl/ssl.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
 #include <mutex>
+#include <sstream>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -158,20 +160,15 @@ class WireCaptureServer {
     }
     Request request;
     if (headerEnd != std::string::npos) {
-      std::size_t line = 0;
-      std::size_t next = raw.find("\r\n");
-      request.requestLine = raw.substr(0, next);
-      line = next + 2;
-      while (line < headerEnd + 2) {
-        next = raw.find("\r\n", line);
-        const std::string header = raw.substr(line, next - line);
-        const auto colon = header.find(':');
+      std::istringstream head(raw.substr(0, headerEnd + 2));
+      std::getline(head, request.requestLine);
+      request.requestLine.pop_back();  // the '\r'
+      for (std::string line; std::getline(head, line);) {
+        const auto colon = line.find(':');
         if (colon != std::string::npos) {
-          std::string value = header.substr(colon + 1);
-          value.erase(0, value.find_first_not_of(' '));
-          request.headers.emplace_back(header.substr(0, colon), value);
+          const auto value = std::min(line.find_first_not_of(' ', colon + 1), line.size() - 1);
+          request.headers.emplace_back(line.substr(0, colon), line.substr(value, line.size() - 1 - value));
         }
-        line = next + 2;
       }
       request.body = raw.substr(headerEnd + 4);
     }

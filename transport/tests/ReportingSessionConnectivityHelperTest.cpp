@@ -64,11 +64,9 @@ TEST_F(ConnectivityHelperTest, AnswerWithoutBodyCompletesExactlyOnceWithAnEmptyB
 
   ASSERT_EQ(done->count(), 1u);
   const auto call = done->calls()[0];
-  EXPECT_TRUE(call.data.empty());
   ASSERT_TRUE(call.response.has_value());
-  EXPECT_EQ(call.response->statusCode, 204);
-  EXPECT_EQ(call.response->url, server.url("/empty"));
-  EXPECT_FALSE(call.error.has_value());
+  EXPECT_EQ(std::tuple(call.data.size(), call.response->statusCode, call.response->url, call.error.has_value()),
+            std::tuple(0u, 204, server.url("/empty"), false));
 
   EXPECT_TRUE(logs.has(Level::Debug, "ConnectivityHelperTask with ID <" + task + "> created"));
   EXPECT_TRUE(logs.has(Level::Debug, "didReceiveResponse: for <session>:<task> <" + session + ">:<" + task + ">"));
@@ -193,11 +191,10 @@ TEST_F(ConnectivityHelperTest, RefusedConnectionCompletesWithAnErrorAtOnce) {
   ASSERT_TRUE(done->waitFor(2));
   for (const auto& call : done->calls()) {
     ASSERT_TRUE(call.error.has_value());
-    EXPECT_EQ(call.error->domain, kURLErrorDomain);
-    EXPECT_EQ(call.error->code, 7);  // CURLE_COULDNT_CONNECT
     EXPECT_FALSE(call.error->description.empty());
-    EXPECT_FALSE(call.response.has_value());
-    EXPECT_TRUE(call.data.empty());
+    // CURLE_COULDNT_CONNECT
+    EXPECT_EQ(std::tuple(call.error->domain, call.error->code, call.response.has_value(), call.data.size()),
+              std::tuple(std::string(kURLErrorDomain), 7, false, 0u));
   }
   // Waiting for connectivity is not waiting for a refusing server.
   EXPECT_EQ(logs.count("next attempt"), 0u);
