@@ -10,8 +10,6 @@
 
 #include "backends/ZerithBackend.h"
 #include "tests/e2e/E2eFixture.h"
-#include "tests/support/CollectorProcess.h"
-#include "zerith/Zerith.h"
 
 namespace zerith::test {
 namespace {
@@ -22,23 +20,16 @@ class BackendCountsTest : public E2eTest {
  protected:
   void startAll() {
     grant(Value(true));
-    const fs::path certs = root.path() / "collector/certs";
     const fs::path www = root.path() / "collector/www";
-    collector = std::make_unique<CollectorProcess>(
-        ZERITH_COLLECTOR_TOOL,
-        std::vector<std::string>{"--generate-cert", certs.string(), "--serve", www.string(), "--status", "200"});
-    ASSERT_GT(collector->port(), 0) << collector->said();
-
+    collector = startCollector({"--serve", www.string(), "--status", "200"});
+    ASSERT_GT(collector->port(), 0);
+    // No draw is below 0: the second backend is sampled out and batches what it gets.
     Dictionary posting{{"event_whitelist", Array{Value(0), Value(3), Value(6)}}, {"event_blacklist", Array{Value(6)}}};
-    // No draw is below 0: this one is sampled out and batches what it gets.
-    const Value sampled = collectorStorebag(collector->url("/post"), Dictionary{{"sampling_threshold", 0.0}});
-    Value bag = collectorStorebag(collector->url("/post"), posting);
-    Dictionary section = bag["seed"].dictCopy();
-    section.set("httpsPost2", sampled["seed"]["httpsPost"]);
-    publishSignedStorebag(
-        Value(Dictionary{{"version", "8.1.0"}, {"seed", Value(section)}, {"release", Value(section)}}), www,
-        collector->url("/zerith"));
-    startDaemon(collectorDaemonOptions(certs));
+    Dictionary section = collectorStorebag(collector->url("/post"), posting)["seed"].dictCopy();
+    section.set("httpsPost2", collectorStorebag(collector->url("/post"),
+                                                Dictionary{{"sampling_threshold", 0.0}})["seed"]["httpsPost"]);
+    publishSignedStorebag(storebag(Value(section)), www, collector->url("/zerith"));
+    startDaemon(trusting(collectorCA()));
   }
 
   std::unique_ptr<CollectorProcess> collector;

@@ -2,14 +2,18 @@
 
 // Scenario helpers of the end-to-end tests: a temporary root with an
 // entitlements policy for the test's own user, the real zerithd started in
-// it; raw socket clients are tests/support/RawFrameSocket.h.
+// it, storebags signed and served, collectors as processes of their own;
+// raw socket clients are tests/support/RawFrameSocket.h.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <chrono>
+#include <condition_variable>
 #include <filesystem>
+#include <fstream>
 #include <memory>
+#include <mutex>
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <sstream>
@@ -23,6 +27,7 @@
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
+#include "tests/support/CollectorProcess.h"
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/RawFrameSocket.h"
@@ -34,6 +39,77 @@
 namespace zerith::test {
 
 using namespace std::chrono_literals;
+
+// Entries of /proc/<pid>/<folder> ("fd": descriptors, "task": threads).
+inline std::size_t procEntries(pid_t pid, const char* folder) {
+  std::error_code ec;
+  std::size_t n = 0;
+  for (auto it = std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/" + folder, ec);
+       !ec && it != std::filesystem::directory_iterator(); it.increment(ec)) {
+    ++n;
+  }
+  return n;
+}
+
+// A field of /proc/<pid>/status in KiB ("VmRSS", "VmHWM").
+inline std::uint64_t procStatusKiB(pid_t pid, const std::string& field) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
+  for (std::string line; std::getline(in, line);) {
+    if (line.rfind(field + ":", 0) == 0) {
+      return std::stoull(line.substr(field.size() + 1));
+    }
+  }
+  return 0;
+}
+
+// What a client's message handler (its aggregation block) received. Declare
+// it before the client: the daemon may still send while the client ends.
+class Received {
+ public:
+  struct Message {
+    Value sessionInfo;
+    unsigned category;
+    unsigned type;
+    Value payload;
+    double timestamp;
+  };
+  void attach(Zerith& client) {
+    client.setMessageHandler(
+        [this](const Value& info, double timestamp, std::uint16_t category, std::uint16_t type, const Value& payload) {
+          std::lock_guard lock(mutex_);
+          messages_.push_back({info, category, type, payload, timestamp});
+          changed_.notify_all();
+        });
+  }
+  // The first message that `match` takes; nullopt on time-out.
+  template <typename Match>
+  std::optional<Message> waitFor(Match match, std::chrono::milliseconds timeout = 10s) {
+    std::unique_lock lock(mutex_);
+    std::optional<Message> found;
+    changed_.wait_for(lock, timeout, [&] {
+      for (const auto& m : messages_) {
+        if (match(m)) {
+          found = m;
+          return true;
+        }
+      }
+      return false;
+    });
+    return found;
+  }
+  std::optional<Message> first() {
+    return waitFor([](const Message&) { return true; });
+  }
+  std::vector<Message> all() {
+    std::lock_guard lock(mutex_);
+    return messages_;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<Message> messages_;
+};
 
 class E2eTest : public ::testing::Test {
  protected:
@@ -85,29 +161,6 @@ class E2eTest : public ::testing::Test {
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(storebagURL));
   }
 
-  // A session of client type 7 that requires user info and gives the one
-  // the collector tests' storebags admit ("demo", "cli"), so that the whole
-  // storebag check runs (consent, locale, filters, sampling); `started`
-  // (when given) receives the start's answer.
-  std::unique_ptr<Zerith> startDemoSession(std::uint32_t sessionID, ZerithReply* started = nullptr) {
-    auto client = Zerith::connect();
-    EXPECT_TRUE(client);
-    if (!client) {
-      return nullptr;
-    }
-    const Value info(Dictionary{{kZerithSessionInfoSessionID, Value(sessionID)},
-                                {kZerithSessionInfoClientType, Value(7)},
-                                {kZerithSessionInfoRequireUserInfo, Value(true)}});
-    const Value user(Dictionary{{kZerithUserInfoClientName, "demo"}, {kZerithUserInfoServiceName, "cli"}});
-    EXPECT_TRUE(client->setSessionInfo(info, user, Value(), false, std::chrono::seconds(10)));
-    ZerithReply answer = client->startConfig(std::chrono::seconds(20));
-    EXPECT_TRUE(answer);
-    if (started) {
-      *started = std::move(answer);
-    }
-    return client;
-  }
-
   // The same for a test server: it answers "/zerith/dravon" with the signed
   // `bag` (cacheable for ten minutes), and the daemon asks it for storebags.
   void serveSignedStorebag(HttpsTestServer& server, const Value& bag) {
@@ -116,6 +169,11 @@ class E2eTest : public ::testing::Test {
                                  .headers = {{"Cache-Control", "max-age=600"}},
                                  .body = std::string(container.begin(), container.end())});
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
+  }
+
+  // A storebag whose seed and release sections are both `section`.
+  static Value storebag(const Value& section) {
+    return Value(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
   }
 
   // The collector tests' storebag: one HTTPS backend for the demo client,
@@ -132,24 +190,26 @@ class E2eTest : public ::testing::Test {
     for (const auto& [key, value] : extra) {
       client.set(key, value);
     }
-    const Value section(Dictionary{{"httpsPost", Dictionary{{"clients", Array{Value(std::move(client))}}}}});
-    return Value(Dictionary{{"version", "8.1.0"}, {"seed", section}, {"release", section}});
+    return storebag(Value(Dictionary{{"httpsPost", Dictionary{{"clients", Array{Value(std::move(client))}}}}}));
   }
 
-  // A daemon that trusts the CA a collector made in `certs` and reads its
-  // locale as British (the collector tests' storebags admit only GB).
-  static DaemonProcess::Options collectorDaemonOptions(const std::filesystem::path& certs) {
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", (certs / "ca.pem").string()};
-    options.environment = {{"LC_ALL", "en_GB.UTF-8"}};
-    return options;
+  // zerith-collector with a certificate made in <root>/collector/certs and
+  // `args`; the daemon trusts it with trusting(collectorCA()).
+  std::unique_ptr<CollectorProcess> startCollector(const std::vector<std::string>& args) const {
+    std::vector<std::string> all = {"--generate-cert", (root.path() / "collector/certs").string()};
+    all.insert(all.end(), args.begin(), args.end());
+    auto collector = std::make_unique<CollectorProcess>(ZERITH_COLLECTOR_TOOL, all);
+    EXPECT_GT(collector->port(), 0) << collector->said();
+    return collector;
   }
+  std::filesystem::path collectorCA() const { return root.path() / "collector/certs/ca.pem"; }
 
-  // A daemon that trusts the test CA (TestCA::shared, what HttpsTestServer
-  // serves with) and reads its locale from `locale` when given.
-  static DaemonProcess::Options testCAOptions(const char* locale = "en_GB.UTF-8") {
-    DaemonProcess::Options options;
-    options.arguments = {"--stop-timeout", "5", "--ca-file", TestCA::shared().caFile().string()};
+  // A daemon that trusts the CA in `caFile` (by default the test CA that
+  // HttpsTestServer serves with) and reads its locale from `locale` when
+  // given (the collector tests' storebags admit only GB).
+  static DaemonProcess::Options trusting(const std::filesystem::path& caFile = TestCA::shared().caFile(),
+                                         const char* locale = "en_GB.UTF-8") {
+    DaemonProcess::Options options{.arguments = {"--stop-timeout", "5", "--ca-file", caFile.string()}};
     if (locale) {
       options.environment = {{"LC_ALL", locale}};
     }
@@ -160,6 +220,27 @@ class E2eTest : public ::testing::Test {
     Error error;
     auto client = Zerith::connect({}, &error);
     EXPECT_NE(client, nullptr) << error.description;
+    return client;
+  }
+
+  // A session of client type 7 that requires user info and gives the one
+  // the collector tests' storebags admit ("demo", "cli"), so that the whole
+  // storebag check runs (consent, locale, filters, sampling); `started`
+  // (when given) receives the start's answer.
+  std::unique_ptr<Zerith> startDemoSession(std::uint32_t sessionID, ZerithReply* started = nullptr) {
+    auto client = connect();
+    if (!client) {
+      return nullptr;
+    }
+    Dictionary info = sessionInfo(sessionID).dictCopy();
+    info.set(kZerithSessionInfoRequireUserInfo, Value(true));
+    const Value user(Dictionary{{kZerithUserInfoClientName, "demo"}, {kZerithUserInfoServiceName, "cli"}});
+    EXPECT_TRUE(client->setSessionInfo(Value(std::move(info)), user, Value(), false, 10s));
+    ZerithReply answer = client->startConfig(20s);
+    EXPECT_TRUE(answer);
+    if (started) {
+      *started = std::move(answer);
+    }
     return client;
   }
 
@@ -190,8 +271,8 @@ class E2eTest : public ::testing::Test {
     if (!client) {
       return Value();
     }
-    EXPECT_TRUE(client->setSessionInfo(sessionInfo(sessionID), Value(), Value(), false, std::chrono::seconds(10)));
-    const auto started = client->startConfig(std::chrono::seconds(20));
+    EXPECT_TRUE(client->setSessionInfo(sessionInfo(sessionID), Value(), Value(), false, 10s));
+    const auto started = client->startConfig(20s);
     EXPECT_TRUE(started);
     return started["backends"];
   }
@@ -217,8 +298,7 @@ class E2eTest : public ::testing::Test {
   nlohmann::ordered_json statusJson() const {
     const CliRun run = zerith({"status", "--json"});
     EXPECT_EQ(run.status, 0) << run.err;
-    return nlohmann::ordered_json::parse(run.out, nullptr,
-                                         /*allow_exceptions=*/false);
+    return nlohmann::ordered_json::parse(run.out, nullptr, /*allow_exceptions=*/false);
   }
 
   DaemonProcess& startDaemon(DaemonProcess::Options options = {}) {

@@ -28,7 +28,7 @@ class SlowServersLockTest : public E2eTest {
     for (const char* name : {"bostin", "elquin", "farrow", "gelmo", "hestra"}) {
       server.on(std::string("/zerith/") + name, {.status = 404, .delay = 5000ms});
     }
-    startDaemon(testCAOptions());
+    startDaemon(trusting());
   }
 
   // A type-7 session that sends one event and ends: its end report is

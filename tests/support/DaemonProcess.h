@@ -11,6 +11,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -30,21 +31,18 @@ class TempRoot;
 class DaemonProcess {
  public:
   struct Options {
-    std::vector<std::string> arguments;                        // after --root and --debug
-    std::vector<std::pair<std::string, std::string>> environment;  // added to ours
+    std::vector<std::string> arguments{};                            // after --root and --debug
+    std::vector<std::pair<std::string, std::string>> environment{};  // added to ours
     bool debug = true;
     std::chrono::milliseconds readyTimeout{15000};
   };
 
   // Starts <build>/daemon/zerithd (or $ZERITHD_BINARY) and waits for its
   // readiness; ready() tells whether it came.
-  explicit DaemonProcess(const TempRoot& root);
   DaemonProcess(const TempRoot& root, Options options);
   ~DaemonProcess();
   DaemonProcess(const DaemonProcess&) = delete;
   DaemonProcess& operator=(const DaemonProcess&) = delete;
-
-  static std::filesystem::path binary();
 
   bool ready() const;
   pid_t pid() const { return pid_; }
@@ -55,7 +53,7 @@ class DaemonProcess {
   // Lines whose message text contains `needle`.
   std::size_t count(std::string_view needle) const;
   // A line whose message is exactly `text` at `level`.
-  bool has(log::Level level, std::string_view text) const;
+  bool has(log::Level level, std::string_view text) const { return countExact(level, text) > 0; }
   std::size_t countExact(log::Level level, std::string_view text) const;
   // Waits until `occurrences` lines contain `needle`; false on time-out.
   bool waitFor(std::string_view needle, std::size_t occurrences = 1,
@@ -77,13 +75,13 @@ class DaemonProcess {
     log::Level level;
     std::string text;
   };
+  using Match = std::function<bool(const Line&)>;
 
-  void start(const TempRoot& root, const Options& options);
   void readLoop();
   void consumeOutput(std::string_view bytes);
-  // Lines that `match` (mutex_ held).
-  template <typename Match>
-  std::size_t countLines(Match match) const;
+  std::size_t countLines(const Match& match) const;  // mutex_ held
+  std::size_t countNow(const Match& match) const;
+  bool waitLines(const Match& match, std::size_t occurrences, std::chrono::milliseconds timeout) const;
 
   pid_t pid_ = -1;
   std::optional<int> exitStatus_;
@@ -92,7 +90,6 @@ class DaemonProcess {
   file::UniqueFd pidFd_;
   file::UniqueFd wakeRead_;
   file::UniqueFd wakeWrite_;
-  std::filesystem::path notifyPath_;
   std::thread reader_;
 
   mutable std::mutex mutex_;
@@ -103,8 +100,6 @@ class DaemonProcess {
   std::vector<std::string> notifications_;
   bool ready_ = false;
 };
-
-class TempRoot;
 
 // A quiet daemon (no debug log, a 5 s stop timeout) in `root`, whose
 // entitlements policy lets the current user open sessions: the benchmarks'

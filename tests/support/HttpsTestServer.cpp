@@ -27,33 +27,12 @@ bool equalsIgnoringCase(std::string_view a, std::string_view b) {
   return a.size() == b.size() && ::strncasecmp(a.data(), b.data(), a.size()) == 0;
 }
 
-
 ossl::BioPtr memoryBio(const std::string& pem) {
   ossl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
   if (!bio) {
     throw std::runtime_error("HttpsTestServer: BIO allocation failed");
   }
   return bio;
-}
-
-// A loopback socket bound to an ephemeral port; -1 on failure.
-int bindLoopback(int& port) {
-  const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) {
-    return -1;
-  }
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  addr.sin_port = 0;
-  socklen_t len = sizeof(addr);
-  if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 ||
-      ::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
-    ::close(fd);
-    return -1;
-  }
-  port = ntohs(addr.sin_port);
-  return fd;
 }
 
 }  // namespace
@@ -192,11 +171,7 @@ HttpsTestServer::HttpsTestServer(const TestCA& ca, Options options) : impl_(std:
   }
   Impl* impl = impl_.get();
   const auto handler = [impl](const httplib::Request& req, httplib::Response& res) { impl->handle(req, res); };
-  server.Get(".*", handler);
-  server.Post(".*", handler);
-  server.Put(".*", handler);
-  server.Patch(".*", handler);
-  server.Delete(".*", handler);
+  server.Get(".*", handler).Post(".*", handler).Put(".*", handler).Patch(".*", handler).Delete(".*", handler);
   server.Options(".*", handler);
   int listening = -1;
   server.set_socket_options([&listening](int fd) {
@@ -289,11 +264,16 @@ void HttpsTestServer::stop() {
   }
 }
 
-RefusingPort::RefusingPort() {
-  fd_ = bindLoopback(port_);
-  if (fd_ < 0) {
+RefusingPort::RefusingPort() : fd_(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t len = sizeof(addr);
+  if (fd_ < 0 || ::bind(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 ||
+      ::getsockname(fd_, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
     throw std::runtime_error("RefusingPort: cannot bind a loopback port");
   }
+  port_ = ntohs(addr.sin_port);
 }
 
 RefusingPort::~RefusingPort() { ::close(fd_); }

@@ -19,7 +19,6 @@ namespace zerith::test {
 
 namespace {
 
-
 [[noreturn]] void fail(const char* what) { throw std::runtime_error(std::string("TestCA: ") + what); }
 
 ossl::PkeyPtr newKey() {
@@ -61,9 +60,11 @@ ossl::X509Ptr newCertificate(EVP_PKEY* subjectKey, const std::string& commonName
   return cert;
 }
 
-std::string pemOf(X509* cert) {
+// The PEM text that `write` puts into a memory BIO.
+template <typename Write>
+std::string pem(Write write) {
   ossl::BioPtr bio(BIO_new(BIO_s_mem()));
-  if (!bio || PEM_write_bio_X509(bio.get(), cert) != 1) {
+  if (!bio || write(bio.get()) != 1) {
     fail("PEM encoding failed");
   }
   char* data = nullptr;
@@ -71,14 +72,12 @@ std::string pemOf(X509* cert) {
   return std::string(data, static_cast<std::size_t>(n));
 }
 
+std::string pemOf(X509* cert) {
+  return pem([&](BIO* bio) { return PEM_write_bio_X509(bio, cert); });
+}
+
 std::string pemOf(EVP_PKEY* key) {
-  ossl::BioPtr bio(BIO_new(BIO_s_mem()));
-  if (!bio || PEM_write_bio_PrivateKey(bio.get(), key, nullptr, nullptr, 0, nullptr, nullptr) != 1) {
-    fail("PEM encoding failed");
-  }
-  char* data = nullptr;
-  const long n = BIO_get_mem_data(bio.get(), &data);
-  return std::string(data, static_cast<std::size_t>(n));
+  return pem([&](BIO* bio) { return PEM_write_bio_PrivateKey(bio, key, nullptr, nullptr, 0, nullptr, nullptr); });
 }
 
 void writeFile(const std::filesystem::path& path, const std::string& contents) {
@@ -114,7 +113,9 @@ struct TestCA::Impl {
     return *server;
   }
 
-  const std::filesystem::path& folderLocked(const TestCA& ca) {
+  // `name` in the CA's folder, which is written on first use.
+  std::filesystem::path file(const TestCA& ca, const char* name) {
+    std::lock_guard lock(mutex);
     if (folder.empty()) {
       std::string tmpl = (std::filesystem::temp_directory_path() / "zerith-ca-XXXXXX").string();
       if (!::mkdtemp(tmpl.data())) {
@@ -126,7 +127,7 @@ struct TestCA::Impl {
       writeFile(std::filesystem::path(tmpl) / "server-key.pem", issued.privateKeyPem);
       folder = tmpl;
     }
-    return folder;
+    return folder / name;
   }
 };
 
@@ -186,19 +187,8 @@ const IssuedCertificate& TestCA::serverCertificate() const {
   return impl_->serverLocked(*this);
 }
 
-std::filesystem::path TestCA::caFile() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->folderLocked(*this) / "ca.pem";
-}
-
-std::filesystem::path TestCA::serverCertificateFile() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->folderLocked(*this) / "server.pem";
-}
-
-std::filesystem::path TestCA::serverKeyFile() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->folderLocked(*this) / "server-key.pem";
-}
+std::filesystem::path TestCA::caFile() const { return impl_->file(*this, "ca.pem"); }
+std::filesystem::path TestCA::serverCertificateFile() const { return impl_->file(*this, "server.pem"); }
+std::filesystem::path TestCA::serverKeyFile() const { return impl_->file(*this, "server-key.pem"); }
 
 }  // namespace zerith::test

@@ -60,7 +60,6 @@ void UdpTestServer::run() {
     }
     UdpDatagram d;
     d.bytes.assign(buffer.begin(), buffer.begin() + n);
-    d.fromPort = ntohs(from.sin_port);
     Decision decision;
     {
       std::lock_guard lock(mutex_);

@@ -1,7 +1,16 @@
 // The real daemon against raw sockets: admission by entitlement, hostile and
-// broken frames, clients that vanish mid-call, and the stop signal.
+// broken frames, clients that vanish mid-call, and the stop signal. The
+// service manager's watchdog: pings while every pool, queue and thread makes
+// progress, none once one of them is wedged. A file size limit under the
+// daemon: a write past it fails with EFBIG, handled as any failed write.
 
 #include <signal.h>
+#include <sys/resource.h>
+
+#include <cerrno>
+#include <cstring>
+#include <random>
+#include <thread>
 
 #include "tests/e2e/E2eFixture.h"
 
@@ -20,8 +29,7 @@ void expectServing(RawFrameSocket& client, std::uint64_t number) {
   EXPECT_EQ((*reply)["args"]["url"], Value("URL not available"));
 }
 
-// --- Admission
-// ----------------------------------------------------------------
+// --- Admission ---------------------------------------------------------------
 
 TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
   for (const Value& entitlement : {Value(), Value(false), Value("yes")}) {
@@ -45,8 +53,7 @@ TEST_F(E2eTest, ClientsWithoutATrueEntitlementAreClosedAndNoSessionIsMade) {
   EXPECT_TRUE(daemon->waitFor("as it has proper entitlement, 0(0) connections."));
 }
 
-// --- Hostile and broken input
-// ------------------------------------------------------
+// --- Hostile and broken input -------------------------------------------------
 
 TEST_F(E2eTest, BrokenFramesCloseOnlyTheirOwnConnectionAndWrongCallsAreAnswered) {
   grant(Value(true));
@@ -118,8 +125,7 @@ TEST_F(E2eTest, ClientVanishingMidCallEndsItsSessionAndTheTransaction) {
   expectServing(*next, 1);
 }
 
-// --- Stopping
-// --------------------------------------------------------------------------
+// --- Stopping ----------------------------------------------------------------
 
 TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
   grant(Value(true));
@@ -161,30 +167,108 @@ TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
 
 TEST_F(E2eTest, StopTimeOutEndsTheDrainOfASessionThatStaysOpen) {
   grant(Value(true));
-  DaemonProcess::Options options;
-  options.arguments = {"--stop-timeout", "0.5"};
-  startDaemon(options);
+  startDaemon({.arguments = {"--stop-timeout", "0.5"}});
   auto client = RawFrameSocket::connect();
   ASSERT_TRUE(client.has_value());
   expectServing(*client, 1);
   EXPECT_EQ(daemon->stop(10s), 0) << daemon->output();
-  EXPECT_TRUE(daemon->has(Level::Error,
-                          "main: Stop time-out passed with the "
-                          "keep-alive transaction still open, exiting"));
+  EXPECT_TRUE(
+      daemon->has(Level::Error, "main: Stop time-out passed with the keep-alive transaction still open, exiting"));
 }
 
 TEST_F(E2eTest, SocketThatCannotBeCreatedFailsTheStartWithAClearMessage) {
   // The runtime folder is a file: nothing can listen there.
   root.write("/run/zerithd", "not a folder");
-  DaemonProcess::Options options;
-  options.readyTimeout = 5s;
-  DaemonProcess failed(root, options);
+  DaemonProcess failed(root, {.readyTimeout = 5s});
   EXPECT_FALSE(failed.ready());
   EXPECT_EQ(failed.waitForExit(10s), 1);
   EXPECT_TRUE(failed.count("main: Unable to create the runtime folder") > 0 ||
               failed.count("main: Unable to listen on") > 0)
       << failed.output();
 }
+
+// --- Watchdog -----------------------------------------------------------------
+
+// The daemon stops pinging once the main operation queue is wedged (through
+// its test hook), so that the manager would restart it.
+TEST_F(E2eTest, WatchdogPingsWhileServingAndStopsOnceAQueueIsWedged) {
+  grant(Value(true));
+  // A 900 ms watchdog: a ping every 300 ms while all is well.
+  startDaemon({.arguments = {"--stop-timeout", "5"},
+               .environment = {{"WATCHDOG_USEC", "900000"}, {"ZERITHD_TEST_WEDGE_MAIN_QUEUE_AFTER_MS", "3000"}}});
+  ASSERT_TRUE(daemon->waitFor("Watchdog on, pinging every 300 ms")) << daemon->output();
+  const auto pings = [&] {
+    const auto all = daemon->notifications();
+    return std::count_if(all.begin(), all.end(), [](const std::string& m) { return m.find("WATCHDOG=1") != m.npos; });
+  };
+  for (int i = 0; i < 50 && pings() < 4; ++i) {
+    std::this_thread::sleep_for(100ms);
+  }
+  ASSERT_GE(pings(), 4) << daemon->output();
+
+  ASSERT_TRUE(daemon->waitFor("watchdog: no progress on the main operation queue", 1, 10s)) << daemon->output();
+  const auto atStall = pings();
+  std::this_thread::sleep_for(2s);  // six ping periods
+  EXPECT_EQ(pings(), atStall) << daemon->output();
+  // Only the one queue is wedged: the daemon still answers and stops.
+  auto client = connect();
+  ASSERT_TRUE(client);
+  EXPECT_TRUE(client->setSessionInfo(sessionInfo(9), Value(), Value(), false, 10s));
+}
+
+// --- Write limit --------------------------------------------------------------
+
+// The signal the daemon would otherwise die of is ignored; it goes on serving.
+struct WriteLimitCase {
+  const char* name;
+  std::uint64_t limit;    // bytes
+  std::size_t eventSize;  // 0: no event is sent
+  const char* failedWrite;
+};
+
+class WriteLimitTest : public E2eTest, public ::testing::WithParamInterface<WriteLimitCase> {};
+
+TEST_P(WriteLimitTest, AWriteBeyondTheLimitFailsAndTheDaemonServesOn) {
+  const WriteLimitCase& c = GetParam();
+  grant(Value(true));
+  HttpsTestServer server;
+  server.on("/post", {.status = 200});
+  serveSignedStorebag(server, collectorStorebag(server.url("/post")));
+  startDaemon(trusting());
+  // The limit holds before the first HTTPS request (which makes the CA
+  // bundle) and before any post.
+  const rlimit limit{c.limit, c.limit};
+  ASSERT_EQ(::prlimit(daemon->pid(), RLIMIT_FSIZE, &limit, nullptr), 0) << std::strerror(errno);
+
+  auto client = startDemoSession(1);
+  ASSERT_TRUE(client);
+  if (c.eventSize != 0) {
+    // Random hex, which compresses poorly.
+    std::mt19937_64 random(7);
+    std::string blob(c.eventSize, '0');
+    for (char& ch : blob) {
+      ch = "0123456789abcdef"[random() % 16];
+    }
+    ASSERT_TRUE(client->sendMessage(event(3, 4, Value(Dictionary{{"blob", blob}})), 10s));
+  }
+  ASSERT_TRUE(daemon->waitFor(c.failedWrite)) << daemon->output();
+  EXPECT_NE(daemon->output().find("File too large"), std::string::npos) << daemon->output();
+
+  // Still alive and answering: another client's session is set up.
+  auto other = connect();
+  ASSERT_TRUE(other);
+  EXPECT_TRUE(other->setSessionInfo(sessionInfo(2), Value(), Value(), false, 10s));
+  EXPECT_TRUE(daemon->running());
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Writes, WriteLimitTest,
+    ::testing::Values(
+        // The system's CA bundle alone is larger than the limit.
+        WriteLimitCase{"CaBundleMemfd", 64 * 1024, 0, "cannot make the CA bundle with the extra authorities"},
+        // The bundle fits; one event's post body does not.
+        WriteLimitCase{"PostBodyFile", 1024 * 1024, 3 * 1024 * 1024, "cannot write the body file"}),
+    [](const auto& info) { return std::string(info.param.name); });
 
 }  // namespace
 }  // namespace zerith::test
