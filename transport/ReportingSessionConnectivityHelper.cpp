@@ -147,8 +147,20 @@ void ReportingSessionConnectivityHelper::startTask(const std::shared_ptr<URLSess
     }
     return;
   }
-  createHelperForTask(*task, std::move(completion));
-  task->resume();
+  if (stateQueue_.isCurrent()) {
+    createHelperForTask(*task, std::move(completion));
+    task->resume();
+    return;
+  }
+  // Registered and started in a turn of the state queue, never by waiting
+  // for one: a completion runs on its own helper's state queue and may start
+  // the next post through another session's helper (a backend's posts in
+  // flight are shared by its sessions). Two such completions waiting for each
+  // other's state queue stopped both for good, and every post behind them.
+  stateQueue_.async([self = shared_from_this(), task, completion = std::move(completion)]() mutable {
+    self->createHelperForTask(*task, std::move(completion));
+    task->resume();
+  });
 }
 
 bool ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {
