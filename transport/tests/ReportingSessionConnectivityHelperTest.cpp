@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -46,6 +47,27 @@ TEST(ConnectivityHelperTaskNumbering, TasksOfAllHelpersAreNumberedFrom00000001In
         std::_Exit(names == "Task_00000001 Task_00000002 Task_00000003 " ? 0 : 1);
       },
       ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(ConnectivityHelperTest, CompletionsThatPostThroughEachOthersHelperNeverStop) {
+  // A backend's sessions share its posts in flight: a completion on one
+  // helper's state queue starts the next post through another helper. Four
+  // chains hop between two helpers at once; waiting for each other's state
+  // queue, two completions once stopped both helpers for good.
+  server.on("/hop", Reply{.status = 204});
+  const std::array helpers{Helper::initWithDelegate({}, 4), Helper::initWithDelegate({}, 4)};
+  constexpr int kHops = 150;
+  auto done = Completions::make();
+  std::function<void(std::size_t, int)> hop = [&](std::size_t at, int left) {
+    helpers[at]->postURLRequestWithCompletionHandler(
+        post(server.url("/hop"), "x"), left == 0 ? done->handler() : done->handler([&, at, left](const auto&) {
+          hop(1 - at, left - 1);
+        }));
+  };
+  for (std::size_t chain = 0; chain < 4; ++chain) {
+    hop(chain % 2, kHops - 1);
+  }
+  EXPECT_TRUE(done->waitFor(4 * kHops, std::chrono::seconds(30))) << done->count() << " of " << 4 * kHops;
 }
 
 TEST_F(ConnectivityHelperTest, AnswerWithoutBodyCompletesExactlyOnceWithAnEmptyBuffer) {
