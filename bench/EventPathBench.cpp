@@ -181,20 +181,26 @@ void BM_RecordsAndEnvelopeOf50(benchmark::State& state) {
   state.counters["envelope bytes"] = static_cast<double>(bytes) / static_cast<double>(state.iterations());
 }
 
+// The 50 records as the backend batches them.
+std::vector<Dictionary> batchOf50(HTTPSPostBackend& b) {
+  timeval now{};
+  gettimeofday(&now, nullptr);
+  std::vector<Dictionary> records;
+  for (int i = 0; i < kBatch; ++i) {
+    Dictionary record = b.newEventDictfromPayload(message(static_cast<std::uint64_t>(i))[kZerithMessageParametersPayload],
+                                                  now, 42, 7, 1);
+    b.prepareEventForMessage(record, Value());
+    records.push_back(std::move(record));
+  }
+  return records;
+}
+
 // The floor of the envelope: the same 50 records, already nlohmann objects
 // with the same keys and values, dumped.
 void BM_ReferenceEnvelopeDump(benchmark::State& state) {
   test::TempRoot root;
   auto b = makeBackend();
-  timeval now{};
-  gettimeofday(&now, nullptr);
-  std::vector<Dictionary> records;
-  for (int i = 0; i < kBatch; ++i) {
-    Dictionary record = b->newEventDictfromPayload(message(static_cast<std::uint64_t>(i))[kZerithMessageParametersPayload],
-                                                   now, 42, 7, 1);
-    b->prepareEventForMessage(record, Value());
-    records.push_back(std::move(record));
-  }
+  std::vector<Dictionary> records = batchOf50(*b);
   const auto envelope = nlohmann::ordered_json::parse(*b->createMessageForPostAndLogging(std::move(records), nullptr));
   const AllocationCount before;
   for (auto _ : state) {
@@ -211,15 +217,7 @@ template <typename Write>
 void envelopeOf50(benchmark::State& state, Write write) {
   test::TempRoot root;
   auto b = makeBackend();
-  timeval now{};
-  gettimeofday(&now, nullptr);
-  std::vector<Dictionary> records;
-  for (int i = 0; i < kBatch; ++i) {
-    Dictionary record = b->newEventDictfromPayload(message(static_cast<std::uint64_t>(i))[kZerithMessageParametersPayload],
-                                                   now, 42, 7, 1);
-    b->prepareEventForMessage(record, Value());
-    records.push_back(std::move(record));
-  }
+  std::vector<Dictionary> records = batchOf50(*b);
   const std::optional<std::string> clientId("E621E1F8-C36C-495A-93FC-0C247A3E6E5F");
   const auto none = [](const std::string&, const Value&) {};
   std::size_t bytes = 0;
