@@ -230,6 +230,13 @@ SerialQueue::Turn::Turn(const SerialQueue& queue) : state_(queue.state_.get()) {
   if constexpr (kLockRanksChecked) {
     // A turn may have to wait for the queue's blocks, which may take any lock.
     lockrank::willAcquire(LockRank::QueueTurn, state_, state_->label.c_str(), false);
+    // The transport's completions and bookkeeping hand work on; they never
+    // wait for a queue: the blocks they would wait for may wait for an HTTP
+    // answer that only this pool delivers.
+    if (tPool == &threadPool(Pool::Transport)) {
+      std::fprintf(stderr, "zerith: a transport pool thread waits for a turn of queue '%s'\n", state_->label.c_str());
+      std::abort();
+    }
   }
   std::unique_lock lock(state_->mutex);
   if (!state_->active && state_->items.empty()) {
