@@ -129,24 +129,12 @@ std::string hashableText(const Value& v) {
 // ---------------------------------------------------------------------------
 // Storebag-driven state and filters
 
-bool HTTPSPostBackend::matchExactStringWithList(const Value& list, const std::optional<std::string>& wholeString,
-                                                bool whitelist) {
-  if (list.count() == 0) {
-    return whitelist;
-  }
-  if (!wholeString) {
-    return !whitelist;
-  }
-  for (const Value& element : *list.array()) {
-    if (const std::string* s = element.string(); s && equalsIgnoringCase(*s, *wholeString)) {
-      return true;
-    }
-  }
-  return false;
-}
+namespace {
 
-bool HTTPSPostBackend::matchStringWithList(const Value& list, const std::optional<std::string>& wholeString,
-                                           bool whitelist) {
+// An empty (or malformed) list lets everything through a whitelist and
+// nothing through a blacklist; a missing value passes only a blacklist.
+template <typename Matches>
+bool matchWithList(const Value& list, const std::optional<std::string>& wholeString, bool whitelist, Matches matches) {
   if (list.count() == 0 || !list.isArray()) {
     return whitelist;
   }
@@ -154,11 +142,25 @@ bool HTTPSPostBackend::matchStringWithList(const Value& list, const std::optiona
     return !whitelist;
   }
   for (const Value& element : *list.array()) {
-    if (const std::string* s = element.string(); s && containsIgnoringCase(*wholeString, *s)) {
+    if (const std::string* s = element.string(); s && matches(*wholeString, *s)) {
       return true;
     }
   }
   return false;
+}
+
+}  // namespace
+
+bool HTTPSPostBackend::matchExactStringWithList(const Value& list, const std::optional<std::string>& wholeString,
+                                                bool whitelist) {
+  return matchWithList(list, wholeString, whitelist,
+                       [](const std::string& whole, const std::string& s) { return equalsIgnoringCase(s, whole); });
+}
+
+bool HTTPSPostBackend::matchStringWithList(const Value& list, const std::optional<std::string>& wholeString,
+                                           bool whitelist) {
+  return matchWithList(list, wholeString, whitelist,
+                       [](const std::string& whole, const std::string& s) { return containsIgnoringCase(whole, s); });
 }
 
 bool HTTPSPostBackend::matchClientNameAndServiceID(const Value& client, const std::optional<std::string>& clientName,
