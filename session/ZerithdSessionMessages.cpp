@@ -35,6 +35,25 @@ struct FlushJoin {
   ClientSessionInterface::ValueErrorCompletion completion;
 };
 
+// Counts the event as accepted by `backend`, then whether its category lists
+// let it through; a dropped event is counted and logged under `operation`.
+bool acceptedByFilters(ZerithBackend& backend, std::uint16_t category, const char* operation) {
+  backend.counters().add(BackendCount::accepted);
+  if (!backend.isWhitelistedEvent(category)) {
+    logger().debug("{}: Dropping event with category {} as it is not whitelisted for backend {}", operation, category,
+                   backend.name());
+    backend.counters().add(BackendCount::droppedFiltered);
+    return false;
+  }
+  if (backend.isBlacklistedEvent(category)) {
+    logger().debug("{}: Dropping event with category {} as it is blacklisted for backend {}", operation, category,
+                   backend.name());
+    backend.counters().add(BackendCount::droppedBlacklisted);
+    return false;
+  }
+  return true;
+}
+
 }  // namespace
 
 // --- Dispatch ------------------------------------------------------------------
@@ -97,17 +116,7 @@ Value ZerithdSession::sendMessageWithDictionary(const Value& message) {
 
   std::optional<std::string> chosen;
   for (const auto& [name, backend] : *set) {
-    backend->counters().add(BackendCount::accepted);
-    if (!backend->isWhitelistedEvent(category)) {
-      logger().debug("sendMessageWithDictionary: Dropping event with category {} as it is not whitelisted for backend {}",
-                     category, backend->name());
-      backend->counters().add(BackendCount::droppedFiltered);
-      continue;
-    }
-    if (backend->isBlacklistedEvent(category)) {
-      logger().debug("sendMessageWithDictionary: Dropping event with category {} as it is blacklisted for backend {}",
-                     category, backend->name());
-      backend->counters().add(BackendCount::droppedBlacklisted);
+    if (!acceptedByFilters(*backend, category, "sendMessageWithDictionary")) {
       continue;
     }
     auto result = backend->sendMessage(methodDictionary, now, category, type, flag);
@@ -325,17 +334,7 @@ void ZerithdSession::sendMessageWithSessionInfo(const Value& sessionInfo, const 
   for (const auto& [name, backend] : *backends) {
     backend->updateState();
     backend->setReportingSessionConnectivityDelegate(helper);
-    backend->counters().add(BackendCount::accepted);
-    if (!backend->isWhitelistedEvent(category)) {
-      logger().debug("sendMessageWithSessionInfo: Dropping event with category {} as it is not whitelisted for backend {}",
-                     category, backend->name());
-      backend->counters().add(BackendCount::droppedFiltered);
-      continue;
-    }
-    if (backend->isBlacklistedEvent(category)) {
-      logger().debug("sendMessageWithSessionInfo: Dropping event with category {} as it is blacklisted for backend {}",
-                     category, backend->name());
-      backend->counters().add(BackendCount::droppedBlacklisted);
+    if (!acceptedByFilters(*backend, category, "sendMessageWithSessionInfo")) {
       continue;
     }
     // A copy of the client's payload itself (no "ClientData" wrapping); a
