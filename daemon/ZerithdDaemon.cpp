@@ -21,6 +21,10 @@
 #if defined(__SANITIZE_ADDRESS__)
 #include <sanitizer/lsan_interface.h>
 #endif
+#if defined(ZERITH_COVERAGE)
+// _Exit skips the exit handler that writes the coverage counters.
+extern "C" void __gcov_dump(void);
+#endif
 
 #include "backends/Spool.h"
 #include "daemon/KeepAliveTransaction.h"
@@ -217,6 +221,9 @@ void ZerithdDaemon::exitProcess(int status) {
   std::fflush(stderr);
 #if defined(__SANITIZE_ADDRESS__)
   __lsan_do_leak_check();
+#endif
+#if defined(ZERITH_COVERAGE)
+  __gcov_dump();
 #endif
   std::_Exit(status);
 }

@@ -28,6 +28,11 @@
 
 #include "tools/zerith-collector/CollectorServer.h"
 
+#if defined(ZERITH_COVERAGE)
+// _Exit skips the exit handler that writes the coverage counters.
+extern "C" void __gcov_dump(void);
+#endif
+
 namespace {
 
 zerith::collector::CollectorServer* running = nullptr;
@@ -137,5 +142,8 @@ int main(int argc, char** argv) {
   server.run();
   server.stop();
   std::cerr << "zerith-collector: stopped\n";
+#if defined(ZERITH_COVERAGE)
+  __gcov_dump();
+#endif
   std::_Exit(0);
 }
