@@ -7,6 +7,9 @@
 #
 #   bench/measure-wakeups.sh [build-dir] [repeats]     (default build/release, 1)
 #
+# ZERITHD_BINARY=<path> measures another zerithd with the same benchmark
+# (the benchmark starts whatever it names), e.g. a build of an older tree.
+#
 # Loads: 8 clients unpaced, 60,000 events, a reply each; the same one-way
 # (--replies none); 8 clients paced at 1,000 events/s, 10,000 events, with
 # and without replies. The futex count covers the daemon's start, its
@@ -15,7 +18,7 @@ set -euo pipefail
 build="${1:-build/release}"
 repeats="${2:-1}"
 bench="$build/bench/e2e_pipeline_bench"
-daemon="$(readlink -f "$build/daemon/zerithd")"
+daemon="$(readlink -f "${ZERITHD_BINARY:-$build/daemon/zerithd}")"
 [ -x "$bench" ] && [ -x "$daemon" ] || { echo "build $build first (e2e_pipeline_bench, zerithd)" >&2; exit 1; }
 work="$(mktemp -d)"
 trap 'rm -rf "$work"' EXIT
