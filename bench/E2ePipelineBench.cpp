@@ -87,6 +87,20 @@ struct Report {
   }
   double deliveredPerSecond() const { return deliverSeconds > 0 ? counts.records / deliverSeconds : 0; }
   double acceptedPerSecond() const { return load.seconds > 0 ? load.accepted / load.seconds : 0; }
+  // Voluntary context switches of the process per delivered event: each is
+  // a thread that went to sleep and had to be woken. Summed over the threads
+  // alive at each sample; a thread that ended in between takes its count
+  // with it (then "-").
+  std::string wakeupsPerEvent() const {
+    if (!before || !after || !counts.records || after->voluntarySwitches < before->voluntarySwitches) {
+      return "-";
+    }
+    char text[32];
+    std::snprintf(text, sizeof(text), "%.2f",
+                  static_cast<double>(after->voluntarySwitches - before->voluntarySwitches) /
+                      static_cast<double>(counts.records));
+    return text;
+  }
 };
 
 // Measures one pipeline whose process is `pid`; `openIdle` opens the idle
@@ -374,13 +388,13 @@ void print(const Settings& s, const std::vector<Report>& reports) {
                                          : "max",
               s.load.window, s.load.replies ? "each" : "none", s.collector.c_str());
   std::printf(
-      "| pipeline | accepted/s | delivered/s | CPU µs/event | peak RSS KiB | private KiB @%llu | private KiB @end | "
-      "posts | gzip | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|---|\n",
+      "| pipeline | accepted/s | delivered/s | CPU µs/event | wake-ups/event | peak RSS KiB | private KiB @%llu | "
+      "private KiB @end | posts | gzip | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|---|---|\n",
       static_cast<unsigned long long>(s.memorySample));
   for (const auto& r : reports) {
-    std::printf("| %s | %.0f | %.0f | %.2f | %s | %s | %s | %llu | %llu | %llu | %lld | %llu |\n", r.pipeline.c_str(),
-                r.acceptedPerSecond(), r.deliveredPerSecond(), r.cpuMicrosPerEvent(),
-                kib(r.after, &ProcSample::peakRssKiB).c_str(), kib(r.atSample, &ProcSample::privateRssKiB).c_str(),
+    std::printf("| %s | %.0f | %.0f | %.2f | %s | %s | %s | %s | %llu | %llu | %llu | %lld | %llu |\n",
+                r.pipeline.c_str(), r.acceptedPerSecond(), r.deliveredPerSecond(), r.cpuMicrosPerEvent(),
+                r.wakeupsPerEvent().c_str(), kib(r.after, &ProcSample::peakRssKiB).c_str(), kib(r.atSample, &ProcSample::privateRssKiB).c_str(),
                 kib(r.after, &ProcSample::privateRssKiB).c_str(), static_cast<unsigned long long>(r.counts.posts),
                 static_cast<unsigned long long>(r.counts.gzipPosts), static_cast<unsigned long long>(r.counts.records),
                 static_cast<long long>(r.expected) - static_cast<long long>(r.counts.records),

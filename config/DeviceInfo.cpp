@@ -314,31 +314,37 @@ std::optional<std::string> localeCountryCode() {
 }
 
 long timeZoneOffsetSeconds() {
-  // tzset() stats the zone file on every call, and every record asks. It is
-  // re-run when TZ changed and otherwise at most once a second, so a new
-  // zone (TZ or the zone file) still shows within a second.
-  {
-    static std::mutex mutex;
-    static std::string lastTZ;
-    static bool hadTZ = false;
-    static std::chrono::steady_clock::time_point lastRead{};
-    const auto now = std::chrono::steady_clock::now();
-    std::lock_guard lock(mutex);
-    const char* tz = std::getenv("TZ");
-    const bool tzChanged = (tz != nullptr) != hadTZ || (tz && lastTZ != tz);
-    if (tzChanged || lastRead == std::chrono::steady_clock::time_point{} || now - lastRead >= std::chrono::seconds(1)) {
-      ::tzset();
-      hadTZ = tz != nullptr;
-      lastTZ = tz ? tz : "";
-      lastRead = now;
-    }
-  }
+  // Every record asks, on whichever thread makes it (socket threads side by
+  // side). tzset() stats the zone file and localtime_r takes the C
+  // library's zone lock, so each thread keeps the offset of the current
+  // second and works it out again, zone re-read first, once the second or TZ
+  // has changed: an offset only changes on a second's boundary, a new zone
+  // (TZ or the zone file) shows within a second, and the threads that send
+  // share no lock.
+  struct Cache {
+    std::string tz;
+    bool hadTZ = false;
+    std::time_t second = -1;
+    long offset = 0;
+  };
+  thread_local Cache cache;
   const std::time_t now = std::time(nullptr);
+  const char* tz = std::getenv("TZ");
+  const bool tzChanged = (tz != nullptr) != cache.hadTZ || (tz && cache.tz != tz);
+  if (!tzChanged && now == cache.second) {
+    return cache.offset;
+  }
+  ::tzset();
+  cache.hadTZ = tz != nullptr;
+  cache.tz = tz ? tz : "";
   std::tm local{};
   if (::localtime_r(&now, &local) == nullptr) {
+    cache.second = -1;
     return 0;
   }
-  return local.tm_gmtoff;
+  cache.second = now;
+  cache.offset = local.tm_gmtoff;
+  return cache.offset;
 }
 
 bool diagnosticsSubmissionAllowed() {

@@ -157,10 +157,16 @@ void ReportingSessionConnectivityHelper::startTask(const std::shared_ptr<URLSess
   // the next post through another session's helper (a backend's posts in
   // flight are shared by its sessions). Two such completions waiting for each
   // other's state queue stopped both for good, and every post behind them.
-  stateQueue_.async([self = shared_from_this(), task, completion = std::move(completion)]() mutable {
+  // The turn is taken right here when the queue is free (a batch that fills
+  // on a socket thread starts its post without waking a transport thread),
+  // else the start is queued behind what the queue is doing.
+  auto start = [self = shared_from_this(), task, completion = std::move(completion)]() mutable {
     self->createHelperForTask(*task, std::move(completion));
     task->resume();
-  });
+  };
+  if (!stateQueue_.runIfFree(start)) {
+    stateQueue_.async(std::move(start));
+  }
 }
 
 bool ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(const URLRequest& request, URLCompletion completion) {

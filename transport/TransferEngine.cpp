@@ -17,8 +17,10 @@
 #include <string>
 #include <thread>
 #include <unordered_map>
+#include <vector>
 
 #include "platform/Log.h"
+#include "platform/SerialQueue.h"
 #include "transport/DeviceConditions.h"
 #include "transport/ExtraTrust.h"
 #include "transport/ResponseHead.h"
@@ -89,6 +91,16 @@ bool failedForLackOfRoute(CURLcode code, long osErrno) {
   return false;
 }
 
+// Delegate callbacks made in the current turn of the transport loop for one
+// session's delegate queue, in the order they were made. Transport thread
+// only.
+struct Gathered {
+  const URLSession* session;
+  SerialQueue queue;
+  std::vector<std::function<void()>> blocks;
+};
+thread_local std::vector<Gathered> tGathered;
+
 }  // namespace
 
 struct TransferEngine::Impl {
@@ -100,6 +112,9 @@ struct TransferEngine::Impl {
 
   // Transport thread only.
   std::unordered_map<CURL*, std::shared_ptr<URLSessionTask>> active;
+  // Tasks completed in this turn of the loop, told to their sessions after
+  // the turn's callbacks have been handed over.
+  std::vector<std::shared_ptr<URLSessionTask>> finishedTasks;
   std::multimap<Clock::time_point, std::function<void()>> timers;
   // Transfers finished since the allocator last gave its free pages back.
   std::size_t finishedSinceTrim = 0;
@@ -183,6 +198,7 @@ struct TransferEngine::Impl {
       for (auto& [easy, task] : active) {
         flush(*task, *task->transfer_);
       }
+      handOver();
       // Idle (no transfer, no timer) the thread sleeps until a command wakes
       // it: an idle daemon has no wake-ups. With transfers under way
       // libcurl shortens the wait to its own time-outs.
@@ -235,15 +251,54 @@ struct TransferEngine::Impl {
   void after(Clock::time_point when, std::function<void()> block) { timers.emplace(when, std::move(block)); }
 
   // Posts a delegate callback for the task to its session's delegate queue.
+  // The callbacks are gathered per session over one turn of the loop and
+  // handed over at its end (handOver): a post's progress, response, data and
+  // completion, and those of the session's other transfers of the turn, reach
+  // its delegate queue as one block, one hand-off (and at most one wake-up of
+  // the queue's pool) instead of one per callback. Each queue still gets its
+  // callbacks in the order they were made.
   template <typename F>
   static void deliver(URLSessionTask& task, Transfer& t, F&& callback) {
     if (!t.delegate) {
       return;
     }
-    task.session().delegateQueue().async(
-        [self = task.shared_from_this(), delegate = t.delegate, callback = std::forward<F>(callback)]() {
-          callback(*delegate, self->session(), *self);
-        });
+    std::function<void()> block = [self = task.shared_from_this(), delegate = t.delegate,
+                                   callback = std::forward<F>(callback)]() {
+      callback(*delegate, self->session(), *self);
+    };
+    const URLSession* session = &task.session();
+    for (Gathered& gathered : tGathered) {
+      if (gathered.session == session) {
+        gathered.blocks.push_back(std::move(block));
+        return;
+      }
+    }
+    tGathered.push_back(Gathered{session, session->delegateQueue(), {}});
+    tGathered.back().blocks.push_back(std::move(block));
+  }
+
+  // At the end of a turn: every session's gathered callbacks go to its
+  // delegate queue as one block; then the sessions hear of their finished tasks, so that an
+  // invalidation this lets go is queued after the last task's completion.
+  void handOver() {
+    std::vector<Gathered> gathered;
+    gathered.swap(tGathered);
+    for (Gathered& g : gathered) {
+      if (g.blocks.size() == 1) {
+        g.queue.async(std::move(g.blocks.front()));
+        continue;
+      }
+      g.queue.async([blocks = std::move(g.blocks)] {
+        for (const auto& block : blocks) {
+          block();
+        }
+      });
+    }
+    std::vector<std::shared_ptr<URLSessionTask>> done;
+    done.swap(finishedTasks);
+    for (const auto& task : done) {
+      task->session().taskFinished();
+    }
   }
 
   static void prepare(URLSessionTask& task, Transfer& t) {
@@ -487,7 +542,7 @@ struct TransferEngine::Impl {
     t.headerList.reset();
     t.bodyFile.reset();
     t.delegate.reset();
-    task->session().taskFinished();
+    finishedTasks.push_back(task);  // handOver tells the session
   }
 
   void cancelTask(const std::shared_ptr<URLSessionTask>& task) {
