@@ -29,7 +29,6 @@ constexpr std::size_t kFramesPerWrite = 64;
 // Frames that wait are gathered into chunks of up to this size, so that
 // queueing one takes no allocation of its own and a write takes many.
 constexpr std::size_t kOutboxChunkBytes = 64u << 10;
-constexpr std::size_t kOutboxChunkStart = 4u << 10;
 
 std::int64_t steadyNanos() {
   return std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now().time_since_epoch())
@@ -137,8 +136,10 @@ void SocketConnection::enqueue(const std::uint8_t* bytes, std::size_t size, Data
   if (owned != nullptr && bytes == owned->data() && size == owned->size()) {
     outbox_.push_back(std::move(*owned));
   } else {
+    // Room for the frames that follow: a chunk that grew by doubling would
+    // copy what it holds at every step.
     Data chunk;
-    chunk.reserve(std::max(size, kOutboxChunkStart));
+    chunk.reserve(std::max(size, kOutboxChunkBytes));
     chunk.assign(bytes, bytes + size);
     outbox_.push_back(std::move(chunk));
   }
