@@ -16,6 +16,10 @@
 // BM_TenSessionsOneHierarchy ten clients in one hierarchy (levels 0-9, shared data set),
 //                            events round-robin over the ten
 // BM_SameDaemonFetchDisplayURL  a call answered by the session without dispatch
+// BM_ClientOneWayEvent       the client's side of one one-way event (the end-to-end
+//                            benchmark's ten-key event, built beforehand)
+// BM_ClientEventWithReply    the same with a reply block, at most 256 unanswered
+// BM_BareSendOfTheEventFrame the reference for both: send() of the same frame
 
 #include <benchmark/benchmark.h>
 
@@ -27,6 +31,8 @@
 
 #include <algorithm>
 #include <chrono>
+#include <condition_variable>
+#include <ctime>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
@@ -35,11 +41,13 @@
 #include <thread>
 #include <vector>
 
+#include "bench/pipeline/BenchEvent.h"
 #include "daemon/KeepAliveTransaction.h"
 #include "daemon/StorebagCache.h"
 #include "daemon/ZerithdAgent.h"
 #include "ipc/EntitlementPolicy.h"
 #include "ipc/Frame.h"
+#include "ipc/ClientSessionWire.h"
 #include "ipc/Listener.h"
 #include "platform/FileUtil.h"
 #include "platform/Log.h"
@@ -51,6 +59,29 @@
 #include "zerith/ZerithConstants.h"
 
 extern char** environ;
+
+// Allocations made by the calling thread (every malloc, calloc and realloc,
+// counted on the way to glibc's allocator), for the client benchmarks.
+namespace {
+thread_local std::uint64_t threadAllocations = 0;
+}
+extern "C" {
+void* __libc_malloc(std::size_t size);
+void* __libc_calloc(std::size_t n, std::size_t size);
+void* __libc_realloc(void* p, std::size_t size);
+void* malloc(std::size_t size) {
+  ++threadAllocations;
+  return __libc_malloc(size);
+}
+void* calloc(std::size_t n, std::size_t size) {
+  ++threadAllocations;
+  return __libc_calloc(n, size);
+}
+void* realloc(void* p, std::size_t size) {
+  ++threadAllocations;
+  return __libc_realloc(p, size);
+}
+}
 
 namespace {
 
@@ -355,6 +386,156 @@ void BM_UnixSocketEcho(benchmark::State& state) {
   state.SetItemsProcessed(n);
 }
 BENCHMARK(BM_UnixSocketEcho)->UseRealTime()->MinTime(2.0);
+
+// --- The client's side of one event -------------------------------------------------
+//
+// The framework's work for one event, from the call to its return, on the
+// calling thread (the CPU column: that thread's CPU time) and in the whole
+// client process (client_process_cpu_us_per_event: with the socket thread
+// that writes out what the socket did not take at once and reads replies),
+// against the daemon side above. The events' Values are built beforehand:
+// building one is the caller's cost either way. The reference is a bare
+// send() of the same frame on a Unix socket whose far end a thread reads and
+// discards, so that the ratio to it says what the framework adds to the one
+// system call an event needs.
+
+constexpr std::size_t kClientEvents = 64;
+
+std::vector<Value> clientEvents() {
+  std::vector<Value> events;
+  for (std::size_t i = 0; i < kClientEvents; ++i) {
+    events.emplace_back(Dictionary{{kZerithMessageParametersCategory, Value(unsigned{bench::kEventCategory})},
+                                   {kZerithMessageParametersType, Value(unsigned{bench::kEventType})},
+                                   {kZerithMessageParametersPayload, bench::eventPayload(i)}});
+  }
+  return events;
+}
+
+double cpuSeconds(clockid_t clock) {
+  timespec t{};
+  ::clock_gettime(clock, &t);
+  return static_cast<double>(t.tv_sec) + static_cast<double>(t.tv_nsec) * 1e-9;
+}
+
+// Counts the process's CPU, the calling thread's allocations and the
+// daemon's CPU over a client run.
+struct ClientCounters {
+  double process = cpuSeconds(CLOCK_PROCESS_CPUTIME_ID);
+  std::uint64_t allocations = threadAllocations;
+  std::uint64_t daemonTicks = cpuTicks(daemonProcess().pid);
+  void report(benchmark::State& state, std::int64_t events) const {
+    if (events <= 0) {
+      return;
+    }
+    const auto n = static_cast<double>(events);
+    state.counters["client_process_cpu_us_per_event"] = (cpuSeconds(CLOCK_PROCESS_CPUTIME_ID) - process) * 1e6 / n;
+    state.counters["allocs_per_event"] = static_cast<double>(threadAllocations - allocations) / n;
+    state.counters["daemon_cpu_us_per_event"] = static_cast<double>(cpuTicks(daemonProcess().pid) - daemonTicks) *
+                                                1e6 / static_cast<double>(::sysconf(_SC_CLK_TCK)) / n;
+    state.SetItemsProcessed(events);
+  }
+};
+
+void BM_ClientOneWayEvent(benchmark::State& state) {
+  if (!daemonProcess().ready) {
+    state.SkipWithError("the daemon side did not start");
+    return;
+  }
+  auto client = startedClient(sessionInfo(3));
+  if (!client) {
+    state.SkipWithError("the session did not start");
+    return;
+  }
+  const auto events = clientEvents();
+  const ClientCounters counters;
+  std::int64_t sent = 0;
+  for (auto _ : state) {
+    client->sendMessageWithDictionary(events[static_cast<std::size_t>(sent) % kClientEvents], nullptr);
+    ++sent;
+  }
+  // Everything sent reached the daemon before the run counts.
+  if (!client->flushMessages(std::chrono::seconds(60)) || !client->isValid()) {
+    state.SkipWithError("the flush after the events failed");
+    return;
+  }
+  counters.report(state, sent);
+}
+BENCHMARK(BM_ClientOneWayEvent)->MinTime(2.0);
+
+void BM_ClientEventWithReply(benchmark::State& state) {
+  if (!daemonProcess().ready) {
+    state.SkipWithError("the daemon side did not start");
+    return;
+  }
+  auto client = startedClient(sessionInfo(4));
+  if (!client) {
+    state.SkipWithError("the session did not start");
+    return;
+  }
+  struct Window {
+    std::mutex mutex;
+    std::condition_variable answered;
+    std::int64_t outstanding = 0;
+  };
+  auto window = std::make_shared<Window>();
+  const auto events = clientEvents();
+  const ClientCounters counters;
+  std::int64_t sent = 0;
+  for (auto _ : state) {
+    {
+      std::unique_lock lock(window->mutex);
+      if (!window->answered.wait_for(lock, kTimeout, [&] { return window->outstanding < 256; })) {
+        state.SkipWithError("no reply for 10 s");
+        return;
+      }
+      ++window->outstanding;
+    }
+    client->sendMessageWithDictionary(events[static_cast<std::size_t>(sent) % kClientEvents], [window](Value) {
+      std::lock_guard lock(window->mutex);
+      --window->outstanding;
+      window->answered.notify_one();
+    });
+    ++sent;
+  }
+  std::unique_lock lock(window->mutex);
+  if (!window->answered.wait_for(lock, std::chrono::seconds(60), [&] { return window->outstanding == 0; })) {
+    state.SkipWithError("replies missing after 60 s");
+    return;
+  }
+  counters.report(state, sent);
+}
+BENCHMARK(BM_ClientEventWithReply)->MinTime(2.0);
+
+void BM_BareSendOfTheEventFrame(benchmark::State& state) {
+  int fds[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
+    state.SkipWithError("socketpair failed");
+    return;
+  }
+  file::UniqueFd near(fds[0]);
+  file::UniqueFd far(fds[1]);
+  std::thread reader([fd = far.get()] {
+    std::vector<std::uint8_t> buffer(64 << 10);
+    while (::read(fd, buffer.data(), buffer.size()) > 0) {
+    }
+  });
+  const Data frame = ipc::encodeCall(ipc::wire::kSendMessage, std::nullopt,
+                                     ipc::wire::sendMessageArgs(clientEvents()[0]));
+  const ClientCounters counters;
+  std::int64_t sent = 0;
+  for (auto _ : state) {
+    if (!writeAll(near.get(), frame)) {
+      state.SkipWithError("send failed");
+      break;
+    }
+    ++sent;
+  }
+  ::shutdown(near.get(), SHUT_RDWR);
+  reader.join();
+  state.counters["frame_bytes"] = static_cast<double>(frame.size());
+  counters.report(state, sent);
+}
+BENCHMARK(BM_BareSendOfTheEventFrame)->MinTime(2.0);
 
 }  // namespace
 

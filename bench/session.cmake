@@ -4,5 +4,6 @@
 # itself, so that the test tree's recording backend can be registered.
 if(TARGET zerith_testsupport)
   zerith_bench(NAME session_bench SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/SessionDispatchBench.cpp
+    ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/BenchEvent.cpp
     DEPS zerith_daemon zerith_session zerith zerith_ipc zerith_platform zerith_testsupport)
 endif()

@@ -13,7 +13,7 @@ void ClientSessionProxy::invoke(const char* operation, Dictionary args, Connecti
   connection_->call(operation, std::move(args), std::move(handler));
 }
 
-void ClientSessionProxy::callValue(const char* operation, Dictionary args, const char* key, ValueCompletion completion) {
+void ClientSessionProxy::callValue(const std::string& operation, Dictionary args, const char* key, ValueCompletion completion) {
   if (!completion) {
     connection_->send(operation, std::move(args));
     return;
@@ -42,7 +42,9 @@ void ClientSessionProxy::fetchDisplayURL(ValueCompletion completion) {
 }
 
 void ClientSessionProxy::sendMessageWithDictionary(const Value& message, ValueCompletion reply) {
-  callValue(kSendMessage, sendMessageArgs(message), kResult, std::move(reply));
+  // The name made once: an event is the call a client makes most.
+  static const std::string operation(kSendMessage);
+  callValue(operation, sendMessageArgs(message), kResult, std::move(reply));
 }
 
 void ClientSessionProxy::flushMessagesWithCompletion(ValueErrorCompletion completion) {

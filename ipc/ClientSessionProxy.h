@@ -43,7 +43,7 @@ class ClientSessionProxy final : public ClientSessionInterface {
   const std::shared_ptr<Connection>& connection() const { return connection_; }
 
  private:
-  void callValue(const char* operation, Dictionary args, const char* key, ValueCompletion completion);
+  void callValue(const std::string& operation, Dictionary args, const char* key, ValueCompletion completion);
 
   std::shared_ptr<Connection> connection_;
 };

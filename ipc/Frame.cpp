@@ -2,6 +2,8 @@
 
 #include <fmt/format.h>
 
+#include <span>
+
 #include "platform/BinaryPlist.h"
 
 namespace zerith::ipc {
@@ -34,38 +36,68 @@ plist::Limits frameLimits() {
   return plist::Limits{kMaxFrameBytes, 32, 1u << 18};
 }
 
+namespace {
+
+void putLength(Data& buffer, std::size_t at, std::size_t n) {
+  buffer[at] = static_cast<std::uint8_t>(n >> 24);
+  buffer[at + 1] = static_cast<std::uint8_t>(n >> 16);
+  buffer[at + 2] = static_cast<std::uint8_t>(n >> 8);
+  buffer[at + 3] = static_cast<std::uint8_t>(n);
+}
+
+// The frame of the dictionary of `fields`, written in place.
+Data encodeFields(std::span<const bplist::Field> fields) {
+  Data frame;
+  const std::size_t n = bplist::encodeAt(fields, frame, kFrameHeaderBytes);
+  frame.resize(kFrameHeaderBytes + n);
+  putLength(frame, 0, n);
+  return frame;
+}
+
+}  // namespace
+
 Data encodeFrame(const Value& message) {
   // The header, then the body written in place behind it.
   Data frame;
   frame.reserve(256);
   frame.resize(kFrameHeaderBytes);
-  const auto n = static_cast<std::uint32_t>(bplist::encode(message, frame));
-  frame[0] = static_cast<std::uint8_t>(n >> 24);
-  frame[1] = static_cast<std::uint8_t>(n >> 16);
-  frame[2] = static_cast<std::uint8_t>(n >> 8);
-  frame[3] = static_cast<std::uint8_t>(n);
+  putLength(frame, 0, bplist::encode(message, frame));
   return frame;
+}
+
+std::size_t encodeCallAt(Data& buffer, std::size_t at, std::string_view operation,
+                         std::optional<std::uint64_t> call, const Dictionary& args, std::uint32_t descriptors) {
+  bplist::Field fields[4];
+  std::size_t count = 0;
+  fields[count++] = bplist::textField("op", operation);
+  if (call) {
+    fields[count++] = bplist::integerField("call", *call);
+  }
+  if (descriptors > 0) {
+    fields[count++] = bplist::integerField("fds", descriptors);
+  }
+  fields[count++] = bplist::dictionaryField("args", args);
+  const std::size_t n = bplist::encodeAt(std::span(fields, count), buffer, at + kFrameHeaderBytes);
+  putLength(buffer, at, n);
+  return kFrameHeaderBytes + n;
 }
 
 Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args,
                 std::uint32_t descriptors) {
-  Dictionary message{{"op", Value(operation)}};
-  if (call) {
-    message.set("call", Value(static_cast<long long>(*call)));
-  }
-  if (descriptors > 0) {
-    message.set("fds", Value(static_cast<long long>(descriptors)));
-  }
-  message.set("args", Value(args));
-  return encodeFrame(Value(std::move(message)));
+  Data frame;
+  frame.resize(encodeCallAt(frame, 0, operation, call, args, descriptors));
+  return frame;
 }
 
 Data encodeReply(std::uint64_t call, const Dictionary& args) {
-  return encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(call))}, {"args", Value(args)}}));
+  const bplist::Field fields[] = {bplist::integerField("reply", call), bplist::dictionaryField("args", args)};
+  return encodeFields(fields);
 }
 
 Data encodeErrorReply(std::uint64_t call, const Error& error) {
-  return encodeFrame(Value(Dictionary{{"reply", Value(static_cast<long long>(call))}, {"error", error.toValue()}}));
+  const Value described = error.toValue();
+  const bplist::Field fields[] = {bplist::integerField("reply", call), bplist::valueField("error", described)};
+  return encodeFields(fields);
 }
 
 FrameDecoder::FrameDecoder(std::uint32_t maxFrameBytes) : maxFrameBytes_(maxFrameBytes) {}

@@ -41,6 +41,11 @@ plist::Limits frameLimits();
 Data encodeFrame(const Value& message);
 Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args,
                 std::uint32_t descriptors = 0);
+// The same call frame written at offset `at` of `buffer`, which grows to
+// make room and is not shrunk (a reused buffer is written without being
+// cleared); returns the frame's size.
+std::size_t encodeCallAt(Data& buffer, std::size_t at, std::string_view operation,
+                         std::optional<std::uint64_t> call, const Dictionary& args, std::uint32_t descriptors = 0);
 Data encodeReply(std::uint64_t call, const Dictionary& args);
 Data encodeErrorReply(std::uint64_t call, const Error& error);
 

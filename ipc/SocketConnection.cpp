@@ -192,7 +192,7 @@ std::string SocketConnection::description() const {
 Error SocketConnection::goneError() { return Error{kErrorDomain, -1, "The connection was invalidated"}; }
 
 void SocketConnection::send(const std::string& operation, Dictionary args) {
-  writeFrame(encodeCall(operation, std::nullopt, args));
+  writeCall(operation, std::nullopt, args);
 }
 
 void SocketConnection::call(const std::string& operation, Dictionary args, ReplyHandler handler) {
@@ -243,7 +243,7 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
   return std::move(waiter->reply);
 }
 
-void SocketConnection::startCall(const std::string& operation, Dictionary args, ReplyHandler handler,
+void SocketConnection::startCall(std::string_view operation, Dictionary args, ReplyHandler handler,
                                  bool neverWaits, std::vector<file::UniqueFd> descriptors) {
   std::uint64_t number = 0;
   {
@@ -258,8 +258,7 @@ void SocketConnection::startCall(const std::string& operation, Dictionary args, 
     return;
   }
   // A failed write invalidates the connection, which fails the call.
-  const auto claimed = static_cast<std::uint32_t>(descriptors.size());
-  writeFrame(encodeCall(operation, number, args, claimed), std::move(descriptors));
+  writeCall(operation, number, args, std::move(descriptors));
 }
 
 // ---- connections that pass no descriptors -------------------------------------------

@@ -15,9 +15,12 @@
 // socket thread serves other connections too.
 //
 // Writing: whole frames, from any thread, in the order the calls were made.
-// A frame is written straight from the calling thread when the socket takes
-// it; what the socket does not take waits in an outbox that drains as the
-// peer reads. While the connection delivers the messages of one read chunk
+// A call's frame is encoded into the calling thread's own buffer and written
+// straight from there when nothing waits and the socket takes it: one system
+// call, no allocation, no other thread. What the socket does not take waits
+// in an outbox that drains as the peer reads; frames that wait are gathered
+// into chunks, so a sender that outpaces its peer queues each frame with a
+// copy and the socket thread writes many with one system call. While the connection delivers the messages of one read chunk
 // that answer without waiting, the frames written meanwhile (their replies
 // above all, but also frames of other threads) are gathered in the outbox
 // and leave in one write when that stretch of delivery ends: one system call
@@ -172,7 +175,7 @@ class SocketConnection final : public Connection {
     bool neverWaits = false;  // the handler may run on a socket thread
   };
 
-  void startCall(const std::string& operation, Dictionary args, ReplyHandler handler, bool neverWaits,
+  void startCall(std::string_view operation, Dictionary args, ReplyHandler handler, bool neverWaits,
                  std::vector<file::UniqueFd> descriptors = {});
   // Descriptors received with the bytes [first, end) of the stream.
   struct ReceivedDescriptors {
@@ -206,6 +209,16 @@ class SocketConnection final : public Connection {
   void releaseInput();
   void protocolError(const std::string& why);
 
+  // Writes the frame of a call of this thread (encoded in the thread's own
+  // buffer); false when the connection no longer writes.
+  bool writeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args,
+                 std::vector<file::UniqueFd> descriptors = {});
+  // Writes the frame `bytes` (held by `owned` when the outbox may take that
+  // vector over instead of copying them).
+  bool writeBytes(const std::uint8_t* bytes, std::size_t size, Data* owned, std::vector<file::UniqueFd> descriptors);
+  // Called with writeMutex_ held: the frame joins the outbox behind what
+  // waits, in the last chunk when it carries no descriptors and fits.
+  void enqueue(const std::uint8_t* bytes, std::size_t size, Data* owned, std::vector<file::UniqueFd> descriptors);
   // Sends what the socket takes now; 0 or an errno.
   int sendSome(const std::uint8_t* bytes, std::size_t size, std::size_t& sent,
                std::vector<file::UniqueFd>* descriptors = nullptr);
@@ -256,11 +269,13 @@ class SocketConnection final : public Connection {
   std::deque<ReceivedDescriptors> receivedDescriptors_;
 
   mutable std::mutex writeMutex_;
+  // Frames waiting, in order, gathered into chunks of up to kOutboxChunkBytes
+  // (a frame with descriptors starts a chunk of its own).
   std::deque<Data> outbox_;
-  // Beside each frame of the outbox: the descriptors that leave with its
+  // Beside each chunk of the outbox: the descriptors that leave with its
   // first byte (empty for most).
   std::deque<std::vector<file::UniqueFd>> outboxDescriptors_;
-  std::size_t outboxOffset_ = 0;  // of the front frame
+  std::size_t outboxOffset_ = 0;  // of the front chunk
   std::size_t outboxBytes_ = 0;
   bool outboxWasLarge_ = false;  // its storage is let go once it drains
   bool writeArmed_ = false;

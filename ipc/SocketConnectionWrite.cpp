@@ -24,8 +24,11 @@ using namespace socket_detail;
 
 namespace {
 
-// Frames handed to the kernel in one sendmsg.
+// Chunks of the outbox handed to the kernel in one sendmsg.
 constexpr std::size_t kFramesPerWrite = 64;
+// Frames that wait are gathered into chunks of up to this size, so that
+// queueing one takes no allocation of its own and a write takes many.
+constexpr std::size_t kOutboxChunkBytes = 64u << 10;
 
 std::int64_t steadyNanos() {
   return std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::steady_clock::now().time_since_epoch())
@@ -93,7 +96,58 @@ int SocketConnection::sendSome(const std::uint8_t* bytes, std::size_t size, std:
   return 0;
 }
 
+namespace {
+
+// The calling thread's buffer for the call frames it writes: encoded in
+// place and written from there, copied only when they have to wait in the
+// outbox. Kept for the next frame unless a large one made it large.
+constexpr std::size_t kKeptFrameBuffer = 64u << 10;
+Data& threadFrameBuffer() {
+  static thread_local Data buffer;
+  return buffer;
+}
+
+}  // namespace
+
+bool SocketConnection::writeCall(std::string_view operation, std::optional<std::uint64_t> call,
+                                 const Dictionary& args, std::vector<file::UniqueFd> descriptors) {
+  Data& buffer = threadFrameBuffer();
+  const std::size_t size =
+      encodeCallAt(buffer, 0, operation, call, args, static_cast<std::uint32_t>(descriptors.size()));
+  const bool written = writeBytes(buffer.data(), size, nullptr, std::move(descriptors));
+  if (buffer.size() > kKeptFrameBuffer) {
+    Data().swap(buffer);
+  }
+  return written;
+}
+
 bool SocketConnection::writeFrame(Data frame, std::vector<file::UniqueFd> descriptors) {
+  return writeBytes(frame.data(), frame.size(), &frame, std::move(descriptors));
+}
+
+void SocketConnection::enqueue(const std::uint8_t* bytes, std::size_t size, Data* owned,
+                               std::vector<file::UniqueFd> descriptors) {
+  setOutboxBytes(outboxBytes_ + size);
+  if (descriptors.empty() && !outbox_.empty() && outbox_.back().size() + size <= kOutboxChunkBytes) {
+    Data& last = outbox_.back();
+    last.insert(last.end(), bytes, bytes + size);
+    return;
+  }
+  if (owned != nullptr && bytes == owned->data() && size == owned->size()) {
+    outbox_.push_back(std::move(*owned));
+  } else {
+    // Room for the frames that follow: a chunk that grew by doubling would
+    // copy what it holds at every step.
+    Data chunk;
+    chunk.reserve(std::max(size, kOutboxChunkBytes));
+    chunk.assign(bytes, bytes + size);
+    outbox_.push_back(std::move(chunk));
+  }
+  outboxDescriptors_.push_back(std::move(descriptors));
+}
+
+bool SocketConnection::writeBytes(const std::uint8_t* bytes, std::size_t size, Data* owned,
+                                  std::vector<file::UniqueFd> descriptors) {
   int err = 0;
   bool overflow = false;
   std::size_t limit = 0;
@@ -110,20 +164,18 @@ bool SocketConnection::writeFrame(Data frame, std::vector<file::UniqueFd> descri
     }
     if (outbox_.empty() && !corked_) {
       std::size_t sent = 0;
-      err = sendSome(frame.data(), frame.size(), sent, &descriptors);
-      if (!err && sent < frame.size()) {
-        outboxOffset_ = sent;
-        setOutboxBytes(frame.size() - sent);
-        outbox_.push_back(std::move(frame));
-        outboxDescriptors_.push_back(std::move(descriptors));
+      err = sendSome(bytes, size, sent, &descriptors);
+      if (!err && sent < size) {
+        // What the socket did not take waits; descriptors that left with
+        // the first byte are gone from `descriptors`.
+        outboxOffset_ = 0;
+        enqueue(bytes + sent, size - sent, owned, std::move(descriptors));
         armWritable();
       }
     } else {
       // Behind frames that wait for the socket, or gathered for the write at
       // the end of a delivery: either way it leaves after them.
-      setOutboxBytes(outboxBytes_ + frame.size());
-      outbox_.push_back(std::move(frame));
-      outboxDescriptors_.push_back(std::move(descriptors));
+      enqueue(bytes, size, owned, std::move(descriptors));
       limit = gPerConnection.load();
       overflow = outboxBytes_ > limit;
     }

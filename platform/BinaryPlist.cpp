@@ -6,6 +6,8 @@
 #include <cmath>
 #include <cstdint>
 #include <cstring>
+#include <span>
+#include <type_traits>
 #include <string_view>
 #include <vector>
 
@@ -541,36 +543,91 @@ std::uint8_t widthOf(std::uint64_t v) {
 
 std::uint8_t log2Width(std::uint8_t width) { return width == 1 ? 0 : width == 2 ? 1 : width == 4 ? 2 : 3; }
 
+// What a string is written as: its bytes up to the first NUL (a string ends
+// there, as it does through libplist), and whether they are all ASCII (then
+// they are written as they are, otherwise as UTF-16). Eight bytes at a time.
+constexpr std::uint64_t kAsciiText = 1ull << 63;
+std::uint64_t scanText(std::string_view s) {
+  constexpr std::uint64_t kOnes = 0x0101010101010101ull;
+  constexpr std::uint64_t kHighs = 0x8080808080808080ull;
+  const char* p = s.data();
+  const std::size_t n = s.size();
+  std::uint64_t seen = 0;
+  std::size_t i = 0;
+  for (; i + 8 <= n; i += 8) {
+    std::uint64_t w = 0;
+    std::memcpy(&w, p + i, 8);
+    if (((w - kOnes) & ~w & kHighs) != 0) {
+      break;  // a NUL in these eight: byte by byte from here
+    }
+    seen |= w;
+  }
+  for (; i < n && p[i] != 0; ++i) {
+    seen |= static_cast<unsigned char>(p[i]);
+  }
+  return i | ((seen & kHighs) == 0 ? kAsciiText : 0);
+}
+
+// Scratch of one encode, kept by the thread for the next.
+struct WriterScratch {
+  std::vector<std::uint32_t> sizes;    // each object's subtree, in write order
+  std::vector<std::uint64_t> offsets;  // each object's offset
+  std::vector<std::uint64_t> texts;    // each string's scanText, in write order
+  std::vector<std::uint16_t> units;    // a string in UTF-16
+};
+WriterScratch& writerScratch() {
+  static thread_local WriterScratch scratch;
+  return scratch;
+}
+
+// Two walks over the tree: the first numbers the objects (depth first, a
+// dictionary's keys before its values), counts each one's subtree, so that a
+// container knows its children's numbers before they are written, scans the
+// strings and adds up a bound on the bytes; the second writes the objects
+// into room made once for that bound.
 class Writer {
  public:
-  explicit Writer(Data& out) : out_(out) {}
+  Writer() : s_(writerScratch()) {}
 
-  std::size_t run(const Value& root) {
-    if (root.isNil()) {
-      return 0;
-    }
-    sizes_.clear();
-    count(root);
-    const std::uint64_t numObjects = sizes_.size();
+  template <typename Root>
+  std::size_t run(const Root& root, Data& out, std::size_t at) {
+    s_.sizes.clear();
+    s_.texts.clear();
+    bound_ = kHeaderBytes + kTrailerBytes;
+    refs_ = 0;
+    plan(root);
+    const std::size_t numObjects = s_.sizes.size();
     refSize_ = tableWidthOf(numObjects);
-    offsets_.clear();
-    offsets_.reserve(numObjects);
-    append("bplist00", kHeaderBytes);
-    write(root, 0);
-    const std::uint64_t tableOffset = out_.size() - start_;
-    const std::uint8_t offsetSize = tableWidthOf(tableOffset);
-    std::uint8_t* p = grow(numObjects * offsetSize + kTrailerBytes);
-    for (const std::uint64_t offset : offsets_) {
-      putBE(p, offset, offsetSize);
-      p += offsetSize;
+    bound_ += refs_ * refSize_ + numObjects * 8;
+    if (s_.offsets.size() < numObjects) {
+      s_.offsets.resize(numObjects);
     }
-    std::memset(p, 0, 6);
-    p[6] = offsetSize;
-    p[7] = refSize_;
-    putBE(p + 8, numObjects, 8);
-    putBE(p + 16, 0, 8);
-    putBE(p + 24, tableOffset, 8);
-    return out_.size() - start_;
+    if (out.size() < at + bound_) {
+      out.resize(at + bound_);
+    }
+    base_ = out.data() + at;
+    p_ = base_;
+    text_ = 0;
+    std::memcpy(p_, "bplist00", kHeaderBytes);
+    p_ += kHeaderBytes;
+    emit(root, 0);
+    const std::uint64_t tableOffset = static_cast<std::uint64_t>(p_ - base_);
+    const std::uint8_t offsetSize = tableWidthOf(tableOffset);
+    for (std::size_t i = 0; i < numObjects; ++i) {
+      putBE(p_, s_.offsets[i], offsetSize);
+      p_ += offsetSize;
+    }
+    std::memset(p_, 0, 6);
+    p_[6] = offsetSize;
+    p_[7] = refSize_;
+    putBE(p_ + 8, numObjects, 8);
+    putBE(p_ + 16, 0, 8);
+    putBE(p_ + 24, tableOffset, 8);
+    p_ += kTrailerBytes;
+    if (s_.units.capacity() > (64u << 10)) {
+      std::vector<std::uint16_t>().swap(s_.units);
+    }
+    return static_cast<std::size_t>(p_ - base_);
   }
 
  private:
@@ -581,48 +638,99 @@ class Writer {
     }
   }
 
-  std::uint8_t* grow(std::size_t n) {
-    const std::size_t at = out_.size();
-    out_.resize(at + n);
-    return out_.data() + at;
+  // ---- the first walk
+
+  void planText(std::string_view s) {
+    const std::uint64_t info = scanText(s);
+    s_.texts.push_back(info);
+    const std::uint64_t length = info & ~kAsciiText;
+    bound_ += 10 + ((info & kAsciiText) ? length : 2 * length);
   }
-  void append(const void* bytes, std::size_t n) {
-    if (n != 0) {
-      std::memcpy(grow(n), bytes, n);
+
+  // One object and its subtree; `v` is not nil.
+  void plan(const Value& v) {
+    const std::size_t index = s_.sizes.size();
+    s_.sizes.push_back(1);
+    v.visit([this](const auto& x) {
+      using T = std::decay_t<decltype(x)>;
+      if constexpr (std::is_same_v<T, std::string>) {
+        planText(x);
+      } else if constexpr (std::is_same_v<T, Data>) {
+        bound_ += 10 + x.size();
+      } else if constexpr (std::is_same_v<T, Array>) {
+        bound_ += 10;
+        for (const auto& e : x) {
+          if (!e.isNil()) {
+            ++refs_;
+            plan(e);
+          }
+        }
+      } else if constexpr (std::is_same_v<T, Dictionary>) {
+        planEntries(x);
+      } else {
+        bound_ += 17;  // a scalar
+      }
+    });
+    s_.sizes[index] = static_cast<std::uint32_t>(s_.sizes.size() - index);
+  }
+
+  void planEntries(const Dictionary& d) {
+    bound_ += 10;
+    for (const auto& [k, e] : d) {
+      if (!e.isNil()) {
+        refs_ += 2;
+        s_.sizes.push_back(1);
+        planText(k);
+        plan(e);
+      }
     }
   }
 
-  // Objects in the order they are written (depth first, a dictionary's keys
-  // before its values), each with the number of objects in its subtree, so
-  // that a container knows its children's numbers before they are written.
-  void count(const Value& v) {
-    const std::size_t index = sizes_.size();
-    sizes_.push_back(1);
-    if (const auto* a = v.array()) {
-      for (const auto& e : *a) {
-        if (!e.isNil()) count(e);
+  void plan(std::span<const Field> fields) {
+    s_.sizes.push_back(1);
+    bound_ += 10;
+    for (const auto& f : fields) {
+      if (f.kind == Field::Kind::Value && f.value->isNil()) {
+        continue;
       }
-    } else if (const auto* d = v.dict()) {
-      for (const auto& [k, e] : *d) {
-        if (!e.isNil()) {
-          sizes_.push_back(1);
-          count(e);
+      refs_ += 2;
+      s_.sizes.push_back(1);
+      planText(f.key);
+      switch (f.kind) {
+        case Field::Kind::Text:
+          s_.sizes.push_back(1);
+          planText(f.text);
+          break;
+        case Field::Kind::Integer:
+          s_.sizes.push_back(1);
+          bound_ += 17;
+          break;
+        case Field::Kind::Dictionary: {
+          const std::size_t index = s_.sizes.size();
+          s_.sizes.push_back(1);
+          planEntries(*f.dictionary);
+          s_.sizes[index] = static_cast<std::uint32_t>(s_.sizes.size() - index);
+          break;
         }
+        case Field::Kind::Value:
+          plan(*f.value);
+          break;
       }
     }
-    sizes_[index] = static_cast<std::uint32_t>(sizes_.size() - index);
+    s_.sizes[0] = static_cast<std::uint32_t>(s_.sizes.size());
   }
+
+  // ---- the second walk
 
   void writeInt(std::uint64_t v) {
     const std::uint8_t width = widthOf(v);
-    std::uint8_t* p = grow(1 + width);
-    p[0] = static_cast<std::uint8_t>(0x10 | log2Width(width));
-    putBE(p + 1, v, width);
+    p_[0] = static_cast<std::uint8_t>(0x10 | log2Width(width));
+    putBE(p_ + 1, v, width);
+    p_ += 1 + width;
   }
 
   void writeMarker(std::uint8_t type, std::uint64_t length) {
-    const std::uint8_t marker = static_cast<std::uint8_t>(type << 4 | (length < 15 ? length : 0xF));
-    append(&marker, 1);
+    *p_++ = static_cast<std::uint8_t>(type << 4 | (length < 15 ? length : 0xF));
     if (length >= 15) {
       writeInt(length);
     }
@@ -633,16 +741,16 @@ class Writer {
       const float f = static_cast<float>(d);
       std::uint32_t bits = 0;
       std::memcpy(&bits, &f, sizeof bits);
-      std::uint8_t* p = grow(5);
-      p[0] = 0x22;
-      putBE(p + 1, bits, 4);
+      p_[0] = 0x22;
+      putBE(p_ + 1, bits, 4);
+      p_ += 5;
       return;
     }
     std::uint64_t bits = 0;
     std::memcpy(&bits, &d, sizeof bits);
-    std::uint8_t* p = grow(9);
-    p[0] = static_cast<std::uint8_t>(type << 4 | 3);
-    putBE(p + 1, bits, 8);
+    p_[0] = static_cast<std::uint8_t>(type << 4 | 3);
+    putBE(p_ + 1, bits, 8);
+    p_ += 9;
   }
 
   // libplist keeps a date as 32-bit seconds and microseconds: a date beyond
@@ -655,17 +763,20 @@ class Writer {
     writeReal(0x3, sec + static_cast<double>(usec) / 1000000);
   }
 
-  void writeString(const std::string& s) {
-    const std::string_view text(s.data(), std::min(s.size(), std::strlen(s.c_str())));
-    const bool ascii = std::all_of(text.begin(), text.end(), [](char c) { return (c & 0x80) == 0; });
-    if (ascii) {
-      writeMarker(0x5, text.size());
-      append(text.data(), text.size());
+  // The next string planned; bytes that are not UTF-8 become U+FFFD.
+  void writeText(std::string_view s) {
+    const std::uint64_t info = s_.texts[text_++];
+    const std::uint64_t length = info & ~kAsciiText;
+    if (info & kAsciiText) {
+      writeMarker(0x5, length);
+      std::memcpy(p_, s.data(), length);
+      p_ += length;
       return;
     }
-    units_.clear();
-    const auto* p = reinterpret_cast<const unsigned char*>(text.data());
-    const auto* end = p + text.size();
+    auto& units = s_.units;
+    units.clear();
+    const auto* p = reinterpret_cast<const unsigned char*>(s.data());
+    const auto* end = p + length;
     while (p < end) {
       std::uint32_t code = nextCodePoint(p, end);
       if (code == kBadUtf8) {
@@ -674,125 +785,172 @@ class Writer {
       }
       if (code >= 0x10000) {
         code -= 0x10000;
-        units_.push_back(static_cast<std::uint16_t>(0xD800 + (code >> 10)));
-        units_.push_back(static_cast<std::uint16_t>(0xDC00 + (code & 0x3FF)));
+        units.push_back(static_cast<std::uint16_t>(0xD800 + (code >> 10)));
+        units.push_back(static_cast<std::uint16_t>(0xDC00 + (code & 0x3FF)));
       } else {
-        units_.push_back(static_cast<std::uint16_t>(code));
+        units.push_back(static_cast<std::uint16_t>(code));
       }
     }
-    writeMarker(0x6, units_.size());
-    std::uint8_t* out = grow(units_.size() * 2);
-    for (const std::uint16_t u : units_) {
-      *out++ = static_cast<std::uint8_t>(u >> 8);
-      *out++ = static_cast<std::uint8_t>(u);
+    writeMarker(0x6, units.size());
+    for (const std::uint16_t u : units) {
+      *p_++ = static_cast<std::uint8_t>(u >> 8);
+      *p_++ = static_cast<std::uint8_t>(u);
     }
   }
 
-  void writeRef(std::uint64_t index) { putBE(grow(refSize_), index, refSize_); }
+  void writeRef(std::uint64_t index) {
+    if (refSize_ == 1) {
+      *p_++ = static_cast<std::uint8_t>(index);
+      return;
+    }
+    putBE(p_, index, refSize_);
+    p_ += refSize_;
+  }
 
-  // Writes object `index` (`v`) and its subtree.
-  void write(const Value& v, std::uint64_t index) {
-    offsets_.push_back(out_.size() - start_);
-    switch (v.type()) {
-      case Value::Type::Nil:
-        break;  // never reached: nil is left out
-      case Value::Type::Bool: {
-        const std::uint8_t marker = v.boolValue() ? 0x09 : 0x08;
-        append(&marker, 1);
-        break;
-      }
-      case Value::Type::Int:
-      case Value::Type::UInt: {
-        const std::uint64_t bits = v.unsignedValue();
-        if (v.type() == Value::Type::UInt && bits > static_cast<std::uint64_t>(INT64_MAX)) {
+  void mark(std::uint64_t index) { s_.offsets[index] = static_cast<std::uint64_t>(p_ - base_); }
+
+  // Writes object `index` (`v`, not nil) and its subtree.
+  void emit(const Value& v, std::uint64_t index) {
+    mark(index);
+    v.visit([this, index](const auto& x) {
+      using T = std::decay_t<decltype(x)>;
+      if constexpr (std::is_same_v<T, bool>) {
+        *p_++ = x ? 0x09 : 0x08;
+      } else if constexpr (std::is_same_v<T, std::int64_t>) {
+        writeInt(static_cast<std::uint64_t>(x));
+      } else if constexpr (std::is_same_v<T, std::uint64_t>) {
+        if (x > static_cast<std::uint64_t>(INT64_MAX)) {
           // The unsigned form, so that the far end reads an unsigned number
           // (a negative one takes eight bytes).
-          std::uint8_t* p = grow(17);
-          p[0] = 0x14;
-          putBE(p + 1, 0, 8);
-          putBE(p + 9, bits, 8);
+          p_[0] = 0x14;
+          putBE(p_ + 1, 0, 8);
+          putBE(p_ + 9, x, 8);
+          p_ += 17;
         } else {
-          writeInt(bits);
+          writeInt(x);
         }
-        break;
-      }
-      case Value::Type::Real:
-        writeReal(0x2, v.doubleValue());
-        break;
-      case Value::Type::Date:
-        writeDate(*v.date());
-        break;
-      case Value::Type::String:
-        writeString(*v.string());
-        break;
-      case Value::Type::Data:
-        writeMarker(0x4, v.data()->size());
-        append(v.data()->data(), v.data()->size());
-        break;
-      case Value::Type::Array: {
+      } else if constexpr (std::is_same_v<T, double>) {
+        writeReal(0x2, x);
+      } else if constexpr (std::is_same_v<T, Date>) {
+        writeDate(x);
+      } else if constexpr (std::is_same_v<T, std::string>) {
+        writeText(x);
+      } else if constexpr (std::is_same_v<T, Data>) {
+        writeMarker(0x4, x.size());
+        if (!x.empty()) {
+          std::memcpy(p_, x.data(), x.size());
+          p_ += x.size();
+        }
+      } else if constexpr (std::is_same_v<T, Array>) {
         std::uint64_t n = 0;
-        for (const auto& e : *v.array()) n += e.isNil() ? 0 : 1;
+        for (const auto& e : x) n += e.isNil() ? 0 : 1;
         writeMarker(0xA, n);
         std::uint64_t child = index + 1;
-        for (const auto& e : *v.array()) {
+        for (const auto& e : x) {
           if (!e.isNil()) {
             writeRef(child);
-            child += sizes_[child];
+            child += s_.sizes[child];
           }
         }
         child = index + 1;
-        for (const auto& e : *v.array()) {
+        for (const auto& e : x) {
           if (!e.isNil()) {
-            write(e, child);
-            child += sizes_[child];
+            emit(e, child);
+            child += s_.sizes[child];
           }
         }
-        break;
+      } else if constexpr (std::is_same_v<T, Dictionary>) {
+        emitEntries(x, index);
       }
-      case Value::Type::Dict: {
-        std::uint64_t n = 0;
-        for (const auto& [k, e] : *v.dict()) n += e.isNil() ? 0 : 1;
-        writeMarker(0xD, n);
-        std::uint64_t child = index + 1;
-        for (const auto& [k, e] : *v.dict()) {
-          if (!e.isNil()) {
-            writeRef(child);
-            child += 1 + sizes_[child + 1];
-          }
-        }
-        child = index + 1;
-        for (const auto& [k, e] : *v.dict()) {
-          if (!e.isNil()) {
-            writeRef(child + 1);
-            child += 1 + sizes_[child + 1];
-          }
-        }
-        child = index + 1;
-        for (const auto& [k, e] : *v.dict()) {
-          if (!e.isNil()) {
-            offsets_.push_back(out_.size() - start_);
-            writeString(k);
-            write(e, child + 1);
-            child += 1 + sizes_[child + 1];
-          }
-        }
-        break;
+    });
+  }
+
+  void emitEntries(const Dictionary& d, std::uint64_t index) {
+    std::uint64_t n = 0;
+    for (const auto& [k, e] : d) n += e.isNil() ? 0 : 1;
+    writeMarker(0xD, n);
+    std::uint64_t child = index + 1;
+    for (const auto& [k, e] : d) {
+      if (!e.isNil()) {
+        writeRef(child);
+        child += 1 + s_.sizes[child + 1];
+      }
+    }
+    child = index + 1;
+    for (const auto& [k, e] : d) {
+      if (!e.isNil()) {
+        writeRef(child + 1);
+        child += 1 + s_.sizes[child + 1];
+      }
+    }
+    child = index + 1;
+    for (const auto& [k, e] : d) {
+      if (!e.isNil()) {
+        mark(child);
+        writeText(k);
+        emit(e, child + 1);
+        child += 1 + s_.sizes[child + 1];
       }
     }
   }
 
-  Data& out_;
-  std::size_t start_ = out_.size();
-  std::uint8_t refSize_ = 1;
-  // Scratch of one encode, kept by the thread for the next.
-  static thread_local std::vector<std::uint32_t> sizes_;
-  static thread_local std::vector<std::uint64_t> offsets_;
-  static thread_local std::vector<std::uint16_t> units_;
-};
+  static bool written(const Field& f) { return f.kind != Field::Kind::Value || !f.value->isNil(); }
 
-thread_local std::vector<std::uint32_t> Writer::sizes_;
-thread_local std::vector<std::uint64_t> Writer::offsets_;
-thread_local std::vector<std::uint16_t> Writer::units_;
+  void emit(std::span<const Field> fields, std::uint64_t index) {
+    mark(index);
+    std::uint64_t n = 0;
+    for (const auto& f : fields) n += written(f) ? 1 : 0;
+    writeMarker(0xD, n);
+    std::uint64_t child = index + 1;
+    for (const auto& f : fields) {
+      if (written(f)) {
+        writeRef(child);
+        child += 1 + s_.sizes[child + 1];
+      }
+    }
+    child = index + 1;
+    for (const auto& f : fields) {
+      if (written(f)) {
+        writeRef(child + 1);
+        child += 1 + s_.sizes[child + 1];
+      }
+    }
+    child = index + 1;
+    for (const auto& f : fields) {
+      if (!written(f)) {
+        continue;
+      }
+      mark(child);
+      writeText(f.key);
+      switch (f.kind) {
+        case Field::Kind::Text:
+          mark(child + 1);
+          writeText(f.text);
+          break;
+        case Field::Kind::Integer:
+          mark(child + 1);
+          writeInt(f.integer);
+          break;
+        case Field::Kind::Dictionary:
+          mark(child + 1);
+          emitEntries(*f.dictionary, child + 1);
+          break;
+        case Field::Kind::Value:
+          emit(*f.value, child + 1);
+          break;
+      }
+      child += 1 + s_.sizes[child + 1];
+    }
+  }
+
+  WriterScratch& s_;
+  std::uint8_t* base_ = nullptr;
+  std::uint8_t* p_ = nullptr;
+  std::size_t bound_ = 0;
+  std::size_t refs_ = 0;
+  std::size_t text_ = 0;
+  std::uint8_t refSize_ = 1;
+};
 
 }  // namespace
 
@@ -805,6 +963,18 @@ std::optional<Value> decode(plist::Bytes bytes, const plist::Limits& limits, std
   return value;
 }
 
-std::size_t encode(const Value& value, Data& out) { return Writer(out).run(value); }
+std::size_t encode(const Value& value, Data& out) {
+  if (value.isNil()) {
+    return 0;
+  }
+  const std::size_t at = out.size();
+  const std::size_t n = Writer().run(value, out, at);
+  out.resize(at + n);
+  return n;
+}
+
+std::size_t encodeAt(std::span<const Field> fields, Data& buffer, std::size_t at) {
+  return Writer().run(fields, buffer, at);
+}
 
 }  // namespace zerith::bplist

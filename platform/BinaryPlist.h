@@ -18,7 +18,9 @@
 // fuzz target holds it to that.
 
 #include <cstddef>
+#include <cstdint>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -43,6 +45,33 @@ std::optional<Value> decode(plist::Bytes bytes, const plist::Limits& limits = {}
 // no nil); nil itself appends nothing. A string ends at its first NUL, as it
 // does through libplist; bytes that are not UTF-8 become U+FFFD.
 std::size_t encode(const Value& value, Data& out);
+
+// One entry of a dictionary written without being built as a Value first (a
+// frame's envelope around its arguments).
+struct Field {
+  enum class Kind { Text, Integer, Dictionary, Value };
+  std::string_view key;
+  Kind kind = Kind::Value;
+  std::string_view text{};
+  std::uint64_t integer = 0;
+  const zerith::Dictionary* dictionary = nullptr;
+  const zerith::Value* value = nullptr;  // a nil value leaves the entry out
+};
+inline Field textField(std::string_view key, std::string_view text) { return {key, Field::Kind::Text, text}; }
+inline Field integerField(std::string_view key, std::uint64_t n) { return {key, Field::Kind::Integer, {}, n}; }
+inline Field dictionaryField(std::string_view key, const zerith::Dictionary& d) {
+  return {key, Field::Kind::Dictionary, {}, 0, &d};
+}
+inline Field valueField(std::string_view key, const zerith::Value& v) {
+  return {key, Field::Kind::Value, {}, 0, nullptr, &v};
+}
+
+// Writes the binary property list of the dictionary of `fields` (in that
+// order, keys not repeated) at offset `at` of `buffer`, as encode() would
+// write that dictionary built as a Value, and returns its size. The buffer
+// grows to make room and is not shrunk: a reused buffer is written without
+// being cleared or reallocated.
+std::size_t encodeAt(std::span<const Field> fields, Data& buffer, std::size_t at);
 
 // Strict UTF-8: no overlong forms, no surrogates, nothing above U+10FFFF.
 bool validUtf8(std::string_view text);

@@ -170,6 +170,14 @@ class Value {
   // malloc_usable_size; children of containers are not included. 0 for nil.
   std::size_t allocationSize() const;
 
+  // Calls `f` once with what the value holds, by const reference (bool,
+  // std::int64_t, std::uint64_t, double, std::string, Data, Date, Array or
+  // Dictionary), or with nullptr for nil: one inline dispatch, for walks
+  // over a whole tree that would otherwise ask type() and then the typed
+  // accessor of every node.
+  template <typename F>
+  decltype(auto) visit(F&& f) const;
+
  private:
   using Storage = std::variant<bool, std::int64_t, std::uint64_t, double, std::string, zerith::Data,
                                zerith::Date, zerith::Array, zerith::Dictionary>;
@@ -183,6 +191,14 @@ class Value {
   static std::shared_ptr<const Storage> sharedNode(std::int64_t v);
   std::shared_ptr<const Storage> node_;
 };
+
+template <typename F>
+decltype(auto) Value::visit(F&& f) const {
+  if (!node_) {
+    return f(nullptr);
+  }
+  return std::visit(f, *node_);
+}
 
 inline std::size_t Dictionary::size() const { return entries_.size(); }
 inline bool Dictionary::empty() const { return entries_.empty(); }

@@ -79,20 +79,33 @@ TEST(DescriptorPassing, FrameClaimingMoreThanAFrameMayCarryEndsTheConnection) {
   EXPECT_EQ(peer.object->received.count(), 0);
 }
 
-TEST(DescriptorPassing, ConnectionCallCarriesItsDescriptors) {
-  ConnectedPair pair;
-  pair.serve();
-  Pipe pipe;
-  std::vector<file::UniqueFd> fds;
-  fds.emplace_back(::dup(pipe.write.get()));
-  pair.a->call("upload", Dictionary(), std::move(fds), [](std::optional<Dictionary>, std::optional<Error>) {});
-  ASSERT_TRUE(pair.object->received.waitFor(1));
-  const auto calls = pair.object->calls();
-  ASSERT_EQ(calls.size(), 1u);
-  ASSERT_EQ(calls[0].descriptors.size(), 1u);
-  EXPECT_EQ(::write(calls[0].descriptors[0]->get(), "x", 1), 1);
-  char byte = 0;
-  EXPECT_EQ(::read(pipe.read.get(), &byte, 1), 1);
+// On an idle socket and behind frames that wait in the outbox (the peer
+// reads only once all are written), the descriptors leave with their own
+// call's frame and every frame keeps its place.
+TEST(DescriptorPassing, ConnectionCallCarriesItsDescriptorsAlsoBehindWaitingFrames) {
+  for (const std::size_t waiting : {0u, 64u}) {
+    ConnectedPair pair;
+    for (std::size_t n = 0; n < waiting; ++n) {
+      pair.a->send("before", Dictionary{{"pad", Value(Data(16u << 10, 0x65))}});
+    }
+    EXPECT_EQ(pair.a->queuedBytes() > 0, waiting > 0);
+    Pipe pipe;
+    std::vector<file::UniqueFd> fds;
+    fds.emplace_back(::dup(pipe.write.get()));
+    pair.a->call("upload", Dictionary(), std::move(fds), [](std::optional<Dictionary>, std::optional<Error>) {});
+    pair.a->send("after", Dictionary());
+    pair.serve();
+    ASSERT_TRUE(pair.object->received.waitFor(waiting + 2));
+    const auto calls = pair.object->calls();
+    ASSERT_EQ(calls.size(), waiting + 2);
+    EXPECT_EQ(calls[waiting].operation, "upload");
+    EXPECT_EQ(calls.back().operation, "after");
+    EXPECT_TRUE(calls.back().descriptors.empty());
+    ASSERT_EQ(calls[waiting].descriptors.size(), 1u);
+    EXPECT_EQ(::write(calls[waiting].descriptors[0]->get(), "x", 1), 1);
+    char byte = 0;
+    EXPECT_EQ(::read(pipe.read.get(), &byte, 1), 1);
+  }
 }
 
 }  // namespace
