@@ -145,25 +145,6 @@ TEST_F(ListenerFixture, StopEndsAcceptingButExistingConnectionsGoOn) {
   EXPECT_TRUE(client.call("after").args) << "an existing connection stopped with the listener";
 }
 
-TEST_F(ListenerFixture, ManyClientsAtOnceAreAllServed) {
-  start();
-  constexpr int kClients = 24;
-  std::vector<std::unique_ptr<Client>> clients;
-  std::vector<std::future<CallResult>> calls;
-  for (int i = 0; i < kClients; ++i) {
-    clients.push_back(std::make_unique<Client>());
-    ASSERT_TRUE(clients.back()->connection);
-  }
-  for (int i = 0; i < kClients; ++i) {
-    calls.push_back(callLater(*clients[static_cast<std::size_t>(i)]->connection, "n", Dictionary{{"i", i}}));
-  }
-  for (int i = 0; i < kClients; ++i) {
-    auto& call = calls[static_cast<std::size_t>(i)];
-    ASSERT_EQ(call.wait_for(kWait), std::future_status::ready) << i;
-    EXPECT_EQ(call.get().args, (Dictionary{{"i", i}}));
-  }
-}
-
 // Socket activation: the parent binds a listening socket and starts this
 // test binary again as the "service" with the socket as fd 3 and
 // LISTEN_FDS/LISTEN_PID set (through sh, whose `exec` keeps the pid that
