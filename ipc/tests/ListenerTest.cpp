@@ -106,17 +106,6 @@ TEST_F(ListenerFixture, AcceptedClientIsServedWithTheEntitlementsThePolicyGrants
   EXPECT_EQ(client.connection->peer().pid, ::getpid());
 }
 
-TEST_F(ListenerFixture, StaleSocketFileIsReplaced) {
-  {
-    auto first = Listener::create(paths::socketPath(), nullptr);
-    ASSERT_TRUE(first);
-  }
-  // A listener that died without cleaning up leaves a socket nobody serves.
-  boundSocket(paths::socketPath().string(), 0);
-  start();
-  EXPECT_TRUE(Client().call("x").args);
-}
-
 TEST_F(ListenerFixture, ALiveListenerIsNotStolenARegularFileIsNotDeletedAndAnOverlongPathFails) {
   log::LogCapture capture;
   EXPECT_EQ(Listener::create(std::string(200, 'x'), nullptr), nullptr);
