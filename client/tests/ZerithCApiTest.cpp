@@ -172,6 +172,9 @@ TEST(CApi, FrameworkFactsMatchTheCppApi) {
   char* key = zerith_public_key_path();
   EXPECT_EQ(std::string(key), (root / "/usr/share/zerith/publicKey.der").string());
   zerith_free(key);
+  root.write("/usr/share/zerith/Info.plist",
+             "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>BundleVersion</key><string>9.4.1</string></dict></plist>");
+  EXPECT_EQ(Zerith::frameworkVersion(), "9.4.1");
 }
 
 }  // namespace

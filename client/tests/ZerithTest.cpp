@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <future>
 #include <regex>
 
 #include "client/tests/TestDaemon.h"
@@ -51,13 +50,6 @@ TEST_F(ZerithFixture, BlockingCallsReturnTheCompletionsArguments) {
   EXPECT_EQ(client.session->log.calls().back().operation, "finishSession");
 }
 
-TEST_F(ZerithFixture, AsynchronousCompletionsRunOnceWithTheAnswer) {
-  auto z = open();
-  ipc::test::Answer<std::pair<Value, std::optional<Error>>> flushed;
-  z->flushMessagesWithCompletion([&](Value v, std::optional<Error> e) { flushed.set({v, e}); });
-  EXPECT_EQ(flushed.get(), std::make_pair(Value("flushed"), std::optional<Error>()));
-}
-
 TEST_F(ZerithFixture, ABlockingCallTimesOutWithAClearError) {
   daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
   auto z = open();
@@ -79,19 +71,6 @@ TEST_F(ZerithFixture, ABlockingCallInsideACallbackFailsInsteadOfDeadlocking) {
   const auto reply = inner.get();
   ASSERT_TRUE(reply.error);
   EXPECT_EQ(reply.error->description, "startConfigWithCompletionHandler: cannot wait inside a callback of its own session");
-}
-
-TEST_F(ZerithFixture, TheDaemonsMessagesReachTheMessageHandler) {
-  auto z = open();
-  ipc::test::Answer<std::tuple<Value, double, std::uint16_t, std::uint16_t, Value>> got;
-  z->setMessageHandler([&](const Value& m, double t, std::uint16_t c, std::uint16_t ty, const Value& p) {
-    got.set({m, t, c, ty, p});
-  });
-  ASSERT_TRUE(z->finishSession(5s));  // the daemon knows the client by now
-  daemon->waitForClient().toClient->sendMessageToClient(Value(Dictionary{{"a", 1}}), 99.25, 12, 34,
-                                                        Value(Dictionary{{"b", "c"}}));
-  EXPECT_EQ(got.get(), std::make_tuple(Value(Dictionary{{"a", 1}}), 99.25, std::uint16_t{12}, std::uint16_t{34},
-                                       Value(Dictionary{{"b", "c"}})));
 }
 
 // Each pending completion fails in its own way: nil, nil and the error,
@@ -158,15 +137,6 @@ TEST_F(ZerithFixture, ARefusedClientLearnsOnItsFirstCall) {
   EXPECT_TRUE(daemon->clients().empty());
 }
 
-TEST(ZerithConnect, NothingListeningGivesNullAndTheReason) {
-  TempRoot root;
-  Error error;
-  EXPECT_EQ(Zerith::connect({}, &error), nullptr);
-  EXPECT_EQ(error.domain, kZerithErrorDomain);
-  EXPECT_EQ(error.description,
-            "Cannot connect to " + (root / "/run/zerithd/com.velmar.zerithd").string() + ": No such file or directory");
-}
-
 TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaultsReplacingWhatIsNotAString) {
   TempRoot root;
   const std::string yes = Zerith::getPersistentIdentifierForDNU(true);
@@ -183,15 +153,6 @@ TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaultsR
   const std::string fresh = Zerith::getPersistentIdentifierForDNU(false);
   EXPECT_TRUE(isUpperCaseUuid(fresh)) << fresh;
   EXPECT_EQ(defaults.objectForKey(kZerithPersistentIdentifierKey), Value(fresh));
-}
-
-TEST(ZerithBundle, VersionComesFromTheBundleOrFallsBackTo80) {
-  TempRoot root;
-  EXPECT_EQ(Zerith::frameworkVersion(), "8.0");
-  root.write("/usr/share/zerith/Info.plist",
-             "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>BundleVersion</key><string>9.4.1</string></dict></plist>");
-  EXPECT_EQ(Zerith::frameworkVersion(), "9.4.1");
-  EXPECT_EQ(Zerith::publicKeyPath(), root / "/usr/share/zerith/publicKey.der");
 }
 
 }  // namespace

@@ -110,20 +110,6 @@ TEST(ClientSessionWire, NilArgumentsArriveAsNilAndBooleanDefaultsToFalse) {
   EXPECT_FALSE(calls[1].hasCompletion);
 }
 
-TEST(ClientSessionWire, ACompletionCalledLaterFromAnotherThreadStillReachesTheClient) {
-  SessionLink link;
-  link.session->answer = false;
-  Answer<Value> url;
-  link.proxy.fetchDisplayURL([&](Value v) { url.set(v); });
-  ASSERT_TRUE(link.session->log.waitFor(1));
-  std::thread([&] {
-    for (auto& late : link.session->takeHeld(1)) {
-      late();
-    }
-  }).join();
-  EXPECT_EQ(url.get(), Value("https://display.example/session"));
-}
-
 TEST(ClientSessionWireRefusal, UnknownOperationIsLoggedAnsweredWithAnErrorAndTheConnectionGoesOn) {
   log::LogCapture capture;
   SessionLink link;

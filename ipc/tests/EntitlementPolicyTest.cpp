@@ -112,12 +112,5 @@ TEST_F(EntitlementPolicyTest, MissingFolderGrantsNothingAndAnUnreadableOneIsLogg
   EXPECT_TRUE(capture.contains("EntitlementPolicy: cannot read the policy folder"));
 }
 
-TEST_F(EntitlementPolicyTest, EditsApplyToTheNextCheck) {
-  write("a.plist", xmlPolicy("<integer>41001</integer>", "", kAdmit));
-  EXPECT_FALSE(policy.entitlementsFor(peer(41001, 1)).empty());
-  write("a.plist", xmlPolicy("<integer>41002</integer>", "", kAdmit));
-  EXPECT_TRUE(policy.entitlementsFor(peer(41001, 1)).empty());
-}
-
 }  // namespace
 }  // namespace zerith::ipc

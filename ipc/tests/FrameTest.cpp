@@ -40,30 +40,6 @@ std::vector<IncomingMessage> readBack(std::initializer_list<Data> frames) {
   return out;
 }
 
-TEST(FrameCodec, AFrameIsABigEndianLengthAndABinaryPropertyList) {
-  const Data frame = encodeCall("fetchDisplayURL:", 3, Dictionary{});
-  ASSERT_GT(frame.size(), 12u);
-  const std::size_t length = (std::size_t{frame[0]} << 24) | (std::size_t{frame[1]} << 16) | (std::size_t{frame[2]} << 8) | frame[3];
-  EXPECT_EQ(length, frame.size() - 4);
-  EXPECT_EQ(std::string(frame.begin() + 4, frame.begin() + 12), "bplist00");
-  const auto decoded = plist::decodeBinary(plist::Bytes(frame.data() + 4, length));
-  ASSERT_TRUE(decoded);
-  EXPECT_EQ(*decoded, Value(Dictionary{{"op", "fetchDisplayURL:"}, {"call", 3}, {"args", Dictionary{}}}));
-}
-
-TEST(FrameCodec, CallsAndRepliesSurviveTheRoundTrip) {
-  const Dictionary args{{"payload", Dictionary{{"d", Data{0, 255}}, {"r", -2.5}, {"big", 1LL << 62}}}};
-  const auto m = readBack({encodeCall("op:", std::nullopt, args), encodeCall("op:", 1ull << 40, args),
-                           encodeReply(9, args), encodeErrorReply(10, Error{"dom", -3, "why"})});
-  ASSERT_EQ(m.size(), 4u);
-  EXPECT_FALSE(m[0].call.call);
-  EXPECT_EQ(m[0].call.args, args);
-  EXPECT_EQ(m[1].call.call, 1ull << 40);
-  EXPECT_EQ(std::make_tuple(m[2].kind, m[2].replyTo, m[2].replyArgs, m[2].replyError),
-            std::make_tuple(IncomingMessage::Kind::Reply, 9u, args, std::optional<Error>()));
-  EXPECT_EQ(m[3].replyError, (Error{"dom", -3, "why"}));
-}
-
 TEST(FrameCodec, EmptyRepliesReadBackWithTheirNumberAtEveryWidth) {
   // Every number must read back as itself, whatever width it is written in.
   const std::uint64_t wide = 0x1234567890abcdefull;

@@ -106,17 +106,6 @@ TEST_F(ListenerFixture, AcceptedClientIsServedWithTheEntitlementsThePolicyGrants
   EXPECT_EQ(client.connection->peer().pid, ::getpid());
 }
 
-TEST_F(ListenerFixture, StaleSocketFileIsReplaced) {
-  {
-    auto first = Listener::create(paths::socketPath(), nullptr);
-    ASSERT_TRUE(first);
-  }
-  // A listener that died without cleaning up leaves a socket nobody serves.
-  boundSocket(paths::socketPath().string(), 0);
-  start();
-  EXPECT_TRUE(Client().call("x").args);
-}
-
 TEST_F(ListenerFixture, ALiveListenerIsNotStolenARegularFileIsNotDeletedAndAnOverlongPathFails) {
   log::LogCapture capture;
   EXPECT_EQ(Listener::create(std::string(200, 'x'), nullptr), nullptr);
@@ -143,25 +132,6 @@ TEST_F(ListenerFixture, StopEndsAcceptingButExistingConnectionsGoOn) {
   Error error;
   EXPECT_EQ(SocketConnection::connect(paths::socketPath(), &error), nullptr);
   EXPECT_TRUE(client.call("after").args) << "an existing connection stopped with the listener";
-}
-
-TEST_F(ListenerFixture, ManyClientsAtOnceAreAllServed) {
-  start();
-  constexpr int kClients = 24;
-  std::vector<std::unique_ptr<Client>> clients;
-  std::vector<std::future<CallResult>> calls;
-  for (int i = 0; i < kClients; ++i) {
-    clients.push_back(std::make_unique<Client>());
-    ASSERT_TRUE(clients.back()->connection);
-  }
-  for (int i = 0; i < kClients; ++i) {
-    calls.push_back(callLater(*clients[static_cast<std::size_t>(i)]->connection, "n", Dictionary{{"i", i}}));
-  }
-  for (int i = 0; i < kClients; ++i) {
-    auto& call = calls[static_cast<std::size_t>(i)];
-    ASSERT_EQ(call.wait_for(kWait), std::future_status::ready) << i;
-    EXPECT_EQ(call.get().args, (Dictionary{{"i", i}}));
-  }
 }
 
 // Socket activation: the parent binds a listening socket and starts this

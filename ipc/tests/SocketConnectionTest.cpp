@@ -24,18 +24,6 @@ std::string closingLine(const SocketConnection& c, const std::string& why) {
 
 // ---- framing on the wire --------------------------------------------------------
 
-TEST(SocketConnectionFraming, CallSentOneByteAtATimeIsDeliveredWholeAndAnswered) {
-  RawPeer peer;
-  peer.write(callFrame("echo", 7, Dictionary{{"text", "hello"}, {"n", 3}}), 1);
-  const auto reply = peer.readMessage();
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->kind, IncomingMessage::Kind::Reply);
-  EXPECT_EQ(reply->replyTo, 7u);
-  EXPECT_EQ(reply->replyArgs, (Dictionary{{"text", "hello"}, {"n", 3}}));
-  ASSERT_EQ(peer.object->calls().size(), 1u);
-  EXPECT_EQ(peer.object->calls()[0].operation, "echo");
-}
-
 // A binary property list {key: value} with both as 8-bit "ASCII" strings,
 // written by hand because libplist's writer would repair the bytes.
 Data oneEntryBinaryDictionary(const std::string& key, const std::string& value) {
@@ -169,43 +157,6 @@ TEST(SocketConnectionFraming, ACallWithoutAnExportedObjectGetsAnErrorReply) {
 
 bool answersCall(const std::optional<Dictionary>& args, int caller, int n) {
   return args && args->get("caller").intValue() == caller && args->get("n").intValue() == n;
-}
-
-TEST(SocketConnectionCalls, RepliesReachTheirOwnCallersWhenAnsweredOutOfOrder) {
-  ConnectedPair pair;
-  // The answering side keeps every reply and sends them back in reverse.
-  std::mutex held;
-  std::vector<std::pair<Message, std::shared_ptr<Reply>>> waiting;
-  constexpr int kThreads = 8;
-  constexpr int kCalls = 25;
-  pair.object->answer = [&](const Message& m, std::shared_ptr<Reply> r) {
-    std::vector<std::pair<Message, std::shared_ptr<Reply>>> all;
-    {
-      std::lock_guard lock(held);
-      waiting.emplace_back(m, std::move(r));
-      if (waiting.size() == kThreads * kCalls) {
-        all.swap(waiting);
-      }
-    }
-    for (auto it = all.rbegin(); it != all.rend(); ++it) {
-      it->second->send(it->first.args);
-    }
-  };
-  pair.serve();
-
-  std::atomic<int> matched{0};
-  Counter done;
-  onThreads(kThreads, [&](int t) {
-    for (int n = 0; n < kCalls; ++n) {
-      pair.a->call("work", Dictionary{{"caller", t}, {"n", n}}, [&, t, n](std::optional<Dictionary> args, std::optional<Error>) {
-        matched += answersCall(args, t, n);
-        done.hit();
-      });
-    }
-  });
-  ASSERT_TRUE(done.waitFor(kThreads * kCalls));
-  EXPECT_EQ(matched, kThreads * kCalls);
-  pair.b->queue().sync([] {});  // the answering turn has finished with the locals
 }
 
 TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOwnReply) {

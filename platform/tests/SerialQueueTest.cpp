@@ -2,35 +2,13 @@
 
 #include <atomic>
 #include <future>
-#include <latch>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "platform/SerialQueue.h"
 
 namespace zerith {
 namespace {
-
-TEST(SerialQueueTest, AsyncBlocksRunInOrderOneAtATime) {
-  SerialQueue q("test.order");
-  std::vector<int> seen;
-  std::atomic<int> running{0};
-  std::atomic<bool> overlapped{false};
-  std::promise<void> done;
-  for (int i = 0; i < 1000; ++i) {
-    q.async([&, i] {
-      if (running.fetch_add(1) != 0) overlapped = true;
-      seen.push_back(i);
-      running.fetch_sub(1);
-      if (i == 999) done.set_value();
-    });
-  }
-  ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
-  EXPECT_FALSE(overlapped);
-  ASSERT_EQ(seen.size(), 1000u);
-  for (int i = 0; i < 1000; ++i) EXPECT_EQ(seen[static_cast<std::size_t>(i)], i);
-}
 
 // Every pool thread runs a block that queues work on a queue of its own and
 // then waits for that queue's turn: the turn needs a drainer from the same
@@ -59,33 +37,6 @@ TEST(SerialQueueTest, SyncFromEveryPoolThreadOntoBusyQueuesDoesNotStarveThePool)
   }
   ASSERT_EQ(all.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready)
       << done.load() << " of " << kOuter << " finished";
-}
-
-TEST(SerialQueueTest, SyncRunsOnTheCallingThreadAfterEarlierBlocks) {
-  SerialQueue q("test.sync");
-  std::latch release(1);
-  std::atomic<bool> firstDone{false};
-  q.async([&] {
-    release.wait();
-    firstDone = true;
-  });
-  auto caller = std::this_thread::get_id();
-  std::thread t([&] {
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    release.count_down();
-  });
-  const auto ranOn = q.sync([&] {
-    EXPECT_TRUE(firstDone.load());
-    EXPECT_TRUE(q.isCurrent());
-    return std::this_thread::get_id();
-  });
-  t.join();
-  EXPECT_EQ(ranOn, caller);
-  EXPECT_FALSE(q.isCurrent());
-  // A block queued after the sync still runs.
-  std::promise<void> p;
-  q.async([&] { p.set_value(); });
-  EXPECT_EQ(p.get_future().wait_for(std::chrono::seconds(5)), std::future_status::ready);
 }
 
 TEST(SerialQueueTest, NestedSyncOntoAnotherQueueAndCancelledTimers) {
