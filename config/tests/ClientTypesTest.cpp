@@ -40,12 +40,6 @@ class EnvironmentTest : public ::testing::Test {
   log::LogCapture capture_;
 };
 
-TEST_F(EnvironmentTest, AbsentValueOnACustomerBuildResolvesToSeed) {
-  EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentSeed);
-  EXPECT_TRUE(capture_.has(Level::Default, "userDefaultsEnvironment: Environment type 3"));
-  EXPECT_EQ(lastResolvedEnvironmentType(), kEnvironmentSeed);
-}
-
 // Stored values as read: out of range is corrected to internal and logged
 // unsigned; zero is accepted and selects no section; a numeric string is
 // its integer.
@@ -84,12 +78,6 @@ TEST_F(EnvironmentTest, ChangedDefaultsTakeEffectAtTheNextCallWithoutRestart) {
               plist::encodeXml(Value(Dictionary{{"environmentType", Value(4)}})));
   EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentRelease);
   EXPECT_EQ(lastResolvedEnvironmentType(), kEnvironmentRelease);
-}
-
-TEST_F(EnvironmentTest, CorruptDefaultsFileCountsAsAbsent) {
-  root_.write("/var/lib/zerithd/defaults/com.velmar.zerith.plist", "<plist><dict><key>environmentType</key>");
-  EXPECT_EQ(userDefaultsEnvironment(), kEnvironmentSeed);
-  EXPECT_TRUE(capture_.contains("ignoring corrupt defaults file"));
 }
 
 // The internal-build flag is computed once per process, so the internal

@@ -7,14 +7,9 @@
 #include <limits>
 
 #include "config/Conversions.h"
-#include "zerith/ZerithConstants.h"
 
 namespace zerith {
 namespace {
-
-TEST(ConversionsTest, ErrorCarriesTheZerithDomainCodeAndDescription) {
-  EXPECT_EQ(makeZerithError("Nothing to flush", 503), (Error{kZerithErrorDomain, 503, "Nothing to flush"}));
-}
 
 TEST(ConversionsTest, TimevalKeepsTheMicrosecondFraction) {
   EXPECT_DOUBLE_EQ(timevalToSeconds(timeval{1000, 500000}), 1000.5);

@@ -218,15 +218,6 @@ TEST(DeviceParsersTest, CountryOfLocaleNames) {
   EXPECT_EQ(device::countryFromLocale("en_G/B"), std::nullopt);
 }
 
-TEST(DeviceParsersTest, DeviceFileMustBeADictionary) {
-  std::string why;
-  EXPECT_TRUE(device::parseDeviceFile(plist::bytesOf(plist::encodeXml(Value(Dictionary{}))), &why));
-  EXPECT_FALSE(device::parseDeviceFile(plist::bytesOf(plist::encodeXml(Value("x"))), &why));
-  EXPECT_EQ(why, "the root is not a dictionary");
-  EXPECT_FALSE(device::parseDeviceFile(plist::bytesOf(std::string("bplist00")), &why));
-  EXPECT_FALSE(why.empty());
-}
-
 using test::ScopedEnv;
 
 TEST_F(DeviceInfoTest, LocaleCountryFollowsTheLocalePrecedence) {

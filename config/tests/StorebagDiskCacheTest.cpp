@@ -5,7 +5,6 @@
 #include <fstream>
 
 #include "config/tests/StorebagTestFixture.h"
-#include "platform/Defaults.h"
 
 namespace zerith {
 namespace {
@@ -49,25 +48,6 @@ TEST(StorebagCacheControl, MaxAgeIsTheComponentAfterMaxAgeElse86400) {
   for (const auto& c : cases) {
     EXPECT_EQ(storebagMaxAgeFromCacheControl(c.header), c.maxAge) << c.header.value_or("(no header)");
   }
-}
-
-TEST_F(StorebagDiskCacheTest, SavedMetricsFollowTheLatestAnswer) {
-  saveLastLoadedStorebagMetricsWithName("ambrel", response("max-age=600", "Tue, 14 Nov 2023 22:13:20 GMT"));
-  EXPECT_EQ(metric("ambrel", "max-age"), Value(600));
-  EXPECT_EQ(metric("ambrel", "Last-Modified"), Value("Tue, 14 Nov 2023 22:13:20 GMT"));
-  EXPECT_TRUE(logs_.has(Level::Debug,
-                        "saveLastLoadedStorebagMetricsWithName: New storebag 'ambrel' received: maxAge 600, "
-                        "Last-Modified 'Tue, 14 Nov 2023 22:13:20 GMT'"));
-  // The keys live in the shared defaults domain under the storebag's name.
-  EXPECT_EQ(Defaults("com.velmar.zerith").objectForKey("CACHED_ambrel_max-age"), Value(600));
-
-  saveLastLoadedStorebagMetricsWithName("ambrel", response(std::nullopt, std::nullopt));
-  EXPECT_EQ(metric("ambrel", "max-age"), Value(86400));
-  EXPECT_TRUE(metric("ambrel", "Last-Modified").isNil());
-  EXPECT_TRUE(logs_.has(Level::Debug,
-                        "saveLastLoadedStorebagMetricsWithName: New storebag 'ambrel' received: maxAge 86400, "
-                        "Last-Modified '(null)'"));
-  EXPECT_TRUE(metric("bostin", "max-age").isNil());
 }
 
 TEST_F(StorebagDiskCacheTest, ReadingMetricsReportsAChangedOrUnchangedLastModified) {
@@ -118,13 +98,6 @@ TEST_F(StorebagDiskCacheTest, SavedContainerIsReadBackWithItsModificationDate) {
   std::size_t files = 0;
   for ([[maybe_unused]] const auto& e : std::filesystem::directory_iterator(paths::storebagCacheDir())) ++files;
   EXPECT_EQ(files, 1u);
-}
-
-TEST_F(StorebagDiskCacheTest, FormingTheFileURLCreatesTheCacheFolder) {
-  std::filesystem::remove_all(paths::storebagCacheDir());
-  const auto url = storebagCacheFileURL("dravon");
-  EXPECT_TRUE(std::filesystem::is_directory(url.parent_path()));
-  EXPECT_FALSE(std::filesystem::exists(url));
 }
 
 TEST_F(StorebagDiskCacheTest, MissingOrOversizedCacheFileIsALoggedLoadFailure) {

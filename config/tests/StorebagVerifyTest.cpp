@@ -173,31 +173,6 @@ TEST_F(StorebagVerifyTest, BrokenContainersAreRefusedWithTheirReason) {
   }
 }
 
-TEST_F(StorebagVerifyTest, ContainerSignedWithAnotherKeyIsRefused) {
-  EXPECT_TRUE(verify(signedContainer(sampleStorebag(), test::otherStorebagKeys())).isNil());
-  // OpenSSL's reason depends on whether the signature, as a number, is below
-  // the other key's modulus: both keys are random.
-  EXPECT_TRUE(logs_.contains(notVerified("invalid padding")) ||
-              logs_.contains(notVerified("data too large for modulus")));
-}
-
-TEST_F(StorebagVerifyTest, SignedBagThatIsNotADictionaryGivesNothing) {
-  const Data array = plist::encodeBinary(Value(Array{Value("release")}));
-  EXPECT_TRUE(verify(*signStorebagContainer(storebagKeys().privateKeyPEM, array)).isNil());
-  const Data notAList = bytes("release = yes");
-  EXPECT_TRUE(verify(*signStorebagContainer(storebagKeys().privateKeyPEM, notAList)).isNil());
-  EXPECT_FALSE(logs_.contains("Signature"));
-}
-
-TEST_F(StorebagVerifyTest, PublicKeyIsReadAfreshAtEveryVerification) {
-  const Data signedByFirst = signedContainer(sampleStorebag());
-  const Data signedBySecond = signedContainer(sampleStorebag(), test::otherStorebagKeys());
-  EXPECT_FALSE(verify(signedByFirst).isNil());
-  installPublicKey(test::otherStorebagKeys().publicKeyDER);
-  EXPECT_TRUE(verify(signedByFirst).isNil());
-  EXPECT_FALSE(verify(signedBySecond).isNil());
-}
-
 TEST_F(StorebagVerifyTest, PublicKeyInPkcs1FormIsAccepted) {
   const auto& der = storebagKeys().publicKeyDER;
   const unsigned char* p = der.data();
@@ -236,21 +211,6 @@ TEST_F(StorebagVerifyTest, MissingCorruptOrNonRsaPublicKeyRefusesEverything) {
   EXPECT_TRUE(verify(container).isNil());
   EXPECT_TRUE(onlyError(expected));
   EXPECT_FALSE(cached("ambrel"));
-}
-
-TEST_F(StorebagVerifyTest, SavingKeepsTheWholeContainerAndARefusedOneChangesNothing) {
-  const Data container = signedContainer(sampleStorebag("1.0"));
-  EXPECT_FALSE(verify(container, true).isNil());
-  EXPECT_TRUE(logs_.has(Level::Default, "fetchStorebagWithName: storebag 'ambrel' has been saved to disk cache"));
-  EXPECT_EQ(cached("ambrel"), container);
-
-  // Not saved unless asked.
-  EXPECT_FALSE(parseAndVerifyStorebag("bostin", container, false).isNil());
-  EXPECT_FALSE(cached("bostin"));
-
-  const Data forged = signedContainer(sampleStorebag("9.9"), test::otherStorebagKeys());
-  EXPECT_TRUE(verify(forged, true).isNil());
-  EXPECT_EQ(cached("ambrel"), container);
 }
 
 }  // namespace

@@ -203,26 +203,6 @@ TEST_F(ConnectivityHelperTest, UploadPostSendsTheExactBodyAndLeavesNoBodyFile) {
   EXPECT_EQ(logs.count("Sent " + total + " out of " + total), 1u);
 }
 
-TEST_F(ConnectivityHelperTest, RefusedConnectionCompletesWithAnErrorAtOnce) {
-  RefusingPort refusing;
-  auto done = Completions::make();
-  auto poster = Helper::initWithDelegate({}, Helper::POSTRequestMode());
-  auto getter = Helper::initWithDelegate({}, Helper::GETRequestMode());
-  poster->postURLRequestWithCompletionHandler(post(refusing.url("/"), "b"), done->handler());
-  getter->getURLRequestWithCompletionHandler(get(refusing.url("/")), done->handler());
-  ASSERT_TRUE(done->waitFor(2));
-  for (const auto& call : done->calls()) {
-    ASSERT_TRUE(call.error.has_value());
-    EXPECT_FALSE(call.error->description.empty());
-    // CURLE_COULDNT_CONNECT
-    EXPECT_EQ(std::tuple(call.error->domain, call.error->code, call.response.has_value(), call.data.size()),
-              std::tuple(std::string(kURLErrorDomain), 7, false, 0u));
-  }
-  // Waiting for connectivity is not waiting for a refusing server.
-  EXPECT_EQ(logs.count("next attempt"), 0u);
-  EXPECT_EQ(filesIn(Helper::storageRootFolder()), 0u);
-}
-
 // A server outside the trusted authorities is refused end to end
 // (StorebagStartTest); here: a bad CA file changes nothing, and trust that
 // was added once does not linger in a cached store.
@@ -296,28 +276,6 @@ TEST_F(ConnectivityHelperTest, InvalidationWithoutAgentOrWithoutTasksStillComple
   orphan->invalidate();
   ASSERT_TRUE(logs.waitFor("didBecomeInvalidWithError: session <" + orphanSession + ">"));
   EXPECT_EQ(events->events(), std::vector<std::string>{"releaseVeskTransaction"});
-}
-
-TEST_F(ConnectivityHelperTest, HelperDroppedWhileTasksRunCompletesEveryTask) {
-  server.on("/a", Reply{.body = "A"});
-  server.holdAnswers();
-  auto helper = Helper::initWithDelegate({}, 4);
-  const std::string session = helper->sessionDescription();
-  auto done = Completions::make();
-  for (int i = 0; i < 3; ++i) {
-    helper->postURLRequestWithCompletionHandler(post(server.url("/a"), std::to_string(i)), done->handler());
-  }
-  ASSERT_TRUE(server.waitForRequests(3));
-  helper.reset();
-  EXPECT_FALSE(logs.contains("QFURLSession dealloced"));
-  server.releaseAnswers();
-  ASSERT_TRUE(done->waitFor(3));
-  ASSERT_TRUE(logs.waitFor("QFURLSession dealloced with ID <" + session + ">"));
-  for (const auto& call : done->calls()) {
-    EXPECT_EQ(text(call.data), "A");
-  }
-  EXPECT_EQ(done->count(), 3u);
-  EXPECT_EQ(logs.count("didBecomeInvalidWithError"), 0u);
 }
 
 TEST_F(ConnectivityHelperTest, CompletionMaySendTheNextRequest) {
