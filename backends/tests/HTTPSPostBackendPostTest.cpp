@@ -386,6 +386,8 @@ TEST_F(HTTPSPostTest, DefaultsURLBeatsTheStorebagAndTheRealtimeURLFollowsIt) {
   ASSERT_TRUE(server.waitForRequestTo("/from-defaults"));
   // The realtime URL follows the storebag's post URL when neither is set.
   EXPECT_EQ(b->realtimePostURL(), server.url("/from-defaults"));
+  EXPECT_TRUE(logs.contains("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '" +
+                            server.url("/from-defaults") + "'"));
 }
 
 TEST_F(HTTPSPostTest, CorrelatedSessionIDRewritesTheBatch) {
