@@ -265,30 +265,6 @@ TEST_F(ZerithdAgentTest, SharedDataIsSeenAtOnceByEverySessionOfTheHierarchy) {
 
 // --- Health ------------------------------------------------------------------------
 
-TEST_F(ZerithdAgentTest, HealthFiguresCountListedSessionsPlusTheEndingOnePerSender) {
-  storebag = Value(Dictionary{{"httpPost", Value(Dictionary{{"enabled", Value(true)}})}});
-  storebagVersion = Value("17");
-  auto a = newSession(sessionInfo(1, 7));
-  auto a2 = newSession(sessionInfo(4, 7));
-  auto b = newSession(sessionInfo(2, 7));
-  auto c = newSession(sessionInfo(3, 2));
-  ASSERT_FALSE(agent->storebagForSession(*a.session).isNil());
-
-  agent->invalidateReportingSession(b.session);  // b ends
-  Dictionary payload;
-  agent->addAgentHealthInfoForSession(*b.session, payload);  // gathered with no lock held
-  EXPECT_EQ(payload.get("SessionsCount_YJ"), Value(3ull));
-  EXPECT_EQ(payload.get("SessionsCount_Unknown"), Value(1ull));
-  EXPECT_EQ(payload.get("BatchSize_YJ"), Value(0u));
-  EXPECT_EQ(payload.get("BatchSize_Unknown"), Value(0u));
-  EXPECT_EQ(payload.get("StorebagsCount"), Value(1ull));
-  const auto storebagsSize = payload.get("StorebagsSize").unsignedValue();
-  EXPECT_GT(storebagsSize, 0u);
-  EXPECT_EQ(payload.get("CalculatedMemoryUsage"), Value(static_cast<unsigned long long>(storebagsSize)));
-  EXPECT_GT(payload.get("ProcessMemoryUsage").unsignedValue(), 0u);
-  EXPECT_EQ(payload.size(), 8u);
-}
-
 TEST_F(ZerithdAgentTest, ProcessMemoryUsageIsAnonymousResidentBytes) {
   const std::uint32_t before = ZerithdAgent::processMemoryUsage();
   constexpr std::size_t kSize = 64u << 20;

@@ -400,6 +400,7 @@ TEST_F(SessionBackendsTest, DispatchFlushesAndHierarchyChangesFromManyThreadsFin
 TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedUp) {
   useStorebag({{"recA", {{"batchedBytes", Value(300)}}}, {"recB", {{"batchedBytes", Value(45)}}}});
   auto other = started(sessionInfo(6));  // another type-7 session, still live
+  auto unknown = newSession(sessionInfo(7, 2));  // a type outside the sender table
   auto c = started(sessionInfo(5));
   EXPECT_EQ(c.session->batchedEventsSize(), 345u);
   const auto a = rec(c, "recA");
@@ -413,6 +414,7 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
   EXPECT_EQ(end.respCode, 1u);
   const Value health = end.message["ClientData"];
   EXPECT_EQ(health["SessionsCount_YJ"], Value(2ull));
+  EXPECT_EQ(health["SessionsCount_Unknown"], Value(1ull));
   EXPECT_EQ(health["BatchSize_YJ"], Value(690u));
   EXPECT_EQ(health["CalculatedMemoryUsage"].unsignedValue(), 690u + health["StorebagsSize"].unsignedValue());
   EXPECT_GT(health["StorebagsSize"].unsignedValue(), 0u);
