@@ -143,22 +143,6 @@ TEST_F(CreateBackendsTest, NilSectionOrSessionInfoGivesNilWithItsErrorAndAnEmpty
   EXPECT_TRUE(none->empty());
 }
 
-TEST_F(CreateBackendsTest, UnknownKindsAreSkippedAndKnownOnesKeepTheSectionOrder) {
-  const Value section(Dictionary{{"carrierPigeon", Value(Dictionary{})},
-                                 {kZerithBackendKovu, Value(Dictionary{{"x", 1}})},
-                                 {"smokeSignal", Value(Dictionary{})},
-                                 {kZerithBackendPellamlog, Value(Dictionary{})}});
-  const auto backends = createBackends(section, sessionInfo_, userInfo_, udid_);
-  ASSERT_TRUE(backends);
-  ASSERT_EQ(backends->size(), 2u);
-  EXPECT_EQ((*backends)[0].first, kZerithBackendKovu);
-  EXPECT_NE(std::dynamic_pointer_cast<KovuBackend>((*backends)[0].second), nullptr);
-  EXPECT_EQ((*backends)[1].first, kZerithBackendPellamlog);
-  EXPECT_NE(std::dynamic_pointer_cast<PellamBackend>((*backends)[1].second), nullptr);
-  EXPECT_TRUE(capture_.has(Level::Error, "ZerithBackend(newBackendWithName): carrierPigeon"));
-  EXPECT_TRUE(capture_.has(Level::Error, "ZerithBackend(newBackendWithName): smokeSignal"));
-}
-
 TEST_F(CreateBackendsTest, EveryBackendCarriesTheSessionIdentityAndDeviceFacts) {
   setFrameworkVersion("2.5.3");
   timeval before{};

@@ -6,7 +6,6 @@
 #include <algorithm>
 #include <atomic>
 #include <numeric>
-#include <set>
 #include <thread>
 
 #include "backends/tests/HTTPSPostBackendTestSupport.h"
@@ -387,6 +386,8 @@ TEST_F(HTTPSPostTest, DefaultsURLBeatsTheStorebagAndTheRealtimeURLFollowsIt) {
   ASSERT_TRUE(server.waitForRequestTo("/from-defaults"));
   // The realtime URL follows the storebag's post URL when neither is set.
   EXPECT_EQ(b->realtimePostURL(), server.url("/from-defaults"));
+  EXPECT_TRUE(logs.contains("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '" +
+                            server.url("/from-defaults") + "'"));
 }
 
 TEST_F(HTTPSPostTest, CorrelatedSessionIDRewritesTheBatch) {
@@ -531,63 +532,6 @@ TEST_F(HTTPSPostTest, BatchStillHeldWhenTheBackendGoesIsCountedAsDropped) {
   EXPECT_EQ(counters->get(BackendCount::batched), 2u);
   EXPECT_EQ(counters->get(BackendCount::droppedDisabled), 2u);
   EXPECT_EQ(counters->get(BackendCount::sent), 0u);
-}
-
-// Envelopes of `n` records whose text looks like JSON structure.
-std::vector<Dictionary> records(int n) {
-  std::vector<Dictionary> out;
-  for (int i = 0; i < n; ++i) {
-    out.push_back(Dictionary{{"n", i}, {"text", "{\"not\":[a record]}"}});
-  }
-  return out;
-}
-
-TEST_F(HTTPSPostTest, RecordsCarryADistinctIDOnlyWithTheKey) {
-  auto without = batching(server.url("/post"));
-  auto envelope = nlohmann::ordered_json::parse(*without->createMessageForPostAndLogging(records(3), nullptr));
-  for (const auto& record : envelope["events"]) {
-    EXPECT_FALSE(record.contains("_recordID")) << record;
-  }
-  Defaults("com.velmar.zerith").setObject("spoolEnabled", Value(true));
-  auto with = batching(server.url("/post"));
-  std::set<std::string> ids;
-  for (int round = 0; round < 2; ++round) {
-    envelope = nlohmann::ordered_json::parse(*with->createMessageForPostAndLogging(records(3), nullptr));
-    for (const auto& record : envelope["events"]) {
-      const std::string id = record.value("_recordID", std::string());
-      EXPECT_EQ(id.size(), 32u) << record;
-      EXPECT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
-      EXPECT_TRUE(ids.insert(id).second) << id;
-    }
-  }
-  EXPECT_EQ(ids.size(), 6u);
-}
-
-// What the answer to a post counts: delivered, or lost when no spool keeps
-// the batch; only a server error disables the backend.
-TEST_F(HTTPSPostTest, AnswersCountDeliveredOrLostRecordsWithoutTheSpool) {
-  server.on("/ok", Reply{.status = 200});
-  server.on("/unavailable", Reply{.status = 503});
-  server.on("/bad", Reply{.status = 400});
-  RefusingPort refusing;
-  struct Row {
-    std::string url;
-    BackendCount counted;
-    std::int32_t state;
-  };
-  const Row rows[] = {{server.url("/ok"), BackendCount::delivered, kBackendStateEnabled},
-                      {refusing.url("/post"), BackendCount::droppedTransportError, kBackendStateEnabled},
-                      {server.url("/unavailable"), BackendCount::droppedTransportError, kBackendStateDisabled},
-                      {server.url("/bad"), BackendCount::droppedTransportError, kBackendStateEnabled}};
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.url);
-    auto b = batching(row.url);
-    post(*b, *b->createMessageForPostAndLogging(records(3), nullptr));
-    expectOnly(*b, {{row.counted, 3}});
-    EXPECT_EQ(b->state(), row.state);
-  }
-  // No spool was asked for anything.
-  EXPECT_FALSE(logs.contains("Spool:"));
 }
 
 }  // namespace

@@ -208,21 +208,6 @@ TEST_F(HTTPSStateTest, EachRefusalDisablesWithItsOwnLine) {
   }
 }
 
-TEST_F(HTTPSStateTest, UserInfoDecidesBetweenUndecidedAndTheCheckedPath) {
-  auto client = enablingClient("https://x/");
-  client.erase("locale_whitelist");  // would disable on the checked path
-  EXPECT_EQ(backend(profileWith({client}), Value(), true)->state(), kBackendStateUndecided);
-  EXPECT_EQ(backend(profileWith({client}), userInfo(), true)->state(), kBackendStateDisabled);
-  // Without required user info no check applies; the post link is taken.
-  auto unchecked = backend(profileWith({client}), Value(), false);
-  EXPECT_EQ(unchecked->state(), kBackendStateEnabled);
-  EXPECT_EQ(unchecked->postURL(), "https://x/");
-  EXPECT_EQ(unchecked->realtimePostURL(), "https://x/");
-  EXPECT_TRUE(logs.contains("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL 'https://x/'"));
-  // No entry for this client at all.
-  EXPECT_EQ(backend(profileWith({client}), userInfo("mail", "sync"), true)->state(), kBackendStateDisabled);
-}
-
 TEST_F(HTTPSStateTest, SamplingDrawOverManyBackendsStaysWithinBinomialBounds) {
   auto client = enablingClient("https://x/");
   client.set("sampling_threshold", 0.25);

@@ -73,35 +73,6 @@ std::set<std::string> namesIn(const fs::path& folder) {
 // ---------------------------------------------------------------------------
 // The file format
 
-TEST(SpoolFileTest, RoundTripKeepsEveryField) {
-  const SpoolBatch batch = batchOf(7, 300);
-  std::string why;
-  const auto back = decodeSpoolFile(encodeSpoolFile(batch), &why);
-  ASSERT_TRUE(back) << why;
-  EXPECT_EQ(back->createdMillis, batch.createdMillis);
-  EXPECT_EQ(back->recordCount, 7u);
-  EXPECT_EQ(back->url, batch.url);
-  EXPECT_EQ(back->headers, batch.headers);
-  EXPECT_EQ(back->body, batch.body);
-}
-
-TEST(SpoolFileTest, EveryTruncationAndEveryFlippedByteIsRefused) {
-  const Data bytes = encodeSpoolFile(batchOf(2, 40));
-  for (std::size_t n = 0; n < bytes.size(); ++n) {
-    std::string why;
-    EXPECT_FALSE(decodeSpoolFile(std::span<const std::uint8_t>(bytes.data(), n), &why)) << n;
-    EXPECT_FALSE(why.empty());
-  }
-  for (std::size_t i = 0; i < bytes.size(); ++i) {
-    Data flipped = bytes;
-    flipped[i] ^= 0x20;
-    EXPECT_FALSE(decodeSpoolFile(flipped, nullptr)) << "byte " << i;
-  }
-  Data longer = bytes;
-  longer.push_back(0);
-  EXPECT_FALSE(decodeSpoolFile(longer, nullptr));
-}
-
 TEST(SpoolFileTest, AnotherVersionOrMagicSaysSo) {
   Data bytes = encodeSpoolFile(batchOf(1, 10));
   bytes[8] = 2;
@@ -250,52 +221,6 @@ TEST_F(SpoolStoreTest, BadFilesAreMovedAsideNeverRead) {
   EXPECT_TRUE(s.read(good));
 }
 
-TEST_F(SpoolStoreTest, SizeLimitDropsTheOldestFirst) {
-  const std::size_t fileSize = encodeSpoolFile(batchOf(1, 1000, now)).size();
-  SpoolStore s = store(3 * fileSize + 10);
-  std::vector<std::string> names;
-  std::vector<SpoolStore::Dropped> dropped;
-  for (std::uint32_t i = 1; i <= 5; ++i) {
-    now += 10;
-    auto outcome = s.write(batchOf(i, 1000, now));
-    ASSERT_TRUE(outcome.written) << i;
-    names.push_back(outcome.name);
-    dropped.insert(dropped.end(), outcome.dropped.begin(), outcome.dropped.end());
-  }
-  ASSERT_EQ(dropped.size(), 2u);
-  EXPECT_EQ(dropped[0].entry.name, names[0]);
-  EXPECT_EQ(dropped[0].entry.records, 1u);
-  EXPECT_EQ(dropped[1].entry.name, names[1]);
-  EXPECT_EQ(dropped[0].reason, SpoolStore::DropReason::size);
-  EXPECT_EQ(namesIn(folder()), (std::set<std::string>{names[2], names[3], names[4]}));
-  EXPECT_LE(s.totalBytes(), 3 * fileSize + 10);
-
-  // A batch larger than the whole spool is refused and drops nothing.
-  const auto huge = s.write(batchOf(9, 5000, now));
-  EXPECT_FALSE(huge.written);
-  EXPECT_EQ(huge.error, 0);
-  EXPECT_TRUE(huge.dropped.empty());
-  EXPECT_EQ(s.size(), 3u);
-}
-
-TEST_F(SpoolStoreTest, AgeLimitDropsWhatIsTooOld) {
-  SpoolStore s = store(1 << 20, 60);
-  const std::string old = s.write(batchOf(4, 10, now)).name;
-  now += 30'000;
-  const std::string young = s.write(batchOf(5, 10, now)).name;
-  now += 31'000;  // the first is 61 s old, the second 31 s
-  const auto dropped = s.dropExpired(now);
-  ASSERT_EQ(dropped.size(), 1u);
-  EXPECT_EQ(dropped[0].entry.name, old);
-  EXPECT_EQ(dropped[0].reason, SpoolStore::DropReason::age);
-  EXPECT_EQ(namesIn(folder()), std::set<std::string>{young});
-  // A write also drops what expired first.
-  now += 30'000;
-  const auto outcome = s.write(batchOf(1, 10, now));
-  ASSERT_EQ(outcome.dropped.size(), 1u);
-  EXPECT_EQ(outcome.dropped[0].entry.name, young);
-}
-
 TEST_F(SpoolStoreTest, FullDiskLosesOnlyTheBatchAndLeavesNoHalfFile) {
   // RLIMIT_FSIZE makes every write past the limit fail with EFBIG, as a full
   // disk fails with ENOSPC: the same path through the store. Done in a
@@ -411,29 +336,6 @@ TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
   EXPECT_EQ(spool->counters().get(BackendCount::delivered), 3u);
   EXPECT_EQ(spool->counters().get(BackendCount::retried), 5u);  // 1 + 1 + 1 + 2
   EXPECT_TRUE(namesIn(root.path() / "spool").empty());
-}
-
-TEST_F(SpoolRetryTest, WhatAnEarlierRunLeftIsDeliveredAtStart) {
-  HttpsTestServer server;
-  server.on("/post", Reply{.status = 200});
-  {
-    SpoolStore store(root.path() / "spool", 1 << 20, 3600);
-    std::string why;
-    ASSERT_TRUE(store.open(&why)) << why;
-    SpoolBatch batch = batchOf(4, 0);
-    batch.createdMillis = std::chrono::duration_cast<std::chrono::milliseconds>(
-                              std::chrono::system_clock::now().time_since_epoch())
-                              .count();
-    batch.url = server.url("/post");
-    const std::string body = R"({"events":[{},{},{},{}]})";
-    batch.body.assign(body.begin(), body.end());
-    ASSERT_TRUE(store.write(batch).written);
-  }
-  auto spool = makeSpool({});
-  ASSERT_TRUE(server.waitForRequests(1));
-  ASSERT_TRUE(waitDrained(*spool));
-  EXPECT_EQ(server.requests()[0].body, R"({"events":[{},{},{},{}]})");
-  EXPECT_EQ(spool->counters().get(BackendCount::delivered), 4u);
 }
 
 TEST_F(SpoolRetryTest, AClientErrorDropsTheBatchForGood) {

@@ -184,15 +184,6 @@ TEST_F(ZerithdAgentTest, UnlistedSessionFindsNoParent) {
       logs.has(Level::Error, "parentSessionIDStringForSession: ERROR: No sessions found for hierarchyToken call"));
 }
 
-TEST_F(ZerithdAgentTest, ReRegisteringUnderANewTokenLeavesTheOldListEmptyButPresent) {
-  auto s = newSession(hierarchyInfo(1, "old", 0));
-  s.session->setSessionInfo(hierarchyInfo(1, "new", 0), Value(), Value(), false);
-  ASSERT_TRUE(agent->correlatedSessions("old").has_value());
-  EXPECT_TRUE(agent->correlatedSessions("old")->empty());
-  ASSERT_TRUE(agent->correlatedSessions("new").has_value());
-  EXPECT_EQ(agent->correlatedSessions("new")->front(), s.session);
-}
-
 TEST_F(ZerithdAgentTest, StandaloneSessionIsNotCorrelated) {
   auto s = newSession(sessionInfo(5));
   EXPECT_TRUE(logs.has(Level::Default,
@@ -274,30 +265,6 @@ TEST_F(ZerithdAgentTest, SharedDataIsSeenAtOnceByEverySessionOfTheHierarchy) {
 
 // --- Health ------------------------------------------------------------------------
 
-TEST_F(ZerithdAgentTest, HealthFiguresCountListedSessionsPlusTheEndingOnePerSender) {
-  storebag = Value(Dictionary{{"httpPost", Value(Dictionary{{"enabled", Value(true)}})}});
-  storebagVersion = Value("17");
-  auto a = newSession(sessionInfo(1, 7));
-  auto a2 = newSession(sessionInfo(4, 7));
-  auto b = newSession(sessionInfo(2, 7));
-  auto c = newSession(sessionInfo(3, 2));
-  ASSERT_FALSE(agent->storebagForSession(*a.session).isNil());
-
-  agent->invalidateReportingSession(b.session);  // b ends
-  Dictionary payload;
-  agent->addAgentHealthInfoForSession(*b.session, payload);  // gathered with no lock held
-  EXPECT_EQ(payload.get("SessionsCount_YJ"), Value(3ull));
-  EXPECT_EQ(payload.get("SessionsCount_Unknown"), Value(1ull));
-  EXPECT_EQ(payload.get("BatchSize_YJ"), Value(0u));
-  EXPECT_EQ(payload.get("BatchSize_Unknown"), Value(0u));
-  EXPECT_EQ(payload.get("StorebagsCount"), Value(1ull));
-  const auto storebagsSize = payload.get("StorebagsSize").unsignedValue();
-  EXPECT_GT(storebagsSize, 0u);
-  EXPECT_EQ(payload.get("CalculatedMemoryUsage"), Value(static_cast<unsigned long long>(storebagsSize)));
-  EXPECT_GT(payload.get("ProcessMemoryUsage").unsignedValue(), 0u);
-  EXPECT_EQ(payload.size(), 8u);
-}
-
 TEST_F(ZerithdAgentTest, ProcessMemoryUsageIsAnonymousResidentBytes) {
   const std::uint32_t before = ZerithdAgent::processMemoryUsage();
   constexpr std::size_t kSize = 64u << 20;
@@ -322,24 +289,6 @@ TEST(SenderCodes, HealthUsesTheTableOnlyForClientTypesFiveToTwentyThree) {
   EXPECT_EQ(healthSenderCode(-1), "Unknown");
   EXPECT_EQ(senderCode(0), "ZP");
   EXPECT_EQ(senderCode(16), "XMORDAL");
-}
-
-// --- Storebags ---------------------------------------------------------------------
-
-TEST_F(ZerithdAgentTest, StorebagIsFetchedForTheSessionsClientTypeAndThenServedFromTheCache) {
-  storebag = Value(Dictionary{{"httpPost", Value(Dictionary{})}});
-  storebagVersion = Value("42");
-  auto a = newSession(sessionInfo(1, 7));
-  auto b = newSession(sessionInfo(2, 11));  // the same storebag name as type 7
-  EXPECT_EQ(agent->storebagForSession(*a.session), storebag);
-  EXPECT_EQ(agent->storebagForSession(*b.session), storebag);
-  EXPECT_EQ(fetchedClientTypes, std::vector<std::int32_t>{7});
-  EXPECT_EQ(agent->storebagVersionForSession(*b.session), Value("42"));
-  // A client type without a storebag has neither (the cache's own test
-  // covers every such type).
-  auto invalid = newSession(sessionInfo(3, 2));
-  EXPECT_TRUE(agent->storebagForSession(*invalid.session).isNil());
-  EXPECT_TRUE(agent->storebagVersionForSession(*invalid.session).isNil());
 }
 
 }  // namespace

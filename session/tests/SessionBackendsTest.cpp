@@ -120,35 +120,6 @@ TEST_F(SessionBackendsTest, EveryBackendGetsClientDataSharedDataTheNumbersAndThe
   EXPECT_EQ(rec(standalone, "recA")->events()[1].flag, 0);
 }
 
-TEST_F(SessionBackendsTest, WhitelistAndBlacklistDecidePerBackend) {
-  useStorebag({{"recA", {{"whitelist", Value(Array{Value(3), Value(4)})}}},
-               {"recB", {{"blacklist", Value(Array{Value(4)})}}},
-               {"recC", {{"whitelist", Value(Array{})}, {"blacklist", Value(Array{})}}}});
-  auto c = started(sessionInfo(5));
-  logs.clear();
-  send(c, event(3, 1));
-  send(c, event(4, 1));
-  send(c, event(5, 1));
-  auto categories = [&](const char* name) {
-    std::vector<unsigned> out;
-    for (const auto& e : rec(c, name)->events()) {
-      if (e.method != 0) {
-        out.push_back(e.method);
-      }
-    }
-    return out;
-  };
-  EXPECT_EQ(categories("recA"), (std::vector<unsigned>{3, 4}));
-  EXPECT_EQ(categories("recB"), (std::vector<unsigned>{3, 5}));
-  EXPECT_TRUE(categories("recC").empty());  // an empty whitelist admits nothing
-  EXPECT_TRUE(logs.has(Level::Debug,
-                       "sendMessageWithDictionary: Dropping event with category 5 as it is not whitelisted for backend recA"));
-  EXPECT_TRUE(
-      logs.has(Level::Debug, "sendMessageWithDictionary: Dropping event with category 4 as it is blacklisted for backend recB"));
-  EXPECT_EQ(logs.count("as it is not whitelisted for backend recC"), 3u);
-  EXPECT_EQ(logs.count("as it is blacklisted for backend recC"), 0u);
-}
-
 TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutOne) {
   const std::map<std::string, std::string> results = {{kZerithBackendHTTPPost, "post#"},
                                                       {kZerithBackendHTTPPost2, "post2#"},
@@ -180,20 +151,6 @@ TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutO
   const std::string log = messageLog();
   EXPECT_NE(log.find(") [recA -> sendMessageWithDictionary] other#2\n"), std::string::npos) << log;
   EXPECT_NE(log.find(") [dashboard -> sendMessageWithDictionary] dash#2\n"), std::string::npos) << log;
-}
-
-TEST_F(SessionBackendsTest, PayloadThatIsNotADictionaryIsRefusedAndTheSessionGoesOn) {
-  useStorebag({{"recA", {}}});
-  auto c = started(sessionInfo(5));
-  EXPECT_TRUE(send(c, event(3, 1, Value("text"))).isNil());
-  EXPECT_TRUE(send(c, event(3, 1, Value(Array{Value(1)}))).isNil());
-  EXPECT_EQ(countExact(Level::Error,
-                       "sendMessageWithDictionary: Dropping event with category 3 as its payload is not a dictionary"),
-            2u);
-  send(c, event(3, 2, Value(Dictionary{{"ok", Value(true)}})));
-  const auto events = rec(c, "recA")->events();
-  ASSERT_EQ(events.size(), 2u);  // the start message and the good event
-  EXPECT_EQ(events[1].respCode, 2u);
 }
 
 TEST_F(SessionBackendsTest, SharedDataIsPerTokenAndBadOrOversizedUpdatesChangeNothing) {
@@ -443,6 +400,7 @@ TEST_F(SessionBackendsTest, DispatchFlushesAndHierarchyChangesFromManyThreadsFin
 TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedUp) {
   useStorebag({{"recA", {{"batchedBytes", Value(300)}}}, {"recB", {{"batchedBytes", Value(45)}}}});
   auto other = started(sessionInfo(6));  // another type-7 session, still live
+  auto unknown = newSession(sessionInfo(7, 2));  // a type outside the sender table
   auto c = started(sessionInfo(5));
   EXPECT_EQ(c.session->batchedEventsSize(), 345u);
   const auto a = rec(c, "recA");
@@ -456,6 +414,7 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
   EXPECT_EQ(end.respCode, 1u);
   const Value health = end.message["ClientData"];
   EXPECT_EQ(health["SessionsCount_YJ"], Value(2ull));
+  EXPECT_EQ(health["SessionsCount_Unknown"], Value(1ull));
   EXPECT_EQ(health["BatchSize_YJ"], Value(690u));
   EXPECT_EQ(health["CalculatedMemoryUsage"].unsignedValue(), 690u + health["StorebagsSize"].unsignedValue());
   EXPECT_GT(health["StorebagsSize"].unsignedValue(), 0u);
@@ -493,6 +452,10 @@ TEST_F(SessionBackendsTest, EndMessageCountsEachBackendsEventsAndTheAgentKeepsTh
   EXPECT_TRUE(end["BackendCounts_recA_batched"].isNil());
   EXPECT_TRUE(end["BackendCounts_recB_droppedFiltered"].isNil());
   EXPECT_EQ(end["SessionsCount_YJ"], Value(2ull));  // the health figures stay as they were
+  EXPECT_TRUE(logs.has(Level::Debug,
+                       "sendMessageWithDictionary: Dropping event with category 5 as it is not whitelisted for backend recA"));
+  EXPECT_TRUE(
+      logs.has(Level::Debug, "sendMessageWithDictionary: Dropping event with category 4 as it is blacklisted for backend recB"));
 
   const auto expectStatus = [&](const char* when) {
     SCOPED_TRACE(when);

@@ -173,22 +173,6 @@ TEST_F(ZerithdSessionTest, FlushAndDisplayURLBeforeConfigurationFailWithoutBacke
   EXPECT_EQ(flush(*s.session), (std::vector<FlushAnswer>{{Value(), std::nullopt}}));
 }
 
-TEST_F(ZerithdSessionTest, MessagesAreCheckedForCategoryFirstThenType) {
-  auto s = newSession(sessionInfo(5));
-  EXPECT_TRUE(send(s, Value(Dictionary{})).isNil());
-  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: No backends available to send message"));
-  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Sending message for session 5"));
-
-  s.session->startConfigWithCompletionHandler(nullptr);
-  logs.clear();
-  EXPECT_TRUE(send(s, Value(Dictionary{})).isNil());
-  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'category'"));
-  EXPECT_FALSE(logs.contains("Missing mandatory parameter 'type'"));
-  EXPECT_TRUE(send(s, Value(Dictionary{{kZerithMessageParametersCategory, Value(3)}})).isNil());
-  EXPECT_TRUE(logs.has(Level::Debug, "sendMessageWithDictionary: Missing mandatory parameter 'type'"));
-  EXPECT_TRUE(send(s, event(3, 4)).isNil());
-}
-
 TEST_F(ZerithdSessionTest, UploadsAreRefusedWithoutAnUploadBackend) {
   auto s = newSession(sessionInfo(5));
   std::optional<bool> uploaded;
@@ -251,21 +235,6 @@ TEST_F(ZerithdSessionTest, UserInfoEntriesReplacePayloadEntriesOnTheWayToTheAggr
   EXPECT_EQ(sent[1].get("category"), Value(3u));
   EXPECT_EQ(sent[1].get("type"), Value(70000u & 0xffffu));
   EXPECT_TRUE(sent[2].get("payload").isNil());  // a nil payload stays nil
-}
-
-TEST_F(ZerithdSessionTest, EventsOfADescendantGoOnlyToTheAggregatingAncestor) {
-  auto parent = newSession(hierarchyInfo(1, "call", 0), /*aggregator=*/true);
-  auto child = newSession(hierarchyInfo(2, "call", 1));
-  child.session->startConfigWithCompletionHandler(nullptr);
-  send(child, event(9, 1));
-  const auto atParent = aggregated(*parent.connection);
-  ASSERT_EQ(atParent.size(), 2u);  // the child's start message and its event
-  EXPECT_EQ(atParent[1].get("message"), hierarchyInfo(2, "call", 1));
-  EXPECT_EQ(atParent[1].get("category"), Value(9u));
-  EXPECT_TRUE(aggregated(*child.connection).empty());
-  // Ending aggregation where there is none sends nothing.
-  child.session->shutdownSessionAggregation();
-  EXPECT_TRUE(aggregated(*child.connection).empty());
 }
 
 // --- One-shot messages -------------------------------------------------------------------
