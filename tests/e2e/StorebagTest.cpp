@@ -88,44 +88,6 @@ TEST_F(StorebagStartTest, StorebagServerOutsideTheTrustedAuthoritiesLeavesTheSes
       << daemon->output();
 }
 
-// The operator's way out of the in-memory cache: SIGHUP drops the cached
-// storebags and the 900-second wait after a failure, so that a new server
-// URL or a replaced public key takes effect without a restart.
-TEST_F(StorebagStartTest, SighupDropsTheCachedStorebagsAndTheWaitAfterAFailure) {
-  RefusingPort refusing;
-  Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(refusing.url("/zerith")));
-  start(/*trustTestCA=*/true);
-  EXPECT_TRUE(startedBackends(31).isNil());
-  ASSERT_TRUE(daemon->waitFor("fetchAndCacheStorebag: Unable to fetch storebag for client type 7: "));
-
-  // A corrected URL alone waits out the 900 seconds.
-  Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value(server.url("/zerith")));
-  EXPECT_TRUE(startedBackends(31).isNil());
-  EXPECT_TRUE(daemon->waitForExact(
-      Level::Default,
-      "storebagForSession: Not fetching storebag for client type 7 - must wait 900 seconds between attempts"));
-  EXPECT_EQ(server.requestCount(), 0u);
-
-  daemon->signal(SIGHUP);
-  ASSERT_TRUE(daemon->waitForExact(Level::Default,
-                                   "main: Received SIGHUP, dropped 1 cached storebag(s) and their waits; "
-                                   "the next session fetches again"));
-  EXPECT_EQ(startedBackends(31), Value(Array{Value("kovu")})) << daemon->output();
-  EXPECT_EQ(server.requestCount(), 1u);
-
-  // A replaced public key: the fresh in-memory copy still serves, until the
-  // operator drops it; then the copy on disk is checked with the new key.
-  const auto other = generateStorebagKeyPair(2048);
-  ASSERT_TRUE(other.has_value());
-  installPublicKey(other->publicKeyDER);
-  EXPECT_EQ(startedBackends(31), Value(Array{Value("kovu")}));
-  daemon->signal(SIGHUP);
-  ASSERT_TRUE(daemon->waitFor("main: Received SIGHUP, dropped 1 cached storebag(s)", 2));
-  EXPECT_TRUE(startedBackends(31).isNil());
-  EXPECT_TRUE(daemon->waitFor("fetchStorebagWithName: Signature can not be verified, "));
-  EXPECT_TRUE(daemon->running());
-}
-
 class StorebagTrustTest : public E2eTest {
  protected:
   void SetUp() override {
@@ -158,7 +120,7 @@ class StorebagTrustTest : public E2eTest {
   // A fresh first fetch: no in-memory entry, no disk copy.
   void forgetStorebags(std::size_t hangups) {
     daemon->signal(SIGHUP);
-    ASSERT_TRUE(daemon->waitFor("main: Received SIGHUP", hangups)) << daemon->output();
+    ASSERT_TRUE(daemon->waitFor("main: Received SIGHUP, dropped ", hangups)) << daemon->output();
     fs::remove(paths::storebagCacheDir() / "dravon");
   }
 
