@@ -1,7 +1,8 @@
 // The real daemon against raw sockets: the stop signal, and a runtime folder
 // it cannot use. The service manager's watchdog: pings while every pool,
-// queue and thread makes progress, none once one of them is wedged. A file size limit under the
-// daemon: a write past it fails with EFBIG, handled as any failed write.
+// queue and thread makes progress, none once one of them is wedged. A file
+// size limit under the daemon: a write past it fails with EFBIG, handled as
+// any failed write.
 
 #include <signal.h>
 #include <sys/resource.h>
