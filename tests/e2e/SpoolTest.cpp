@@ -4,13 +4,12 @@
 // from a file before every request and dropping records it took before.
 // With "spoolEnabled" every event sent while it failed arrives exactly once
 // by record ID after it recovers, also when the daemon was killed (SIGKILL)
-// and started again; limits drop the oldest batches first and say how many
-// records they dropped; bad spool files are moved aside. Without the key a
-// failed batch is gone. Under a flood `zerith status` says of every event
+// and started again; the age limit drops batches and says how many records
+// it dropped; bad spool files are moved aside. Without the key a failed
+// batch is gone. Under a flood `zerith status` says of every event
 // whether it was delivered, is still in the spool or was dropped and why.
 
 #include <fcntl.h>
-#include <fmt/format.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -214,34 +213,6 @@ TEST_F(SpoolTest, EventsSentWhileTheCollectorClosesStallsAndFailsArriveOnceAfter
   client->finishSession(10s);
 }
 
-TEST_F(SpoolTest, BatchesKeptAfterTheirSessionEndedCountInTheEndedTotals) {
-  startAll(spoolOn(), {{"expedite", 0}, {"event_threshold", 100}}, /*status=*/true);
-  auto client = startSession(505);
-  ASSERT_TRUE(client);
-  behave("close");
-  sendBatch(*client, 1, 5);
-  ASSERT_TRUE(daemon->waitFor("Spool: kept batch", 1)) << daemon->output();
-  // The final report's batch fails too, and its answer comes when the
-  // session and its backend may be gone.
-  client->finishSession(10s);
-  client.reset();
-  ASSERT_TRUE(daemon->waitFor("Spool: kept batch", 2)) << daemon->output();
-  behave("answer");
-  ASSERT_TRUE(daemon->waitFor("Spool: empty")) << daemon->output();
-
-  const Json status = statusJson();
-  ASSERT_EQ(status["ended"].size(), 1u) << status;
-  const auto& counts = status["ended"][0]["counts"];
-  // Every batch is written ahead: the start record went through at once,
-  // the five events and the final report failed, were posted again and
-  // delivered.
-  EXPECT_GE(counts.value("spooled", 0), 7) << counts;
-  EXPECT_EQ(counts.value("delivered", 0), counts.value("spooled", 0)) << counts;
-  EXPECT_EQ(counts.value("retried", 0), counts.value("spooled", 0) - 1) << counts;
-  EXPECT_EQ(counts.value("inSpool", 0), 0) << counts;
-  EXPECT_EQ(counts.value("droppedTransportError", 0), 0) << counts;
-}
-
 TEST_F(SpoolTest, SpooledBatchesSurviveAKillAndBadFilesAreMovedAside) {
   startAll(spoolOn());
   auto client = startSession(502);
@@ -314,30 +285,6 @@ TEST_F(SpoolTest, SpooledBatchesSurviveAKillAndBadFilesAreMovedAside) {
   EXPECT_TRUE(daemon->running());
 }
 
-TEST_F(SpoolTest, TheSizeLimitDropsTheOldestBatchesAndCountsThem) {
-  startAll(spoolOn({{"spoolMaxBytes", Value(4096)}}));
-  auto client = startSession(503);
-  ASSERT_TRUE(client);
-  behave("close");
-  for (int batch = 0; batch < 8; ++batch) {
-    sendBatch(*client, batch * 5 + 1, 5);
-    ASSERT_TRUE(daemon->waitFor("Spool: kept batch", static_cast<std::size_t>(batch) + 1)) << daemon->output();
-  }
-  const std::size_t droppedBatches = daemon->count("Spool: dropped the oldest batch");
-  ASSERT_GE(droppedBatches, 1u) << daemon->output();
-  EXPECT_TRUE(daemon->waitFor(fmt::format("; {} records dropped so far", droppedBatches * 5))) << daemon->output();
-
-  behave("answer");
-  ASSERT_TRUE(daemon->waitFor("Spool: empty", 1, 20s)) << daemon->output();
-  const int firstKept = static_cast<int>(droppedBatches) * 5 + 1;
-  const auto ids = taken(firstKept, 40);
-  for (int n = 1; n <= 40; ++n) {
-    // The oldest batches went first; every later one arrived once.
-    EXPECT_EQ(ids.count(n), n >= firstKept ? 1u : 0u) << "event " << n;
-  }
-  client->finishSession(10s);
-}
-
 TEST_F(SpoolTest, TheAgeLimitDropsBatchesBeforeTheirRetry) {
   startAll(spoolOn(
       {{"spoolMaxAgeSeconds", Value(1)}, {"spoolRetryInitialSeconds", Value(3)}, {"spoolRetryMaxSeconds", Value(3)}}));
@@ -350,26 +297,6 @@ TEST_F(SpoolTest, TheAgeLimitDropsBatchesBeforeTheirRetry) {
   ASSERT_TRUE(daemon->waitFor("older than 1 seconds; 5 records dropped so far")) << daemon->output();
   EXPECT_EQ(daemon->count("Spool: delivered batch"), 0u);
   EXPECT_TRUE(taken(1, 5, 2s).empty());
-  client->finishSession(10s);
-}
-
-TEST_F(SpoolTest, WithoutTheKeyAFailedBatchIsGoneAndRecordsCarryNoID) {
-  startAll(Dictionary{});
-  auto client = startSession(505);
-  ASSERT_TRUE(client);
-  behave("close");
-  sendBatch(*client, 1, 5);
-  ASSERT_TRUE(daemon->waitFor("HTTPSPostBackend(postJsonMessage): post error:")) << daemon->output();
-  behave("answer");
-  sendBatch(*client, 6, 1);
-  const auto ids = taken(6, 6);
-  ASSERT_EQ(ids.count(6), 1u) << daemon->output();
-  EXPECT_EQ(*ids.at(6).begin(), "none");
-  for (int n = 1; n <= 5; ++n) {
-    EXPECT_EQ(ids.count(n), 0u) << "event " << n;
-  }
-  EXPECT_EQ(daemon->count("Spool:"), 0u);
-  EXPECT_FALSE(fs::exists(spoolFolder()));
   client->finishSession(10s);
 }
 
