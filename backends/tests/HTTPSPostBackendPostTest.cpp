@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <atomic>
 #include <numeric>
+#include <set>
 #include <thread>
 
 #include "backends/tests/HTTPSPostBackendTestSupport.h"
@@ -532,6 +533,36 @@ TEST_F(HTTPSPostTest, BatchStillHeldWhenTheBackendGoesIsCountedAsDropped) {
   EXPECT_EQ(counters->get(BackendCount::batched), 2u);
   EXPECT_EQ(counters->get(BackendCount::droppedDisabled), 2u);
   EXPECT_EQ(counters->get(BackendCount::sent), 0u);
+}
+
+// Envelopes of `n` records whose text looks like JSON structure.
+std::vector<Dictionary> records(int n) {
+  std::vector<Dictionary> out;
+  for (int i = 0; i < n; ++i) {
+    out.push_back(Dictionary{{"n", i}, {"text", "{\"not\":[a record]}"}});
+  }
+  return out;
+}
+
+TEST_F(HTTPSPostTest, RecordsCarryADistinctIDOnlyWithTheKey) {
+  auto without = batching(server.url("/post"));
+  auto envelope = nlohmann::ordered_json::parse(*without->createMessageForPostAndLogging(records(3), nullptr));
+  for (const auto& record : envelope["events"]) {
+    EXPECT_FALSE(record.contains("_recordID")) << record;
+  }
+  Defaults("com.velmar.zerith").setObject("spoolEnabled", Value(true));
+  auto with = batching(server.url("/post"));
+  std::set<std::string> ids;
+  for (int round = 0; round < 2; ++round) {
+    envelope = nlohmann::ordered_json::parse(*with->createMessageForPostAndLogging(records(3), nullptr));
+    for (const auto& record : envelope["events"]) {
+      const std::string id = record.value("_recordID", std::string());
+      EXPECT_EQ(id.size(), 32u) << record;
+      EXPECT_EQ(id.find_first_not_of("0123456789abcdef"), std::string::npos) << id;
+      EXPECT_TRUE(ids.insert(id).second) << id;
+    }
+  }
+  EXPECT_EQ(ids.size(), 6u);
 }
 
 }  // namespace

@@ -221,6 +221,34 @@ TEST_F(SpoolStoreTest, BadFilesAreMovedAsideNeverRead) {
   EXPECT_TRUE(s.read(good));
 }
 
+TEST_F(SpoolStoreTest, SizeLimitDropsTheOldestFirst) {
+  const std::size_t fileSize = encodeSpoolFile(batchOf(1, 1000, now)).size();
+  SpoolStore s = store(3 * fileSize + 10);
+  std::vector<std::string> names;
+  std::vector<SpoolStore::Dropped> dropped;
+  for (std::uint32_t i = 1; i <= 5; ++i) {
+    now += 10;
+    auto outcome = s.write(batchOf(i, 1000, now));
+    ASSERT_TRUE(outcome.written) << i;
+    names.push_back(outcome.name);
+    dropped.insert(dropped.end(), outcome.dropped.begin(), outcome.dropped.end());
+  }
+  ASSERT_EQ(dropped.size(), 2u);
+  EXPECT_EQ(dropped[0].entry.name, names[0]);
+  EXPECT_EQ(dropped[0].entry.records, 1u);
+  EXPECT_EQ(dropped[1].entry.name, names[1]);
+  EXPECT_EQ(dropped[0].reason, SpoolStore::DropReason::size);
+  EXPECT_EQ(namesIn(folder()), (std::set<std::string>{names[2], names[3], names[4]}));
+  EXPECT_LE(s.totalBytes(), 3 * fileSize + 10);
+
+  // A batch larger than the whole spool is refused and drops nothing.
+  const auto huge = s.write(batchOf(9, 5000, now));
+  EXPECT_FALSE(huge.written);
+  EXPECT_EQ(huge.error, 0);
+  EXPECT_TRUE(huge.dropped.empty());
+  EXPECT_EQ(s.size(), 3u);
+}
+
 TEST_F(SpoolStoreTest, FullDiskLosesOnlyTheBatchAndLeavesNoHalfFile) {
   // RLIMIT_FSIZE makes every write past the limit fail with EFBIG, as a full
   // disk fails with ENOSPC: the same path through the store. Done in a

@@ -173,6 +173,15 @@ TEST_F(StorebagVerifyTest, BrokenContainersAreRefusedWithTheirReason) {
   }
 }
 
+TEST_F(StorebagVerifyTest, PublicKeyIsReadAfreshAtEveryVerification) {
+  const Data signedByFirst = signedContainer(sampleStorebag());
+  const Data signedBySecond = signedContainer(sampleStorebag(), test::otherStorebagKeys());
+  EXPECT_FALSE(verify(signedByFirst).isNil());
+  installPublicKey(test::otherStorebagKeys().publicKeyDER);
+  EXPECT_TRUE(verify(signedByFirst).isNil());
+  EXPECT_FALSE(verify(signedBySecond).isNil());
+}
+
 TEST_F(StorebagVerifyTest, PublicKeyInPkcs1FormIsAccepted) {
   const auto& der = storebagKeys().publicKeyDER;
   const unsigned char* p = der.data();

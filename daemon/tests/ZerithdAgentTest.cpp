@@ -184,6 +184,15 @@ TEST_F(ZerithdAgentTest, UnlistedSessionFindsNoParent) {
       logs.has(Level::Error, "parentSessionIDStringForSession: ERROR: No sessions found for hierarchyToken call"));
 }
 
+TEST_F(ZerithdAgentTest, ReRegisteringUnderANewTokenLeavesTheOldListEmptyButPresent) {
+  auto s = newSession(hierarchyInfo(1, "old", 0));
+  s.session->setSessionInfo(hierarchyInfo(1, "new", 0), Value(), Value(), false);
+  ASSERT_TRUE(agent->correlatedSessions("old").has_value());
+  EXPECT_TRUE(agent->correlatedSessions("old")->empty());
+  ASSERT_TRUE(agent->correlatedSessions("new").has_value());
+  EXPECT_EQ(agent->correlatedSessions("new")->front(), s.session);
+}
+
 TEST_F(ZerithdAgentTest, StandaloneSessionIsNotCorrelated) {
   auto s = newSession(sessionInfo(5));
   EXPECT_TRUE(logs.has(Level::Default,

@@ -77,6 +77,35 @@ int floodUntilHeldBack(RawPeer& peer, std::size_t pad, int maxCalls,
   return calls;
 }
 
+TEST_F(Flood, APeerThatDoesNotReadIsThrottledAndServedInFullOnceItReads) {
+  setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = 64u << 20,
+                  .allConnections = 1u << 30});
+  log::LogCapture capture;
+  RawPeer flooder;
+  constexpr std::size_t kPad = 2000;
+  constexpr int kMax = 50000;  // 100 MB of calls: far beyond what a throttled connection takes
+  const int written = floodUntilHeldBack(flooder, kPad, kMax);
+  ASSERT_LT(written, kMax) << "the connection never stopped taking calls";
+  ASSERT_TRUE(capture.waitFor(flooder.connection->description() + ": peer does not read its replies ("));
+  EXPECT_TRUE(flooder.connection->readingPaused());
+  // Held at the mark: at most one reply past it.
+  EXPECT_GE(flooder.connection->queuedBytes(), 256u << 10);
+  EXPECT_LT(flooder.connection->queuedBytes(), (256u << 10) + kPad + 200);
+  EXPECT_LT(flooder.object->calls().size(), static_cast<std::size_t>(written)) << "every call was taken in";
+  EXPECT_EQ(flooder.invalidated.count(), 0);
+
+  // Reading the replies lets the connection read on; every call is answered
+  // in order and nothing stays queued.
+  for (int i = 1; i <= written; ++i) {
+    ASSERT_EQ(flooder.nextReplyTo(), static_cast<std::uint64_t>(i)) << "of " << written;
+  }
+  EXPECT_EQ(flooder.object->calls().size(), static_cast<std::size_t>(written));
+  EXPECT_TRUE(capture.contains(flooder.connection->description() + ": peer caught up; reading resumed"));
+  EXPECT_FALSE(flooder.connection->readingPaused());
+  EXPECT_EQ(flooder.connection->queuedBytes(), 0u);
+  EXPECT_TRUE(capture.waitFor("memory given back"));
+}
+
 TEST_F(Flood, SeveralFloodersStayUnderTheLimitForAllTheSlowestIsClosedFirstAndOthersAreServed) {
   // Each flooder is held at about 256 KiB; the third one takes the total past
   // 640 KiB, which closes the one that has waited longest: not the one whose
