@@ -19,6 +19,7 @@
 #include <thread>
 #include <vector>
 
+#include "bench/BenchSocket.h"
 #include "bench/pipeline/ProcStats.h"
 #include "ipc/Frame.h"
 #include "platform/FileUtil.h"
@@ -116,13 +117,11 @@ bool readFrame(int fd, std::vector<std::uint8_t>& body) {
 }
 
 void BM_UnixSocketEcho(benchmark::State& state) {
-  int fds[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
-    state.SkipWithError("socketpair failed");
+  file::UniqueFd client;
+  file::UniqueFd server;
+  if (!bench::socketPair(state, client, server)) {
     return;
   }
-  file::UniqueFd client(fds[0]);
-  file::UniqueFd server(fds[1]);
   const Data request = requestFrame();
   const Data reply = replyFrame();
   std::thread echo([fd = server.get(), &reply] {

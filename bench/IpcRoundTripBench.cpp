@@ -19,6 +19,7 @@
 #include <thread>
 #include <vector>
 
+#include "bench/BenchSocket.h"
 #include "bench/pipeline/BenchEvent.h"
 #include "ipc/Frame.h"
 #include "ipc/SocketConnection.h"
@@ -119,13 +120,11 @@ bool readFrame(int fd, std::vector<std::uint8_t>& buffer) {
 }
 
 void BM_BareUnixEcho(benchmark::State& state) {
-  int fds[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
-    state.SkipWithError("socketpair failed");
+  file::UniqueFd near;
+  file::UniqueFd far;
+  if (!bench::socketPair(state, near, far)) {
     return;
   }
-  file::UniqueFd near(fds[0]);
-  file::UniqueFd far(fds[1]);
   std::thread echo([fd = far.get()] {
     std::vector<std::uint8_t> buffer;
     while (readFrame(fd, buffer) && writeAll(fd, buffer.data(), buffer.size())) {

@@ -41,6 +41,7 @@
 #include <thread>
 #include <vector>
 
+#include "bench/BenchSocket.h"
 #include "bench/pipeline/BenchEvent.h"
 #include "daemon/KeepAliveTransaction.h"
 #include "daemon/StorebagCache.h"
@@ -356,13 +357,11 @@ bool readFrame(int fd, std::vector<std::uint8_t>& body) {
 }
 
 void BM_UnixSocketEcho(benchmark::State& state) {
-  int fds[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
-    state.SkipWithError("socketpair failed");
+  file::UniqueFd client;
+  file::UniqueFd server;
+  if (!bench::socketPair(state, client, server)) {
     return;
   }
-  file::UniqueFd client(fds[0]);
-  file::UniqueFd server(fds[1]);
   const Data request =
       ipc::encodeCall("sendMessageWithDictionary:reply:", 1, Dictionary{{"message", benchEvent(1)}});
   const Data reply = ipc::encodeReply(1, Dictionary{});
@@ -507,13 +506,11 @@ void BM_ClientEventWithReply(benchmark::State& state) {
 BENCHMARK(BM_ClientEventWithReply)->MinTime(2.0);
 
 void BM_BareSendOfTheEventFrame(benchmark::State& state) {
-  int fds[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
-    state.SkipWithError("socketpair failed");
+  file::UniqueFd near;
+  file::UniqueFd far;
+  if (!bench::socketPair(state, near, far)) {
     return;
   }
-  file::UniqueFd near(fds[0]);
-  file::UniqueFd far(fds[1]);
   std::thread reader([fd = far.get()] {
     std::vector<std::uint8_t> buffer(64 << 10);
     while (::read(fd, buffer.data(), buffer.size()) > 0) {
