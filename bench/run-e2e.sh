@@ -11,21 +11,36 @@
 # spool on and the collector down for 1,000,000 events, then up (backlog
 # spooled and drained). Every run checks
 # that each event arrived exactly once and prints "NOT lossless" otherwise.
-# Last, the library floor: libplist, nlohmann, zlib and libcurl alone on one
-# event's share of the work (ipc_bench, https_bench).
-# Set QUICK=1 for shorter runs (a tenth of the events, 10 s idle).
+# Then the library floor: libplist, nlohmann, zlib and libcurl alone on one
+# event's share of the work (ipc_bench, https_bench); futex calls per event in
+# the daemon (bench/measure-wakeups.sh, strace); the fetchDisplayURL: round
+# trip beside a bare socket echo, on the machine as it is and again with two
+# busy processes beside it (e2e_bench). Last, a table of every ratio against
+# its target.
+# Set QUICK=1 for shorter runs (a tenth of the events, 10 s idle, no strace
+# pass).
 set -euo pipefail
 build="${1:-build/release}"
 bench="$build/bench/e2e_pipeline_bench"
-ninja -C "$build" e2e_pipeline_bench zerithd ipc_bench https_bench >/dev/null
+ninja -C "$build" e2e_pipeline_bench zerithd ipc_bench https_bench e2e_bench >/dev/null
+work="$(mktemp -d)"
+burners=()
+cleanup() {
+  for b in "${burners[@]}"; do kill "$b" 2>/dev/null || true; done
+  rm -rf "$work"
+}
+trap cleanup EXIT
 scale=1
 idle=60
 if [ "${QUICK:-0}" = 1 ]; then scale=10; idle=10; fi
 
+# Runs one load and keeps its output under a name for the summary.
+runs=0
 run() {
+  runs=$((runs + 1))
   echo
   echo "## $*"
-  "$bench" "$@"
+  "$bench" "$@" | tee "$work/run$runs"
 }
 
 echo "# e2e pipeline benchmark, $(date -u '+%Y-%m-%d %H:%M UTC'), load average: $(cut -d' ' -f1-3 /proc/loadavg)"
@@ -48,8 +63,102 @@ run --pipelines zerithd --clients 8 --events $((1000000 / scale)) --memory-sampl
 echo
 echo "## the library floor of one event"
 floor=(--benchmark_repetitions=3 --benchmark_report_aggregates_only=true)
-"$build/bench/ipc_bench" --benchmark_filter='OfAnEvent|EmptyReply' "${floor[@]}" 2>/dev/null | grep _median
+"$build/bench/ipc_bench" --benchmark_filter='OfAnEvent|EmptyReply' "${floor[@]}" 2>/dev/null | grep _median |
+  tee "$work/floor"
 "$build/bench/https_bench" --benchmark_filter='ReferenceNlohmannRecord|ReferenceZlib|ReferenceCurl' "${floor[@]}" 2>/dev/null |
   grep _median
+
+# Futex calls per event: strace on every thread of the daemon, unpaced and
+# at 1,000 events/s (the tracer slows what it traces; the full run only).
+if [ "$scale" = 1 ]; then
+  echo
+  echo "## futex calls per event in zerithd"
+  "$(dirname "$0")/measure-wakeups.sh" "$build" | tee "$work/futex"
+fi
+
+# The fetchDisplayURL: round trip beside the bare echo, as the machine is and
+# with two busy processes (one a core) beside it.
+# (Each side runs for two seconds, as the benchmark sets.)
+roundtrip() {
+  "$build/bench/e2e_bench" --benchmark_counters_tabular=true 2>/dev/null |
+    awk '/^BM_UnixSocketEcho|^BM_DaemonFetchDisplayURL/'
+}
+echo
+echo "## fetchDisplayURL: round trip, beside the bare echo"
+roundtrip | tee "$work/rt-quiet"
+for _ in 1 2; do
+  (while :; do :; done) &
+  burners+=($!)
+done
+echo "## the same with two busy processes beside it (load $(cut -d' ' -f1 /proc/loadavg))"
+roundtrip | tee "$work/rt-load"
+for b in "${burners[@]}"; do kill "$b" 2>/dev/null || true; done
+burners=()
+
 echo
 echo "load average after: $(cut -d' ' -f1-3 /proc/loadavg)"
+
+# ---------------------------------------------------------------------------
+# Summary: each figure's ratio in this run beside its target.
+
+# "<delivered> <cpu> <rss>" ratios of run N.
+ratios() {
+  sed -n 's/^ratio zerithd\/peer: delivered\/s \([0-9.]*\), CPU per event \([0-9.]*\), private RSS \([0-9.]*\)$/\1 \2 \3/p' \
+    "$work/run$1"
+}
+lossless() {
+  if grep -q "NOT lossless" "$work/run$1"; then echo "NOT lossless"; else echo "lossless"; fi
+}
+# The column of a benchmark's row in a tabular google-benchmark output:
+# field <column name> of the row whose name starts with <row>.
+counter() {
+  awk -v row="$2" -v col="$3" '
+    $1 == "Benchmark" { for (i = 1; i <= NF; i++) names[i] = $i }
+    index($1, row) == 1 { for (i = 1; i <= NF; i++) if (names[i] == col) print $(i + 2) }' "$1" | head -n 1 |
+    awk '{ v = $1; sub(/\/s$/, "", v); m = 1
+           if (v ~ /k$/) { m = 1e3 } else if (v ~ /M$/) { m = 1e6 }
+           sub(/[kM]$/, "", v); print v * m }'
+}
+median() { awk -v row="$2" 'index($1, row) == 1 { print $2 }' "$1" | head -n 1; }
+divide() { awk -v a="$1" -v b="$2" 'BEGIN { if (a == "" || b == "" || b + 0 == 0) print "-"; else printf "%.2f", a / b }'; }
+verdict() { # value, "ge"/"le", target
+  awk -v v="$1" -v op="$2" -v t="$3" 'BEGIN {
+    if (v == "-" || v == "") { print "?"; exit }
+    ok = (op == "ge") ? (v + 0 >= t + 0) : (v + 0 <= t + 0); print ok ? "yes" : "no" }'
+}
+row() { # figure, measured, op, target
+  printf '| %s | %s | %s %s | %s |\n' "$1" "$2" "$([ "$3" = ge ] && echo "≥" || echo "≤")" "$4" "$(verdict "$2" "$3" "$4")"
+}
+
+echo
+echo "## summary: zerithd beside its references, this run"
+echo
+echo "| figure | measured | target | met |"
+echo "|---|---|---|---|"
+for n in 2 5; do
+  read -r delivered cpu _ < <(ratios $n)
+  what="8 clients unpaced, $([ $n = 2 ] && echo "a reply each" || echo "one-way") ($(lossless $n))"
+  row "delivered events/s × the peer's, $what" "$delivered" ge 1.5
+  row "daemon CPU per event × the peer's, $what" "$cpu" le 0.5
+done
+for n in 3 4 6; do
+  read -r _ cpu _ < <(ratios $n)
+  what=$(sed -n '2s/^clients=\([0-9]*\) events=[0-9]* rate=\([0-9]*\) .* replies=\([a-z]*\) .*/\1 clients, \2 events\/s, replies: \3/p' "$work/run$n")
+  row "daemon CPU per event × the peer's, $what ($(lossless $n))" "$cpu" le 0.2
+done
+if [ -f "$work/futex" ]; then
+  awk -F'|' '$2 ~ /unpaced/ { gsub(/^ +| +$/, "", $2); gsub(/ /, "", $5); print $2 "|" $5 }' "$work/futex" |
+    while IFS='|' read -r what calls; do row "futex calls per event in the daemon, $what" "$calls" le 0.5; done
+fi
+for when in quiet load; do
+  f="$work/rt-$when"
+  rate=$(divide "$(counter "$f" BM_DaemonFetchDisplayURL round_trips)" "$(counter "$f" BM_UnixSocketEcho round_trips)")
+  p99=$(divide "$(counter "$f" BM_DaemonFetchDisplayURL p99_us)" "$(counter "$f" BM_UnixSocketEcho p99_us)")
+  label=$([ $when = quiet ] && echo "as the machine is" || echo "two busy processes beside it")
+  row "fetchDisplayURL: round trips/s × the bare echo's, $label" "$rate" ge 0.5
+  row "fetchDisplayURL: p99 × the bare echo's, $label" "$p99" le 2
+done
+row "frame decode of one event × libplist's parse of the same bytes" \
+  "$(divide "$(median "$work/floor" BM_FrameDecodeOfAnEvent_median)" "$(median "$work/floor" BM_ReferenceLibplistParseOfAnEvent_median)")" le 0.3
+read -r _ _ rss < <(ratios 7)
+row "private RSS at the end of $((1000000 / scale)) events × the peer's ($(lossless 7))" "$rss" le 1
