@@ -398,7 +398,8 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
   std::optional<std::string> pretty;
   std::vector<Dictionary> one;
   one.push_back(std::move(event));
-  const auto body = createMessageForPostAndLogging(std::move(one), &pretty);
+  std::uint32_t records = 0;
+  const auto body = createMessageForPostAndLogging(std::move(one), &pretty, &records);
   if (!body) {
     counters().add(BackendCount::droppedUnencodable);
     return std::nullopt;
@@ -408,7 +409,7 @@ std::optional<std::string> HTTPSPostBackend::sendMessage(const Value& message, c
     text = fmt::format("Flushed events:\n{}\nStandalone event:\n{}", orNull(flushed), orNull(pretty));
   }
   countPosted(1, flag);
-  postJSONMessage(*body, flag, method, respCode, nullptr);
+  postJSONMessage(*body, flag, method, respCode, nullptr, records);
   if (flushPreceded) {
     setImmutable();
   }
@@ -434,7 +435,8 @@ std::string HTTPSPostBackend::userAgent() const {
 }
 
 void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t flag, std::optional<std::uint16_t> method,
-                                       std::optional<std::uint16_t> responseCode, PostCompletion completion) {
+                                       std::optional<std::uint16_t> responseCode, PostCompletion completion,
+                                       std::optional<std::uint32_t> records) {
   const Fields f = fields();
   const bool realtime = (flag | 2) == 3;
   std::optional<std::string> url = realtime ? f.realtimePostURL : f.postURL;
@@ -515,7 +517,7 @@ void HTTPSPostBackend::postJSONMessage(const std::string& json, std::int32_t fla
   }
   auto post = std::make_shared<LivePost>();
   post->transport = std::move(transport);
-  post->records = countEnvelopeRecords(json);
+  post->records = records ? *records : countEnvelopeRecords(json);
   post->counters = sharedCounters();
   post->backend = weak_from_this();
   post->backendName = name();
@@ -579,7 +581,7 @@ std::optional<std::string> HTTPSPostBackend::flushMessagesWithCompletion(FlushCo
     return std::nullopt;
   }
   countPosted(outcome.events, 0);
-  postJSONMessage(*outcome.body, 0, std::nullopt, std::nullopt, std::move(completion));
+  postJSONMessage(*outcome.body, 0, std::nullopt, std::nullopt, std::move(completion), outcome.bodyRecords);
   if (outcome.pretty) {
     setImmutable();
   }
@@ -634,7 +636,8 @@ HTTPSPostBackend::FlushOutcome HTTPSPostBackend::takeBatchOnStateQueue() {
   batch_ = Batch{};
   counters().remove(BackendCount::inBatch, taken);
   outcome.events = kept.size();
-  outcome.body = kept.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(kept), &outcome.pretty);
+  outcome.body =
+      kept.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(kept), &outcome.pretty, &outcome.bodyRecords);
   if (!outcome.body) {
     counters().add(BackendCount::droppedUnencodable, outcome.events);
     outcome.events = 0;

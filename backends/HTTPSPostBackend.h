@@ -91,11 +91,16 @@ class HTTPSPostBackend : public ZerithBackend {
   std::optional<std::string> batchEvent(Dictionary event);
   // The compact envelope (entries JSON cannot carry left out and logged).
   // When `prettyJsonString` is given and printing is allowed, it receives
-  // the pretty-printed copy.
+  // the pretty-printed copy; `recordCount`, when given, the number of
+  // records the envelope holds.
   std::optional<std::string> createMessageForPostAndLogging(std::vector<Dictionary> events,
-                                                            std::optional<std::string>* prettyJsonString) const;
+                                                            std::optional<std::string>* prettyJsonString,
+                                                            std::uint32_t* recordCount = nullptr) const;
+  // `records`: how many records `json` holds, when the caller knows it (an
+  // envelope it made); otherwise they are counted in the text.
   void postJSONMessage(const std::string& json, std::int32_t flag, std::optional<std::uint16_t> method,
-                       std::optional<std::uint16_t> responseCode, PostCompletion completion);
+                       std::optional<std::uint16_t> responseCode, PostCompletion completion,
+                       std::optional<std::uint32_t> records = std::nullopt);
 
   // Storebag-driven pieces.
   bool matchClientNameAndServiceID(const Value& client, const std::optional<std::string>& clientName,
@@ -169,7 +174,8 @@ class HTTPSPostBackend : public ZerithBackend {
   // or why there is nothing to post.
   struct FlushOutcome {
     const char* error = nullptr;
-    std::size_t events = 0;  // records in the body
+    std::size_t events = 0;  // records taken from the batch
+    std::uint32_t bodyRecords = 0;  // records in the body
     std::optional<std::string> body;
     std::optional<std::string> pretty;
   };

@@ -159,7 +159,7 @@ std::optional<std::string> HTTPSPostBackend::batchEvent(Dictionary event) {
 }
 
 std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
-    std::vector<Dictionary> events, std::optional<std::string>* prettyJsonString) const {
+    std::vector<Dictionary> events, std::optional<std::string>* prettyJsonString, std::uint32_t* recordCount) const {
   timeval now{};
   gettimeofday(&now, nullptr);
   const Fields f = fields();
@@ -180,6 +180,11 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(
         v.description());
   });
 
+  if (recordCount) {
+    // The envelope carries every record when it has a client identifier,
+    // none without.
+    *recordCount = clientId ? static_cast<std::uint32_t>(events.size()) : 0;
+  }
   if (prettyJsonString) {
     const ZerithEnvironmentType environment =
         lastResolvedEnvironmentType() != kEnvironmentNone ? lastResolvedEnvironmentType() : userDefaultsEnvironment();
