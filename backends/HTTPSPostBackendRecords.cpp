@@ -77,8 +77,7 @@ Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& tim
     event.set("_build", Value(*build));
   }
   event.set("_internal", Value(isInternalBuild() ? 3u : 2u));
-  const std::string minor = selfVersionMinor() != 0 ? fmt::format(".{}", selfVersionMinor()) : std::string();
-  event.set("_reportVers", Value(fmt::format("{}.{}{}", selfVersionMajor(), selfVersionMiddle(), minor)));
+  event.set("_reportVers", reportVersion());
   event.set("_timezoneOffset", Value(static_cast<long long>(timeZoneOffsetSeconds())));
   return event;
 }

@@ -151,6 +151,15 @@ void ZerithBackend::setSelfVersion(std::string_view version) {
   selfVersionMajor_.store(static_cast<std::uint8_t>(intValueOf(pieces[0])));
   selfVersionMiddle_.store(pieces.size() >= 2 ? static_cast<std::uint8_t>(intValueOf(pieces[1])) : 0);
   selfVersionMinor_.store(pieces.size() >= 3 ? static_cast<std::uint8_t>(intValueOf(pieces[2])) : 0);
+  const std::string minor = selfVersionMinor() != 0 ? fmt::format(".{}", selfVersionMinor()) : std::string();
+  Value text(fmt::format("{}.{}{}", selfVersionMajor(), selfVersionMiddle(), minor));
+  std::lock_guard lock(propertyMutex_);
+  reportVersion_ = std::move(text);
+}
+
+Value ZerithBackend::reportVersion() const {
+  std::lock_guard lock(propertyMutex_);
+  return reportVersion_;
 }
 
 std::int32_t ZerithBackend::state() const {

@@ -204,6 +204,9 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   std::uint8_t selfVersionMajor() const { return selfVersionMajor_.load(); }
   std::uint8_t selfVersionMiddle() const { return selfVersionMiddle_.load(); }
   std::uint8_t selfVersionMinor() const { return selfVersionMinor_.load(); }
+  // The framework version as records carry it ("8.1", "1.2.3"), made once
+  // when the version is set; records share the one value.
+  Value reportVersion() const;
   bool shouldUseWiFiOnly() const { return shouldUseWiFiOnly_.load(); }
   void setShouldUseWiFiOnly(bool v) { shouldUseWiFiOnly_.store(v); }
   // Arrays of numbers, or nil when absent.
@@ -233,6 +236,7 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   Value samplingThreshold_;
   Value eventWhitelist_;
   Value eventBlacklist_;
+  Value reportVersion_{std::string("0.0")};
   std::optional<Data> digestKey_;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
 
