@@ -1,4 +1,3 @@
-#include "platform/OpenSSLHandles.h"
 #include "tests/support/HttpsTestServer.h"
 
 #include <arpa/inet.h>
@@ -15,9 +14,6 @@
 #include <thread>
 
 #include <httplib.h>
-#include <openssl/bio.h>
-#include <openssl/pem.h>
-#include <openssl/x509.h>
 
 namespace zerith::test {
 
@@ -25,14 +21,6 @@ namespace {
 
 bool equalsIgnoringCase(std::string_view a, std::string_view b) {
   return a.size() == b.size() && ::strncasecmp(a.data(), b.data(), a.size()) == 0;
-}
-
-ossl::BioPtr memoryBio(const std::string& pem) {
-  ossl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
-  if (!bio) {
-    throw std::runtime_error("HttpsTestServer: BIO allocation failed");
-  }
-  return bio;
 }
 
 }  // namespace
@@ -52,8 +40,6 @@ std::size_t RecordedRequest::headerCount(std::string_view name) const {
 }
 
 struct HttpsTestServer::Impl {
-  ossl::X509Ptr certificate;
-  ossl::PkeyPtr key;
   std::unique_ptr<httplib::SSLServer> server;
   std::thread thread;
   int port = 0;
@@ -143,15 +129,7 @@ struct HttpsTestServer::Impl {
 HttpsTestServer::HttpsTestServer(const TestCA& ca) : HttpsTestServer(ca, Options{}) {}
 
 HttpsTestServer::HttpsTestServer(const TestCA& ca, Options options) : impl_(std::make_unique<Impl>()) {
-  const IssuedCertificate& issued = ca.serverCertificate();
-  auto certBio = memoryBio(issued.certificatePem);
-  impl_->certificate.reset(PEM_read_bio_X509(certBio.get(), nullptr, nullptr, nullptr));
-  auto keyBio = memoryBio(issued.privateKeyPem);
-  impl_->key.reset(PEM_read_bio_PrivateKey(keyBio.get(), nullptr, nullptr, nullptr));
-  if (!impl_->certificate || !impl_->key) {
-    throw std::runtime_error("HttpsTestServer: unreadable certificate or key");
-  }
-  impl_->server = std::make_unique<httplib::SSLServer>(impl_->certificate.get(), impl_->key.get());
+  impl_->server = std::make_unique<httplib::SSLServer>(ca.serverCertificateFile().c_str(), ca.serverKeyFile().c_str());
   if (!impl_->server->is_valid()) {
     throw std::runtime_error("HttpsTestServer: TLS context could not be set up");
   }

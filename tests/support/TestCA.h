@@ -1,9 +1,7 @@
 #pragma once
 
-// A certificate authority made at run time for tests: an EC P-256 key and a
-// self-signed CA certificate, and server certificates it issues (for
-// "localhost", 127.0.0.1 and ::1 unless told otherwise). Nothing is read from
-// or written to the system's trust store.
+// The tests' local certificate authority, whose server certificates are for
+// "localhost", 127.0.0.1 and ::1 unless told otherwise. Failures throw.
 //
 // `TestCA::shared()` is the one CA of a test process; its certificate and a
 // server certificate and key are also written as PEM files into a folder of
@@ -15,12 +13,11 @@
 #include <string>
 #include <vector>
 
+#include "platform/LocalCertificateAuthority.h"
+
 namespace zerith::test {
 
-struct IssuedCertificate {
-  std::string certificatePem;
-  std::string privateKeyPem;
-};
+using zerith::IssuedCertificate;
 
 class TestCA {
  public:

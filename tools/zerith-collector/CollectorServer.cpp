@@ -10,9 +10,7 @@
 #include <unistd.h>
 
 #include <openssl/err.h>
-#include <openssl/pem.h>
 #include <openssl/ssl.h>
-#include <openssl/x509v3.h>
 
 #include <algorithm>
 #include <cctype>
@@ -23,6 +21,8 @@
 #include <sstream>
 #include <thread>
 #include <vector>
+
+#include "platform/LocalCertificateAuthority.h"
 
 namespace zerith::collector {
 
@@ -652,85 +652,6 @@ void CollectorServer::handle(Connection& connection) {
 // ---------------------------------------------------------------------------
 // Certificates
 
-namespace {
-
-struct PkeyFree {
-  void operator()(EVP_PKEY* p) const { EVP_PKEY_free(p); }
-};
-struct X509Free {
-  void operator()(X509* p) const { X509_free(p); }
-};
-using Pkey = std::unique_ptr<EVP_PKEY, PkeyFree>;
-using Cert = std::unique_ptr<X509, X509Free>;
-
-Pkey newKey() { return Pkey(EVP_EC_gen("P-256")); }
-
-bool addExtension(X509* cert, X509* issuer, int nid, const char* value) {
-  X509V3_CTX ctx;
-  X509V3_set_ctx_nodb(&ctx);
-  X509V3_set_ctx(&ctx, issuer, cert, nullptr, nullptr, 0);
-  X509_EXTENSION* ext = X509V3_EXT_conf_nid(nullptr, &ctx, nid, value);
-  if (!ext) {
-    return false;
-  }
-  const bool ok = X509_add_ext(cert, ext, -1) == 1;
-  X509_EXTENSION_free(ext);
-  return ok;
-}
-
-Cert makeCertificate(EVP_PKEY* key, const char* commonName, X509* issuer, EVP_PKEY* issuerKey, bool ca, long serial) {
-  Cert cert(X509_new());
-  X509_set_version(cert.get(), 2);
-  ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), serial);
-  X509_gmtime_adj(X509_getm_notBefore(cert.get()), -3600);
-  X509_gmtime_adj(X509_getm_notAfter(cert.get()), 60L * 60 * 24 * 365);
-  X509_set_pubkey(cert.get(), key);
-  X509_NAME* name = X509_get_subject_name(cert.get());
-  X509_NAME_add_entry_by_txt(name, "CN", MBSTRING_ASC, reinterpret_cast<const unsigned char*>(commonName), -1, -1, 0);
-  X509* signer = issuer ? issuer : cert.get();
-  X509_set_issuer_name(cert.get(), X509_get_subject_name(signer));
-  bool ok = true;
-  if (ca) {
-    ok = addExtension(cert.get(), signer, NID_basic_constraints, "critical,CA:TRUE") &&
-         addExtension(cert.get(), signer, NID_key_usage, "critical,keyCertSign,cRLSign") &&
-         addExtension(cert.get(), signer, NID_subject_key_identifier, "hash");
-  } else {
-    ok = addExtension(cert.get(), signer, NID_basic_constraints, "critical,CA:FALSE") &&
-         addExtension(cert.get(), signer, NID_key_usage, "critical,digitalSignature") &&
-         addExtension(cert.get(), signer, NID_ext_key_usage, "serverAuth") &&
-         addExtension(cert.get(), signer, NID_subject_alt_name, "DNS:localhost,IP:127.0.0.1,IP:::1") &&
-         addExtension(cert.get(), signer, NID_authority_key_identifier, "keyid");
-  }
-  if (!ok || X509_sign(cert.get(), issuerKey, EVP_sha256()) == 0) {
-    return nullptr;
-  }
-  return cert;
-}
-
-bool writePem(const fs::path& path, const std::function<int(BIO*)>& write, bool secret) {
-  BIO* bio = BIO_new(BIO_s_mem());
-  const bool ok = write(bio) == 1;
-  char* data = nullptr;
-  const long size = BIO_get_mem_data(bio, &data);
-  std::string text(data, static_cast<std::size_t>(size));
-  BIO_free(bio);
-  if (!ok) {
-    return false;
-  }
-  const fs::path temporary = path.string() + ".new";
-  const int fd = ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, secret ? 0600 : 0644);
-  if (fd < 0) {
-    return false;
-  }
-  const bool written = ::write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
-  ::close(fd);
-  std::error_code ec;
-  fs::rename(temporary, path, ec);
-  return written && !ec;
-}
-
-}  // namespace
-
 bool generateCertificates(const fs::path& folder, std::string* error) {
   const auto fail = [&](std::string why) {
     if (error) {
@@ -746,20 +667,13 @@ bool generateCertificates(const fs::path& folder, std::string* error) {
   if (fs::exists(folder / "ca.pem") && fs::exists(folder / "cert.pem") && fs::exists(folder / "key.pem")) {
     return true;
   }
-  Pkey caKey = newKey();
-  Pkey serverKey = newKey();
-  if (!caKey || !serverKey) {
-    return fail("cannot make EC keys");
+  constexpr std::chrono::seconds kYear = std::chrono::hours(24 * 365);
+  const auto ca = LocalCertificateAuthority::create("zerith-collector local CA", kYear, error);
+  const auto server = ca ? ca->issueServerCertificate({"localhost"}, {"127.0.0.1", "::1"}, kYear, error) : std::nullopt;
+  if (!server) {
+    return false;
   }
-  long serial = static_cast<long>(std::time(nullptr));
-  Cert ca = makeCertificate(caKey.get(), "zerith-collector local CA", nullptr, caKey.get(), true, serial);
-  Cert server = ca ? makeCertificate(serverKey.get(), "localhost", ca.get(), caKey.get(), false, serial + 1) : nullptr;
-  if (!ca || !server) {
-    return fail("cannot make the certificates");
-  }
-  if (!writePem(folder / "key.pem", [&](BIO* b) { return PEM_write_bio_PrivateKey(b, serverKey.get(), nullptr, nullptr, 0, nullptr, nullptr); }, true) ||
-      !writePem(folder / "cert.pem", [&](BIO* b) { return PEM_write_bio_X509(b, server.get()); }, false) ||
-      !writePem(folder / "ca.pem", [&](BIO* b) { return PEM_write_bio_X509(b, ca.get()); }, false)) {
+  if (!ca->writeFiles(folder, *server)) {
     return fail("cannot write the certificate files into " + folder.string());
   }
   return true;
