@@ -81,7 +81,7 @@ fi
 # (Each side runs for two seconds, as the benchmark sets.)
 roundtrip() {
   "$build/bench/e2e_bench" --benchmark_counters_tabular=true 2>/dev/null |
-    awk '/^BM_UnixSocketEcho|^BM_DaemonFetchDisplayURL/'
+    awk '/^Benchmark|^BM_UnixSocketEcho|^BM_DaemonFetchDisplayURL/'
 }
 echo
 echo "## fetchDisplayURL: round trip, beside the bare echo"
@@ -90,8 +90,9 @@ for _ in 1 2; do
   (while :; do :; done) &
   burners+=($!)
 done
-echo "## the same with two busy processes beside it (load $(cut -d' ' -f1 /proc/loadavg))"
+echo "## the same with two busy processes beside it"
 roundtrip | tee "$work/rt-load"
+echo "(load average: $(cut -d' ' -f1-3 /proc/loadavg))"
 for b in "${burners[@]}"; do kill "$b" 2>/dev/null || true; done
 burners=()
 
@@ -143,7 +144,7 @@ for n in 2 5; do
 done
 for n in 3 4 6; do
   read -r _ cpu _ < <(ratios $n)
-  what=$(sed -n '2s/^clients=\([0-9]*\) events=[0-9]* rate=\([0-9]*\) .* replies=\([a-z]*\) .*/\1 clients, \2 events\/s, replies: \3/p' "$work/run$n")
+  what=$(sed -n 's/^clients=\([0-9]*\) events=[0-9]* rate=\([0-9]*\) .* replies=\([a-z]*\) .*/\1 clients, \2 events\/s, replies: \3/p' "$work/run$n")
   row "daemon CPU per event × the peer's, $what ($(lossless $n))" "$cpu" le 0.2
 done
 if [ -f "$work/futex" ]; then
