@@ -45,8 +45,9 @@ Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& tim
   event.set("_startTS", Value(static_cast<long long>(startTS)));
   event.set("_sender", Value(senderCode(static_cast<std::uint32_t>(compType()))));
   event.set("_clientVersion", Value(static_cast<unsigned>(clientVersion())));
-  if (auto combined = combinedSessionIDString()) {
-    event.set("_sessionID", Value(*combined));
+  RecordFacts facts = recordFacts();
+  if (!facts.combinedSessionID.isNil()) {
+    event.set("_sessionID", std::move(facts.combinedSessionID));
   }
   const std::int32_t type = compType();
   if (type == 7 || (isInternal() && (type == 11 || type == 13))) {
@@ -60,24 +61,24 @@ Dictionary HTTPSPostBackend::completeRecord(Dictionary event, const timeval& tim
   event.set("eventTime", Value(clientTS));
   // Absent product facts leave no entry rather than a null on the wire (an
   // entry of the payload by that name goes too).
-  if (auto family = productFamily()) {
-    event.set("_productFamily", Value(std::move(*family)));
+  if (!facts.productFamily.isNil()) {
+    event.set("_productFamily", std::move(facts.productFamily));
   } else {
     event.erase("_productFamily");
   }
-  if (auto model = hardwareType()) {
-    event.set("_productModel", Value(std::move(*model)));
+  if (!facts.hardwareType.isNil()) {
+    event.set("_productModel", std::move(facts.hardwareType));
   } else {
     event.erase("_productModel");
   }
-  if (auto version = productVersion()) {
-    event.set("_osVersion", Value(*version));
+  if (!facts.productVersion.isNil()) {
+    event.set("_osVersion", std::move(facts.productVersion));
   }
-  if (auto build = buildVersion()) {
-    event.set("_build", Value(*build));
+  if (!facts.buildVersion.isNil()) {
+    event.set("_build", std::move(facts.buildVersion));
   }
   event.set("_internal", Value(isInternalBuild() ? 3u : 2u));
-  event.set("_reportVers", reportVersion());
+  event.set("_reportVers", std::move(facts.reportVersion));
   event.set("_timezoneOffset", Value(static_cast<long long>(timeZoneOffsetSeconds())));
   return event;
 }

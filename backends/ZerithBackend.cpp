@@ -117,7 +117,7 @@ std::string ZerithBackend::convertIntoSHA256(std::string_view text) {
 ZerithBackend::ZerithBackend(std::string name, Value profile, std::optional<std::string> productFamily)
     : name_(std::move(name)),
       profile_(std::move(profile)),
-      productFamily_(std::move(productFamily)),
+      productFamily_(productFamily ? Value(std::move(*productFamily)) : Value()),
       samplingFactor_(crypto::randomUniform(9999) / 10000.0),
       stateQueue_(kBackendStateQueueLabel) {}
 
@@ -157,9 +157,10 @@ void ZerithBackend::setSelfVersion(std::string_view version) {
   reportVersion_ = std::move(text);
 }
 
-Value ZerithBackend::reportVersion() const {
+ZerithBackend::RecordFacts ZerithBackend::recordFacts() const {
   std::lock_guard lock(propertyMutex_);
-  return reportVersion_;
+  return RecordFacts{combinedSessionIDString_, productFamily_, hardwareType_,
+                     productVersion_,          buildVersion_,  reportVersion_};
 }
 
 std::int32_t ZerithBackend::state() const {
@@ -259,19 +260,32 @@ std::uint32_t ZerithBackend::batchedEventsSize() { return 0; }
     field = std::move(v);                                   \
   }
 
-ZERITH_LOCKED_PROPERTY(std::optional<std::string>, combinedSessionIDString, setCombinedSessionIDString,
-                       combinedSessionIDString_)
+// A text kept as a value, nil when absent.
+#define ZERITH_LOCKED_TEXT_PROPERTY(getter, setter, field)                                \
+  std::optional<std::string> ZerithBackend::getter() const {                            \
+    std::lock_guard lock(propertyMutex_);                                               \
+    const std::string* text = field.string();                                           \
+    return text ? std::optional<std::string>(*text) : std::nullopt;                     \
+  }                                                                                     \
+  void ZerithBackend::setter(std::optional<std::string> v) {                            \
+    Value text = v ? Value(std::move(*v)) : Value();                                    \
+    std::lock_guard lock(propertyMutex_);                                               \
+    field = std::move(text);                                                            \
+  }
+
+ZERITH_LOCKED_TEXT_PROPERTY(combinedSessionIDString, setCombinedSessionIDString, combinedSessionIDString_)
 ZERITH_LOCKED_PROPERTY(std::optional<std::string>, displayURL, setDisplayURL, displayURL_)
-ZERITH_LOCKED_PROPERTY(std::optional<std::string>, productVersion, setProductVersion, productVersion_)
-ZERITH_LOCKED_PROPERTY(std::optional<std::string>, buildVersion, setBuildVersion, buildVersion_)
-ZERITH_LOCKED_PROPERTY(std::optional<std::string>, hardwareType, setHardwareType, hardwareType_)
-ZERITH_LOCKED_PROPERTY(std::optional<std::string>, productFamily, setProductFamily, productFamily_)
+ZERITH_LOCKED_TEXT_PROPERTY(productVersion, setProductVersion, productVersion_)
+ZERITH_LOCKED_TEXT_PROPERTY(buildVersion, setBuildVersion, buildVersion_)
+ZERITH_LOCKED_TEXT_PROPERTY(hardwareType, setHardwareType, hardwareType_)
+ZERITH_LOCKED_TEXT_PROPERTY(productFamily, setProductFamily, productFamily_)
 ZERITH_LOCKED_PROPERTY(Value, userInfoDict, setUserInfoDict, userInfoDict_)
 ZERITH_LOCKED_PROPERTY(Value, samplingThreshold, setSamplingThreshold, samplingThreshold_)
 ZERITH_LOCKED_PROPERTY(Value, eventWhitelist, setEventWhitelist, eventWhitelist_)
 ZERITH_LOCKED_PROPERTY(Value, eventBlacklist, setEventBlacklist, eventBlacklist_)
 ZERITH_LOCKED_PROPERTY(std::optional<Data>, digestKey, setDigestKey, digestKey_)
 
+#undef ZERITH_LOCKED_TEXT_PROPERTY
 #undef ZERITH_LOCKED_PROPERTY
 
 std::optional<std::string> postableURL(std::string url, std::string* why) {

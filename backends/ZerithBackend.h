@@ -204,9 +204,20 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   std::uint8_t selfVersionMajor() const { return selfVersionMajor_.load(); }
   std::uint8_t selfVersionMiddle() const { return selfVersionMiddle_.load(); }
   std::uint8_t selfVersionMinor() const { return selfVersionMinor_.load(); }
-  // The framework version as records carry it ("8.1", "1.2.3"), made once
-  // when the version is set; records share the one value.
-  Value reportVersion() const;
+  // What every record of this backend carries from the backend's own
+  // properties, read under one lock; absent texts are nil. The values are
+  // shared with the backend (no copy per record). `reportVersion` is the
+  // framework version as records carry it ("8.1", "1.2.3"), made once when
+  // the version is set.
+  struct RecordFacts {
+    Value combinedSessionID;
+    Value productFamily;
+    Value hardwareType;
+    Value productVersion;
+    Value buildVersion;
+    Value reportVersion;
+  };
+  RecordFacts recordFacts() const;
   bool shouldUseWiFiOnly() const { return shouldUseWiFiOnly_.load(); }
   void setShouldUseWiFiOnly(bool v) { shouldUseWiFiOnly_.store(v); }
   // Arrays of numbers, or nil when absent.
@@ -226,11 +237,13 @@ class ZerithBackend : public std::enable_shared_from_this<ZerithBackend> {
   std::int32_t state_ = kBackendStateUndecided;  // only on stateQueue_
 
   mutable std::mutex propertyMutex_;  // the string, dictionary and list fields below
-  std::optional<std::string> productVersion_;
-  std::optional<std::string> buildVersion_;
-  std::optional<std::string> hardwareType_;
-  std::optional<std::string> productFamily_;
-  std::optional<std::string> combinedSessionIDString_;
+  // The texts records carry are kept as values (nil when absent), which
+  // records share.
+  Value productVersion_;
+  Value buildVersion_;
+  Value hardwareType_;
+  Value productFamily_;
+  Value combinedSessionIDString_;
   std::optional<std::string> displayURL_;
   Value userInfoDict_;
   Value samplingThreshold_;
