@@ -227,6 +227,20 @@ Value sessionInfo(std::uint32_t id, const std::optional<std::string>& token = {}
   return Value(std::move(d));
 }
 
+// A started session of one client against the served daemon, or nullptr
+// with the benchmark skipped and told why.
+std::unique_ptr<Zerith> startedClientOrSkip(benchmark::State& state, const Value& info) {
+  if (!daemonProcess().ready) {
+    state.SkipWithError("the daemon side did not start");
+    return nullptr;
+  }
+  auto client = startedClient(info);
+  if (!client) {
+    state.SkipWithError("the session did not start");
+  }
+  return client;
+}
+
 void runEvents(benchmark::State& state, std::vector<std::unique_ptr<Zerith>>& clients) {
   auto& daemon = daemonProcess();
   const std::uint64_t before = cpuTicks(daemon.pid);
@@ -296,13 +310,8 @@ BENCHMARK(BM_TenSessionsOneHierarchy)->UseRealTime()->MinTime(3.0);
 // no agent lock), so that the difference to the runs above is what the
 // dispatch of one event costs.
 void BM_SameDaemonFetchDisplayURL(benchmark::State& state) {
-  if (!daemonProcess().ready) {
-    state.SkipWithError("the daemon side did not start");
-    return;
-  }
-  auto client = startedClient(sessionInfo(2));
+  auto client = startedClientOrSkip(state, sessionInfo(2));
   if (!client) {
-    state.SkipWithError("the session did not start");
     return;
   }
   auto& daemon = daemonProcess();
@@ -436,13 +445,8 @@ struct ClientCounters {
 };
 
 void BM_ClientOneWayEvent(benchmark::State& state) {
-  if (!daemonProcess().ready) {
-    state.SkipWithError("the daemon side did not start");
-    return;
-  }
-  auto client = startedClient(sessionInfo(3));
+  auto client = startedClientOrSkip(state, sessionInfo(3));
   if (!client) {
-    state.SkipWithError("the session did not start");
     return;
   }
   const auto events = clientEvents();
@@ -462,13 +466,8 @@ void BM_ClientOneWayEvent(benchmark::State& state) {
 BENCHMARK(BM_ClientOneWayEvent)->MinTime(2.0);
 
 void BM_ClientEventWithReply(benchmark::State& state) {
-  if (!daemonProcess().ready) {
-    state.SkipWithError("the daemon side did not start");
-    return;
-  }
-  auto client = startedClient(sessionInfo(4));
+  auto client = startedClientOrSkip(state, sessionInfo(4));
   if (!client) {
-    state.SkipWithError("the session did not start");
     return;
   }
   struct Window {
