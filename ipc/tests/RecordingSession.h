@@ -76,64 +76,61 @@ class RecordingSession : public ClientSessionInterface {
   void setSessionInfo(const Value& sessionInfo, const Value& userInfo, const Value& frameworksToCheck,
                       bool hasAggregationBlock) override {
     record("setSessionInfo", {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"frameworksToCheck", frameworksToCheck},
-                              {"hasAggregationBlock", hasAggregationBlock}}, false);
+                              {"hasAggregationBlock", hasAggregationBlock}});
   }
   void startConfigWithCompletionHandler(ValueCompletion completion) override {
-    record("startConfig", {}, bool(completion));
-    complete([=, this] { completion(backends); }, bool(completion));
+    record("startConfig", {}, completion, [=, this] { completion(backends); });
   }
   void fetchStatesWithUserInfo(const Value& userInfo, ValueCompletion completion) override {
-    record("fetchStates", {{"userInfo", userInfo}}, bool(completion));
-    complete([=, this] { completion(backends); }, bool(completion));
+    record("fetchStates", {{"userInfo", userInfo}}, completion, [=, this] { completion(backends); });
   }
   void fetchDisplayURL(ValueCompletion completion) override {
-    record("fetchDisplayURL", {}, bool(completion));
-    complete([=, this] { completion(displayURL); }, bool(completion));
+    record("fetchDisplayURL", {}, completion, [=, this] { completion(displayURL); });
   }
   void sendMessageWithDictionary(const Value& message, ValueCompletion reply) override {
-    record("sendMessage", {{"message", message}}, bool(reply));
-    complete([=, this] { reply(sendResult); }, bool(reply));
+    record("sendMessage", {{"message", message}}, reply, [=, this] { reply(sendResult); });
   }
   void flushMessagesWithCompletion(ValueErrorCompletion completion) override {
-    record("flushMessages", {}, bool(completion));
-    complete([=, this] { completion(flushResult, flushError); }, bool(completion));
+    record("flushMessages", {}, completion, [=, this] { completion(flushResult, flushError); });
   }
-  void finishSessionGracefully() override { record("finishSession", {}, false); }
+  void finishSessionGracefully() override { record("finishSession", {}); }
   void uploadFileAtPath(const Value& fileURL, const Value& extensionToken, BoolCompletion completion) override {
-    record("uploadFile", {{"fileURL", fileURL}, {"extensionToken", extensionToken}}, bool(completion));
-    complete([=, this] { completion(uploadFileResult); }, bool(completion));
+    record("uploadFile", {{"fileURL", fileURL}, {"extensionToken", extensionToken}}, completion,
+           [=, this] { completion(uploadFileResult); });
   }
   void uploadFileWithDescriptor(const Value& fileURL, std::shared_ptr<const file::UniqueFd> descriptor,
                                 UploadCompletion completion) override {
-    record("uploadFile", {{"fileURL", fileURL}, {"descriptor", descriptor && *descriptor}}, bool(completion));
-    complete([=, this] { completion(uploadFileResult, false); }, bool(completion));
+    record("uploadFile", {{"fileURL", fileURL}, {"descriptor", descriptor && *descriptor}}, completion,
+           [=, this] { completion(uploadFileResult, false); });
   }
   void uploadLogData(const Value& logData, BoolErrorCompletion completion) override {
-    record("uploadLogData", {{"logData", logData}}, bool(completion));
-    complete([=, this] { completion(uploadLogResult, uploadLogError); }, bool(completion));
+    record("uploadLogData", {{"logData", logData}}, completion, [=, this] { completion(uploadLogResult, uploadLogError); });
   }
   void sendMessageWithSessionInfo(const Value& sessionInfo, const Value& userInfo, std::uint16_t category,
                                   std::uint16_t type, const Value& payload, ValueCompletion reply) override {
     record("sendMessageWithSessionInfo",
            {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"category", unsigned{category}}, {"type", unsigned{type}},
             {"payload", payload}},
-           bool(reply));
-    complete([=, this] { reply(oneShotResult); }, bool(reply));
+           reply, [=, this] { reply(oneShotResult); });
   }
   void updateSharedDataWithDictionary(const Value& dictionary) override {
-    record("updateSharedData", {{"dictionary", dictionary}}, false);
+    record("updateSharedData", {{"dictionary", dictionary}});
   }
   void updateSharedDataForKey(const Value& key, const Value& value) override {
-    record("updateSharedDataForKey", {{"key", key}, {"value", value}}, false);
+    record("updateSharedDataForKey", {{"key", key}, {"value", value}});
   }
   void setDigestKey(const Value& digestKey, std::int32_t algorithm) override {
-    record("setDigestKey", {{"digestKey", digestKey}, {"algorithm", algorithm}}, false);
+    record("setDigestKey", {{"digestKey", digestKey}, {"algorithm", algorithm}});
   }
 
  private:
-  void record(const char* op, Dictionary args, bool hasCompletion) { log.add({op, std::move(args), hasCompletion}); }
-  void complete(std::function<void()> run, bool present) {
-    if (!present) {
+  void record(const char* op, Dictionary args) { log.add({op, std::move(args), false}); }
+  // Logs the call, then answers it through `run` (or holds `run`) when the
+  // caller passed a completion.
+  template <typename Completion>
+  void record(const char* op, Dictionary args, const Completion& completion, std::function<void()> run) {
+    log.add({op, std::move(args), bool(completion)});
+    if (!completion) {
       return;
     }
     if (answer) {
