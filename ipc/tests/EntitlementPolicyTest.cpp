@@ -36,20 +36,18 @@ struct EntitlementPolicyTest : ::testing::Test {
   }
 };
 
-TEST_F(EntitlementPolicyTest, ListedUserByIdOrNameIsGrantedOthersAreNot) {
+TEST_F(EntitlementPolicyTest, ListedUserByIdOrNameAndPrimaryOrSupplementaryGroupAreGrantedOthersAreNot) {
   write("by-id.plist", xmlPolicy("<integer>41001</integer>", "", kAdmit));
   write("by-name.plist", xmlPolicy("<string>root</string>", "", "<key>by-name</key><true/>"));
-  EXPECT_EQ(policy.entitlementsFor(peer(kUser, 1)).get(kZerithdEntitlement), Value(true));
+  write("group.plist", xmlPolicy("", "<integer>42002</integer><string>root</string>", "<key>by-group</key><true/>"));
+  EXPECT_EQ(policy.entitlementsFor(peer(kUser, 1)), (Dictionary{{kZerithdEntitlement, true}}));
   EXPECT_EQ(policy.entitlementsFor(peer(0, 1)), (Dictionary{{"by-name", true}}));
   EXPECT_TRUE(policy.entitlementsFor(peer(kUser + 1, 1)).empty());
-}
-
-TEST_F(EntitlementPolicyTest, PrimaryOrSupplementaryGroupIsGranted) {
-  write("group.plist", xmlPolicy("", "<integer>42002</integer><string>root</string>", kAdmit));
-  EXPECT_EQ(policy.entitlementsFor(peer(kUser, kExtraGroup)).get(kZerithdEntitlement), Value(true));
-  EXPECT_EQ(policy.entitlementsFor(peer(kUser, kGroup, {7, kExtraGroup})).get(kZerithdEntitlement), Value(true));
-  EXPECT_EQ(policy.entitlementsFor(peer(kUser, kGroup, {0})).get(kZerithdEntitlement), Value(true));
-  EXPECT_TRUE(policy.entitlementsFor(peer(kUser, kGroup, {7, 8})).empty());
+  const Dictionary byGroup{{"by-group", true}};
+  EXPECT_EQ(policy.entitlementsFor(peer(kUser + 1, kExtraGroup)), byGroup);
+  EXPECT_EQ(policy.entitlementsFor(peer(kUser + 1, kGroup, {7, kExtraGroup})), byGroup);
+  EXPECT_EQ(policy.entitlementsFor(peer(kUser + 1, kGroup, {0})), byGroup);
+  EXPECT_TRUE(policy.entitlementsFor(peer(kUser + 1, kGroup, {7, 8})).empty());
 }
 
 TEST_F(EntitlementPolicyTest, ValuesArePassedAsWrittenSoFalseAndNonBooleansReachTheDecision) {
@@ -93,14 +91,14 @@ TEST_F(EntitlementPolicyTest, BrokenFilesAreLoggedAndGrantNothingWhileGoodOnesSt
 
   EXPECT_EQ(policy.entitlementsFor(peer(41001, 1)), (Dictionary{{"good", true}}));
   EXPECT_TRUE(capture.contains("EntitlementPolicy: " + dir + "/1-corrupt.plist: not a property list: "));
-  EXPECT_TRUE(capture.has(log::Level::Error, "EntitlementPolicy: " + dir + "/2-not-dict.plist: not a dictionary; the file grants nothing"));
-  EXPECT_TRUE(capture.has(log::Level::Error, "EntitlementPolicy: " + dir +
-                                                 "/3-unknown-user.plist: unknown user \"no-such-zerith-user\"; the file grants nothing"));
-  EXPECT_TRUE(capture.has(log::Level::Error, "EntitlementPolicy: " + dir +
-                                                 "/4-bad-entry.plist: a user entry is neither a name nor an id: 41001; the file grants nothing"));
-  EXPECT_TRUE(capture.has(log::Level::Error, "EntitlementPolicy: " + dir +
-                                                 "/5-no-entitlements.plist: \"entitlements\" is missing or not a dictionary; the file grants nothing"));
-  EXPECT_TRUE(capture.contains("/7-unknown-group.plist: unknown group \"no-such-zerith-group\"; the file grants nothing"));
+  const auto refused = [&](const std::string& file, const std::string& why) {
+    return capture.has(log::Level::Error, "EntitlementPolicy: " + dir + "/" + file + ": " + why + "; the file grants nothing");
+  };
+  EXPECT_TRUE(refused("2-not-dict.plist", "not a dictionary"));
+  EXPECT_TRUE(refused("3-unknown-user.plist", "unknown user \"no-such-zerith-user\""));
+  EXPECT_TRUE(refused("4-bad-entry.plist", "a user entry is neither a name nor an id: 41001"));
+  EXPECT_TRUE(refused("5-no-entitlements.plist", "\"entitlements\" is missing or not a dictionary"));
+  EXPECT_TRUE(refused("7-unknown-group.plist", "unknown group \"no-such-zerith-group\""));
 }
 
 TEST_F(EntitlementPolicyTest, MissingFolderGrantsNothingAndAnUnreadableOneIsLogged) {

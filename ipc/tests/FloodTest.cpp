@@ -36,11 +36,10 @@ class Flood : public ::testing::Test {
 };
 
 // Writes calls into the peer's socket without reading, until the connection
-// has stopped reading and the socket stays full for `quiet`. Returns the
+// has stopped reading and the socket stays full for 300 ms. Returns the
 // number of calls written, or stops at `maxCalls` (the connection never
 // pushed back).
-int floodUntilHeldBack(RawPeer& peer, std::size_t pad, int maxCalls,
-                       std::chrono::milliseconds quiet = std::chrono::milliseconds(300)) {
+int floodUntilHeldBack(RawPeer& peer, std::size_t pad, int maxCalls) {
   const int fd = peer.raw.fd();
   ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) | O_NONBLOCK);
   int calls = 0;
@@ -69,7 +68,7 @@ int floodUntilHeldBack(RawPeer& peer, std::size_t pad, int maxCalls,
       break;
     }
     pollfd p{fd, POLLOUT, 0};
-    if (::poll(&p, 1, static_cast<int>(quiet.count())) == 0 && peer.connection->readingPaused()) {
+    if (::poll(&p, 1, 300) == 0 && peer.connection->readingPaused()) {
       break;  // held back (a slow machine alone may leave the socket full for a while)
     }
   }
