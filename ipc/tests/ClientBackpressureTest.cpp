@@ -27,37 +27,6 @@ constexpr std::size_t kPad = 4000;
 
 Data eventArgsPad() { return Data(kPad, 0x65); }
 
-// A listening socket in a root of its own, the client end connected to it
-// with SocketConnection::connect, and the accepted daemon end as a raw
-// socket the test reads (or leaves unread) itself.
-struct ClientEnd {
-  zerith::test::TempRoot root;
-  file::UniqueFd listening = boundSocket((root / "/client.sock").string(), 1);
-  std::optional<RawFrameSocket> raw;
-  std::shared_ptr<SocketConnection> connection;
-  Counter invalidated;
-
-  ClientEnd() {
-    Error error;
-    connection = SocketConnection::connect((root / "/client.sock").string(), &error);
-    EXPECT_TRUE(connection) << error.description;
-    raw.emplace(file::UniqueFd(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC)), 64u << 20);
-    EXPECT_TRUE(raw->fd() >= 0);
-    if (connection) {
-      connection->setInvalidationHandler([this] { invalidated.hit(); });
-      connection->resume();
-    }
-  }
-  ~ClientEnd() {
-    if (connection) {
-      connection->invalidate();
-      invalidated.waitFor(1);
-    }
-  }
-
-  std::optional<IncomingMessage> readMessage() { return readIncoming(*raw); }
-};
-
 // Far more one-way events than the kernel's socket buffers and the outbox's
 // mark take.
 constexpr int kHeldBackEvents = 1500;
@@ -85,30 +54,49 @@ struct EventWriter {
   }
 };
 
-// The limits of these tests, for as long as the client end lives.
-struct SmallMarks {
-  SmallMarks() {
-    setQueueLimits({.pauseReadingAt = kPause, .resumeReadingAt = kResume, .perConnection = 1u << 20,
-                    .allConnections = 1u << 30});
-  }
-  ~SmallMarks() { setQueueLimits(QueueLimits{}); }
-};
-
-// A client end whose writer sends kHeldBackEvents one-way events to a daemon
-// end that reads nothing.
+// Small marks for the test's lifetime; a listening socket in a root of its
+// own, the client end connected to it with SocketConnection::connect, and
+// the accepted daemon end as a raw socket the test reads (or leaves unread)
+// itself.
 class ClientBackpressure : public ::testing::Test {
  protected:
-  // True once the writer, started here, waits at the outbox mark.
-  bool writerHeldBack() {
-    if (end.connection) {
-      writer = std::make_unique<EventWriter>(*end.connection);
+  ClientBackpressure() {
+    setQueueLimits({.pauseReadingAt = kPause, .resumeReadingAt = kResume, .perConnection = 1u << 20,
+                    .allConnections = 1u << 30});
+    Error error;
+    connection = SocketConnection::connect((root / "/client.sock").string(), &error);
+    EXPECT_TRUE(connection) << error.description;
+    raw.emplace(file::UniqueFd(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC)), 64u << 20);
+    EXPECT_TRUE(raw->fd() >= 0);
+    if (connection) {
+      connection->setInvalidationHandler([this] { invalidated.hit(); });
+      connection->resume();
     }
-    return writer && capture.waitFor(end.connection->description() + ": peer does not read (");
+  }
+  // The end of the connection also releases a writer that still waits.
+  ~ClientBackpressure() override {
+    if (connection) {
+      connection->invalidate();
+      invalidated.waitFor(1);
+    }
+    writer.reset();
+    setQueueLimits(QueueLimits{});
   }
 
-  SmallMarks marks;
+  // True once the writer, started here, waits at the outbox mark.
+  bool writerHeldBack() {
+    if (connection) {
+      writer = std::make_unique<EventWriter>(*connection);
+    }
+    return writer && capture.waitFor(connection->description() + ": peer does not read (");
+  }
+
   log::LogCapture capture;
-  ClientEnd end;
+  zerith::test::TempRoot root;
+  file::UniqueFd listening = boundSocket((root / "/client.sock").string(), 1);
+  std::optional<RawFrameSocket> raw;
+  std::shared_ptr<SocketConnection> connection;
+  Counter invalidated;
   std::unique_ptr<EventWriter> writer;
 };
 
@@ -116,11 +104,11 @@ TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAnd
   ASSERT_TRUE(writerHeldBack());
   EXPECT_LT(writer->sent.load(), kHeldBackEvents) << "the writer was not held back";
   const std::size_t frame = encodeCall("event", std::nullopt, Dictionary{{"n", 0}, {"pad", Value(eventArgsPad())}}).size();
-  EXPECT_GT(end.connection->queuedBytes(), kPause);
-  EXPECT_LE(end.connection->queuedBytes(), kPause + frame + 16);
+  EXPECT_GT(connection->queuedBytes(), kPause);
+  EXPECT_LE(connection->queuedBytes(), kPause + frame + 16);
 
   for (int n = 0; n < kHeldBackEvents; ++n) {
-    const auto event = end.readMessage();
+    const auto event = readIncoming(*raw);
     ASSERT_TRUE(event) << "event " << n << " of " << kHeldBackEvents << " missing";
     ASSERT_EQ(event->kind, IncomingMessage::Kind::Call);
     EXPECT_FALSE(event->call.call) << "a one-way event carries no call number";
@@ -129,8 +117,8 @@ TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAnd
   writer->thread.join();
   EXPECT_EQ(writer->sent.load(), kHeldBackEvents);
   EXPECT_LE(writer->mostQueued.load(), kPause + frame + 16) << "the outbox grew past its mark";
-  EXPECT_EQ(end.connection->queuedBytes(), 0u);
-  EXPECT_FALSE(end.connection->isInvalidated());
+  EXPECT_EQ(connection->queuedBytes(), 0u);
+  EXPECT_FALSE(connection->isInvalidated());
   EXPECT_FALSE(capture.contains("closing connection"));
 }
 
@@ -138,20 +126,20 @@ TEST_F(ClientBackpressure, AClientEndOverTheMarkStillReadsItsReplies) {
   // A daemon that waits for its replies to be read before it reads on, and a
   // client that would read them only once its own outbox drained, would wait
   // for each other for ever.
-  ASSERT_TRUE(end.connection);
+  ASSERT_TRUE(connection);
   Counter answered;
   for (int n = 0; n < 3; ++n) {
-    end.connection->call("ask", Dictionary{{"n", n}}, [&](std::optional<Dictionary> args, std::optional<Error>) {
+    connection->call("ask", Dictionary{{"n", n}}, [&](std::optional<Dictionary> args, std::optional<Error>) {
       EXPECT_TRUE(args);
       answered.hit();
     });
   }
   ASSERT_TRUE(writerHeldBack());
-  ASSERT_TRUE(end.raw->write(framesOf(3, [](int n) { return encodeReply(static_cast<std::uint64_t>(n + 1), Dictionary{}); })));
+  ASSERT_TRUE(raw->write(framesOf(3, [](int n) { return encodeReply(static_cast<std::uint64_t>(n + 1), Dictionary{}); })));
   EXPECT_TRUE(answered.waitFor(3)) << "the client stopped reading because its own outbox was full";
-  EXPECT_FALSE(end.connection->readingPaused());
-  end.connection->invalidate();
-  ASSERT_TRUE(end.invalidated.waitFor(1));
+  EXPECT_FALSE(connection->readingPaused());
+  connection->invalidate();
+  ASSERT_TRUE(invalidated.waitFor(1));
 }
 
 // How a waiting writer is released: the client ends the connection, or the
@@ -164,23 +152,23 @@ TEST_P(ClientBackpressureRelease, QueueBlocksNeverWaitAndTheEndOfTheConnectionRe
   // Over the mark, nothing read: a block of the connection's own queue still
   // gets its frame queued (past the mark) and goes on.
   Counter fromQueue;
-  end.connection->queue().async([&] {
-    end.connection->send("fromQueue", Dictionary{});
+  connection->queue().async([&] {
+    connection->send("fromQueue", Dictionary{});
     fromQueue.hit();
   });
   EXPECT_TRUE(fromQueue.waitFor(1)) << "a block of the connection's queue waited for the outbox";
-  EXPECT_GT(end.connection->queuedBytes(), kPause);
+  EXPECT_GT(connection->queuedBytes(), kPause);
   if (GetParam()) {
-    end.connection->invalidate();
+    connection->invalidate();
   } else {
-    end.raw->close();  // the daemon goes away
+    raw->close();  // the daemon goes away
   }
   // Every send after the end returns at once; the writer gets through the rest.
   auto done = std::async(std::launch::async, [&] { writer->thread.join(); });
   ASSERT_EQ(done.wait_for(kWait), std::future_status::ready) << "the writer still waits after the connection ended";
   EXPECT_EQ(writer->sent.load(), kHeldBackEvents);
-  EXPECT_TRUE(end.invalidated.waitFor(1));
-  EXPECT_EQ(end.connection->queuedBytes(), 0u);
+  EXPECT_TRUE(invalidated.waitFor(1));
+  EXPECT_EQ(connection->queuedBytes(), 0u);
 }
 
 INSTANTIATE_TEST_SUITE_P(ByClientOrDaemon, ClientBackpressureRelease, ::testing::Bool(),
