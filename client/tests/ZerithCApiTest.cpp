@@ -29,6 +29,12 @@ struct SessionDeleter {
 };
 using SessionPtr = std::unique_ptr<zerith_session, SessionDeleter>;
 
+// A call the library refused with `why` as its last error.
+void expectRefused(int rc, const std::string& why) {
+  EXPECT_EQ(rc, -1);
+  EXPECT_STREQ(zerith_last_error(), why.c_str());
+}
+
 struct CApiFixture : DaemonFixture {
   SessionPtr open(zerith_format format = ZERITH_FORMAT_JSON) {
     SessionPtr s(zerith_create(format));
@@ -37,8 +43,17 @@ struct CApiFixture : DaemonFixture {
   }
 };
 
-TEST_F(CApiFixture, EveryOperationTakesJsonAndAnswersThroughItsCallback) {
+TEST_F(CApiFixture, EveryOperationTakesJsonAndAnswersThroughItsCallbackAndMessagesArriveAsText) {
   auto s = open();
+  ipc::test::Answer<std::string> got;
+  zerith_set_message_callback(
+      s.get(),
+      [](void* context, const char* message, double timestamp, uint16_t category, uint16_t type, const char* payload) {
+        static_cast<ipc::test::Answer<std::string>*>(context)->set(std::string(message ? message : "NULL") + " " +
+                                                      std::to_string(timestamp) + " " + std::to_string(category) + " " +
+                                                      std::to_string(type) + " " + (payload ? payload : "NULL"));
+      },
+      &got);
   ASSERT_EQ(zerith_set_session_info(s.get(), R"({"sessionID": 1, "clientType": 7})", nullptr, R"(["A"])", 1), 0);
   Catcher started, sent, states, url, flush, upload, uploadLog, oneShot;
   ASSERT_EQ(zerith_start_config(s.get(), &Catcher::callback, &started), 0);
@@ -67,7 +82,10 @@ TEST_F(CApiFixture, EveryOperationTakesJsonAndAnswersThroughItsCallback) {
                                    R"("description":"no upload backend"}})");
   EXPECT_EQ(oneShot.get().reply, R"({"result":"one-shot"})");
 
-  auto session = daemon->waitForClient().session;
+  const auto client = daemon->waitForClient();
+  client.toClient->sendMessageToClient(Value(), 1.5, 7, 8, Value(Dictionary{{"x", 1}}));
+  EXPECT_EQ(got.get(), R"(NULL 1.500000 7 8 {"x":1})");
+  const auto& session = client.session;
   ASSERT_TRUE(session->log.waitFor(13));
   const auto calls = session->log.calls();
   EXPECT_EQ(Value(calls[0].args), Value(Dictionary{{"sessionInfo", Dictionary{{"sessionID", 1}, {"clientType", 7}}},
@@ -99,14 +117,10 @@ TEST_F(CApiFixture, XmlPropertyListsInAndOut) {
 
 TEST_F(CApiFixture, BadTextIsRefusedLocallyAndNothingIsSent) {
   auto s = open();
-  EXPECT_EQ(zerith_set_session_info(s.get(), "{not json", nullptr, nullptr, 0), -1);
-  EXPECT_STREQ(zerith_last_error(), "session info is not valid JSON");
-  EXPECT_EQ(zerith_send_message(s.get(), "[1, 2]", nullptr, nullptr), -1);
-  EXPECT_STREQ(zerith_last_error(), "message is not a dictionary");
-  EXPECT_EQ(zerith_upload_log_data(s.get(), "{}", nullptr, nullptr), -1);
-  EXPECT_STREQ(zerith_last_error(), "log data is not an array");
-  EXPECT_EQ(zerith_upload_file(s.get(), nullptr, nullptr, nullptr, nullptr), -1);
-  EXPECT_STREQ(zerith_last_error(), "a file URL is required");
+  expectRefused(zerith_set_session_info(s.get(), "{not json", nullptr, nullptr, 0), "session info is not valid JSON");
+  expectRefused(zerith_send_message(s.get(), "[1, 2]", nullptr, nullptr), "message is not a dictionary");
+  expectRefused(zerith_upload_log_data(s.get(), "{}", nullptr, nullptr), "log data is not an array");
+  expectRefused(zerith_upload_file(s.get(), nullptr, nullptr, nullptr, nullptr), "a file URL is required");
   auto xml = open(ZERITH_FORMAT_PLIST_XML);
   EXPECT_EQ(zerith_update_shared_data(xml.get(), "<plist><dict><key>a</key>"), -1);
   EXPECT_EQ(std::string(zerith_last_error()).rfind("dictionary is not an XML property list: ", 0), 0u) << zerith_last_error();
@@ -134,29 +148,12 @@ TEST_F(CApiFixture, FailedCallReportsTheErrorAndInvalidationCallbackRuns) {
   EXPECT_EQ(invalidated.get_future().wait_for(ipc::test::kWait), std::future_status::ready);
 }
 
-TEST_F(CApiFixture, MessagesFromTheDaemonArriveAsText) {
-  auto s = open();
-  ipc::test::Answer<std::string> got;
-  zerith_set_message_callback(
-      s.get(),
-      [](void* context, const char* message, double timestamp, uint16_t category, uint16_t type, const char* payload) {
-        static_cast<ipc::test::Answer<std::string>*>(context)->set(std::string(message ? message : "NULL") + " " +
-                                                      std::to_string(timestamp) + " " + std::to_string(category) + " " +
-                                                      std::to_string(type) + " " + (payload ? payload : "NULL"));
-      },
-      &got);
-  ASSERT_EQ(zerith_finish_session(s.get()), 0);
-  daemon->waitForClient().toClient->sendMessageToClient(Value(), 1.5, 7, 8, Value(Dictionary{{"x", 1}}));
-  EXPECT_EQ(got.get(), R"(NULL 1.500000 7 8 {"x":1})");
-}
-
 TEST(CApi, UnconnectedOrUnreachableSessionsSayWhy) {
   TempRoot root;
   SessionPtr s(zerith_create(ZERITH_FORMAT_JSON));
-  EXPECT_EQ(zerith_fetch_display_url(s.get(), nullptr, nullptr), -1);
-  EXPECT_STREQ(zerith_last_error(), "the session is not connected");
-  EXPECT_EQ(zerith_connect(s.get(), "/nonexistent-zerith/sock"), -1);
-  EXPECT_STREQ(zerith_last_error(), "Cannot connect to /nonexistent-zerith/sock: No such file or directory");
+  expectRefused(zerith_fetch_display_url(s.get(), nullptr, nullptr), "the session is not connected");
+  expectRefused(zerith_connect(s.get(), "/nonexistent-zerith/sock"),
+                "Cannot connect to /nonexistent-zerith/sock: No such file or directory");
   EXPECT_EQ(zerith_finish_session(nullptr), -1);
   EXPECT_EQ(zerith_create(static_cast<zerith_format>(7)), nullptr);
 }
