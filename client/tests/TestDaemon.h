@@ -18,16 +18,10 @@
 #include "ipc/tests/IpcTestSupport.h"
 #include "ipc/tests/RecordingSession.h"
 #include "platform/Paths.h"
-#include "tests/support/TempRoot.h"
 
 namespace zerith::test {
 
-inline void grantEntitlement(const TempRoot& root, const std::string& value = "<true/>") {
-  root.write("/etc/zerithd/entitlements.d/test.plist",
-             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict><key>users</key><array><integer>" +
-                 std::to_string(::getuid()) + "</integer></array><key>entitlements</key><dict>"
-                 "<key>com.velmar.private.zerithd</key>" + value + "</dict></dict></plist>\n");
-}
+using ipc::test::grantEntitlement;
 
 class TestDaemon : public ipc::ListenerDelegate {
  public:

@@ -29,7 +29,7 @@ struct SessionLink {
   }
 };
 
-TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) {
+TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsNilsIncludedAndCompletionBothWays) {
   SessionLink link;
   const Value sessionInfo(Dictionary{{"sessionID", 3}, {"clientType", 7}});
   const Value userInfo(Dictionary{{"clientName", "mail"}});
@@ -55,6 +55,8 @@ TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) 
   link.proxy.updateSharedDataWithDictionary(Value(Dictionary{{"shared", 1}}));
   link.proxy.updateSharedDataForKey(Value("key"), Value(Array{Value(1)}));
   link.proxy.setDigestKey(Value(Data{1, 2, 3}), -7);
+  link.proxy.setSessionInfo(Value(), Value(), Value(), false);
+  link.proxy.fetchStatesWithUserInfo(Value(), nullptr);
 
   EXPECT_EQ(started.get(), link.session->backends);
   EXPECT_EQ(states.get(), link.session->backends);
@@ -66,7 +68,7 @@ TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) 
             std::make_pair(false, std::optional<Error>(Error{"com.velmar.zerith.ErrorDomain", -1, "no upload backend"})));
   EXPECT_EQ(oneShot.get(), Value("one-shot"));
 
-  ASSERT_TRUE(link.session->log.waitFor(13));
+  ASSERT_TRUE(link.session->log.waitFor(15));
   const auto calls = link.session->log.calls();
   const std::vector<std::pair<std::string, Dictionary>> expected = {
       {"setSessionInfo", {{"sessionInfo", sessionInfo}, {"userInfo", userInfo}, {"frameworksToCheck", frameworks},
@@ -84,12 +86,17 @@ TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) 
       {"updateSharedData", {{"dictionary", Dictionary{{"shared", 1}}}}},
       {"updateSharedDataForKey", {{"key", "key"}, {"value", Array{Value(1)}}}},
       {"setDigestKey", {{"digestKey", Data{1, 2, 3}}, {"algorithm", -7}}},
+      {"setSessionInfo", {{"sessionInfo", Value()}, {"userInfo", Value()}, {"frameworksToCheck", Value()},
+                          {"hasAggregationBlock", false}}},
+      {"fetchStates", {{"userInfo", Value()}}},
   };
   ASSERT_EQ(calls.size(), expected.size());
   for (std::size_t i = 0; i < expected.size(); ++i) {
     EXPECT_EQ(calls[i].operation, expected[i].first);
     EXPECT_EQ(Value(calls[i].args), Value(expected[i].second)) << expected[i].first << ": " << Value(calls[i].args).description();
   }
+  // No completion asked for: the session gets none and nothing is answered.
+  EXPECT_FALSE(calls.back().hasCompletion);
 
   link.toClient.sendMessageToClient(Value(Dictionary{{"m", 1}}), 1234.5, 3, 4, Value(Dictionary{{"x", "y"}}));
   ASSERT_TRUE(link.client->log.waitFor(1));
@@ -98,22 +105,10 @@ TEST(ClientSessionWire, EveryOperationCarriesItsArgumentsAndCompletionBothWays) 
                              {"payload", Dictionary{{"x", "y"}}}}));
 }
 
-TEST(ClientSessionWire, NilArgumentsArriveAsNilAndBooleanDefaultsToFalse) {
-  SessionLink link;
-  link.proxy.setSessionInfo(Value(), Value(), Value(), false);
-  link.proxy.fetchStatesWithUserInfo(Value(), nullptr);
-  ASSERT_TRUE(link.session->log.waitFor(2));
-  const auto calls = link.session->log.calls();
-  EXPECT_EQ(Value(calls[0].args), Value(Dictionary{{"sessionInfo", Value()}, {"userInfo", Value()},
-                                                   {"frameworksToCheck", Value()}, {"hasAggregationBlock", false}}));
-  // No completion asked for: the session gets none and nothing is answered.
-  EXPECT_FALSE(calls[1].hasCompletion);
-}
-
 TEST(ClientSessionWireRefusal, UnknownOperationIsLoggedAnsweredWithAnErrorAndTheConnectionGoesOn) {
   log::LogCapture capture;
   SessionLink link;
-  const auto result = callAndWait(*link.pair.a, "bogus:", Dictionary{});
+  const auto result = link.pair.a->callAndWait("bogus:", Dictionary{}, kWait);
   ASSERT_TRUE(result.error);
   EXPECT_EQ(*result.error, (Error{"com.velmar.zerith.ErrorDomain", -1, "Unknown operation \"bogus:\""}));
   EXPECT_TRUE(capture.has(log::Level::Error,
@@ -130,58 +125,54 @@ TEST(ClientSessionWireRefusal, UnknownOperationIsLoggedAnsweredWithAnErrorAndThe
 struct WrongArgs {
   const char* op;
   Dictionary args;
-  std::string description;
+  const char* argument;
+  const char* wanted;  // what the argument must be, and what it is
 };
 
 TEST(ClientSessionWireRefusal, WrongArgumentTypesAreRefusedBeforeTheSessionSeesThem) {
-  const std::string oneShot = wire::kSendMessageWithSessionInfo;
-  const std::vector<WrongArgs> cases = {
-      {wire::kSetSessionInfo, {{"sessionInfo", "not a dict"}},
-       "Argument \"sessionInfo\" of setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock: must be a dictionary, not a string"},
-      {wire::kSetSessionInfo, {{"hasAggregationBlock", 1}},
-       "Argument \"hasAggregationBlock\" of setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock: must be a boolean, not 1"},
-      {wire::kSetSessionInfo, {{"frameworksToCheck", Dictionary{}}},
-       "Argument \"frameworksToCheck\" of setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock: must be an array, not a dictionary"},
-      {wire::kSendMessageWithSessionInfo, {{"category", 65536}, {"type", 1}},
-       "Argument \"category\" of " + oneShot + " must be an unsigned 16-bit integer, not 65536"},
-      {wire::kSendMessageWithSessionInfo, {{"category", -1}, {"type", 1}},
-       "Argument \"category\" of " + oneShot + " must be an unsigned 16-bit integer, not -1"},
-      {wire::kSendMessageWithSessionInfo, {{"category", 1}},
-       "Argument \"type\" of " + oneShot + " must be an unsigned 16-bit integer, not nil"},
-      {wire::kSendMessageWithSessionInfo, {{"category", 1.0}, {"type", 1}},
-       "Argument \"category\" of " + oneShot + " must be an unsigned 16-bit integer, not a real"},
-      {wire::kSetDigestKey, {{"digestKey", "secret"}, {"algorithm", 1}},
-       "Argument \"digestKey\" of setDigestKey:algorithm: must be data, not a string"},
-      {wire::kSetDigestKey, {{"algorithm", 2147483648LL}},
-       "Argument \"algorithm\" of setDigestKey:algorithm: must be a signed 32-bit integer, not 2147483648"},
-      {wire::kUploadFile, {}, "Argument \"fileURL\" of uploadFileAtPath:extensionToken:completionHandler: must be a string, not nil"},
-      {wire::kUpdateSharedDataForKey, {{"key", 5}}, "Argument \"key\" of updateSharedDataForKey:value: must be a string, not 5"},
-      {wire::kSendMessage, {{"message", Array{}}}, "Argument \"message\" of sendMessageWithDictionary:reply: must be a dictionary, not an array"},
+  const char* setInfo = "setSessionInfo:userInfo:frameworksToCheck:hasAggregationBlock:";
+  const char* oneShot = "sendMessageWithSessionInfo:userInfo:category:type:payload:reply:";
+  const char* digest = "setDigestKey:algorithm:";
+  const WrongArgs cases[] = {
+      {setInfo, {{"sessionInfo", "not a dict"}}, "sessionInfo", "a dictionary, not a string"},
+      {setInfo, {{"hasAggregationBlock", 1}}, "hasAggregationBlock", "a boolean, not 1"},
+      {setInfo, {{"frameworksToCheck", Dictionary{}}}, "frameworksToCheck", "an array, not a dictionary"},
+      {oneShot, {{"category", 65536}, {"type", 1}}, "category", "an unsigned 16-bit integer, not 65536"},
+      {oneShot, {{"category", -1}, {"type", 1}}, "category", "an unsigned 16-bit integer, not -1"},
+      {oneShot, {{"category", 1}}, "type", "an unsigned 16-bit integer, not nil"},
+      {oneShot, {{"category", 1.0}, {"type", 1}}, "category", "an unsigned 16-bit integer, not a real"},
+      {digest, {{"digestKey", "secret"}, {"algorithm", 1}}, "digestKey", "data, not a string"},
+      {digest, {{"algorithm", 2147483648LL}}, "algorithm", "a signed 32-bit integer, not 2147483648"},
+      {"uploadFileAtPath:extensionToken:completionHandler:", {}, "fileURL", "a string, not nil"},
+      {"updateSharedDataForKey:value:", {{"key", 5}}, "key", "a string, not 5"},
+      {"sendMessageWithDictionary:reply:", {{"message", Array{}}}, "message", "a dictionary, not an array"},
   };
   log::LogCapture capture;
   SessionLink link;
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.description);
-    const auto result = callAndWait(*link.pair.a, c.op, c.args);
+    const std::string description = "Argument \"" + std::string(c.argument) + "\" of " + c.op + " must be " + c.wanted;
+    SCOPED_TRACE(description);
+    const auto result = link.pair.a->callAndWait(c.op, c.args, kWait);
     ASSERT_TRUE(result.error) << "accepted";
-    EXPECT_EQ(*result.error, (Error{"com.velmar.zerith.ErrorDomain", -1, c.description}));
-    EXPECT_TRUE(capture.has(log::Level::Error, "ClientSessionExporter: " + c.description + " from " + link.pair.b->description()));
+    EXPECT_EQ(*result.error, (Error{"com.velmar.zerith.ErrorDomain", -1, description}));
+    EXPECT_TRUE(capture.has(log::Level::Error, "ClientSessionExporter: " + description + " from " + link.pair.b->description()));
   }
   EXPECT_EQ(link.session->log.size(), 0u);
   // Edge values that are right pass.
-  EXPECT_TRUE(callAndWait(*link.pair.a, wire::kSetDigestKey, {{"algorithm", -2147483648LL}}).args);
-  EXPECT_TRUE(callAndWait(*link.pair.a, wire::kSendMessageWithSessionInfo, {{"category", 0}, {"type", 65535}}).args);
+  EXPECT_TRUE(link.pair.a->callAndWait(wire::kSetDigestKey, {{"algorithm", -2147483648LL}}, kWait).args);
+  EXPECT_TRUE(link.pair.a->callAndWait(wire::kSendMessageWithSessionInfo, {{"category", 0}, {"type", 65535}}, kWait).args);
   EXPECT_EQ(link.session->log.size(), 2u);
 }
 
 TEST(ClientSessionWireRefusal, TheClientRefusesMalformedMessagesFromTheDaemon) {
   log::LogCapture capture;
   SessionLink link;
-  const auto result = callAndWait(*link.pair.b, wire::kSendMessageToClient, {{"timestamp", 1.0}, {"category", "x"}, {"type", 1}});
+  const auto result =
+      link.pair.b->callAndWait(wire::kSendMessageToClient, {{"timestamp", 1.0}, {"category", "x"}, {"type", 1}}, kWait);
   ASSERT_TRUE(result.error);
   EXPECT_EQ(result.error->description,
             "Argument \"category\" of sendMessageToClient:timestamp:category:type:payload: must be an unsigned 16-bit integer, not a string");
-  const auto unknown = callAndWait(*link.pair.b, "other:", {});
+  const auto unknown = link.pair.b->callAndWait("other:", {}, kWait);
   ASSERT_TRUE(unknown.error);
   EXPECT_TRUE(capture.has(log::Level::Error, "ClientSessionReplyExporter: Unknown operation \"other:\""));
   EXPECT_EQ(link.client->log.size(), 0u);

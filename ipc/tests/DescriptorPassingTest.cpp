@@ -72,13 +72,6 @@ INSTANTIATE_TEST_SUITE_P(Claims, DescriptorPassingTest,
                                            Case{"MoreSentThanClaimed", 1, 3, 1}, Case{"ClaimedNotSent", 2, 0, 0}),
                          [](const auto& info) { return std::string(info.param.name); });
 
-TEST(DescriptorPassing, FrameClaimingMoreThanAFrameMayCarryEndsTheConnection) {
-  RawPeer peer;
-  peer.write(encodeCall("upload", 1, Dictionary(), kMaxDescriptorsPerFrame + 1));
-  EXPECT_TRUE(peer.invalidated.waitFor(1));
-  EXPECT_EQ(peer.object->received.count(), 0);
-}
-
 // On an idle socket and behind frames that wait in the outbox (the peer
 // reads only once all are written), the descriptors leave with their own
 // call's frame and every frame keeps its place.

@@ -115,18 +115,5 @@ TEST(FrameDecoderTest, ExactlyTheLimitPassesOneMoreIsRefusedFromTheHeaderAloneAn
   EXPECT_EQ(decoder.next(body, why), FrameDecoder::Status::Invalid);
 }
 
-TEST(MessageShape, RepliesAndCallsThatBreakTheShapeAreRefusedWithTheReason) {
-  auto why = [](const Value& v) {
-    std::string w;
-    EXPECT_FALSE(decodeMessage(plist::bytesOf(plist::encodeBinary(v)), &w)) << v.description();
-    return w;
-  };
-  EXPECT_EQ(why(Value(Dictionary{{"op", "x"}, {"reply", 1}})), "message has both \"op\" and \"reply\"");
-  EXPECT_EQ(why(Value(Dictionary{{"reply", "1"}})), "message \"reply\" is not an unsigned integer");
-  EXPECT_EQ(why(Value(Dictionary{{"reply", 1}, {"error", "bad"}})), "reply \"error\" is a string, not a dictionary");
-  EXPECT_EQ(why(Value(Dictionary{{"op", "x"}, {"call", 1.5}})), "message \"call\" is not an unsigned integer");
-  EXPECT_EQ(why(Value("just a string")), "message is a string, not a dictionary");
-}
-
 }  // namespace
 }  // namespace zerith::ipc

@@ -21,6 +21,7 @@
 #include "ipc/Frame.h"
 #include "ipc/SocketConnection.h"
 #include "tests/support/RawFrameSocket.h"
+#include "tests/support/TempRoot.h"
 
 namespace zerith::ipc::test {
 
@@ -28,6 +29,14 @@ using namespace std::chrono_literals;
 using zerith::test::frameWithBody;
 using zerith::test::RawFrameSocket;
 inline constexpr auto kWait = 10s;
+
+// A policy under `root` that gives this user the daemon's entitlement as `value`.
+inline void grantEntitlement(const zerith::test::TempRoot& root, const std::string& value = "<true/>") {
+  root.write("/etc/zerithd/entitlements.d/test.plist",
+             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict><key>users</key><array><integer>" +
+                 std::to_string(::getuid()) + "</integer></array><key>entitlements</key><dict>"
+                 "<key>com.velmar.private.zerithd</key>" + value + "</dict></dict></plist>\n");
+}
 
 // Counts events and lets a test wait for a number of them.
 class Counter {
@@ -186,25 +195,13 @@ struct ConnectedPair {
   }
 };
 
-// The outcome of one Connection::call, waited for with a time-out.
-struct CallResult {
-  bool arrived = false;
-  std::optional<Dictionary> args;
-  std::optional<Error> error;
-};
-
-inline std::future<CallResult> callLater(Connection& connection, const std::string& op, Dictionary args) {
-  auto promise = std::make_shared<std::promise<CallResult>>();
+// The outcome of one Connection::call with a completion.
+inline std::future<SocketConnection::WaitedReply> callLater(Connection& connection, const std::string& op, Dictionary args) {
+  auto promise = std::make_shared<std::promise<SocketConnection::WaitedReply>>();
   connection.call(op, std::move(args), [promise](std::optional<Dictionary> a, std::optional<Error> e) {
-    promise->set_value(CallResult{true, std::move(a), std::move(e)});
+    promise->set_value({std::move(a), std::move(e)});
   });
   return promise->get_future();
-}
-
-inline CallResult callAndWait(Connection& connection, const std::string& op, Dictionary args,
-                              std::chrono::milliseconds timeout = kWait) {
-  auto future = callLater(connection, op, std::move(args));
-  return future.wait_for(timeout) == std::future_status::ready ? future.get() : CallResult{};
 }
 
 // A socket bound at `path` and listening with `backlog` (0: bound only, as a

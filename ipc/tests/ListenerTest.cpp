@@ -5,10 +5,9 @@
 #include <sys/stat.h>
 #include <sys/wait.h>
 
-#include <fstream>
-
 #include "ipc/EntitlementPolicy.h"
 #include "ipc/tests/IpcTestSupport.h"
+#include "platform/FileUtil.h"
 #include "platform/Log.h"
 #include "platform/Paths.h"
 #include "tests/support/TempRoot.h"
@@ -60,15 +59,10 @@ struct Client {
       connection->invalidate();
     }
   }
-  CallResult call(const std::string& op, Dictionary args = {}, std::chrono::milliseconds timeout = kWait) {
-    return connection ? callAndWait(*connection, op, std::move(args), timeout) : CallResult{};
+  SocketConnection::WaitedReply call(const std::string& op, Dictionary args = {}, std::chrono::milliseconds timeout = kWait) {
+    return connection ? connection->callAndWait(op, std::move(args), timeout) : SocketConnection::WaitedReply{};
   }
 };
-
-void writePolicy(const zerith::test::TempRoot& root, const std::string& name, const std::string& body) {
-  root.write("/etc/zerithd/entitlements.d/" + name,
-             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\">\n" + body + "\n</plist>\n");
-}
 
 struct ListenerFixture : ::testing::Test {
   zerith::test::TempRoot root;
@@ -81,20 +75,15 @@ struct ListenerFixture : ::testing::Test {
     listener->setDelegate(&delegate);
     listener->resume();
   }
-  void TearDown() override { listener.reset(); }
 };
 
 TEST_F(ListenerFixture, AcceptedClientIsServedWithTheEntitlementsThePolicyGrantsIt) {
-  writePolicy(root, "clients.plist",
-              "<dict><key>users</key><array><integer>" + std::to_string(::getuid()) +
-                  "</integer></array><key>entitlements</key><dict><key>com.velmar.private.zerithd</key><true/>"
-                  "</dict></dict>");
+  grantEntitlement(root);
   start();
   // The socket is open to everyone; the policy decides.
   struct stat st {};
   ASSERT_EQ(::lstat(paths::socketPath().c_str(), &st), 0);
-  EXPECT_TRUE(S_ISSOCK(st.st_mode));
-  EXPECT_EQ(st.st_mode & 0777, 0666u);
+  EXPECT_EQ(st.st_mode & (S_IFMT | 0777), S_IFSOCK | 0666u);
   Client client;
   ASSERT_TRUE(client.connection);
   EXPECT_EQ(client.call("hello", Dictionary{{"x", 1}}).args, (Dictionary{{"x", 1}}));
@@ -117,10 +106,7 @@ TEST_F(ListenerFixture, ALiveListenerIsNotStolenARegularFileIsNotDeletedAndAnOve
   root.write("/run/other/file", "keep me");
   EXPECT_EQ(Listener::create(root / "/run/other/file", nullptr), nullptr);
   EXPECT_TRUE(capture.has(log::Level::Error, "Listener: " + (root / "/run/other/file").string() + " exists and is not a socket"));
-  std::ifstream in(root / "/run/other/file");
-  std::string text;
-  std::getline(in, text);
-  EXPECT_EQ(text, "keep me");
+  EXPECT_EQ(file::readAll(root / "/run/other/file", 64), bytesOfText("keep me"));
 }
 
 TEST_F(ListenerFixture, StopEndsAcceptingButExistingConnectionsGoOn) {
