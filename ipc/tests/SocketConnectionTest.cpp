@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <future>
+#include <set>
 #include <thread>
 
 #include "ipc/tests/IpcTestSupport.h"
@@ -506,10 +507,7 @@ TEST(SocketConnectionIdentity, PeerCredentialsComeFromTheSocketAndTheDescription
   EXPECT_EQ(std::make_tuple(p.pid, p.uid, p.gid), std::make_tuple(::getpid(), ::getuid(), ::getgid()));
   std::vector<gid_t> groups(static_cast<std::size_t>(::getgroups(0, nullptr)));
   groups.resize(static_cast<std::size_t>(::getgroups(static_cast<int>(groups.size()), groups.data())));
-  std::sort(groups.begin(), groups.end());
-  auto got = p.groups;
-  std::sort(got.begin(), got.end());
-  EXPECT_EQ(got, groups);
+  EXPECT_EQ(std::multiset<gid_t>(p.groups.begin(), p.groups.end()), std::multiset<gid_t>(groups.begin(), groups.end()));
   const std::string text = raw.connection->description();
   EXPECT_EQ(text.rfind("<connection pid=" + std::to_string(p.pid) + " uid=" + std::to_string(p.uid) + " fd=", 0), 0u)
       << text;
