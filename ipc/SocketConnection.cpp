@@ -1,9 +1,12 @@
 #include "ipc/SocketConnection.h"
 #include "ipc/SocketConnectionHelpers.h"
 
+#include <poll.h>
+#include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <sys/uio.h>
 #include <sys/un.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -210,6 +213,25 @@ void SocketConnection::call(const std::string& operation, Dictionary args, std::
   startCall(operation, std::move(args), std::move(handler), false, std::move(descriptors));
 }
 
+namespace {
+
+// The calling thread's wake-up for the replies it waits for: an eventfd,
+// shared with the reply handlers that hold it, so that a reply arriving
+// after its caller gave up never writes to a descriptor number the thread
+// has given back. Null when the process has no descriptor left.
+std::shared_ptr<const file::UniqueFd> callerWakeFd() {
+  thread_local std::shared_ptr<const file::UniqueFd> wake;
+  if (!wake) {
+    file::UniqueFd fd(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    if (fd) {
+      wake = std::make_shared<const file::UniqueFd>(std::move(fd));
+    }
+  }
+  return wake;
+}
+
+}  // namespace
+
 SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& operation, Dictionary args,
                                                             std::chrono::milliseconds timeout,
                                                             std::vector<file::UniqueFd> descriptors) {
@@ -218,8 +240,10 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
     std::condition_variable done;
     bool arrived = false;
     WaitedReply reply;
+    std::shared_ptr<const file::UniqueFd> wake;
   };
   auto waiter = std::make_shared<Waiter>();
+  waiter->wake = callerWakeFd();
   startCall(
       operation, std::move(args),
       [waiter](std::optional<Dictionary> a, std::optional<Error> e) {
@@ -231,16 +255,61 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
         }
         // After the lock: the woken caller does not block on it again. The
         // handler's own reference keeps the waiter alive meanwhile.
-        waiter->done.notify_one();
+        if (waiter->wake) {
+          const std::uint64_t one = 1;
+          [[maybe_unused]] const ssize_t n = ::write(waiter->wake->get(), &one, sizeof(one));
+        } else {
+          waiter->done.notify_one();
+        }
       },
       true, std::move(descriptors));
-  std::unique_lock lock(waiter->mutex);
-  if (!waiter->done.wait_for(lock, timeout, [&] { return waiter->arrived; })) {
-    WaitedReply late;
-    late.timedOut = true;
-    return late;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  WaitedReply late;
+  late.timedOut = true;
+  auto answered = [&]() -> std::optional<WaitedReply> {
+    std::lock_guard lock(waiter->mutex);
+    if (waiter->arrived) {
+      return std::move(waiter->reply);
+    }
+    return std::nullopt;
+  };
+  if (!waiter->wake) {
+    std::unique_lock lock(waiter->mutex);
+    if (!waiter->done.wait_until(lock, deadline, [&] { return waiter->arrived; })) {
+      return late;
+    }
+    return std::move(waiter->reply);
   }
-  return std::move(waiter->reply);
+  // The reply wakes this thread through its eventfd, or through the socket
+  // when this thread reads it. A thread of the connection's own queue or a
+  // socket thread only waits: they are what reads otherwise.
+  bool watchSocket = clientEnd_ && !onSocketThread() && !queue_.isCurrent();
+  for (;;) {
+    if (auto reply = answered()) {
+      return std::move(*reply);
+    }
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    if (left.count() <= 0) {
+      return late;
+    }
+    pollfd watched[2] = {{waiter->wake->get(), POLLIN, 0}, {fd_, POLLIN, 0}};
+    const int ready = ::poll(watched, watchSocket ? 2 : 1, static_cast<int>(std::min<std::int64_t>(left.count(), 60'000)));
+    if (ready < 0 && errno != EINTR) {
+      // Not expected of poll with valid descriptors; the socket threads still
+      // read, and the wake-up still comes, so wait for that alone.
+      watchSocket = false;
+      continue;
+    }
+    if ((watched[0].revents & POLLIN) != 0) {
+      std::uint64_t count = 0;
+      [[maybe_unused]] const ssize_t n = ::read(waiter->wake->get(), &count, sizeof(count));
+    }
+    if (watchSocket && watched[1].revents != 0 && !readForCaller()) {
+      // Another thread reads (or reading is held back): its delivery of
+      // the reply writes the wake-up; polling the socket on would only spin.
+      watchSocket = false;
+    }
+  }
 }
 
 void SocketConnection::startCall(std::string_view operation, Dictionary args, ReplyHandler handler,

@@ -24,6 +24,10 @@ namespace {
 
 constexpr std::size_t kReadChunk = 64u << 10;
 
+// Set while a thread waiting for its reply reads for the connection: like a
+// socket thread, it hands a message that may wait to the queue's pool.
+thread_local bool tCallerReads = false;
+
 // Sends the reply to one call through the connection that delivered it.
 class SocketReply final : public Reply {
  public:
@@ -74,7 +78,7 @@ class SocketReply final : public Reply {
 // ---- reading (on the queue) ---------------------------------------------------
 
 void SocketConnection::startRead() {
-  if (invalidated_) {
+  if (invalidated_ || readArmed_.exchange(true)) {
     return;
   }
   // No buffer is held while the connection waits: the bytes are read when
@@ -84,6 +88,7 @@ void SocketConnection::startRead() {
   // drop.
   socket_.async_wait(asio::socket_base::wait_read,
                      [self = std::static_pointer_cast<SocketConnection>(shared_from_this())](const std::error_code& ec) {
+                       self->readArmed_ = false;
                        self->onReadable(ec);
                      });
 }
@@ -129,60 +134,83 @@ void SocketConnection::onReadable(const std::error_code& ec) {
       readFailed(ec);
       return;
     }
-    if (invalidated_) {
-      return;
-    }
-    thread_local std::vector<std::uint8_t> chunk(kReadChunk);
-    iovec part{chunk.data(), chunk.size()};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxDescriptorsPerFrame)];
-    msghdr message{};
-    message.msg_iov = &part;
-    message.msg_iovlen = 1;
-    message.msg_control = control;
-    message.msg_controllen = sizeof(control);
-    const ssize_t n = ::recvmsg(fd_, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-    if (n < 0) {
-      const int err = errno;
-      if (err == EAGAIN || err == EWOULDBLOCK || err == EINTR) {
-        startRead();
-        return;
-      }
-      readFailed(std::error_code(err, std::system_category()));
-      return;
-    }
-    std::vector<file::UniqueFd> fds;
-    for (cmsghdr* c = CMSG_FIRSTHDR(&message); c != nullptr; c = CMSG_NXTHDR(&message, c)) {
-      if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) {
-        continue;
-      }
-      const std::size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-      for (std::size_t i = 0; i < count; ++i) {
-        int fd = -1;
-        std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof(int));
-        fds.emplace_back(fd);
-      }
-    }
-    if ((message.msg_flags & MSG_CTRUNC) != 0) {
-      // More than a frame may carry, or no descriptor left in this process:
-      // the kernel closed what did not fit.
-      log_.error("{}: descriptors sent with a call were cut off (at most {} per call, or none left here)",
-                 description(), kMaxDescriptorsPerFrame);
-    }
-    if (n == 0) {
-      readFailed(asio::error::eof);
-      return;
-    }
-    const auto size = static_cast<std::size_t>(n);
-    if (!fds.empty()) {
-      receivedDescriptors_.push_back(ReceivedDescriptors{bytesReceived_, bytesReceived_ + size, std::move(fds)});
-    }
-    bytesReceived_ += size;
-    decoder_.append(chunk.data(), size);
-    continueReading();
+    readChunk();
   };
   if (!queue_.runIfFree(handle)) {
     queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this()), handle] { handle(); });
   }
+}
+
+bool SocketConnection::readChunk() {
+  if (invalidated_) {
+    return false;
+  }
+  thread_local std::vector<std::uint8_t> chunk(kReadChunk);
+  iovec part{chunk.data(), chunk.size()};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxDescriptorsPerFrame)];
+  msghdr message{};
+  message.msg_iov = &part;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof(control);
+  const ssize_t n = ::recvmsg(fd_, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+  if (n < 0) {
+    const int err = errno;
+    if (err == EAGAIN || err == EWOULDBLOCK || err == EINTR) {
+      startRead();
+      return false;
+    }
+    readFailed(std::error_code(err, std::system_category()));
+    return false;
+  }
+  std::vector<file::UniqueFd> fds;
+  for (cmsghdr* c = CMSG_FIRSTHDR(&message); c != nullptr; c = CMSG_NXTHDR(&message, c)) {
+    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) {
+      continue;
+    }
+    const std::size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+    for (std::size_t i = 0; i < count; ++i) {
+      int fd = -1;
+      std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof(int));
+      fds.emplace_back(fd);
+    }
+  }
+  if ((message.msg_flags & MSG_CTRUNC) != 0) {
+    // More than a frame may carry, or no descriptor left in this process:
+    // the kernel closed what did not fit.
+    log_.error("{}: descriptors sent with a call were cut off (at most {} per call, or none left here)",
+               description(), kMaxDescriptorsPerFrame);
+  }
+  if (n == 0) {
+    readFailed(asio::error::eof);
+    return false;
+  }
+  const auto size = static_cast<std::size_t>(n);
+  if (!fds.empty()) {
+    receivedDescriptors_.push_back(ReceivedDescriptors{bytesReceived_, bytesReceived_ + size, std::move(fds)});
+  }
+  bytesReceived_ += size;
+  decoder_.append(chunk.data(), size);
+  continueReading();
+  return true;
+}
+
+bool SocketConnection::readForCaller() {
+  if (!resumed_ || invalidated_ || readPausedFlag_.load()) {
+    return false;
+  }
+  bool read = false;
+  queue_.runIfFree([&] {
+    // Reading may have been held back since the check above; the flag is
+    // only set in a turn, so this second look is the one that counts.
+    if (readPausedFlag_.load()) {
+      return;
+    }
+    tCallerReads = true;
+    read = readChunk();
+    tCallerReads = false;
+  });
+  return read;
 }
 
 bool SocketConnection::outboxHoldsReading(std::size_t waiting) const {
@@ -271,7 +299,7 @@ SocketConnection::InputState SocketConnection::processInput() {
       deliver(std::move(*message));
       continue;
     }
-    if (onSocketThread()) {
+    if (onSocketThread() || tCallerReads) {
       // The rest of this turn goes to the pool; the socket thread goes back
       // to the other connections. The queue runs it right after this turn.
       // The message that may wait is delivered there uncorked.

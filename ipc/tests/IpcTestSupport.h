@@ -8,7 +8,9 @@
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
@@ -171,7 +173,9 @@ struct RawPeer {
 };
 
 // Two real connections joined by a socket pair; serve() exports `object` on
-// b and resumes both.
+// b and resumes both. With `clientEnd`, a is made as a client makes its
+// connection (connect), which is the end whose waiting callers read their
+// replies themselves.
 struct ConnectedPair {
   std::shared_ptr<SocketConnection> a;
   std::shared_ptr<SocketConnection> b;
@@ -183,7 +187,23 @@ struct ConnectedPair {
     b->resume();
   }
 
-  ConnectedPair() {
+  explicit ConnectedPair(bool clientEnd = false) {
+    if (clientEnd) {
+      static std::atomic<int> made{0};
+      const std::string path = "/tmp/zerith-pair-" + std::to_string(::getpid()) + "-" + std::to_string(++made) + ".sock";
+      file::UniqueFd listening(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+      sockaddr_un address{};
+      address.sun_family = AF_UNIX;
+      std::strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
+      EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
+      EXPECT_EQ(::listen(listening.get(), 1), 0);
+      a = SocketConnection::connect(path);
+      file::UniqueFd accepted(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+      const PeerCredentials peer = *readPeerCredentials(accepted.get());
+      b = SocketConnection::adopt(std::move(accepted), peer, Dictionary());
+      ::unlink(path.c_str());
+      return;
+    }
     auto [ours, theirs] = socketPair();
     const PeerCredentials peer = *readPeerCredentials(ours.get());
     a = SocketConnection::adopt(std::move(ours), peer, Dictionary());

@@ -161,15 +161,16 @@ TEST(SocketConnectionFraming, AReplyToAnUnknownCallAndACallWithoutAnExportedObje
 // ---- calls, replies and writers ---------------------------------------------------
 
 TEST(SocketConnectionCalls, ManyThreadsWaitingOnSeveralConnectionsEachGetTheirOwnReply) {
-  // Replies are taken on the socket threads while the callers wait; calls
-  // that never wait are answered on the socket thread, the others on the
-  // pool, so replies of one connection come back from both.
-  constexpr int kPairs = 3;
+  // Replies are taken on the socket threads while the callers wait, or on a
+  // client end by the waiting callers themselves, each reading the others'
+  // replies too; calls that never wait are answered on the socket thread,
+  // the others on the pool, so replies of one connection come back from both.
+  constexpr int kPairs = 4;
   constexpr int kThreads = 6;
   constexpr int kCalls = 150;
   std::vector<std::unique_ptr<ConnectedPair>> pairs;
   for (int p = 0; p < kPairs; ++p) {
-    pairs.push_back(std::make_unique<ConnectedPair>());
+    pairs.push_back(std::make_unique<ConnectedPair>(p % 2 == 0));
     pairs.back()->object->quick = [](const Message& m) { return m.args.get("n").intValue() % 3 != 0; };
     pairs.back()->serve();
   }
