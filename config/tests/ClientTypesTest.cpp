@@ -80,13 +80,6 @@ TEST_F(EnvironmentTest, ChangedDefaultsTakeEffectAtTheNextCallWithoutRestart) {
   EXPECT_EQ(lastResolvedEnvironmentType(), kEnvironmentRelease);
 }
 
-// The internal-build flag is computed once per process, so the internal
-// cases run in a child process of their own.
-class InternalBuildDeathTest : public ::testing::Test {
- protected:
-  void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
-};
-
 void writeReleaseType(const test::TempRoot& root, const char* releaseType) {
   root.write("/etc/zerithd/device.plist",
              plist::encodeXml(Value(Dictionary{{"ReleaseType", Value(releaseType)}})));
@@ -94,7 +87,9 @@ void writeReleaseType(const test::TempRoot& root, const char* releaseType) {
 
 // Only the exact text "Internal" makes an internal build, where an absent
 // value resolves to internal; the flag stays as it was when the file changes.
-TEST_F(InternalBuildDeathTest, OnlyTheExactTextInternalCountsAndTheFlagIsKeptWhenTheDeviceFileChanges) {
+// The flag is computed once per process: each case runs in a child of its own.
+TEST(InternalBuildDeathTest, OnlyTheExactTextInternalCountsAndTheFlagIsKeptWhenTheDeviceFileChanges) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
   for (const auto& [releaseType, internal] : {std::pair{"Internal", true}, std::pair{"internal", false}}) {
     EXPECT_EXIT(
         {

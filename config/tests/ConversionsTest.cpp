@@ -1,10 +1,10 @@
 #include <gtest/gtest.h>
 #include <arpa/inet.h>
 
-#include <array>
-#include <cmath>
 #include <cstring>
+#include <iterator>
 #include <limits>
+#include <string>
 
 #include "config/Conversions.h"
 
@@ -26,12 +26,9 @@ TEST(ConversionsTest, NonFiniteDoublesBecomeMinusOne) {
 }
 
 TEST(ConversionsTest, MinutesTruncateTowardsZero) {
-  EXPECT_EQ(roundDownToMinute(119), 60);
-  EXPECT_EQ(roundDownToMinute(-61), -60);
-  EXPECT_EQ(roundDownToMinute(59), 0);
-  EXPECT_EQ(roundDownToMinute(-59), 0);
-  EXPECT_EQ(roundDownToMinute(120), 120);
-  EXPECT_EQ(roundDownToMinute(1000), 960);
+  const std::pair<std::int64_t, std::int64_t> cases[] = {{119, 60},  {-61, -60}, {59, 0},
+                                                          {-59, 0},  {120, 120}, {1000, 960}};
+  for (const auto& [seconds, minute] : cases) EXPECT_EQ(roundDownToMinute(seconds), minute) << seconds;
 }
 
 TEST(ConversionsTest, SocketAddressIsZeroFilledWithPortInNetworkOrder) {
@@ -39,14 +36,9 @@ TEST(ConversionsTest, SocketAddressIsZeroFilledWithPortInNetworkOrder) {
   std::memset(&address, 0xAB, sizeof(address));
   makeIPv4SocketAddress("127.0.0.1", 8080, &address);
   EXPECT_EQ(address.sin_family, AF_INET);
-  const auto* port = reinterpret_cast<const unsigned char*>(&address.sin_port);
-  EXPECT_EQ(port[0], 0x1F);
-  EXPECT_EQ(port[1], 0x90);
-  const auto* ip = reinterpret_cast<const unsigned char*>(&address.sin_addr);
-  EXPECT_EQ((std::array<unsigned char, 4>{ip[0], ip[1], ip[2], ip[3]}), (std::array<unsigned char, 4>{127, 0, 0, 1}));
-  for (unsigned char b : address.sin_zero) {
-    EXPECT_EQ(b, 0);
-  }
+  EXPECT_EQ(ntohs(address.sin_port), 8080);
+  EXPECT_EQ(ntohl(address.sin_addr.s_addr), INADDR_LOOPBACK);
+  EXPECT_EQ(std::string(std::begin(address.sin_zero), std::end(address.sin_zero)), std::string(8, '\0'));
 }
 
 TEST(ConversionsTest, SocketAddressReadsNoMoreThanSixteenCharacters) {

@@ -6,6 +6,7 @@
 #include <cstring>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "config/DeviceInfo.h"
 #include "platform/Defaults.h"
@@ -20,6 +21,7 @@ namespace {
 using log::Level;
 
 constexpr char kMachineID[] = "0123456789abcdef0123456789abcdef\n";
+using Answers = std::vector<std::optional<std::string>>;
 
 class DeviceInfoTest : public ::testing::Test {
  protected:
@@ -30,19 +32,22 @@ class DeviceInfoTest : public ::testing::Test {
     const Value v = deviceInformationValue(key);
     return v.string() ? std::optional<std::string>(*v.string()) : std::nullopt;
   }
+  // Product version, build, type, serial number and hardware model.
+  Answers systemAnswers() {
+    return {answer(kDeviceKeyProductVersion), answer(kDeviceKeyBuildVersion), answer(kDeviceKeyProductType),
+            answer(kDeviceKeySerialNumber), answer(kDeviceKeyHardwareModel)};
+  }
 
   test::TempRoot root_;
   log::LogCapture capture_;
 };
 
 TEST_F(DeviceInfoTest, BareRootHasNoAnswersButTheHostName) {
-  EXPECT_TRUE(deviceProductVersion().isNil());
-  EXPECT_TRUE(deviceBuildVersion().isNil());
-  EXPECT_TRUE(deviceProductType().isNil());
-  EXPECT_TRUE(deviceHardwareModel().isNil());
-  EXPECT_TRUE(deviceSerialNumber().isNil());
-  EXPECT_TRUE(deviceInformationValue(kDeviceKeyUniqueDeviceID).isNil());
-  EXPECT_TRUE(deviceInformationValue(kDeviceKeyReleaseType).isNil());
+  EXPECT_EQ((std::vector<Value>{deviceProductVersion(), deviceBuildVersion(), deviceProductType(),
+                                 deviceHardwareModel(), deviceSerialNumber(),
+                                 deviceInformationValue(kDeviceKeyUniqueDeviceID),
+                                 deviceInformationValue(kDeviceKeyReleaseType)}),
+            std::vector<Value>(7));
   char host[HOST_NAME_MAX + 1] = {};
   ASSERT_EQ(::gethostname(host, sizeof(host) - 1), 0);
   EXPECT_EQ(answer(kDeviceKeyDeviceName), std::string(host));
@@ -57,11 +62,7 @@ TEST_F(DeviceInfoTest, LinuxSourcesAnswerWithTrimmedValues) {
   root_.write("/sys/class/dmi/id/product_serial", "  SN-42 \n");
   root_.write("/sys/class/dmi/id/board_vendor", "Velmar\n");
   root_.write("/sys/class/dmi/id/board_name", "B-7\n");
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_EQ(answer(kDeviceKeyBuildVersion), "20240601.1");
-  EXPECT_EQ(answer(kDeviceKeyProductType), "Tarvix");
-  EXPECT_EQ(answer(kDeviceKeySerialNumber), "SN-42");
-  EXPECT_EQ(answer(kDeviceKeyHardwareModel), "Velmar B-7");
+  EXPECT_EQ(systemAnswers(), (Answers{"12", "20240601.1", "Tarvix", "SN-42", "Velmar B-7"}));
 }
 
 TEST_F(DeviceInfoTest, DeviceTreeAnswersWhereThereIsNoDmi) {
@@ -69,11 +70,7 @@ TEST_F(DeviceInfoTest, DeviceTreeAnswersWhereThereIsNoDmi) {
   root_.write("/proc/device-tree/compatible", std::string("velmar,b2\0brcm,bcm2711\0", 23));
   root_.write("/proc/device-tree/serial-number", std::string("00000000abcd\0", 13));
   root_.write("/usr/lib/os-release", "VERSION_ID=3.19\nIMAGE_VERSION=7\n");
-  EXPECT_EQ(answer(kDeviceKeyProductType), "Velmar Board Rev 2");
-  EXPECT_EQ(answer(kDeviceKeyHardwareModel), "velmar,b2");
-  EXPECT_EQ(answer(kDeviceKeySerialNumber), "00000000abcd");
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "3.19");
-  EXPECT_EQ(answer(kDeviceKeyBuildVersion), "7");
+  EXPECT_EQ(systemAnswers(), (Answers{"3.19", "7", "Velmar Board Rev 2", "00000000abcd", "velmar,b2"}));
 }
 
 TEST_F(DeviceInfoTest, OperatorFileWinsOverLinuxSourcesAndIsReReadWhenChanged) {
@@ -95,27 +92,12 @@ TEST_F(DeviceInfoTest, OperatorFileWinsOverLinuxSourcesAndIsReReadWhenChanged) {
   EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
 }
 
-TEST_F(DeviceInfoTest, BrokenDeviceFileIsLoggedOnceAndIgnored) {
-  root_.write("/etc/os-release", "VERSION_ID=12\n");
-  root_.write("/etc/zerithd/device.plist", plist::encodeXml(Value(Array{Value("ProductVersion")})));
-  const std::string path = (root_ / "/etc/zerithd/device.plist").string();
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_TRUE(capture_.has(Level::Error,
-                           "Device facts: ignoring device file " + path + ": the root is not a dictionary"));
-  EXPECT_EQ(capture_.count("Device facts: ignoring device file"), 1u);
-
-  // Garbage of another length is a new version of the file: logged again.
-  root_.write("/etc/zerithd/device.plist", "<plist><dict><key>ProductVersion</key>");
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_EQ(capture_.count("Device facts: ignoring device file"), 2u);
-}
-
-// A device file that cannot be used leaves the system's own facts: one
-// whose binary form holds a NUL inside a string (which libplist would abort
-// the process on), and a folder in its place (which not even the superuser
-// can read).
-TEST_F(DeviceInfoTest, UnusableDeviceFileIsLoggedAndIgnoredNotFatal) {
+// A device file that cannot be used leaves the system's own facts and is
+// logged once for each version of it: a root that is not a dictionary, XML
+// cut short, a binary list with a NUL inside a string (which libplist would
+// abort the process on), and a folder in its place (which not even the
+// superuser can read).
+TEST_F(DeviceInfoTest, UnusableDeviceFileIsLoggedOncePerVersionAndIgnored) {
   // {"ProductVersion": "a\0b"}
   const std::uint8_t nul[] = {
       0x62, 0x70, 0x6c, 0x69, 0x73, 0x74, 0x30, 0x30, 0xd1, 0x01, 0x02, 0x5e, 0x50, 0x72, 0x6f, 0x64, 0x75,
@@ -123,10 +105,22 @@ TEST_F(DeviceInfoTest, UnusableDeviceFileIsLoggedAndIgnoredNotFatal) {
       0x00, 0x00, 0x00, 0x00, 0x00, 0x01, 0x01, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x03, 0x00, 0x00,
       0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x1e};
   const std::string path = (root_ / "/etc/zerithd/device.plist").string();
+  const std::string ignoring = "Device facts: ignoring device file " + path + ": ";
+  // Each of another length: a new version of the file.
+  const std::pair<std::string, const char*> versions[] = {
+      {plist::encodeXml(Value(Array{Value("ProductVersion")})), "the root is not a dictionary"},
+      {"<plist><dict><key>ProductVersion</key>", ""},
+      {std::string(reinterpret_cast<const char*>(nul), sizeof(nul)), "string holds a NUL character"},
+  };
   root_.write("/etc/os-release", "VERSION_ID=12\n");
-  root_.write("/etc/zerithd/device.plist", std::string(reinterpret_cast<const char*>(nul), sizeof(nul)));
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_TRUE(capture_.contains("string holds a NUL character"));
+  for (std::size_t i = 0; i < std::size(versions); ++i) {
+    root_.write("/etc/zerithd/device.plist", versions[i].first);
+    EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+    EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
+    EXPECT_TRUE(capture_.contains(ignoring + versions[i].second)) << i;
+    EXPECT_EQ(capture_.count("Device facts: ignoring device file"), i + 1);
+  }
+  EXPECT_TRUE(capture_.has(Level::Error, ignoring + "the root is not a dictionary"));
 
   std::filesystem::remove(path);
   std::filesystem::create_directories(path);
@@ -198,24 +192,17 @@ TEST(DeviceParsersTest, OsReleaseQuotingEscapesAndJunkLines) {
       "#VERSION_ID=1\n"
       "VERSION_ID=12   \n"
       "UNTERMINATED=\"abc");
-  EXPECT_EQ(fields.at("NAME"), "Debian \"GNU\"/Linux");
-  EXPECT_EQ(fields.at("PRETTY"), "single $quoted");
-  EXPECT_EQ(fields.at("EMPTY"), "");
-  EXPECT_EQ(fields.at("VERSION_ID"), "12");
-  EXPECT_EQ(fields.at("UNTERMINATED"), "abc");
-  EXPECT_EQ(fields.size(), 5u);
+  EXPECT_EQ(fields, (decltype(fields){{"NAME", "Debian \"GNU\"/Linux"}, {"PRETTY", "single $quoted"}, {"EMPTY", ""},
+                                     {"VERSION_ID", "12"}, {"UNTERMINATED", "abc"}}));
 }
 
 TEST(DeviceParsersTest, CountryOfLocaleNames) {
-  EXPECT_EQ(device::countryFromLocale("en_GB.UTF-8"), "GB");
-  EXPECT_EQ(device::countryFromLocale("de_DE@euro"), "DE");
-  EXPECT_EQ(device::countryFromLocale("pt_br"), "BR");
-  EXPECT_EQ(device::countryFromLocale("es_419.UTF-8"), "419");
-  EXPECT_EQ(device::countryFromLocale("C"), std::nullopt);
-  EXPECT_EQ(device::countryFromLocale("C.UTF-8"), std::nullopt);
-  EXPECT_EQ(device::countryFromLocale("POSIX"), std::nullopt);
-  EXPECT_EQ(device::countryFromLocale("en_.UTF-8"), std::nullopt);
-  EXPECT_EQ(device::countryFromLocale("en_G/B"), std::nullopt);
+  Answers countries;
+  for (const char* locale : {"en_GB.UTF-8", "de_DE@euro", "pt_br", "es_419.UTF-8", "C", "C.UTF-8", "POSIX", "en_.UTF-8",
+                             "en_G/B"}) {
+    countries.push_back(device::countryFromLocale(locale));
+  }
+  EXPECT_EQ(countries, (Answers{"GB", "DE", "BR", "419", {}, {}, {}, {}, {}}));
 }
 
 using test::ScopedEnv;

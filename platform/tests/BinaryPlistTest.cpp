@@ -137,8 +137,7 @@ TEST(BinaryPlistWriter, KeepsWhatLibplistWouldLoseOrRefuse) {
   EXPECT_TRUE(none.empty());
 }
 
-// ---- refused input
-// --------------------------------------------------------------
+// ---- refused input -----------------------------------------------------
 
 // A binary list of `objects` (the first is the top), references of `refSize`
 // bytes and one-byte offsets, each object's references already in place.

@@ -8,13 +8,13 @@
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
 #include <vector>
-#include <functional>
 
 #include "platform/RemoveFiles.h"  // <regex>, included the way GCC 12 with sanitizers wants it
 #include "platform/Log.h"
@@ -119,32 +119,6 @@ class ReleaseCountingAgent : public ConnectivityHelperDelegate {
  private:
   std::shared_ptr<EventLog> log_;
 };
-
-// Task descriptions named in the captured log lines that start with `prefix`
-// ("createHelperForTask: created helperTask for task <" -> "Task_0000002a").
-inline std::vector<std::string> taskDescriptionsAfter(const log::LogCapture& logs, const std::string& prefix) {
-  std::vector<std::string> found;
-  for (const auto& line : logs.lines()) {
-    if (line.text.rfind(prefix, 0) == 0) {
-      const auto end = line.text.find('>', prefix.size());
-      found.push_back(line.text.substr(prefix.size(), end - prefix.size()));
-    }
-  }
-  return found;
-}
-
-// Waits (bounded) until the capture holds `count` lines containing `needle`.
-inline bool waitForLogCount(const log::LogCapture& logs, const std::string& needle, std::size_t count,
-                            std::chrono::milliseconds timeout = kWait) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (logs.count(needle) < count) {
-    if (std::chrono::steady_clock::now() > deadline) {
-      return false;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  return true;
-}
 
 inline bool isUUIDString(const std::string& s) {
   static const std::regex uuid("^[0-9A-F]{8}-[0-9A-F]{4}-[0-9A-F]{4}-[0-9A-F]{4}-[0-9A-F]{12}$");
