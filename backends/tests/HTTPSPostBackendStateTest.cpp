@@ -384,9 +384,9 @@ TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
   }
   if (row.perCountryGB) {
     // Another country's entry first: only the device's own applies.
+    const Value gb(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", *row.perCountryGB}});
     client.set("per_country_sampling_thresholds",
-               Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}),
-                     Value(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", *row.perCountryGB}})});
+               Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}), gb});
   }
   if (row.override) {
     client.set("override_sampling", *row.override);
@@ -400,7 +400,7 @@ TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Paths, OverrideSamplingTest, ::testing::ValuesIn(kOverrideRows),
-                         [](const ::testing::TestParamInfo<OverrideRow>& info) { return std::string(info.param.name); });
+                         [](const auto& info) { return std::string(info.param.name); });
 
 // A later decision that ends before the sampling step (here the locale)
 // leaves no override from the earlier one.

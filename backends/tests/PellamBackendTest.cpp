@@ -42,7 +42,8 @@ TEST_F(PellamBackendTest, RegisteredEventCarriesNumbersOverPayloadKeys) {
   EXPECT_EQ(first["category"], 28);
   EXPECT_EQ(first["event"], "Hollond-ZTH");
   EXPECT_EQ(first["payload"].dump(), R"({"event":65535,"watts":2.5,"respCode":4,"method":3})");
-  EXPECT_EQ(nlohmann::ordered_json::parse(lines[1])["payload"].dump(), R"({"b":true,"method":9,"respCode":0,"event":1})");
+  EXPECT_EQ(nlohmann::ordered_json::parse(lines[1])["payload"].dump(),
+            R"({"b":true,"method":9,"respCode":0,"event":1})");
   // The caller's payload is not changed.
   EXPECT_EQ(payload["event"], Value("client's own"));
 }

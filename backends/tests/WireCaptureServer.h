@@ -3,7 +3,8 @@
 // A TLS server on 127.0.0.1, port 0, that keeps the exact bytes of each
 // request as they came off the wire (header lines in their order, the body
 // as sent), which the recording HTTPS test server cannot: its library sorts
-// the headers. It answers every request with 200 and closes the connection. It also counts handshakes that failed, so a test can tell a
+// the headers. It answers every request with 200 and closes the
+// connection. It also counts handshakes that failed, so a test can tell a
 // refused connection (no request bytes at all) from one that sent its
 // request.
 //
