@@ -1,13 +1,18 @@
 #pragma once
 
 // Scenario helpers of the backend tests: installing an adaptor plugin into
-// the temporary root and reading line files.
+// the temporary root, reading line files, a backend's self version and what
+// it counted.
+
+#include <gtest/gtest.h>
 
 #include <filesystem>
 #include <fstream>
 #include <string>
 #include <vector>
 
+#include "backends/BackendCounters.h"
+#include "backends/ZerithBackend.h"
 #include "platform/Paths.h"
 
 namespace zerith::test {
@@ -25,6 +30,31 @@ inline std::vector<std::string> readLines(const std::filesystem::path& path) {
     lines.push_back(line);
   }
   return lines;
+}
+
+// "major.middle.minor" of a backend's self version, as it keeps it for its
+// subclasses.
+inline std::string selfVersionOf(const ZerithBackend& b) {
+  struct Peek : ZerithBackend {
+    using ZerithBackend::selfVersionMajor;
+    using ZerithBackend::selfVersionMiddle;
+    using ZerithBackend::selfVersionMinor;
+  };
+  return std::to_string((b.*&Peek::selfVersionMajor)()) + "." + std::to_string((b.*&Peek::selfVersionMiddle)()) +
+         "." + std::to_string((b.*&Peek::selfVersionMinor)());
+}
+
+// Every count but the ones named is 0.
+inline void expectOnly(const BackendCounters& counters,
+                       std::initializer_list<std::pair<BackendCount, std::uint64_t>> wanted) {
+  for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
+    const auto kind = static_cast<BackendCount>(i);
+    std::uint64_t expected = 0;
+    for (const auto& [k, n] : wanted) {
+      expected = k == kind ? n : expected;
+    }
+    EXPECT_EQ(counters.get(kind), expected) << backendCountName(kind);
+  }
 }
 
 }  // namespace zerith::test

@@ -23,18 +23,10 @@ namespace {
 
 using log::Level;
 
-// Reads the fields a backend keeps for its subclasses.
+// Reads the start time a backend keeps for its subclasses.
 struct Peek : ZerithBackend {
-  using ZerithBackend::selfVersionMajor;
-  using ZerithBackend::selfVersionMiddle;
-  using ZerithBackend::selfVersionMinor;
   using ZerithBackend::startTimeStamp;
 };
-
-std::string selfVersionOf(const ZerithBackend& b) {
-  return std::to_string((b.*&Peek::selfVersionMajor)()) + "." + std::to_string((b.*&Peek::selfVersionMiddle)()) +
-         "." + std::to_string((b.*&Peek::selfVersionMinor)());
-}
 
 double startOf(const ZerithBackend& b) { return (b.*&Peek::startTimeStamp)(); }
 
@@ -116,10 +108,6 @@ class CreateBackendsTest : public ::testing::Test {
                                                   {"ProductType", "Velmar7,1"},
                                                   {"DeviceName", "kitchen"}})));
   }
-  void setFrameworkVersion(const char* version) {
-    root_.write("/usr/share/zerith/Info.plist",
-                plist::encodeXml(Value(Dictionary{{"BundleVersion", version}})));
-  }
 
   test::TempRoot root_;
   log::LogCapture capture_;
@@ -144,7 +132,7 @@ TEST_F(CreateBackendsTest, NilSectionOrSessionInfoGivesNilWithItsErrorAndAnEmpty
 }
 
 TEST_F(CreateBackendsTest, EveryBackendCarriesTheSessionIdentityAndDeviceFacts) {
-  setFrameworkVersion("2.5.3");
+  root_.write("/usr/share/zerith/Info.plist", plist::encodeXml(Value(Dictionary{{"BundleVersion", "2.5.3"}})));
   timeval before{};
   ::gettimeofday(&before, nullptr);
   const Value section(Dictionary{{kZerithBackendPellamlog, Value(Dictionary{})}, {kZerithBackendKovu, Value()}});
@@ -158,7 +146,7 @@ TEST_F(CreateBackendsTest, EveryBackendCarriesTheSessionIdentityAndDeviceFacts) 
     // The client version keeps its low 16 bits.
     EXPECT_EQ(std::tuple(b->sessionID(), b->compType(), b->clientVersion(), std::string(b->udid()), b->productVersion(),
                          b->buildVersion(), b->hardwareType(), b->productFamily(), b->isInternal(), b->requireUserInfo(),
-                         b->batchEvents(), b->userInfoDict(), selfVersionOf(*b)),
+                         b->batchEvents(), b->userInfoDict(), test::selfVersionOf(*b)),
               std::tuple(4242u, 13, 4464, std::string(udid_), "17.2", "21C52", "Velmar7,1", "kitchen", false, true,
                          true, userInfo_, "2.5.3"));
     EXPECT_GE(startOf(*b), timevalToSeconds(before));
@@ -178,7 +166,7 @@ TEST_F(CreateBackendsTest, MissingDeviceFactsFlagsAndFrameworkVersionStayEmptyOr
                        b->batchEvents(), b->userInfoDict(), b->udid()),
             std::tuple(std::nullopt, std::nullopt, 0u, 8, false, false, Value(), nullptr));
   // A framework bundle without a version reports 8.0.
-  EXPECT_EQ(selfVersionOf(*b), "8.0.0");
+  EXPECT_EQ(test::selfVersionOf(*b), "8.0.0");
 }
 
 }  // namespace

@@ -10,6 +10,7 @@
 #include <set>
 
 #include "backends/DashboardDatagram.h"
+#include "backends/tests/BackendTestSupport.h"
 #include "platform/Log.h"
 #include "platform/PropertyList.h"
 #include "tests/support/HttpsTestServer.h"
@@ -29,14 +30,12 @@ using namespace std::chrono_literals;
 constexpr char kUdid[] = "0123456789abcdef0123456789abcdef01234567";
 
 Value profileFor(std::uint16_t port, std::optional<int> reliableMs = std::nullopt, Dictionary extra = {}) {
-  Dictionary p{{"ip", Value("127.0.0.1")}, {"port", Value(static_cast<int>(port))}};
+  extra.set("ip", Value("127.0.0.1"));
+  extra.set("port", Value(static_cast<int>(port)));
   if (reliableMs) {
-    p.set("reliable", Value(*reliableMs));
+    extra.set("reliable", Value(*reliableMs));
   }
-  for (const auto& [k, v] : extra) {
-    p.set(k, v);
-  }
-  return Value(p);
+  return Value(std::move(extra));
 }
 
 // Made by the factory, as a session makes it.
@@ -80,14 +79,12 @@ class QueueWatch : Recorder<std::pair<std::size_t, bool>> {
   // The backend outlives the test while its timer drains the queue: the
   // observer is taken away again before the watch goes.
   ~QueueWatch() { backend_.setQueueObserver(nullptr); }
-  bool waitFor(const std::function<bool(std::size_t count, bool cancelled, std::size_t changes)>& predicate) {
+  // Waits until the last report is (count, cancelled); nullopt: any count.
+  bool waitFor(std::optional<std::size_t> count, bool cancelled = false) {
     return waitUntil([&](const auto& reports) {
       const auto last = reports.empty() ? std::pair<std::size_t, bool>{0, false} : reports.back();
-      return predicate(last.first, last.second, reports.size());
+      return (!count || last.first == *count) && last.second == cancelled;
     }, 10s);
-  }
-  bool waitForCount(std::size_t count) {
-    return waitFor([count](std::size_t c, bool, std::size_t) { return c == count; });
   }
 
  private:
@@ -229,7 +226,7 @@ TEST_F(DashboardBackendTest, LossyNetworkStillGetsEveryDatagramAcknowledgedWithi
     return acknowledged.size() == kEvents;
   };
   ASSERT_TRUE(server.waitUntil(tally));
-  ASSERT_TRUE(watch.waitForCount(0));
+  ASSERT_TRUE(watch.waitFor(0));
   tally(server.arrivals());
   std::uint64_t copiesSent = 0;
   for (std::uint16_t e = 1; e <= kEvents; ++e) {
@@ -241,12 +238,11 @@ TEST_F(DashboardBackendTest, LossyNetworkStillGetsEveryDatagramAcknowledgedWithi
   // Every event handed over once and acknowledged once; each further copy
   // that went out whole was a retransmission (a first copy the socket did
   // not take whole is not one, but loopback takes them all).
-  EXPECT_EQ(b->counters().get(BackendCount::sent), kEvents);
-  EXPECT_EQ(b->counters().get(BackendCount::delivered), kEvents);
-  EXPECT_EQ(b->counters().get(BackendCount::retried), copiesSent - kEvents);
-  EXPECT_EQ(b->counters().get(BackendCount::droppedTransportError), 0u);
+  expectOnly(b->counters(), {{BackendCount::sent, kEvents},
+                             {BackendCount::delivered, kEvents},
+                             {BackendCount::retried, copiesSent - kEvents}});
   b->cleanup();
-  ASSERT_TRUE(watch.waitFor([](std::size_t, bool cancelled, std::size_t) { return cancelled; }));
+  ASSERT_TRUE(watch.waitFor(std::nullopt, true));
 }
 
 // Asked to clean up with a datagram still unanswered, the backend sends it
@@ -256,9 +252,9 @@ TEST_F(DashboardBackendTest, UnansweredDatagramIsSentFiveTimesThenDroppedBeforeT
   ASSERT_NE(b, nullptr);
   QueueWatch watch(*b);
   send(*b, Value(Dictionary{{"k", Value("v")}}), at(1, 0), 1, 2, 9);
-  ASSERT_TRUE(watch.waitForCount(1));
+  ASSERT_TRUE(watch.waitFor(1));
   b->cleanup();
-  ASSERT_TRUE(watch.waitFor([](std::size_t count, bool cancelled, std::size_t) { return cancelled && count == 0; }));
+  ASSERT_TRUE(watch.waitFor(0, true));
   EXPECT_TRUE(logs.has(Level::Debug, "DashboardBackend(myPeriodicTask): clean up at myPeriodicTask."));
   EXPECT_EQ(b->socketDescriptor(), -1);
   // The last copy leaves the queue as it is sent; the server may read it a
@@ -269,10 +265,8 @@ TEST_F(DashboardBackendTest, UnansweredDatagramIsSentFiveTimesThenDroppedBeforeT
   for (const auto& d : arrivals) {
     EXPECT_EQ(d.bytes, arrivals[0].bytes);
   }
-  EXPECT_EQ(b->counters().get(BackendCount::sent), 1u);
-  EXPECT_EQ(b->counters().get(BackendCount::retried), 4u);
-  EXPECT_EQ(b->counters().get(BackendCount::droppedTransportError), 1u);
-  EXPECT_EQ(b->counters().get(BackendCount::delivered), 0u);
+  expectOnly(b->counters(),
+             {{BackendCount::sent, 1}, {BackendCount::retried, 4}, {BackendCount::droppedTransportError, 1}});
 }
 
 TEST_F(DashboardBackendTest, FiftyFirstQueuedDatagramPushesOutTheOldest) {
@@ -287,8 +281,7 @@ TEST_F(DashboardBackendTest, FiftyFirstQueuedDatagramPushesOutTheOldest) {
   EXPECT_EQ(queue.front().eventNumber, 2);
   EXPECT_EQ(queue.back().eventNumber, 51);
   EXPECT_EQ(queue.front().state, UDPPacketToSend::kAwaitingAcknowledgement);
-  EXPECT_EQ(b->counters().get(BackendCount::sent), 51u);
-  EXPECT_EQ(b->counters().get(BackendCount::droppedQueueFull), 1u);
+  expectOnly(b->counters(), {{BackendCount::sent, 51}, {BackendCount::droppedQueueFull, 1}});
   b->cleanup();
 }
 
@@ -299,7 +292,7 @@ TEST_F(DashboardBackendTest, ShortLongForgedAndUnknownAcknowledgementsAreIgnored
   for (const std::uint16_t e : {std::uint16_t{4}, std::uint16_t{4}, std::uint16_t{5}}) {
     send(*b, Value(Dictionary{}), at(1, 0), 1, 2, e);
   }
-  ASSERT_TRUE(watch.waitForCount(3));
+  ASSERT_TRUE(watch.waitFor(3));
   const std::uint16_t port = b->boundPort();
 
   server.sendTo(port, ackFor(5, 61));    // too short to hold an event number
@@ -319,7 +312,7 @@ TEST_F(DashboardBackendTest, ShortLongForgedAndUnknownAcknowledgementsAreIgnored
   // One valid acknowledgement for the duplicated number: only the first
   // record goes; it arrives after the others, so they were all seen.
   server.sendTo(port, ackFor(4));
-  ASSERT_TRUE(watch.waitForCount(2));
+  ASSERT_TRUE(watch.waitFor(2));
   const auto queue = b->messageQueueSnapshot();
   ASSERT_EQ(queue.size(), 2u);
   EXPECT_EQ(queue[0].eventNumber, 4);

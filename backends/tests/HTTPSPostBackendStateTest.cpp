@@ -165,8 +165,7 @@ TEST_F(HTTPSStateTest, ClientNamesMatchExactlyAndServicesBySubstringIgnoringCase
 }
 
 TEST_F(HTTPSStateTest, FrameworkVersionGateComparesMajorMiddleMinor) {
-  auto b = backend(profileWith({enablingClient("https://x/")}));
-  b->setSelfVersion("8.1.0");
+  auto b = backend(profileWith({enablingClient("https://x/")}));  // framework 8.1.0
   EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{})));
   EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "8.1"}})));
   EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "7.9.9"}})));
@@ -286,7 +285,6 @@ TEST_F(HTTPSStateTest, WrongTypesInEveryProfileKeyAreLoggedAndNeverCrash) {
 TEST_F(HTTPSStateTest, NegativeAndStringThresholdsKeepTheBackendWorking) {
   auto client = enablingClient(server.url("/post"));
   client.set("event_threshold", -3);
-  server.on("/post", Reply{});
   auto b = backend(profileWith({client}), userInfo(), true, true);
   ASSERT_EQ(b->eventThreshold(), -3);
   EXPECT_TRUE(logs.contains("resetBackendStateWithClient: event_threshold -3 is negative"));
@@ -306,7 +304,6 @@ TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndU
                               Value(Dictionary{{"key", "clientName"}, {"action", "sha256"}}),
                               Value(Dictionary{{"key", "bytes"}, {"action", "shred"}}),
                               Value("not a filter")});
-  server.on("/post", Reply{});
   auto b = backend(profileWith({client}), userInfo(), true, true);
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   EXPECT_EQ(b->numberOfFilters(), 6);
@@ -356,11 +353,24 @@ TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndU
 struct OverrideRow {
   const char* name;
   double factor;
-  Value threshold;          // "sampling_threshold"; nil: absent
-  Value perCountryGB;       // a per-country threshold for GB; nil: none
-  Value override;           // "override_sampling"; nil: absent
+  std::optional<double> threshold;     // "sampling_threshold"
+  std::optional<double> perCountryGB;  // a per-country threshold for GB
+  std::optional<double> override;      // "override_sampling"
   std::int32_t state;
-  Value reported;           // what the end report carries
+  std::optional<double> reported;  // what the end report carries; nullopt: -1
+};
+
+const OverrideRow kOverrideRows[] = {
+    {"DrawBelowThresholdEnables", 0.1, 0.25, {}, {}, kBackendStateEnabled, {}},
+    {"DrawAboveThresholdSamplesOut", 0.3, 0.25, {}, {}, kBackendStateSampledOut, {}},
+    {"DrawAtThresholdSamplesOut", 0.25, 0.25, {}, {}, kBackendStateSampledOut, {}},
+    {"DrawPastThresholdBelowOverrideSamplesOut", 0.3, 0.25, {}, 0.5, kBackendStateSampledOut, 0.5},
+    {"PlainThresholdEnables", 0.3, 1.0, {}, 0.5, kBackendStateEnabled, {}},
+    {"PlainDrawAtThresholdKeptByOverride", 0.5, 0.5, {}, 0.9, kBackendStateSampledOut, 0.9},
+    {"PlainDrawPastOverrideDisables", 0.95, 0.5, {}, 0.9, kBackendStateDisabled, 0.9},
+    {"NoThresholdDisablesWithoutOverride", 0.1, {}, {}, 0.5, kBackendStateDisabled, {}},
+    {"PerCountryThresholdEnables", 0.3, 0.0, 1.0, 0.0, kBackendStateEnabled, {}},
+    {"PerCountryThresholdSamplesOut", 0.6, 1.0, 0.5, 0.8, kBackendStateSampledOut, 0.8},
 };
 
 class OverrideSamplingTest : public HTTPSBackendTest, public ::testing::WithParamInterface<OverrideRow> {};
@@ -369,46 +379,28 @@ TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
   const OverrideRow& row = GetParam();
   auto client = enablingClient(server.url("/post"));
   client.erase("sampling_threshold");
-  if (!row.threshold.isNil()) {
-    client.set("sampling_threshold", row.threshold);
+  if (row.threshold) {
+    client.set("sampling_threshold", *row.threshold);
   }
-  if (!row.perCountryGB.isNil()) {
+  if (row.perCountryGB) {
     // Another country's entry first: only the device's own applies.
+    const Value gb(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", *row.perCountryGB}});
     client.set("per_country_sampling_thresholds",
-               Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}),
-                     Value(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", row.perCountryGB}})});
+               Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}), gb});
   }
-  if (!row.override.isNil()) {
-    client.set("override_sampling", row.override);
+  if (row.override) {
+    client.set("override_sampling", *row.override);
   }
   auto b = backend(profileWith({client}));
   b->setSamplingFactor(row.factor);
   b->updateState();
   EXPECT_EQ(b->state(), row.state);
-  EXPECT_EQ(b->overrideSampling().isNil() ? Value(-1) : b->overrideSampling(), row.reported);
+  EXPECT_EQ(b->overrideSampling().isNil() ? Value(-1) : b->overrideSampling(),
+            row.reported ? Value(*row.reported) : Value(-1));
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Paths, OverrideSamplingTest,
-    ::testing::Values(
-        OverrideRow{"DrawBelowThresholdEnables", 0.1, Value(0.25), Value(), Value(), kBackendStateEnabled, Value(-1)},
-        OverrideRow{"DrawAboveThresholdSamplesOut", 0.3, Value(0.25), Value(), Value(), kBackendStateSampledOut,
-                    Value(-1)},
-        OverrideRow{"DrawAtThresholdSamplesOut", 0.25, Value(0.25), Value(), Value(), kBackendStateSampledOut,
-                    Value(-1)},
-        OverrideRow{"DrawPastThresholdBelowOverrideSamplesOut", 0.3, Value(0.25), Value(), Value(0.5),
-                    kBackendStateSampledOut, Value(0.5)},
-        OverrideRow{"PlainThresholdEnables", 0.3, Value(1.0), Value(), Value(0.5), kBackendStateEnabled, Value(-1)},
-        OverrideRow{"PlainDrawAtThresholdKeptByOverride", 0.5, Value(0.5), Value(), Value(0.9), kBackendStateSampledOut,
-                    Value(0.9)},
-        OverrideRow{"PlainDrawPastOverrideDisables", 0.95, Value(0.5), Value(), Value(0.9), kBackendStateDisabled,
-                    Value(0.9)},
-        OverrideRow{"NoThresholdDisablesWithoutOverride", 0.1, Value(), Value(), Value(0.5), kBackendStateDisabled,
-                    Value(-1)},
-        OverrideRow{"PerCountryThresholdEnables", 0.3, Value(0.0), Value(1.0), Value(0.0), kBackendStateEnabled, Value(-1)},
-        OverrideRow{"PerCountryThresholdSamplesOut", 0.6, Value(1.0), Value(0.5), Value(0.8), kBackendStateSampledOut,
-                    Value(0.8)}),
-    [](const ::testing::TestParamInfo<OverrideRow>& info) { return std::string(info.param.name); });
+INSTANTIATE_TEST_SUITE_P(Paths, OverrideSamplingTest, ::testing::ValuesIn(kOverrideRows),
+                         [](const auto& info) { return std::string(info.param.name); });
 
 // A later decision that ends before the sampling step (here the locale)
 // leaves no override from the earlier one.

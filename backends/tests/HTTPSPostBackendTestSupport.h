@@ -2,7 +2,7 @@
 
 // Scenario helpers of the HTTPS backend tests: a fixture with a temporary
 // root, the test CA trusted, a recording HTTPS server and a real
-// connectivity helper; profiles; flushes and posts that wait for their
+// connectivity helper, "/post" answered 200; profiles; flushes and posts that wait for their
 // completion; what the backend counted; gzip inflation and an independent
 // HMAC.
 
@@ -19,6 +19,7 @@
 #include <nlohmann/json.hpp>
 
 #include "backends/HTTPSPostBackend.h"
+#include "backends/tests/BackendTestSupport.h"
 #include "config/ClientTypes.h"
 #include "config/DeviceInfo.h"
 #include "config/tests/ScopedEnv.h"
@@ -137,6 +138,7 @@ class HTTPSBackendTest : public ::testing::Test {
     ASSERT_TRUE(URLSession::setExtraCAFile(TestCA::shared().caFile().string()));
     transport = ReportingSessionConnectivityHelper::initWithDelegate({}, 4);
     Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(true));
+    server.on("/post", Reply{});  // a collector that takes everything, unless a test says otherwise
   }
   void TearDown() override {
     transport->invalidate();
@@ -177,28 +179,16 @@ class HTTPSBackendTest : public ::testing::Test {
 
   static timeval at(long seconds, long micros = 0) { return timeval{seconds, micros}; }
 
-  // Every count but the ones named is 0.
-  static void expectOnly(const ZerithBackend& b, std::initializer_list<std::pair<BackendCount, std::uint64_t>> wanted) {
-    for (std::size_t i = 0; i < kBackendCountKinds; ++i) {
-      const auto kind = static_cast<BackendCount>(i);
-      std::uint64_t expected = 0;
-      for (const auto& [k, n] : wanted) {
-        expected = k == kind ? n : expected;
-      }
-      EXPECT_EQ(b.counters().get(kind), expected) << backendCountName(kind);
+  // Flushes, or posts `json` as it is, and waits for the completion; its error, if any.
+  static std::optional<Error> flush(HTTPSPostBackend& b) { return completed(b, std::nullopt); }
+  static std::optional<Error> post(HTTPSPostBackend& b, const std::string& json) { return completed(b, json); }
+  static std::optional<Error> completed(HTTPSPostBackend& b, const std::optional<std::string>& json) {
+    auto results = ResultLog::make();
+    if (json) {
+      b.postJSONMessage(*json, 0, std::nullopt, std::nullopt, results->handler());
+    } else {
+      b.flushMessagesWithCompletion(results->handler());
     }
-  }
-  // Flushes and waits for the completion; its error, if any.
-  static std::optional<Error> flush(HTTPSPostBackend& b) {
-    auto results = ResultLog::make();
-    b.flushMessagesWithCompletion(results->handler());
-    EXPECT_TRUE(results->waitFor(1));
-    return results->errors().empty() ? std::nullopt : results->errors()[0];
-  }
-  // Posts `json` as it is and waits for the completion; its error, if any.
-  static std::optional<Error> post(HTTPSPostBackend& b, const std::string& json) {
-    auto results = ResultLog::make();
-    b.postJSONMessage(json, 0, std::nullopt, std::nullopt, results->handler());
     EXPECT_TRUE(results->waitFor(1));
     return results->errors().empty() ? std::nullopt : results->errors()[0];
   }

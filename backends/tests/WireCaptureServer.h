@@ -3,7 +3,7 @@
 // A TLS server on 127.0.0.1, port 0, that keeps the exact bytes of each
 // request as they came off the wire (header lines in their order, the body
 // as sent), which the recording HTTPS test server cannot: its library sorts
-// the headers. It answers every request with a fixed status and closes the
+// the headers. It answers every request with 200 and closes the
 // connection. It also counts handshakes that failed, so a test can tell a
 // refused connection (no request bytes at all) from one that sent its
 // request.
@@ -46,9 +46,7 @@ class WireCaptureServer {
     std::string body;
   };
 
-  explicit WireCaptureServer(const IssuedCertificate& certificate = TestCA::shared().serverCertificate(),
-                             int status = 200)
-      : status_(status) {
+  explicit WireCaptureServer(const IssuedCertificate& certificate = TestCA::shared().serverCertificate()) {
     ctx_ = SSL_CTX_new(TLS_server_method());
     BIO* certBio = BIO_new_mem_buf(certificate.certificatePem.data(), static_cast<int>(certificate.certificatePem.size()));
     X509* cert = PEM_read_bio_X509(certBio, nullptr, nullptr, nullptr);
@@ -148,9 +146,9 @@ class WireCaptureServer {
       if (headerEnd == std::string::npos) {
         headerEnd = raw.find("\r\n\r\n");
         if (headerEnd != std::string::npos) {
-          const auto at = lowerCopy(raw.substr(0, headerEnd)).find("\r\ncontent-length:");
-          if (at != std::string::npos) {
-            contentLength = std::stoul(raw.substr(at + 17));
+          const std::string head = raw.substr(0, headerEnd);
+          if (const char* at = ::strcasestr(head.c_str(), "\r\ncontent-length:")) {
+            contentLength = std::stoul(std::string(at + 17));
           }
         }
       }
@@ -172,7 +170,7 @@ class WireCaptureServer {
       }
       request.body = raw.substr(headerEnd + 4);
     }
-    const std::string answer = "HTTP/1.1 " + std::to_string(status_) + " Status\r\nContent-Length: 0\r\nConnection: close\r\n\r\n";
+    const std::string answer = "HTTP/1.1 200 OK\r\nContent-Length: 0\r\nConnection: close\r\n\r\n";
     SSL_write(ssl, answer.data(), static_cast<int>(answer.size()));
     SSL_shutdown(ssl);
     SSL_free(ssl);
@@ -186,14 +184,6 @@ class WireCaptureServer {
     changed_.notify_all();
   }
 
-  static std::string lowerCopy(std::string s) {
-    for (char& c : s) {
-      c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-    }
-    return s;
-  }
-
-  const int status_;
   SSL_CTX* ctx_ = nullptr;
   int fd_ = -1;
   int port_ = 0;

@@ -4,6 +4,7 @@
 #include <vector>
 
 #include "backends/ZerithBackend.h"
+#include "backends/tests/BackendTestSupport.h"
 
 namespace zerith {
 namespace {
@@ -23,9 +24,6 @@ class ProbeBackend : public ZerithBackend {
   }
 
   using ZerithBackend::eventID;
-  using ZerithBackend::selfVersionMajor;
-  using ZerithBackend::selfVersionMiddle;
-  using ZerithBackend::selfVersionMinor;
   using ZerithBackend::setEventBlacklist;
   using ZerithBackend::setEventWhitelist;
   using ZerithBackend::stateQueue;
@@ -34,26 +32,21 @@ class ProbeBackend : public ZerithBackend {
   std::int32_t lastFlag = 0;
 };
 
-struct Version {
-  int major, middle, minor;
-  bool operator==(const Version&) const = default;
-};
-
-Version selfVersionOf(std::string_view text) {
+std::string selfVersionOf(std::string_view text) {
   ProbeBackend b;
   b.setSelfVersion(text);
-  return {b.selfVersionMajor(), b.selfVersionMiddle(), b.selfVersionMinor()};
+  return test::selfVersionOf(b);
 }
 
 TEST(ZerithBackendTest, SelfVersionSplitsIntoThreeTruncatedBytes) {
-  EXPECT_EQ(selfVersionOf("3"), (Version{3, 0, 0}));
-  EXPECT_EQ(selfVersionOf("3.1"), (Version{3, 1, 0}));
-  EXPECT_EQ(selfVersionOf("3.1.4.1"), (Version{3, 1, 4}));
-  EXPECT_EQ(selfVersionOf("300.1"), (Version{44, 1, 0}));
-  EXPECT_EQ(selfVersionOf("8.1.0"), (Version{8, 1, 0}));
-  EXPECT_EQ(selfVersionOf(""), (Version{0, 0, 0}));
-  EXPECT_EQ(selfVersionOf("2.x.7b"), (Version{2, 0, 7}));
-  EXPECT_EQ(selfVersionOf("-1.256.257"), (Version{255, 0, 1}));
+  EXPECT_EQ(selfVersionOf("3"), "3.0.0");
+  EXPECT_EQ(selfVersionOf("3.1"), "3.1.0");
+  EXPECT_EQ(selfVersionOf("3.1.4.1"), "3.1.4");
+  EXPECT_EQ(selfVersionOf("300.1"), "44.1.0");
+  EXPECT_EQ(selfVersionOf("8.1.0"), "8.1.0");
+  EXPECT_EQ(selfVersionOf(""), "0.0.0");
+  EXPECT_EQ(selfVersionOf("2.x.7b"), "2.0.7");
+  EXPECT_EQ(selfVersionOf("-1.256.257"), "255.0.1");
 }
 
 TEST(ZerithBackendTest, FirstEventIsNumberOneAndTheNumberWrapsAt16Bits) {
