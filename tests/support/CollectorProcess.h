@@ -9,6 +9,7 @@
 //   auto line = collector.nextLine("record");
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
 #include <unistd.h>
 
@@ -18,11 +19,24 @@
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "tests/support/Command.h"
 
 namespace zerith::test {
+
+// Whether `line` has every member of the JSON object `expected` with its
+// value, members that are objects on both sides compared the same way (it
+// may have others).
+inline ::testing::AssertionResult hasMembers(const nlohmann::ordered_json& line, std::string_view expected) {
+  nlohmann::ordered_json merged = line;
+  merged.merge_patch(nlohmann::ordered_json::parse(expected.begin(), expected.end()));
+  if (merged == line) {
+    return ::testing::AssertionSuccess();
+  }
+  return ::testing::AssertionFailure() << line.dump() << " differs from " << expected;
+}
 
 class CollectorProcess {
  public:
