@@ -97,9 +97,6 @@ class PeerBoundsTest : public E2eTest {
   // Without --debug, where lines that peers cause are rate-limited.
   DaemonProcess& startQuietDaemon(DaemonProcess::Options options = {}) {
     options.debug = false;
-    if (options.arguments.empty()) {
-      options.arguments = {"--stop-timeout", "5"};
-    }
     return startDaemon(std::move(options));
   }
 

@@ -9,20 +9,34 @@
 //   auto line = collector.nextLine("record");
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
-#include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdlib>
+#include <memory>
+#include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
-#include <nlohmann/json.hpp>
+#include "tests/support/Command.h"
 
 namespace zerith::test {
+
+// Whether `line` has every member of the JSON object `expected` with its
+// value, members that are objects on both sides compared the same way (it
+// may have others).
+inline ::testing::AssertionResult hasMembers(const nlohmann::ordered_json& line, std::string_view expected) {
+  nlohmann::ordered_json merged = line;
+  merged.merge_patch(nlohmann::ordered_json::parse(expected.begin(), expected.end()));
+  if (merged == line) {
+    return ::testing::AssertionSuccess();
+  }
+  return ::testing::AssertionFailure() << line.dump() << " differs from " << expected;
+}
 
 class CollectorProcess {
  public:
@@ -32,37 +46,25 @@ class CollectorProcess {
     if (::pipe2(out, O_CLOEXEC) != 0 || ::pipe2(err, O_CLOEXEC) != 0) {
       return;
     }
-    pid_ = ::fork();
-    if (pid_ == 0) {
-      ::dup2(out[1], 1);
-      ::dup2(err[1], 2);
-      args.insert(args.begin(), tool);
-      std::vector<char*> argv;
-      for (auto& a : args) {
-        argv.push_back(a.data());
-      }
-      argv.push_back(nullptr);
-      ::execv(argv[0], argv.data());
-      ::_exit(127);
+    out_.reset(out[0]);
+    err_.reset(err[0]);
+    args.insert(args.begin(), tool);
+    {
+      // Only the child keeps the writing ends: its end is our end of file.
+      const file::UniqueFd outWrite(out[1]);
+      const file::UniqueFd errWrite(err[1]);
+      child_ = std::make_unique<ChildProcess>(args, std::vector<std::pair<int, int>>{{out[1], 1}, {err[1], 2}});
     }
-    ::close(out[1]);
-    ::close(err[1]);
-    out_ = out[0];
-    err_ = err[0];
     // Ready once it says where it listens.
     while (said_.find("listening on ") == std::string::npos || said_.back() != '\n') {
-      if (!readSome(err_, said_)) {
+      if (!readSome(err_.get(), said_)) {
         break;
       }
     }
     const auto at = said_.rfind(':');
     port_ = at == std::string::npos ? 0 : std::atoi(said_.c_str() + at + 1);
   }
-  ~CollectorProcess() {
-    stop();
-    ::close(out_);
-    ::close(err_);
-  }
+  ~CollectorProcess() { stop(); }
   CollectorProcess(const CollectorProcess&) = delete;
   CollectorProcess& operator=(const CollectorProcess&) = delete;
 
@@ -86,18 +88,15 @@ class CollectorProcess {
         }
         continue;
       }
-      if (!readSome(out_, pending_, timeout)) {
+      if (!readSome(out_.get(), pending_, timeout)) {
         return std::nullopt;
       }
     }
   }
 
   void stop() {
-    if (pid_ > 0) {
-      ::kill(pid_, SIGTERM);
-      int status = 0;
-      ::waitpid(pid_, &status, 0);
-      pid_ = -1;
+    if (child_) {
+      child_->stop(std::chrono::seconds(5));
     }
   }
 
@@ -116,9 +115,9 @@ class CollectorProcess {
     return true;
   }
 
-  pid_t pid_ = -1;
-  int out_ = -1;
-  int err_ = -1;
+  std::unique_ptr<ChildProcess> child_;
+  file::UniqueFd out_;
+  file::UniqueFd err_;
   int port_ = 0;
   std::string said_;
   std::string pending_;

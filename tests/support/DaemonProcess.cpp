@@ -2,12 +2,8 @@
 
 #include <fcntl.h>
 #include <poll.h>
-#include <signal.h>
-#include <spawn.h>
 #include <sys/socket.h>
-#include <sys/syscall.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -25,8 +21,6 @@ extern char** environ;
 namespace zerith::test {
 
 namespace {
-
-using Clock = std::chrono::steady_clock;
 
 // "2024-05-01 10:00:00.123456 daemon[debug] text" -> level and text; a line
 // of another shape counts as an error with its whole text.
@@ -107,34 +101,8 @@ DaemonProcess::DaemonProcess(const TempRoot& root, Options options) {
   for (const auto& [k, v] : options.environment) {
     env.push_back(k + "=" + v);
   }
-  const auto pointers = [](std::vector<std::string>& strings) {
-    std::vector<char*> out;
-    for (auto& s : strings) {
-      out.push_back(s.data());
-    }
-    out.push_back(nullptr);
-    return out;
-  };
-  std::vector<char*> argv = pointers(args);
-  std::vector<char*> envp = pointers(env);
-
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_adddup2(&actions, stderrWrite.get(), STDERR_FILENO);
-  posix_spawnattr_t attr;
-  posix_spawnattr_init(&attr);
-  // The child starts with no signal blocked, whatever this thread blocks.
-  sigset_t none;
-  sigemptyset(&none);
-  posix_spawnattr_setsigmask(&attr, &none);
-  posix_spawnattr_setflags(&attr, POSIX_SPAWN_SETSIGMASK);
-  const int rc = posix_spawn(&pid_, argv[0], &actions, &attr, argv.data(), envp.data());
-  posix_spawn_file_actions_destroy(&actions);
-  posix_spawnattr_destroy(&attr);
-  if (rc != 0) {
-    throw std::runtime_error("cannot start " + args[0] + ": " + std::strerror(rc));
-  }
-  pidFd_.reset(static_cast<int>(::syscall(SYS_pidfd_open, pid_, 0)));
+  child_ =
+      std::make_unique<ChildProcess>(args, std::vector<std::pair<int, int>>{{stderrWrite.get(), STDERR_FILENO}}, env);
   reader_ = std::thread([this] { readLoop(); });
   std::unique_lock lock(mutex_);
   changed_.wait_for(lock, options.readyTimeout, [this] { return ready_ || !stderrRead_; });
@@ -142,7 +110,7 @@ DaemonProcess::DaemonProcess(const TempRoot& root, Options options) {
 
 DaemonProcess::~DaemonProcess() {
   if (running()) {
-    ::kill(pid_, SIGKILL);
+    signal(SIGKILL);
     waitForExit(std::chrono::milliseconds(10000));
   }
   if (wakeWrite_) {
@@ -217,8 +185,6 @@ bool DaemonProcess::ready() const {
   return ready_;
 }
 
-bool DaemonProcess::running() { return pid_ > 0 && !exitStatus_ && !waitForExit(std::chrono::milliseconds(0)); }
-
 std::string DaemonProcess::output() const {
   std::lock_guard lock(mutex_);
   return output_;
@@ -267,43 +233,14 @@ bool DaemonProcess::waitForExact(log::Level level, std::string_view text, std::s
   return waitLines(exactly(level, text), occurrences, timeout);
 }
 
-void DaemonProcess::signal(int sig) {
-  if (pid_ > 0 && !exitStatus_) {
-    ::kill(pid_, sig);
-  }
-}
-
 std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout) {
-  if (exitStatus_ || pid_ <= 0) {
-    return exitStatus_;
+  const auto status = child_->waitForExit(timeout);
+  if (status) {
+    // Everything the process wrote is read before the caller looks at it.
+    std::unique_lock lock(mutex_);
+    changed_.wait_for(lock, std::max(timeout, std::chrono::milliseconds(5000)), [this] { return !stderrRead_; });
   }
-  const auto deadline = Clock::now() + timeout;
-  if (pidFd_) {
-    pollfd fd{pidFd_.get(), POLLIN, 0};
-    int rc;
-    do {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
-      rc = ::poll(&fd, 1, static_cast<int>(std::max<long long>(left, 0)));
-    } while (rc < 0 && errno == EINTR);
-    if (rc == 0) {
-      return std::nullopt;
-    }
-  }
-  int status = 0;
-  if (::waitpid(pid_, &status, pidFd_ ? 0 : WNOHANG) != pid_) {
-    return std::nullopt;
-  }
-  exitStatus_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  // Everything the process wrote is read before the caller looks at it.
-  std::unique_lock lock(mutex_);
-  changed_.wait_until(lock, std::max(deadline, Clock::now() + std::chrono::seconds(5)),
-                      [this] { return !stderrRead_; });
-  return exitStatus_;
-}
-
-std::optional<int> DaemonProcess::stop(std::chrono::milliseconds timeout) {
-  signal(SIGTERM);
-  return waitForExit(timeout);
+  return status;
 }
 
 std::unique_ptr<DaemonProcess> startEntitledDaemon(TempRoot& root, const char* builtBinary) {

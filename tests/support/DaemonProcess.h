@@ -6,7 +6,7 @@
 // stopped with SIGTERM (or killed when the test ends first). Every wait is
 // bounded, so a daemon that hangs fails the test instead of hanging it.
 
-#include <sys/types.h>
+#include <signal.h>
 
 #include <chrono>
 #include <condition_variable>
@@ -23,6 +23,7 @@
 
 #include "platform/FileUtil.h"
 #include "platform/Log.h"
+#include "tests/support/Command.h"
 
 namespace zerith::test {
 
@@ -45,8 +46,8 @@ class DaemonProcess {
   DaemonProcess& operator=(const DaemonProcess&) = delete;
 
   bool ready() const;
-  pid_t pid() const { return pid_; }
-  bool running();
+  pid_t pid() const { return child_->pid(); }
+  bool running() { return !waitForExit(std::chrono::milliseconds(0)); }
 
   // The captured standard error so far.
   std::string output() const;
@@ -63,12 +64,15 @@ class DaemonProcess {
   // The messages received on the notify socket ("READY=1", "STATUS=...").
   std::vector<std::string> notifications() const;
 
-  void signal(int signal);
+  void signal(int signal) { child_->signal(signal); }
   // The exit status (the code, or 128 + signal), nullopt when it did not
   // exit in time.
   std::optional<int> waitForExit(std::chrono::milliseconds timeout);
   // SIGTERM, then waitForExit.
-  std::optional<int> stop(std::chrono::milliseconds timeout = std::chrono::milliseconds(10000));
+  std::optional<int> stop(std::chrono::milliseconds timeout = std::chrono::milliseconds(10000)) {
+    signal(SIGTERM);
+    return waitForExit(timeout);
+  }
 
  private:
   struct Line {
@@ -83,11 +87,9 @@ class DaemonProcess {
   std::size_t countNow(const Match& match) const;
   bool waitLines(const Match& match, std::size_t occurrences, std::chrono::milliseconds timeout) const;
 
-  pid_t pid_ = -1;
-  std::optional<int> exitStatus_;
+  std::unique_ptr<ChildProcess> child_;
   file::UniqueFd stderrRead_;
   file::UniqueFd notifySocket_;
-  file::UniqueFd pidFd_;
   file::UniqueFd wakeRead_;
   file::UniqueFd wakeWrite_;
   std::thread reader_;

@@ -4,22 +4,17 @@
 #include <fcntl.h>
 #include <netinet/in.h>
 #include <poll.h>
-#include <signal.h>
-#include <spawn.h>
-#include <sys/syscall.h>
 #include <sys/inotify.h>
 #include <sys/socket.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <fstream>
-#include <sstream>
+#include <stdexcept>
 #include <vector>
 
 #include "platform/FileUtil.h"
-#include "tests/support/Command.h"
 
 namespace zerith::test {
 
@@ -27,60 +22,23 @@ namespace {
 
 constexpr const char* kNginx = "/usr/sbin/nginx";
 
-// Waits up to `timeout` for the child to end; kills it when it does not.
-// Returns its wait status.
-int reap(pid_t pid, int timeoutMs) {
-  file::UniqueFd pidfd(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
-  if (pidfd) {
-    pollfd p{pidfd.get(), POLLIN, 0};
-    int r;
-    do {
-      r = ::poll(&p, 1, timeoutMs);
-    } while (r < 0 && errno == EINTR);
-    if (r == 0) {
-      ::kill(pid, SIGKILL);
-    }
-  }
-  int status = 0;
-  while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
-  }
-  return status;
-}
-
-// Runs nginx with `args`, its output going to `output`, with `listenFd`
-// (when >= 0) handed over as an inherited listening socket. The socket is
+// nginx with `args`, its output appended to `output`, `listenFd` (when
+// >= 0) handed over as an inherited listening socket. The socket is
 // close-on-exec here (no other child gets it); nginx gets a duplicate.
-pid_t spawnNginx(const std::vector<std::string>& args, const std::filesystem::path& output, int listenFd,
-                 std::string& error) {
+std::unique_ptr<ChildProcess> spawnNginx(std::vector<std::string> args, const std::filesystem::path& output,
+                                         int listenFd) {
+  args.insert(args.begin(), kNginx);
   const int inheritFd = listenFd == 3 ? 4 : 3;
-  std::vector<char*> argv;
-  for (const auto& a : args) {
-    argv.push_back(const_cast<char*>(a.c_str()));
-  }
-  argv.push_back(nullptr);
-  const std::string inherit = "NGINX=" + std::to_string(inheritFd) + ";";
-  std::vector<char*> envp;
+  const file::UniqueFd in(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+  const file::UniqueFd out(::open(output.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+  std::vector<std::pair<int, int>> descriptors = {
+      {in.get(), STDIN_FILENO}, {out.get(), STDOUT_FILENO}, {out.get(), STDERR_FILENO}};
+  std::vector<std::string> environment;
   if (listenFd >= 0) {
-    envp.push_back(const_cast<char*>(inherit.c_str()));
+    descriptors.emplace_back(listenFd, inheritFd);
+    environment.push_back("NGINX=" + std::to_string(inheritFd) + ";");
   }
-  envp.push_back(nullptr);
-
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
-  posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, output.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
-  posix_spawn_file_actions_adddup2(&actions, STDOUT_FILENO, STDERR_FILENO);
-  if (listenFd >= 0) {
-    posix_spawn_file_actions_adddup2(&actions, listenFd, inheritFd);
-  }
-  pid_t pid = -1;
-  const int rc = ::posix_spawn(&pid, kNginx, &actions, nullptr, argv.data(), envp.data());
-  posix_spawn_file_actions_destroy(&actions);
-  if (rc != 0) {
-    error = std::string("posix_spawn nginx: ") + std::strerror(rc);
-    return -1;
-  }
-  return pid;
+  return std::make_unique<ChildProcess>(args, descriptors, environment);
 }
 
 }  // namespace
@@ -88,8 +46,10 @@ pid_t spawnNginx(const std::vector<std::string>& args, const std::filesystem::pa
 bool NginxServer::available() { return ::access(kNginx, X_OK) == 0; }
 
 NginxServer::NginxServer(Options options, const TestCA& ca) : options_(std::move(options)) {
-  if (!start(ca)) {
-    stop();
+  try {
+    start(ca);
+  } catch (const std::runtime_error& e) {
+    error_ = e.what();
   }
 }
 
@@ -98,7 +58,6 @@ NginxServer::~NginxServer() { stop(); }
 std::string NginxServer::url(std::string_view path) const {
   return "https://127.0.0.1:" + std::to_string(port_) + std::string(path);
 }
-
 
 std::string NginxServer::accessLog() const { return readText(options_.workDir / "access.log"); }
 
@@ -127,10 +86,10 @@ bool NginxServer::waitForAccessLog(std::string_view needle, std::chrono::millise
   }
 }
 
-bool NginxServer::start(const TestCA& ca) {
+void NginxServer::start(const TestCA& ca) {
   if (!available()) {
     error_ = "nginx is not installed";
-    return false;
+    return;
   }
   namespace fs = std::filesystem;
   const fs::path dir = fs::absolute(options_.workDir);
@@ -149,7 +108,7 @@ bool NginxServer::start(const TestCA& ca) {
       ::listen(listener.get(), 128) != 0 ||
       ::getsockname(listener.get(), reinterpret_cast<sockaddr*>(&address), &length) != 0) {
     error_ = std::string("listening socket: ") + std::strerror(errno);
-    return false;
+    return;
   }
   port_ = ntohs(address.sin_port);
 
@@ -180,36 +139,25 @@ bool NginxServer::start(const TestCA& ca) {
                       << "  }\n"
                       << "}\n";
 
-  const std::vector<std::string> base = {kNginx, "-p", dir.string(), "-c", conf.string(),
-                                         "-e", (dir / "error.log").string()};
+  const std::vector<std::string> base = {"-p", dir.string(), "-c", conf.string(), "-e", (dir / "error.log").string()};
   const fs::path output = dir / "nginx.out";
-
   // Check the configuration first, so that a mistake is an error here and
   // not a hanging request later.
   auto testArgs = base;
   testArgs.push_back("-t");
-  const pid_t tester = spawnNginx(testArgs, output, -1, error_);
-  if (tester < 0) {
-    return false;
-  }
-  const int status = reap(tester, 10000);
-  if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
+  if (spawnNginx(testArgs, output, -1)->waitForExit(std::chrono::seconds(10)) != 0) {
     error_ = "nginx -t refused the configuration:\n" + readText(output);
-    return false;
+    return;
   }
-
   auto runArgs = base;
-  runArgs.push_back("-g");
-  runArgs.push_back("daemon off;");
-  pid_ = spawnNginx(runArgs, output, listener.get(), error_);
-  return pid_ > 0;
+  runArgs.insert(runArgs.end(), {"-g", "daemon off;"});
+  nginx_ = spawnNginx(runArgs, output, listener.get());
 }
 
 void NginxServer::stop() {
-  if (pid_ > 0) {
-    ::kill(pid_, SIGTERM);
-    reap(pid_, 5000);
-    pid_ = -1;
+  if (nginx_) {
+    nginx_->stop(std::chrono::seconds(5));
+    nginx_.reset();
   }
 }
 

@@ -16,13 +16,13 @@
 //   ASSERT_TRUE(nginx.started()) << nginx.error();
 //   ... fetch nginx.url("/bags/dravon") ...
 
-#include <sys/types.h>
-
 #include <chrono>
 #include <filesystem>
+#include <memory>
 #include <string>
 #include <string_view>
 
+#include "tests/support/Command.h"
 #include "tests/support/TestCA.h"
 
 namespace zerith::test {
@@ -45,7 +45,7 @@ class NginxServer {
   NginxServer(const NginxServer&) = delete;
   NginxServer& operator=(const NginxServer&) = delete;
 
-  bool started() const { return pid_ > 0; }
+  bool started() const { return nginx_ != nullptr; }
   // Why it did not start (with nginx's own messages).
   const std::string& error() const { return error_; }
 
@@ -65,11 +65,11 @@ class NginxServer {
   void stop();
 
  private:
-  bool start(const TestCA& ca);
+  void start(const TestCA& ca);
 
   Options options_;
   int port_ = 0;
-  pid_t pid_ = -1;
+  std::unique_ptr<ChildProcess> nginx_;
   std::string error_;
 };
 
