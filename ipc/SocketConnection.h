@@ -277,6 +277,12 @@ class SocketConnection final : public Connection {
   // reads for itself ends its turn with startRead() as a socket thread does,
   // and must not add a second wait.
   std::atomic<bool> readArmed_{false};
+  // Set during a waiting caller's read turn. A socket thread woken by the
+  // same bytes that finds the queue taken then leaves the wait's re-arming to
+  // that turn (rearmAfterCaller_) instead of handing an empty read to the
+  // pool: a thread less woken per call.
+  std::atomic<bool> callerReading_{false};
+  std::atomic<bool> rearmAfterCaller_{false};
   // Used only on the queue (or by the one outstanding read).
   FrameDecoder decoder_;
   std::size_t inputHeld_ = 0;  // decoder_.held() as last counted

@@ -136,9 +136,18 @@ void SocketConnection::onReadable(const std::error_code& ec) {
     }
     readChunk();
   };
-  if (!queue_.runIfFree(handle)) {
-    queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this()), handle] { handle(); });
+  if (queue_.runIfFree(handle)) {
+    return;
   }
+  if (!ec && callerReading_.load()) {
+    rearmAfterCaller_ = true;
+    // The caller's turn takes the flag as it ends; when it ended before
+    // seeing it, the flag is still ours to act on.
+    if (callerReading_.load() || !rearmAfterCaller_.exchange(false)) {
+      return;
+    }
+  }
+  queue_.async([self = std::static_pointer_cast<SocketConnection>(shared_from_this()), handle] { handle(); });
 }
 
 bool SocketConnection::readChunk() {
@@ -207,8 +216,14 @@ bool SocketConnection::readForCaller() {
       return;
     }
     tCallerReads = true;
+    callerReading_ = true;
     read = readChunk();
+    callerReading_ = false;
     tCallerReads = false;
+    // Held back meanwhile: the end of the pause arms the wait.
+    if (rearmAfterCaller_.exchange(false) && !readPausedFlag_.load()) {
+      startRead();
+    }
   });
   return read;
 }
