@@ -25,7 +25,27 @@ constexpr std::size_t kTrailerBytes = 32;
 // limit, as they do in any list that shares nothing.
 constexpr const char* kExpandsPast = "text and data expand to more than {} bytes";
 
-std::uint64_t readBE(const std::uint8_t* p, std::size_t n) {
+[[gnu::always_inline]] inline std::uint64_t readBE(const std::uint8_t* p, std::size_t n) {
+  // References and offsets are read for every object: their usual widths
+  // without a loop.
+  switch (n) {
+    case 1:
+      return p[0];
+    case 2:
+      return (std::uint64_t{p[0]} << 8) | p[1];
+    case 4: {
+      std::uint32_t v = 0;
+      std::memcpy(&v, p, 4);
+      return __builtin_bswap32(v);
+    }
+    case 8: {
+      std::uint64_t v = 0;
+      std::memcpy(&v, p, 8);
+      return __builtin_bswap64(v);
+    }
+    default:
+      break;
+  }
   std::uint64_t v = 0;
   for (std::size_t i = 0; i < n; ++i) {
     v = (v << 8) | p[i];
@@ -117,6 +137,42 @@ std::uint32_t nextCodePoint(const unsigned char*& p, const unsigned char* end) {
   }
   p += extra + 1;
   return code;
+}
+
+// Where a string's bytes end: at the first NUL (a string ends there, as it
+// does through libplist), and whether they are all ASCII (then the writer
+// writes them as they are, otherwise as UTF-16, and the reader need not
+// check them as UTF-8). Eight bytes at a time.
+constexpr std::uint64_t kAsciiText = 1ull << 63;
+std::uint64_t scanText(std::string_view s) {
+  constexpr std::uint64_t kOnes = 0x0101010101010101ull;
+  constexpr std::uint64_t kHighs = 0x8080808080808080ull;
+  const char* p = s.data();
+  const std::size_t n = s.size();
+  std::uint64_t seen = 0;
+  std::size_t i = 0;
+  for (; i + 8 <= n; i += 8) {
+    std::uint64_t w = 0;
+    std::memcpy(&w, p + i, 8);
+    if (((w - kOnes) & ~w & kHighs) != 0) {
+      break;  // a NUL in these eight: byte by byte from here
+    }
+    seen |= w;
+  }
+  if (i < n && n - i < 8) {
+    // The last few bytes as one word, filled up with bytes that are neither
+    // NUL nor high.
+    std::uint64_t w = kOnes;
+    std::memcpy(&w, p + i, n - i);
+    if (((w - kOnes) & ~w & kHighs) == 0) {
+      seen |= w;
+      i = n;
+    }
+  }
+  for (; i < n && p[i] != 0; ++i) {
+    seen |= static_cast<unsigned char>(p[i]);
+  }
+  return i | ((seen & kHighs) == 0 ? kAsciiText : 0);
 }
 
 }  // namespace
@@ -266,15 +322,16 @@ class Reader {
     // process when it has): such strings are refused.
     if (type == 0x5) {
       const std::string_view text(reinterpret_cast<const char*>(p), length);
-      if (std::memchr(p, 0, length) != nullptr) {
+      const std::uint64_t scan = scanText(text);
+      if ((scan & ~kAsciiText) != length) {
         error = "string holds a NUL character";
         return false;
       }
-      if (text_ == Text::Utf8Only && !validUtf8(text)) {
+      if (text_ == Text::Utf8Only && (scan & kAsciiText) == 0 && !validUtf8(text)) {
         error = kNotUtf8;
         return false;
       }
-      out.assign(text);
+      out = std::string(text);
       return true;
     }
     if (length == 0) {
@@ -289,6 +346,12 @@ class Reader {
     }
     appendUtf16(p, length, out);
     return true;
+  }
+
+  static std::uint64_t keyBit(const std::string& key) {
+    const std::size_t n = key.size();
+    const unsigned mix = n == 0 ? 0 : n + 7u * static_cast<unsigned char>(key[0]) + 13u * static_cast<unsigned char>(key[n - 1]);
+    return 1ull << (mix & 63);
   }
 
   // The text of key object `ref` at nesting `depth`, counted as a node of
@@ -472,6 +535,9 @@ class Reader {
         }
         Dictionary dict;
         dict.reserve(count);
+        // Keys seen so far, one bit each by length and end bytes: a key whose
+        // bit is clear is new and is appended without a look for it.
+        std::uint64_t seenKeys = 0;
         for (std::uint64_t i = 0; i < count; ++i) {
           // A key is read as text only: no Value is made for it.
           std::string key;
@@ -488,7 +554,13 @@ class Reader {
           }
           // A key given twice keeps its first place and its last value, as
           // a tree read through libplist does.
-          dict.set(std::move(key), entry->value);
+          const std::uint64_t bit = keyBit(key);
+          if ((seenKeys & bit) != 0) {
+            dict.set(std::move(key), entry->value);
+          } else {
+            seenKeys |= bit;
+            dict.appendNew(std::move(key), entry->value);
+          }
         }
         value = Value(std::move(dict));
         break;
@@ -542,31 +614,6 @@ std::uint8_t widthOf(std::uint64_t v) {
 }
 
 std::uint8_t log2Width(std::uint8_t width) { return width == 1 ? 0 : width == 2 ? 1 : width == 4 ? 2 : 3; }
-
-// What a string is written as: its bytes up to the first NUL (a string ends
-// there, as it does through libplist), and whether they are all ASCII (then
-// they are written as they are, otherwise as UTF-16). Eight bytes at a time.
-constexpr std::uint64_t kAsciiText = 1ull << 63;
-std::uint64_t scanText(std::string_view s) {
-  constexpr std::uint64_t kOnes = 0x0101010101010101ull;
-  constexpr std::uint64_t kHighs = 0x8080808080808080ull;
-  const char* p = s.data();
-  const std::size_t n = s.size();
-  std::uint64_t seen = 0;
-  std::size_t i = 0;
-  for (; i + 8 <= n; i += 8) {
-    std::uint64_t w = 0;
-    std::memcpy(&w, p + i, 8);
-    if (((w - kOnes) & ~w & kHighs) != 0) {
-      break;  // a NUL in these eight: byte by byte from here
-    }
-    seen |= w;
-  }
-  for (; i < n && p[i] != 0; ++i) {
-    seen |= static_cast<unsigned char>(p[i]);
-  }
-  return i | ((seen & kHighs) == 0 ? kAsciiText : 0);
-}
 
 // Scratch of one encode, kept by the thread for the next.
 struct WriterScratch {

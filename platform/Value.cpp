@@ -88,6 +88,10 @@ void Dictionary::set(std::string key, Value value) {
     entries_[static_cast<std::size_t>(i)].second = std::move(value);
     return;
   }
+  appendNew(std::move(key), std::move(value));
+}
+
+void Dictionary::appendNew(std::string key, Value value) {
   entries_.emplace_back(std::move(key), std::move(value));
   if (index_) {
     // Keep the sorted index: insert the new position in order. Copies of

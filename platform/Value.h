@@ -66,6 +66,9 @@ class Dictionary {
 
   // Replaces an existing entry in place (keeping its position) or appends.
   void set(std::string key, Value value);
+  // Appends an entry whose key the caller knows is not in the dictionary
+  // (a reader that tracks its keys itself), without looking for it first.
+  void appendNew(std::string key, Value value);
   bool erase(std::string_view key);
   void clear();
   // Room for `count` entries without growing again (a builder that knows its

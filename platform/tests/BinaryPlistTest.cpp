@@ -273,12 +273,16 @@ TEST(BinaryPlistReader, SharedObjectsAreBuiltOnceAtEveryReferenceWidth) {
 
 TEST(BinaryPlistReader, ARepeatedKeyKeepsTheLastValueAtTheFirstPlace) {
   // {a: 1, b: 2, a: 3}: one entry "a", the later value, where the key first
-  // stood; libplist's reading through plist::decodeBinary agrees.
-  const Data bytes = listOf({{0xD3, 1, 2, 1, 3, 4, 5}, {0x51, 'a'}, {0x51, 'b'}, {0x10, 1}, {0x10, 2}, {0x10, 3}});
-  for (const auto& back : {bplist::decode(plist::bytesOf(bytes)), plist::decodeBinary(plist::bytesOf(bytes))}) {
-    ASSERT_TRUE(back);
-    EXPECT_EQ(keysOf(*back), (std::vector<std::string>{"a", "b"}));
-    EXPECT_EQ(*back, Value(Dictionary{{"a", 3}, {"b", 2}}));
+  // stood; libplist's reading through plist::decodeBinary agrees. The second
+  // "a" is the same key object, then a key object of its own.
+  for (const Data& bytes :
+       {listOf({{0xD3, 1, 2, 1, 3, 4, 5}, {0x51, 'a'}, {0x51, 'b'}, {0x10, 1}, {0x10, 2}, {0x10, 3}}),
+        listOf({{0xD3, 1, 2, 6, 3, 4, 5}, {0x51, 'a'}, {0x51, 'b'}, {0x10, 1}, {0x10, 2}, {0x10, 3}, {0x51, 'a'}})}) {
+    for (const auto& back : {bplist::decode(plist::bytesOf(bytes)), plist::decodeBinary(plist::bytesOf(bytes))}) {
+      ASSERT_TRUE(back);
+      EXPECT_EQ(keysOf(*back), (std::vector<std::string>{"a", "b"}));
+      EXPECT_EQ(*back, Value(Dictionary{{"a", 3}, {"b", 2}}));
+    }
   }
 }
 
