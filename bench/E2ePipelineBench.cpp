@@ -77,6 +77,10 @@ struct Report {
   std::optional<ProcSample> before{}, after{}, atSample{};
   std::optional<ProcSample> idleBefore{}, idleAfter{};
   double idleSeconds = 0;
+  // The clients' process (this one, less the thread that counts the
+  // collector's lines) and the collector's, over the same load.
+  double clientCpuSeconds = 0;
+  double collectorCpuSeconds = 0;
 
   bool lossless() const {
     return error.empty() && counts.records == expected && counts.duplicates == 0 && counts.unexpected == 0 &&
@@ -85,6 +89,8 @@ struct Report {
   double cpuMicrosPerEvent() const {
     return before && after && counts.records ? (after->cpuSeconds - before->cpuSeconds) * 1e6 / counts.records : 0;
   }
+  double clientMicrosPerEvent() const { return counts.records ? clientCpuSeconds * 1e6 / counts.records : 0; }
+  double collectorMicrosPerEvent() const { return counts.records ? collectorCpuSeconds * 1e6 / counts.records : 0; }
   double deliveredPerSecond() const { return deliverSeconds > 0 ? counts.records / deliverSeconds : 0; }
   double acceptedPerSecond() const { return load.seconds > 0 ? load.accepted / load.seconds : 0; }
   // Voluntary context switches of the process per delivered event: each is
@@ -120,6 +126,9 @@ void measure(Report& r, const Settings& s, Collector& collector, pid_t pid, Open
   r.expected = s.events;
   collector.expect(s.events);
   r.before = sampleProcess(pid);
+  const auto clientsBefore = sampleProcess(::getpid());
+  const double readerBefore = collector.lineReaderCpuSeconds();
+  const auto collectorBefore = collector.processId() ? sampleProcess(*collector.processId()) : std::nullopt;
   std::thread sampler;
   if (s.memorySample > 0 && s.memorySample < s.events) {
     sampler = std::thread([&] {
@@ -138,6 +147,15 @@ void measure(Report& r, const Settings& s, Collector& collector, pid_t pid, Open
   }
   r.deliverSeconds = std::chrono::duration<double>(Clock::now() - t0).count();
   r.after = sampleProcess(pid);
+  const auto clientsAfter = sampleProcess(::getpid());
+  const auto collectorAfter = collector.processId() ? sampleProcess(*collector.processId()) : std::nullopt;
+  if (clientsBefore && clientsAfter) {
+    r.clientCpuSeconds = clientsAfter->cpuSeconds - clientsBefore->cpuSeconds -
+                         (collector.lineReaderCpuSeconds() - readerBefore);
+  }
+  if (collectorBefore && collectorAfter) {
+    r.collectorCpuSeconds = collectorAfter->cpuSeconds - collectorBefore->cpuSeconds;
+  }
   if (sampler.joinable()) {
     sampler.join();
   }
@@ -388,12 +406,14 @@ void print(const Settings& s, const std::vector<Report>& reports) {
                                          : "max",
               s.load.window, s.load.replies ? "each" : "none", s.collector.c_str());
   std::printf(
-      "| pipeline | accepted/s | delivered/s | CPU µs/event | wake-ups/event | peak RSS KiB | private KiB @%llu | "
-      "private KiB @end | posts | gzip | records | lost | dup |\n|---|---|---|---|---|---|---|---|---|---|---|---|---|\n",
+      "| pipeline | accepted/s | delivered/s | CPU µs/event | client CPU µs/event | collector CPU µs/event | "
+      "wake-ups/event | peak RSS KiB | private KiB @%llu | private KiB @end | posts | gzip | records | lost | dup "
+      "|\n|---|---|---|---|---|---|---|---|---|---|---|---|---|---|---|\n",
       static_cast<unsigned long long>(s.memorySample));
   for (const auto& r : reports) {
-    std::printf("| %s | %.0f | %.0f | %.2f | %s | %s | %s | %s | %llu | %llu | %llu | %lld | %llu |\n",
+    std::printf("| %s | %.0f | %.0f | %.2f | %.2f | %.2f | %s | %s | %s | %s | %llu | %llu | %llu | %lld | %llu |\n",
                 r.pipeline.c_str(), r.acceptedPerSecond(), r.deliveredPerSecond(), r.cpuMicrosPerEvent(),
+                r.clientMicrosPerEvent(), r.collectorMicrosPerEvent(),
                 r.wakeupsPerEvent().c_str(), kib(r.after, &ProcSample::peakRssKiB).c_str(), kib(r.atSample, &ProcSample::privateRssKiB).c_str(),
                 kib(r.after, &ProcSample::privateRssKiB).c_str(), static_cast<unsigned long long>(r.counts.posts),
                 static_cast<unsigned long long>(r.counts.gzipPosts), static_cast<unsigned long long>(r.counts.records),
@@ -422,9 +442,10 @@ void print(const Settings& s, const std::vector<Report>& reports) {
     (r.pipeline == "zerithd" ? z : p) = &r;
   }
   if (z && p && z->lossless() && p->lossless()) {
-    std::printf("ratio zerithd/peer: delivered/s %.2f, CPU per event %.2f, private RSS %.2f\n",
+    std::printf("ratio zerithd/peer: delivered/s %.2f, CPU per event %.2f, client CPU per event %.2f, private RSS %.2f\n",
                 p->deliveredPerSecond() > 0 ? z->deliveredPerSecond() / p->deliveredPerSecond() : 0,
                 p->cpuMicrosPerEvent() > 0 ? z->cpuMicrosPerEvent() / p->cpuMicrosPerEvent() : 0,
+                p->clientMicrosPerEvent() > 0 ? z->clientMicrosPerEvent() / p->clientMicrosPerEvent() : 0,
                 p->after && z->after && p->after->privateRssKiB
                     ? static_cast<double>(z->after->privateRssKiB) / static_cast<double>(p->after->privateRssKiB)
                     : 0);

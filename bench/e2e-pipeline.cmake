@@ -12,9 +12,10 @@ if(TARGET zerith_testsupport)
             ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/ProcStats.cpp
             ${CMAKE_CURRENT_SOURCE_DIR}/pipeline/ZerithdPipeline.cpp
     DEPS zerith_backends zerith_config zerith_transport zerith_ipc zerith zerith_platform
-         zerith_testsupport zerith_collector CLI11::CLI11)
-  add_dependencies(e2e_pipeline_bench zerithd)
-  target_compile_definitions(e2e_pipeline_bench PRIVATE ZERITHD_BUILT_BINARY="$<TARGET_FILE:zerithd>")
+         zerith_testsupport CLI11::CLI11)
+  add_dependencies(e2e_pipeline_bench zerithd zerith-collector)
+  target_compile_definitions(e2e_pipeline_bench PRIVATE ZERITHD_BUILT_BINARY="$<TARGET_FILE:zerithd>"
+                                                        ZERITH_COLLECTOR_TOOL="$<TARGET_FILE:zerith-collector>")
   if(ZERITH_TESTS)
     add_test(NAME e2e_pipeline_smoke
       COMMAND e2e_pipeline_bench --smoke --clients 2 --events 3000 --memory-sample 0)

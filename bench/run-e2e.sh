@@ -104,7 +104,7 @@ echo "load average after: $(cut -d' ' -f1-3 /proc/loadavg)"
 
 # "<delivered> <cpu> <rss>" ratios of run N.
 ratios() {
-  sed -n 's/^ratio zerithd\/peer: delivered\/s \([0-9.]*\), CPU per event \([0-9.]*\), private RSS \([0-9.]*\)$/\1 \2 \3/p' \
+  sed -n 's/^ratio zerithd\/peer: delivered\/s \([0-9.]*\), CPU per event \([0-9.]*\), client CPU per event [0-9.]*, private RSS \([0-9.]*\)$/\1 \2 \3/p' \
     "$work/run$1"
 }
 lossless() {
@@ -142,6 +142,11 @@ for n in 2 5; do
   row "delivered events/s × the peer's, $what" "$delivered" ge 1.5
   row "daemon CPU per event × the peer's, $what" "$cpu" le 0.5
 done
+# The client's side of a one-way event: the CPU of the benchmark's process
+# (the eight clients; the collector runs apart) per event, 8 clients unpaced.
+clientCpu() { awk -F'|' -v p="$2" '$2 ~ "^ " p " $" { gsub(/ /, "", $6); print $6 }' "$work/run$1"; }
+row "client CPU µs per one-way event, the framework's encode and send (the peer's clients: $(clientCpu 5 peer) µs)" \
+  "$(clientCpu 5 zerithd)" le 7.5
 for n in 3 4 6; do
   read -r _ cpu _ < <(ratios $n)
   what=$(sed -n 's/^clients=\([0-9]*\) events=[0-9]* rate=\([0-9]*\) .* replies=\([a-z]*\) .*/\1 clients, \2 events\/s, replies: \3/p' "$work/run$n")

@@ -4,27 +4,34 @@
 // counts the records of every posted JSON envelope by their event
 // identifier, so that an event lost or delivered twice shows in the counts.
 // Two servers can do the receiving:
-// - zerith-collector's server (tools/zerith-collector), run in this
-//   process: it inflates gzip bodies, parses each envelope and hands one
-//   JSON line per record, which is counted here;
+// - zerith-collector (tools/zerith-collector), a process of its own: it
+//   inflates gzip bodies, parses each envelope and writes one JSON line per
+//   record to a pipe; the lines are counted here, on a thread whose CPU
+//   time is kept apart, so that this process's CPU is the clients';
 // - the test support's HTTPS server (kept-alive connections, no request
 //   kept), whose library inflates gzip bodies; the body is scanned here.
 
+#include <sys/types.h>
+
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <thread>
 #include <vector>
 
+#include "platform/FileUtil.h"
+
 namespace zerith::test {
 class HttpsTestServer;
 }
-namespace zerith::collector {
-class CollectorServer;
+namespace zerith::test {
+class ChildProcess;
 }
 
 namespace zerith::bench {
@@ -91,19 +98,30 @@ class Collector {
   // new one arrived for `idle`.
   bool waitForRecords(std::uint64_t records, std::chrono::milliseconds idle) const;
 
+  // zerith-collector's process (nullopt for the test server, which runs in
+  // this process), and the CPU time this process spent reading its lines.
+  std::optional<pid_t> processId() const;
+  double lineReaderCpuSeconds() const;
+
  private:
   void count(std::string_view body, bool gzip);
   // Marks one event identifier as seen; under mutex_.
   void noteEventId(std::uint64_t id);
-  void countLine(const std::string& line);
+  void countLine(std::string_view line);
+  void startCollectorProcess();
+  void readCollectorLines();
 
   mutable std::mutex mutex_;
   mutable std::condition_variable changed_;
   std::vector<bool> seen_;
   Counts counts_;
   std::unique_ptr<test::HttpsTestServer> testServer_;
-  std::unique_ptr<collector::CollectorServer> collectorServer_;
+  std::unique_ptr<test::ChildProcess> collectorProcess_;
+  file::UniqueFd collectorOutput_;
+  std::string collectorURL_;
+  std::string behaviourFile_;
   std::thread collectorThread_;
+  std::atomic<std::uint64_t> readerCpuNanos_{0};
 };
 
 }  // namespace zerith::bench

@@ -10,7 +10,7 @@
 // --out FILE (stdout), --status N (200), --digest-key KEY, --store DIR,
 // --answer TEXT ("success"), --log-data-path PATH ("/logdata"),
 // --serve DIR (GET of static files, e.g. a storebag), --max-body BYTES,
-// --max-inflated BYTES, --behaviour-file FILE (answer | status N | stall MS |
+// --max-inflated BYTES, --max-connections N (64), --behaviour-file FILE (answer | status N | stall MS |
 // close, read before every connection and request), --drop-duplicates
 // (records by "_recordID"). Stops on SIGINT/SIGTERM, or when the process named
 // by --parent-pid has gone.
@@ -47,6 +47,7 @@ int main(int argc, char** argv) {
   long long maxBody = static_cast<long long>(options.limits.maxBodyBytes);
   long long maxInflated = static_cast<long long>(options.limits.maxInflatedBytes);
   int parentPid = 0;
+  long long maxConnections = static_cast<long long>(options.maxConnections);
   app.add_option("--listen", options.listenAddress, "address to listen on")->capture_default_str();
   app.add_option("--port", options.port, "port (0: any free port)")->check(CLI::Range(0, 65535));
   app.add_option("--port-file", portFile, "write the port chosen into this file once listening");
@@ -65,6 +66,10 @@ int main(int argc, char** argv) {
   app.add_option("--serve", options.serveFolder, "answer GETs with the files of this folder");
   app.add_option("--max-body", maxBody, "largest body taken, in bytes")->check(CLI::PositiveNumber);
   app.add_option("--max-inflated", maxInflated, "largest body after gzip is undone, in bytes")->check(CLI::PositiveNumber);
+  app.add_option("--max-connections", maxConnections,
+                 "connections served at once; more are closed as they come (a load test may need more)")
+      ->check(CLI::Range(1, 65536))
+      ->capture_default_str();
   app.add_option("--parent-pid", parentPid, "stop once this process has gone");
   app.add_option("--behaviour-file", options.behaviourFile,
                  "read how to behave from this file before every connection and request: "
@@ -75,6 +80,7 @@ int main(int argc, char** argv) {
 
   options.limits.maxBodyBytes = static_cast<std::size_t>(maxBody);
   options.limits.maxInflatedBytes = static_cast<std::size_t>(maxInflated);
+  options.maxConnections = static_cast<std::size_t>(maxConnections);
   if (!digestKey.empty()) {
     options.digestKey = digestKey;
   }
