@@ -41,7 +41,7 @@ daemon_pid() {
 # Prints "<records> <wake-ups/event> <CPU µs/event> <delivered/s>" of the
 # zerithd row of one benchmark run (its output in $1).
 row() {
-  awk -F'|' '$2 ~ /^ zerithd / { gsub(/ /, ""); print $12, $6, $5, $4 }' "$1"
+  awk -F'|' '$2 ~ /^ zerithd / { gsub(/ /, ""); print $14, $8, $5, $4 }' "$1"
 }
 
 measure() {
