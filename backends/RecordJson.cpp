@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <cstring>
 #include <string_view>
+#include <type_traits>
 
 #include <rapidjson/stringbuffer.h>
 #include <rapidjson/writer.h>
@@ -75,40 +76,104 @@ std::string_view utf8(std::string_view s, std::string& scratch) {
   return out ? std::string_view(*out) : s;
 }
 
-void writeKey(Writer& w, std::string_view key, std::string& scratch) {
-  const std::string_view text = utf8(key, scratch);
-  w.Key(text.data(), static_cast<rapidjson::SizeType>(text.size()));
+// Whether JSON writes `s` between its quotes as it is: no control
+// character, quote or backslash (bytes above ASCII pass as they are, as the
+// writer passes UTF-8). Eight bytes at a time.
+bool plainText(std::string_view s) {
+  constexpr std::uint64_t kOnes = 0x0101010101010101u;
+  constexpr std::uint64_t kHighs = 0x8080808080808080u;
+  const auto special = [](std::uint64_t w) {
+    const std::uint64_t quote = w ^ (kOnes * '"');
+    const std::uint64_t backslash = w ^ (kOnes * '\\');
+    return (((w - kOnes * 0x20) & ~w) | ((quote - kOnes) & ~quote) | ((backslash - kOnes) & ~backslash)) & kHighs;
+  };
+  std::size_t i = 0;
+  for (; i + 8 <= s.size(); i += 8) {
+    std::uint64_t w = 0;
+    std::memcpy(&w, s.data() + i, 8);
+    if (special(w) != 0) {
+      return false;
+    }
+  }
+  if (i == s.size()) {
+    return true;
+  }
+  std::uint64_t w = kOnes * 'a';
+  std::memcpy(&w, s.data() + i, s.size() - i);
+  return special(w) == 0;
 }
 
-void writeString(Writer& w, std::string_view s, std::string& scratch) {
-  const std::string_view text = utf8(s, scratch);
-  w.String(text.data(), static_cast<rapidjson::SizeType>(text.size()));
+struct Scratch {
+  rapidjson::StringBuffer& buffer;  // what the writer writes into
+  std::string text{};               // text made UTF-8
+};
+
+// A key or a string value: plain text is copied between its quotes in one
+// go, other text goes through the writer's escaping.
+void writeText(Writer& w, std::string_view s, Scratch& scratch) {
+  const std::string_view text = utf8(s, scratch.text);
+  if (plainText(text)) {
+    // The writer puts the separator before a value (comma or colon) and
+    // keeps count; the text follows it straight into the buffer, as
+    // RawValue would copy it a byte at a time.
+    w.RawValue("", 0, rapidjson::kStringType);
+    char* at = scratch.buffer.Push(text.size() + 2);
+    at[0] = '"';
+    std::memcpy(at + 1, text.data(), text.size());
+    at[text.size() + 1] = '"';
+  } else {
+    w.String(text.data(), static_cast<rapidjson::SizeType>(text.size()));
+  }
 }
 
-// Whether JSON carries the value: not nil, data, a nested array or
-// dictionary, nor a real that is not finite.
+void writeKey(Writer& w, std::string_view key, Scratch& scratch) { writeText(w, key, scratch); }
+void writeString(Writer& w, std::string_view s, Scratch& scratch) { writeText(w, s, scratch); }
+
+// Writes `key` and the value when JSON carries it (not nil, data, a nested
+// array or dictionary, nor a real that is not finite), in one dispatch on
+// the value's kind; false, with nothing written, otherwise.
+bool writeEntry(Writer& w, std::string_view key, const Value& v, Scratch& scratch) {
+  return v.visit([&](const auto& x) -> bool {
+    using T = std::decay_t<decltype(x)>;
+    if constexpr (std::is_same_v<T, double>) {
+      if (!std::isfinite(x)) {
+        return false;
+      }
+      writeKey(w, key, scratch);
+      w.Double(x);
+    } else if constexpr (std::is_same_v<T, bool>) {
+      writeKey(w, key, scratch);
+      w.Bool(x);
+    } else if constexpr (std::is_same_v<T, std::int64_t>) {
+      writeKey(w, key, scratch);
+      w.Int64(x);
+    } else if constexpr (std::is_same_v<T, std::uint64_t>) {
+      writeKey(w, key, scratch);
+      w.Uint64(x);
+    } else if constexpr (std::is_same_v<T, std::string>) {
+      writeKey(w, key, scratch);
+      writeString(w, x, scratch);
+    } else if constexpr (std::is_same_v<T, Date>) {
+      writeKey(w, key, scratch);
+      w.Double(sanitizeDouble(x.secondsSince1970));
+    } else {
+      return false;  // nil, data, arrays and dictionaries
+    }
+    return true;
+  });
+}
+
+// Whether JSON carries the value, as writeEntry decides it.
 bool carried(const Value& v) {
-  switch (v.type()) {
-    case Value::Type::Real: return std::isfinite(v.doubleValue());
-    case Value::Type::Bool:
-    case Value::Type::Int:
-    case Value::Type::UInt:
-    case Value::Type::String:
-    case Value::Type::Date: return true;
-    default: return false;
-  }
-}
-
-void writeValue(Writer& w, const Value& v, std::string& scratch) {
-  switch (v.type()) {
-    case Value::Type::Bool: w.Bool(v.boolValue()); break;
-    case Value::Type::Int: w.Int64(v.intValue()); break;
-    case Value::Type::UInt: w.Uint64(v.unsignedValue()); break;
-    case Value::Type::Real: w.Double(v.doubleValue()); break;
-    case Value::Type::String: writeString(w, *v.string(), scratch); break;
-    case Value::Type::Date: w.Double(sanitizeDouble(v.date()->secondsSince1970)); break;
-    default: break;
-  }
+  return v.visit([](const auto& x) -> bool {
+    using T = std::decay_t<decltype(x)>;
+    if constexpr (std::is_same_v<T, double>) {
+      return std::isfinite(x);
+    } else {
+      return std::is_same_v<T, bool> || std::is_same_v<T, std::int64_t> || std::is_same_v<T, std::uint64_t> ||
+             std::is_same_v<T, std::string> || std::is_same_v<T, Date>;
+    }
+  });
 }
 
 }  // namespace
@@ -119,7 +184,7 @@ std::string envelopeJson(double postTime, const std::optional<std::string>& clie
   // Room for a typical record's text, so the buffer seldom grows.
   rapidjson::StringBuffer buffer(nullptr, 64 + (clientId ? records.size() * 768 : 0));
   Writer w(buffer);
-  std::string scratch;
+  Scratch scratch{buffer};
   w.StartObject();
   w.Key("postTime");
   w.Double(sanitizeDouble(postTime));
@@ -134,10 +199,7 @@ std::string envelopeJson(double postTime, const std::optional<std::string>& clie
         if (recordID && key == "_recordID") {
           continue;  // the spool's own identifier below takes its place: one key, not two
         }
-        if (carried(value)) {
-          writeKey(w, key, scratch);
-          writeValue(w, value, scratch);
-        } else if (dropped) {
+        if (!writeEntry(w, key, value, scratch) && dropped) {
           dropped(key, value);
         }
       }

@@ -33,6 +33,10 @@ const std::vector<Dictionary> kRecords = {
      {"E0 80", "\xE0\x80x"}, {"surrogate", "\xED\xA0\x80"},
      {"cut at end", "ok\xE2\x82"}, {"cut by A", "\xF0\x9F\x98" "A"}, {"past U+10FFFF", "\xF4\x90\x80\x80"},
      {"continuation", "\x80\xBF"}, {"valid then not", "\xF0\x9F\x98\x80\xF8"}, {"key \xFE", 1}},
+    // One character that needs escaping among plain text, in a whole word of
+    // eight and in the few bytes after the last one.
+    {{"quote in a word", "abc\"defghij"}, {"backslash after", "abcdefgh\\"}, {"tab after", "abcdefghi\t"},
+     {"tail quote", "ab\"c"}, {"\"key\"", "plain text longer than two words, all of it"}, {"del", "\x7f"}},
     {},
     {{"_recordID", "from the payload"}, {"z", 1}, {"a", 2}},
 };
