@@ -76,31 +76,37 @@ std::string_view utf8(std::string_view s, std::string& scratch) {
   return out ? std::string_view(*out) : s;
 }
 
-// Whether JSON writes `s` between its quotes as it is: no control
-// character, quote or backslash (bytes above ASCII pass as they are, as the
-// writer passes UTF-8). Eight bytes at a time.
-bool plainText(std::string_view s) {
+// What a text holds, eight bytes at a time: bytes above ASCII (then it may
+// need making UTF-8), and characters JSON escapes (control characters,
+// quote, backslash; bytes above ASCII pass as they are, as the writer
+// passes UTF-8).
+struct TextScan {
+  bool high = false;
+  bool special = false;
+};
+TextScan scanText(std::string_view s) {
   constexpr std::uint64_t kOnes = 0x0101010101010101u;
   constexpr std::uint64_t kHighs = 0x8080808080808080u;
-  const auto special = [](std::uint64_t w) {
+  std::uint64_t high = 0;
+  std::uint64_t special = 0;
+  const auto add = [&](std::uint64_t w) {
     const std::uint64_t quote = w ^ (kOnes * '"');
     const std::uint64_t backslash = w ^ (kOnes * '\\');
-    return (((w - kOnes * 0x20) & ~w) | ((quote - kOnes) & ~quote) | ((backslash - kOnes) & ~backslash)) & kHighs;
+    high |= w;
+    special |= ((w - kOnes * 0x20) & ~w) | ((quote - kOnes) & ~quote) | ((backslash - kOnes) & ~backslash);
   };
   std::size_t i = 0;
   for (; i + 8 <= s.size(); i += 8) {
     std::uint64_t w = 0;
     std::memcpy(&w, s.data() + i, 8);
-    if (special(w) != 0) {
-      return false;
-    }
+    add(w);
   }
-  if (i == s.size()) {
-    return true;
+  if (i < s.size()) {
+    std::uint64_t w = kOnes * 'a';  // the last few bytes, filled up with plain ones
+    std::memcpy(&w, s.data() + i, s.size() - i);
+    add(w);
   }
-  std::uint64_t w = kOnes * 'a';
-  std::memcpy(&w, s.data() + i, s.size() - i);
-  return special(w) == 0;
+  return {(high & kHighs) != 0, (special & kHighs) != 0};
 }
 
 struct Scratch {
@@ -111,8 +117,13 @@ struct Scratch {
 // A key or a string value: plain text is copied between its quotes in one
 // go, other text goes through the writer's escaping.
 void writeText(Writer& w, std::string_view s, Scratch& scratch) {
-  const std::string_view text = utf8(s, scratch.text);
-  if (plainText(text)) {
+  TextScan scan = scanText(s);
+  std::string_view text = s;
+  if (scan.high) {
+    text = utf8(s, scratch.text);
+    scan = scanText(text);
+  }
+  if (!scan.special) {
     // The writer puts the separator before a value (comma or colon) and
     // keeps count; the text follows it straight into the buffer, as
     // RawValue would copy it a byte at a time.
