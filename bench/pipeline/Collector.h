@@ -28,11 +28,9 @@
 #include "platform/FileUtil.h"
 
 namespace zerith::test {
-class HttpsTestServer;
-}
-namespace zerith::test {
 class ChildProcess;
-}
+class HttpsTestServer;
+}  // namespace zerith::test
 
 namespace zerith::bench {
 
