@@ -2,11 +2,14 @@
 // executable receiving what a real HTTPS backend, libcurl uploads and
 // static-file GETs send it.
 
+#include <arpa/inet.h>
 #include <curl/curl.h>
 #include <fcntl.h>
+#include <netinet/in.h>
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <signal.h>
+#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <zlib.h>
@@ -16,6 +19,7 @@
 #include <fstream>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "backends/HTTPSPostBackend.h"
@@ -251,6 +255,37 @@ TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
     ASSERT_TRUE(line) << r.name;
     EXPECT_EQ((*line)["kind"], r.kind) << r.name;
   }
+}
+
+// Each connection holds a thread of the collector: beyond --max-connections
+// a connection is closed as it comes, and its place is free again once a
+// connection ends.
+TEST_F(CollectorToolTest, ConnectionsBeyondItsLimitAreClosedUntilOneEnds) {
+  auto args = baseArgs();
+  args.insert(args.end(), {"--max-connections", "1"});
+  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
+  // A connection that says nothing holds the one place (the collector
+  // accepts in the order connections came).
+  file::UniqueFd silent(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_port = htons(static_cast<std::uint16_t>(collector.port()));
+  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  ASSERT_EQ(::connect(silent.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
+  const std::string envelope = "{\"postTime\":1}";
+  EXPECT_EQ(curlRequest(collector.url("/post"), certs / "ca.pem", envelope, {}).status, 0);
+  silent.reset();
+  long status = 0;
+  for (int attempt = 0; attempt < 100 && status != 200; ++attempt) {
+    if (attempt > 0) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+    status = curlRequest(collector.url("/post"), certs / "ca.pem", envelope, {}).status;
+  }
+  EXPECT_EQ(status, 200);
+  const auto line = collector.nextLine();
+  ASSERT_TRUE(line);
+  EXPECT_EQ((*line)["kind"], "envelope");
 }
 
 TEST_F(CollectorToolTest, ServesStaticFilesWithLastModifiedAndNothingOutsideItsFolder) {
