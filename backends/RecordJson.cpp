@@ -137,44 +137,8 @@ void writeText(Writer& w, std::string_view s, Scratch& scratch) {
   }
 }
 
-void writeKey(Writer& w, std::string_view key, Scratch& scratch) { writeText(w, key, scratch); }
-void writeString(Writer& w, std::string_view s, Scratch& scratch) { writeText(w, s, scratch); }
-
-// Writes `key` and the value when JSON carries it (not nil, data, a nested
-// array or dictionary, nor a real that is not finite), in one dispatch on
-// the value's kind; false, with nothing written, otherwise.
-bool writeEntry(Writer& w, std::string_view key, const Value& v, Scratch& scratch) {
-  return v.visit([&](const auto& x) -> bool {
-    using T = std::decay_t<decltype(x)>;
-    if constexpr (std::is_same_v<T, double>) {
-      if (!std::isfinite(x)) {
-        return false;
-      }
-      writeKey(w, key, scratch);
-      w.Double(x);
-    } else if constexpr (std::is_same_v<T, bool>) {
-      writeKey(w, key, scratch);
-      w.Bool(x);
-    } else if constexpr (std::is_same_v<T, std::int64_t>) {
-      writeKey(w, key, scratch);
-      w.Int64(x);
-    } else if constexpr (std::is_same_v<T, std::uint64_t>) {
-      writeKey(w, key, scratch);
-      w.Uint64(x);
-    } else if constexpr (std::is_same_v<T, std::string>) {
-      writeKey(w, key, scratch);
-      writeString(w, x, scratch);
-    } else if constexpr (std::is_same_v<T, Date>) {
-      writeKey(w, key, scratch);
-      w.Double(sanitizeDouble(x.secondsSince1970));
-    } else {
-      return false;  // nil, data, arrays and dictionaries
-    }
-    return true;
-  });
-}
-
-// Whether JSON carries the value, as writeEntry decides it.
+// Whether JSON carries the value: not nil, data, a nested array or
+// dictionary, nor a real that is not finite.
 bool carried(const Value& v) {
   return v.visit([](const auto& x) -> bool {
     using T = std::decay_t<decltype(x)>;
@@ -185,6 +149,32 @@ bool carried(const Value& v) {
              std::is_same_v<T, std::string> || std::is_same_v<T, Date>;
     }
   });
+}
+
+// Writes `key` and the value when JSON carries it; false, with nothing
+// written, otherwise.
+bool writeEntry(Writer& w, std::string_view key, const Value& v, Scratch& scratch) {
+  if (!carried(v)) {
+    return false;
+  }
+  writeText(w, key, scratch);
+  v.visit([&](const auto& x) {
+    using T = std::decay_t<decltype(x)>;
+    if constexpr (std::is_same_v<T, double>) {
+      w.Double(x);
+    } else if constexpr (std::is_same_v<T, bool>) {
+      w.Bool(x);
+    } else if constexpr (std::is_same_v<T, std::int64_t>) {
+      w.Int64(x);
+    } else if constexpr (std::is_same_v<T, std::uint64_t>) {
+      w.Uint64(x);
+    } else if constexpr (std::is_same_v<T, std::string>) {
+      writeText(w, x, scratch);
+    } else if constexpr (std::is_same_v<T, Date>) {
+      w.Double(sanitizeDouble(x.secondsSince1970));
+    }
+  });
+  return true;
 }
 
 }  // namespace
@@ -201,7 +191,7 @@ std::string envelopeJson(double postTime, const std::optional<std::string>& clie
   w.Double(sanitizeDouble(postTime));
   if (clientId) {
     w.Key("clientId");
-    writeString(w, *clientId, scratch);
+    writeText(w, *clientId, scratch);
     w.Key("events");
     w.StartArray();
     for (const Dictionary& record : records) {
@@ -216,7 +206,7 @@ std::string envelopeJson(double postTime, const std::optional<std::string>& clie
       }
       if (recordID) {
         w.Key("_recordID");
-        writeString(w, recordID(), scratch);
+        writeText(w, recordID(), scratch);
       }
       w.EndObject();
     }
