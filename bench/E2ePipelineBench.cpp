@@ -4,8 +4,9 @@
 // socket; both batch them by 50 and post them over HTTPS to one collector on
 // loopback that counts every record by its identifier. Reported per
 // pipeline: events per second accepted and delivered, CPU microseconds per
-// event (user + system of the pipeline's process, from /proc), peak and
-// private RSS, and whether every event arrived exactly once; with
+// event (user + system of the pipeline's process, from /proc) and beside it
+// the clients' (this process) and the collector's (a process of its own),
+// peak and private RSS, and whether every event arrived exactly once; with
 // --idle-seconds, the CPU time and wake-ups of the idle process holding ten
 // open sessions, per minute.
 //
