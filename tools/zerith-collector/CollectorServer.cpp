@@ -91,23 +91,43 @@ double nowSeconds() {
 }
 
 // A line with the keys a reader looks for first; the request's headers last.
-std::string render(const Json& line) {
-  static const char* const order[] = {"time",       "kind",     "status",   "method",  "path",   "query",
-                                      "digest",     "_sender",  "_sessionID", "record", "clientId", "postTime",
-                                      "events",     "gzip",     "bodySize", "size",    "sha256", "stored",
-                                      "storeError", "error"};
-  Json out = Json::object();
-  for (const char* key : order) {
-    if (line.contains(key)) {
-      out[key] = line[key];
+// `extra` holds keys of this line beside the request's own (`line`), which
+// it is not copied into: a record line's keys beside the request's. Written
+// as text straight from both, so a record is never copied to be written.
+std::string render(const Json& line, const Json& extra = Json::object()) {
+  static constexpr std::string_view order[] = {"time",   "kind",     "status",   "method",     "path",
+                                               "query",  "digest",   "_sender",  "_sessionID", "record",
+                                               "clientId", "postTime", "events",  "gzip",       "bodySize",
+                                               "size",   "sha256",   "stored",   "storeError", "error"};
+  const auto ordered = [](std::string_view key) { return std::find(std::begin(order), std::end(order), key) != std::end(order); };
+  std::string out = "{";
+  const auto put = [&out](std::string_view key, const Json& value) {
+    if (out.size() > 1) {
+      out += ',';
+    }
+    out += Json(key).dump(-1, ' ', false, Json::error_handler_t::replace);
+    out += ':';
+    out += value.dump(-1, ' ', false, Json::error_handler_t::replace);
+  };
+  for (const std::string_view key : order) {
+    if (const auto it = extra.find(key); it != extra.end()) {
+      put(key, *it);
+    } else if (const auto own = line.find(key); own != line.end()) {
+      put(key, *own);
     }
   }
   for (const auto& [key, value] : line.items()) {
-    if (!out.contains(key)) {
-      out[key] = value;
+    if (!ordered(key) && !extra.contains(key)) {
+      put(key, value);
     }
   }
-  return out.dump(-1, ' ', false, Json::error_handler_t::replace);
+  for (const auto& [key, value] : extra.items()) {
+    if (!ordered(key)) {
+      put(key, value);
+    }
+  }
+  out += '}';
+  return out;
 }
 
 // Only names that cannot leave the folder: no empty, "." or ".." piece.
@@ -571,7 +591,7 @@ void CollectorServer::handle(Connection& connection) {
     }
     const int status = now.kind == Behaviour::Kind::status ? now.value : options_.status;
 
-    const DecodedBody decoded = decodeRequestBody(contentEncoding, body, options_.limits);
+    DecodedBody decoded = decodeRequestBody(contentEncoding, body, options_.limits);
     if (!decoded.ok) {
       refuse(decoded.error.find("exceeds") != std::string::npos || decoded.error.find("beyond") != std::string::npos ? 413 : 415,
              decoded.error);
@@ -588,38 +608,45 @@ void CollectorServer::handle(Connection& connection) {
 
     std::string answerText;
     if (decoded.envelope) {
-      const Json& envelope = *decoded.envelope;
+      Json& envelope = *decoded.envelope;
       Json common = line;
       common["postTime"] = envelope["postTime"];
       if (envelope.contains("clientId")) {
         common["clientId"] = envelope["clientId"];
       }
-      const Json events = envelope.contains("events") ? envelope["events"] : Json::array();
+      Json events = envelope.contains("events") ? std::move(envelope["events"]) : Json::array();
       if (events.empty()) {
         common["kind"] = "envelope";
         common["events"] = 0;
         writer_(render(common));
       }
+      // The envelope's lines leave together, before its answer.
+      std::string lines;
+      const auto add = [&lines](const std::string& text) {
+        lines += lines.empty() ? "" : "\n";
+        lines += text;
+      };
       const bool taken = status >= 200 && status <= 299;
-      for (const Json& record : events) {
-        Json out = common;
-        out["kind"] = "record";
+      for (Json& record : events) {
         if (options_.dropDuplicates && taken && record.is_object() && record.contains("_recordID") &&
             record["_recordID"].is_string()) {
           std::lock_guard lock(behaviourMutex_);
           if (!seenRecordIDs_.insert(record["_recordID"].get<std::string>()).second) {
             ++duplicates_;
-            out["kind"] = "duplicate";
-            out["_recordID"] = record["_recordID"];
-            out["duplicates"] = duplicates_.load();
-            writer_(render(out));
+            add(render(common, Json{{"kind", "duplicate"},
+                                    {"_recordID", record["_recordID"]},
+                                    {"duplicates", duplicates_.load()}}));
             continue;
           }
         }
-        out["_sender"] = record.is_object() && record.contains("_sender") ? record["_sender"] : Json(nullptr);
-        out["_sessionID"] = record.is_object() && record.contains("_sessionID") ? record["_sessionID"] : Json(nullptr);
-        out["record"] = record;
-        writer_(render(out));
+        Json own{{"kind", "record"}};
+        own["_sender"] = record.is_object() && record.contains("_sender") ? record["_sender"] : Json(nullptr);
+        own["_sessionID"] = record.is_object() && record.contains("_sessionID") ? record["_sessionID"] : Json(nullptr);
+        own["record"] = std::move(record);
+        add(render(common, own));
+      }
+      if (!lines.empty()) {
+        writer_(lines);
       }
     } else {
       const bool logData = path == options_.logDataPath;

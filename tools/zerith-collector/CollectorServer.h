@@ -82,7 +82,9 @@ struct Behaviour {
 
 class CollectorServer {
  public:
-  using LineWriter = std::function<void(const std::string& line)>;
+  // Writes one line, or the lines of one envelope joined by newlines, at
+  // once (without a newline at the end).
+  using LineWriter = std::function<void(const std::string& lines)>;
 
   CollectorServer(CollectorOptions options, LineWriter writer);
   ~CollectorServer();

@@ -157,6 +157,13 @@ TEST_F(CollectorToolTest, BackendRecordsArriveOneLinePerRecordWithSenderSessionA
     EXPECT_TRUE(hasMembers(*line, R"({"kind":"record","path":"/post","_sender":"YJ","_sessionID":77})"));
     EXPECT_TRUE(hasMembers(*line, R"({"digest":"valid","gzip":true,"record":{"n":)" + std::to_string(n) + "}}"));
     EXPECT_EQ((*line)["headers"][0][0], "Host");
+    // The keys a reader looks for come first, the request's headers last.
+    std::vector<std::string> keys;
+    for (const auto& [key, value] : line->items()) {
+      keys.push_back(key);
+    }
+    EXPECT_EQ(keys, (std::vector<std::string>{"time", "kind", "status", "method", "path", "query", "digest", "_sender",
+                                              "_sessionID", "record", "clientId", "postTime", "gzip", "bodySize", "headers"}));
   }
 
   // A wrong key on the device side shows as an invalid digest.
