@@ -90,45 +90,63 @@ double nowSeconds() {
   return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
 }
 
-// A line with the keys a reader looks for first; the request's headers last.
-// `extra` holds keys of this line beside the request's own (`line`), which
-// it is not copied into: a record line's keys beside the request's. Written
-// as text straight from both, so a record is never copied to be written.
-std::string render(const Json& line, const Json& extra = Json::object()) {
-  static constexpr std::string_view order[] = {"time",   "kind",     "status",   "method",     "path",
-                                               "query",  "digest",   "_sender",  "_sessionID", "record",
-                                               "clientId", "postTime", "events",  "gzip",       "bodySize",
-                                               "size",   "sha256",   "stored",   "storeError", "error"};
-  const auto ordered = [](std::string_view key) { return std::find(std::begin(order), std::end(order), key) != std::end(order); };
-  std::string out = "{";
-  const auto put = [&out](std::string_view key, const Json& value) {
-    if (out.size() > 1) {
-      out += ',';
+// A line's entries as JSON text, each with its place: the keys a reader
+// looks for first, in this order, then the rest (the request's headers) in
+// the order they came. An envelope's record lines share the request's
+// entries, written once, and add their own.
+class LineText {
+ public:
+  explicit LineText(const Json& line) {
+    for (const auto& [key, value] : line.items()) {
+      add(key, value);
     }
-    out += Json(key).dump(-1, ' ', false, Json::error_handler_t::replace);
-    out += ':';
-    out += value.dump(-1, ' ', false, Json::error_handler_t::replace);
+  }
+  void add(std::string_view key, const Json& value) {
+    std::string text = Json(key).dump(-1, ' ', false, Json::error_handler_t::replace);
+    text += ':';
+    text += value.dump(-1, ' ', false, Json::error_handler_t::replace);
+    entries_.push_back(Entry{placeOf(key), std::string(key), std::move(text)});
+  }
+  // The line, with `own`'s entries beside these (replacing any of the same key).
+  std::string render(const LineText& own = LineText(Json::object())) const {
+    std::vector<const Entry*> all;
+    all.reserve(entries_.size() + own.entries_.size());
+    for (const Entry& e : entries_) {
+      const auto same = [&e](const Entry& o) { return o.key == e.key; };
+      if (std::none_of(own.entries_.begin(), own.entries_.end(), same)) {
+        all.push_back(&e);
+      }
+    }
+    for (const Entry& e : own.entries_) {
+      all.push_back(&e);
+    }
+    std::stable_sort(all.begin(), all.end(), [](const Entry* a, const Entry* b) { return a->place < b->place; });
+    std::string out = "{";
+    for (const Entry* e : all) {
+      out += out.size() > 1 ? "," : "";
+      out += e->text;
+    }
+    out += '}';
+    return out;
+  }
+
+ private:
+  struct Entry {
+    std::size_t place;
+    std::string key;
+    std::string text;
   };
-  for (const std::string_view key : order) {
-    if (const auto it = extra.find(key); it != extra.end()) {
-      put(key, *it);
-    } else if (const auto own = line.find(key); own != line.end()) {
-      put(key, *own);
-    }
+  static std::size_t placeOf(std::string_view key) {
+    static constexpr std::string_view order[] = {"time",     "kind",     "status",   "method",     "path",
+                                                 "query",    "digest",   "_sender",  "_sessionID", "record",
+                                                 "clientId", "postTime", "events",   "gzip",       "bodySize",
+                                                 "size",     "sha256",   "stored",   "storeError", "error"};
+    return static_cast<std::size_t>(std::find(std::begin(order), std::end(order), key) - std::begin(order));
   }
-  for (const auto& [key, value] : line.items()) {
-    if (!ordered(key) && !extra.contains(key)) {
-      put(key, value);
-    }
-  }
-  for (const auto& [key, value] : extra.items()) {
-    if (!ordered(key)) {
-      put(key, value);
-    }
-  }
-  out += '}';
-  return out;
-}
+  std::vector<Entry> entries_;
+};
+
+std::string render(const Json& line) { return LineText(line).render(); }
 
 // Only names that cannot leave the folder: no empty, "." or ".." piece.
 std::optional<fs::path> servedFile(const fs::path& folder, const std::string& path) {
@@ -591,7 +609,7 @@ void CollectorServer::handle(Connection& connection) {
     }
     const int status = now.kind == Behaviour::Kind::status ? now.value : options_.status;
 
-    DecodedBody decoded = decodeRequestBody(contentEncoding, body, options_.limits);
+    const DecodedBody decoded = decodeRequestBody(contentEncoding, body, options_.limits);
     if (!decoded.ok) {
       refuse(decoded.error.find("exceeds") != std::string::npos || decoded.error.find("beyond") != std::string::npos ? 413 : 415,
              decoded.error);
@@ -608,42 +626,47 @@ void CollectorServer::handle(Connection& connection) {
 
     std::string answerText;
     if (decoded.envelope) {
-      Json& envelope = *decoded.envelope;
+      const Json& envelope = *decoded.envelope;
       Json common = line;
       common["postTime"] = envelope["postTime"];
       if (envelope.contains("clientId")) {
         common["clientId"] = envelope["clientId"];
       }
-      Json events = envelope.contains("events") ? std::move(envelope["events"]) : Json::array();
+      static const Json kNoEvents = Json::array();
+      const Json& events = envelope.contains("events") ? envelope["events"] : kNoEvents;
       if (events.empty()) {
         common["kind"] = "envelope";
         common["events"] = 0;
         writer_(render(common));
       }
       // The envelope's lines leave together, before its answer.
+      const LineText shared(common);
       std::string lines;
       const auto add = [&lines](const std::string& text) {
         lines += lines.empty() ? "" : "\n";
         lines += text;
       };
       const bool taken = status >= 200 && status <= 299;
-      for (Json& record : events) {
+      for (const Json& record : events) {
         if (options_.dropDuplicates && taken && record.is_object() && record.contains("_recordID") &&
             record["_recordID"].is_string()) {
           std::lock_guard lock(behaviourMutex_);
           if (!seenRecordIDs_.insert(record["_recordID"].get<std::string>()).second) {
             ++duplicates_;
-            add(render(common, Json{{"kind", "duplicate"},
-                                    {"_recordID", record["_recordID"]},
-                                    {"duplicates", duplicates_.load()}}));
+            add(shared.render(LineText(Json{{"kind", "duplicate"},
+                                            {"_recordID", record["_recordID"]},
+                                            {"duplicates", duplicates_.load()}})));
             continue;
           }
         }
-        Json own{{"kind", "record"}};
-        own["_sender"] = record.is_object() && record.contains("_sender") ? record["_sender"] : Json(nullptr);
-        own["_sessionID"] = record.is_object() && record.contains("_sessionID") ? record["_sessionID"] : Json(nullptr);
-        own["record"] = std::move(record);
-        add(render(common, own));
+        LineText own(Json{{"kind", "record"}});
+        const auto member = [&record](const char* key) {
+          return record.is_object() && record.contains(key) ? record[key] : Json(nullptr);
+        };
+        own.add("_sender", member("_sender"));
+        own.add("_sessionID", member("_sessionID"));
+        own.add("record", record);
+        add(shared.render(own));
       }
       if (!lines.empty()) {
         writer_(lines);
