@@ -108,9 +108,9 @@ int main(int argc, char** argv) {
   }
   std::ostream& out = outFile.empty() ? std::cout : file;
   std::mutex outMutex;
-  CollectorServer server(options, [&](const std::string& line) {
+  CollectorServer server(options, [&](const std::string& lines) {
     std::lock_guard lock(outMutex);
-    out << line << '\n';
+    out << lines << '\n';
     out.flush();
   });
   if (!server.start(&error)) {
