@@ -7,3 +7,5 @@ zerith_fuzz(NAME connection_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/ConnectionF
 zerith_fuzz(NAME daemon_status_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/DaemonStatusFuzz.cpp DEPS zerith_ipc)
 # The frame codec against libplist on the same bytes (differential).
 zerith_fuzz(NAME binary_plist_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/BinaryPlistFuzz.cpp DEPS zerith_ipc)
+# The entitlements policy's files, read as the listener reads them.
+zerith_fuzz(NAME entitlement_policy_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/EntitlementPolicyFuzz.cpp DEPS zerith_ipc)
