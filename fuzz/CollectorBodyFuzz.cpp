@@ -1,7 +1,8 @@
 // Feeds one input to the collector's decoding of untrusted request bodies:
 // as a body with and without "Content-Encoding: gzip", under small limits so
-// that the size, inflation and depth checks are reached, and to the depth
-// scan itself. Also replayed over its corpus by the collector tests.
+// that the size, inflation and depth checks are reached, to the depth scan
+// itself, and as the text of a behaviour file. Also replayed over its corpus
+// by the collector tests.
 
 #include <cstddef>
 #include <cstdint>
@@ -9,6 +10,7 @@
 #include <string_view>
 
 #include "tools/zerith-collector/CollectorBody.h"
+#include "tools/zerith-collector/CollectorServer.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   using namespace zerith::collector;
@@ -27,5 +29,15 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     }
   }
   (void)jsonNestingDepth(body, 16);
+  // Only the four behaviours, each with a number in its range.
+  if (const auto behaviour = Behaviour::parse(body)) {
+    const int n = behaviour->value;
+    const bool sane = behaviour->kind == Behaviour::Kind::status  ? n >= 100 && n <= 599
+                      : behaviour->kind == Behaviour::Kind::stall ? n >= 0 && n <= 600000
+                                                                  : n == 0;
+    if (!sane) {
+      std::abort();
+    }
+  }
   return 0;
 }
