@@ -35,12 +35,16 @@ void replaceFile(const std::filesystem::path& path, std::string_view contents) {
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  // Every path under a scratch root of this process.
-  std::string folder = (std::filesystem::temp_directory_path() / "device-file-fuzz-XXXXXX").string();
+  // Every path under a scratch root of this process, removed at its exit.
+  static std::string folder = (std::filesystem::temp_directory_path() / "device-file-fuzz-XXXXXX").string();
   if (::mkdtemp(folder.data()) == nullptr) {
     std::abort();
   }
   zerith::paths::setRoot(folder);
+  std::atexit([] {
+    std::error_code ignored;
+    std::filesystem::remove_all(folder, ignored);
+  });
   return 0;
 }
 
