@@ -44,12 +44,13 @@ bool parse(const zerith_session* s, const char* text, const char* what, Value& o
     return true;
   }
   if (s->format == ZERITH_FORMAT_JSON) {
-    auto parsed = nlohmann::ordered_json::parse(text, nullptr, false);
-    if (parsed.is_discarded()) {
-      fail(std::string(what) + " is not valid JSON");
+    std::string why;
+    auto parsed = zerith::json::parseValue(text, &why);
+    if (!parsed) {
+      fail(std::string(what) + " " + why);
       return false;
     }
-    out = zerith::json::fromJson(parsed);
+    out = std::move(*parsed);
     return true;
   }
   std::string why;

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <string_view>
 
+#include "platform/Json.h"
 #include "tools/zerith-collector/CollectorBody.h"
 #include "tools/zerith-collector/CollectorServer.h"
 
@@ -28,7 +29,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
       (void)decoded.envelope->dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
     }
   }
-  (void)jsonNestingDepth(body, 16);
+  (void)zerith::json::nestingDepth(body, 16);
   // Only the four behaviours, each with a number in its range.
   if (const auto behaviour = Behaviour::parse(body)) {
     const int n = behaviour->value;

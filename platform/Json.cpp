@@ -1,5 +1,6 @@
 #include "platform/Json.h"
 
+#include <algorithm>
 #include <cmath>
 
 #include "platform/Crypto.h"
@@ -65,6 +66,53 @@ Value fromJson(const nlohmann::ordered_json& j) {
 
 std::string serialize(const Value& value, bool pretty) {
   return pretty ? toJson(value).dump(4) : toJson(value).dump();
+}
+
+std::size_t nestingDepth(std::string_view text, std::size_t limit) {
+  std::size_t depth = 0;
+  std::size_t deepest = 0;
+  bool inString = false;
+  bool escaped = false;
+  for (const char c : text) {
+    if (inString) {
+      if (escaped) {
+        escaped = false;
+      } else if (c == '\\') {
+        escaped = true;
+      } else if (c == '"') {
+        inString = false;
+      }
+      continue;
+    }
+    if (c == '"') {
+      inString = true;
+    } else if (c == '[' || c == '{') {
+      deepest = std::max(deepest, ++depth);
+      if (deepest > limit) {
+        return deepest;
+      }
+    } else if ((c == ']' || c == '}') && depth > 0) {
+      --depth;
+    }
+  }
+  return deepest;
+}
+
+std::optional<Value> parseValue(std::string_view text, std::string* why, std::size_t maxDepth) {
+  const auto refuse = [why](std::string reason) -> std::optional<Value> {
+    if (why) {
+      *why = std::move(reason);
+    }
+    return std::nullopt;
+  };
+  if (nestingDepth(text, maxDepth) > maxDepth) {
+    return refuse("nests deeper than " + std::to_string(maxDepth) + " levels");
+  }
+  const auto parsed = nlohmann::ordered_json::parse(text, nullptr, /*allow_exceptions=*/false);
+  if (parsed.is_discarded()) {
+    return refuse("is not valid JSON");
+  }
+  return fromJson(parsed);
 }
 
 }  // namespace zerith::json

@@ -61,6 +61,21 @@ TEST(ValueTest, JsonKeepsOrderAndEncodesDataAsBase64) {
   EXPECT_EQ(json::fromJson(nlohmann::ordered_json::parse(R"({"q":[1,2.5,"s"]})"))["q"].at(1).doubleValue(), 2.5);
 }
 
+TEST(ValueTest, JsonFromCallersIsRefusedWithItsReasonWhenBrokenOrTooDeep) {
+  std::string why;
+  EXPECT_EQ(json::parseValue(R"({"q":[1,"]"]})", &why), Value(Dictionary{{"q", Array{Value(1), Value("]")}}})) << why;
+  EXPECT_FALSE(json::parseValue("{\"q\":", &why));
+  EXPECT_EQ(why, "is not valid JSON");
+  // Deep enough to overflow a thread's stack in the conversion: refused
+  // before anything is parsed. Brackets inside strings do not count.
+  const std::string deep = std::string(200000, '[') + std::string(200000, ']');
+  EXPECT_FALSE(json::parseValue(deep, &why));
+  EXPECT_EQ(why, "nests deeper than 32 levels");
+  EXPECT_TRUE(json::parseValue(std::string(32, '[') + std::string(32, ']')));
+  EXPECT_FALSE(json::parseValue(std::string(33, '[') + std::string(33, ']')));
+  EXPECT_EQ(json::nestingDepth("{\"a\":\"[[[[\\\"[[[\"}", 100), 1u);
+}
+
 TEST(ValueTest, SharedSmallNumbersBehaveAsNumbersMadeApart) {
   // Booleans and integers from -1 to 255 share their nodes; either side of
   // that range they are made apart. Type, equality and identity of copies

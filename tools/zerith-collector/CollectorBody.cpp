@@ -6,6 +6,7 @@
 #include <cctype>
 
 #include "platform/Crypto.h"
+#include "platform/Json.h"
 
 namespace zerith::collector {
 
@@ -63,36 +64,6 @@ std::optional<std::string> gunzipBounded(std::string_view gzip, std::size_t maxB
   return out;
 }
 
-std::size_t jsonNestingDepth(std::string_view text, std::size_t limit) {
-  std::size_t depth = 0;
-  std::size_t deepest = 0;
-  bool inString = false;
-  bool escaped = false;
-  for (const char c : text) {
-    if (inString) {
-      if (escaped) {
-        escaped = false;
-      } else if (c == '\\') {
-        escaped = true;
-      } else if (c == '"') {
-        inString = false;
-      }
-      continue;
-    }
-    if (c == '"') {
-      inString = true;
-    } else if (c == '[' || c == '{') {
-      deepest = std::max(deepest, ++depth);
-      if (deepest > limit) {
-        return deepest;
-      }
-    } else if ((c == ']' || c == '}') && depth > 0) {
-      --depth;
-    }
-  }
-  return deepest;
-}
-
 DecodedBody decodeRequestBody(std::string_view contentEncoding, std::string_view body, const BodyLimits& limits) {
   DecodedBody out;
   if (body.size() > limits.maxBodyBytes) {
@@ -118,7 +89,7 @@ DecodedBody decodeRequestBody(std::string_view contentEncoding, std::string_view
 
   const auto first = out.bytes.find_first_not_of(" \t\r\n");
   if (first == std::string::npos || out.bytes[first] != '{' ||
-      jsonNestingDepth(out.bytes, limits.maxJsonDepth) > limits.maxJsonDepth) {
+      json::nestingDepth(out.bytes, limits.maxJsonDepth) > limits.maxJsonDepth) {
     return out;
   }
   auto json = nlohmann::ordered_json::parse(out.bytes, nullptr, /*allow_exceptions=*/false);

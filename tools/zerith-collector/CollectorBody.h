@@ -40,10 +40,6 @@ DecodedBody decodeRequestBody(std::string_view contentEncoding, std::string_view
 // gzip or would inflate beyond `maxBytes`.
 std::optional<std::string> gunzipBounded(std::string_view gzip, std::size_t maxBytes, std::string* error = nullptr);
 
-// The deepest nesting of arrays and objects in JSON-like text, counting
-// brackets outside strings; stops counting once it passes `limit`.
-std::size_t jsonNestingDepth(std::string_view text, std::size_t limit);
-
 // "<xxxxxxxx xxxxxxxx ...>" of HMAC-SHA-1 over `message`, as the backends
 // send it in "X-ZTH-DIGEST".
 std::string digestHeaderValue(std::string_view key, std::string_view message);

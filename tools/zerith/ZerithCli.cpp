@@ -91,11 +91,12 @@ class Failure : public std::runtime_error {
 };
 
 Value parseJson(const std::string& text, const std::string& what) {
-  auto parsed = nlohmann::ordered_json::parse(text, nullptr, false);
-  if (parsed.is_discarded()) {
-    throw Failure(kExitUsage, what + " is not valid JSON: " + text);
+  std::string why;
+  auto parsed = json::parseValue(text, &why);
+  if (!parsed) {
+    throw Failure(kExitUsage, what + " " + why + ": " + text);
   }
-  return json::fromJson(parsed);
+  return std::move(*parsed);
 }
 
 Value parseDictionary(const std::optional<std::string>& text, const std::string& what) {

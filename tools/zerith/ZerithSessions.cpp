@@ -254,13 +254,14 @@ int runSessions(std::istream& script, const std::filesystem::path& socket, std::
     if (first == std::string::npos || text[first] == '#') {
       continue;
     }
-    const auto parsed = nlohmann::ordered_json::parse(text, nullptr, false);
-    if (parsed.is_discarded()) {
-      err << "zerith: line " << number << " is not valid JSON: " << text << '\n';
+    std::string why;
+    const auto parsed = json::parseValue(text, &why);
+    if (!parsed) {
+      err << "zerith: line " << number << " " << why << ": " << text << '\n';
       return kExitUsage;
     }
     try {
-      if (const auto status = runner.line(json::fromJson(parsed))) {
+      if (const auto status = runner.line(*parsed)) {
         err << "zerith: line " << number << " failed\n";
         return *status;
       }
