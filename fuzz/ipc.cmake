@@ -9,3 +9,5 @@ zerith_fuzz(NAME daemon_status_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/DaemonSt
 zerith_fuzz(NAME binary_plist_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/BinaryPlistFuzz.cpp DEPS zerith_ipc)
 # The entitlements policy's files, read as the listener reads them.
 zerith_fuzz(NAME entitlement_policy_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/EntitlementPolicyFuzz.cpp DEPS zerith_ipc)
+# JSON text from callers (payloads, session info, script lines) as values.
+zerith_fuzz(NAME json_value_fuzz SOURCES ${CMAKE_CURRENT_SOURCE_DIR}/JsonValueFuzz.cpp DEPS zerith_platform)
