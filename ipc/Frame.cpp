@@ -66,7 +66,8 @@ Data encodeFrame(const Value& message) {
 }
 
 std::size_t encodeCallAt(Data& buffer, std::size_t at, std::string_view operation,
-                         std::optional<std::uint64_t> call, const Dictionary& args, std::uint32_t descriptors) {
+                         std::optional<std::uint64_t> call, const Dictionary& args, std::uint32_t descriptors,
+                         bplist::Shape* shape) {
   bplist::Field fields[4];
   std::size_t count = 0;
   fields[count++] = bplist::textField("op", operation);
@@ -77,9 +78,23 @@ std::size_t encodeCallAt(Data& buffer, std::size_t at, std::string_view operatio
     fields[count++] = bplist::integerField("fds", descriptors);
   }
   fields[count++] = bplist::dictionaryField("args", args);
-  const std::size_t n = bplist::encodeAt(std::span(fields, count), buffer, at + kFrameHeaderBytes);
+  const std::size_t n = bplist::encodeAt(std::span(fields, count), buffer, at + kFrameHeaderBytes, shape);
   putLength(buffer, at, n);
   return kFrameHeaderBytes + n;
+}
+
+std::optional<std::string> frameRefusal(std::size_t bodyBytes, const bplist::Shape& shape) {
+  const plist::Limits limits = frameLimits();
+  if (bodyBytes > limits.maxBytes) {
+    return fmt::format("message of {} bytes exceeds the frame limit of {}", bodyBytes, limits.maxBytes);
+  }
+  if (shape.depth > limits.maxDepth) {
+    return fmt::format("message nests deeper than {} levels", limits.maxDepth);
+  }
+  if (shape.objects > limits.maxNodes) {
+    return fmt::format("message holds more than {} objects", limits.maxNodes);
+  }
+  return std::nullopt;
 }
 
 Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args,

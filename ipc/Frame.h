@@ -17,6 +17,7 @@
 #include <string_view>
 
 #include "ipc/Connection.h"
+#include "platform/BinaryPlist.h"
 #include "platform/Error.h"
 #include "platform/PropertyList.h"
 #include "platform/Value.h"
@@ -45,7 +46,11 @@ Data encodeCall(std::string_view operation, std::optional<std::uint64_t> call, c
 // make room and is not shrunk (a reused buffer is written without being
 // cleared); returns the frame's size.
 std::size_t encodeCallAt(Data& buffer, std::size_t at, std::string_view operation,
-                         std::optional<std::uint64_t> call, const Dictionary& args, std::uint32_t descriptors = 0);
+                         std::optional<std::uint64_t> call, const Dictionary& args, std::uint32_t descriptors = 0,
+                         bplist::Shape* shape = nullptr);
+// Why a frame's reader would refuse a body of `bodyBytes` bytes that has
+// `shape` (too large, too deep, too many objects); nullopt when it would not.
+std::optional<std::string> frameRefusal(std::size_t bodyBytes, const bplist::Shape& shape);
 Data encodeReply(std::uint64_t call, const Dictionary& args);
 Data encodeErrorReply(std::uint64_t call, const Error& error);
 

@@ -312,6 +312,20 @@ SocketConnection::WaitedReply SocketConnection::callAndWait(const std::string& o
   }
 }
 
+void SocketConnection::failCall(std::uint64_t call, Error error) {
+  std::optional<PendingCall> pending;
+  {
+    std::lock_guard lock(callsMutex_);
+    if (const auto it = pending_.find(call); it != pending_.end()) {
+      pending = std::move(it->second);
+      pending_.erase(it);
+    }
+  }
+  if (pending) {
+    queue_.async([handler = std::move(pending->handler), error = std::move(error)] { handler(std::nullopt, error); });
+  }
+}
+
 void SocketConnection::startCall(std::string_view operation, Dictionary args, ReplyHandler handler,
                                  bool neverWaits, std::vector<file::UniqueFd> descriptors) {
   std::uint64_t number = 0;

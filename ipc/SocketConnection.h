@@ -221,8 +221,11 @@ class SocketConnection final : public Connection {
   void releaseInput();
   void protocolError(const std::string& why);
 
+  // Ends the unanswered call `call` with `error`, on the queue.
+  void failCall(std::uint64_t call, Error error);
   // Writes the frame of a call of this thread (encoded in the thread's own
-  // buffer); false when the connection no longer writes.
+  // buffer); false when the connection no longer writes, or when the frame
+  // is more than a frame may carry (the call alone fails).
   bool writeCall(std::string_view operation, std::optional<std::uint64_t> call, const Dictionary& args,
                  std::vector<file::UniqueFd> descriptors = {});
   // Writes the frame `bytes` (held by `owned` when the outbox may take that

@@ -112,8 +112,18 @@ Data& threadFrameBuffer() {
 bool SocketConnection::writeCall(std::string_view operation, std::optional<std::uint64_t> call,
                                  const Dictionary& args, std::vector<file::UniqueFd> descriptors) {
   Data& buffer = threadFrameBuffer();
+  bplist::Shape shape;
   const std::size_t size =
-      encodeCallAt(buffer, 0, operation, call, args, static_cast<std::uint32_t>(descriptors.size()));
+      encodeCallAt(buffer, 0, operation, call, args, static_cast<std::uint32_t>(descriptors.size()), &shape);
+  if (auto why = frameRefusal(size - kFrameHeaderBytes, shape)) {
+    // The other end would refuse the frame and close the connection: this
+    // call alone fails, and the connection goes on.
+    log_.error("{}: {} not sent: {}", description(), operation, *why);
+    if (call) {
+      failCall(*call, Error{kErrorDomain, -1, "The message was not sent: " + *why});
+    }
+    return false;
+  }
   const bool written = writeBytes(buffer.data(), size, nullptr, std::move(descriptors));
   if (buffer.size() > kKeptFrameBuffer) {
     Data().swap(buffer);

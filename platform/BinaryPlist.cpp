@@ -642,7 +642,8 @@ class Writer {
     s_.texts.clear();
     bound_ = kHeaderBytes + kTrailerBytes;
     refs_ = 0;
-    plan(root);
+    depth_ = 0;
+    plan(root, 1);
     const std::size_t numObjects = s_.sizes.size();
     refSize_ = tableWidthOf(numObjects);
     bound_ += refs_ * refSize_ + numObjects * 8;
@@ -694,11 +695,13 @@ class Writer {
     bound_ += 10 + ((info & kAsciiText) ? length : 2 * length);
   }
 
-  // One object and its subtree; `v` is not nil.
-  void plan(const Value& v) {
+  // One object at nesting `depth` (the root is 1) and its subtree; `v` is
+  // not nil.
+  void plan(const Value& v, std::size_t depth) {
+    depth_ = std::max(depth_, depth);
     const std::size_t index = s_.sizes.size();
     s_.sizes.push_back(1);
-    v.visit([this](const auto& x) {
+    v.visit([this, depth](const auto& x) {
       using T = std::decay_t<decltype(x)>;
       if constexpr (std::is_same_v<T, std::string>) {
         planText(x);
@@ -709,11 +712,11 @@ class Writer {
         for (const auto& e : x) {
           if (!e.isNil()) {
             ++refs_;
-            plan(e);
+            plan(e, depth + 1);
           }
         }
       } else if constexpr (std::is_same_v<T, Dictionary>) {
-        planEntries(x);
+        planEntries(x, depth);
       } else {
         bound_ += 17;  // a scalar
       }
@@ -721,19 +724,22 @@ class Writer {
     s_.sizes[index] = static_cast<std::uint32_t>(s_.sizes.size() - index);
   }
 
-  void planEntries(const Dictionary& d) {
+  // A dictionary's keys and values sit one level below it.
+  void planEntries(const Dictionary& d, std::size_t depth) {
     bound_ += 10;
     for (const auto& [k, e] : d) {
       if (!e.isNil()) {
         refs_ += 2;
         s_.sizes.push_back(1);
+        depth_ = std::max(depth_, depth + 1);
         planText(k);
-        plan(e);
+        plan(e, depth + 1);
       }
     }
   }
 
-  void plan(std::span<const Field> fields) {
+  void plan(std::span<const Field> fields, std::size_t depth) {
+    depth_ = std::max(depth_, depth);
     s_.sizes.push_back(1);
     bound_ += 10;
     for (const auto& f : fields) {
@@ -742,6 +748,7 @@ class Writer {
       }
       refs_ += 2;
       s_.sizes.push_back(1);
+      depth_ = std::max(depth_, depth + 1);
       planText(f.key);
       switch (f.kind) {
         case Field::Kind::Text:
@@ -755,12 +762,12 @@ class Writer {
         case Field::Kind::Dictionary: {
           const std::size_t index = s_.sizes.size();
           s_.sizes.push_back(1);
-          planEntries(*f.dictionary);
+          planEntries(*f.dictionary, depth + 1);
           s_.sizes[index] = static_cast<std::uint32_t>(s_.sizes.size() - index);
           break;
         }
         case Field::Kind::Value:
-          plan(*f.value);
+          plan(*f.value, depth + 1);
           break;
       }
     }
@@ -995,8 +1002,13 @@ class Writer {
   std::uint8_t* p_ = nullptr;
   std::size_t bound_ = 0;
   std::size_t refs_ = 0;
+  std::size_t depth_ = 0;
   std::size_t text_ = 0;
   std::uint8_t refSize_ = 1;
+
+ public:
+  // What the last run wrote, as a reader counts it against its limits.
+  Shape shape() const { return Shape{depth_, s_.sizes.size()}; }
 };
 
 }  // namespace
@@ -1020,8 +1032,13 @@ std::size_t encode(const Value& value, Data& out) {
   return n;
 }
 
-std::size_t encodeAt(std::span<const Field> fields, Data& buffer, std::size_t at) {
-  return Writer().run(fields, buffer, at);
+std::size_t encodeAt(std::span<const Field> fields, Data& buffer, std::size_t at, Shape* shape) {
+  Writer writer;
+  const std::size_t n = writer.run(fields, buffer, at);
+  if (shape) {
+    *shape = writer.shape();
+  }
+  return n;
 }
 
 }  // namespace zerith::bplist

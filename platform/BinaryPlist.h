@@ -66,12 +66,20 @@ inline Field valueField(std::string_view key, const zerith::Value& v) {
   return {key, Field::Kind::Value, {}, 0, nullptr, &v};
 }
 
+// What a writer wrote, as decode() counts it against plist::Limits: the
+// deepest nesting (the root is 1, a container's keys and values one below
+// it) and the objects.
+struct Shape {
+  std::size_t depth = 0;
+  std::size_t objects = 0;
+};
+
 // Writes the binary property list of the dictionary of `fields` (in that
 // order, keys not repeated) at offset `at` of `buffer`, as encode() would
 // write that dictionary built as a Value, and returns its size. The buffer
 // grows to make room and is not shrunk: a reused buffer is written without
-// being cleared or reallocated.
-std::size_t encodeAt(std::span<const Field> fields, Data& buffer, std::size_t at);
+// being cleared or reallocated. With `shape`, says what it wrote.
+std::size_t encodeAt(std::span<const Field> fields, Data& buffer, std::size_t at, Shape* shape = nullptr);
 
 // Strict UTF-8: no overlong forms, no surrogates, nothing above U+10FFFF.
 bool validUtf8(std::string_view text);

@@ -248,6 +248,32 @@ TEST(SocketConnectionCalls, AnErrorReplyReachesTheCallerAsAnError) {
   EXPECT_EQ(pair.a->callAndWait("y", Dictionary{}, kWait).args, (Dictionary{{"ok", true}}));
 }
 
+// A call the other end would refuse (too deep, too large) is not sent: it
+// alone fails with the reason, and the connection goes on. The deepest call
+// the reader takes is sent and answered, so both ends count nesting alike.
+TEST(SocketConnectionCalls, ACallBeyondTheFrameLimitsFailsAloneAndTheConnectionGoesOn) {
+  ConnectedPair pair;
+  pair.serve();
+  // The root is 1, "args" 2, its entry 3: 29 arrays put the leaf at 32.
+  const auto nested = [](int arrays) {
+    Value v("leaf");
+    for (int i = 0; i < arrays; ++i) {
+      v = Value(Array{v});
+    }
+    return Dictionary{{"v", v}};
+  };
+  const auto deepest = pair.a->callAndWait("x", nested(29), kWait);
+  EXPECT_FALSE(deepest.error) << deepest.error->description;
+  EXPECT_EQ(deepest.args, nested(29));
+  EXPECT_EQ(pair.a->callAndWait("x", nested(30), kWait).error,
+            (Error{kErrorDomain, -1, "The message was not sent: message nests deeper than 32 levels"}));
+  const auto large = pair.a->callAndWait("x", Dictionary{{"v", std::string(kMaxFrameBytes, 'x')}}, kWait);
+  ASSERT_TRUE(large.error);
+  EXPECT_NE(large.error->description.find("exceeds the frame limit of 4194304"), std::string::npos);
+  EXPECT_EQ(pair.a->callAndWait("y", Dictionary{{"ok", true}}, kWait).args, (Dictionary{{"ok", true}}));
+  EXPECT_EQ(pair.object->calls().size(), 2u);  // the refused ones never arrived
+}
+
 // ---- ordering, queue and invalidation -------------------------------------------
 
 // Holds the queues of peers[i..] (nested syncs need no pool thread) while
