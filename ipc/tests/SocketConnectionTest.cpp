@@ -267,11 +267,17 @@ TEST(SocketConnectionCalls, ACallBeyondTheFrameLimitsFailsAloneAndTheConnectionG
   EXPECT_EQ(deepest.args, nested(29));
   EXPECT_EQ(pair.a->callAndWait("x", nested(30), kWait).error,
             (Error{kErrorDomain, -1, "The message was not sent: message nests deeper than 32 levels"}));
+  // The objects: the root, "op", "call", "args" and "v" with their values,
+  // and the array's elements; the reader takes 262144.
+  const auto wide = [](std::size_t elements) { return Dictionary{{"v", Array(elements, Value(7))}}; };
+  EXPECT_FALSE(pair.a->callAndWait("x", wide((1u << 18) - 9), kWait).error);
+  EXPECT_EQ(pair.a->callAndWait("x", wide((1u << 18) - 8), kWait).error,
+            (Error{kErrorDomain, -1, "The message was not sent: message holds more than 262144 objects"}));
   const auto large = pair.a->callAndWait("x", Dictionary{{"v", std::string(kMaxFrameBytes, 'x')}}, kWait);
   ASSERT_TRUE(large.error);
   EXPECT_NE(large.error->description.find("exceeds the frame limit of 4194304"), std::string::npos);
   EXPECT_EQ(pair.a->callAndWait("y", Dictionary{{"ok", true}}, kWait).args, (Dictionary{{"ok", true}}));
-  EXPECT_EQ(pair.object->calls().size(), 2u);  // the refused ones never arrived
+  EXPECT_EQ(pair.object->calls().size(), 3u);  // the refused ones never arrived
 }
 
 // ---- ordering, queue and invalidation -------------------------------------------
