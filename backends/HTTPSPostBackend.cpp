@@ -172,7 +172,7 @@ void notPosted(const std::shared_ptr<LivePost>& post, BackendCount reason, LossL
     return;
   }
   if (post->spool && reason == BackendCount::droppedBusy) {
-    post->spool->keep(post->request, post->records, post->counters);
+    post->spool->keep(post->request, post->records, post->counters, nullptr, Spool::Kept::withoutAPost);
     return;
   }
   post->counters->add(reason, post->records);

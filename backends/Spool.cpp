@@ -236,9 +236,10 @@ void Spool::start() {
 }
 
 void Spool::keep(URLRequest request, std::uint32_t records, std::shared_ptr<BackendCounters> counters,
-                 std::function<void(bool kept)> done) {
+                 std::function<void(bool kept)> done, Kept how) {
   std::weak_ptr<Spool> weak = weak_from_this();
-  queue_.async([weak, request = std::move(request), records, backend = std::move(counters), done = std::move(done)] {
+  queue_.async([weak, request = std::move(request), records, backend = std::move(counters), done = std::move(done),
+                how] {
     auto self = weak.lock();
     if (!self) {
       return;
@@ -267,6 +268,9 @@ void Spool::keep(URLRequest request, std::uint32_t records, std::shared_ptr<Back
       if (outcome.written) {
         kept = true;
         self->owners_[outcome.name] = backend;
+        if (how == Kept::withoutAPost) {
+          self->unposted_.insert(outcome.name);
+        }
         countBoth(BackendCount::spooled, records);
         countBoth(BackendCount::inSpool, records);
         self->hasBacklog_ = true;
@@ -314,7 +318,7 @@ void Spool::countDrops(const std::vector<SpoolStore::Dropped>& dropped) {
     droppedRecords_ += drop.entry.records;
     countOn(drop.entry.name, BackendCount::droppedSpoolFull, drop.entry.records);
     uncountOn(drop.entry.name, BackendCount::inSpool, drop.entry.records);
-    owners_.erase(drop.entry.name);
+    forget(drop.entry.name);
     if (drop.reason == SpoolStore::DropReason::size) {
       backendsLogger().error(
           "Spool: dropped the oldest batch {} ({} records) for the size limit of {} bytes; {} records dropped so far",

@@ -259,13 +259,16 @@ class Spool : public std::enable_shared_from_this<Spool> {
   Spool(Token, std::filesystem::path folder, SpoolConfig config,
         std::shared_ptr<ReportingSessionConnectivityInterface> transport);
 
+  // Whether a batch the spool keeps went out in a post before: its first
+  // post from the spool counts as "retried" only then.
+  enum class Kept { afterItsPost, withoutAPost };
   // Keeps a failed post's request (written on the spool's queue) and counts
   // it, on the posting backend's `counters` too (when given) until the batch
   // is delivered or dropped, whether or not the backend still lives. `done`
   // (optional) runs on the spool's queue once the batch is written or
   // dropped.
   void keep(URLRequest request, std::uint32_t records, std::shared_ptr<BackendCounters> counters,
-            std::function<void(bool kept)> done = nullptr);
+            std::function<void(bool kept)> done = nullptr, Kept how = Kept::afterItsPost);
   // A collector answered a live post with 2xx: a waiting retry goes now.
   void collectorAnswered();
 
@@ -307,6 +310,11 @@ class Spool : public std::enable_shared_from_this<Spool> {
   void retryAnswered(const std::string& name, std::uint32_t records, long status, const std::optional<Error>& error);
   std::chrono::steady_clock::duration backoffWithJitter();
   void countDrops(const std::vector<SpoolStore::Dropped>& dropped);
+  // The batch is gone from the spool: its owner and its mark go too.
+  void forget(const std::string& name) {
+    owners_.erase(name);
+    unposted_.erase(name);
+  }
   void countOn(const std::string& name, BackendCount what, std::uint64_t n);
   // Takes `n` back from a gauge, on the spool's counts and the batch's backend's.
   void uncountOn(const std::string& name, BackendCount what, std::uint64_t n);
@@ -328,6 +336,10 @@ class Spool : public std::enable_shared_from_this<Spool> {
   double backoffSeconds_ = 0;  // 0: the next failure waits the initial delay
   std::uint64_t droppedRecords_ = 0;
   std::map<std::string, std::shared_ptr<BackendCounters>> owners_;  // a batch's backend's counts
+  // Batches no post has carried yet (kept without one). A batch found from
+  // an earlier run may have been posted before the daemon stopped: its
+  // first post counts as a retry.
+  std::set<std::string> unposted_;
   std::mt19937_64 random_;
   std::atomic<bool> hasBacklog_{false};
   std::atomic<bool> usable_{false};  // the folder opened

@@ -76,7 +76,7 @@ void Spool::retryNext() {
     // Moved aside or gone: what it held is lost.
     countOn(entry->name, BackendCount::droppedSpoolFull, entry->records);
     uncountOn(entry->name, BackendCount::inSpool, entry->records);
-    owners_.erase(entry->name);
+    forget(entry->name);
   }
   if (!batch) {
     if (store_->size() == 0) {
@@ -96,7 +96,10 @@ void Spool::retryNext() {
   postInFlight_ = true;
   // Kept from the size and age limits while its post is under way.
   store_->pin(entry->name);
-  countOn(entry->name, BackendCount::retried, entry->records);
+  // Posted again, unless this is the first post that carries it.
+  if (unposted_.erase(entry->name) == 0) {
+    countOn(entry->name, BackendCount::retried, entry->records);
+  }
   std::weak_ptr<Spool> weak = weak_from_this();
   const std::string name = entry->name;
   const std::uint32_t records = entry->records;
@@ -135,7 +138,7 @@ void Spool::retryAnswered(const std::string& name, std::uint32_t records, long s
     countOn(name, BackendCount::delivered, records);
     uncountOn(name, BackendCount::inSpool, records);
     store_->remove(name);
-    owners_.erase(name);
+    forget(name);
     backoffSeconds_ = 0;
     backendsLogger().info("Spool: delivered batch {} ({} records); {} batches waiting", name, records, store_->size());
     if (store_->size() > 0) {
@@ -152,7 +155,7 @@ void Spool::retryAnswered(const std::string& name, std::uint32_t records, long s
     countOn(name, BackendCount::droppedTransportError, records);
     uncountOn(name, BackendCount::inSpool, records);
     store_->remove(name);
-    owners_.erase(name);
+    forget(name);
     backendsLogger().error("Spool: the collector refused batch {} ({} records) with status {}; dropped", name, records,
                            status);
     scheduleRetry(std::chrono::steady_clock::duration::zero());

@@ -132,7 +132,7 @@ void Spool::liveAnswered(const std::string& name, LiveAnswer answer) {
     const auto entry = store.find(name);
     const std::uint32_t records = entry ? entry->records : 0;
     if (records == 0 && answer != LiveAnswer::failed && answer != LiveAnswer::notPosted) {
-      self->owners_.erase(name);  // already gone (dropped while its post ran): counted then
+      self->forget(name);  // already gone (dropped while its post ran): counted then
       return;
     }
     switch (answer) {
@@ -140,13 +140,13 @@ void Spool::liveAnswered(const std::string& name, LiveAnswer answer) {
         self->countOn(name, BackendCount::delivered, records);
         self->uncountOn(name, BackendCount::inSpool, records);
         store.remove(name);
-        self->owners_.erase(name);
+        self->forget(name);
         break;
       case LiveAnswer::refused:
         self->countOn(name, BackendCount::droppedTransportError, records);
         self->uncountOn(name, BackendCount::inSpool, records);
         store.remove(name);
-        self->owners_.erase(name);
+        self->forget(name);
         break;
       case LiveAnswer::failed:
         backendsLogger().info("Spool: kept batch {} ({} records) after its post failed; {} batches ({} bytes) waiting",
@@ -154,6 +154,9 @@ void Spool::liveAnswered(const std::string& name, LiveAnswer answer) {
         self->retryLater();
         break;
       case LiveAnswer::notPosted:
+        if (entry) {
+          self->unposted_.insert(name);
+        }
         backendsLogger().debug("Spool: kept batch {} ({} records) without a post; {} batches waiting", name, records,
                                store.size());
         self->retryLater();
