@@ -4,7 +4,9 @@
 // stream's event and the upload server takes the file, which the framework
 // then removes.
 
+#include <csignal>
 #include <filesystem>
+#include <future>
 
 #include "tests/e2e/E2eFixture.h"
 #include "tests/support/Command.h"
@@ -29,7 +31,7 @@ class ExamplesTest : public E2eTest {
 
 TEST_F(ExamplesTest, EveryExampleRunsToItsEndWithoutAStorebag) {
   startDaemon();
-  for (const std::string name : {"c_report", "c_upload", "cpp_report", "cpp_call"}) {
+  for (const std::string name : {"c_report", "c_upload", "cpp_report", "cpp_call", "cpp_reconnect"}) {
     const CommandResult result = run(name);
     EXPECT_EQ(result.status, 0) << name << ":\n" << result.output << daemon->output();
   }
@@ -69,6 +71,22 @@ TEST_F(ExamplesTest, TheCallReceivesEveryStreamEventAndTheUploadServerTakesTheFi
   const auto requests = server.requests();
   const auto posted = std::find_if(requests.begin(), requests.end(), [](const auto& r) { return r.path == "/upload"; });
   EXPECT_NE(posted->body.size(), 0u);
+}
+
+// The daemon dies under the reporter and a new one starts: the reporter
+// connects again, and every event it made reaches a daemon.
+TEST_F(ExamplesTest, TheReporterSendsEveryEventAcrossARestartOfTheDaemon) {
+  startDaemon();
+  auto reporter = std::async(std::launch::async, [this] { return run("cpp_reconnect"); });
+  ASSERT_TRUE(daemon->waitFor("sendMessageWithDictionary: Sending message for session 200", 5)) << daemon->output();
+  daemon->signal(SIGKILL);
+  ASSERT_TRUE(daemon->waitForExit(10s));
+  daemon.reset();
+  startDaemon();
+  const CommandResult result = reporter.get();
+  EXPECT_EQ(result.status, 0) << result.output;
+  EXPECT_NE(result.output.find("reconnect: connected again"), std::string::npos) << result.output;
+  EXPECT_NE(result.output.find("reconnect: 30 events sent, 0 dropped, 0 not sent"), std::string::npos) << result.output;
 }
 
 }  // namespace
