@@ -2,14 +2,17 @@
 // the disk cache. Runs the structural check, the parser, base64 decoding and
 // the signature check against a fixed public key (the seeds in the corpus
 // are signed with its private key, so verified inputs reach the bag
-// decoder), and the bag decoder on the raw input as well. Each input is
+// decoder), and the bag decoder and the operator's lint on the raw input as
+// well (every finding names what it found). Each input is
 // checked twice: with the RSA key alone, and with the Ed25519 key too (the
 // "strong-" seeds carry that key's signature, so they reach its check).
 
 #include <cstddef>
+#include <cstdlib>
 #include <cstdint>
 #include <span>
 
+#include "config/StorebagLint.h"
 #include "config/StorebagVerify.h"
 
 namespace {
@@ -65,6 +68,12 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   if (strong.status == zerith::StorebagVerifyStatus::Verified) {
     (void)zerith::decodeStorebagBag(strong.bagBytes);
   }
-  (void)zerith::decodeStorebagBag(zerith::Data(input.begin(), input.end()));
+  if (const auto bag = zerith::decodeStorebagBag(zerith::Data(input.begin(), input.end())); !bag.isNil()) {
+    for (const auto& finding : zerith::lintStorebag(bag)) {
+      if (finding.what.empty()) {
+        std::abort();
+      }
+    }
+  }
   return 0;
 }

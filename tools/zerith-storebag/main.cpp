@@ -5,15 +5,19 @@
 //                          [--format binary|xml]
 //   zerith-storebag verify --public publicKey.der [--ed25519-public publicKeyEd25519.der] --in container.plist
 //   zerith-storebag show   --public publicKey.der [--ed25519-public publicKeyEd25519.der] --in container.plist
+//   zerith-storebag lint   --in bag.plist
 //   zerith-storebag [--root DIR] forget-issue-time --name dravon
 //
 // `sign` stamps the bag with its issue time ("issue_time", now) before it
 // signs it; `forget-issue-time` is the operator's way back past the daemon's
-// anti-rollback check for one storebag name.
+// anti-rollback check for one storebag name. `lint` says what the daemon
+// would ignore in a bag or never enable (config/StorebagLint.h); `sign`
+// prints the same findings on standard error and signs all the same.
 //
 // Exit status 0 on success, 1 when an operation fails (unreadable input, a
-// refused container), CLI11's codes for usage errors.
+// refused container, a bag with lint errors), CLI11's codes for usage errors.
 
+#include <algorithm>
 #include <cmath>
 #include <cstdio>
 #include <filesystem>
@@ -25,8 +29,10 @@
 
 #include "config/StorebagDiskCache.h"
 #include "config/StorebagIssueTimes.h"
+#include "config/StorebagLint.h"
 #include "config/StorebagSigner.h"
 #include "config/StorebagVerify.h"
+#include "platform/Crypto.h"
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
@@ -94,6 +100,11 @@ int sign(const std::string& keyPath, const std::string& strongKeyPath, const std
   const auto input = readInput(inPath, error);
   if (!input) {
     return failWith(error);
+  }
+  if (const zerith::Value decoded = zerith::decodeStorebagBag(*input); !decoded.isNil()) {
+    for (const auto& finding : zerith::lintStorebag(decoded)) {
+      std::cerr << "zerith-storebag: " << inPath << ": " << finding.describe() << "\n";
+    }
   }
   // Whole seconds: the XML form of a date keeps no fraction.
   const zerith::Date now{std::floor(zerith::Date::now().secondsSince1970)};
@@ -167,6 +178,37 @@ int check(const std::string& publicPath, const std::string& strongPublicPath, co
   return 0;
 }
 
+// The findings of a storebag, or of the bag inside a container (not
+// verified: lint needs no key).
+int lint(const std::string& inPath) {
+  std::string error;
+  const auto input = readInput(inPath, error);
+  if (!input) {
+    return failWith(error);
+  }
+  zerith::Value bag = zerith::decodeStorebagBag(*input, &error);
+  if (const std::string* text = bag["bag"].string(); text && bag["signature"].isString()) {
+    std::cout << inPath << ": a signed container; its bag, not verified:\n";
+    const auto inner = zerith::crypto::base64Decode(*text);
+    error = "\"bag\" is not valid base64";
+    bag = inner ? zerith::decodeStorebagBag(*inner, &error) : zerith::Value();
+  }
+  if (bag.isNil()) {
+    return failWith("'" + inPath + "': " + error);
+  }
+  const auto findings = zerith::lintStorebag(bag);
+  const auto errors = std::count_if(findings.begin(), findings.end(), [](const auto& f) { return f.error; });
+  for (const auto& finding : findings) {
+    std::cout << finding.describe() << "\n";
+  }
+  const auto counted = [](std::size_t n, const char* what) {
+    return std::to_string(n) + " " + what + (n == 1 ? "" : "s");
+  };
+  std::cout << inPath << ": " << counted(static_cast<std::size_t>(errors), "error") << ", "
+            << counted(findings.size() - static_cast<std::size_t>(errors), "warning") << "\n";
+  return errors == 0 ? 0 : 1;
+}
+
 int forgetIssueTime(const std::string& root, const std::string& name) {
   zerith::paths::setRoot(root);
   std::optional<zerith::Date> forgotten;
@@ -218,6 +260,11 @@ int main(int argc, char** argv) {
     cmd->add_option("--in", inPath, "Container")->required();
   }
 
+  auto* lintCmd = app.add_subcommand("lint", "Say what the daemon would ignore in a storebag or never enable (exit "
+                                             "status 1 on errors)");
+  lintCmd->add_option("--in", inPath, "Storebag property list, or a container (its bag is not verified)")
+      ->required();
+
   auto* forgetCmd = app.add_subcommand("forget-issue-time", "Let the daemon accept an older storebag of this name "
                                                             "again (the operator's way back)");
   forgetCmd->add_option("--name", name, "Storebag name (dravon, ...)")->required();
@@ -229,6 +276,9 @@ int main(int argc, char** argv) {
   }
   if (signCmd->parsed()) {
     return sign(keyPath, strongKeyPath, inPath, outPath, format);
+  }
+  if (lintCmd->parsed()) {
+    return lint(inPath);
   }
   if (forgetCmd->parsed()) {
     return forgetIssueTime(root, name);

@@ -17,6 +17,7 @@
 #include "platform/Json.h"
 #include "platform/Log.h"
 #include "platform/Paths.h"
+#include "platform/Spelling.h"
 #include "tools/zerith/ZerithSessions.h"
 #include "tools/zerith/ZerithStatus.h"
 #include "zerith/Zerith.h"
@@ -397,33 +398,10 @@ class Runner {
   std::unique_ptr<Zerith> session_;
 };
 
-// Edit distance, for "did you mean" hints on misspelt words.
-std::size_t distance(const std::string& a, const std::string& b) {
-  std::vector<std::size_t> row(b.size() + 1);
-  for (std::size_t j = 0; j <= b.size(); ++j) {
-    row[j] = j;
-  }
-  for (std::size_t i = 1; i <= a.size(); ++i) {
-    std::size_t diagonal = row[0];
-    row[0] = i;
-    for (std::size_t j = 1; j <= b.size(); ++j) {
-      const std::size_t above = row[j];
-      row[j] = std::min({row[j] + 1, row[j - 1] + 1, diagonal + (a[i - 1] == b[j - 1] ? 0 : 1)});
-      diagonal = above;
-    }
-  }
-  return row[b.size()];
-}
-
+// " (did you mean --option?)" for a misspelt word, or nothing.
 std::string suggestion(const std::string& word, const std::vector<std::string>& known) {
-  const std::string* best = nullptr;
-  std::size_t bestDistance = 3;  // at most two edits away
-  for (const auto& candidate : known) {
-    if (const auto d = distance(word, candidate); d < bestDistance) {
-      best = &candidate;
-      bestDistance = d;
-    }
-  }
+  const std::vector<std::string_view> words(known.begin(), known.end());
+  const auto best = nearestSpelling(word, words);
   return best ? " (did you mean " + *best + "?)" : "";
 }
 

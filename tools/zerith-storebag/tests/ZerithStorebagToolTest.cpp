@@ -169,5 +169,34 @@ TEST_F(ZerithStorebagToolTest, ForgetIssueTimeDropsOnlyTheNamedStorebag) {
   EXPECT_NE(damaged.output.find("is unusable"), std::string::npos) << damaged.output;
 }
 
+// An operator's typos: lint names them and fails, sign says the same on
+// standard error and signs all the same, and lint reads the bag inside the
+// container too. A clean bag passes.
+TEST_F(ZerithStorebagToolTest, LintNamesWhatTheDaemonWouldIgnoreBeforeAndAfterSigning) {
+  prepare();
+  const test::CommandResult clean = run("lint --in bag.plist");
+  EXPECT_EQ(clean.status, 0);
+  EXPECT_EQ(clean.output, "bag.plist: 0 errors, 0 warnings\n");
+
+  const Value dashboard(Dictionary{{"ip", "10.0.0.1"}});
+  write("typo.plist", plist::encodeXml(Value(Dictionary{{"seed", Dictionary{{"dashboard", dashboard}}},
+                                                        {"relase", Dictionary{{"dashboard", dashboard}}}})));
+  const std::string findings =
+      "error: seed.dashboard: no \"port\": the backend is not made\n"
+      "warning: unknown key \"relase\" (did you mean \"release\"?): the daemon does not read it\n";
+  const test::CommandResult typo = run("lint --in typo.plist");
+  EXPECT_EQ(typo.status, 1);
+  EXPECT_EQ(typo.output, findings + "typo.plist: 1 error, 1 warning\n");
+
+  const test::CommandResult signing = run("sign --key key.pem --in typo.plist --out typo.container");
+  EXPECT_EQ(signing.status, 0) << signing.output;
+  EXPECT_NE(signing.output.find("zerith-storebag: typo.plist: error: seed.dashboard: no \"port\""), std::string::npos)
+      << signing.output;
+  const test::CommandResult container = run("lint --in typo.container");
+  EXPECT_EQ(container.status, 1);
+  EXPECT_EQ(container.output, "typo.container: a signed container; its bag, not verified:\n" + findings +
+                                  "typo.container: 1 error, 1 warning\n");
+}
+
 }  // namespace
 }  // namespace zerith
