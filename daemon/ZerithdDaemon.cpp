@@ -33,6 +33,7 @@ extern "C" void __gcov_dump(void);
 #include "daemon/ZerithdAgent.h"
 #include "ipc/EntitlementPolicy.h"
 #include "ipc/Listener.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Executors.h"
 #include "platform/Log.h"
 #include "platform/ThreadPools.h"
@@ -170,6 +171,10 @@ int ZerithdDaemon::run() {
   const auto limits = ipc::ConnectionLimits::forThisProcess("com.velmar.zerith");
   listener->setConnectionLimits(limits);
   logger().info("main: at most {} client connections, {} per user", limits.total, limits.perUid);
+  // A misspelt key would otherwise be ignored without a word.
+  for (const std::string& unread : unreadDefaultsKeys("com.velmar.zerith")) {
+    logger().error("main: {}; it is ignored", unread);
+  }
   const auto transaction = std::make_shared<KeepAliveTransaction>();
   const auto agent = ZerithdAgent::create(transaction, std::make_unique<StorebagCache>());
   listener->setDelegate(agent.get());

@@ -42,6 +42,18 @@ TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
   EXPECT_NE(std::find(notes.begin(), notes.end(), "STOPPING=1"), notes.end());
 }
 
+// A misspelt key of its defaults is named when the daemon starts; the
+// test's own key (the storebag server) is one it reads.
+TEST_F(E2eTest, AKeyOfItsDefaultsThatTheDaemonDoesNotReadIsNamedAtStart) {
+  grant(Value(true));
+  Defaults("com.velmar.zerith").setObject("spoolEnbled", Value(true));
+  startDaemon();
+  EXPECT_TRUE(daemon->waitFor("main: zerithd does not read \"spoolEnbled\" in com.velmar.zerith (did you mean "
+                              "\"spoolEnabled\"?); it is ignored"))
+      << daemon->output();
+  EXPECT_EQ(daemon->count("does not read"), 1u);
+}
+
 TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
   grant(Value(true));
   startDaemon();

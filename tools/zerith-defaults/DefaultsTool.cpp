@@ -12,6 +12,7 @@
 
 #include "config/MessageLog.h"
 #include "platform/Defaults.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/PropertyList.h"
 
 namespace zerith::tool {
@@ -112,6 +113,14 @@ int write(const std::vector<std::string>& w, std::ostream& err) {
   if (!Defaults(w[1]).setObject(w[2], *value)) {
     err << fmt::format("zerith-defaults: could not write {}\n", Defaults(w[1]).path().string());
     return kNotFound;
+  }
+  // Written all the same: the operator may know better (a newer daemon).
+  auto unread = unreadDefaultsDomain(w[1]);
+  if (!unread) {
+    unread = unreadDefaultsKey(w[1], w[2]);
+  }
+  if (unread) {
+    err << "zerith-defaults: warning: " << *unread << "\n";
   }
   return kOk;
 }

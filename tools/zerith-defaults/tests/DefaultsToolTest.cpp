@@ -106,5 +106,27 @@ TEST_F(DefaultsToolTest, DeleteRemovesAKeyOrTheWholeDomain) {
   EXPECT_EQ(run({"delete", "com.velmar.zerith"}).status, tool::kNotFound);
 }
 
+// A name the daemon does not read is written all the same, with a warning
+// that names the nearest one it reads; the daemon's own keys and the ones it
+// makes itself (storebag metrics, identifiers) draw none.
+TEST_F(DefaultsToolTest, AKeyOrDomainTheDaemonDoesNotReadIsWrittenWithAWarning) {
+  const std::pair<std::string, std::string> writes[] = {
+      {"com.velmar.zerith spoolEnbled -bool true",
+       "zerith-defaults: warning: zerithd does not read \"spoolEnbled\" in com.velmar.zerith (did you mean "
+       "\"spoolEnabled\"?)\n"},
+      {"com.velmar.zerth spoolEnabled -bool true",
+       "zerith-defaults: warning: zerithd reads no domain com.velmar.zerth (did you mean \"com.velmar.zerith\"?)\n"},
+      {"com.velmar.zerith.consent DiagnosticsSubmissionAllowed -bool true", ""},
+      {"com.velmar.zerith spoolEnabled -bool true", ""},
+      {"com.velmar.zerith CACHED_dravon_max-age -int 600", ""},
+  };
+  for (const auto& [arguments, warning] : writes) {
+    const Result r = runTool("write " + arguments);
+    EXPECT_EQ(r.status, 0) << arguments;
+    EXPECT_EQ(r.err, warning) << arguments;
+  }
+  EXPECT_EQ(domain_.objectForKey("spoolEnbled"), Value(true));
+}
+
 }  // namespace
 }  // namespace zerith
