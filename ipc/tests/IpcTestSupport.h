@@ -172,6 +172,18 @@ struct RawPeer {
   }
 };
 
+// A socket bound at `path` and listening with `backlog` (0: bound only, as a
+// listener that died leaves it).
+inline file::UniqueFd boundSocket(const std::string& path, int backlog) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
+  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  EXPECT_EQ(::bind(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0) << path;
+  EXPECT_TRUE(backlog == 0 || ::listen(fd.get(), backlog) == 0) << path;
+  return fd;
+}
+
 // Two real connections joined by a socket pair; serve() exports `object` on
 // b and resumes both. With `clientEnd`, a is made as a client makes its
 // connection (connect), which is the end whose waiting callers read their
@@ -191,12 +203,7 @@ struct ConnectedPair {
     if (clientEnd) {
       static std::atomic<int> made{0};
       const std::string path = "/tmp/zerith-pair-" + std::to_string(::getpid()) + "-" + std::to_string(++made) + ".sock";
-      file::UniqueFd listening(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-      sockaddr_un address{};
-      address.sun_family = AF_UNIX;
-      std::strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
-      EXPECT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
-      EXPECT_EQ(::listen(listening.get(), 1), 0);
+      const file::UniqueFd listening = boundSocket(path, 1);
       a = SocketConnection::connect(path);
       file::UniqueFd accepted(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
       const PeerCredentials peer = *readPeerCredentials(accepted.get());
@@ -222,18 +229,6 @@ inline std::future<SocketConnection::WaitedReply> callLater(Connection& connecti
     promise->set_value({std::move(a), std::move(e)});
   });
   return promise->get_future();
-}
-
-// A socket bound at `path` and listening with `backlog` (0: bound only, as a
-// listener that died leaves it).
-inline file::UniqueFd boundSocket(const std::string& path, int backlog) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
-  file::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  EXPECT_EQ(::bind(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0) << path;
-  EXPECT_TRUE(backlog == 0 || ::listen(fd.get(), backlog) == 0) << path;
-  return fd;
 }
 
 inline Data bytesOfText(const std::string& s) { return Data(s.begin(), s.end()); }
