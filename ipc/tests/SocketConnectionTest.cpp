@@ -132,17 +132,6 @@ TEST(SocketConnectionFraming, BadFramesOfOneUserCloseEveryConnectionWhileTheLogH
   }
 }
 
-TEST(SocketConnectionFraming, ABodyJustUnderTheLimitPassesAndTheConnectionWritesLargeReplies) {
-  // 3 MiB through a socket whose buffer is far smaller: the reply goes out
-  // through the outbox as the peer reads.
-  RawPeer peer;
-  Dictionary args{{"blob", Value(Data(3u << 20, 0x5a))}};
-  peer.write(callFrame("big", 9, args));
-  const auto reply = peer.readMessage();
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->replyArgs, args);
-}
-
 TEST(SocketConnectionFraming, AReplyToAnUnknownCallAndACallWithoutAnExportedObjectAreLoggedAndTheConnectionGoesOn) {
   log::LogCapture capture;
   RawPeer peer;
@@ -270,7 +259,10 @@ TEST(SocketConnectionCalls, ACallBeyondTheFrameLimitsFailsAloneAndTheConnectionG
   // The objects: the root, "op", "call", "args" and "v" with their values,
   // and the array's elements; the reader takes 262144.
   const auto wide = [](std::size_t elements) { return Dictionary{{"v", Array(elements, Value(7))}}; };
-  EXPECT_FALSE(pair.a->callAndWait("x", wide((1u << 18) - 9), kWait).error);
+  // The widest call is a frame of 2 MiB each way, far more than a socket
+  // buffer holds: read in pieces, and its echo written through the outbox.
+  const auto widest = pair.a->callAndWait("x", wide((1u << 18) - 9), kWait);
+  EXPECT_TRUE(widest.args == wide((1u << 18) - 9)) << (widest.error ? widest.error->description : "not echoed whole");
   EXPECT_EQ(pair.a->callAndWait("x", wide((1u << 18) - 8), kWait).error,
             (Error{kErrorDomain, -1, "The message was not sent: message holds more than 262144 objects"}));
   const auto large = pair.a->callAndWait("x", Dictionary{{"v", std::string(kMaxFrameBytes, 'x')}}, kWait);
