@@ -1,7 +1,5 @@
 #include "config/StorebagDiskCache.h"
 
-#include <sys/stat.h>
-
 #include <fstream>
 
 #include "config/tests/StorebagTestFixture.h"
@@ -55,16 +53,14 @@ TEST_F(StorebagDiskCacheTest, ReadingMetricsReportsAChangedOrUnchangedLastModifi
   bool unchanged = false;
   std::optional<std::string> lastModified;
   getLastLoadedStorebagMetricsWithName("ambrel", &maxAge, &unchanged, &lastModified);
-  EXPECT_EQ(maxAge, 0);  // no metrics: a cached copy is always stale
-  EXPECT_FALSE(unchanged);
-  EXPECT_FALSE(lastModified);
+  EXPECT_EQ(std::tie(maxAge, unchanged, lastModified),
+            std::make_tuple(0, false, std::optional<std::string>()));  // no metrics: a cached copy is always stale
   EXPECT_TRUE(logs_.has(Level::Debug, "getLastLoadedStorebagMetricsWithName: maxAge is 0 for storebag ambrel"));
 
   saveLastLoadedStorebagMetricsWithName("ambrel", response("max-age=77", "Wed, 01 May 2024 10:00:00 GMT"));
   getLastLoadedStorebagMetricsWithName("ambrel", &maxAge, &unchanged, &lastModified);
-  EXPECT_EQ(maxAge, 77);
-  EXPECT_FALSE(unchanged);  // nothing passed in always differs
-  EXPECT_EQ(lastModified, "Wed, 01 May 2024 10:00:00 GMT");
+  EXPECT_EQ(std::tie(maxAge, unchanged, lastModified),  // unchanged: nothing passed in always differs
+            std::make_tuple(77, false, std::optional<std::string>("Wed, 01 May 2024 10:00:00 GMT")));
   EXPECT_TRUE(logs_.has(Level::Debug,
                         "getLastLoadedStorebagMetricsWithName: 'Last-Modified' has changed to 'Wed, 01 May 2024 "
                         "10:00:00 GMT' for storebag 'ambrel'"));
@@ -95,9 +91,7 @@ TEST_F(StorebagDiskCacheTest, SavedContainerIsReadBackWithItsModificationDate) {
   ASSERT_TRUE(saveStorebagToDisk("ambrel", bytes("x")));
   EXPECT_EQ(loadStorebagFromDisk("ambrel"), bytes("x"));
   // No temporary files are left next to it.
-  std::size_t files = 0;
-  for ([[maybe_unused]] const auto& e : std::filesystem::directory_iterator(paths::storebagCacheDir())) ++files;
-  EXPECT_EQ(files, 1u);
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(paths::storebagCacheDir()), {}), 1);
 }
 
 TEST_F(StorebagDiskCacheTest, MissingOrOversizedCacheFileIsALoggedLoadFailure) {

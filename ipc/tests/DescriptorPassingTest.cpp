@@ -91,8 +91,7 @@ TEST(DescriptorPassing, ConnectionCallCarriesItsDescriptorsAlsoBehindWaitingFram
     ASSERT_TRUE(pair.object->received.waitFor(waiting + 2));
     const auto calls = pair.object->calls();
     ASSERT_EQ(calls.size(), waiting + 2);
-    EXPECT_EQ(calls[waiting].operation, "upload");
-    EXPECT_EQ(calls.back().operation, "after");
+    EXPECT_EQ(std::tie(calls[waiting].operation, calls.back().operation), std::make_tuple("upload", "after"));
     EXPECT_TRUE(calls.back().descriptors.empty());
     ASSERT_EQ(calls[waiting].descriptors.size(), 1u);
     EXPECT_EQ(::write(calls[waiting].descriptors[0]->get(), "x", 1), 1);
