@@ -18,7 +18,6 @@ using test::bytes;
 using test::sampleStorebag;
 using test::signedContainer;
 using test::storebagKeys;
-using test::text;
 
 // The container's fields, to tamper with.
 Value containerFields(const Data& container) { return *plist::decode(plist::bytesOf(container)); }

@@ -6,7 +6,6 @@
 
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <future>

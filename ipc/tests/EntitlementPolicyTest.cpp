@@ -1,10 +1,8 @@
 #include "ipc/EntitlementPolicy.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
 #include "platform/Log.h"
-#include "platform/Paths.h"
 #include "platform/PropertyList.h"
 #include "tests/support/TempRoot.h"
 

@@ -1,7 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <fstream>
-
 #include "platform/Defaults.h"
 #include "platform/Log.h"
 #include "tests/support/TempRoot.h"

@@ -9,7 +9,6 @@
 #include <filesystem>
 #include <fstream>
 
-#include "platform/Paths.h"
 #include "transport/tests/TransportTestSupport.h"
 
 namespace zerith::test {
