@@ -26,7 +26,6 @@ using test::withEntry;
 using test::withoutKey;
 namespace fs = std::filesystem;
 
-// The release section of sampleStorebag().
 Value releaseSection() { return sampleStorebag()["release"]; }
 
 // A file's modification time as an HTTP date, as a static server sends it.
