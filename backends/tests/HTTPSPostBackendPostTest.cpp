@@ -198,9 +198,7 @@ TEST_F(HTTPSPostTest, FlushPostsTheBatchAndReportsWhyItCouldNot) {
   EXPECT_EQ(b->batchedEventsSize(), 0u);
 
   // Every record filtered out by the event lists.
-  auto client = enablingClient(server.url("/post"));
-  client.set("event_blacklist", Array{Value(1)});
-  auto blocked = backend(profileWith({client}), userInfo(), true, true);
+  auto blocked = batching(server.url("/post"), {{"event_blacklist", Array{Value(1)}}});
   blocked->sendMessage(clientEvent(4), at(1001), 1, 0, 0);
   EXPECT_EQ(flush(*blocked).value_or(Error{}).description,
             "Nothing to flush: batched events were completely filtered out");
@@ -215,9 +213,8 @@ TEST_F(HTTPSPostTest, FlushPostsTheBatchAndReportsWhyItCouldNot) {
 }
 
 TEST_F(HTTPSPostTest, RealtimeEventWhileBatchedFlushesFirstAndFreezesTheState) {
-  auto client = enablingClient(server.url("/post"));
+  auto client = enablingClient(server.url("/post"), {{"realtime_post_url", server.url("/now")}});
   client.erase("override_dnu");  // consent respected: printable copies
-  client.set("realtime_post_url", server.url("/now"));
   server.on("/now", Reply{});
   auto b = backend(profileWith({client}), userInfo(), true, true);
   ASSERT_EQ(b->state(), kBackendStateEnabled);
@@ -241,10 +238,7 @@ TEST_F(HTTPSPostTest, RealtimeEventWhileBatchedFlushesFirstAndFreezesTheState) {
 
 TEST_F(HTTPSPostTest, SampledOutBackendIsWokenByFlagTwoOrThreeButBatchesThatEvent) {
   for (int flag : {2, 3}) {
-    auto client = enablingClient(server.url("/post"));
-    client.set("sampling_threshold", 0.0);
-    client.set("override_sampling", 1.0);
-    auto b = backend(profileWith({client}));
+    auto b = immediate(server.url("/post"), {{"sampling_threshold", 0.0}, {"override_sampling", 1.0}});
     ASSERT_EQ(b->state(), kBackendStateSampledOut);
     const std::size_t before = server.requestCount();
     b->sendMessage(clientEvent(1), at(1001), 1, 0, 1);  // realtime, but sampled out: batched
@@ -339,10 +333,9 @@ TEST_F(HTTPSPostTest, CellularIsForbiddenForHapticsAndForBackendsWithoutUserInfo
   };
   auto recording = std::make_shared<Recording>();
   const auto cellular = [&](Value info, bool wifiOnly) {
-    auto client = enablingClient("https://127.0.0.1:1/");
-    client.set("use_wifi_only", wifiOnly ? 1 : 0);
-    client.set("client", "demo,com.velmar.lumira");
-    client.set("service", "cli,haptics");
+    const auto client = enablingClient("https://127.0.0.1:1/", {{"use_wifi_only", wifiOnly ? 1 : 0},
+                                                                {"client", "demo,com.velmar.lumira"},
+                                                                {"service", "cli,haptics"}});
     const bool require = !info.isNil();
     auto b = backend(profileWith({client}), std::move(info), require);
     b->setReportingSessionConnectivityDelegate(recording);
@@ -387,10 +380,8 @@ TEST_F(HTTPSPostTest, CorrelatedSessionIDRewritesTheBatch) {
 // --- Counts ----------------------------------------------------------------------------------
 
 TEST_F(HTTPSPostTest, BatchedEventsAreSentOrDroppedByTheEventListsAtTheFlush) {
-  Dictionary client = enablingClient(server.url("/post"));
-  client.set("event_whitelist", Array{Value(1), Value(2)});
-  client.set("event_blacklist", Array{Value(2)});
-  auto b = backend(profileWith({client}), userInfo(), true, true);
+  auto b = batching(server.url("/post"),
+                    {{"event_whitelist", Array{Value(1), Value(2)}}, {"event_blacklist", Array{Value(2)}}});
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   for (const std::uint16_t category : {1, 2, 3, 1}) {
     b->sendMessage(clientEvent(category), at(1001), category, 0, 0);
@@ -436,10 +427,7 @@ TEST_F(HTTPSPostTest, EventsThatMayNotGoCountTheReasonThatKeptThem) {
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.what);
-    Dictionary client = enablingClient(server.url("/post"));
-    for (const auto& [key, value] : c.change) {
-      client.set(key, value);
-    }
+    Dictionary client = enablingClient(server.url("/post"), c.change);
     if (!c.withURL) {
       client.erase("post_url");
     }

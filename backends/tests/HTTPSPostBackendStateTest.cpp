@@ -118,9 +118,7 @@ TEST_F(HTTPSRecordTest, EnvelopeCarriesDatesAsSecondsAndDropsWhatJsonCannotHold)
 }
 
 TEST_F(HTTPSRecordTest, EnvelopeWithoutClientIdentifierHoldsOnlyPostTime) {
-  auto client = enablingClient(server.url("/post"));
-  client.set("extras_on_internal", 1);
-  auto b = backend(profileWith({client}));
+  auto b = immediate(server.url("/post"), {{"extras_on_internal", 1}});
   b->setIsInternal(true);  // identified by the device identifier, which is absent
   const auto body = b->createMessageForPostAndLogging({Dictionary{{"a", 1}}}, nullptr);
   ASSERT_TRUE(body);
@@ -208,10 +206,8 @@ TEST_F(HTTPSStateTest, EachRefusalDisablesWithItsOwnLine) {
 }
 
 TEST_F(HTTPSStateTest, SamplingDrawOverManyBackendsStaysWithinBinomialBounds) {
-  auto client = enablingClient("https://x/");
-  client.set("sampling_threshold", 0.25);
-  client.set("override_sampling", 0.5);
-  const Value profile = profileWith({client});
+  const Value profile =
+      profileWith({enablingClient("https://x/", {{"sampling_threshold", 0.25}, {"override_sampling", 0.5}})});
   constexpr int kBackends = 1000;
   int enabled = 0;
   int sampledOut = 0;
@@ -283,9 +279,7 @@ TEST_F(HTTPSStateTest, WrongTypesInEveryProfileKeyAreLoggedAndNeverCrash) {
 }
 
 TEST_F(HTTPSStateTest, NegativeAndStringThresholdsKeepTheBackendWorking) {
-  auto client = enablingClient(server.url("/post"));
-  client.set("event_threshold", -3);
-  auto b = backend(profileWith({client}), userInfo(), true, true);
+  auto b = batching(server.url("/post"), {{"event_threshold", -3}});
   ASSERT_EQ(b->eventThreshold(), -3);
   EXPECT_TRUE(logs.contains("resetBackendStateWithClient: event_threshold -3 is negative"));
   // Each batched event flushes what came before it.
@@ -297,14 +291,13 @@ TEST_F(HTTPSStateTest, NegativeAndStringThresholdsKeepTheBackendWorking) {
 }
 
 TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndUserInfo) {
-  auto client = enablingClient(server.url("/post"));
-  client.set("filters", Array{Value(Dictionary{{"key", "UDID"}, {"action", "sha256"}}),
-                              Value(Dictionary{{"key", "secret"}, {"method", 5}, {"action", "remove"}}),
-                              Value(Dictionary{{"key", "account"}, {"status", 9}, {"action", "sha256"}}),
-                              Value(Dictionary{{"key", "clientName"}, {"action", "sha256"}}),
-                              Value(Dictionary{{"key", "bytes"}, {"action", "shred"}}),
-                              Value("not a filter")});
-  auto b = backend(profileWith({client}), userInfo(), true, true);
+  auto b = batching(server.url("/post"),
+                    {{"filters", Array{Value(Dictionary{{"key", "UDID"}, {"action", "sha256"}}),
+                                       Value(Dictionary{{"key", "secret"}, {"method", 5}, {"action", "remove"}}),
+                                       Value(Dictionary{{"key", "account"}, {"status", 9}, {"action", "sha256"}}),
+                                       Value(Dictionary{{"key", "clientName"}, {"action", "sha256"}}),
+                                       Value(Dictionary{{"key", "bytes"}, {"action", "shred"}}),
+                                       Value("not a filter")}}});
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   EXPECT_EQ(b->numberOfFilters(), 6);
 
@@ -405,10 +398,7 @@ INSTANTIATE_TEST_SUITE_P(Paths, OverrideSamplingTest, ::testing::ValuesIn(kOverr
 // A later decision that ends before the sampling step (here the locale)
 // leaves no override from the earlier one.
 TEST_F(HTTPSBackendTest, LocaleRefusalAfterAnOverrideDecisionReportsNone) {
-  auto client = enablingClient(server.url("/post"));
-  client.set("sampling_threshold", 0.5);
-  client.set("override_sampling", 0.9);
-  auto b = backend(profileWith({client}));
+  auto b = immediate(server.url("/post"), {{"sampling_threshold", 0.5}, {"override_sampling", 0.9}});
   b->setSamplingFactor(0.6);
   b->updateState();
   ASSERT_EQ(b->state(), kBackendStateSampledOut);

@@ -112,9 +112,10 @@ inline Value userInfo(const std::string& client = "demo", const std::string& ser
   return Value(Dictionary{{"clientName", client}, {"serviceName", service}});
 }
 
-// One client entry that enables everything for `demo`/`cli` in GB.
-inline Dictionary enablingClient(const std::string& postURL) {
-  return Dictionary{{"client", "demo"},
+// One client entry that enables everything for `demo`/`cli` in GB, with
+// `changes` set over it.
+inline Dictionary enablingClient(const std::string& postURL, const Dictionary& changes = {}) {
+  Dictionary client{{"client", "demo"},
                     {"service", "cli"},
                     {"override_dnu", 1},
                     {"locale_whitelist", Array{Value("GB"), Value("US")}},
@@ -122,6 +123,10 @@ inline Dictionary enablingClient(const std::string& postURL) {
                     {"sampling_threshold", 1.0},
                     {"event_threshold", 49},
                     {"post_url", postURL}};
+  for (const auto& [key, value] : changes) {
+    client.set(key, value);
+  }
+  return client;
 }
 
 inline Value profileWith(std::vector<Dictionary> clients) {
@@ -169,12 +174,13 @@ class HTTPSBackendTest : public ::testing::Test {
     return b;
   }
 
-  // Enabled for `demo`/`cli`, posting each event at once or batching them.
-  std::shared_ptr<HTTPSPostBackend> immediate(const std::string& url) {
-    return backend(profileWith({enablingClient(url)}));
+  // Enabled for `demo`/`cli` (with `changes` to that client entry), posting
+  // each event at once or batching them.
+  std::shared_ptr<HTTPSPostBackend> immediate(const std::string& url, const Dictionary& changes = {}) {
+    return backend(profileWith({enablingClient(url, changes)}));
   }
-  std::shared_ptr<HTTPSPostBackend> batching(const std::string& url) {
-    return backend(profileWith({enablingClient(url)}), userInfo(), true, true);
+  std::shared_ptr<HTTPSPostBackend> batching(const std::string& url, const Dictionary& changes = {}) {
+    return backend(profileWith({enablingClient(url, changes)}), userInfo(), true, true);
   }
 
   static timeval at(long seconds, long micros = 0) { return timeval{seconds, micros}; }
