@@ -8,6 +8,7 @@
 
 #include <map>
 #include <set>
+#include <stdexcept>
 
 #include "backends/DashboardDatagram.h"
 #include "backends/tests/BackendTestSupport.h"
@@ -28,15 +29,6 @@ using log::Level;
 using namespace std::chrono_literals;
 
 constexpr char kUdid[] = "0123456789abcdef0123456789abcdef01234567";
-
-Value profileFor(std::uint16_t port, std::optional<int> reliableMs = std::nullopt, Dictionary extra = {}) {
-  extra.set("ip", Value("127.0.0.1"));
-  extra.set("port", Value(static_cast<int>(port)));
-  if (reliableMs) {
-    extra.set("reliable", Value(*reliableMs));
-  }
-  return Value(std::move(extra));
-}
 
 // Made by the factory, as a session makes it.
 std::shared_ptr<DashboardBackend> makeBackend(const Value& profile) {
@@ -102,6 +94,21 @@ std::vector<std::uint8_t> ackFor(std::uint16_t event, std::size_t size = 64) {
 
 class DashboardBackendTest : public ::testing::Test {
  protected:
+  // A backend sending to the test server, reliable with that period when
+  // one is given; a test cannot go on without it.
+  std::shared_ptr<DashboardBackend> backend(std::optional<int> reliableMs = std::nullopt, Dictionary profile = {}) {
+    profile.set("ip", Value("127.0.0.1"));
+    profile.set("port", Value(static_cast<int>(server.port())));
+    if (reliableMs) {
+      profile.set("reliable", Value(*reliableMs));
+    }
+    auto b = makeBackend(Value(std::move(profile)));
+    if (!b) {
+      throw std::runtime_error("the factory made no dashboard backend");
+    }
+    return b;
+  }
+
   log::LogCapture logs;
   UdpTestServer server;
 };
@@ -109,8 +116,7 @@ class DashboardBackendTest : public ::testing::Test {
 // --- The datagram's bytes ----------------------------------------------------------------------
 
 TEST_F(DashboardBackendTest, EmptyEventIsA64ByteHeaderWithComplementedFieldsAndTimeIn4msSteps) {
-  auto b = makeBackend(profileFor(server.port()));
-  ASSERT_NE(b, nullptr);
+  auto b = backend();
   const auto line = send(*b, Value(Dictionary{}), at(12, 345678), 0x0102, 0x0304, 0x0a0b);
   ASSERT_TRUE(server.waitForArrivals(1));
   const auto d = server.arrivals()[0].bytes;
@@ -127,8 +133,7 @@ TEST_F(DashboardBackendTest, EmptyEventIsA64ByteHeaderWithComplementedFieldsAndT
 }
 
 TEST_F(DashboardBackendTest, TextIsOrderedByValueLengthWithEscapesAndNullForContainersAndCut) {
-  auto b = makeBackend(profileFor(server.port()));
-  ASSERT_NE(b, nullptr);
+  auto b = backend();
   const Value event(Dictionary{{"s", Value("a\nb=c\\d")},
                                {"long", Value("abcdef")},
                                {"nested", Value(Dictionary{{"x", Value(1)}})},
@@ -171,8 +176,7 @@ TEST_F(DashboardBackendTest, AddressBackendSetsTheReliableAndNotFromProfileFlags
 
 TEST_F(DashboardBackendTest, ProfileWithoutReliableSendsOnceAndNeverBinds) {
   server.setPolicy([](const auto&, std::size_t) { return UdpTestServer::Decision{.acknowledge = true}; });
-  auto b = makeBackend(profileFor(server.port()));
-  ASSERT_NE(b, nullptr);
+  auto b = backend();
   EXPECT_FALSE(b->reliableUDP());
   EXPECT_EQ(b->boundPort(), 0);
   EXPECT_FALSE(b->hasReadSource());
@@ -203,8 +207,7 @@ TEST_F(DashboardBackendTest, LossyNetworkStillGetsEveryDatagramAcknowledgedWithi
     }
     return UdpTestServer::Decision{.acknowledge = true};
   });
-  auto b = makeBackend(profileFor(server.port(), 5));
-  ASSERT_NE(b, nullptr);
+  auto b = backend(5);
   ASSERT_TRUE(b->reliableUDP());
   QueueWatch watch(*b);
   constexpr std::uint16_t kEvents = 30;
@@ -248,8 +251,7 @@ TEST_F(DashboardBackendTest, LossyNetworkStillGetsEveryDatagramAcknowledgedWithi
 // Asked to clean up with a datagram still unanswered, the backend sends it
 // five times in all, drops it, and only then lets its sources go.
 TEST_F(DashboardBackendTest, UnansweredDatagramIsSentFiveTimesThenDroppedBeforeTheCleanupEnds) {
-  auto b = makeBackend(profileFor(server.port(), 3));
-  ASSERT_NE(b, nullptr);
+  auto b = backend(3);
   QueueWatch watch(*b);
   send(*b, Value(Dictionary{{"k", Value("v")}}), at(1, 0), 1, 2, 9);
   ASSERT_TRUE(watch.waitFor(1));
@@ -271,8 +273,7 @@ TEST_F(DashboardBackendTest, UnansweredDatagramIsSentFiveTimesThenDroppedBeforeT
 
 TEST_F(DashboardBackendTest, FiftyFirstQueuedDatagramPushesOutTheOldest) {
   // A period long enough that no tick runs during the test.
-  auto b = makeBackend(profileFor(server.port(), 600000));
-  ASSERT_NE(b, nullptr);
+  auto b = backend(600000);
   for (std::uint16_t e = 1; e <= 51; ++e) {
     send(*b, Value(Dictionary{}), at(1, 0), 1, 2, e);
   }
@@ -286,8 +287,7 @@ TEST_F(DashboardBackendTest, FiftyFirstQueuedDatagramPushesOutTheOldest) {
 }
 
 TEST_F(DashboardBackendTest, ShortLongForgedAndUnknownAcknowledgementsAreIgnored) {
-  auto b = makeBackend(profileFor(server.port(), 600000));
-  ASSERT_NE(b, nullptr);
+  auto b = backend(600000);
   QueueWatch watch(*b);
   for (const std::uint16_t e : {std::uint16_t{4}, std::uint16_t{4}, std::uint16_t{5}}) {
     send(*b, Value(Dictionary{}), at(1, 0), 1, 2, e);
@@ -326,8 +326,7 @@ TEST_F(DashboardBackendTest, ShortLongForgedAndUnknownAcknowledgementsAreIgnored
 // --- Clean-up --------------------------------------------------------------------------------
 
 TEST_F(DashboardBackendTest, CleanupWithAnEmptyQueueCancelsTheSourcesAtOnce) {
-  auto b = makeBackend(profileFor(server.port(), 600000));
-  ASSERT_NE(b, nullptr);
+  auto b = backend(600000);
   ASSERT_TRUE(b->hasReadSource());
   b->cleanup();
   b->cleanup();  // finds nothing left to cancel: the socket is not closed twice
@@ -362,9 +361,7 @@ class DashboardLogDataTest : public DashboardBackendTest {
 
 TEST_F(DashboardLogDataTest, ArrayIsPostedAsABinaryPropertyListAndTheLocationReported) {
   https.on("/logs", Reply{.body = "https://store.example/logs/42"});
-  auto b = makeBackend(profileFor(server.port(), std::nullopt,
-                                  {{"post_url", Value(https.url("/logs"))}, {"display_url", Value("https://dash/")}}));
-  ASSERT_NE(b, nullptr);
+  auto b = backend(std::nullopt, {{"post_url", Value(https.url("/logs"))}, {"display_url", Value("https://dash/")}});
   EXPECT_EQ(b->displayURL(), "https://dash/");
   EXPECT_EQ(b->postURL(), https.url("/logs"));
   EXPECT_TRUE(b->usingProfile());
@@ -383,12 +380,12 @@ TEST_F(DashboardLogDataTest, ArrayIsPostedAsABinaryPropertyListAndTheLocationRep
 }
 
 TEST_F(DashboardLogDataTest, NoPostURLNotAnArrayAndTransportErrorsAnswerNo) {
-  auto without = makeBackend(profileFor(server.port()));
+  auto without = backend();
   EXPECT_FALSE(without->uploadLogData(Value(Array{Value("x")})));
   EXPECT_TRUE(logs.has(Level::Error, "DashboardBackend(uploadLogData): Post URL for log data array is nil"));
 
   RefusingPort refusing;
-  auto b = makeBackend(profileFor(server.port(), std::nullopt, {{"post_url", Value(refusing.url("/logs"))}}));
+  auto b = backend(std::nullopt, {{"post_url", Value(refusing.url("/logs"))}});
   b->setReportingSessionConnectivityDelegate(transport);
   EXPECT_FALSE(b->uploadLogData(Value("not an array")));
   EXPECT_TRUE(logs.has(Level::Error, "DashboardBackend(uploadLogData): Failed to serialize log data array for upload"));
