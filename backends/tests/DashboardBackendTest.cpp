@@ -398,12 +398,7 @@ TEST_F(DashboardLogDataTest, NoPostURLNotAnArrayAndTransportErrorsAnswerNo) {
 // --- The codec --------------------------------------------------------------------------------
 
 TEST(DashboardDatagramTest, DecodeChecksLengthsAndUndoesTheEscapes) {
-  dashboard::Header h;
-  h.seconds = 12;
-  h.microseconds = 345678;
-  h.sessionID = 7;
-  h.eventNumber = 300;
-  h.udid = kUdid;
+  const dashboard::Header h{.seconds = 12, .microseconds = 345678, .sessionID = 7, .udid = kUdid, .eventNumber = 300};
   const auto bytes = dashboard::encode(h, R"( a=x y b=c\=d\\ e=)");
   std::string why;
   const auto d = dashboard::decode(bytes, &why);
