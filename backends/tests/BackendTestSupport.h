@@ -1,14 +1,15 @@
 #pragma once
 
 // Scenario helpers of the backend tests: installing an adaptor plugin into
-// the temporary root, reading line files, a backend's self version and what
-// it counted.
+// the temporary root, writing files and reading line files, a backend's self
+// version and what it counted.
 
 #include <gtest/gtest.h>
 
 #include <filesystem>
 #include <fstream>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "backends/BackendCounters.h"
@@ -21,6 +22,10 @@ inline void installAdaptorPlugin(const char* builtPlugin) {
   const auto target = paths::adaptorPluginPath();
   std::filesystem::create_directories(target.parent_path());
   std::filesystem::copy_file(builtPlugin, target, std::filesystem::copy_options::overwrite_existing);
+}
+
+inline void writeFile(const std::filesystem::path& path, std::string_view contents) {
+  std::ofstream(path, std::ios::binary) << contents;
 }
 
 inline std::vector<std::string> readLines(const std::filesystem::path& path) {

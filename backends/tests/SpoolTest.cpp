@@ -11,7 +11,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <fstream>
 #include <future>
 #include <set>
 #include <thread>
@@ -20,6 +19,7 @@
 
 #include "backends/Spool.h"
 #include "backends/tests/BackendTestSupport.h"
+#include "tests/support/Command.h"
 #include "tests/support/HttpsTestServer.h"
 #include "tests/support/TempRoot.h"
 #include "tests/support/TestCA.h"
@@ -42,16 +42,6 @@ SpoolBatch batchOf(std::uint32_t records, std::size_t bodyBytes, std::int64_t cr
     batch.body.push_back(static_cast<std::uint8_t>('a' + i % 26));
   }
   return batch;
-}
-
-std::string slurp(const fs::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-}
-
-void spit(const fs::path& path, std::string_view bytes) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
 }
 
 mode_t modeOf(const fs::path& path) {
@@ -200,17 +190,17 @@ TEST_F(SpoolStoreTest, BadFilesAreMovedAsideNeverRead) {
     shortened = s.write(batchOf(3, 80, now)).name;
   }
   // A flipped body byte keeps the size: found only by the checksum on read.
-  std::string bytes = slurp(folder() / corrupt);
+  std::string bytes = readText(folder() / corrupt);
   bytes[bytes.size() - 5] ^= 1;
-  spit(folder() / corrupt, bytes);
-  bytes = slurp(folder() / shortened);
-  spit(folder() / shortened, bytes.substr(0, bytes.size() - 10));
+  writeFile(folder() / corrupt, bytes);
+  bytes = readText(folder() / shortened);
+  writeFile(folder() / shortened, bytes.substr(0, bytes.size() - 10));
   Data other = encodeSpoolFile(batchOf(4, 10, now));
   other[8] = 9;
-  spit(folder() / "0000000000000001-00000000.zspool", std::string(other.begin(), other.end()));
-  spit(folder() / "notes.txt", "hello");
+  writeFile(folder() / "0000000000000001-00000000.zspool", std::string(other.begin(), other.end()));
+  writeFile(folder() / "notes.txt", "hello");
   // A write that a kill cut short.
-  spit(folder() / (".tmp-" + good + ".Ab12Cd"), "ZTHSPOOL half");
+  writeFile(folder() / (".tmp-" + good + ".Ab12Cd"), "ZTHSPOOL half");
 
   SpoolStore s = store();
   EXPECT_EQ(namesIn(s.badFolder()),

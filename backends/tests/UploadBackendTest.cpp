@@ -9,7 +9,7 @@
 #include <fstream>
 #include <future>
 
-#include "platform/Defaults.h"
+#include "backends/tests/BackendTestSupport.h"
 #include "platform/Log.h"
 #include "platform/SandboxExtension.h"
 #include "tests/support/HttpsTestServer.h"
@@ -25,10 +25,6 @@ using log::Level;
 namespace fs = std::filesystem;
 
 constexpr char kUdid[] = "0123456789abcdef0123456789abcdef01234567";
-
-void writeFile(const fs::path& path, const std::string& contents) {
-  std::ofstream(path, std::ios::binary) << contents;
-}
 
 // The answer of one upload: (taken, serverSucceeded), or nullopt when none
 // came within the wait.
