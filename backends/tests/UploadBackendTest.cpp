@@ -36,6 +36,9 @@ class UploadBackendTest : public ::testing::Test {
     URLSession::setExtraCAFile(TestCA::shared().caFile().string());
     files = root.path() / "client";
     fs::create_directories(files);
+    // A client's file, and a collector that takes it.
+    writeFile(files / "report.log", "data");
+    https.on("/upload", Reply{.body = "success"});
     backend = UploadBackend::initWithName(kZerithBackendUploadServer,
                                           Value(Dictionary{{"post_url", Value(https.url("/upload"))},
                                                            {"display_url", Value("https://display/")}}),
@@ -81,14 +84,12 @@ class UploadBackendTest : public ::testing::Test {
 };
 
 TEST_F(UploadBackendTest, PostedWithoutSuccessOrWithATransportErrorStillAnswersYes) {
-  https.on("/upload", Reply{.body = "ok"});
-  const fs::path file = files / "report.log";
-  writeFile(file, "data");
-  EXPECT_EQ(upload(file), std::make_pair(true, false));
+  https.on("/upload", Reply{.body = "ok"});  // answered, but not with "success"
+  EXPECT_EQ(upload(files / "report.log"), std::make_pair(true, false));
 
   RefusingPort refusing;
   backend->setUploadURL(refusing.url("/upload"));
-  EXPECT_EQ(upload(file), std::make_pair(true, false));
+  EXPECT_EQ(upload(files / "report.log"), std::make_pair(true, false));
   EXPECT_TRUE(logs.contains("UploadBackend(uploadFileAtPath): post "));
 }
 
@@ -109,11 +110,9 @@ TEST_F(UploadBackendTest, EmptyOrChangedFilesAreRefused) {
 }
 
 TEST_F(UploadBackendTest, PlainHttpUploadAddressIsUpgradedAsEventPostsAre) {
-  https.on("/upload", Reply{.body = "success"});
   // The server speaks only TLS: the file arrives only when the scheme was
   // upgraded.
   backend->setUploadURL("http://127.0.0.1:" + std::to_string(https.port()) + "/upload");
-  writeFile(files / "report.log", "data");
   EXPECT_EQ(upload(files / "report.log"), std::make_pair(true, true));
   ASSERT_EQ(https.requestCount(), 1u);
   const auto request = https.requests()[0];
@@ -129,9 +128,7 @@ TEST_F(UploadBackendTest, PlainHttpUploadAddressIsUpgradedAsEventPostsAre) {
 }
 
 TEST_F(UploadBackendTest, StalledServerEndsWithNoAtTheTimeLimit) {
-  https.on("/upload", Reply{.body = "success"});
   https.holdAnswers();
-  writeFile(files / "report.log", "data");
   const auto began = std::chrono::steady_clock::now();
   auto f = start(files / "report.log", 1000, std::chrono::milliseconds(1500));
   EXPECT_EQ(wait(f, std::chrono::seconds(10)), std::make_pair(false, false));
@@ -141,9 +138,7 @@ TEST_F(UploadBackendTest, StalledServerEndsWithNoAtTheTimeLimit) {
 }
 
 TEST_F(UploadBackendTest, UploadsBeyondTheLimitsWaitWithoutAThreadOrAreRefused) {
-  https.on("/upload", Reply{.body = "success"});
   https.holdAnswers();
-  writeFile(files / "report.log", "data");
   // Two run for one client (the per-client limit), eight wait, the rest are
   // refused at once; another client still gets a slot of the four.
   std::vector<std::future<std::pair<bool, bool>>> mine;
