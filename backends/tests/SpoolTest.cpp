@@ -78,12 +78,8 @@ TEST(SpoolFileTest, AnotherVersionOrMagicSaysSo) {
 TEST(SpoolFileTest, LengthsInsideTheBodyAreBounded) {
   // A body that claims a URL longer than the file: the checksum holds (the
   // file was made so), the field check refuses.
-  Data body;
-  for (std::uint8_t b : {0xff, 0xff, 0xff, 0x7f, 0, 0, 0, 0, 0, 0, 0, 0}) {
-    body.push_back(b);
-  }
-  SpoolBatch batch;
-  Data bytes = encodeSpoolFile(batch);
+  const Data body{0xff, 0xff, 0xff, 0x7f, 0, 0, 0, 0, 0, 0, 0, 0};
+  Data bytes = encodeSpoolFile(SpoolBatch{});
   bytes.resize(kSpoolHeaderSize);
   bytes.insert(bytes.end(), body.begin(), body.end());
   bytes[24] = static_cast<std::uint8_t>(body.size());
@@ -312,10 +308,7 @@ TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
   std::atomic<int> answered{0};
   // Two 503s, then the collector takes everything.
   server.on("/post", [&](const RecordedRequest&) { return Reply{.status = ++answered <= 2 ? 503 : 200}; });
-  SpoolConfig config;
-  config.retryInitialSeconds = 0.05;
-  config.retryMaxSeconds = 0.2;
-  auto spool = makeSpool(config);
+  auto spool = makeSpool({.retryInitialSeconds = 0.05, .retryMaxSeconds = 0.2});
   ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), R"({"events":[{"a":1}]})"), 1));
   // Kept when no post slot was free: its first post is not a retry.
   ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), R"({"events":[{"b":2},{"c":3}]})"), 2,
@@ -338,9 +331,7 @@ TEST_F(SpoolRetryTest, FailuresBackOffThenTheSameBytesArriveOnce) {
 TEST_F(SpoolRetryTest, AClientErrorDropsTheBatchForGood) {
   HttpsTestServer server;
   server.on("/post", Reply{.status = 400});
-  SpoolConfig config;
-  config.retryInitialSeconds = 0.02;
-  auto spool = makeSpool(config);
+  auto spool = makeSpool({.retryInitialSeconds = 0.02});
   ASSERT_TRUE(kept(*spool, requestTo(server.url("/post"), "{}"), 3));
   ASSERT_TRUE(waitDrained(*spool));
   EXPECT_EQ(server.requestCount(), 1u);
@@ -349,10 +340,8 @@ TEST_F(SpoolRetryTest, AClientErrorDropsTheBatchForGood) {
 }
 
 TEST_F(SpoolRetryTest, SizeLimitCountsWhatItDrops) {
-  SpoolConfig config;
-  config.maxBytes = SpoolConfig::kMinMaxBytes;
-  config.retryInitialSeconds = 3600;  // no retry during the test
-  auto spool = makeSpool(config);
+  // No retry during the test.
+  auto spool = makeSpool({.maxBytes = SpoolConfig::kMinMaxBytes, .retryInitialSeconds = 3600});
   RefusingPort refusing;
   const std::string body(1500, 'x');
   for (int i = 0; i < 3; ++i) {
