@@ -32,21 +32,15 @@ class ProbeBackend : public ZerithBackend {
   std::int32_t lastFlag = 0;
 };
 
-std::string selfVersionOf(std::string_view text) {
-  ProbeBackend b;
-  b.setSelfVersion(text);
-  return test::selfVersionOf(b);
-}
-
 TEST(ZerithBackendTest, SelfVersionSplitsIntoThreeTruncatedBytes) {
-  EXPECT_EQ(selfVersionOf("3"), "3.0.0");
-  EXPECT_EQ(selfVersionOf("3.1"), "3.1.0");
-  EXPECT_EQ(selfVersionOf("3.1.4.1"), "3.1.4");
-  EXPECT_EQ(selfVersionOf("300.1"), "44.1.0");
-  EXPECT_EQ(selfVersionOf("8.1.0"), "8.1.0");
-  EXPECT_EQ(selfVersionOf(""), "0.0.0");
-  EXPECT_EQ(selfVersionOf("2.x.7b"), "2.0.7");
-  EXPECT_EQ(selfVersionOf("-1.256.257"), "255.0.1");
+  const std::pair<const char*, const char*> versions[] = {
+      {"3", "3.0.0"},     {"3.1", "3.1.0"}, {"3.1.4.1", "3.1.4"}, {"300.1", "44.1.0"},
+      {"8.1.0", "8.1.0"}, {"", "0.0.0"},    {"2.x.7b", "2.0.7"},  {"-1.256.257", "255.0.1"}};
+  for (const auto& [text, version] : versions) {
+    ProbeBackend b;
+    b.setSelfVersion(text);
+    EXPECT_EQ(test::selfVersionOf(b), version) << '"' << text << '"';
+  }
 }
 
 TEST(ZerithBackendTest, FirstEventIsNumberOneAndTheNumberWrapsAt16Bits) {
