@@ -113,6 +113,22 @@ class AgentFixture : public ::testing::Test {
     return c;
   }
 
+  // A configured session on the current storebag.
+  Client started(const Value& info, bool aggregator = false, const Value& userInfo = Value()) {
+    auto c = newSession(info, aggregator, userInfo);
+    c.session->startConfigWithCompletionHandler(nullptr);
+    return c;
+  }
+
+  // Unlists a session, lets it go and waits for `line`: by default the end
+  // of the only session, whose transport, closed last, has released the
+  // keep-alive count.
+  void endSession(Client& c, const std::string& line = "releaseVeskTransaction: Vesk transaction ended") {
+    agent->invalidateReportingSession(c.session);
+    c.session.reset();
+    ASSERT_TRUE(logs.waitFor(line));
+  }
+
   // Messages the daemon sent to a client's aggregator.
   static std::vector<Dictionary> aggregated(const FakeConnection& connection) {
     std::vector<Dictionary> out;

@@ -106,9 +106,7 @@ TEST_F(ZerithdAgentTest, SessionArrivingBeforeThePreviousTransportClosedBeginsAS
   ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ref count is 1"));
   EXPECT_EQ(transaction->endCount(), 0u);
 
-  agent->invalidateReportingSession(b.session);
-  b.session.reset();
-  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
+  endSession(b);
   EXPECT_EQ(agent->veskTransactionReference(), 0);
   EXPECT_EQ(transaction->endCount(), 1u);
 }

@@ -35,17 +35,9 @@ class SessionBackendsTest : public AgentFixture {
     storebag = Value(std::move(bag));
   }
 
-  // A configured session on the current storebag.
-  Client started(const Value& info, bool aggregator = false, const Value& userInfo = Value()) {
-    auto c = newSession(info, aggregator, userInfo);
-    c.session->startConfigWithCompletionHandler(nullptr);
-    return c;
-  }
-
   static std::shared_ptr<RecordingBackend> rec(const Client& c, std::string_view name) {
     return RecordingBackend::of(c.session->backendNamed(name));
   }
-
 };
 
 // --- The set --------------------------------------------------------------------------
@@ -273,9 +265,7 @@ TEST_F(SessionBackendsTest, SessionEndingMidFlushLetsTheLateCompletionsFinishSaf
   ASSERT_EQ(device.size(), 40u);
   int calls = 0;
   c.session->flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++calls; });
-  agent->invalidateReportingSession(c.session);
-  c.session.reset();
-  ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
+  endSession(c);
   EXPECT_EQ(a->cleanups(), 1);
   // The backend outlives its session: the device identifier it points at
   // must too.
@@ -405,9 +395,7 @@ TEST_F(SessionBackendsTest, EndMessageCarriesBatchSizesAndEveryBackendIsCleanedU
   EXPECT_EQ(c.session->batchedEventsSize(), 345u);
   const auto a = rec(c, "recA");
   const auto b = rec(c, "recB");
-  agent->invalidateReportingSession(c.session);
-  c.session.reset();
-  ASSERT_TRUE(logs.waitFor("dealloc: ZerithdSession dealloc: 5"));
+  endSession(c, "dealloc: ZerithdSession dealloc: 5");
   ASSERT_TRUE(a->waitForCount(2));
   const auto end = a->events().back();
   EXPECT_EQ(end.method, 0u);

@@ -20,14 +20,6 @@ class ZerithdSessionTest : public AgentFixture {
     storebagVersion = Value("42");
   }
 
-  // Unlists the only session and waits until it is gone: its transport,
-  // closed last, has released the keep-alive count.
-  void endSession(Client& c) {
-    agent->invalidateReportingSession(c.session);
-    c.session.reset();
-    ASSERT_TRUE(logs.waitFor("releaseVeskTransaction: Vesk transaction ended"));
-  }
-
   static std::optional<Value> oneShot(const Client& c, const Value& info, const Value& userInfo = Value()) {
     return answer([&](auto done) { c.session->sendMessageWithSessionInfo(info, userInfo, 1, 2, Value(), done); });
   }
@@ -145,8 +137,7 @@ TEST_F(ZerithdSessionTest, StartMessageCarriesLocaleAndAutomaticTimeOnCustomerBu
       Defaults("com.velmar.timed").setObject("AutomaticTimeZoneEnabled", Value(*row.automaticTime));
     }
     ::setenv("LC_ALL", row.locale, 1);
-    auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-    s.session->startConfigWithCompletionHandler(nullptr);
+    auto s = started(sessionInfo(5), /*aggregator=*/true);
     ::unsetenv("LC_ALL");
     const auto sent = aggregated(*s.connection);
     ASSERT_EQ(sent.size(), 1u);
@@ -196,8 +187,7 @@ TEST_F(ZerithdSessionTest, EndMessageSaysWhetherTheSessionFinishedGracefully) {
   for (const bool graceful : {true, false}) {
     SCOPED_TRACE(graceful ? "finished gracefully" : "ended without finishing");
     logs.clear();
-    auto s = newSession(sessionInfo(5), /*aggregator=*/true);
-    s.session->startConfigWithCompletionHandler(nullptr);
+    auto s = started(sessionInfo(5), /*aggregator=*/true);
     if (graceful) {
       s.session->finishSessionGracefully();
       EXPECT_TRUE(logs.has(Level::Debug, "finishSessionGracefully: Session 5 has been finished gracefully"));
@@ -225,8 +215,7 @@ TEST_F(ZerithdSessionTest, EndMessageSaysWhetherTheSessionFinishedGracefully) {
 // --- Aggregation -------------------------------------------------------------------------
 
 TEST_F(ZerithdSessionTest, UserInfoEntriesReplacePayloadEntriesOnTheWayToTheAggregator) {
-  auto s = newSession(sessionInfo(5), /*aggregator=*/true, Value(Dictionary{{"a", Value(2)}}));
-  s.session->startConfigWithCompletionHandler(nullptr);
+  auto s = started(sessionInfo(5), /*aggregator=*/true, Value(Dictionary{{"a", Value(2)}}));
   send(s, event(3, 70000, Value(Dictionary{{"a", Value(1)}, {"b", Value(1)}})));  // the type narrowed to 16 bits
   send(s, event(3, 4));
   const auto sent = aggregated(*s.connection);
