@@ -287,13 +287,11 @@ TEST_F(ZerithdAgentTest, ProcessMemoryUsageIsAnonymousResidentBytes) {
 }
 
 TEST(SenderCodes, HealthUsesTheTableOnlyForClientTypesFiveToTwentyThree) {
-  EXPECT_EQ(healthSenderCode(0), "Unknown");
-  EXPECT_EQ(healthSenderCode(4), "Unknown");
-  EXPECT_EQ(healthSenderCode(5), "YF");
-  EXPECT_EQ(healthSenderCode(14), "YH-QOB");
-  EXPECT_EQ(healthSenderCode(23), "WB");
-  EXPECT_EQ(healthSenderCode(24), "Unknown");
-  EXPECT_EQ(healthSenderCode(-1), "Unknown");
+  const std::pair<std::int64_t, const char*> health[] = {
+      {0, "Unknown"}, {4, "Unknown"}, {5, "YF"}, {14, "YH-QOB"}, {23, "WB"}, {24, "Unknown"}, {-1, "Unknown"}};
+  for (const auto& [clientType, code] : health) {
+    EXPECT_EQ(healthSenderCode(clientType), code) << "client type " << clientType;
+  }
   EXPECT_EQ(senderCode(0), "ZP");
   EXPECT_EQ(senderCode(16), "XMORDAL");
 }
