@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 #include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
