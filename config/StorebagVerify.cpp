@@ -11,6 +11,7 @@
 
 #include "config/StorebagDiskCache.h"
 #include "config/StorebagIssueTimes.h"
+#include "config/StorebagLint.h"
 #include "platform/Crypto.h"
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
@@ -378,6 +379,15 @@ Value parseAndVerifyStorebag(const std::string& name, const Data& data, bool sav
   }
   if (save && saveStorebagToDisk(name, data)) {
     configLogger().info("fetchStorebagWithName: storebag '{}' has been saved to disk cache", name);
+  }
+  // What the daemon will ignore in the bag or never enable, said once as the
+  // bag arrives from the server rather than session by session.
+  for (const auto& finding : save ? lintStorebag(bag) : std::vector<StorebagFinding>{}) {
+    if (finding.error) {
+      configLogger().error("fetchStorebagWithName: storebag '{}': {}", name, finding.describe());
+    } else {
+      configLogger().info("fetchStorebagWithName: storebag '{}': {}", name, finding.describe());
+    }
   }
   // A bag's time is remembered as it arrives from the server; reading the
   // disk copy back does not raise it again, so that the operator's forgetting

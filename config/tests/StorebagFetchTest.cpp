@@ -206,6 +206,19 @@ TEST_F(StorebagServerTest, FirstFetchIsAPlainGetOfTheVersionedURL) {
   EXPECT_EQ(metric("ambrel", "Last-Modified"), Value("Tue, 14 Nov 2023 22:13:20 GMT"));
 }
 
+// What lint finds in a bag is logged once, as it arrives from the server;
+// the disk copy read back later is not linted again.
+TEST_F(StorebagServerTest, ABagFromTheServerIsLintedAsItArrives) {
+  serve(signedContainer(withEntry(sampleStorebag(), "relase", Value(Dictionary{}))), {{"Cache-Control", "max-age=600"}});
+  EXPECT_EQ(fetch(5).section, releaseSection());
+  const std::string finding = "fetchStorebagWithName: storebag 'ambrel': warning: unknown key \"relase\" (did you mean "
+                              "\"release\"?): the daemon does not read it";
+  EXPECT_TRUE(logs_.has(Level::Default, finding));
+  logs_.clear();
+  EXPECT_EQ(fetch(5).section, releaseSection());
+  EXPECT_FALSE(logs_.contains("unknown key"));
+}
+
 // (Which Cache-Control headers have a usable max age is the parser's table.)
 TEST_F(StorebagServerTest, AnswerWithoutCacheHeadersIsKeptFor86400) {
   serve(signedContainer(sampleStorebag()));
