@@ -1,5 +1,9 @@
 #include "tools/zerith/ZerithCli.h"
 
+#include <grp.h>
+#include <pwd.h>
+#include <unistd.h>
+
 #include <fstream>
 #include <iostream>
 
@@ -13,6 +17,7 @@
 #include <vector>
 
 #include "config/ClientTypes.h"
+#include "ipc/EntitlementPolicy.h"
 #include "platform/Crypto.h"
 #include "platform/Json.h"
 #include "platform/Log.h"
@@ -405,6 +410,42 @@ std::string suggestion(const std::string& word, const std::vector<std::string>& 
   return best ? " (did you mean " + *best + "?)" : "";
 }
 
+// What the policy folder grants a process of `user` (a name or a uid; this
+// process's user by default), decided as the daemon decides it from a
+// connection's credentials: the user, its primary group and its
+// supplementary groups. Files the policy refuses are logged on stderr.
+int runEntitlements(const std::optional<std::string>& user, std::ostream& out, std::ostream& err) {
+  const std::string who = user.value_or(std::to_string(::geteuid()));
+  std::vector<char> buffer(1 << 16);
+  passwd entry{};
+  passwd* found = nullptr;
+  const bool numeric = !who.empty() && std::all_of(who.begin(), who.end(), [](char c) { return c >= '0' && c <= '9'; });
+  if (numeric) {
+    ::getpwuid_r(static_cast<uid_t>(std::stoul(who)), &entry, buffer.data(), buffer.size(), &found);
+  } else {
+    ::getpwnam_r(who.c_str(), &entry, buffer.data(), buffer.size(), &found);
+  }
+  if (!found) {
+    err << "zerith: no user " << who << " on this system\n";
+    return kExitUsage;
+  }
+  std::vector<gid_t> groups(64);
+  for (int count = static_cast<int>(groups.size());
+       ::getgrouplist(entry.pw_name, entry.pw_gid, groups.data(), &count) < 0 && count < (1 << 16);) {
+    groups.resize(static_cast<std::size_t>(count) * 2);
+    count = static_cast<int>(groups.size());
+  }
+  ipc::PeerCredentials peer{0, entry.pw_uid, entry.pw_gid, groups};
+  const Dictionary granted = ipc::EntitlementPolicy().entitlementsFor(peer);
+  const Value admits = granted.get(ipc::kZerithdEntitlement);
+  out << json::serialize(Value(Dictionary{{"user", std::string(entry.pw_name)},
+                                          {"uid", static_cast<unsigned long long>(entry.pw_uid)},
+                                          {"admitted", admits.isBool() && admits.boolValue()},
+                                          {"entitlements", granted}}))
+      << '\n';
+  return 0;
+}
+
 std::vector<std::string> longNames(const CLI::App& app) {
   std::vector<std::string> names;
   for (const auto* option : app.get_options()) {
@@ -506,6 +547,11 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
                 "com.velmar.private.zerithd.status)");
   status->allow_extras();
   status->add_flag("--json", statusJson, "Print the status as one JSON line instead of tables");
+  std::optional<std::string> user;
+  auto* entitlements = app.add_subcommand(
+      "entitlements", "Show what the entitlements policy grants a user's processes and whether the daemon admits them");
+  entitlements->allow_extras();
+  entitlements->add_option("--user", user, "User name or uid (default: this process's user)");
 
   const auto usage = [&](const std::string& what) {
     err << "zerith: " << what << "\nRun with --help for more information.\n";
@@ -518,7 +564,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return code == 0 ? 0 : kExitUsage;
   }
   CLI::App* chosen = nullptr;
-  for (auto* sub : {session, sessions, identifier, version, status}) {
+  for (auto* sub : {session, sessions, identifier, version, status, entitlements}) {
     if (*sub) {
       chosen = sub;
     }
@@ -527,7 +573,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return usage(*problem);
   }
   if (!chosen) {
-    return usage("a command is required: session, sessions, status, identifier or version");
+    return usage("a command is required: session, sessions, status, entitlements, identifier or version");
   }
   if (timeoutMs < 1) {
     return usage("--timeout must be at least 1 millisecond, not " + std::to_string(timeoutMs));
@@ -557,6 +603,9 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
                                               {"publicKey", Zerith::publicKeyPath().string()}}))
           << '\n';
       return 0;
+    }
+    if (chosen == entitlements) {
+      return runEntitlements(user, out, err);
     }
     if (chosen == status) {
       return runStatus(socket ? std::filesystem::path(*socket) : Zerith::defaultSocketPath(),

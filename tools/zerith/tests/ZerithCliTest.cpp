@@ -1,12 +1,16 @@
 #include "tools/zerith/ZerithCli.h"
 #include "tools/zerith/ZerithStatus.h"
 
+#include <unistd.h>
+
 #include <fstream>
 #include <gtest/gtest.h>
 
 #include <sstream>
 
 #include "client/tests/TestDaemon.h"
+#include "ipc/EntitlementPolicy.h"
+#include "platform/Json.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -224,7 +228,7 @@ TEST_F(CliFixture, BadCommandLinesAreRefusedBeforeConnecting) {
   EXPECT_EQ(runCli({"session", "--session-id", "1", "--step", "start"}).err, "zerith: session needs --client-type" + more);
   EXPECT_EQ(runCli({"session", "--client-type", "7", "--step", "start"}).err, "zerith: session needs --session-id" + more);
   EXPECT_EQ(runCli({"session", "--client-type", "7", "--session-id", "1"}).err, "zerith: session needs --step" + more);
-  EXPECT_EQ(runCli({}).err, "zerith: a command is required: session, sessions, status, identifier or version" + more);
+  EXPECT_EQ(runCli({}).err, "zerith: a command is required: session, sessions, status, entitlements, identifier or version" + more);
 
   // Misspelt words are named, with the nearest known one.
   EXPECT_EQ(runCli(session({"--stepp", "start"})).err,
@@ -286,6 +290,36 @@ TEST(Cli, IdentifierAndVersionUnderTheGivenRootOrTheDefaultOne) {
   const auto v = runCli({"version"});
   unsetenv("ZERITHD_ROOT");
   EXPECT_EQ(v.out, version);
+}
+
+// What the policy grants a user's processes, as the daemon decides it: this
+// process's user before and after it is granted, another user, and a user
+// the system does not have.
+TEST(Cli, EntitlementsShowWhatThePolicyGrantsAUser) {
+  TempRoot root;
+  const auto entitlements = [&root](std::vector<std::string> more) {
+    more.insert(more.begin(), {"--root", root.path().string(), "entitlements"});
+    const CliResult r = runCli(more);
+    EXPECT_EQ(r.status, 0) << r.err;
+    std::string why;
+    return json::parseValue(r.out, &why).value_or(Value());
+  };
+  const Value before = entitlements({});
+  EXPECT_EQ(before["uid"].unsignedValue(), ::geteuid());
+  EXPECT_EQ(before["admitted"], Value(false));
+  EXPECT_EQ(before["entitlements"], Value(Dictionary{}));
+
+  grantEntitlement(root);
+  const Value after = entitlements({"--user", std::to_string(::geteuid())});
+  EXPECT_EQ(after["admitted"], Value(true));
+  EXPECT_EQ(after["entitlements"][ipc::kZerithdEntitlement], Value(true));
+  if (::geteuid() != 65534) {
+    EXPECT_EQ(entitlements({"--user", "65534"})["admitted"], Value(false));
+  }
+
+  const CliResult unknown = runCli({"--root", root.path().string(), "entitlements", "--user", "no-such-zerith-user"});
+  EXPECT_EQ(unknown.status, cli::kExitUsage);
+  EXPECT_EQ(unknown.err, "zerith: no user no-such-zerith-user on this system\n");
 }
 
 }  // namespace
