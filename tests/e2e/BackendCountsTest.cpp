@@ -19,7 +19,6 @@ namespace fs = std::filesystem;
 class BackendCountsTest : public E2eTest {
  protected:
   void startAll() {
-    grant(Value(true));
     const fs::path www = root.path() / "collector/www";
     collector = startCollector({"--serve", www.string(), "--status", "200"});
     ASSERT_GT(collector->port(), 0);

@@ -32,7 +32,6 @@ void expectServing(RawFrameSocket& client, std::uint64_t number) {
 // --- Stopping ----------------------------------------------------------------
 
 TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
-  grant(Value(true));
   startDaemon();
   EXPECT_EQ(daemon->stop(5s), 0) << daemon->output();
   EXPECT_FALSE(daemon->output().empty());
@@ -45,7 +44,6 @@ TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
 // A misspelt key of its defaults is named when the daemon starts; the
 // test's own key (the storebag server) is one it reads.
 TEST_F(E2eTest, AKeyOfItsDefaultsThatTheDaemonDoesNotReadIsNamedAtStart) {
-  grant(Value(true));
   Defaults("com.velmar.zerith").setObject("spoolEnbled", Value(true));
   startDaemon();
   EXPECT_TRUE(daemon->waitFor("main: zerithd does not read \"spoolEnbled\" in com.velmar.zerith (did you mean "
@@ -55,7 +53,6 @@ TEST_F(E2eTest, AKeyOfItsDefaultsThatTheDaemonDoesNotReadIsNamedAtStart) {
 }
 
 TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
-  grant(Value(true));
   startDaemon();
   auto client = RawFrameSocket::connect();
   ASSERT_TRUE(client.has_value());
@@ -82,7 +79,6 @@ TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
 }
 
 TEST_F(E2eTest, StopTimeOutEndsTheDrainOfASessionThatStaysOpen) {
-  grant(Value(true));
   startDaemon({.arguments = {"--stop-timeout", "0.5"}});
   auto client = RawFrameSocket::connect();
   ASSERT_TRUE(client.has_value());
@@ -108,7 +104,6 @@ TEST_F(E2eTest, SocketThatCannotBeCreatedFailsTheStartWithAClearMessage) {
 // The daemon stops pinging once the main operation queue is wedged (through
 // its test hook), so that the manager would restart it.
 TEST_F(E2eTest, WatchdogPingsWhileServingAndStopsOnceAQueueIsWedged) {
-  grant(Value(true));
   // A 900 ms watchdog: a ping every 300 ms while all is well.
   startDaemon({.arguments = {"--stop-timeout", "5"},
                .environment = {{"WATCHDOG_USEC", "900000"}, {"ZERITHD_TEST_WEDGE_MAIN_QUEUE_AFTER_MS", "3000"}}});
@@ -146,7 +141,6 @@ class WriteLimitTest : public E2eTest, public ::testing::WithParamInterface<Writ
 
 TEST_P(WriteLimitTest, AWriteBeyondTheLimitFailsAndTheDaemonServesOn) {
   const WriteLimitCase& c = GetParam();
-  grant(Value(true));
   HttpsTestServer server;
   server.on("/post", {.status = 200});
   serveSignedStorebag(server, collectorStorebag(server.url("/post")));

@@ -16,8 +16,6 @@ namespace {
 
 class ExamplesTest : public E2eTest {
  protected:
-  void SetUp() override { grant(Value(true)); }
-
   // The example `name` ("c_upload", "cpp_call") run with this test's root.
   CommandResult run(const std::string& name) const {
     const std::string binary = std::string(ZERITH_EXAMPLES_DIR) + "/zerith_example_" + name;

@@ -115,7 +115,6 @@ struct OversizedAnswer {
 class OversizedAnswerTest : public PeerBoundsTest, public ::testing::WithParamInterface<OversizedAnswer> {};
 
 TEST_P(OversizedAnswerTest, IsCutAtTheLimitWhileItStreamsAndOthersAreServed) {
-  grant(Value(true));
   HttpsTestServer server;
   serveSignedStorebag(server, collectorStorebag(server.url("/post")));
   const std::string huge(64u << 20, 'x');
@@ -144,7 +143,6 @@ INSTANTIATE_TEST_SUITE_P(
     [](const auto& info) { return std::string(info.param.name); });
 
 TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
-  grant(Value(true));
   startQuietDaemon();
   const std::uint64_t idle = rssKiB();
   // 200 clients each start a frame of almost 4 MiB and send 1 MiB of it:
@@ -176,7 +174,6 @@ TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
 TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack) {
   DescriptorLimit limit(20000);
   ASSERT_GE(limit.granted(), 10500u);
-  grant(Value(true));
   Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(12000));
   startQuietDaemon();
   const std::uint64_t idle = rssKiB();
@@ -223,7 +220,6 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
 }
 
 TEST_F(PeerBoundsTest, AtTheConnectionLimitAcceptingWaitsUntilOneCloses) {
-  grant(Value(true));
   Defaults("com.velmar.zerith").setObject("maxConnections", Value(20));
   Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(20));
   startQuietDaemon();

@@ -23,10 +23,7 @@ using log::Level;
 
 class ClientSessionTest : public E2eTest {
  protected:
-  void SetUp() override {
-    grant(Value(true));
-    startDaemon({.arguments = {"--stop-timeout", "10"}});
-  }
+  void SetUp() override { startDaemon({.arguments = {"--stop-timeout", "10"}}); }
 };
 
 TEST_F(ClientSessionTest, LifecycleOperationsAnswerAsASessionWithoutBackends) {
@@ -119,7 +116,6 @@ TEST_F(ClientSessionTest, SessionsArrivingWhileAnEndedTransportClosesKeepThePair
 class SessionsTogetherTest : public E2eTest {
  protected:
   void SetUp() override {
-    grant(Value(true));
     const Value bag(Dictionary{{"version", Value("6.1.0")},
                                {"seed", Value(Dictionary{{kZerithBackendKovu, Value(Dictionary{})},
                                                          {kZerithBackendPellamlog, Value(Dictionary{})}})}});

@@ -19,7 +19,6 @@ namespace {
 class SlowServersLockTest : public E2eTest {
  protected:
   void SetUp() override {
-    grant(Value(true));
     // Client type 7's storebag ("dravon") is answered at once; its posts
     // take 2.5 s. Every other storebag name is answered after 5 s with a
     // 404: a first fetch with no disk copy, well within its 15 s time-out.

@@ -26,7 +26,6 @@ constexpr double kNewer = 1'800'000'000;  // 2027-01-15 08:00:00
 class StorebagStartTest : public E2eTest {
  protected:
   void SetUp() override {
-    grant(Value(true));
     serveSignedStorebag(server, Value(Dictionary{{"version", Value("5.2.0")},
                                                  {"seed", Dictionary{{"kovu", Dictionary{{"active", Value(true)}}}}}}));
   }

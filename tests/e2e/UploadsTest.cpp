@@ -71,7 +71,6 @@ Load settledLoad(pid_t pid) {
 class UploadsTest : public E2eTest {
  protected:
   void SetUp() override {
-    grant(Value(true));
     fs::create_directories(files);
   }
 
