@@ -87,15 +87,13 @@ TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
   EXPECT_TRUE(daemon->waitFor("refusing the status to")) << daemon->output();
 
   grant(Value(true), /*status=*/true);
-  const CliRun json = zerith({"status", "--json"});
-  ASSERT_EQ(json.status, 0) << json.err;
-  const auto parsed = nlohmann::ordered_json::parse(json.out);
+  const auto parsed = statusJson();
   // The asking connection is not listed; the refused one may still be, on
   // its way out, without backends.
   for (const auto& live : parsed["sessions"]) {
-    EXPECT_TRUE(live["backends"].empty()) << json.out;
+    EXPECT_TRUE(live["backends"].empty()) << parsed;
   }
-  ASSERT_EQ(parsed["ended"].size(), 2u) << json.out;
+  ASSERT_EQ(parsed["ended"].size(), 2u) << parsed;
   // Now with the final report itself, posted, and its end-of-session flush.
   EXPECT_TRUE(hasMembers(parsed["ended"][0], R"({"clientType":7,"backend":"httpsPost","sessions":1,
       "counts":{"sent":3,"droppedFiltered":1,"droppedBlacklisted":1,"droppedSampledOut":0}})"));

@@ -177,10 +177,7 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
   Defaults("com.velmar.zerith").setObject("maxConnectionsPerUser", Value(12000));
   startQuietDaemon();
   const std::uint64_t idle = rssKiB();
-  const auto descriptors = [&] {
-    const std::filesystem::path fds = "/proc/" + std::to_string(daemon->pid()) + "/fd";
-    return std::distance(std::filesystem::directory_iterator(fds), std::filesystem::directory_iterator());
-  };
+  const auto descriptors = [&] { return procEntries(daemon->pid(), "fd"); };
   // Twice: the second burst reuses what the first left, and gives it back too.
   for (int burst = 1; burst <= 2; ++burst) {
     std::vector<RawFrameSocket> clients;
@@ -203,7 +200,7 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
     // Every descriptor is given back, and the memory they took is trimmed
     // down to a little above idle (the sessions' last teardown can lag).
     const auto closing = std::chrono::steady_clock::now() + 60s;  // a sanitizer build closes slowly
-    while (descriptors() > 64 && std::chrono::steady_clock::now() < closing) {
+    while (descriptors() > 64u && std::chrono::steady_clock::now() < closing) {
       std::this_thread::sleep_for(100ms);
     }
     const auto trimmed = std::chrono::steady_clock::now() + 15s;
@@ -211,7 +208,7 @@ TEST_F(PeerBoundsTest, TenThousandIdleConnectionsAreHeldAndTheirMemoryGivenBack)
     while (kResidentSizeMeansSomething && rssKiB() > enough && std::chrono::steady_clock::now() < trimmed) {
       std::this_thread::sleep_for(100ms);
     }
-    EXPECT_LE(descriptors(), 64) << "burst " << burst;
+    EXPECT_LE(descriptors(), 64u) << "burst " << burst;
     if (kResidentSizeMeansSomething) {
       EXPECT_LE(rssKiB(), enough) << "burst " << burst << ": idle " << idle << " KiB, with 10,000 open " << held
                                   << " KiB";

@@ -37,12 +37,6 @@ namespace {
 namespace fs = std::filesystem;
 using Json = nlohmann::ordered_json;
 
-// Writes the collector's behaviour ("answer", "stall 300", "status 503", ...).
-bool writeBehaviour(const fs::path& behaviourFile, const std::string& text) {
-  return file::writeAtomically(
-      behaviourFile, std::span<const std::uint8_t>(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()));
-}
-
 // The collector's lines, read on a thread of their own so that its output
 // pipe never fills while a test floods: the records taken, and the record
 // IDs of the numbered events (method 3, payload "n") by number.
@@ -115,8 +109,7 @@ class SpoolTest : public E2eTest {
     for (const auto& [key, value] : keys) {
       Defaults("com.velmar.zerith").setObject(key, value);
     }
-    fs::create_directories(behaviourFile.parent_path());
-    writeBehaviour(behaviourFile, "answer");
+    behave("answer");
     collector = startCollector({"--serve", (root.path() / "collector/www").string(), "--behaviour-file",
                                 behaviourFile.string(), "--drop-duplicates"});
     ASSERT_GT(collector->port(), 0);
@@ -126,7 +119,12 @@ class SpoolTest : public E2eTest {
     startDaemon(trusting(collectorCA()));
   }
 
-  void behave(const std::string& text) { ASSERT_TRUE(writeBehaviour(behaviourFile, text)); }
+  // Writes the collector's behaviour ("answer", "stall 300", "status 503", ...).
+  void behave(const std::string& text) {
+    fs::create_directories(behaviourFile.parent_path());
+    ASSERT_TRUE(file::writeAtomically(
+        behaviourFile, std::span<const std::uint8_t>(reinterpret_cast<const std::uint8_t*>(text.data()), text.size())));
+  }
 
   // The spool on, retried after 0.2 s and then at most every second.
   static Dictionary spoolOn(Dictionary more = {}) {
@@ -488,8 +486,7 @@ TEST(SpoolUnderLoadTest, AFileThatCannotBeOpenedNowStaysAndIsReadLater) {
 // The collector is a process of its own, so that only this process runs
 // short of descriptors.
 TEST_F(SpoolTest, ConcurrentWritesAndReadsNeverMoveAGoodFile) {
-  fs::create_directories(behaviourFile.parent_path());
-  ASSERT_TRUE(writeBehaviour(behaviourFile, "status 503"));
+  behave("status 503");
   collector = startCollector({"--behaviour-file", behaviourFile.string()});
   ASSERT_TRUE(URLSession::setExtraCAFile(collectorCA().string()));
   // Its lines are read all along, so that its output never fills.
@@ -540,7 +537,7 @@ TEST_F(SpoolTest, ConcurrentWritesAndReadsNeverMoveAGoodFile) {
   for (auto& t : writers) {
     t.join();
   }
-  ASSERT_TRUE(writeBehaviour(behaviourFile, "answer"));
+  behave("answer");
   const auto deadline = std::chrono::steady_clock::now() + 30s;
   while (spool->pendingBatches() > 0 && std::chrono::steady_clock::now() < deadline) {
     std::this_thread::sleep_for(20ms);

@@ -98,13 +98,8 @@ TEST_F(UploadsTest, ClientRightsDecideWhatCanBeUploaded) {
   }
   ::chmod(root.path().c_str(), 0755);
   ::chmod(files.c_str(), 0777);
-  start(Dictionary{{"clients", Array{Value(Dictionary{{"client", "demo"},
-                                                      {"service", "cli"},
-                                                      {"override_dnu", 1},
-                                                      {"sampling_threshold", 1.0},
-                                                      {"locale_whitelist", Array{Value("GB")}},
-                                                      {"post_url", uploads.url("/upload")}})}}},
-        "en_GB.UTF-8");
+  // The demo client's profile that the collector tests' storebags give.
+  start(collectorStorebag(uploads.url("/upload"))["seed"]["httpsPost"].dictCopy(), "en_GB.UTF-8");
   uploads.on("/upload", Reply{.body = "success"});
   std::ofstream(files / "secret.log") << "secret";
   ::chown((files / "secret.log").c_str(), 0, 0);
