@@ -111,9 +111,12 @@ TEST(CollectorBodyCorpus, EveryCorpusInputDecodesWithoutCrashing) {
 
 class CollectorToolTest : public ::testing::Test {
  protected:
-  void SetUp() override { certs = root.path() / "certs"; }
-
-  std::vector<std::string> baseArgs() const { return {"--generate-cert", certs.string(), "--port", "0"}; }
+  // The built collector on a free port with a certificate it makes in
+  // `certs`, and `more` arguments.
+  CollectorProcess start(std::vector<std::string> more) const {
+    more.insert(more.begin(), {"--generate-cert", certs.string(), "--port", "0"});
+    return CollectorProcess(ZERITH_COLLECTOR_TOOL, more);
+  }
 
   // A real HTTPS backend that posts every event at once to `url`.
   std::shared_ptr<HTTPSPostBackend> backendFor(const std::string& url) {
@@ -132,14 +135,12 @@ class CollectorToolTest : public ::testing::Test {
   }
 
   TempRoot root;
-  fs::path certs;
+  fs::path certs = root.path() / "certs";
   std::shared_ptr<ReportingSessionConnectivityHelper> transport;
 };
 
 TEST_F(CollectorToolTest, BackendRecordsArriveOneLinePerRecordWithSenderSessionAndCheckedDigest) {
-  auto args = baseArgs();
-  args.insert(args.end(), {"--digest-key", "secret"});
-  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
+  CollectorProcess collector = start({"--digest-key", "secret"});
   ASSERT_GT(collector.port(), 0);
   auto b = backendFor(collector.url("/post"));
   b->setDigestKey(Data{'s', 'e', 'c', 'r', 'e', 't'});
@@ -212,9 +213,7 @@ CurlAnswer curlRequest(const std::string& url, const fs::path& ca, const std::op
 
 TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLocation) {
   const fs::path store = root.path() / "store";
-  auto args = baseArgs();
-  args.insert(args.end(), {"--store", store.string(), "--log-data-path", "/logs"});
-  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
+  CollectorProcess collector = start({"--store", store.string(), "--log-data-path", "/logs"});
   const std::string file = "diagnostic log\n" + std::string(5000, 'z');
   const auto upload =
       curlRequest(collector.url("/upload?uuid=abc&sequence=3&filename=x.log.gz&raw=true"), certs / "ca.pem",
@@ -239,9 +238,7 @@ TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLoc
 }
 
 TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
-  auto args = baseArgs();
-  args.insert(args.end(), {"--max-body", "100000", "--max-inflated", "200000"});
-  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
+  CollectorProcess collector = start({"--max-body", "100000", "--max-inflated", "200000"});
   const struct {
     const char* name;
     std::string body;
@@ -266,9 +263,7 @@ TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
 // a connection is closed as it comes, and its place is free again once a
 // connection ends.
 TEST_F(CollectorToolTest, ConnectionsBeyondItsLimitAreClosedUntilOneEnds) {
-  auto args = baseArgs();
-  args.insert(args.end(), {"--max-connections", "1"});
-  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
+  CollectorProcess collector = start({"--max-connections", "1"});
   // A connection that says nothing holds the one place (the collector
   // accepts in the order connections came).
   file::UniqueFd silent(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
@@ -298,9 +293,7 @@ TEST_F(CollectorToolTest, ServesStaticFilesWithLastModifiedAndNothingOutsideItsF
   fs::create_directories(www);
   std::ofstream(www / "dravon") << "signed bag";
   std::ofstream(root.path() / "secret") << "no";
-  auto args = baseArgs();
-  args.insert(args.end(), {"--serve", www.string()});
-  CollectorProcess collector(ZERITH_COLLECTOR_TOOL, args);
+  CollectorProcess collector = start({"--serve", www.string()});
   const auto get = [&](const std::string& path, const std::vector<std::string>& headers) {
     return curlRequest(collector.url(path), certs / "ca.pem", std::nullopt, headers);
   };
