@@ -33,13 +33,7 @@ CliResult runCli(std::vector<std::string> args) {
   return {status, out.str(), err.str()};
 }
 
-struct CliFixture : ::testing::Test {
-  TempRoot root;
-  std::unique_ptr<TestDaemon> daemon;
-  void SetUp() override {
-    grantEntitlement(root);
-    daemon = std::make_unique<TestDaemon>();
-  }
+struct CliFixture : DaemonFixture {
   std::vector<std::string> session(std::initializer_list<std::string> more) {
     std::vector<std::string> args{"--root", root.path().string(), "--timeout", "5000", "session", "--client-type", "7",
                                   "--session-id", "1"};
