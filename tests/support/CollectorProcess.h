@@ -64,7 +64,11 @@ class CollectorProcess {
     const auto at = said_.rfind(':');
     port_ = at == std::string::npos ? 0 : std::atoi(said_.c_str() + at + 1);
   }
-  ~CollectorProcess() { stop(); }
+  ~CollectorProcess() {
+    if (child_) {
+      child_->stop(std::chrono::seconds(5));
+    }
+  }
   CollectorProcess(const CollectorProcess&) = delete;
   CollectorProcess& operator=(const CollectorProcess&) = delete;
 
@@ -91,12 +95,6 @@ class CollectorProcess {
       if (!readSome(out_.get(), pending_, timeout)) {
         return std::nullopt;
       }
-    }
-  }
-
-  void stop() {
-    if (child_) {
-      child_->stop(std::chrono::seconds(5));
     }
   }
 

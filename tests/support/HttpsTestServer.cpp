@@ -34,11 +34,6 @@ std::optional<std::string> RecordedRequest::header(std::string_view name) const 
   return std::nullopt;
 }
 
-std::size_t RecordedRequest::headerCount(std::string_view name) const {
-  return static_cast<std::size_t>(
-      std::count_if(headers.begin(), headers.end(), [&](const auto& h) { return equalsIgnoringCase(h.first, name); }));
-}
-
 struct HttpsTestServer::Impl {
   std::unique_ptr<httplib::SSLServer> server;
   std::thread thread;

@@ -43,7 +43,6 @@ struct RecordedRequest {
 
   // First value of the header (case-insensitive name), nullopt when absent.
   std::optional<std::string> header(std::string_view name) const;
-  std::size_t headerCount(std::string_view name) const;
 };
 
 // Every member has a default, so designated initializers may name any subset

@@ -68,8 +68,6 @@ TestCA& TestCA::shared() {
   return ca;
 }
 
-const std::string& TestCA::certificatePem() const { return impl_->ca->certificatePem(); }
-
 IssuedCertificate TestCA::issueServerCertificate(const std::vector<std::string>& dnsNames,
                                                  const std::vector<std::string>& ipAddresses) const {
   std::string error;

@@ -29,8 +29,6 @@ class TestCA {
   // The process's shared CA (created on first use).
   static TestCA& shared();
 
-  const std::string& certificatePem() const;
-
   // A new leaf certificate for TLS servers, signed by this CA, valid from an
   // hour ago for 30 days.
   IssuedCertificate issueServerCertificate(const std::vector<std::string>& dnsNames = {"localhost"},
