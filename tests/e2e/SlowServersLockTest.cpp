@@ -43,13 +43,8 @@ class SlowServersLockTest : public E2eTest {
   static std::future<bool> startSessionAsync(std::int64_t clientType, std::uint32_t id) {
     return std::async(std::launch::async, [clientType, id] {
       auto client = Zerith::connect();
-      if (!client) {
-        return false;
-      }
-      if (!client->setSessionInfo(sessionInfo(id, clientType), Value(), Value(), false, 20s)) {
-        return false;
-      }
-      return static_cast<bool>(client->startConfig(20s));
+      return client && client->setSessionInfo(sessionInfo(id, clientType), Value(), Value(), false, 20s) &&
+             client->startConfig(20s);
     });
   }
 
