@@ -105,8 +105,7 @@ TEST_F(E2eTest, SocketThatCannotBeCreatedFailsTheStartWithAClearMessage) {
 // its test hook), so that the manager would restart it.
 TEST_F(E2eTest, WatchdogPingsWhileServingAndStopsOnceAQueueIsWedged) {
   // A 900 ms watchdog: a ping every 300 ms while all is well.
-  startDaemon({.arguments = {"--stop-timeout", "5"},
-               .environment = {{"WATCHDOG_USEC", "900000"}, {"ZERITHD_TEST_WEDGE_MAIN_QUEUE_AFTER_MS", "3000"}}});
+  startDaemon({.environment = {{"WATCHDOG_USEC", "900000"}, {"ZERITHD_TEST_WEDGE_MAIN_QUEUE_AFTER_MS", "3000"}}});
   ASSERT_TRUE(daemon->waitFor("Watchdog on, pinging every 300 ms")) << daemon->output();
   const auto pings = [&] {
     const auto all = daemon->notifications();

@@ -34,9 +34,7 @@ class StorebagStartTest : public E2eTest {
 };
 
 TEST_F(StorebagStartTest, StorebagServerOutsideTheTrustedAuthoritiesLeavesTheSessionUnstarted) {
-  DaemonProcess::Options options = trusting();
-  options.arguments.resize(2);  // no --ca-file
-  startDaemon(options);
+  startDaemon();  // no --ca-file: the test CA is not trusted
   EXPECT_TRUE(startedBackends(31).isNil());
   // The error line carries the TLS cause, not only the info line before it.
   const std::string url = server.url("/zerith/dravon?version=8.0");
