@@ -7,6 +7,7 @@
 #include <csignal>
 #include <filesystem>
 #include <future>
+#include <map>
 
 #include "tests/e2e/E2eFixture.h"
 #include "tests/support/Command.h"
@@ -29,14 +30,15 @@ class ExamplesTest : public E2eTest {
 
 TEST_F(ExamplesTest, EveryExampleRunsToItsEndWithoutAStorebag) {
   startDaemon();
+  std::map<std::string, CommandResult> results;
   for (const std::string name : {"c_report", "c_upload", "cpp_report", "cpp_call", "cpp_reconnect"}) {
-    const CommandResult result = run(name);
+    const CommandResult& result = results[name] = run(name);
     EXPECT_EQ(result.status, 0) << name << ":\n" << result.output << daemon->output();
   }
-  const CommandResult call = run("cpp_call");
+  const CommandResult& call = results["cpp_call"];
   EXPECT_NE(call.output.find("call: no backends for this client type, so nothing is aggregated"), std::string::npos)
       << call.output;
-  const CommandResult upload = run("c_upload");
+  const CommandResult& upload = results["c_upload"];
   for (const char* line : {"upload file: {\"success\":false,\"removeFile\":false}", "the log file is still here",
                            "one-shot event: {\"result\":\"storebag not available\"}"}) {
     EXPECT_NE(upload.output.find(line), std::string::npos) << line << " in\n" << upload.output;
@@ -68,6 +70,7 @@ TEST_F(ExamplesTest, TheCallReceivesEveryStreamEventAndTheUploadServerTakesTheFi
   ASSERT_TRUE(server.waitForRequestTo("/upload"));
   const auto requests = server.requests();
   const auto posted = std::find_if(requests.begin(), requests.end(), [](const auto& r) { return r.path == "/upload"; });
+  ASSERT_NE(posted, requests.end());
   EXPECT_NE(posted->body.size(), 0u);
 }
 
