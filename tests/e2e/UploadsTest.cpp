@@ -98,8 +98,7 @@ TEST_F(UploadsTest, ClientRightsDecideWhatCanBeUploaded) {
   }
   ::chmod(root.path().c_str(), 0755);
   ::chmod(files.c_str(), 0777);
-  // The demo client's profile that the collector tests' storebags give.
-  start(collectorStorebag(uploads.url("/upload"))["seed"]["httpsPost"].dictCopy(), "en_GB.UTF-8");
+  start(Dictionary{{"post_url", uploads.url("/upload")}}, "en_GB.UTF-8");
   uploads.on("/upload", Reply{.body = "success"});
   std::ofstream(files / "secret.log") << "secret";
   ::chown((files / "secret.log").c_str(), 0, 0);
@@ -147,6 +146,11 @@ TEST_F(UploadsTest, ClientRightsDecideWhatCanBeUploaded) {
                               ": no descriptor came with the request"));
   EXPECT_FALSE(uploads.waitForRequestTo("/upload", std::chrono::milliseconds(0)));
   EXPECT_TRUE(fs::exists(files / "secret.log"));
+
+  // The session has an upload backend: what its own user may read goes.
+  std::ofstream(files / "mine.log") << "mine";
+  EXPECT_EQ(client->uploadFile(Value("file://" + (files / "mine.log").string()), Value(), 10s)["success"], Value(true));
+  EXPECT_TRUE(uploads.waitForRequestTo("/upload"));
 }
 
 enum class Server { Holds, Fails, Refuses, NoBodyFile };
