@@ -237,7 +237,16 @@ class Linter {
       warning(at, "unknown key " + quoted(key) + (nearest ? " (did you mean " + quoted(*nearest) + "?)" : "") + ": " +
                       unknown);
     } else if (!isOfKind(value, found->kind)) {
-      warning(at, quoted(key) + " is " + value.kindName() + ", the daemon reads " + kindText(found->kind));
+      // A list names the first element of another kind.
+      const bool listKind = found->kind == Kind::strings || found->kind == Kind::numbers;
+      const Array* list = listKind ? value.array() : nullptr;
+      const auto other = list ? std::find_if_not(list->begin(), list->end(),
+                                                 [kind = found->kind](const Value& e) {
+                                                   return kind == Kind::strings ? e.isString() : numberLike(e);
+                                                 })
+                              : Array::const_iterator();
+      const std::string what = list ? std::string(" holds ") + other->kindName() : std::string(" is ") + value.kindName();
+      warning(at, quoted(key) + what + ", the daemon reads " + kindText(found->kind));
     }
   }
 

@@ -135,7 +135,7 @@ TEST(StorebagLintTest, EachMistakeIsNamedWhereItIs) {
            c.set("device_blacklist", Array{Value(1)});
          });
        },
-       {"warning: " + client + ": \"device_blacklist\" is an array, the daemon reads a list of strings",
+       {"warning: " + client + ": \"device_blacklist\" holds an integer, the daemon reads a list of strings",
         "warning: " + client + ": \"event_threshold\" is a string, the daemon reads a number",
         "warning: " + client + ": \"post_url\" is an integer, the daemon reads a string"}},
       {"filters and country thresholds",
