@@ -4,6 +4,8 @@
 #include <array>
 #include <string_view>
 
+#include <fmt/format.h>
+
 #include "platform/Spelling.h"
 #include "zerith/ZerithConstants.h"
 
@@ -89,7 +91,12 @@ bool isOfKind(const Value& v, Kind kind) {
   return true;
 }
 
-std::string quoted(std::string_view key) { return "\"" + std::string(key) + "\""; }
+// " (did you mean \"x\"?)" for the known name nearest to `name`, or nothing.
+template <typename Names>
+std::string hint(std::string_view name, const Names& known) {
+  const auto nearest = nearestSpelling(name, known);
+  return nearest ? fmt::format(" (did you mean \"{}\"?)", *nearest) : std::string();
+}
 
 class Linter {
  public:
@@ -97,7 +104,7 @@ class Linter {
 
   void bag(const Value& bag) {
     if (!bag.isDict()) {
-      error("", std::string("the bag is ") + bag.kindName() + ", not a dictionary: the daemon refuses it");
+      error("", fmt::format("the bag is {}, not a dictionary: the daemon refuses it", bag.kindName()));
       return;
     }
     bool customerSection = false;
@@ -107,8 +114,8 @@ class Linter {
         continue;
       }
       if (!value.isDict()) {
-        error(key, std::string("the section is ") + value.kindName() +
-                       ", not a dictionary: devices of this environment find no section");
+        error(key, fmt::format("the section is {}, not a dictionary: devices of this environment find no section",
+                               value.kindName()));
         continue;
       }
       customerSection = customerSection || key == "seed" || key == "release";
@@ -125,9 +132,9 @@ class Linter {
  private:
   void section(const std::string& where, const Value& section) {
     for (const auto& [name, profile] : section.dict()->entries()) {
-      const std::string at = where + "." + name;
+      const std::string at = fmt::format("{}.{}", where, name);
       if (!profile.isDict()) {
-        error(at, std::string("the profile is ") + profile.kindName() + ", not a dictionary: the backend is not made");
+        error(at, fmt::format("the profile is {}, not a dictionary: the backend is not made", profile.kindName()));
       } else if (name == kZerithBackendHTTPPost || name == kZerithBackendHTTPPost2 || name == kZerithBackendQRS) {
         https(at, profile);
       } else if (name == kZerithBackendDashboard) {
@@ -142,9 +149,7 @@ class Linter {
         const std::array<std::string_view, 7> backends = {
             kZerithBackendHTTPPost, kZerithBackendHTTPPost2,  kZerithBackendDashboard,    kZerithBackendQRS,
             kZerithBackendKovu,     kZerithBackendPellamlog, kZerithBackendUploadServer};
-        const auto nearest = nearestSpelling(name, backends);
-        warning(at, "no backend has this name" + (nearest ? " (did you mean " + quoted(*nearest) + "?)" : "") +
-                        ": the daemon skips it");
+        warning(at, fmt::format("no backend has this name{}: the daemon skips it", hint(name, backends)));
       }
     }
   }
@@ -157,17 +162,17 @@ class Linter {
       return;
     }
     if (!clients.isArray() || clients.count() == 0) {
-      error(at + ".clients", "not a list of client entries: the backend never reports");
+      error(fmt::format("{}.clients", at), "not a list of client entries: the backend never reports");
       return;
     }
     for (std::size_t i = 0; i < clients.count(); ++i) {
-      client(at + ".clients[" + std::to_string(i) + "]", clients.at(i));
+      client(fmt::format("{}.clients[{}]", at, i), clients.at(i));
     }
   }
 
   void client(const std::string& at, const Value& entry) {
     if (!entry.isDict()) {
-      error(at, std::string("the client entry is ") + entry.kindName() + ", not a dictionary: it matches no client");
+      error(at, fmt::format("the client entry is {}, not a dictionary: it matches no client", entry.kindName()));
       return;
     }
     keys(at, entry, kClientKeys);
@@ -175,7 +180,7 @@ class Linter {
     // filter and sampling checks; without these three it never does.
     const char* const never = "sessions that require user info are never enabled by this entry";
     if (entry["locale_whitelist"].count() == 0) {
-      error(at, "no \"locale_whitelist\" (or an empty one): " + std::string(never));
+      error(at, fmt::format("no \"locale_whitelist\" (or an empty one): {}", never));
     }
     required(at, entry, "filters", never);
     required(at, entry, "sampling_threshold", never);
@@ -205,13 +210,13 @@ class Linter {
       return;
     }
     if (!value.isArray()) {
-      warning(at, quoted(name) + " is " + value.kindName() + ", not a list: the daemon ignores it");
+      warning(at, fmt::format("\"{}\" is {}, not a list: the daemon ignores it", name, value.kindName()));
       return;
     }
     for (std::size_t i = 0; i < value.count(); ++i) {
-      const std::string where = at + "." + std::string(name) + "[" + std::to_string(i) + "]";
+      const std::string where = fmt::format("{}.{}[{}]", at, name, i);
       if (!value.at(i).isDict()) {
-        warning(where, std::string("is ") + value.at(i).kindName() + ", not a dictionary: the daemon ignores it");
+        warning(where, fmt::format("is {}, not a dictionary: the daemon ignores it", value.at(i).kindName()));
         continue;
       }
       keys(where, value.at(i), known);
@@ -233,26 +238,22 @@ class Linter {
     if (found == known.end()) {
       std::array<std::string_view, N> names;
       std::transform(known.begin(), known.end(), names.begin(), [](const Key& k) { return k.name; });
-      const auto nearest = nearestSpelling(key, names);
-      warning(at, "unknown key " + quoted(key) + (nearest ? " (did you mean " + quoted(*nearest) + "?)" : "") + ": " +
-                      unknown);
+      warning(at, fmt::format("unknown key \"{}\"{}: {}", key, hint(key, names), unknown));
     } else if (!isOfKind(value, found->kind)) {
       // A list names the first element of another kind.
-      const bool listKind = found->kind == Kind::strings || found->kind == Kind::numbers;
-      const Array* list = listKind ? value.array() : nullptr;
-      const auto other = list ? std::find_if_not(list->begin(), list->end(),
-                                                 [kind = found->kind](const Value& e) {
-                                                   return kind == Kind::strings ? e.isString() : numberLike(e);
-                                                 })
-                              : Array::const_iterator();
-      const std::string what = list ? std::string(" holds ") + other->kindName() : std::string(" is ") + value.kindName();
-      warning(at, quoted(key) + what + ", the daemon reads " + kindText(found->kind));
+      const Array* list = found->kind == Kind::strings || found->kind == Kind::numbers ? value.array() : nullptr;
+      const auto other = [kind = found->kind](const Value& e) {
+        return kind == Kind::strings ? !e.isString() : !numberLike(e);
+      };
+      warning(at, fmt::format("\"{}\" {} {}, the daemon reads {}", key, list ? "holds" : "is",
+                              list ? std::find_if(list->begin(), list->end(), other)->kindName() : value.kindName(),
+                              kindText(found->kind)));
     }
   }
 
   void required(const std::string& at, const Value& dict, std::string_view key, const std::string& otherwise) {
     if (dict[key].isNil()) {
-      error(at, "no " + quoted(key) + ": " + otherwise);
+      error(at, fmt::format("no \"{}\": {}", key, otherwise));
     }
   }
 
@@ -263,7 +264,7 @@ class Linter {
 }  // namespace
 
 std::string StorebagFinding::describe() const {
-  return std::string(error ? "error: " : "warning: ") + (where.empty() ? "" : where + ": ") + what;
+  return fmt::format("{}: {}{}{}", error ? "error" : "warning", where, where.empty() ? "" : ": ", what);
 }
 
 std::vector<StorebagFinding> lintStorebag(const Value& bag) {

@@ -133,11 +133,15 @@ TEST(StorebagLintTest, EachMistakeIsNamedWhereItIs) {
            c.set("event_threshold", "ten");
            c.set("post_url", 7);
            c.set("device_blacklist", Array{Value(1)});
+           c.set("per_country_sampling_thresholds", "DE");
+           c.set("event_whitelist", Array{Value(1), Value("2")});
          });
        },
        {"warning: " + client + ": \"device_blacklist\" holds an integer, the daemon reads a list of strings",
         "warning: " + client + ": \"event_threshold\" is a string, the daemon reads a number",
-        "warning: " + client + ": \"post_url\" is an integer, the daemon reads a string"}},
+        "warning: " + client + ": \"post_url\" is an integer, the daemon reads a string",
+        "warning: " + client + ": \"event_whitelist\" holds a string, the daemon reads a list of numbers",
+        "warning: " + client + ": \"per_country_sampling_thresholds\" is a string, not a list: the daemon ignores it"}},
       {"filters and country thresholds",
        [](Dictionary& bag) {
          editClient(bag, [](Dictionary& c) {
@@ -158,15 +162,19 @@ TEST(StorebagLintTest, EachMistakeIsNamedWhereItIs) {
            s.set("httpsPost2", Dictionary{{"display_url", "z"}});
            s.set("qrs", Dictionary{{"clients", Array{}}});
            s.set("httpPost", Dictionary{});
+           s.set("energy", Dictionary{});
            s.set("pellamlog", "on");
+           s.set("httpsPost", Dictionary{{"clients", Array{Value("demo")}}});
          });
        },
-       {"error: release.httpsPost2: no \"clients\": the backend is not made",
+       {"error: release.httpsPost.clients[0]: the client entry is a string, not a dictionary: it matches no client",
+        "error: release.httpsPost2: no \"clients\": the backend is not made",
         "error: release.qrs.clients: not a list of client entries: the backend never reports",
         "error: release.dashboard: no \"port\": the backend is not made",
         "error: release.uploadServer: no \"post_url\": the backend is not made",
         "error: release.pellamlog: the profile is a string, not a dictionary: the backend is not made",
-        "warning: release.httpPost: no backend has this name (did you mean \"httpsPost\"?): the daemon skips it"}},
+        "warning: release.httpPost: no backend has this name (did you mean \"httpsPost\"?): the daemon skips it",
+        "warning: release.energy: no backend has this name: the daemon skips it"}},
       {"the bag's own keys",
        [](Dictionary& bag) {
          bag.set("issue_time", "yesterday");
