@@ -188,7 +188,8 @@ class Linter {
       warning(at, "no \"post_url\": its events have nowhere to go unless the device's defaults name one");
     }
     list(at, entry, "filters", kFilterKeys, [this](const std::string& where, const Value& filter) {
-      if (const std::string* action = filter["action"].string(); action && *action != "remove" && *action != "sha256") {
+      const Value action = filter["action"];
+      if (const std::string* text = action.string(); text && *text != "remove" && *text != "sha256") {
         warning(where, "\"action\" is neither \"remove\" nor \"sha256\": the filter keeps the value");
       }
       if (filter["key"].isNil()) {

@@ -187,7 +187,8 @@ int lint(const std::string& inPath) {
     return failWith(error);
   }
   zerith::Value bag = zerith::decodeStorebagBag(*input, &error);
-  if (const std::string* text = bag["bag"].string(); text && bag["signature"].isString()) {
+  const zerith::Value inside = bag["bag"];
+  if (const std::string* text = inside.string(); text && bag["signature"].isString()) {
     std::cout << inPath << ": a signed container; its bag, not verified:\n";
     const auto inner = zerith::crypto::base64Decode(*text);
     error = "\"bag\" is not valid base64";
