@@ -4,6 +4,7 @@
 #include <pwd.h>
 #include <unistd.h>
 
+#include <charconv>
 #include <fstream>
 #include <iostream>
 
@@ -419,9 +420,10 @@ int runEntitlements(const std::optional<std::string>& user, std::ostream& out, s
   std::vector<char> buffer(1 << 16);
   passwd entry{};
   passwd* found = nullptr;
-  const bool numeric = !who.empty() && std::all_of(who.begin(), who.end(), [](char c) { return c >= '0' && c <= '9'; });
-  if (numeric) {
-    ::getpwuid_r(static_cast<uid_t>(std::stoul(who)), &entry, buffer.data(), buffer.size(), &found);
+  uid_t uid = 0;
+  const auto [end, ec] = std::from_chars(who.data(), who.data() + who.size(), uid);
+  if (ec == std::errc() && end == who.data() + who.size()) {
+    ::getpwuid_r(uid, &entry, buffer.data(), buffer.size(), &found);
   } else {
     ::getpwnam_r(who.c_str(), &entry, buffer.data(), buffer.size(), &found);
   }
@@ -429,12 +431,18 @@ int runEntitlements(const std::optional<std::string>& user, std::ostream& out, s
     err << "zerith: no user " << who << " on this system\n";
     return kExitUsage;
   }
+  // getgrouplist says how many groups there are when the room was short;
+  // only the ones it wrote count (a zero left over would read as root's group).
   std::vector<gid_t> groups(64);
-  for (int count = static_cast<int>(groups.size());
-       ::getgrouplist(entry.pw_name, entry.pw_gid, groups.data(), &count) < 0 && count < (1 << 16);) {
-    groups.resize(static_cast<std::size_t>(count) * 2);
-    count = static_cast<int>(groups.size());
+  int count = static_cast<int>(groups.size());
+  while (::getgrouplist(entry.pw_name, entry.pw_gid, groups.data(), &count) < 0) {
+    if (count <= static_cast<int>(groups.size()) || count > (1 << 16)) {
+      err << "zerith: cannot read the groups of " << entry.pw_name << "\n";
+      return kExitUsage;
+    }
+    groups.resize(static_cast<std::size_t>(count));
   }
+  groups.resize(static_cast<std::size_t>(count));
   ipc::PeerCredentials peer{0, entry.pw_uid, entry.pw_gid, groups};
   const Dictionary granted = ipc::EntitlementPolicy().entitlementsFor(peer);
   const Value admits = granted.get(ipc::kZerithdEntitlement);

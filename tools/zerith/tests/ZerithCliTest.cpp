@@ -309,6 +309,15 @@ TEST(Cli, EntitlementsShowWhatThePolicyGrantsAUser) {
   EXPECT_EQ(after["entitlements"][ipc::kZerithdEntitlement], Value(true));
   if (::geteuid() != 65534) {
     EXPECT_EQ(entitlements({"--user", "65534"})["admitted"], Value(false));
+    // Groups count as the daemon counts them: nobody's own (65534) admits
+    // it, root's group (0) does not, as nobody is not in it.
+    for (const auto& [gid, admitted] : {std::pair{0, false}, std::pair{65534, true}}) {
+      root.write("/etc/zerithd/entitlements.d/group.plist",
+                 "<plist version=\"1.0\"><dict><key>groups</key><array><integer>" + std::to_string(gid) +
+                     "</integer></array><key>entitlements</key><dict><key>com.velmar.private.zerithd</key><true/>"
+                     "</dict></dict></plist>\n");
+      EXPECT_EQ(entitlements({"--user", "65534"})["admitted"], Value(admitted)) << "group " << gid;
+    }
   }
 
   const CliResult unknown = runCli({"--root", root.path().string(), "entitlements", "--user", "no-such-zerith-user"});
