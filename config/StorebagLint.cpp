@@ -110,7 +110,7 @@ class Linter {
     bool customerSection = false;
     for (const auto& [key, value] : bag.dict()->entries()) {
       if (std::find(kSections.begin(), kSections.end(), key) == kSections.end()) {
-        entry("", kBagKeys, key, value, "the daemon does not read it");
+        checkEntry("", kBagKeys, key, value, "the daemon does not read it");
         continue;
       }
       if (!value.isDict()) {
@@ -228,13 +228,13 @@ class Linter {
   template <std::size_t N>
   void keys(const std::string& at, const Value& dict, const std::array<Key, N>& known) {
     for (const auto& [key, value] : dict.dict()->entries()) {
-      entry(at, known, key, value, "the daemon does not read it (a misspelt key reads as absent)");
+      checkEntry(at, known, key, value, "the daemon does not read it (a misspelt key reads as absent)");
     }
   }
 
   template <std::size_t N>
-  void entry(const std::string& at, const std::array<Key, N>& known, const std::string& key, const Value& value,
-             const char* unknown) {
+  void checkEntry(const std::string& at, const std::array<Key, N>& known, const std::string& key, const Value& value,
+                  const char* unknown) {
     const auto found = std::find_if(known.begin(), known.end(), [&key](const Key& k) { return k.name == key; });
     if (found == known.end()) {
       std::array<std::string_view, N> names;
