@@ -109,7 +109,10 @@ DaemonProcess::DaemonProcess(const TempRoot& root, Options options) {
 }
 
 DaemonProcess::~DaemonProcess() {
-  if (running()) {
+  // Stopped as the service manager stops it, so that its exit path runs (and
+  // a coverage build writes the daemon's counters); a daemon still draining
+  // sessions after that is killed.
+  if (running() && !stop(std::chrono::milliseconds(2000))) {
     signal(SIGKILL);
     waitForExit(std::chrono::milliseconds(10000));
   }

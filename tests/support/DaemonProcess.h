@@ -3,7 +3,7 @@
 // Runs the real zerithd binary for end-to-end tests: started in a TempRoot
 // with --debug, its standard error captured line by line, readiness taken
 // from its own sd_notify("READY=1") through a notify socket of ours, and
-// stopped with SIGTERM (or killed when the test ends first). Every wait is
+// stopped with SIGTERM (killed when it has not gone 2 s after). Every wait is
 // bounded, so a daemon that hangs fails the test instead of hanging it.
 
 #include <signal.h>
