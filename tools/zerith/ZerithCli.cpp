@@ -25,6 +25,7 @@
 #include "platform/Paths.h"
 #include "platform/Spelling.h"
 #include "tools/zerith/ZerithSessions.h"
+#include "tools/zerith/ZerithSpool.h"
 #include "tools/zerith/ZerithStatus.h"
 #include "zerith/Zerith.h"
 
@@ -560,6 +561,11 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
       "entitlements", "Show what the entitlements policy grants a user's processes and whether the daemon admits them");
   entitlements->allow_extras();
   entitlements->add_option("--user", user, "User name or uid (default: this process's user)");
+  bool spoolJson = false;
+  auto* spool = app.add_subcommand(
+      "spool", "Show the batches waiting in the spool to be posted again, per URL (read from the spool folder)");
+  spool->allow_extras();
+  spool->add_flag("--json", spoolJson, "Print every batch as one JSON line instead of a table");
 
   const auto usage = [&](const std::string& what) {
     err << "zerith: " << what << "\nRun with --help for more information.\n";
@@ -572,7 +578,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return code == 0 ? 0 : kExitUsage;
   }
   CLI::App* chosen = nullptr;
-  for (auto* sub : {session, sessions, identifier, version, status, entitlements}) {
+  for (auto* sub : {session, sessions, identifier, version, status, entitlements, spool}) {
     if (*sub) {
       chosen = sub;
     }
@@ -581,7 +587,7 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     return usage(*problem);
   }
   if (!chosen) {
-    return usage("a command is required: session, sessions, status, entitlements, identifier or version");
+    return usage("a command is required: session, sessions, status, spool, entitlements, identifier or version");
   }
   if (timeoutMs < 1) {
     return usage("--timeout must be at least 1 millisecond, not " + std::to_string(timeoutMs));
@@ -614,6 +620,9 @@ int run(int argc, const char* const* argv, std::ostream& out, std::ostream& err)
     }
     if (chosen == entitlements) {
       return runEntitlements(user, out, err);
+    }
+    if (chosen == spool) {
+      return runSpool(spoolJson, out, err);
     }
     if (chosen == status) {
       return runStatus(socket ? std::filesystem::path(*socket) : Zerith::defaultSocketPath(),

@@ -222,7 +222,7 @@ TEST_F(CliFixture, BadCommandLinesAreRefusedBeforeConnecting) {
   EXPECT_EQ(runCli({"session", "--session-id", "1", "--step", "start"}).err, "zerith: session needs --client-type" + more);
   EXPECT_EQ(runCli({"session", "--client-type", "7", "--step", "start"}).err, "zerith: session needs --session-id" + more);
   EXPECT_EQ(runCli({"session", "--client-type", "7", "--session-id", "1"}).err, "zerith: session needs --step" + more);
-  EXPECT_EQ(runCli({}).err, "zerith: a command is required: session, sessions, status, entitlements, identifier or version" + more);
+  EXPECT_EQ(runCli({}).err, "zerith: a command is required: session, sessions, status, spool, entitlements, identifier or version" + more);
 
   // Misspelt words are named, with the nearest known one.
   EXPECT_EQ(runCli(session({"--stepp", "start"})).err,
