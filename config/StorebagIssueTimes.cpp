@@ -143,10 +143,19 @@ std::optional<Date> storebagIssueTime(const Value& bag, std::string* unusable) {
 
 bool storebagIssueTimeRequired() { return defaultsObjectForKey(kRequireStorebagIssueTimeKey).boolValue(); }
 
-std::optional<Date> rememberedStorebagIssueTime(const std::string& name) {
+std::optional<StorebagIssueTimes> rememberedStorebagIssueTimes(std::string* why) {
   std::lock_guard inProcess(ZerithdUtil::lock());
+  std::string error;
+  auto times = readIssueTimes(error);
+  if (!times && why) {
+    *why = std::move(error);
+  }
+  return times;
+}
+
+std::optional<Date> rememberedStorebagIssueTime(const std::string& name) {
   std::string why;
-  const auto times = readIssueTimes(why);
+  const auto times = rememberedStorebagIssueTimes(&why);
   if (!times) {
     configLogger().error("rememberedStorebagIssueTime: {}; no issue time is remembered for storebag '{}'", why, name);
     return std::nullopt;

@@ -48,6 +48,9 @@ std::optional<Date> storebagIssueTime(const Value& bag, std::string* unusable);
 // Whether the defaults require an issue time.
 bool storebagIssueTimeRequired();
 
+// Every remembered time, or nullopt with `why` when the file cannot be read
+// or fails its checks (no file: none remembered).
+std::optional<StorebagIssueTimes> rememberedStorebagIssueTimes(std::string* why);
 // The newest issue time accepted for `name`, nullopt when none is known. A
 // file that cannot be read or fails its checks counts as empty (logged).
 std::optional<Date> rememberedStorebagIssueTime(const std::string& name);

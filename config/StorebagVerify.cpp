@@ -256,6 +256,8 @@ Value decodeStorebagBag(const Data& bagBytes, std::string* why) {
   return *bag;
 }
 
+std::optional<Data> frameworkPublicKey() { return file::readAll(frameworkPublicKeyPath(), kMaxPublicKeyBytes); }
+
 std::filesystem::path frameworkStrongPublicKeyPath() { return paths::frameworkResourceDir() / "publicKeyEd25519.der"; }
 
 std::optional<Data> frameworkStrongPublicKey() {
@@ -272,28 +274,47 @@ StorebagRefusalCounts& storebagRefusalCounts() {
   return counts;
 }
 
+StorebagBagCheck checkStorebagBag(const std::string& name, const Data& bagBytes) {
+  StorebagBagCheck check;
+  check.bag = decodeStorebagBag(bagBytes, &check.unusable);
+  if (!check.bag.isNil()) {
+    check.issued = storebagIssueTime(check.bag, &check.unusable);
+  }
+  if (!check.unusable.empty()) {
+    check.verdict = StorebagBagCheck::Verdict::Unusable;
+    check.bag = Value();
+    return check;
+  }
+  if (!check.issued) {
+    if (storebagIssueTimeRequired()) {
+      check.verdict = StorebagBagCheck::Verdict::MissingIssueTime;
+    }
+    return check;
+  }
+  check.newest = rememberedStorebagIssueTime(name);
+  if (check.newest && *check.issued < *check.newest) {
+    check.verdict = StorebagBagCheck::Verdict::Rollback;
+  }
+  return check;
+}
+
 namespace {
 
 // The bag of a verified container, or nil when it must not be used: logged,
 // noted and counted.
 Value usableBag(const std::string& name, const Data& bagBytes, const StorebagSource& source) {
-  std::string unusable;
-  Value bag = decodeStorebagBag(bagBytes, &unusable);
-  std::optional<Date> issued;
-  if (!bag.isNil()) {
-    issued = storebagIssueTime(bag, &unusable);
-  }
-  if (!unusable.empty()) {
-    configLogger().error("fetchStorebagWithName: storebag '{}' from {} is signed but unusable: {}", name, source.where,
-                         unusable);
-    noteStorebagFailure("the signed storebag is unusable: " + unusable);
-    if (source.counted) {
-      ++storebagRefusalCounts().unusable;
-    }
-    return Value();
-  }
-  if (!issued) {
-    if (storebagIssueTimeRequired()) {
+  StorebagBagCheck check = checkStorebagBag(name, bagBytes);
+  switch (check.verdict) {
+    case StorebagBagCheck::Verdict::Usable: return std::move(check.bag);
+    case StorebagBagCheck::Verdict::Unusable:
+      configLogger().error("fetchStorebagWithName: storebag '{}' from {} is signed but unusable: {}", name,
+                           source.where, check.unusable);
+      noteStorebagFailure("the signed storebag is unusable: " + check.unusable);
+      if (source.counted) {
+        ++storebagRefusalCounts().unusable;
+      }
+      return Value();
+    case StorebagBagCheck::Verdict::MissingIssueTime:
       configLogger().error("fetchStorebagWithName: storebag '{}' from {} has no \"{}\" and {} is set: refused", name,
                            source.where, kStorebagIssueTimeKey, kRequireStorebagIssueTimeKey);
       noteStorebagFailure(fmt::format("the storebag has no \"{}\"", kStorebagIssueTimeKey));
@@ -301,23 +322,19 @@ Value usableBag(const std::string& name, const Data& bagBytes, const StorebagSou
         ++storebagRefusalCounts().missingIssueTime;
       }
       return Value();
-    }
-    return bag;
+    case StorebagBagCheck::Verdict::Rollback:
+      configLogger().error(
+          "fetchStorebagWithName: storebag '{}' from {} was issued at {}, before {}, the newest issue time accepted for "
+          "it: refused as a rollback",
+          name, source.where, describeIssueTime(*check.issued), describeIssueTime(*check.newest));
+      noteStorebagFailure(fmt::format("the storebag was issued at {}, before the newest accepted {}",
+                                      describeIssueTime(*check.issued), describeIssueTime(*check.newest)));
+      if (source.counted) {
+        ++storebagRefusalCounts().rollbacks;
+      }
+      return Value();
   }
-  const auto newest = rememberedStorebagIssueTime(name);
-  if (newest && *issued < *newest) {
-    configLogger().error(
-        "fetchStorebagWithName: storebag '{}' from {} was issued at {}, before {}, the newest issue time accepted for "
-        "it: refused as a rollback",
-        name, source.where, describeIssueTime(*issued), describeIssueTime(*newest));
-    noteStorebagFailure(fmt::format("the storebag was issued at {}, before the newest accepted {}",
-                                    describeIssueTime(*issued), describeIssueTime(*newest)));
-    if (source.counted) {
-      ++storebagRefusalCounts().rollbacks;
-    }
-    return Value();
-  }
-  return bag;
+  return Value();
 }
 
 }  // namespace
@@ -326,7 +343,7 @@ Value parseAndVerifyStorebag(const std::string& name, const Data& data, bool sav
   const auto keyPath = frameworkPublicKeyPath();
   const auto strongKey = frameworkStrongPublicKey();
   const auto verification =
-      verifyStorebagContainer(plist::bytesOf(data), file::readAll(keyPath, kMaxPublicKeyBytes), strongKey);
+      verifyStorebagContainer(plist::bytesOf(data), frameworkPublicKey(), strongKey);
   const auto strongKeyPath = frameworkStrongPublicKeyPath().string();
   switch (verification.status) {
     case StorebagVerifyStatus::NotAPropertyList:

@@ -75,6 +75,10 @@ std::string describeStorebagRefusal(const StorebagVerification& verification);
 // with `why` ("the bag is an array, not a dictionary", the parser's reason).
 Value decodeStorebagBag(const Data& bagBytes, std::string* why = nullptr);
 
+// The framework's RSA key ("publicKey.der"), read afresh; nullopt when it cannot be
+// read or is larger than a public key can be.
+std::optional<Data> frameworkPublicKey();
+
 // The framework's Ed25519 key: nullopt when "publicKeyEd25519.der" does not
 // exist (one signature is enough), its bytes otherwise (empty when it cannot
 // be read, which refuses every container).
@@ -107,6 +111,21 @@ void clearStorebagFailure();
 // Adds a cause ("; " between several: a failed download, then the unsigned
 // fallback refused).
 void noteStorebagFailure(const std::string& cause);
+
+// What the daemon makes of the bag of a verified container: used, or refused
+// as unusable (not a property list dictionary, an issue time that is no
+// date), for having no issue time while one is required, or as a rollback
+// (issued before the newest time accepted for `name`). No logging, no
+// counting: parseAndVerifyStorebag does both, `zerith-storebag cached` tells.
+struct StorebagBagCheck {
+  enum class Verdict { Usable, Unusable, MissingIssueTime, Rollback };
+  Verdict verdict = Verdict::Usable;
+  Value bag;                      // nil when unusable
+  std::string unusable;           // the cause when unusable
+  std::optional<Date> issued;
+  std::optional<Date> newest;     // remembered for `name` (read only when the bag has an issue time)
+};
+StorebagBagCheck checkStorebagBag(const std::string& name, const Data& bagBytes);
 
 // Parses and verifies a container with the framework's public key(s), then
 // checks its bag: a property list dictionary, with an issue time not older
