@@ -7,12 +7,14 @@
 //   zerith-storebag show   --public publicKey.der [--ed25519-public publicKeyEd25519.der] --in container.plist
 //   zerith-storebag lint   --in bag.plist
 //   zerith-storebag [--root DIR] forget-issue-time --name dravon
+//   zerith-storebag [--root DIR] cached [--folder DIR]
 //
 // `sign` stamps the bag with its issue time ("issue_time", now) before it
 // signs it; `forget-issue-time` is the operator's way back past the daemon's
 // anti-rollback check for one storebag name. `lint` says what the daemon
 // would ignore in a bag or never enable (config/StorebagLint.h); `sign`
 // prints the same findings on standard error and signs all the same.
+// `cached` says what the daemon makes of each copy in its disk cache.
 //
 // Exit status 0 on success, 1 when an operation fails (unreadable input, a
 // refused container, a bag with lint errors), CLI11's codes for usage errors.
@@ -20,6 +22,7 @@
 #include <algorithm>
 #include <cmath>
 #include <cstdio>
+#include <cstdlib>
 #include <filesystem>
 #include <iostream>
 #include <optional>
@@ -36,6 +39,7 @@
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
+#include "tools/zerith-storebag/StorebagCacheReport.h"
 
 namespace {
 
@@ -226,6 +230,27 @@ int forgetIssueTime(const std::string& root, const std::string& name) {
   return 0;
 }
 
+int cached(const std::string& root, const std::string& folderOption) {
+  zerith::paths::setRoot(root);
+  // Outside a relocated root the daemon's cache follows its service manager
+  // (CacheDirectory=) or its user's home; an operator's shell has neither,
+  // so the packaged service's folder is the one meant when it exists.
+  fs::path folder = folderOption.empty() ? zerith::paths::storebagCacheDir() : fs::path(folderOption);
+  const fs::path packaged = "/var/cache/zerithd/storebags";
+  std::error_code ec;
+  if (folderOption.empty() && !zerith::paths::relocated() && !std::getenv("CACHE_DIRECTORY") &&
+      fs::is_directory(packaged, ec)) {
+    folder = packaged;
+  }
+  std::string why;
+  const auto report = zerith::reportStorebagCache(folder, &why);
+  if (!report) {
+    return failWith(why);
+  }
+  std::cout << zerith::describeStorebagCache(*report, zerith::Date::now());
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -236,7 +261,8 @@ int main(int argc, char** argv) {
   std::string format = "binary", type = "rsa";
   std::string root = zerith::paths::defaultRoot().string();
   int bits = 2048;
-  app.add_option("--root", root, "Root folder of every zerithd path, for forget-issue-time (environment ZERITHD_ROOT)");
+  app.add_option("--root", root,
+                 "Root folder of every zerithd path, for forget-issue-time and cached (environment ZERITHD_ROOT)");
 
   auto* keygenCmd = app.add_subcommand("keygen", "Create a key pair (PEM private key, DER public key)");
   keygenCmd->add_option("--private", privatePath, "Private key file to write (PEM)")->required();
@@ -270,6 +296,13 @@ int main(int argc, char** argv) {
                                                             "again (the operator's way back)");
   forgetCmd->add_option("--name", name, "Storebag name (dravon, ...)")->required();
 
+  auto* cachedCmd = app.add_subcommand("cached", "Say what the daemon makes of each storebag in its disk cache: "
+                                                 "age, signatures, issue time, used or refused");
+  std::string cacheFolder;
+  cachedCmd->add_option("--folder", cacheFolder,
+                        "The cache folder (default: the root's, or /var/cache/zerithd/storebags of the packaged "
+                        "service)");
+
   CLI11_PARSE(app, argc, argv);
 
   if (keygenCmd->parsed()) {
@@ -280,6 +313,9 @@ int main(int argc, char** argv) {
   }
   if (lintCmd->parsed()) {
     return lint(inPath);
+  }
+  if (cachedCmd->parsed()) {
+    return cached(root, cacheFolder);
   }
   if (forgetCmd->parsed()) {
     return forgetIssueTime(root, name);

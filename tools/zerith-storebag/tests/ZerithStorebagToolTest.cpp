@@ -12,6 +12,7 @@
 #include "config/StorebagIssueTimes.h"
 #include "platform/Crypto.h"
 #include "platform/FileUtil.h"
+#include "platform/Paths.h"
 #include "platform/PropertyList.h"
 #include "tests/support/Command.h"
 #include "tests/support/TempRoot.h"
@@ -161,6 +162,11 @@ TEST_F(ZerithStorebagToolTest, ForgetIssueTimeDropsOnlyTheNamedStorebag) {
   EXPECT_EQ(rememberedStorebagIssueTime("ambrel"), Date{1'700'000'000});
   EXPECT_EQ(run(rootOption + "forget-issue-time --name dravon").output,
             "no issue time remembered for storebag dravon\n");
+  // What is left to forget, as the operator sees it.
+  EXPECT_EQ(run(rootOption + "cached").output, "No storebag is cached in " + paths::storebagCacheDir().string() +
+                                                   ".\n\nIssue times remembered without a cached copy (" +
+                                                   storebagIssueTimesFile().string() +
+                                                   "):\n  ambrel  2023-11-14 22:13:20 +0000\n");
 
   // A damaged file is not silently replaced by the operator's step.
   std::ofstream(storebagIssueTimesFile(), std::ios::trunc) << "garbage";
