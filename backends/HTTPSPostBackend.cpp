@@ -22,6 +22,7 @@
 #include "config/SenderCodes.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Log.h"
 #include "zerith/Zerith.h"
 #include "zerith/ZerithConstants.h"
@@ -43,16 +44,14 @@ constexpr double kPostTimeoutSeconds = 60;
 
 // An integer key of com.velmar.zerith within [low, high]; otherwise logged
 // and `fallback`.
-std::int32_t limitFromDefaults(const char* key, std::int32_t low, std::int32_t high, std::int32_t fallback) {
-  const Value v = Defaults("com.velmar.zerith").objectForKey(key);
-  if (v.isNil()) {
-    return fallback;
+std::int32_t limitFromDefaults(const DefaultsSetting& setting, std::int32_t fallback) {
+  std::string problem;
+  if (const auto n = defaultsNumber(setting, Defaults(std::string(setting.domain)).objectForKey(setting.key), &problem)) {
+    return static_cast<std::int32_t>(*n);
   }
-  if (v.isNumber() && v.intValue() >= low && v.intValue() <= high) {
-    return static_cast<std::int32_t>(v.intValue());
+  if (!problem.empty()) {
+    backendsLogger().error("HTTPSPostBackend(initWithName): \"{}\" {}; using {}", setting.key, problem, fallback);
   }
-  backendsLogger().error("HTTPSPostBackend(initWithName): \"{}\" holds {}, not a number from {} to {}; using {}", key,
-                         v.description(), low, high, fallback);
   return fallback;
 }
 
@@ -284,12 +283,12 @@ std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(std::string nam
 HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::optional<std::string> productFamily)
     : ZerithBackend(std::move(name), std::move(profile), std::move(productFamily)) {
   Fields f;
-  if (auto url = defaultsStringForKey("httpsPostURL")) {
+  if (auto url = defaultsStringForKey(defaultsSetting("httpsPostURL").key)) {
     f.postURL = *url;
     backendsLogger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for postURL", *url);
   }
   f.useDefaultPostURL = f.postURL.has_value();
-  if (auto url = defaultsStringForKey("httpsRealtimePostURL")) {
+  if (auto url = defaultsStringForKey(defaultsSetting("httpsRealtimePostURL").key)) {
     f.realtimePostURL = *url;
     backendsLogger().debug("HTTPSPostBackend(initWithName): Using user default '{}' for realtimePostURL", *url);
   }
@@ -301,12 +300,14 @@ HTTPSPostBackend::HTTPSPostBackend(Token, std::string name, Value profile, std::
   f.dnuEnabled = diagnosticsSubmissionAllowed();
   f.uuidRespectDnu = Zerith::getPersistentIdentifierForDNU(true);
   f.uuidOverrideDnu = Zerith::getPersistentIdentifierForDNU(false);
-  const auto force = defaultsStringForKey("forceEventLogging");
-  f.forceEventLogging = force && (Value(*force).boolValue() || equalsIgnoringCase(*force, "true") ||
-                                  equalsIgnoringCase(*force, "yes"));
+  // A value of the wrong kind is logged once, when the daemon starts.
+  constexpr const DefaultsSetting& force = defaultsSetting("forceEventLogging");
+  std::string ignored;
+  f.forceEventLogging =
+      defaultsBoolean(force, Defaults(std::string(force.domain)).objectForKey(force.key), &ignored).value_or(false);
   f.spoolEnabled = spoolEnabledInDefaults();
-  f.postsInFlight = limitFromDefaults("postsInFlightPerBackend", 1, kMaxPostsInFlight, kDefaultPostsInFlight);
-  f.postsWaiting = limitFromDefaults("postsWaitingPerBackend", 0, kMaxPostsWaiting, kDefaultPostsWaiting);
+  f.postsInFlight = limitFromDefaults(defaultsSetting("postsInFlightPerBackend"), kDefaultPostsInFlight);
+  f.postsWaiting = limitFromDefaults(defaultsSetting("postsWaitingPerBackend"), kDefaultPostsWaiting);
   fields_ = std::move(f);
 }
 

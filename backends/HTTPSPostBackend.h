@@ -27,6 +27,7 @@
 #include <vector>
 
 #include "backends/ZerithBackend.h"
+#include "platform/DefaultsKeys.h"
 
 namespace zerith {
 
@@ -50,9 +51,8 @@ class HTTPSPostBackend : public ZerithBackend {
   // spool when on, otherwise in memory, up to "postsWaitingPerBackend"
   // batches; past that it is dropped (droppedBusy).
   static constexpr std::int32_t kDefaultPostsInFlight = 16;
-  static constexpr std::int32_t kMaxPostsInFlight = 4096;
   static constexpr std::int32_t kDefaultPostsWaiting = 1024;
-  static constexpr std::int32_t kMaxPostsWaiting = 65536;
+  static constexpr auto kMaxPostsWaiting = static_cast<std::int32_t>(defaultsSetting("postsWaitingPerBackend").high);
 
   // Completion of a post: a result object (always nil) and an error.
   using PostCompletion = FlushCompletion;

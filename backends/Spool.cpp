@@ -10,6 +10,7 @@
 #include "backends/BackendsLog.h"
 #include "backends/ZerithBackend.h"
 #include "platform/Defaults.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Paths.h"
 #include "transport/ReportingSessionConnectivityHelper.h"
 
@@ -19,72 +20,22 @@ namespace fs = std::filesystem;
 
 namespace {
 
-constexpr const char* kDefaultsDomain = "com.velmar.zerith";
-
-
-
 // A 64-bit seed from the kernel's random source.
 std::uint64_t randomSeed() {
   std::random_device device;
   return (static_cast<std::uint64_t>(device()) << 32) ^ device();
 }
 
-bool parseBool(const Value& v, std::optional<bool>& out) {
-  if (v.isBool()) {
-    out = v.boolValue();
-    return true;
-  }
-  if (v.isNumber()) {
-    const std::int64_t i = v.intValue();
-    if (i == 0 || i == 1) {
-      out = i == 1;
-      return true;
-    }
-    return false;
-  }
-  if (const std::string* s = v.string()) {
-    std::string lower(*s);
-    std::transform(lower.begin(), lower.end(), lower.begin(), [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-    if (lower == "true" || lower == "yes" || lower == "1") {
-      out = true;
-      return true;
-    }
-    if (lower == "false" || lower == "no" || lower == "0") {
-      out = false;
-      return true;
-    }
-  }
-  return false;
-}
-
-// A number key within [low, high]; anything else is logged and the default
+// A number setting within its range; anything else is logged and the default
 // stays.
 template <typename T>
-void numberKey(const Value& values, const char* key, T low, T high, T& into) {
-  const Value v = values[key];
-  if (v.isNil()) {
-    return;
+void numberKey(const Value& values, const DefaultsSetting& setting, T& into) {
+  std::string problem;
+  if (const auto d = defaultsNumber(setting, values[setting.key], &problem)) {
+    into = static_cast<T>(*d);
+  } else if (!problem.empty()) {
+    backendsLogger().error("Spool: defaults key \"{}\" {}; using {}", setting.key, problem, into);
   }
-  double d = 0;
-  if (v.isNumber()) {
-    d = v.doubleValue();
-  } else if (const std::string* s = v.string()) {
-    char* end = nullptr;
-    errno = 0;
-    d = std::strtod(s->c_str(), &end);
-    if (s->empty() || *end != '\0' || errno != 0) {
-      backendsLogger().error("Spool: defaults key \"{}\" holds '{}', not a number; using {}", key, *s, into);
-      return;
-    }
-  } else {
-    backendsLogger().error("Spool: defaults key \"{}\" holds {}, not a number; using {}", key, v.kindName(), into);
-    return;
-  }
-  if (!std::isfinite(d) || d < static_cast<double>(low) || d > static_cast<double>(high)) {
-    backendsLogger().error("Spool: defaults key \"{}\" is {}, outside {} to {}; using {}", key, d, low, high, into);
-    return;
-  }
-  into = static_cast<T>(d);
 }
 
 }  // namespace
@@ -94,20 +45,18 @@ void numberKey(const Value& values, const char* key, T low, T high, T& into) {
 
 SpoolConfig SpoolConfig::fromDictionary(const Value& values) {
   SpoolConfig config;
-  if (const Value enabled = values["spoolEnabled"]; !enabled.isNil()) {
-    std::optional<bool> on;
-    if (parseBool(enabled, on)) {
-      config.enabled = *on;
-    } else {
-      backendsLogger().error("Spool: defaults key \"spoolEnabled\" holds {} '{}', not a boolean; the spool stays off",
-                             enabled.kindName(), enabled.description());
-    }
+  constexpr const DefaultsSetting& enabledSetting = defaultsSetting("spoolEnabled");
+  std::string problem;
+  if (const auto on = defaultsBoolean(enabledSetting, values[enabledSetting.key], &problem)) {
+    config.enabled = *on;
+  } else if (!problem.empty()) {
+    backendsLogger().error("Spool: defaults key \"spoolEnabled\" {}; the spool stays off", problem);
   }
-  numberKey<std::uint64_t>(values, "spoolMaxBytes", kMinMaxBytes, kMaxMaxBytes, config.maxBytes);
-  numberKey<std::int64_t>(values, "spoolMaxAgeSeconds", 1, kMaxMaxAgeSeconds, config.maxAgeSeconds);
-  numberKey<double>(values, "spoolRetryInitialSeconds", 0.01, 3600, config.retryInitialSeconds);
-  numberKey<double>(values, "spoolRetryMaxSeconds", 0.01, 86400, config.retryMaxSeconds);
-  numberKey<double>(values, "spoolCommitIntervalSeconds", 0.0, kMaxCommitIntervalSeconds, config.commitIntervalSeconds);
+  numberKey(values, defaultsSetting("spoolMaxBytes"), config.maxBytes);
+  numberKey(values, defaultsSetting("spoolMaxAgeSeconds"), config.maxAgeSeconds);
+  numberKey(values, defaultsSetting("spoolRetryInitialSeconds"), config.retryInitialSeconds);
+  numberKey(values, defaultsSetting("spoolRetryMaxSeconds"), config.retryMaxSeconds);
+  numberKey(values, defaultsSetting("spoolCommitIntervalSeconds"), config.commitIntervalSeconds);
   if (config.retryMaxSeconds < config.retryInitialSeconds) {
     backendsLogger().error("Spool: \"spoolRetryMaxSeconds\" {} is below \"spoolRetryInitialSeconds\" {}; using the latter for both",
                            config.retryMaxSeconds, config.retryInitialSeconds);
@@ -116,11 +65,13 @@ SpoolConfig SpoolConfig::fromDictionary(const Value& values) {
   return config;
 }
 
-SpoolConfig SpoolConfig::fromDefaults() { return fromDictionary(Defaults(kDefaultsDomain).dictionary()); }
+SpoolConfig SpoolConfig::fromDefaults() { return fromDictionary(Defaults(std::string(kZerithDomain)).dictionary()); }
 
 bool spoolEnabledInDefaults() {
-  std::optional<bool> on;
-  return parseBool(Defaults(kDefaultsDomain).objectForKey("spoolEnabled"), on) && *on;
+  constexpr const DefaultsSetting& setting = defaultsSetting("spoolEnabled");
+  std::string problem;
+  return defaultsBoolean(setting, Defaults(std::string(kZerithDomain)).objectForKey(setting.key), &problem)
+      .value_or(false);
 }
 
 std::string newRecordID() {

@@ -71,6 +71,7 @@
 #include <vector>
 
 #include "backends/BackendCounters.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/SerialQueue.h"
 #include "platform/Value.h"
 #include "transport/ReportingSessionConnectivityInterface.h"
@@ -84,13 +85,11 @@ class ZerithBackend;
 
 struct SpoolConfig {
   static constexpr std::uint64_t kDefaultMaxBytes = 64ull << 20;
-  static constexpr std::uint64_t kMinMaxBytes = 4096;
-  static constexpr std::uint64_t kMaxMaxBytes = 1ull << 40;
+  // The smallest "spoolMaxBytes" taken.
+  static constexpr auto kMinMaxBytes = static_cast<std::uint64_t>(defaultsSetting("spoolMaxBytes").low);
   static constexpr std::int64_t kDefaultMaxAgeSeconds = 7 * 24 * 3600;
-  static constexpr std::int64_t kMaxMaxAgeSeconds = 365ll * 24 * 3600;
   static constexpr double kDefaultRetryInitialSeconds = 1;
   static constexpr double kDefaultRetryMaxSeconds = 300;
-  static constexpr double kMaxCommitIntervalSeconds = 1;
 
   bool enabled = false;
   std::uint64_t maxBytes = kDefaultMaxBytes;

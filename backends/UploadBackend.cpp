@@ -13,6 +13,7 @@
 #include "config/Compression.h"
 #include "config/StorebagDiskCache.h"
 #include "transport/URLSession.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Log.h"
 #include "platform/SandboxExtension.h"
 
@@ -131,32 +132,21 @@ UploadLoad uploadLoad() {
 
 UploadLimits UploadLimits::fromDefaults() {
   UploadLimits limits;
-  const auto number = [](const char* key, double low, double high) -> std::optional<double> {
-    const Value v = defaultsObjectForKey(key);
-    if (v.isNil()) {
-      return std::nullopt;
+  const auto number = [](const DefaultsSetting& setting) -> std::optional<double> {
+    std::string problem;
+    const auto n = defaultsNumber(setting, defaultsObjectForKey(setting.key), &problem);
+    if (!problem.empty()) {
+      backendsLogger().error("UploadBackend: defaults key \"{}\" {}; using the default", setting.key, problem);
     }
-    double d = 0;
-    if (v.isNumber()) {
-      d = v.doubleValue();
-    } else {
-      backendsLogger().error("UploadBackend: defaults key {} is not a number; using the default", key);
-      return std::nullopt;
-    }
-    if (!(d >= low && d <= high)) {
-      backendsLogger().error("UploadBackend: defaults key {} is out of range ({} to {}); using the default", key, low,
-                             high);
-      return std::nullopt;
-    }
-    return d;
+    return n;
   };
-  if (const auto seconds = number("uploadTimeoutSeconds", 0.1, 3600)) {
+  if (const auto seconds = number(defaultsSetting("uploadTimeoutSeconds"))) {
     limits.timeLimit = std::chrono::milliseconds(static_cast<long long>(*seconds * 1000));
   }
-  if (const auto n = number("uploadsAtOnce", 1, 64)) {
+  if (const auto n = number(defaultsSetting("uploadsAtOnce"))) {
     limits.atOnce = static_cast<std::size_t>(*n);
   }
-  if (const auto n = number("uploadsPerClient", 1, 64)) {
+  if (const auto n = number(defaultsSetting("uploadsPerClient"))) {
     limits.perClient = static_cast<std::size_t>(*n);
   }
   return limits;

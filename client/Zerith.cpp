@@ -12,6 +12,7 @@
 #include "ipc/SocketConnection.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Log.h"
 #include "platform/Paths.h"
 
@@ -282,8 +283,9 @@ std::string Zerith::getPersistentIdentifierForDNU(bool dnu) {
   // write against other processes.
   static std::mutex creating;
   std::lock_guard lock(creating);
-  const Defaults defaults("com.velmar.zerith");
-  const char* key = dnu ? kZerithPersistentIdentifierDNUKey : kZerithPersistentIdentifierKey;
+  const Defaults defaults{std::string(kZerithDomain)};
+  const std::string_view key =
+      dnu ? defaultsSetting(kZerithPersistentIdentifierDNUKey).key : defaultsSetting(kZerithPersistentIdentifierKey).key;
   const Value stored = defaults.objectForKey(key);
   if (const auto* text = stored.string(); text && !text->empty()) {
     return *text;

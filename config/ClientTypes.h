@@ -7,12 +7,15 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
+
+#include "platform/DefaultsKeys.h"
 
 namespace zerith {
 
 // The process-wide settings domain of zerithd.
 inline constexpr char kZerithDefaultsDomain[] = "com.velmar.zerith";
-inline constexpr char kEnvironmentTypeKey[] = "environmentType";
+inline constexpr std::string_view kEnvironmentTypeKey = defaultsSetting("environmentType").key;
 
 using ZerithClientType = std::uint32_t;
 using ZerithEnvironmentType = std::uint32_t;

@@ -33,6 +33,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/DefaultsKeys.h"
 #include "platform/Value.h"
 
 namespace zerith {
@@ -74,7 +75,8 @@ long timeZoneOffsetSeconds();
 // "DiagnosticsSubmissionAllowed" of the defaults domain
 // "com.velmar.zerith.consent". Absent means no consent.
 inline constexpr char kConsentDefaultsDomain[] = "com.velmar.zerith.consent";
-inline constexpr char kConsentDefaultsKey[] = "DiagnosticsSubmissionAllowed";
+static_assert(kConsentDomain == kConsentDefaultsDomain);
+inline constexpr std::string_view kConsentDefaultsKey = defaultsSetting("DiagnosticsSubmissionAllowed", kConsentDomain).key;
 bool diagnosticsSubmissionAllowed();
 
 // The parsers behind the facts, for tests and the fuzz target.

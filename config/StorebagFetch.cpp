@@ -12,6 +12,7 @@
 #include "config/StorebagServers.h"
 #include "config/StorebagVerify.h"
 #include "config/ConfigLog.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/LockRank.h"
 #include "platform/PropertyList.h"
 #include "platform/ThreadPools.h"
@@ -51,7 +52,7 @@ struct SynchronousFetch {
 }  // namespace
 
 std::string storebagServerURL() {
-  const Value configured = defaultsObjectForKey("zerith_storebag_url");
+  const Value configured = defaultsObjectForKey(defaultsSetting("zerith_storebag_url").key);
   if (const auto* url = configured.string()) {
     return *url;
   }

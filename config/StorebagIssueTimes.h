@@ -18,6 +18,7 @@
 #include <optional>
 #include <string>
 
+#include "platform/DefaultsKeys.h"
 #include "platform/PropertyList.h"
 #include "platform/Value.h"
 
@@ -27,7 +28,7 @@ namespace zerith {
 inline constexpr const char* kStorebagIssueTimeKey = "issue_time";
 // Defaults key (domain com.velmar.zerith): when true, a bag without an issue
 // time is refused.
-inline constexpr const char* kRequireStorebagIssueTimeKey = "storebag_require_issue_time";
+inline constexpr std::string_view kRequireStorebagIssueTimeKey = defaultsSetting("storebag_require_issue_time").key;
 
 using StorebagIssueTimes = std::map<std::string, Date>;
 

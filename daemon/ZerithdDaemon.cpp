@@ -171,9 +171,10 @@ int ZerithdDaemon::run() {
   const auto limits = ipc::ConnectionLimits::forThisProcess("com.velmar.zerith");
   listener->setConnectionLimits(limits);
   logger().info("main: at most {} client connections, {} per user", limits.total, limits.perUid);
-  // A misspelt key would otherwise be ignored without a word.
-  for (const std::string& unread : unreadDefaultsKeys("com.velmar.zerith")) {
-    logger().error("main: {}; it is ignored", unread);
+  // A misspelt key or a value out of range would otherwise be ignored
+  // without a word, or only when a session first reads it.
+  for (const std::string& problem : defaultsDomainProblems(kZerithDomain)) {
+    logger().error("main: {}", problem);
   }
   const auto transaction = std::make_shared<KeepAliveTransaction>();
   const auto agent = ZerithdAgent::create(transaction, std::make_unique<StorebagCache>());

@@ -22,6 +22,7 @@
 #include "ipc/EntitlementPolicy.h"
 #include "ipc/SocketConnection.h"
 #include "platform/Defaults.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Executors.h"
 #include "platform/Log.h"
 #include "platform/RateLimitedLog.h"
@@ -429,23 +430,20 @@ ConnectionLimits ConnectionLimits::forThisProcess(const std::string& defaultsDom
   ConnectionLimits limits = forDescriptorLimit(descriptors);
   const std::size_t most = descriptors > kMinReservedDescriptors ? descriptors - kMinReservedDescriptors : 16;
   const Defaults defaults(defaultsDomain);
-  const auto key = [&](const char* name, std::size_t& value) {
-    const Value v = defaults.objectForKey(name);
-    if (v.isNil()) {
-      return;
+  const auto key = [&](const DefaultsSetting& setting, std::size_t& value) {
+    std::string problem;
+    if (const auto n = defaultsNumber(setting, defaults.objectForKey(setting.key), &problem)) {
+      value = std::min<std::size_t>(static_cast<std::size_t>(*n), most);
+    } else if (!problem.empty()) {
+      log::Logger("ipc").error("Listener: ignoring \"{}\": it {}", setting.key, problem);
     }
-    if (!v.isNumber() || v.intValue() <= 0) {
-      log::Logger("ipc").error("Listener: ignoring {} = {}: not a positive integer", name, v.description());
-      return;
-    }
-    value = std::min<std::size_t>(static_cast<std::size_t>(v.intValue()), most);
   };
   const std::size_t derivedTotal = limits.total;
-  key("maxConnections", limits.total);
+  key(defaultsSetting("maxConnections"), limits.total);
   if (limits.total != derivedTotal) {
     limits.perUid = std::max<std::size_t>(limits.total / 4, 1);
   }
-  key("maxConnectionsPerUser", limits.perUid);
+  key(defaultsSetting("maxConnectionsPerUser"), limits.perUid);
   limits.perUid = std::min(limits.perUid, limits.total);
   return limits;
 }

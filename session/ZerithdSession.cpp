@@ -11,6 +11,7 @@
 #include "config/DeviceInfo.h"
 #include "ipc/ClientSessionReplyProxy.h"
 #include "ipc/Connection.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
 #include "platform/Log.h"
@@ -315,7 +316,8 @@ void ZerithdSession::sendStartMessage() {
     return country ? Value(*country) : Value("Unknown");
   }();
   const Value reportVersion = Value(frameworkBundleVersion().value_or("8.0"));
-  const Value automatic = Defaults("com.velmar.timed").objectForKey("AutomaticTimeZoneEnabled");
+  constexpr const DefaultsSetting& automaticSetting = defaultsSetting("AutomaticTimeZoneEnabled", kTimedDomain);
+  const Value automatic = Defaults(std::string(kTimedDomain)).objectForKey(automaticSetting.key);
   const bool automaticTimeSet = automatic.isNil() ? true : automatic.boolValue();
 
   Dictionary payload;
