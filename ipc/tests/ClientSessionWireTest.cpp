@@ -144,6 +144,7 @@ TEST(ClientSessionWireRefusal, WrongArgumentTypesAreRefusedBeforeTheSessionSeesT
       {digest, {{"digestKey", "secret"}, {"algorithm", 1}}, "digestKey", "data, not a string"},
       {digest, {{"algorithm", 2147483648LL}}, "algorithm", "a signed 32-bit integer, not 2147483648"},
       {"uploadFileAtPath:extensionToken:completionHandler:", {}, "fileURL", "a string, not nil"},
+      {"updateSharedDataWithDictionary:", {{"dictionary", Array{Value(1)}}}, "dictionary", "a dictionary, not an array"},
       {"updateSharedDataForKey:value:", {{"key", 5}}, "key", "a string, not 5"},
       {"sendMessageWithDictionary:reply:", {{"message", Array{}}}, "message", "a dictionary, not an array"},
   };
