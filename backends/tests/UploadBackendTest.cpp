@@ -97,10 +97,8 @@ TEST_F(UploadBackendTest, EmptyOrChangedFilesAreRefused) {
   EXPECT_EQ(https.requestCount(), 0u);
 }
 
-TEST_F(UploadBackendTest, PlainHttpUploadAddressIsUpgradedAsEventPostsAre) {
-  // The server speaks only TLS: the file arrives only when the scheme was
-  // upgraded.
-  backend->setUploadURL("http://127.0.0.1:" + std::to_string(https.port()) + "/upload");
+// An http:// address is upgraded: the end-to-end uploads test posts to one.
+TEST_F(UploadBackendTest, TheAddressNamesDeviceSessionAndFileAndOnlyHttpIsPosted) {
   EXPECT_EQ(upload(files / "report.log"), std::make_pair(true, true));
   ASSERT_EQ(https.requestCount(), 1u);
   const auto request = https.requests()[0];
