@@ -58,8 +58,6 @@ TEST(BackendFactoryTest, NamesMakeTheirKindsAndEveryRefusalSaysWho) {
       {"adaptor unknown on Tarvix devices", kZerithBackendKovu, nullptr, {}, 13, "Tarvix"},
       {"Tarvix rule reads the device, not the family", kZerithBackendKovu, isA<KovuBackend>, {}, 13, "Tarvix Mini",
        "Tarvix"},
-      {"https post", kZerithBackendHTTPPost, isA<HTTPSPostBackend>},
-      {"https post 2", kZerithBackendHTTPPost2, isA<HTTPSPostBackend>},
       {"digest https post", kZerithBackendQRS, isA<HTTPSPostBackend>},
       {"https post without a client list", kZerithBackendHTTPPost, nullptr,
        "HTTPSPostBackend(initWithName): can't find the client list.", 7, nullptr, "F", Value(Dictionary{})},
