@@ -41,14 +41,18 @@ TEST_F(E2eTest, StopSignalWithoutSessionsExitsAtOnce) {
   EXPECT_NE(std::find(notes.begin(), notes.end(), "STOPPING=1"), notes.end());
 }
 
-// A misspelt key of its defaults is named when the daemon starts; the
-// test's own key (the storebag server) is one it reads.
-TEST_F(E2eTest, AKeyOfItsDefaultsThatTheDaemonDoesNotReadIsNamedAtStart) {
+// A misspelt key of its defaults, and a value its reader refuses, are named
+// when the daemon starts; the test's own key (the storebag server) is one it
+// reads.
+TEST_F(E2eTest, DefaultsTheDaemonDoesNotReadOrUseAreNamedAtStart) {
   Defaults("com.velmar.zerith").setObject("spoolEnbled", Value(true));
+  Defaults("com.velmar.zerith").setObject("uploadsAtOnce", Value(0));
   startDaemon();
   EXPECT_TRUE(daemon->waitFor("main: zerithd does not read \"spoolEnbled\" in com.velmar.zerith (did you mean "
                               "\"spoolEnabled\"?); it is ignored"))
       << daemon->output();
+  EXPECT_TRUE(daemon->waitFor("main: \"uploadsAtOnce\" in com.velmar.zerith is 0, outside 1 to 64; zerithd does not "
+                              "use this value"));
   EXPECT_EQ(daemon->count("does not read"), 1u);
 }
 

@@ -122,7 +122,41 @@ int write(const std::vector<std::string>& w, std::ostream& err) {
   if (unread) {
     err << "zerith-defaults: warning: " << *unread << "\n";
   }
+  for (const std::string& problem : defaultsDomainProblems(w[1])) {
+    if (problem.starts_with("\"" + w[2] + "\" ")) {
+      err << "zerith-defaults: warning: " << problem << "\n";
+    }
+  }
   return kOk;
+}
+
+// Every problem of the named domains' files (every domain the daemon reads
+// when none is named): status 1 when there is one.
+int check(const std::vector<std::string>& w, std::ostream& out, std::ostream& err) {
+  std::vector<std::string> domains(w.begin() + 1, w.end());
+  if (domains.empty()) {
+    for (const DefaultsSetting& s : kDefaultsSettings) {
+      if (std::find(domains.begin(), domains.end(), s.domain) == domains.end()) {
+        domains.emplace_back(s.domain);
+      }
+    }
+  }
+  std::size_t problems = 0;
+  for (const std::string& domain : domains) {
+    if (const auto unread = unreadDefaultsDomain(domain);
+        unread && std::filesystem::exists(Defaults(domain).path())) {
+      err << "zerith-defaults: " << *unread << "\n";
+      ++problems;
+      continue;
+    }
+    for (const std::string& problem : defaultsDomainProblems(domain)) {
+      err << "zerith-defaults: " << problem << "\n";
+      ++problems;
+    }
+  }
+  out << (problems == 0 ? std::string("no problems\n")
+                        : fmt::format("{} problem{}\n", problems, problems == 1 ? "" : "s"));
+  return problems == 0 ? kOk : kNotFound;
 }
 
 int remove(const std::vector<std::string>& w, std::ostream& err) {
@@ -155,16 +189,21 @@ int remove(const std::vector<std::string>& w, std::ostream& err) {
 std::string usage() {
   return "usage: zerith-defaults [--root DIR] read DOMAIN [KEY]\n"
          "       zerith-defaults [--root DIR] write DOMAIN KEY [-string|-int|-bool|-real] VALUE\n"
-         "       zerith-defaults [--root DIR] delete DOMAIN [KEY]\n";
+         "       zerith-defaults [--root DIR] delete DOMAIN [KEY]\n"
+         "       zerith-defaults [--root DIR] check [DOMAIN...]\n";
 }
 
 int runDefaultsCommand(const std::vector<std::string>& words, std::ostream& out, std::ostream& err) {
   const std::size_t n = words.size();
   const std::string command = n > 0 ? words[0] : std::string();
-  // A domain names a file in the defaults folder, never a path.
-  if (n >= 2 && (words[1].empty() || words[1].find('/') != std::string::npos || words[1][0] == '.')) {
-    err << fmt::format("zerith-defaults: '{}' is not a domain name\n", words[1]);
-    return kUsage;
+  // A domain names a file in the defaults folder, never a path. check takes
+  // several.
+  const std::size_t domainsEnd = command == "check" ? n : std::min<std::size_t>(n, 2);
+  for (std::size_t i = 1; i < domainsEnd; ++i) {
+    if (words[i].empty() || words[i].find('/') != std::string::npos || words[i][0] == '.') {
+      err << fmt::format("zerith-defaults: '{}' is not a domain name\n", words[i]);
+      return kUsage;
+    }
   }
   if (command == "read" && (n == 2 || n == 3)) {
     return read(words, out, err);
@@ -174,6 +213,9 @@ int runDefaultsCommand(const std::vector<std::string>& words, std::ostream& out,
   }
   if (command == "delete" && (n == 2 || n == 3)) {
     return remove(words, err);
+  }
+  if (command == "check") {
+    return check(words, out, err);
   }
   err << usage();
   return kUsage;

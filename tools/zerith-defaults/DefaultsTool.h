@@ -9,6 +9,9 @@
 //   write DOMAIN KEY [-string|-int|-integer|-bool|-boolean|-real|-float] VALUE
 //                          a typed value (a string without a type)
 //   delete DOMAIN [KEY]    one key, or the whole domain
+//   check [DOMAIN...]      keys the daemon does not read and values its
+//                          readers refuse, in the named domains or in every
+//                          domain it reads; status 1 when there is one
 
 #include <iosfwd>
 #include <string>
@@ -18,7 +21,7 @@ namespace zerith::tool {
 
 // Exit statuses.
 inline constexpr int kOk = 0;
-inline constexpr int kNotFound = 1;  // no such domain or key, or a failed write
+inline constexpr int kNotFound = 1;  // no such domain or key, a failed write, or a problem that check found
 inline constexpr int kUsage = 2;     // bad command line or value
 
 // Runs one command (its words after the program's own options); output goes

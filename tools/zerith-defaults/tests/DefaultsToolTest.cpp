@@ -126,6 +126,39 @@ TEST_F(DefaultsToolTest, AKeyOrDomainTheDaemonDoesNotReadIsWrittenWithAWarning) 
     EXPECT_EQ(r.err, warning) << arguments;
   }
   EXPECT_EQ(domain_.objectForKey("spoolEnbled"), Value(true));
+
+  // A value the daemon's reader refuses is written with a warning too.
+  const Result outOfRange = runTool("write com.velmar.zerith uploadsAtOnce -int 0");
+  EXPECT_EQ(outOfRange.status, 0);
+  EXPECT_EQ(outOfRange.err, "zerith-defaults: warning: \"uploadsAtOnce\" in com.velmar.zerith is 0, outside 1 to "
+                            "64; zerithd does not use this value\n");
+}
+
+// check names every problem of the domains the daemon reads, in each file's
+// order, and says whether there was one.
+TEST_F(DefaultsToolTest, CheckNamesUnreadKeysAndRefusedValues) {
+  EXPECT_EQ(run({"check"}).out, "no problems\n");
+  ASSERT_TRUE(domain_.setObject("spoolMaxBytes", Value("lots")));
+  ASSERT_TRUE(domain_.setObject("spoolEnbled", Value(true)));
+  ASSERT_TRUE(domain_.setObject("spoolEnabled", Value(true)));
+  ASSERT_TRUE(Defaults("com.velmar.timed").setObject("AutomaticTimeZoneEnabled", Value("sometimes")));
+  ASSERT_TRUE(Defaults("com.velmar.zerth").setObject("a", Value(1)));
+
+  const Result all = run({"check"});
+  EXPECT_EQ(all.status, tool::kNotFound);
+  EXPECT_EQ(all.out, "3 problems\n");
+  EXPECT_EQ(all.err,
+            "zerith-defaults: \"spoolMaxBytes\" in com.velmar.zerith holds 'lots', not a number; zerithd does not use "
+            "this value\n"
+            "zerith-defaults: zerithd does not read \"spoolEnbled\" in com.velmar.zerith (did you mean "
+            "\"spoolEnabled\"?); it is ignored\n"
+            "zerith-defaults: \"AutomaticTimeZoneEnabled\" in com.velmar.timed holds 'sometimes', not a boolean; "
+            "zerithd does not use this value\n");
+  const Result named = runTool("check com.velmar.zerth");
+  EXPECT_EQ(named.status, tool::kNotFound);
+  EXPECT_EQ(named.err, "zerith-defaults: zerithd reads no domain com.velmar.zerth (did you mean "
+                       "\"com.velmar.zerith\"?)\n");
+  EXPECT_EQ(run({"check", "com.velmar.zerith", "../etc"}).status, tool::kUsage);
 }
 
 }  // namespace
