@@ -1,6 +1,6 @@
 // Feeds one input to every reader of operator-written files: as the device
 // file and as a defaults domain (through the files, as the daemon reads
-// them), and as the text of os-release, machine-id, a locale name and a
+// them, every setting's value checked against its table row), and as the text of os-release, machine-id, a locale name and a
 // message log name. Also replayed over its corpus by the config tests.
 
 #include <cstddef>
@@ -17,6 +17,7 @@
 #include "config/Identifiers.h"
 #include "config/MessageLog.h"
 #include "platform/Defaults.h"
+#include "platform/DefaultsKeys.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
 
@@ -67,6 +68,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   replaceFile(domain.path(), text);
   (void)userDefaultsEnvironment();
   (void)defaultsStringForKey("httpsPostURL");
+  // Every setting's value through the parse its readers use, as
+  // zerith-defaults check and the daemon's start run it.
+  (void)defaultsDomainProblems(kZerithDomain);
 
   // The text files.
   (void)device::parseOsRelease(text);
