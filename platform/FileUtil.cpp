@@ -4,7 +4,10 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <cstring>
 #include <string>
+
+#include <fmt/format.h>
 
 namespace zerith::file {
 
@@ -33,6 +36,45 @@ std::optional<Data> readAll(const std::filesystem::path& path, std::size_t limit
     out.insert(out.end(), buf, buf + n);
   }
   return out;
+}
+
+RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t limit) {
+  RegularFileRead result;
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+  if (!fd || ::fstat(fd.get(), &result.status) != 0) {
+    result.error = errno;
+    result.why = errno == ELOOP ? "a symbolic link, which is not followed" : std::strerror(errno);
+    return result;
+  }
+  if (!S_ISREG(result.status.st_mode)) {
+    result.why = "not a regular file";
+    return result;
+  }
+  const auto size = static_cast<std::uint64_t>(result.status.st_size);
+  if (size > limit) {
+    result.why = fmt::format("{} bytes, more than the {} read", size, limit);
+    return result;
+  }
+  Data bytes(static_cast<std::size_t>(size));
+  std::size_t got = 0;
+  while (got < bytes.size()) {
+    const ssize_t n = ::read(fd.get(), bytes.data() + got, bytes.size() - got);
+    if (n < 0 && errno == EINTR) {
+      continue;
+    }
+    if (n < 0) {
+      result.error = errno;
+      result.why = std::strerror(errno);
+      return result;
+    }
+    if (n == 0) {
+      break;  // shorter than it was: what is there
+    }
+    got += static_cast<std::size_t>(n);
+  }
+  bytes.resize(got);
+  result.bytes = std::move(bytes);
+  return result;
 }
 
 bool writeAtomically(const std::filesystem::path& path, std::span<const std::uint8_t> bytes,

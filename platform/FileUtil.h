@@ -2,12 +2,14 @@
 
 // Small file helpers: an owned descriptor, bounded reads, atomic writes.
 
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdint>
 #include <filesystem>
 #include <optional>
 #include <span>
+#include <string>
 
 #include "platform/Value.h"
 
@@ -48,6 +50,19 @@ class UniqueFd {
 
 // The whole file, or nullopt when it cannot be read or is larger than `limit`.
 std::optional<Data> readAll(const std::filesystem::path& path, std::size_t limit);
+
+// A file of a folder that another user may write (the daemon's spool and
+// caches, read by the operator's tools): no symbolic link followed, no FIFO
+// waited on, a regular file of at most `limit` bytes. `bytes` when it was
+// read; otherwise `error` (an errno; 0 for a file that is not regular or too
+// large) and `why`, for a person. `status` is the file's when it was opened.
+struct RegularFileRead {
+  std::optional<Data> bytes;
+  int error = 0;
+  std::string why;
+  struct stat status {};
+};
+RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t limit);
 
 // Temporary file in the same folder, fsync, rename over `path`, fsync the
 // folder. The temporary file is removed on failure.

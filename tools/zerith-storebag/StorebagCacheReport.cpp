@@ -1,9 +1,7 @@
 #include "tools/zerith-storebag/StorebagCacheReport.h"
 
 #include <dirent.h>
-#include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -17,6 +15,7 @@
 #include "config/StorebagIssueTimes.h"
 #include "config/StorebagVerify.h"
 #include "platform/FileUtil.h"
+#include "platform/HumanText.h"
 
 namespace zerith {
 
@@ -35,42 +34,6 @@ std::vector<std::uint32_t> clientTypesOf(const std::string& name) {
   return types;
 }
 
-// The container in a cache file, read as the daemon reads it (no link
-// followed, at most kMaxStorebagContainerBytes); nullopt with the reason.
-std::optional<Data> readContainer(const std::filesystem::path& path, struct stat& st, std::string& why) {
-  file::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
-  if (!fd || ::fstat(fd.get(), &st) != 0) {
-    why = errno == ELOOP ? "a symbolic link, which the daemon does not follow" : std::strerror(errno);
-    return std::nullopt;
-  }
-  if (!S_ISREG(st.st_mode)) {
-    why = "not a regular file";
-    return std::nullopt;
-  }
-  if (static_cast<std::uint64_t>(st.st_size) > kMaxStorebagContainerBytes) {
-    why = fmt::format("{} bytes, more than the {} the daemon reads", st.st_size, kMaxStorebagContainerBytes);
-    return std::nullopt;
-  }
-  Data bytes(static_cast<std::size_t>(st.st_size));
-  std::size_t got = 0;
-  while (got < bytes.size()) {
-    const ssize_t n = ::read(fd.get(), bytes.data() + got, bytes.size() - got);
-    if (n < 0 && errno == EINTR) {
-      continue;
-    }
-    if (n <= 0) {
-      if (n < 0) {
-        why = std::strerror(errno);
-        return std::nullopt;
-      }
-      break;
-    }
-    got += static_cast<std::size_t>(n);
-  }
-  bytes.resize(got);
-  return bytes;
-}
-
 CachedStorebag describeFile(const std::filesystem::path& folder, const std::string& name,
                             const std::optional<StorebagIssueTimes>& remembered) {
   CachedStorebag entry;
@@ -87,16 +50,16 @@ CachedStorebag describeFile(const std::filesystem::path& folder, const std::stri
     }
   }
 
-  struct stat st {};
-  std::string why;
-  const auto container = readContainer(folder / name, st, why);
-  if (!container) {
+  const file::RegularFileRead read = file::readRegularFile(folder / name, kMaxStorebagContainerBytes);
+  if (!read.bytes) {
     entry.signature = "not checked";
-    entry.refused = "the file cannot be read: " + why;
+    entry.refused = "the file cannot be read: " + read.why;
     return entry;
   }
+  const Data* container = &*read.bytes;
   entry.bytes = container->size();
-  entry.saved = Date{static_cast<double>(st.st_mtim.tv_sec) + static_cast<double>(st.st_mtim.tv_nsec) / 1e9};
+  entry.saved = Date{static_cast<double>(read.status.st_mtim.tv_sec) +
+                     static_cast<double>(read.status.st_mtim.tv_nsec) / 1e9};
 
   const auto strongKey = frameworkStrongPublicKey();
   const auto verification = verifyStorebagContainer(plist::bytesOf(*container), frameworkPublicKey(), strongKey);
@@ -123,21 +86,6 @@ CachedStorebag describeFile(const std::filesystem::path& folder, const std::stri
       break;
   }
   return entry;
-}
-
-// "45 s", "12 min", "2 h 5 min", "3 d 4 h".
-std::string durationText(double seconds) {
-  const auto s = static_cast<std::int64_t>(std::max(0.0, std::floor(seconds)));
-  if (s < 60) {
-    return fmt::format("{} s", s);
-  }
-  if (s < 3600) {
-    return fmt::format("{} min", s / 60);
-  }
-  if (s < 86400) {
-    return s % 3600 >= 60 ? fmt::format("{} h {} min", s / 3600, s % 3600 / 60) : fmt::format("{} h", s / 3600);
-  }
-  return s % 86400 >= 3600 ? fmt::format("{} d {} h", s / 86400, s % 86400 / 3600) : fmt::format("{} d", s / 86400);
 }
 
 }  // namespace
@@ -194,12 +142,12 @@ std::string describeStorebagCache(const StorebagCacheReport& report, Date now) {
                                      : fmt::format("client type{} {}", bag.clientTypes.size() == 1 ? "" : "s", types));
     if (bag.saved) {
       const double age = std::fabs(now.secondsSince1970 - bag.saved->secondsSince1970);
-      out += fmt::format("  saved      {}, {} ago, {} bytes\n", describeIssueTime(*bag.saved), durationText(age),
+      out += fmt::format("  saved      {}, {} ago, {} bytes\n", describeIssueTime(*bag.saved), describeDuration(age),
                          bag.bytes);
       const bool expired = age > bag.maxAgeSeconds;
-      out += fmt::format("  max age    {}: {}\n", durationText(bag.maxAgeSeconds),
+      out += fmt::format("  max age    {}: {}\n", describeDuration(bag.maxAgeSeconds),
                          expired ? "passed; the next session's fetch uses this copy and asks the server again"
-                                 : fmt::format("fresh for {} more", durationText(bag.maxAgeSeconds - age)));
+                                 : fmt::format("fresh for {} more", describeDuration(bag.maxAgeSeconds - age)));
     }
     if (bag.lastModified) {
       out += fmt::format("  server's Last-Modified  {}\n", *bag.lastModified);

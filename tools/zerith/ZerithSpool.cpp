@@ -3,7 +3,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <array>
@@ -16,6 +15,7 @@
 
 #include "backends/Spool.h"
 #include "platform/FileUtil.h"
+#include "platform/HumanText.h"
 #include "platform/Json.h"
 #include "platform/Paths.h"
 #include "tools/zerith/ZerithCli.h"
@@ -51,43 +51,20 @@ struct FileOutcome {
 };
 
 FileOutcome readBatch(const fs::path& path, const std::string& name) {
-  file::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
-  struct stat st {};
-  if (!fd || ::fstat(fd.get(), &st) != 0) {
-    if (errno == ENOENT) {
-      return {};
-    }
-    return {std::nullopt, errno == ELOOP ? "not a regular file" : std::string(std::strerror(errno))};
-  }
-  if (!S_ISREG(st.st_mode) || !name.ends_with(kSpoolSuffix) || name.size() == kSpoolSuffix.size()) {
+  if (!name.ends_with(kSpoolSuffix) || name.size() == kSpoolSuffix.size()) {
     return {std::nullopt, "not a spool file name or not a regular file"};
   }
-  const auto size = static_cast<std::uint64_t>(st.st_size);
-  if (size > kSpoolHeaderSize + kSpoolMaxBodySize) {
-    return {std::nullopt, fmt::format("{} bytes, more than a spool file holds", size)};
+  const file::RegularFileRead read = file::readRegularFile(path, kSpoolHeaderSize + kSpoolMaxBodySize);
+  if (!read.bytes) {
+    return read.error == ENOENT ? FileOutcome{} : FileOutcome{std::nullopt, read.why};
   }
-  Data bytes(size);
-  std::size_t got = 0;
-  while (got < bytes.size()) {
-    const ssize_t n = ::read(fd.get(), bytes.data() + got, bytes.size() - got);
-    if (n < 0 && errno == EINTR) {
-      continue;
-    }
-    if (n < 0) {
-      return {std::nullopt, std::string(std::strerror(errno))};
-    }
-    if (n == 0) {
-      break;
-    }
-    got += static_cast<std::size_t>(n);
-  }
-  bytes.resize(got);
   std::string why;
-  auto batch = decodeSpoolFile(bytes, &why);
+  auto batch = decodeSpoolFile(*read.bytes, &why);
   if (!batch) {
     return {std::nullopt, why};
   }
-  return {SpoolListing::Batch{name, batch->createdMillis, batch->recordCount, got, std::move(batch->url)}, {}};
+  return {SpoolListing::Batch{name, batch->createdMillis, batch->recordCount, read.bytes->size(), std::move(batch->url)},
+          {}};
 }
 
 void countSetAside(const fs::path& bad, SpoolListing& listing) {
@@ -103,38 +80,6 @@ void countSetAside(const fs::path& bad, SpoolListing& listing) {
     }
   }
   ::closedir(dir);
-}
-
-// "512 B", "1.2 KiB", "64.0 MiB".
-std::string bytesText(std::uint64_t bytes) {
-  if (bytes < 1024) {
-    return fmt::format("{} B", bytes);
-  }
-  constexpr const char* kUnits[] = {"KiB", "MiB", "GiB", "TiB"};
-  double value = static_cast<double>(bytes) / 1024;
-  std::size_t unit = 0;
-  while (value >= 1024 && unit + 1 < std::size(kUnits)) {
-    value /= 1024;
-    ++unit;
-  }
-  return fmt::format("{:.1f} {}", value, kUnits[unit]);
-}
-
-// "45 s", "12 min", "2 h 5 min", "3 d 4 h"; a time ahead of the clock is 0 s.
-std::string ageText(std::int64_t seconds) {
-  seconds = std::max<std::int64_t>(seconds, 0);
-  if (seconds < 60) {
-    return fmt::format("{} s", seconds);
-  }
-  if (seconds < 3600) {
-    return fmt::format("{} min", seconds / 60);
-  }
-  if (seconds < 86400) {
-    return seconds % 3600 >= 60 ? fmt::format("{} h {} min", seconds / 3600, seconds % 3600 / 60)
-                                : fmt::format("{} h", seconds / 3600);
-  }
-  return seconds % 86400 >= 3600 ? fmt::format("{} d {} h", seconds / 86400, seconds % 86400 / 3600)
-                                 : fmt::format("{} d", seconds / 86400);
 }
 
 std::string utcText(std::int64_t millis) {
@@ -210,8 +155,8 @@ std::string spoolTable(const SpoolListing& listing, std::chrono::system_clock::t
   const auto ageSeconds = [nowMillis](std::int64_t createdMillis) { return (nowMillis - createdMillis) / 1000; };
   std::string out = fmt::format("Spool {}: ", listing.folder.string());
   if (listing.enabled) {
-    out += fmt::format("spooling on, up to {}, batches kept {}\n", bytesText(listing.maxBytes),
-                       ageText(listing.maxAgeSeconds));
+    out += fmt::format("spooling on, up to {}, batches kept {}\n", describeByteCount(listing.maxBytes),
+                       describeDuration(listing.maxAgeSeconds));
   } else {
     out += "spooling is off (spoolEnabled is not true)";
     out += listing.batches.empty() ? "\n" : "; the batches below stay until it is on again\n";
@@ -247,16 +192,16 @@ std::string spoolTable(const SpoolListing& listing, std::chrono::system_clock::t
           return a.createdMillis < b.createdMillis;
         })->createdMillis;
     out += fmt::format("{} batch{}, {} record{}, {}; the oldest made {} ({} ago)\n\n", listing.batches.size(),
-                       listing.batches.size() == 1 ? "" : "es", records, records == 1 ? "" : "s", bytesText(bytes),
-                       utcText(oldest), ageText(ageSeconds(oldest)));
+                       listing.batches.size() == 1 ? "" : "es", records, records == 1 ? "" : "s", describeByteCount(bytes),
+                       utcText(oldest), describeDuration(ageSeconds(oldest)));
 
     std::vector<std::pair<std::string, Row>> rows(byURL.begin(), byURL.end());
     std::stable_sort(rows.begin(), rows.end(),
                      [](const auto& a, const auto& b) { return a.second.oldestMillis < b.second.oldestMillis; });
     std::vector<std::array<std::string, 5>> cells{{"URL", "BATCHES", "RECORDS", "BYTES", "OLDEST"}};
     for (const auto& [url, row] : rows) {
-      cells.push_back({url, std::to_string(row.batches), std::to_string(row.records), bytesText(row.bytes),
-                       ageText(ageSeconds(row.oldestMillis))});
+      cells.push_back({url, std::to_string(row.batches), std::to_string(row.records), describeByteCount(row.bytes),
+                       describeDuration(ageSeconds(row.oldestMillis))});
     }
     std::array<std::size_t, 5> widths{};
     for (const auto& line : cells) {
@@ -270,7 +215,7 @@ std::string spoolTable(const SpoolListing& listing, std::chrono::system_clock::t
     }
     if (expired > 0) {
       out += fmt::format("\n{} batch{} past the age of {}: the daemon drops {} at its next write or retry.\n",
-                         expired, expired == 1 ? " is" : "es are", ageText(listing.maxAgeSeconds),
+                         expired, expired == 1 ? " is" : "es are", describeDuration(listing.maxAgeSeconds),
                          expired == 1 ? "it" : "them");
     }
   }
@@ -282,7 +227,7 @@ std::string spoolTable(const SpoolListing& listing, std::chrono::system_clock::t
   }
   if (listing.setAsideFiles > 0) {
     out += fmt::format("\nbad/ holds {} file{} ({}) set aside earlier; the daemon never reads them again.\n",
-                       listing.setAsideFiles, listing.setAsideFiles == 1 ? "" : "s", bytesText(listing.setAsideBytes));
+                       listing.setAsideFiles, listing.setAsideFiles == 1 ? "" : "s", describeByteCount(listing.setAsideBytes));
   }
   return out;
 }
