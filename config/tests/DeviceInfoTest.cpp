@@ -76,16 +76,16 @@ TEST_F(DeviceInfoTest, DeviceTreeAnswersWhereThereIsNoDmi) {
 TEST_F(DeviceInfoTest, OperatorFileWinsOverLinuxSourcesAndIsReReadWhenChanged) {
   root_.write("/etc/os-release", "VERSION_ID=12\n");
   root_.write("/sys/class/dmi/id/product_name", "Generic\n");
+  // Product version and type, release type and device name.
+  const auto shown = [&] {
+    return Answers{answer(kDeviceKeyProductVersion), answer(kDeviceKeyProductType), answer(kDeviceKeyReleaseType),
+                   answer(kDeviceKeyDeviceName)};
+  };
   writeDeviceFile({{"ProductVersion", "17.2"}, {"DeviceName", "kitchen"}, {"ReleaseType", "Internal"}});
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "17.2");
-  EXPECT_EQ(answer(kDeviceKeyDeviceName), "kitchen");
-  EXPECT_EQ(answer(kDeviceKeyReleaseType), "Internal");
-  EXPECT_EQ(answer(kDeviceKeyProductType), "Generic");  // not in the file: Linux answers
+  EXPECT_EQ(shown(), (Answers{"17.2", "Generic", "Internal", "kitchen"}));  // no type in the file: Linux answers
 
-  writeDeviceFile({{"ProductType", "Tarvix"}});
-  EXPECT_EQ(answer(kDeviceKeyProductVersion), "12");
-  EXPECT_EQ(answer(kDeviceKeyProductType), "Tarvix");
-  EXPECT_EQ(answer(kDeviceKeyReleaseType), std::nullopt);
+  writeDeviceFile({{"DeviceName", "hall"}, {"ProductType", "Tarvix"}});
+  EXPECT_EQ(shown(), (Answers{"12", "Tarvix", std::nullopt, "hall"}));
 
   // An entry that is not a string falls back to Linux.
   writeDeviceFile({{"ProductVersion", Value(17)}});

@@ -22,9 +22,7 @@ Value sample() {
 
 TEST(PropertyListTest, NilEntriesAreLeftOut) {
   Dictionary d{{"a", 1}, {"b", Value()}};
-  auto back = plist::decode(plist::bytesOf(plist::encodeBinary(Value(d))));
-  ASSERT_TRUE(back);
-  EXPECT_EQ(back->count(), 1u);
+  EXPECT_EQ(plist::decode(plist::bytesOf(plist::encodeBinary(Value(d)))), Value(Dictionary{{"a", 1}}));
   EXPECT_TRUE(plist::encodeBinary(Value()).empty());
 }
 
@@ -47,12 +45,9 @@ TEST(PropertyListTest, BinaryAndXmlKeepTypesOrderAndLargeContainersWhole) {
     const auto back = binary ? plist::decode(plist::bytesOf(plist::encodeBinary(v)))
                              : plist::decode(plist::bytesOf(plist::encodeXml(v)));
     ASSERT_TRUE(back) << binary;
-    EXPECT_EQ(*back, v) << binary;
-    ASSERT_EQ(back->count(), 1011u);
-    EXPECT_EQ(back->dict()->entries()[7].first, "list");
-    EXPECT_EQ(back->dict()->entries()[1007].first, "key-999");
-    EXPECT_EQ((*back)["key-998"].intValue(), 998000);  // found through the read list's own index
-    EXPECT_EQ((*back)["many"].count(), 1000u);
+    EXPECT_EQ(back->dict()->entries(), v.dict()->entries()) << binary;
+    // Every key of the original looked up through the read list's own index.
+    EXPECT_EQ(v, *back) << binary;
   }
 }
 
