@@ -84,34 +84,27 @@ TEST_F(HTTPSRecordTest, SessionIdentifierFormDependsOnComponentTypeAndInternalFl
   EXPECT_TRUE(std::isfinite(record.get("_clientTS").doubleValue()));
 }
 
-TEST_F(HTTPSRecordTest, EnvelopeCarriesDatesAsSecondsAndDropsWhatJsonCannotHold) {
+// What the batch writer keeps, escapes and drops, and the envelope's key
+// order, are RecordJsonTest's; here what the backend adds: a line for each
+// dropped entry, the identifier it chose, and no printable copy.
+TEST_F(HTTPSRecordTest, EnvelopeNamesEachDroppedEntryAndCarriesTheOverridingIdentifier) {
   auto b = backend(profileWith({enablingClient(server.url("/post"))}));
-  Dictionary record{{"when", Date{1234.5}},
-                    {"inf", std::numeric_limits<double>::infinity()},
-                    {"nan", std::numeric_limits<double>::quiet_NaN()},
-                    {"list", Array{Value(1)}},
-                    {"nested", Dictionary{{"a", 1}}},
-                    {"blob", Data{1, 2}},
-                    {"flag", true},
-                    {"bad utf8", std::string("a\xff\xfe" "b")},
-                    {"quote\"key", "line\nbreak"}};
+  const Dictionary record{{"inf", std::numeric_limits<double>::infinity()},
+                          {"nan", std::numeric_limits<double>::quiet_NaN()},
+                          {"list", Array{Value(1)}},
+                          {"nested", Dictionary{{"a", 1}}},
+                          {"blob", Data{1, 2}},
+                          {"flag", true}};
   std::optional<std::string> pretty;
   const auto body = b->createMessageForPostAndLogging({record}, &pretty);
   ASSERT_TRUE(body);
-  const auto envelope = nlohmann::ordered_json::parse(*body);  // valid JSON despite the bytes above
-  ASSERT_TRUE(envelope.contains("events"));
-  const auto& event = envelope["events"][0];
-  EXPECT_DOUBLE_EQ(event["when"].get<double>(), 1234.5);
-  EXPECT_TRUE(event["flag"].get<bool>());
-  EXPECT_EQ(event["quote\"key"], "line\nbreak");
-  EXPECT_EQ(event["bad utf8"], "a\xEF\xBF\xBD\xEF\xBF\xBD" "b");
   for (const char* dropped : {"inf", "nan", "list", "nested", "blob"}) {
-    EXPECT_FALSE(event.contains(dropped)) << dropped;
     EXPECT_TRUE(logs.contains(std::string("HTTPSPostBackend(createMessageForPostAndLogging): QFJSONSerialization unable "
                                           "to handle key: ") + dropped))
         << dropped;
   }
-  EXPECT_EQ(envelope.begin().key(), "postTime");
+  const auto envelope = nlohmann::ordered_json::parse(*body);
+  EXPECT_EQ(envelope["events"], nlohmann::ordered_json::parse(R"([{"flag":true}])"));
   EXPECT_EQ(envelope["clientId"], Zerith::getPersistentIdentifierForDNU(false));  // override_dnu 1
   // Consent given but overridden: no printable copy.
   EXPECT_FALSE(pretty);
