@@ -10,7 +10,6 @@
 
 #include "backends/tests/HTTPSPostBackendTestSupport.h"
 #include "backends/tests/WireCaptureServer.h"
-#include "zerith/ZerithConstants.h"
 
 namespace zerith::test {
 namespace {

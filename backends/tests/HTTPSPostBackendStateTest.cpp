@@ -13,7 +13,7 @@ namespace {
 class HTTPSRecordTest : public HTTPSBackendTest {};
 
 TEST_F(HTTPSRecordTest, RecordCountsFromTheStartMinuteAndCarriesEveryKeyInOrder) {
-  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  auto b = immediate(server.url("/post"));
   ASSERT_TRUE(b);
   const Dictionary payload{{"_method", "overwritten"}, {"bytes", 17}};
   const Dictionary record = b->newEventDictfromPayload(Value(payload), at(1010, 250000), 5, 6, 99);
@@ -40,7 +40,7 @@ TEST_F(HTTPSRecordTest, RecordCountsFromTheStartMinuteAndCarriesEveryKeyInOrder)
 }
 
 TEST_F(HTTPSRecordTest, AbsentHardwareTypeLeavesNoModelEvenWhenThePayloadNamedOne) {
-  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  auto b = immediate(server.url("/post"));
   ASSERT_TRUE(b);
   b->setHardwareType(std::nullopt);
   // A payload past the dictionary's index threshold, so that the removal
@@ -59,7 +59,7 @@ TEST_F(HTTPSRecordTest, AbsentHardwareTypeLeavesNoModelEvenWhenThePayloadNamedOn
 }
 
 TEST_F(HTTPSRecordTest, SessionIdentifierFormDependsOnComponentTypeAndInternalFlag) {
-  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  auto b = immediate(server.url("/post"));
   b->setCombinedSessionIDString("AAA.BBB");
   const auto sessionOf = [&](int type, bool internal) {
     b->setCompType(type);
@@ -86,7 +86,7 @@ TEST_F(HTTPSRecordTest, SessionIdentifierFormDependsOnComponentTypeAndInternalFl
 // order, are RecordJsonTest's; here what the backend adds: a line for each
 // dropped entry, the identifier it chose, and no printable copy.
 TEST_F(HTTPSRecordTest, EnvelopeNamesEachDroppedEntryAndCarriesTheOverridingIdentifier) {
-  auto b = backend(profileWith({enablingClient(server.url("/post"))}));
+  auto b = immediate(server.url("/post"));
   const Dictionary record{{"inf", std::numeric_limits<double>::infinity()},
                           {"nan", std::numeric_limits<double>::quiet_NaN()},
                           {"list", Array{Value(1)}},
@@ -139,7 +139,7 @@ TEST_F(HTTPSRecordTest, PrintableCopyOnlyWhenConsentIsRespectedOrLoggingIsForced
 class HTTPSStateTest : public HTTPSBackendTest {};
 
 TEST_F(HTTPSStateTest, ClientNamesMatchExactlyAndServicesBySubstringIgnoringCase) {
-  auto b = backend(profileWith({enablingClient("https://x/")}));
+  auto b = immediate("https://x/");
   Dictionary entry{{"client", "mail,Demo"}, {"service", "Sync,CL"}};
   EXPECT_TRUE(b->matchClientNameAndServiceID(Value(entry), "DEMO", "the-cli-service"));
   EXPECT_TRUE(b->matchClientNameAndServiceID(Value(entry), "mail", "sync"));
@@ -154,7 +154,7 @@ TEST_F(HTTPSStateTest, ClientNamesMatchExactlyAndServicesBySubstringIgnoringCase
 }
 
 TEST_F(HTTPSStateTest, FrameworkVersionGateComparesMajorMiddleMinor) {
-  auto b = backend(profileWith({enablingClient("https://x/")}));  // framework 8.1.0
+  auto b = immediate("https://x/");  // framework 8.1.0
   EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{})));
   EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "8.1"}})));
   EXPECT_TRUE(b->isFrameworkEnabledForClient(Value(Dictionary{{"enabledSince", "7.9.9"}})));
