@@ -44,19 +44,15 @@ TEST(ZerithDashboardToolTest, ReliableBackendsDatagramsArePrintedAndAcknowledged
   backend->cleanup();
 }
 
-TEST(ZerithDashboardToolTest, MalformedDatagramsAreReportedNotDecoded) {
+TEST(ZerithDashboardToolTest, MalformedDatagramIsReportedNotDecoded) {
   CollectorProcess tool(ZERITH_DASHBOARD_TOOL, {});
   const auto port = static_cast<std::uint16_t>(tool.port());
   ASSERT_NE(port, 0) << tool.said();
   UdpTestServer sender;
   sender.sendTo(port, std::vector<std::uint8_t>(10, 0xff));
-  auto json = tool.nextLine().value_or(nlohmann::ordered_json::object());
+  const auto json = tool.nextLine().value_or(nlohmann::ordered_json::object());
   EXPECT_EQ(json["size"], 10);
   EXPECT_EQ(json["error"], "10 bytes, shorter than the 64-byte header");
-  std::vector<std::uint8_t> liar(64, 0);  // its length field says 65535 bytes
-  sender.sendTo(port, liar);
-  json = tool.nextLine().value_or(nlohmann::ordered_json::object());
-  EXPECT_EQ(json["error"], "length field says 65535 bytes, 64 arrived");
 }
 
 TEST(ZerithDashboardToolTest, DroppedShareLosesDatagramsWithoutALine) {
