@@ -411,9 +411,6 @@ TEST(DashboardDatagramTest, DecodeChecksLengthsAndUndoesTheEscapes) {
   EXPECT_FALSE(dashboard::decode(shortened, &why).has_value());
   EXPECT_EQ(why, "length field says 82 bytes, 81 arrived");
   EXPECT_FALSE(dashboard::decode(std::vector<std::uint8_t>(63, 0), &why).has_value());
-  EXPECT_FALSE(dashboard::acknowledgedEventNumber(std::vector<std::uint8_t>(61, 0), false).has_value());
-  EXPECT_FALSE(dashboard::acknowledgedEventNumber(std::vector<std::uint8_t>(62, 0), true).has_value());
-  EXPECT_EQ(dashboard::acknowledgedEventNumber(ackFor(513, 62), false), 513);
 }
 
 }  // namespace

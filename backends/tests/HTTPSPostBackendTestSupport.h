@@ -153,8 +153,8 @@ class HTTPSBackendTest : public ::testing::Test {
   // A backend as a session sets it up: client type 7, version 12, session
   // 42, started at 1000.5 s, framework 8.1.0, then its state decided.
   std::shared_ptr<HTTPSPostBackend> backend(const Value& profile, Value info = userInfo(), bool requireUserInfo = true,
-                                            bool batch = false, const std::string& name = "httpsPost") {
-    auto b = HTTPSPostBackend::initWithName(name, profile, std::string("TestFamily"));
+                                            bool batch = false) {
+    auto b = HTTPSPostBackend::initWithName("httpsPost", profile, std::string("TestFamily"));
     if (!b) {
       return nullptr;
     }

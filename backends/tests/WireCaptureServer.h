@@ -4,9 +4,9 @@
 // request as they came off the wire (header lines in their order, the body
 // as sent), which the recording HTTPS test server cannot: its library sorts
 // the headers. It answers every request with 200 and closes the
-// connection. It also counts handshakes that failed, so a test can tell a
-// refused connection (no request bytes at all) from one that sent its
-// request.
+// connection. It also counts the connections it served, with a request or
+// without (a failed handshake, or a client that closed after it), so a test
+// can wait for a refused connection and then see that it sent no request.
 //
 // Any certificate and key can be given, so tests can present a certificate
 // for the wrong host name.
@@ -88,16 +88,10 @@ class WireCaptureServer {
     std::lock_guard lock(mutex_);
     return requests_;
   }
-  std::size_t requestBytes() const {
-    std::lock_guard lock(mutex_);
-    return requestBytes_;
-  }
-  // Waits until `count` requests or failed handshakes have happened.
+  // Waits until `count` connections have been served.
   bool waitForConnections(std::size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(10)) const {
     std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, timeout, [&] {
-      return requests_.size() + static_cast<std::size_t>(failedHandshakes_) >= count;
-    });
+    return changed_.wait_for(lock, timeout, [&] { return connections_ >= count; });
   }
 
  private:
@@ -126,7 +120,7 @@ class WireCaptureServer {
       // decrypts: count them as none.
       {
         std::lock_guard lock(mutex_);
-        ++failedHandshakes_;
+        ++connections_;
       }
       changed_.notify_all();
       SSL_free(ssl);
@@ -176,7 +170,7 @@ class WireCaptureServer {
     SSL_free(ssl);
     {
       std::lock_guard lock(mutex_);
-      requestBytes_ += raw.size();
+      ++connections_;
       if (!raw.empty()) {
         requests_.push_back(std::move(request));
       }
@@ -192,8 +186,7 @@ class WireCaptureServer {
   mutable std::mutex mutex_;
   mutable std::condition_variable changed_;
   std::vector<Request> requests_;
-  int failedHandshakes_ = 0;
-  std::size_t requestBytes_ = 0;
+  std::size_t connections_ = 0;
 };
 
 }  // namespace zerith::test

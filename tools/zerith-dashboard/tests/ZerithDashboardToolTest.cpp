@@ -4,8 +4,6 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
-#include <condition_variable>
-#include <mutex>
 #include <string>
 #include <vector>
 
@@ -13,6 +11,7 @@
 #include "tests/support/CollectorProcess.h"
 #include "tests/support/UdpTestServer.h"
 #include "tools/zerith-dashboard/DashboardReceiver.h"
+#include "transport/tests/TransportTestSupport.h"
 
 namespace zerith::test {
 namespace {
@@ -24,17 +23,11 @@ TEST(ZerithDashboardToolTest, ReliableBackendsDatagramsArePrintedAndAcknowledged
   const auto port = static_cast<std::uint16_t>(tool.port());
   ASSERT_NE(port, 0) << tool.said();
   auto backend = DashboardBackend::initWithName(
-      "dashboard", Value(Dictionary{{"ip", Value("127.0.0.1")}, {"port", Value(port)}, {"reliable", Value(5)}}),
+      "dashboard", Value(Dictionary{{"ip", Value("127.0.0.1")}, {"port", Value(port)}, {"reliable", Value(1000)}}),
       std::nullopt);
   ASSERT_NE(backend, nullptr);
-  std::mutex mutex;
-  std::condition_variable changed;
-  std::vector<std::size_t> counts;
-  backend->setQueueObserver([&](std::size_t count, bool) {
-    std::lock_guard lock(mutex);
-    counts.push_back(count);
-    changed.notify_all();
-  });
+  Recorder<std::size_t> counts;  // the retransmission queue's sizes
+  backend->setQueueObserver([&](std::size_t count, bool) { counts.add(count); });
   backend->setSessionID(77);
   backend->setCompType(5);
   backend->sendMessage(Value(Dictionary{{"name", Value("a=b c")}}), timeval{12, 345678}, std::uint16_t{3},
@@ -43,28 +36,23 @@ TEST(ZerithDashboardToolTest, ReliableBackendsDatagramsArePrintedAndAcknowledged
   ASSERT_TRUE(line.has_value());
   EXPECT_TRUE(hasMembers(*line, R"({"time":12.344,"sender":"YF","sessionID":77,"event":9,"method":3,"respCode":4,
       "reliable":true,"items":{"name":"a=b c"},"acknowledged":true})"));
-  // Acknowledged: nothing is sent again, the queue drains.
-  {
-    std::unique_lock lock(mutex);
-    EXPECT_TRUE(changed.wait_for(lock, 10s, [&] { return !counts.empty() && counts.back() == 0; }));
-  }
+  // The queue drains by the tool's acknowledgement, not by giving up
+  // after five sendings (a second apart).
+  EXPECT_TRUE(counts.waitUntil([](const auto& sizes) { return !sizes.empty() && sizes.back() == 0; }, 10s));
+  EXPECT_EQ(backend->counters().get(BackendCount::delivered), 1u);
   backend->setQueueObserver(nullptr);  // the observer's locals end with the test
   backend->cleanup();
 }
 
-TEST(ZerithDashboardToolTest, MalformedDatagramsAreReportedNotDecoded) {
+TEST(ZerithDashboardToolTest, MalformedDatagramIsReportedNotDecoded) {
   CollectorProcess tool(ZERITH_DASHBOARD_TOOL, {});
   const auto port = static_cast<std::uint16_t>(tool.port());
   ASSERT_NE(port, 0) << tool.said();
   UdpTestServer sender;
   sender.sendTo(port, std::vector<std::uint8_t>(10, 0xff));
-  auto json = tool.nextLine().value_or(nlohmann::ordered_json::object());
+  const auto json = tool.nextLine().value_or(nlohmann::ordered_json::object());
   EXPECT_EQ(json["size"], 10);
   EXPECT_EQ(json["error"], "10 bytes, shorter than the 64-byte header");
-  std::vector<std::uint8_t> liar(64, 0);  // its length field says 65535 bytes
-  sender.sendTo(port, liar);
-  json = tool.nextLine().value_or(nlohmann::ordered_json::object());
-  EXPECT_EQ(json["error"], "length field says 65535 bytes, 64 arrived");
 }
 
 TEST(ZerithDashboardToolTest, DroppedShareLosesDatagramsWithoutALine) {
