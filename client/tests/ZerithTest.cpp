@@ -5,7 +5,6 @@
 #include <regex>
 
 #include "client/tests/TestDaemon.h"
-#include "ipc/Frame.h"
 #include "platform/Defaults.h"
 
 namespace zerith::test {
