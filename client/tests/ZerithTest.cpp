@@ -5,7 +5,6 @@
 #include <regex>
 
 #include "client/tests/TestDaemon.h"
-#include "ipc/Frame.h"
 #include "platform/Defaults.h"
 
 namespace zerith::test {
@@ -28,7 +27,8 @@ struct ZerithFixture : DaemonFixture {
   }
 };
 
-TEST_F(ZerithFixture, BlockingCallsReturnTheCompletionsArgumentsExceptInsideACallback) {
+// What the blocking calls return is checked by zerith's tests, whose steps print it.
+TEST_F(ZerithFixture, BlockingCallsReturnOnceTheDaemonTookThemAndFailInsideACallback) {
   auto z = open();
   const Value info(Dictionary{{kZerithSessionInfoSessionID, 5}, {kZerithSessionInfoClientType, 7}});
   const auto set = z->setSessionInfo(info, Value(), Value(), false, 5s);
@@ -37,15 +37,6 @@ TEST_F(ZerithFixture, BlockingCallsReturnTheCompletionsArgumentsExceptInsideACal
   auto client = daemon->waitForClient();
   ASSERT_EQ(client.session->log.size(), 1u);
 
-  const auto started = z->startConfig(5s);
-  ASSERT_TRUE(started);
-  EXPECT_EQ(started["backends"], client.session->backends);
-  EXPECT_EQ(z->fetchDisplayURL(5s)["url"], Value("https://display.example/session"));
-  const auto sent = z->sendMessage(Value(Dictionary{{"category", 1}, {"type", 2}}), 5s);
-  EXPECT_EQ(sent["result"], Value("sent"));
-  const auto upload = z->uploadLogData(Value(Array{}), 5s);
-  EXPECT_EQ(upload["success"], Value(false));
-  EXPECT_EQ(upload["error"], (Error{kZerithErrorDomain, -1, "no upload backend"}.toValue()));
   // Inside a callback of the same session a blocking call fails instead of deadlocking.
   ipc::test::Answer<ZerithReply> inner;
   z->fetchDisplayURL([&](Value) { inner.set(z->startConfig(5s)); });
@@ -56,13 +47,11 @@ TEST_F(ZerithFixture, BlockingCallsReturnTheCompletionsArgumentsExceptInsideACal
   EXPECT_EQ(client.session->log.calls().back().operation, "finishSession");
 }
 
-TEST_F(ZerithFixture, ABlockingCallTimesOutWithAClearError) {
+// The error of the time-out itself is checked by zerith's AStepThatTimesOutStopsTheScript.
+TEST_F(ZerithFixture, TheLateAnswerToABlockingCallThatTimedOutGoesNowhereAndTheSessionGoesOn) {
   daemon->prepare = [](ipc::test::RecordingSession& s) { s.answer = false; };
   auto z = open();
-  const auto reply = z->fetchDisplayURL(50ms);
-  ASSERT_TRUE(reply.error);
-  EXPECT_EQ(*reply.error, (Error{kZerithErrorDomain, -1, "No answer to fetchDisplayURL: within 50 ms"}));
-  // The session's late answer goes nowhere and the session goes on.
+  EXPECT_TRUE(z->fetchDisplayURL(50ms).error);
   auto client = daemon->waitForClient();
   for (auto& late : client.session->takeHeld()) {
     late();
@@ -118,20 +107,6 @@ TEST_F(ZerithFixture, ClientGoingAwayMidCallEndsItsDaemonSideAndNoHandlerRunsAft
     late();  // answering a client that left
   }
   EXPECT_EQ(invalidated.count(), 0);
-}
-
-// The listener closes a connection its delegate refuses; the client's
-// pending call fails and its handler runs.
-TEST_F(ZerithFixture, ARefusedClientLearnsOnItsFirstCall) {
-  grantEntitlement(root, "<false/>");
-  auto z = open();
-  Counter invalidated;
-  z->setInvalidationHandler([&] { invalidated.hit(); });
-  const auto reply = z->startConfig(5s);
-  ASSERT_TRUE(reply.error);
-  EXPECT_EQ(reply.error->description, "The connection was invalidated");
-  EXPECT_TRUE(invalidated.waitFor(1));
-  EXPECT_TRUE(daemon->clients().empty());
 }
 
 TEST(ZerithPersistentIdentifier, StableUpperCaseUuidsOnePerAnswerKeptInDefaultsReplacingWhatIsNotAString) {

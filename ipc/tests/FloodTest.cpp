@@ -28,11 +28,13 @@ Data paddedCall(std::uint64_t n, std::size_t pad) {
   return encodeCall("echo", n, Dictionary{{"n", static_cast<long long>(n)}, {"pad", Value(Data(pad, 0x61))}});
 }
 
-// Sets the limits for one test and puts the defaults back afterwards.
+// Sets the limits for one test, puts the defaults back afterwards and captures the log.
 class Flood : public ::testing::Test {
  protected:
   void SetUp() override { ASSERT_EQ(queuedBytesOfAllConnections(), 0u) << "an earlier test left bytes queued"; }
   void TearDown() override { setQueueLimits(QueueLimits{}); }
+
+  log::LogCapture capture;
 };
 
 // Writes calls into the peer's socket without reading, until the connection
@@ -79,7 +81,6 @@ int floodUntilHeldBack(RawPeer& peer, std::size_t pad, int maxCalls) {
 TEST_F(Flood, APeerThatDoesNotReadIsThrottledAndServedInFullOnceItReads) {
   setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = 64u << 20,
                   .allConnections = 1u << 30});
-  log::LogCapture capture;
   RawPeer flooder;
   constexpr std::size_t kPad = 2000;
   constexpr int kMax = 50000;  // 100 MB of calls: far beyond what a throttled connection takes
@@ -112,7 +113,6 @@ TEST_F(Flood, SeveralFloodersStayUnderTheLimitForAllTheSlowestIsClosedFirstAndOt
   constexpr std::size_t kLimit = 640u << 10;
   setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = 64u << 20,
                   .allConnections = kLimit});
-  log::LogCapture capture;
   RawPeer normal;
   std::vector<std::unique_ptr<RawPeer>> flooders;
   constexpr std::size_t kPad = 1000;
@@ -156,7 +156,6 @@ TEST_F(Flood, CallsLeftUnansweredHoldBackFurtherCallsUntilHalfAreAnswered) {
   // peer reads everything, so only the unanswered calls can hold it back.
   setQueueLimits({.pauseReadingAt = 1u << 20, .resumeReadingAt = 256u << 10, .perConnection = 64u << 20,
                   .allConnections = 1u << 30, .callsInFlight = 64});
-  log::LogCapture capture;
   RawPeer peer;
   std::mutex held;
   std::vector<std::shared_ptr<Reply>> unanswered;
@@ -213,7 +212,6 @@ TEST_F(Flood, MessagesTheDaemonSendsToAPeerThatNeverReadsCloseItAtTheConnectionL
   constexpr std::size_t kPerConnection = 2u << 20;
   setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = kPerConnection,
                   .allConnections = 1u << 30});
-  log::LogCapture capture;
   RawPeer peer;
   RawPeer bystander;
   // Sends from the daemon's end never wait for the peer, past the mark or not.

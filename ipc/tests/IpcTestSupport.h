@@ -5,7 +5,6 @@
 // fail a test instead of hanging it.
 
 #include <gtest/gtest.h>
-#include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>

@@ -136,15 +136,12 @@ class RawFrameSocket {
       }
     }
   }
-  // The next message as a property list.
-  std::optional<Value> read(std::chrono::milliseconds timeout = std::chrono::seconds(10)) {
-    const auto body = readFrame(timeout);
-    return body ? plist::decodeBinary(*body) : std::nullopt;
-  }
-  // The reply to call `number` (other messages are skipped).
+  // The reply to call `number` as a property list (other messages are
+  // skipped).
   std::optional<Value> replyTo(std::uint64_t number, std::chrono::milliseconds timeout = std::chrono::seconds(10)) {
     for (;;) {
-      auto m = read(timeout);
+      const auto body = readFrame(timeout);
+      auto m = body ? plist::decodeBinary(*body) : std::nullopt;
       if (!m || (*m)["reply"].unsignedValue() == number) {
         return m;
       }
