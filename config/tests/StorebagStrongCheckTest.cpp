@@ -7,7 +7,6 @@
 #include "config/StorebagIssueTimes.h"
 #include "config/StorebagVerify.h"
 #include "config/tests/StorebagTestFixture.h"
-#include "platform/Crypto.h"
 
 namespace zerith {
 namespace {

@@ -52,6 +52,14 @@ class StorebagCacheTest : public ::testing::Test {
 
   void advance(double seconds) { now_.secondsSince1970 += seconds; }
   Value entry(const std::string& name) const { return cache_.entries().get(name); }
+  // An entry as a fetch at the current time records it.
+  Value recorded(const Value& storebag, const char* version, const char* state, std::int32_t maxAge) const {
+    return Value(Dictionary{{"StorebagData", storebag},
+                            {"StorebagVersion", Value(version)},
+                            {"StorebagFetchTime", Value(now_)},
+                            {"StorebagFetchState", Value(state)},
+                            {"StorebagMaxAge", Value(maxAge)}});
+  }
 
   log::LogCapture logs_;
   Date now_{1700000000};  // 2023-11-14 22:13:20 UTC
@@ -79,7 +87,7 @@ TEST_F(StorebagCacheTest, FailedFetchIsNotRetriedWithin900Seconds) {
   advance(1);  // 900 seconds: the wait is over
   EXPECT_EQ(cache_.storebagForClientType(5, 3), section("second"));
   EXPECT_EQ(fetchedTypes_.size(), 2u);
-  EXPECT_EQ(*entry("ambrel")["StorebagFetchState"].string(), "Fetch Successful");
+  EXPECT_EQ(entry("ambrel"), recorded(section("second"), "2.0", "Fetch Successful", 600));
 }
 
 // (That the failure line ends with the fetch's cause is the end-to-end start test's.)
@@ -120,8 +128,7 @@ TEST_F(StorebagCacheTest, FailureAfterSuccessKeepsServingTheOlderStorebag) {
   advance(61);
   EXPECT_EQ(cache_.storebagForClientType(5, 2), section("old"));  // refetched, failed, old data kept
   EXPECT_EQ(fetchedTypes_.size(), 2u);
-  EXPECT_EQ(*entry("ambrel")["StorebagFetchState"].string(), "Fetch Failure");
-  EXPECT_EQ(*cache_.storebagVersionForClientType(5).string(), "1.0");
+  EXPECT_EQ(entry("ambrel"), recorded(section("old"), "1.0", "Fetch Failure", 0));
 
   advance(100);  // within the wait after the failure
   EXPECT_EQ(cache_.storebagForClientType(5, 3), section("old"));
@@ -160,11 +167,7 @@ TEST_F(StorebagCacheTest, UnchangedStorebagKeepsOlderDataAndCountsAsSuccess) {
   advance(20);
   EXPECT_EQ(cache_.storebagForClientType(5, 2), section("a"));
   EXPECT_FALSE(logs_.contains("Unable to fetch storebag"));
-  const Value e = entry("ambrel");
-  EXPECT_EQ(*e["StorebagFetchState"].string(), "Fetch Successful");
-  EXPECT_EQ(e["StorebagFetchTime"].date(), now_);
-  EXPECT_EQ(e["StorebagMaxAge"].intValue(), 300);
-  EXPECT_EQ(*e["StorebagVersion"].string(), "1.0");
+  EXPECT_EQ(entry("ambrel"), recorded(section("a"), "1.0", "Fetch Successful", 300));
 
   advance(299);  // the unchanged answer's max age holds
   EXPECT_EQ(cache_.storebagForClientType(5, 3), section("a"));
@@ -215,11 +218,7 @@ TEST_F(StorebagCacheTest, FetchLogsItsStepsRecordsTheEntryAndGrowsTheEstimatedSi
   EXPECT_TRUE(logs_.has(Level::Debug, "storebagForSession: Retrieving storebag for session 4000000000 with client type 8"));
   EXPECT_TRUE(logs_.has(Level::Debug, "fetchAndCacheStorebag: Fetching storebag for client type 8"));
   EXPECT_TRUE(logs_.has(Level::Debug, "fetchAndCacheStorebag: Storebag max age: 1234 seconds"));
-  const Value e = entry("elquin");
-  EXPECT_EQ(e["StorebagData"], section("a"));
-  EXPECT_EQ(*e["StorebagVersion"].string(), "3.1");
-  EXPECT_EQ(e["StorebagFetchTime"].date(), now_);
-  EXPECT_EQ(e["StorebagMaxAge"].intValue(), 1234);
+  EXPECT_EQ(entry("elquin"), recorded(section("a"), "3.1", "Fetch Successful", 1234));
 
   const std::size_t one = cache_.estimatedSize();
   cache_.storebagForClientType(5, 1);

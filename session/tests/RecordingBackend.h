@@ -19,6 +19,7 @@
 #include <condition_variable>
 #include <memory>
 #include <mutex>
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -34,6 +35,13 @@ class RecordingBackend final : public ZerithBackend {
     std::uint16_t respCode = 0;
     std::uint16_t eventID = 0;
     std::int32_t flag = 0;
+
+    bool operator==(const Event&) const = default;
+    // Readable events in test failures.
+    friend void PrintTo(const Event& e, std::ostream* os) {
+      *os << "{" << e.message.description() << ", method " << e.method << ", respCode " << e.respCode << ", event "
+          << e.eventID << ", flag " << e.flag << "}";
+    }
   };
 
   RecordingBackend(std::string name, Value profile, std::optional<std::string> productFamily)

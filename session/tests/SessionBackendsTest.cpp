@@ -97,19 +97,16 @@ TEST_F(SessionBackendsTest, EveryBackendGetsClientDataSharedDataTheNumbersAndThe
   for (const char* name : {"recA", "recB"}) {
     const auto events = rec(c, name)->events();
     ASSERT_EQ(events.size(), 2u) << name;  // the start message, then this one
-    const auto& e = events[1];
-    EXPECT_EQ(e.message, Value(Dictionary{{"SharedData", Value(Dictionary{{"room", Value("blue")}})},
-                                          {"ClientData", payload}}));
-    EXPECT_EQ(e.method, 3u);
-    EXPECT_EQ(e.respCode, 70004u & 0xffffu);
-    EXPECT_EQ(e.flag, 9);  // read as 32 bits
-    EXPECT_EQ(e.eventID, 2u);  // numbered per backend; the start message was 1
+    // The type narrowed to 16 bits, the flag read as 32; events numbered
+    // per backend, the start message was 1.
+    const Value message(
+        Dictionary{{"SharedData", Value(Dictionary{{"room", Value("blue")}})}, {"ClientData", payload}});
+    EXPECT_EQ(events[1], (RecordingBackend::Event{message, 3, 70004 & 0xffff, 2, 9}));
   }
   // Without a payload and without shared data the dictionary is empty.
   auto standalone = started(sessionInfo(6));
   send(standalone, event(4, 1));
-  EXPECT_EQ(rec(standalone, "recA")->events()[1].message, Value(Dictionary{}));
-  EXPECT_EQ(rec(standalone, "recA")->events()[1].flag, 0);
+  EXPECT_EQ(rec(standalone, "recA")->events()[1], (RecordingBackend::Event{Value(Dictionary{}), 4, 1, 2, 0}));
 }
 
 TEST_F(SessionBackendsTest, LastHttpsResultWinsAndTheDashboardsShowsOnlyWithoutOne) {
@@ -492,9 +489,8 @@ TEST_F(SessionBackendsTest, OneShotHandsThePayloadItselfToAThrowAwaySet) {
   ASSERT_EQ(made.size(), 1u);
   const auto events = made[0]->events();
   ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].message, payload);  // no ClientData wrapping on a customer build
-  EXPECT_EQ(events[0].method, 4u);
-  EXPECT_EQ(events[0].flag, 0);
+  // No ClientData wrapping on a customer build.
+  EXPECT_EQ(events[0], (RecordingBackend::Event{payload, 4, 2, 1, 0}));
   EXPECT_EQ(made[0]->cleanups(), 1);
   EXPECT_EQ(made[0]->state(), kBackendStateEnabled);
   EXPECT_NE(made[0]->reportingSessionConnectivityDelegate(), nullptr);
