@@ -117,9 +117,10 @@ class E2eTest : public ::testing::Test {
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value("https://127.0.0.1:1/zerith"));
   }
 
-  // The test's own user may (or may not) report, and read the daemon's
-  // status when `status` is set.
-  void grant(const Value& entitlement, bool status = false) {
+  // The `users` (by default the test's own) may (or may not) report, and
+  // read the daemon's status when `status` is set.
+  void grant(const Value& entitlement, bool status = false,
+             Array users = {Value(static_cast<unsigned long long>(::getuid()))}) {
     Dictionary entitlements;
     if (!entitlement.isNil()) {
       entitlements.set("com.velmar.private.zerithd", entitlement);
@@ -127,8 +128,8 @@ class E2eTest : public ::testing::Test {
     if (status) {
       entitlements.set(ipc::kDaemonStatusEntitlement, true);
     }
-    const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
-                                  {"entitlements", Value(std::move(entitlements))}});
+    const Value policy(
+        Dictionary{{"users", Value(std::move(users))}, {"entitlements", Value(std::move(entitlements))}});
     root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
   }
 

@@ -82,13 +82,6 @@ std::optional<RawFrameSocket> connectAs(uid_t uid) {
 
 class PeerBoundsTest : public E2eTest {
  protected:
-  // The test's own user and "nobody" may report.
-  void grantRootAndNobody() {
-    const Value policy(Dictionary{{"users", Array{Value(0ull), Value(65534ull)}},
-                                  {"entitlements", Dictionary{{"com.velmar.private.zerithd", true}}}});
-    root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
-  }
-
   // A client answered within a second and a half.
   static bool answered(RawFrameSocket& client, std::uint64_t number = 1) {
     return client.call("fetchDisplayURL:", number) && client.replyTo(number, 1500ms).has_value();
@@ -247,7 +240,7 @@ TEST_F(PeerBoundsTest, UnderTheUnitsDescriptorLimitOneUserCannotLockOthersOut) {
   ASSERT_TRUE(std::regex_search(text, m, std::regex("\nLimitNOFILE=([0-9]+)\n")));
   DescriptorLimit limit(std::stoul(m[1]));
   ASSERT_EQ(limit.granted(), std::stoul(m[1]));
-  grantRootAndNobody();
+  grant(Value(true), false, {Value(0ull), Value(65534ull)});  // root and "nobody" may report
   startQuietDaemon();
   const auto limits = ipc::ConnectionLimits::forDescriptorLimit(limit.granted());
   ASSERT_TRUE(daemon->waitFor(fmt::format("at most {} client connections, {} per user", limits.total, limits.perUid)));
