@@ -22,7 +22,6 @@
 
 #include "config/StorebagSigner.h"
 #include "ipc/DaemonStatus.h"
-#include "ipc/Frame.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
@@ -71,13 +70,12 @@ class Received {
     unsigned category;
     unsigned type;
     Value payload;
-    double timestamp;
   };
   void attach(Zerith& client) {
     client.setMessageHandler(
-        [this](const Value& info, double timestamp, std::uint16_t category, std::uint16_t type, const Value& payload) {
+        [this](const Value& info, double, std::uint16_t category, std::uint16_t type, const Value& payload) {
           std::lock_guard lock(mutex_);
-          messages_.push_back({info, category, type, payload, timestamp});
+          messages_.push_back({info, category, type, payload});
           changed_.notify_all();
         });
   }

@@ -9,10 +9,8 @@
 #include <filesystem>
 #include <fstream>
 #include <sstream>
-#include <thread>
 
 #include "ipc/ClientSessionWire.h"
-#include "platform/Json.h"
 #include "tests/e2e/E2eFixture.h"
 
 namespace zerith::test {
