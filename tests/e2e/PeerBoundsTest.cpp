@@ -142,10 +142,8 @@ TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
   // 200 MiB together, past the 128 MiB the daemon holds for all clients.
   constexpr std::size_t kClients = 200;
   constexpr std::size_t kSent = 1u << 20;
-  const std::uint32_t length = (4u << 20) - 8;
-  Data start{static_cast<std::uint8_t>(length >> 24), static_cast<std::uint8_t>(length >> 16),
-             static_cast<std::uint8_t>(length >> 8), static_cast<std::uint8_t>(length)};
-  start.resize(kSent, 0);
+  Data start = frameWithBody(Data((4u << 20) - 8, 0));
+  start.resize(kSent);
   std::vector<RawFrameSocket> clients;
   std::size_t cut = 0;
   for (std::size_t i = 0; i < kClients; ++i) {
