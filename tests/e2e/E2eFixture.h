@@ -22,7 +22,6 @@
 
 #include "config/StorebagSigner.h"
 #include "ipc/DaemonStatus.h"
-#include "ipc/Frame.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
@@ -71,13 +70,12 @@ class Received {
     unsigned category;
     unsigned type;
     Value payload;
-    double timestamp;
   };
   void attach(Zerith& client) {
     client.setMessageHandler(
-        [this](const Value& info, double timestamp, std::uint16_t category, std::uint16_t type, const Value& payload) {
+        [this](const Value& info, double, std::uint16_t category, std::uint16_t type, const Value& payload) {
           std::lock_guard lock(mutex_);
-          messages_.push_back({info, category, type, payload, timestamp});
+          messages_.push_back({info, category, type, payload});
           changed_.notify_all();
         });
   }
@@ -117,9 +115,10 @@ class E2eTest : public ::testing::Test {
     Defaults("com.velmar.zerith").setObject("zerith_storebag_url", Value("https://127.0.0.1:1/zerith"));
   }
 
-  // The test's own user may (or may not) report, and read the daemon's
-  // status when `status` is set.
-  void grant(const Value& entitlement, bool status = false) {
+  // The `users` (by default the test's own) may (or may not) report, and
+  // read the daemon's status when `status` is set.
+  void grant(const Value& entitlement, bool status = false,
+             Array users = {Value(static_cast<unsigned long long>(::getuid()))}) {
     Dictionary entitlements;
     if (!entitlement.isNil()) {
       entitlements.set("com.velmar.private.zerithd", entitlement);
@@ -127,8 +126,8 @@ class E2eTest : public ::testing::Test {
     if (status) {
       entitlements.set(ipc::kDaemonStatusEntitlement, true);
     }
-    const Value policy(Dictionary{{"users", Value(Array{Value(static_cast<unsigned long long>(::getuid()))})},
-                                  {"entitlements", Value(std::move(entitlements))}});
+    const Value policy(
+        Dictionary{{"users", Value(std::move(users))}, {"entitlements", Value(std::move(entitlements))}});
     root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
   }
 

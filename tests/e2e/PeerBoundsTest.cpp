@@ -82,13 +82,6 @@ std::optional<RawFrameSocket> connectAs(uid_t uid) {
 
 class PeerBoundsTest : public E2eTest {
  protected:
-  // The test's own user and "nobody" may report.
-  void grantRootAndNobody() {
-    const Value policy(Dictionary{{"users", Array{Value(0ull), Value(65534ull)}},
-                                  {"entitlements", Dictionary{{"com.velmar.private.zerithd", true}}}});
-    root.write("/etc/zerithd/entitlements.d/test.plist", plist::encodeXml(policy));
-  }
-
   // A client answered within a second and a half.
   static bool answered(RawFrameSocket& client, std::uint64_t number = 1) {
     return client.call("fetchDisplayURL:", number) && client.replyTo(number, 1500ms).has_value();
@@ -149,10 +142,8 @@ TEST_F(PeerBoundsTest, UnfinishedFramesOfManyClientsStayUnderTheMemoryCap) {
   // 200 MiB together, past the 128 MiB the daemon holds for all clients.
   constexpr std::size_t kClients = 200;
   constexpr std::size_t kSent = 1u << 20;
-  const std::uint32_t length = (4u << 20) - 8;
-  Data start{static_cast<std::uint8_t>(length >> 24), static_cast<std::uint8_t>(length >> 16),
-             static_cast<std::uint8_t>(length >> 8), static_cast<std::uint8_t>(length)};
-  start.resize(kSent, 0);
+  Data start = frameWithBody(Data((4u << 20) - 8, 0));
+  start.resize(kSent);
   std::vector<RawFrameSocket> clients;
   std::size_t cut = 0;
   for (std::size_t i = 0; i < kClients; ++i) {
@@ -247,7 +238,7 @@ TEST_F(PeerBoundsTest, UnderTheUnitsDescriptorLimitOneUserCannotLockOthersOut) {
   ASSERT_TRUE(std::regex_search(text, m, std::regex("\nLimitNOFILE=([0-9]+)\n")));
   DescriptorLimit limit(std::stoul(m[1]));
   ASSERT_EQ(limit.granted(), std::stoul(m[1]));
-  grantRootAndNobody();
+  grant(Value(true), false, {Value(0ull), Value(65534ull)});  // root and "nobody" may report
   startQuietDaemon();
   const auto limits = ipc::ConnectionLimits::forDescriptorLimit(limit.granted());
   ASSERT_TRUE(daemon->waitFor(fmt::format("at most {} client connections, {} per user", limits.total, limits.perUid)));

@@ -9,10 +9,8 @@
 #include <filesystem>
 #include <fstream>
 #include <sstream>
-#include <thread>
 
 #include "ipc/ClientSessionWire.h"
-#include "platform/Json.h"
 #include "tests/e2e/E2eFixture.h"
 
 namespace zerith::test {
@@ -136,15 +134,16 @@ class SessionsTogetherTest : public E2eTest {
     EXPECT_EQ(started["backends"], Value(Array{Value("kovu"), Value("pellamlog")})) << daemon->output();
   }
 
-  // The events of one kind that the adaptor backend handed on, in order.
-  // The adaptor writes while the session dispatches, before the reply (or
-  // the daemon's log line) that the test waited for, so one read sees them.
-  std::vector<nlohmann::json> adaptorLinesOf(unsigned method, unsigned respCode) const {
-    std::vector<nlohmann::json> found;
+  // The payloads ("dict") of the events of one kind that the adaptor backend
+  // handed on, in order, as one array. The adaptor writes while the session
+  // dispatches, before the reply (or the daemon's log line) that the test
+  // waited for, so one read sees them.
+  nlohmann::json adaptorDictsOf(unsigned method, unsigned respCode) const {
+    nlohmann::json found = nlohmann::json::array();
     std::ifstream in(adaptorOutput);
     for (std::string line; std::getline(in, line);) {
       if (auto l = nlohmann::json::parse(line); l["method"] == method && l["respCode"] == respCode) {
-        found.push_back(std::move(l));
+        found.push_back(std::move(l["dict"]));
       }
     }
     return found;
@@ -179,9 +178,7 @@ TEST_F(SessionsTogetherTest, ThreeLevelsShareStatesDataAndTheRootsAggregator) {
   const auto sent = grandchild->sendMessage(event(20, 3, Value(Dictionary{{"x", Value(1)}})), 10s);
   ASSERT_TRUE(sent);
   EXPECT_TRUE(sent["result"].isNil());  // neither backend returns a result
-  const auto lines = adaptorLinesOf(20, 3);
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0]["dict"], nlohmann::json::parse(R"({"SharedData":{"room":"blue"},"ClientData":{"x":1}})"));
+  EXPECT_EQ(adaptorDictsOf(20, 3), nlohmann::json::parse(R"([{"SharedData":{"room":"blue"},"ClientData":{"x":1}}])"));
 
   const auto aggregated = atRoot.waitFor([](const auto& m) { return m.category == 20 && !m.sessionInfo.isNil(); });
   ASSERT_TRUE(aggregated.has_value());
@@ -194,7 +191,7 @@ TEST_F(SessionsTogetherTest, ThreeLevelsShareStatesDataAndTheRootsAggregator) {
     EXPECT_NE(m.category, 20u);  // only the end-of-aggregation message
   }
   // Every session's start message went through the adaptor.
-  EXPECT_EQ(adaptorLinesOf(0, 0).size(), 3u);
+  EXPECT_EQ(adaptorDictsOf(0, 0).size(), 3u);
 }
 
 TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWorking) {
@@ -230,8 +227,8 @@ TEST_F(SessionsTogetherTest, BadEventsAndVanishingClientsLeaveTheOtherSessionsWo
   for (unsigned k = 0; k < 5; ++k) {
     ASSERT_TRUE(child->sendMessage(event(71, k), 10s));
   }
-  EXPECT_EQ(adaptorLinesOf(71, 4).size(), 1u);
-  EXPECT_EQ(adaptorLinesOf(70, 1).size(), 0u);
+  EXPECT_EQ(adaptorDictsOf(71, 4).size(), 1u);
+  EXPECT_EQ(adaptorDictsOf(70, 1).size(), 0u);
   ASSERT_TRUE(child->flushMessages(10s));
 }
 
@@ -275,10 +272,9 @@ TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
     aggregated |= l.value("session", "") == "call" && l.value("event", "") == "message" && l["category"] == 90;
   }
   EXPECT_TRUE(aggregated) << run.out;
-  ASSERT_EQ(adaptorLinesOf(90, 1).size(), 1u);
-  EXPECT_EQ(adaptorLinesOf(90, 1)[0]["dict"],
-            nlohmann::json::parse(R"({"SharedData":{"room":"green"},"ClientData":{"jitter":4}})"));
-  EXPECT_EQ(adaptorLinesOf(91, 1)[0]["dict"], nlohmann::json::parse(R"({"once":1})"));
+  EXPECT_EQ(adaptorDictsOf(90, 1),
+            nlohmann::json::parse(R"([{"SharedData":{"room":"green"},"ClientData":{"jitter":4}}])"));
+  EXPECT_EQ(adaptorDictsOf(91, 1), nlohmann::json::parse(R"([{"once":1}])"));
 
   // A line that cannot run ends the script with status 2 and says which.
   root.write("/var/tmp/bad.jsonl", "{\"session\":\"x\",\"step\":\"send\",\"category\":1,\"type\":1}\n");

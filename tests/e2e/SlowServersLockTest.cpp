@@ -7,7 +7,6 @@
 #include <chrono>
 #include <future>
 #include <memory>
-#include <thread>
 #include <vector>
 
 #include "tests/e2e/E2eFixture.h"

@@ -161,12 +161,25 @@ class SpoolTest : public E2eTest {
   // What the collector took of events [first, last]: record IDs by event
   // number, once all arrived or `timeout` passed.
   std::map<int, std::set<std::string>> taken(int first, int last, std::chrono::seconds timeout = 30s) {
-    std::set<int> wanted;
-    for (int n = first; n <= last; ++n) {
-      wanted.insert(n);
-    }
-    reader->waitFor(wanted, timeout);
+    reader->waitFor(numbers(first, last), timeout);
     return reader->idsByNumber();
+  }
+  static std::set<int> numbers(int first, int last) {
+    std::set<int> all;
+    for (int n = first; n <= last; ++n) {
+      all.insert(n);
+    }
+    return all;
+  }
+
+  // Every event of `wanted` arrived under one record ID of 32 characters: its
+  // batch was formed once, and its repeats were dropped.
+  void expectEachOnce(const std::map<int, std::set<std::string>>& ids, const std::set<int>& wanted) const {
+    for (const int n : wanted) {
+      ASSERT_EQ(ids.count(n), 1u) << "event " << n << " lost\n" << daemon->output();
+      EXPECT_EQ(ids.at(n).size(), 1u) << "event " << n;
+      EXPECT_EQ(ids.at(n).begin()->size(), 32u) << *ids.at(n).begin();
+    }
   }
 
   fs::path spoolFolder() const { return root.path() / "var/lib/zerithd/spool"; }
@@ -191,13 +204,7 @@ TEST_F(SpoolTest, EventsSentWhileTheCollectorClosesStallsAndFailsArriveOnceAfter
   EXPECT_TRUE(daemon->waitFor("postJSONMessage: backend httpsPost disabled by server 503 return code"));
 
   behave("answer");
-  const auto ids15 = taken(1, 15);
-  for (int n = 1; n <= 15; ++n) {
-    ASSERT_EQ(ids15.count(n), 1u) << "event " << n << " never arrived\n" << daemon->output();
-    const auto& ids = ids15.at(n);
-    EXPECT_EQ(ids.size(), 1u) << "event " << n;
-    EXPECT_EQ(ids.begin()->size(), 32u) << *ids.begin();
-  }
+  expectEachOnce(taken(1, 15), numbers(1, 15));
   ASSERT_TRUE(daemon->waitFor("Spool: empty")) << daemon->output();
   EXPECT_EQ(daemon->count("Spool: delivered batch"), 3u);
   client->finishSession(10s);
@@ -244,20 +251,13 @@ TEST_F(SpoolTest, SpooledBatchesSurviveAKillAndBadFilesAreMovedAside) {
   ASSERT_TRUE(daemon->waitFor("Spool: empty", 1, 20s)) << daemon->output();
 
   const auto ids = taken(1, 10);
-  for (int n = 1; n <= 10; ++n) {
-    ASSERT_EQ(ids.count(n), 1u) << "event " << n << " lost\n" << daemon->output();
-    EXPECT_EQ(ids.at(n).size(), 1u) << "event " << n;
-  }
+  expectEachOnce(ids, numbers(1, 10));
   // The batch the kill may have cut arrives whole or not at all. Its records
   // are read a line each, so once one is in, the rest are waited for.
   const auto third = [](const std::map<int, std::set<std::string>>& got) {
-    std::size_t count = 0;
-    for (int n = 11; n <= 15; ++n) {
-      count += got.count(n);
-    }
-    return count;
+    return std::ranges::count_if(numbers(11, 15), [&](int n) { return got.contains(n); });
   };
-  const std::size_t arrived = third(ids) == 0 ? 0 : third(taken(11, 15, 10s));
+  const auto arrived = third(ids) == 0 ? 0 : third(taken(11, 15, 10s));
   EXPECT_TRUE(arrived == 0 || arrived == 5) << arrived;
 
   // Each moved aside with its cause (the names under bad/ are the store's
@@ -415,12 +415,7 @@ TEST_F(SpoolTest, AKillAtRandomMomentsLosesNoAnsweredEventAndDeliversEachOnce) {
   startDaemon(trusting(collectorCA()));
   ASSERT_FALSE(answered.empty());
   EXPECT_TRUE(reader->waitFor(answered, 60s)) << daemon->output();
-  const auto ids = reader->idsByNumber();
-  for (const int n : answered) {
-    ASSERT_EQ(ids.count(n), 1u) << "event " << n << " lost\n" << daemon->output();
-    // One record ID: the batch was formed once, and its repeats were dropped.
-    EXPECT_EQ(ids.at(n).size(), 1u) << "event " << n;
-  }
+  expectEachOnce(reader->idsByNumber(), answered);
   std::cout << "[ figures ] " << answered.size() << " answered events over " << kRounds << " kills, all delivered\n";
 }
 
@@ -438,11 +433,8 @@ TEST_F(SpoolTest, ConcurrentWritesAndReadsNeverMoveAGoodFile) {
   ASSERT_TRUE(URLSession::setExtraCAFile(collectorCA().string()));
   // Its lines are read all along, so that its output never fills.
   reader = std::make_unique<CollectorReader>(*collector);
-  SpoolConfig config;
-  config.enabled = true;
-  config.retryInitialSeconds = 0.02;
-  config.retryMaxSeconds = 0.1;
-  config.commitIntervalSeconds = 0.005;
+  const SpoolConfig config{
+      .enabled = true, .retryInitialSeconds = 0.02, .retryMaxSeconds = 0.1, .commitIntervalSeconds = 0.005};
   auto spool = Spool::create(
       root.path() / "spool", config,
       ReportingSessionConnectivityHelper::initWithDelegate(std::weak_ptr<ConnectivityHelperDelegate>(),

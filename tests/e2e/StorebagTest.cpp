@@ -11,7 +11,6 @@
 
 #include "config/StorebagIssueTimes.h"
 #include "config/StorebagSigner.h"
-#include "config/StorebagVerify.h"
 #include "tests/e2e/E2eFixture.h"
 
 namespace zerith::test {

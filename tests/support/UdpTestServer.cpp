@@ -67,7 +67,6 @@ void UdpTestServer::run() {
         decision = policy_(d.bytes, arrivals_.size());
       }
     }
-    d.dropped = decision.drop;
     if (!decision.drop && decision.acknowledge) {
       const std::size_t ackLength = std::min<std::size_t>(d.bytes.size(), 64);
       ::sendto(fd_, d.bytes.data(), ackLength, 0, reinterpret_cast<sockaddr*>(&from), fromLength);

@@ -21,7 +21,6 @@ namespace zerith::test {
 
 struct UdpDatagram {
   std::vector<std::uint8_t> bytes;
-  bool dropped = false;       // lost before delivery
   bool acknowledged = false;  // an acknowledgement was sent for it
 };
 
