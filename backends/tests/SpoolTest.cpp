@@ -117,8 +117,6 @@ TEST(SpoolConfigTest, BadValuesFallBackToTheDefaults) {
                                                                         {"spoolRetryMaxSeconds", 0.25}}));
   // A ceiling below the first wait is raised to it.
   EXPECT_EQ(fields(good), std::tuple(true, 100000u, 60, 0.5, 0.5));
-  EXPECT_TRUE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", true}})).enabled);
-  EXPECT_FALSE(SpoolConfig::fromDictionary(Value(Dictionary{{"spoolEnabled", 2}})).enabled);
 }
 
 // ---------------------------------------------------------------------------
