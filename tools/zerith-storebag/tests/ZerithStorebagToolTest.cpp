@@ -7,7 +7,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 #include "config/StorebagIssueTimes.h"
 #include "platform/Crypto.h"

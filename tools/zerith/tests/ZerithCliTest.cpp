@@ -6,32 +6,14 @@
 #include <fstream>
 #include <gtest/gtest.h>
 
-#include <sstream>
-
 #include "client/tests/TestDaemon.h"
 #include "ipc/EntitlementPolicy.h"
 #include "platform/Json.h"
+#include "tools/zerith/tests/RunCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
 namespace {
-
-struct CliResult {
-  int status;
-  std::string out;
-  std::string err;
-};
-
-CliResult runCli(std::vector<std::string> args) {
-  args.insert(args.begin(), "zerith");
-  std::vector<const char*> argv;
-  for (const auto& a : args) {
-    argv.push_back(a.c_str());
-  }
-  std::ostringstream out, err;
-  const int status = cli::run(static_cast<int>(argv.size()), argv.data(), out, err);
-  return {status, out.str(), err.str()};
-}
 
 struct CliFixture : DaemonFixture {
   std::vector<std::string> session(std::initializer_list<std::string> more) {

@@ -11,7 +11,7 @@
 #include "platform/Json.h"
 #include "platform/Paths.h"
 #include "tests/support/TempRoot.h"
-#include "tools/zerith/ZerithCli.h"
+#include "tools/zerith/tests/RunCli.h"
 
 namespace zerith::test {
 namespace {
@@ -39,19 +39,10 @@ struct SpoolFolder : ::testing::Test {
     return outcome.name;
   }
 
-  static std::pair<int, std::string> runCli(std::vector<std::string> args, std::string* err = nullptr) {
-    std::vector<const char*> argv{"zerith", "--root", nullptr};
-    const std::string rootText = paths::root().string();
-    argv[2] = rootText.c_str();
-    for (const auto& a : args) {
-      argv.push_back(a.c_str());
-    }
-    std::ostringstream out, errors;
-    const int status = cli::run(static_cast<int>(argv.size()), argv.data(), out, errors);
-    if (err) {
-      *err = errors.str();
-    }
-    return {status, out.str()};
+  // `zerith spool` under this test's root.
+  static CliResult spoolCommand(std::vector<std::string> more = {}) {
+    more.insert(more.begin(), {"--root", paths::root().string(), "spool"});
+    return runCli(more);
   }
 };
 
@@ -107,9 +98,9 @@ TEST_F(SpoolFolder, ListsWhatWaitsPerURLAndWhatTheDaemonWouldSetAside) {
 
 TEST_F(SpoolFolder, TheJsonLineCarriesEveryBatchAndTheSettings) {
   const std::string name = spool("https://a.example/post", 2, kNoonMillis);
-  const auto [status, out] = runCli({"spool", "--json"});
-  ASSERT_EQ(status, 0);
-  const auto parsed = nlohmann::json::parse(out);
+  const CliResult r = spoolCommand({"--json"});
+  ASSERT_EQ(r.status, 0);
+  const auto parsed = nlohmann::json::parse(r.out);
   EXPECT_EQ(parsed["enabled"], false);
   EXPECT_EQ(parsed["maxAgeSeconds"], SpoolConfig::kDefaultMaxAgeSeconds);
   EXPECT_EQ(parsed["batches"], nlohmann::json::parse(fmt::format(
@@ -120,22 +111,21 @@ TEST_F(SpoolFolder, TheJsonLineCarriesEveryBatchAndTheSettings) {
 
 TEST_F(SpoolFolder, SpoolingOffOrNoFolderOrAFolderThatCannotBeListed) {
   spool("https://a.example/post", 1, kNoonMillis);
-  auto [status, out] = runCli({"spool"});
-  EXPECT_EQ(status, 0);
-  EXPECT_NE(out.find("spooling is off (spoolEnabled is not true); the batches below stay until it is on again\n"),
+  CliResult r = spoolCommand();
+  EXPECT_EQ(r.status, 0);
+  EXPECT_NE(r.out.find("spooling is off (spoolEnabled is not true); the batches below stay until it is on again\n"),
             std::string::npos)
-      << out;
+      << r.out;
 
   fs::remove_all(paths::spoolDir());
-  std::tie(status, out) = runCli({"spool"});
-  EXPECT_EQ(status, 0);
-  EXPECT_NE(out.find("No batch waits.\n"), std::string::npos) << out;
+  r = spoolCommand();
+  EXPECT_EQ(r.status, 0);
+  EXPECT_NE(r.out.find("No batch waits.\n"), std::string::npos) << r.out;
 
   std::ofstream(paths::spoolDir()) << "a file where the folder should be";
-  std::string err;
-  std::tie(status, out) = runCli({"spool"}, &err);
-  EXPECT_EQ(status, cli::kExitStepFailed);
-  EXPECT_EQ(err, "zerith: spool: cannot list " + paths::spoolDir().string() + ": Not a directory\n");
+  r = spoolCommand();
+  EXPECT_EQ(r.status, cli::kExitStepFailed);
+  EXPECT_EQ(r.err, "zerith: spool: cannot list " + paths::spoolDir().string() + ": Not a directory\n");
 }
 
 }  // namespace
