@@ -256,6 +256,24 @@ Value decodeStorebagBag(const Data& bagBytes, std::string* why) {
   return *bag;
 }
 
+std::vector<std::string> storebagKeyProblems() {
+  std::vector<std::string> problems;
+  const auto keyPath = frameworkPublicKeyPath().string();
+  if (const auto key = frameworkPublicKey(); !key) {
+    problems.push_back(fmt::format("no storebag public key can be read at {}: every storebag is refused", keyPath));
+  } else if (!rsaPublicKeyFromDER(*key)) {
+    problems.push_back(
+        fmt::format("{} is not an RSA public key in DER form: every storebag is refused", keyPath));
+  }
+  const auto strongPath = frameworkStrongPublicKeyPath().string();
+  if (const auto strongKey = frameworkStrongPublicKey(); strongKey && !ed25519PublicKeyFromDER(*strongKey)) {
+    problems.push_back(fmt::format("{} cannot be read or is not an Ed25519 public key in DER form: every storebag is "
+                                   "refused",
+                                   strongPath));
+  }
+  return problems;
+}
+
 std::optional<Data> frameworkPublicKey() { return file::readAll(frameworkPublicKeyPath(), kMaxPublicKeyBytes); }
 
 std::filesystem::path frameworkStrongPublicKeyPath() { return paths::frameworkResourceDir() / "publicKeyEd25519.der"; }

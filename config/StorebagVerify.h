@@ -20,6 +20,7 @@
 #include <optional>
 #include <span>
 #include <string>
+#include <vector>
 
 #include "platform/PropertyList.h"
 #include "platform/Value.h"
@@ -78,6 +79,12 @@ Value decodeStorebagBag(const Data& bagBytes, std::string* why = nullptr);
 // The framework's RSA key ("publicKey.der"), read afresh; nullopt when it cannot be
 // read or is larger than a public key can be.
 std::optional<Data> frameworkPublicKey();
+
+// What is wrong with the installed public keys, one line each: no RSA key,
+// or one that is not an RSA public key in DER form; an Ed25519 key file that
+// cannot be read or holds no Ed25519 key. Each of these refuses every
+// storebag (zerithd --check).
+std::vector<std::string> storebagKeyProblems();
 
 // The framework's Ed25519 key: nullopt when "publicKeyEd25519.der" does not
 // exist (one signature is enough), its bytes otherwise (empty when it cannot

@@ -5,6 +5,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -27,6 +28,8 @@ extern "C" void __gcov_dump(void);
 #endif
 
 #include "backends/Spool.h"
+#include "config/DeviceInfo.h"
+#include "config/StorebagVerify.h"
 #include "daemon/KeepAliveTransaction.h"
 #include "daemon/StorebagCache.h"
 #include "daemon/Watchdog.h"
@@ -35,6 +38,7 @@ extern "C" void __gcov_dump(void);
 #include "ipc/Listener.h"
 #include "platform/DefaultsKeys.h"
 #include "platform/Executors.h"
+#include "platform/FileUtil.h"
 #include "platform/Log.h"
 #include "platform/ThreadPools.h"
 #include "platform/Paths.h"
@@ -219,6 +223,44 @@ int ZerithdDaemon::run() {
   // finishes (and logs its end) before the process goes.
   agent->veskTransactionReference();
   return 0;
+}
+
+int ZerithdDaemon::check(std::ostream& out) const {
+  std::vector<std::string> problems;
+  std::vector<std::string_view> domains;
+  for (const DefaultsSetting& setting : kDefaultsSettings) {
+    if (std::find(domains.begin(), domains.end(), setting.domain) == domains.end()) {
+      domains.push_back(setting.domain);
+      for (std::string& problem : defaultsDomainProblems(setting.domain)) {
+        problems.push_back(std::move(problem));
+      }
+    }
+  }
+  for (std::string& problem : storebagKeyProblems()) {
+    problems.push_back(std::move(problem));
+  }
+  for (const std::string& problem : ipc::EntitlementPolicy().problems()) {
+    problems.push_back("entitlements policy: " + problem);
+  }
+  std::error_code ec;
+  if (std::filesystem::exists(paths::deviceFile(), ec)) {
+    const file::RegularFileRead read = file::readRegularFile(paths::deviceFile(), 256u << 10);
+    std::string why = read.why;
+    if (read.bytes && !device::parseDeviceFile(*read.bytes, &why)) {
+      problems.push_back(fmt::format("the device file {} is not used: {}", paths::deviceFile().string(), why));
+    } else if (!read.bytes) {
+      problems.push_back(fmt::format("the device file {} cannot be read: {}", paths::deviceFile().string(), why));
+    }
+  }
+  if (options_.caFile && !URLSession::setExtraCAFile(options_.caFile->string())) {
+    problems.push_back(fmt::format("no CA certificate can be loaded from {}", options_.caFile->string()));
+  }
+  for (const std::string& problem : problems) {
+    out << "zerithd: " << problem << '\n';
+  }
+  out << (problems.empty() ? std::string("zerithd: no problems\n")
+                           : fmt::format("zerithd: {} problem{}\n", problems.size(), problems.size() == 1 ? "" : "s"));
+  return problems.empty() ? 0 : 1;
 }
 
 void ZerithdDaemon::exitProcess(int status) {

@@ -14,6 +14,7 @@
 #include <filesystem>
 #include <memory>
 #include <optional>
+#include <ostream>
 
 namespace zerith {
 
@@ -41,6 +42,13 @@ class ZerithdDaemon {
 
   // The exit status.
   int run();
+
+  // What the daemon would read when it starts, checked without starting it
+  // (zerithd --check): the defaults domains it reads, the storebag public
+  // keys, the entitlements policy files, the device file and the --ca-file.
+  // One line per problem on `out`, then their count; the exit status is 0
+  // when there is none, 1 otherwise.
+  int check(std::ostream& out) const;
 
   // Ends the process once run() has returned: flushes the log and exits
   // without static destructors, which would race the thread pools and the

@@ -7,6 +7,8 @@
 #include <cerrno>
 #include <limits>
 
+#include <fmt/format.h>
+
 #include "platform/FileUtil.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
@@ -94,7 +96,15 @@ EntitlementPolicy::EntitlementPolicy(std::filesystem::path folder) : folder_(std
 
 std::filesystem::path EntitlementPolicy::folder() const { return folder_ ? *folder_ : paths::entitlementsDir(); }
 
-Dictionary EntitlementPolicy::entitlementsFor(const PeerCredentials& peer) const {
+Dictionary EntitlementPolicy::entitlementsFor(const PeerCredentials& peer) const { return evaluate(&peer, nullptr); }
+
+std::vector<std::string> EntitlementPolicy::problems() const {
+  std::vector<std::string> found;
+  evaluate(nullptr, &found);
+  return found;
+}
+
+Dictionary EntitlementPolicy::evaluate(const PeerCredentials* peerOrNull, std::vector<std::string>* problems) const {
   namespace fs = std::filesystem;
   const fs::path dir = folder();
   Dictionary granted;
@@ -111,15 +121,17 @@ Dictionary EntitlementPolicy::entitlementsFor(const PeerCredentials& peer) const
     }
   }
   if (ec) {
-    log_.error("EntitlementPolicy: cannot read the policy folder {}: {}; nothing is granted", dir.string(),
-               ec.message());
+    const std::string why = fmt::format("cannot read the policy folder {}: {}; nothing is granted", dir.string(),
+                                        ec.message());
+    problems ? problems->push_back(why) : log_.error("EntitlementPolicy: {}", why);
     return Dictionary();
   }
   std::sort(files.begin(), files.end());
 
   for (const auto& path : files) {
     auto reject = [&](const std::string& why) {
-      log_.error("EntitlementPolicy: {}: {}; the file grants nothing", path.string(), why);
+      const std::string line = fmt::format("{}: {}; the file grants nothing", path.string(), why);
+      problems ? problems->push_back(line) : log_.error("EntitlementPolicy: {}", line);
     };
     const auto bytes = file::readAll(path, kMaxPolicyFileBytes);
     if (!bytes) {
@@ -148,6 +160,10 @@ Dictionary EntitlementPolicy::entitlementsFor(const PeerCredentials& peer) const
       reject(why);
       continue;
     }
+    if (!peerOrNull) {
+      continue;
+    }
+    const PeerCredentials& peer = *peerOrNull;
     bool listed = contains(users, peer.uid) || contains(groups, peer.gid);
     for (const gid_t g : peer.groups) {
       listed = listed || contains(groups, g);

@@ -16,6 +16,8 @@
 // to the next connection.
 
 #include <filesystem>
+#include <string>
+#include <vector>
 
 #include "ipc/Connection.h"
 #include "platform/Log.h"
@@ -34,8 +36,14 @@ class EntitlementPolicy {
 
   std::filesystem::path folder() const;
   Dictionary entitlementsFor(const PeerCredentials& peer) const;
+  // Why each policy file that grants nothing does so ("<path>: not a
+  // dictionary; the file grants nothing"), as entitlementsFor logs it, in
+  // name order; empty when every file counts (zerithd --check).
+  std::vector<std::string> problems() const;
 
  private:
+  Dictionary evaluate(const PeerCredentials* peerOrNull, std::vector<std::string>* problems) const;
+
   std::optional<std::filesystem::path> folder_;
   log::Logger log_{"ipc"};
 };

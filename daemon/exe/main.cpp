@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <iostream>
 #include <string>
 #include <thread>
 
@@ -44,6 +45,10 @@ int main(int argc, char** argv) {
                  "Seconds to wait on SIGTERM for open sessions' transports to close")
       ->check(CLI::NonNegativeNumber)
       ->capture_default_str();
+  bool check = false;
+  app.add_flag("--check", check,
+               "Check the defaults, storebag keys, entitlements policy, device file and --ca-file that the daemon "
+               "reads, print what is wrong and exit (status 1 when something is)");
   CLI11_PARSE(app, argc, argv);
 
   zerith::log::configure({.debug = options.debug, .journal = std::nullopt});
@@ -60,6 +65,11 @@ int main(int argc, char** argv) {
     options.caFile = caFile;
   }
   options.stopTimeout = std::chrono::milliseconds(static_cast<long long>(stopTimeoutSeconds * 1000));
+  if (check) {
+    const int status = zerith::ZerithdDaemon(std::move(options)).check(std::cout);
+    std::cout.flush();
+    zerith::ZerithdDaemon::exitProcess(status);
+  }
   const int status = zerith::ZerithdDaemon(std::move(options)).run();
   zerith::ZerithdDaemon::exitProcess(status);
 }

@@ -12,11 +12,15 @@
 #include <random>
 #include <thread>
 
+#include <fmt/format.h>
+
 #include "tests/e2e/E2eFixture.h"
+#include "tests/support/Command.h"
 
 namespace zerith::test {
 namespace {
 
+namespace fs = std::filesystem;
 using log::Level;
 
 constexpr const char* kDisplayURL = "fetchDisplayURL:";
@@ -54,6 +58,41 @@ TEST_F(E2eTest, DefaultsTheDaemonDoesNotReadOrUseAreNamedAtStart) {
   EXPECT_TRUE(daemon->waitFor("main: \"uploadsAtOnce\" in com.velmar.zerith is 0, outside 1 to 64; zerithd does not "
                               "use this value"));
   EXPECT_EQ(daemon->count("does not read"), 1u);
+}
+
+// --check reads what the daemon reads at start and says what is wrong with
+// it, without starting: nothing listens afterwards.
+TEST_F(E2eTest, CheckNamesWhatTheDaemonWouldFindWrongWithoutStarting) {
+  const auto check = [&] {
+    return runCommand(fmt::format("'{}' --root '{}' --check 2>/dev/null", (buildDir() / "daemon" / "zerithd").string(),
+                                  root.path().string()));
+  };
+  root.write("/usr/share/zerith/publicKey.der", "not a key");
+  root.write("/etc/zerithd/entitlements.d/10-broken.plist", plist::encodeXml(Value(Array{})));
+  root.write("/etc/zerithd/device.plist", "<plist>");
+  Defaults("com.velmar.zerith").setObject("uploadsAtOnce", Value(0));
+  const CommandResult broken = check();
+  EXPECT_EQ(broken.status, 1);
+  EXPECT_EQ(broken.output.substr(0, broken.output.find("zerithd: the device file")),
+            "zerithd: \"uploadsAtOnce\" in com.velmar.zerith is 0, outside 1 to 64; zerithd does not use this value\n"
+            "zerithd: " + (root / "/usr/share/zerith/publicKey.der").string() +
+                " is not an RSA public key in DER form: every storebag is refused\n"
+                "zerithd: entitlements policy: " + (root / "/etc/zerithd/entitlements.d/10-broken.plist").string() +
+                ": not a dictionary; the file grants nothing\n");
+  EXPECT_NE(broken.output.find("zerithd: the device file " + (root / "/etc/zerithd/device.plist").string() +
+                               " is not used: "),
+            std::string::npos)
+      << broken.output;
+  EXPECT_TRUE(broken.output.ends_with("zerithd: 4 problems\n")) << broken.output;
+  EXPECT_FALSE(fs::exists(paths::socketPath()));
+
+  (void)signedStorebag(Value(Dictionary{}));  // installs the public key
+  fs::remove(root / "/etc/zerithd/entitlements.d/10-broken.plist");
+  fs::remove(root / "/etc/zerithd/device.plist");
+  Defaults("com.velmar.zerith").removeObject("uploadsAtOnce");
+  const CommandResult clean = check();
+  EXPECT_EQ(clean.status, 0);
+  EXPECT_EQ(clean.output, "zerithd: no problems\n");
 }
 
 TEST_F(E2eTest, StopSignalDrainsOpenSessionsAndRefusesNewOnes) {
