@@ -97,6 +97,7 @@ TEST_F(EntitlementPolicyTest, BrokenFilesAreLoggedAndGrantNothingWhileGoodOnesSt
   EXPECT_TRUE(refused("4-bad-entry.plist", "a user entry is neither a name nor an id: 41001"));
   EXPECT_TRUE(refused("5-no-entitlements.plist", "\"entitlements\" is missing or not a dictionary"));
   EXPECT_TRUE(refused("7-unknown-group.plist", "unknown group \"no-such-zerith-group\""));
+  EXPECT_EQ(policy.problems().size(), 6u) << "the same six files, as zerithd --check names them";
 }
 
 TEST_F(EntitlementPolicyTest, MissingFolderGrantsNothingAndAnUnreadableOneIsLogged) {

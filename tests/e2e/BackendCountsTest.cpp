@@ -81,7 +81,7 @@ TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
   EXPECT_TRUE(report->contains("SessionsCount_YJ"));
 
   // Without its own entitlement the status is refused, the connection kept.
-  const CliRun refused = zerith({"status", "--json"});
+  const CliResult refused = zerith({"status", "--json"});
   EXPECT_EQ(refused.status, cli::kExitRefused) << refused.err;
   EXPECT_NE(refused.err.find(ipc::kDaemonStatusEntitlement), std::string::npos) << refused.err;
   EXPECT_TRUE(daemon->waitFor("refusing the status to")) << daemon->output();
@@ -100,7 +100,7 @@ TEST_F(BackendCountsTest, FinalReportAndStatusSayWhatBecameOfEveryEvent) {
   EXPECT_TRUE(hasMembers(parsed["ended"][1],
                          R"({"backend":"httpsPost2","counts":{"batched":5,"droppedSampledOut":5,"sent":0}})"));
 
-  const CliRun table = zerith({"status"});
+  const CliResult table = zerith({"status"});
   ASSERT_EQ(table.status, 0) << table.err;
   EXPECT_NE(table.out.find("Ended sessions, totals by client type and backend:"), std::string::npos) << table.out;
   EXPECT_NE(table.out.find("sampledOut 5"), std::string::npos) << table.out;

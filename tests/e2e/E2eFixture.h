@@ -16,7 +16,6 @@
 #include <mutex>
 #include <nlohmann/json.hpp>
 #include <optional>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -33,6 +32,7 @@
 #include "tests/support/TempRoot.h"
 #include "tests/support/TestCA.h"
 #include "tools/zerith/ZerithCli.h"
+#include "tools/zerith/tests/RunCli.h"
 #include "zerith/Zerith.h"
 
 namespace zerith::test {
@@ -276,25 +276,13 @@ class E2eTest : public ::testing::Test {
   }
 
   // `zerith --root <root> args...`, run in this process.
-  struct CliRun {
-    int status;
-    std::string out;
-    std::string err;
-  };
-  CliRun zerith(std::vector<std::string> args) const {
-    args.insert(args.begin(), {"zerith", "--root", root.path().string()});
-    std::vector<const char*> argv;
-    for (const auto& a : args) {
-      argv.push_back(a.c_str());
-    }
-    std::ostringstream out;
-    std::ostringstream err;
-    const int status = cli::run(static_cast<int>(argv.size()), argv.data(), out, err);
-    return {status, out.str(), err.str()};
+  CliResult zerith(std::vector<std::string> args) const {
+    args.insert(args.begin(), {"--root", root.path().string()});
+    return runCli(std::move(args));
   }
   // `zerith status --json`, parsed (discarded when it fails).
   nlohmann::ordered_json statusJson() const {
-    const CliRun run = zerith({"status", "--json"});
+    const CliResult run = zerith({"status", "--json"});
     EXPECT_EQ(run.status, 0) << run.err;
     return nlohmann::ordered_json::parse(run.out, nullptr, /*allow_exceptions=*/false);
   }

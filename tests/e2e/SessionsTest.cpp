@@ -247,7 +247,7 @@ TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
 {"session":"stream","step":"close"}
 {"session":"call","step":"finish"}
 )");
-  const CliRun run = zerith({"sessions", "--script", (root / "/var/tmp/script.jsonl").string()});
+  const CliResult run = zerith({"sessions", "--script", (root / "/var/tmp/script.jsonl").string()});
   ASSERT_EQ(run.status, 0) << run.err << run.out;
 
   std::vector<nlohmann::json> lines;
@@ -278,7 +278,7 @@ TEST_F(SessionsTogetherTest, TheCommandLineDrivesAHierarchyFromJsonLines) {
 
   // A line that cannot run ends the script with status 2 and says which.
   root.write("/var/tmp/bad.jsonl", "{\"session\":\"x\",\"step\":\"send\",\"category\":1,\"type\":1}\n");
-  const CliRun bad = zerith({"sessions", "--script", (root / "/var/tmp/bad.jsonl").string()});
+  const CliResult bad = zerith({"sessions", "--script", (root / "/var/tmp/bad.jsonl").string()});
   EXPECT_EQ(bad.status, 2);
   EXPECT_NE(bad.err.find("line 1: no open session \"x\""), std::string::npos) << bad.err;
 }
