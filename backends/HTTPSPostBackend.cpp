@@ -42,8 +42,8 @@ namespace {
 // connection for ever.
 constexpr double kPostTimeoutSeconds = 60;
 
-// An integer key of com.velmar.zerith within [low, high]; otherwise logged
-// and `fallback`.
+// An integer setting within its range in the defaults table; otherwise
+// logged and `fallback`.
 std::int32_t limitFromDefaults(const DefaultsSetting& setting, std::int32_t fallback) {
   std::string problem;
   if (const auto n = defaultsNumber(setting, Defaults(std::string(setting.domain)).objectForKey(setting.key), &problem)) {
