@@ -146,19 +146,6 @@ std::optional<std::string> unreadDefaultsDomain(std::string_view domain) {
   return "zerithd reads no domain " + std::string(domain) + didYouMean(nearestSpelling(domain, names));
 }
 
-std::vector<std::string> unreadDefaultsKeys(std::string_view domain) {
-  std::vector<std::string> unread;
-  const Value values = Defaults(std::string(domain)).dictionary();
-  if (const Dictionary* dict = values.dict()) {
-    for (const auto& [key, value] : dict->entries()) {
-      if (auto why = unreadDefaultsKey(domain, key)) {
-        unread.push_back(std::move(*why));
-      }
-    }
-  }
-  return unread;
-}
-
 std::vector<std::string> defaultsDomainProblems(std::string_view domain) {
   std::vector<std::string> problems;
   const Value values = Defaults(std::string(domain)).dictionary();

@@ -111,9 +111,6 @@ std::optional<std::string> unreadDefaultsKey(std::string_view domain, std::strin
 // tell the operator, with the nearest such domain.
 std::optional<std::string> unreadDefaultsDomain(std::string_view domain);
 
-// What unreadDefaultsKey says of each key of the domain's file, in its order.
-std::vector<std::string> unreadDefaultsKeys(std::string_view domain);
-
 // Every problem of the domain's file, in its order: keys nobody reads ("...;
 // it is ignored") and values the readers refuse ("\"spoolMaxBytes\" in
 // com.velmar.zerith is 100, outside 4096 to 1099511627776; zerithd does not
