@@ -11,8 +11,10 @@
 namespace zerith::paths {
 
 namespace {
-std::mutex gMutex;
-fs::path gRoot = "/";
+// Never destroyed: pool threads live until the process ends and may still
+// resolve a path while a test process runs its static destructors.
+std::mutex& gMutex = *new std::mutex;
+fs::path& gRoot = *new fs::path("/");
 
 fs::path homeFolder() {
   if (const char* home = std::getenv("HOME"); home && *home) {
