@@ -75,98 +75,93 @@ TEST(StorebagLintTest, ABagThatSetsEveryKeyTheDaemonReadsDrawsNoFinding) {
   EXPECT_EQ(described(Value(fullBag())), std::vector<std::string>{});
 }
 
+using Change = std::function<void(Dictionary&)>;
+
 // `change` applied to the full bag, and what the lint says of it.
 struct Row {
   const char* name;
-  std::function<void(Dictionary&)> change;
+  Change change;
   std::vector<std::string> expected;
 };
 
-// The first client entry of the release section's httpsPost backend.
-void editClient(Dictionary& bag, const std::function<void(Dictionary&)>& edit) {
-  Dictionary section = bag.get("release").dictCopy();
-  Dictionary https = section.get("httpsPost").dictCopy();
-  Dictionary client = https.get("clients").at(0).dictCopy();
-  edit(client);
-  https.set("clients", Array{Value(std::move(client))});
-  section.set("httpsPost", std::move(https));
-  bag.set("release", std::move(section));
+// `edit` made to the release section of a bag.
+Change inSection(Change edit) {
+  return [edit](Dictionary& bag) {
+    Dictionary section = bag.get("release").dictCopy();
+    edit(section);
+    bag.set("release", std::move(section));
+  };
 }
 
-void editSection(Dictionary& bag, const std::function<void(Dictionary&)>& edit) {
-  Dictionary section = bag.get("release").dictCopy();
-  edit(section);
-  bag.set("release", std::move(section));
+// `edit` made to the first client entry of the release section's httpsPost backend.
+Change inClient(Change edit) {
+  return inSection([edit](Dictionary& section) {
+    Dictionary https = section.get("httpsPost").dictCopy();
+    Dictionary client = https.get("clients").at(0).dictCopy();
+    edit(client);
+    https.set("clients", Array{Value(std::move(client))});
+    section.set("httpsPost", std::move(https));
+  });
 }
 
 TEST(StorebagLintTest, EachMistakeIsNamedWhereItIs) {
   const std::string client = "release.httpsPost.clients[0]";
   const Row rows[] = {
       {"misspelt client key",
-       [](Dictionary& bag) {
-         editClient(bag, [](Dictionary& c) {
-           c.erase("sampling_threshold");
-           c.set("sampling_treshold", 1.0);
-         });
-       },
+       inClient([](Dictionary& c) {
+         c.erase("sampling_threshold");
+         c.set("sampling_treshold", 1.0);
+       }),
        {"warning: " + client +
             ": unknown key \"sampling_treshold\" (did you mean \"sampling_threshold\"?): the daemon does not read it "
             "(a misspelt key reads as absent)",
         "error: " + client + ": no \"sampling_threshold\": sessions that require user info are never enabled by "
                              "this entry"}},
       {"empty locale list",
-       [](Dictionary& bag) { editClient(bag, [](Dictionary& c) { c.set("locale_whitelist", Array{}); }); },
+       inClient([](Dictionary& c) { c.set("locale_whitelist", Array{}); }),
        {"error: " + client + ": no \"locale_whitelist\" (or an empty one): sessions that require user info are never "
                              "enabled by this entry"}},
       {"no filters, no post URL",
-       [](Dictionary& bag) {
-         editClient(bag, [](Dictionary& c) {
-           c.erase("filters");
-           c.erase("post_url");
-         });
-       },
+       inClient([](Dictionary& c) {
+         c.erase("filters");
+         c.erase("post_url");
+       }),
        {"error: " + client + ": no \"filters\": sessions that require user info are never enabled by this entry",
         "warning: " + client + ": no \"post_url\": its events have nowhere to go unless the device's defaults name one"}},
       {"values of another type",
-       [](Dictionary& bag) {
-         editClient(bag, [](Dictionary& c) {
-           c.set("event_threshold", "ten");
-           c.set("post_url", 7);
-           c.set("device_blacklist", Array{Value(1)});
-           c.set("per_country_sampling_thresholds", "DE");
-           c.set("event_whitelist", Array{Value(1), Value("2")});
-         });
-       },
+       inClient([](Dictionary& c) {
+         c.set("event_threshold", "ten");
+         c.set("post_url", 7);
+         c.set("device_blacklist", Array{Value(1)});
+         c.set("per_country_sampling_thresholds", "DE");
+         c.set("event_whitelist", Array{Value(1), Value("2")});
+       }),
        {"warning: " + client + ": \"device_blacklist\" holds an integer, the daemon reads a list of strings",
         "warning: " + client + ": \"event_threshold\" is a string, the daemon reads a number",
         "warning: " + client + ": \"post_url\" is an integer, the daemon reads a string",
         "warning: " + client + ": \"event_whitelist\" holds a string, the daemon reads a list of numbers",
         "warning: " + client + ": \"per_country_sampling_thresholds\" is a string, not a list: the daemon ignores it"}},
       {"filters and country thresholds",
-       [](Dictionary& bag) {
-         editClient(bag, [](Dictionary& c) {
-           c.set("filters", Array{Value(Dictionary{{"action", "hash"}}), Value("udid")});
-           c.set("per_country_sampling_thresholds", Array{Value(Dictionary{{"country", strings({"FR"})}})});
-         });
-       },
+       inClient([](Dictionary& c) {
+         c.set("filters", Array{Value(Dictionary{{"action", "hash"}}), Value("udid")});
+         c.set("per_country_sampling_thresholds", Array{Value(Dictionary{{"country", strings({"FR"})}})});
+       }),
        {"warning: " + client + ".filters[0]: \"action\" is neither \"remove\" nor \"sha256\": the filter keeps the value",
         "warning: " + client + ".filters[0]: no \"key\": the filter applies to no entry",
         "warning: " + client + ".filters[1]: is a string, not a dictionary: the daemon ignores it",
         "error: " + client + ".per_country_sampling_thresholds[0]: no \"threshold\": devices of these countries "
                              "report as if the threshold were 0"}},
       {"backends that are not made",
-       [](Dictionary& bag) {
-         editSection(bag, [](Dictionary& s) {
-           s.set("dashboard", Dictionary{{"ip", "10.0.0.1"}});
-           s.set("uploadServer", Dictionary{});
-           s.set("httpsPost2", Dictionary{{"display_url", "z"}});
-           s.set("qrs", Dictionary{{"clients", Array{}}});
-           s.set("httpPost", Dictionary{});
-           s.set("energy", Dictionary{});
-           s.set("pellamlog", "on");
-           s.set("httpsPost", Dictionary{{"clients", Array{Value("demo")}}});
-         });
-       },
+       inSection([](Dictionary& s) {
+         s.set("dashboard", Dictionary{{"ip", "10.0.0.1"}});
+         s.set("uploadServer", Dictionary{});
+         s.set("httpsPost2", Dictionary{{"display_url", "z"}});
+         s.set("qrs", Dictionary{{"clients", Array{}}});
+         s.set("httpPost", Dictionary{});
+         s.set("energy", Dictionary{});
+         s.set("pellamlog", "on");
+         s.set("httpsPost", Dictionary{{"clients", Array{Value("demo")}}});
+       }),
        {"error: release.httpsPost.clients[0]: the client entry is a string, not a dictionary: it matches no client",
         "error: release.httpsPost2: no \"clients\": the backend is not made",
         "error: release.qrs.clients: not a list of client entries: the backend never reports",
