@@ -41,6 +41,20 @@ class ZerithStorebagToolTest : public ::testing::Test {
     write("bag.plist", plist::encodeXml(bag_));
   }
 
+  // Each command line ends with its status, what it prints beginning as given.
+  struct Expected {
+    std::string arguments;
+    int status;
+    std::string output;
+  };
+  void expectRuns(const std::vector<Expected>& runs) const {
+    for (const auto& e : runs) {
+      const test::CommandResult r = run(e.arguments);
+      EXPECT_EQ(r.status, e.status) << e.arguments << "\n" << r.output;
+      EXPECT_EQ(r.output.rfind(e.output, 0), 0u) << e.arguments << "\n" << r.output;
+    }
+  }
+
   test::TempRoot root_;
   const Value bag_ = Value(
       Dictionary{{"release", Value(Dictionary{{"kovu", Value(Dictionary{{"active", true}})}})}, {"version", "3.0.1"}});
@@ -64,12 +78,8 @@ TEST_F(ZerithStorebagToolTest, SignedContainerVerifiesAndShowsTheBag) {
   unstamped.erase("issue_time");
   EXPECT_EQ(Value(unstamped), bag_);
 
-  const test::CommandResult verify = run("verify --public publicKey.der --in container");
-  EXPECT_EQ(verify.status, 0);
-  EXPECT_EQ(
-      verify.output.rfind("verified: " + std::to_string(signedBag.size()) + " bag bytes, version 3.0.1, issued ", 0),
-      0u)
-      << verify.output;
+  expectRuns({{"verify --public publicKey.der --in container", 0,
+               "verified: " + std::to_string(signedBag.size()) + " bag bytes, version 3.0.1, issued "}});
 
   const test::CommandResult show = run("show --public publicKey.der --in container");
   EXPECT_EQ(show.status, 0);
@@ -89,32 +99,23 @@ TEST_F(ZerithStorebagToolTest, RefusalsExitWithOneAndSayWhy) {
   ASSERT_EQ(run("sign --key key.pem --in bag.plist --out container").status, 0);
   ASSERT_EQ(run("keygen --private other.pem --public other.der").status, 0);
 
-  struct Case {
-    std::string arguments;
-    std::string message;
-  };
   write("array.plist", plist::encodeXml(Value(Array{Value(1)})));
   write("junk", "not a property list");
-  const Case cases[] = {
-      {"verify --public other.der --in container",
+  expectRuns({
+      {"verify --public other.der --in container", 1,
        // OpenSSL's reason depends on the two random keys ("invalid padding"
        // or "data too large for modulus"); it follows in brackets.
        "zerith-storebag: 'container' refused: the signature does not match the bag under this public key ("},
-      {"verify --public publicKey.der --in bag.plist",
+      {"verify --public publicKey.der --in bag.plist", 1,
        "zerith-storebag: 'bag.plist' refused: the container has no \"signature\" string\n"},
-      {"show --public key.pem --in container",
+      {"show --public key.pem --in container", 1,
        "zerith-storebag: 'container' refused: the public key is not an RSA public key in DER form\n"},
-      {"verify --public publicKey.der --in missing", "zerith-storebag: cannot read 'missing': no such file\n"},
-      {"sign --key key.pem --in array.plist --out x",
+      {"verify --public publicKey.der --in missing", 1, "zerith-storebag: cannot read 'missing': no such file\n"},
+      {"sign --key key.pem --in array.plist --out x", 1,
        "zerith-storebag: 'array.plist' is not a property list dictionary\n"},
-      {"sign --key publicKey.der --in bag.plist --out x", "zerith-storebag: cannot sign with 'publicKey.der': "},
-      {"sign --key key.pem --in junk --out x", "zerith-storebag: 'junk' is not a property list: "},
-  };
-  for (const auto& c : cases) {
-    const test::CommandResult r = run(c.arguments);
-    EXPECT_EQ(r.status, 1) << c.arguments;
-    EXPECT_EQ(r.output.substr(0, c.message.size()), c.message) << c.arguments;
-  }
+      {"sign --key publicKey.der --in bag.plist --out x", 1, "zerith-storebag: cannot sign with 'publicKey.der': "},
+      {"sign --key key.pem --in junk --out x", 1, "zerith-storebag: 'junk' is not a property list: "},
+  });
   EXPECT_FALSE(fs::exists(at("x")));
   EXPECT_NE(run("sign --key key.pem --in bag.plist").status, 0);  // --out is required
   EXPECT_NE(run("").status, 0);
@@ -128,23 +129,14 @@ TEST_F(ZerithStorebagToolTest, OneCommandSignsWithBothAndVerifyNeedsBothWhenGive
   EXPECT_NE(signing.output.find("(RSA and Ed25519)"), std::string::npos) << signing.output;
   ASSERT_EQ(run("sign --key key.pem --in bag.plist --out rsa-only").status, 0);
 
-  struct Case {
-    const char* arguments;
-    int status;
-    const char* output;  // its beginning
-  } cases[] = {
+  expectRuns({
       {"verify --public publicKey.der --ed25519-public ed.der --in both", 0, "verified (RSA and Ed25519): "},
       {"verify --public publicKey.der --in both", 0, "verified: "},
       {"verify --public publicKey.der --ed25519-public ed.der --in rsa-only", 1,
        "zerith-storebag: 'rsa-only' refused: the container has no \"signature_ed25519\" string"},
       {"sign --key key.pem --ed25519-key key.pem --in bag.plist --out x", 1,
        "zerith-storebag: cannot sign with 'key.pem': the private key is not an Ed25519 key"},
-  };
-  for (const auto& c : cases) {
-    const auto r = run(c.arguments);
-    EXPECT_EQ(r.status, c.status) << c.arguments << "\n" << r.output;
-    EXPECT_EQ(r.output.rfind(c.output, 0), 0u) << c.arguments << "\n" << r.output;
-  }
+  });
   EXPECT_FALSE(fs::exists(at("x")));
 }
 
