@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include "client/tests/TestDaemon.h"
+#include "config/tests/ScopedEnv.h"
 #include "ipc/EntitlementPolicy.h"
 #include "platform/Json.h"
 #include "tools/zerith/tests/RunCli.h"
@@ -262,10 +263,8 @@ TEST(Cli, IdentifierAndVersionUnderTheGivenRootOrTheDefaultOne) {
       "{\"version\":\"8.0\",\"publicKey\":\"" + (root / "/usr/share/zerith/publicKey.der").string() + "\"}\n";
   EXPECT_EQ(runCli({"--root", root.path().string(), "version"}).out, version);
   // Without --root the daemon's default root is used.
-  ASSERT_EQ(setenv("ZERITHD_ROOT", root.path().c_str(), 1), 0);
-  const auto v = runCli({"version"});
-  unsetenv("ZERITHD_ROOT");
-  EXPECT_EQ(v.out, version);
+  const ScopedEnv defaultRoot("ZERITHD_ROOT", root.path().c_str());
+  EXPECT_EQ(runCli({"version"}).out, version);
 }
 
 // What the policy grants a user's processes, as the daemon decides it: this
