@@ -104,6 +104,11 @@ TEST(CollectorBodyCorpus, EveryCorpusInputDecodesWithoutCrashing) {
   EXPECT_GT(inputs, 0u);
 }
 
+struct CurlAnswer {
+  long status = 0;
+  std::string body;
+};
+
 class CollectorToolTest : public ::testing::Test {
  protected:
   // The built collector on a free port with a certificate it makes in
@@ -127,6 +132,40 @@ class CollectorToolTest : public ::testing::Test {
     b->setReportingSessionConnectivityDelegate(transport);
     b->updateState();
     return b;
+  }
+
+  // A POST of `body` to `collector` with libcurl trusting the certificate
+  // it made, or a GET without a body (its path sent as it is, "/../" included).
+  CurlAnswer request(const CollectorProcess& collector, const std::string& path,
+                     const std::optional<std::string>& body = std::nullopt,
+                     const std::vector<std::string>& headers = {}) const {
+    CURL* curl = curl_easy_init();
+    CurlAnswer answer;
+    curl_slist* list = nullptr;
+    for (const auto& h : headers) {
+      list = curl_slist_append(list, h.c_str());
+    }
+    curl_easy_setopt(curl, CURLOPT_URL, collector.url(path).c_str());
+    curl_easy_setopt(curl, CURLOPT_CAINFO, (certs / "ca.pem").c_str());
+    if (body) {
+      curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body->data());
+      curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body->size()));
+    }
+    curl_easy_setopt(curl, CURLOPT_PATH_AS_IS, 1L);
+    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, list);
+    curl_easy_setopt(curl, CURLOPT_TIMEOUT, 20L);
+    curl_easy_setopt(
+        curl, CURLOPT_WRITEFUNCTION, +[](char* p, size_t s, size_t n, void* u) {
+          static_cast<std::string*>(u)->append(p, s * n);
+          return s * n;
+        });
+    curl_easy_setopt(curl, CURLOPT_WRITEDATA, &answer.body);
+    if (curl_easy_perform(curl) == CURLE_OK) {
+      curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &answer.status);
+    }
+    curl_slist_free_all(list);
+    curl_easy_cleanup(curl);
+    return answer;
   }
 
   TempRoot root;
@@ -168,51 +207,12 @@ TEST_F(CollectorToolTest, BackendRecordsArriveOneLinePerRecordWithSenderSessionA
   EXPECT_EQ((*line)["digest"], "invalid");
 }
 
-struct CurlAnswer {
-  long status = 0;
-  std::string body;
-};
-
-// A POST of `body` with libcurl trusting `ca`, or a GET without a body
-// (its path sent as it is, "/../" included).
-CurlAnswer curlRequest(const std::string& url, const fs::path& ca, const std::optional<std::string>& body,
-                       const std::vector<std::string>& headers) {
-  CURL* curl = curl_easy_init();
-  CurlAnswer answer;
-  curl_slist* list = nullptr;
-  for (const auto& h : headers) {
-    list = curl_slist_append(list, h.c_str());
-  }
-  curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
-  curl_easy_setopt(curl, CURLOPT_CAINFO, ca.c_str());
-  if (body) {
-    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body->data());
-    curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body->size()));
-  }
-  curl_easy_setopt(curl, CURLOPT_PATH_AS_IS, 1L);
-  curl_easy_setopt(curl, CURLOPT_HTTPHEADER, list);
-  curl_easy_setopt(curl, CURLOPT_TIMEOUT, 20L);
-  curl_easy_setopt(
-      curl, CURLOPT_WRITEFUNCTION, +[](char* p, size_t s, size_t n, void* u) {
-        static_cast<std::string*>(u)->append(p, s * n);
-        return s * n;
-      });
-  curl_easy_setopt(curl, CURLOPT_WRITEDATA, &answer.body);
-  if (curl_easy_perform(curl) == CURLE_OK) {
-    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &answer.status);
-  }
-  curl_slist_free_all(list);
-  curl_easy_cleanup(curl);
-  return answer;
-}
-
 TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLocation) {
   const fs::path store = root.path() / "store";
   CollectorProcess collector = start({"--store", store.string(), "--log-data-path", "/logs"});
   const std::string file = "diagnostic log\n" + std::string(5000, 'z');
-  const auto upload =
-      curlRequest(collector.url("/upload?uuid=abc&sequence=3&filename=x.log.gz&raw=true"), certs / "ca.pem",
-                  gzipOf(file), {"Content-Type: application/octet-stream", "Content-Encoding: gzip"});
+  const auto upload = request(collector, "/upload?uuid=abc&sequence=3&filename=x.log.gz&raw=true", gzipOf(file),
+                              {"Content-Type: application/octet-stream", "Content-Encoding: gzip"});
   EXPECT_EQ(upload.status, 200);
   EXPECT_EQ(upload.body, "success");
   auto line = collector.nextLine();
@@ -224,7 +224,7 @@ TEST_F(CollectorToolTest, UploadsAreStoredInflatedAndLogDataIsAnsweredWithItsLoc
   ASSERT_TRUE(stored);
   EXPECT_EQ(std::string(stored->begin(), stored->end()), file);
 
-  const auto logData = curlRequest(collector.url("/logs"), certs / "ca.pem", "archived log data", {});
+  const auto logData = request(collector, "/logs", "archived log data");
   line = collector.nextLine();
   ASSERT_TRUE(line);
   EXPECT_EQ((*line)["kind"], "logdata");
@@ -247,7 +247,7 @@ TEST_F(CollectorToolTest, HostileBodiesAreRefusedWithoutStoppingTheCollector) {
       {"fine, still answered", "{\"postTime\":1}", {}, 200, "envelope"},
   };
   for (const auto& r : requests) {
-    EXPECT_EQ(curlRequest(collector.url("/post"), certs / "ca.pem", r.body, r.headers).status, r.status) << r.name;
+    EXPECT_EQ(request(collector, "/post", r.body, r.headers).status, r.status) << r.name;
     const auto line = collector.nextLine();
     ASSERT_TRUE(line) << r.name;
     EXPECT_EQ((*line)["kind"], r.kind) << r.name;
@@ -268,14 +268,14 @@ TEST_F(CollectorToolTest, ConnectionsBeyondItsLimitAreClosedUntilOneEnds) {
   address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
   ASSERT_EQ(::connect(silent.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
   const std::string envelope = "{\"postTime\":1}";
-  EXPECT_EQ(curlRequest(collector.url("/post"), certs / "ca.pem", envelope, {}).status, 0);
+  EXPECT_EQ(request(collector, "/post", envelope).status, 0);
   silent.reset();
   long status = 0;
   for (int attempt = 0; attempt < 100 && status != 200; ++attempt) {
     if (attempt > 0) {
       std::this_thread::sleep_for(std::chrono::milliseconds(100));
     }
-    status = curlRequest(collector.url("/post"), certs / "ca.pem", envelope, {}).status;
+    status = request(collector, "/post", envelope).status;
   }
   EXPECT_EQ(status, 200);
   const auto line = collector.nextLine();
@@ -289,15 +289,13 @@ TEST_F(CollectorToolTest, ServesStaticFilesWithLastModifiedAndNothingOutsideItsF
   std::ofstream(www / "dravon") << "signed bag";
   std::ofstream(root.path() / "secret") << "no";
   CollectorProcess collector = start({"--serve", www.string()});
-  const auto get = [&](const std::string& path, const std::vector<std::string>& headers) {
-    return curlRequest(collector.url(path), certs / "ca.pem", std::nullopt, headers);
-  };
-  const auto bag = get("/dravon?version=8.1", {});
+  const auto bag = request(collector, "/dravon?version=8.1");
   EXPECT_EQ(bag.status, 200);
   EXPECT_EQ(bag.body, "signed bag");
-  EXPECT_EQ(get("/dravon", {"If-Modified-Since: Fri, 01 Jan 2100 00:00:00 GMT"}).status, 304);
-  EXPECT_EQ(get("/../secret", {}).status, 404);
-  EXPECT_EQ(get("/missing", {}).status, 404);
+  EXPECT_EQ(request(collector, "/dravon", std::nullopt, {"If-Modified-Since: Fri, 01 Jan 2100 00:00:00 GMT"}).status,
+            304);
+  EXPECT_EQ(request(collector, "/../secret").status, 404);
+  EXPECT_EQ(request(collector, "/missing").status, 404);
 }
 
 TEST_F(CollectorToolTest, RefusesToStartWithoutCertificateOrWithABadOne) {
