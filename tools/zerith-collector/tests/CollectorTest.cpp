@@ -7,7 +7,6 @@
 #include <netinet/in.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <zlib.h>
 
 #include <chrono>
 #include <filesystem>
@@ -18,9 +17,11 @@
 #include <vector>
 
 #include "backends/HTTPSPostBackend.h"
+#include "config/Compression.h"
 #include "config/DeviceInfo.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
+#include "platform/PropertyList.h"
 #include "tests/support/CollectorProcess.h"
 #include "tests/support/Command.h"
 #include "tests/support/TempRoot.h"
@@ -39,18 +40,10 @@ using collector::BodyLimits;
 using collector::decodeRequestBody;
 using Json = nlohmann::ordered_json;
 
+// `text` gzip'd as a device sends a request body.
 std::string gzipOf(const std::string& text) {
-  z_stream s{};
-  deflateInit2(&s, 9, Z_DEFLATED, 16 + MAX_WBITS, 8, Z_DEFAULT_STRATEGY);
-  std::string out(deflateBound(&s, text.size()), '\0');
-  s.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-  s.avail_in = static_cast<uInt>(text.size());
-  s.next_out = reinterpret_cast<Bytef*>(out.data());
-  s.avail_out = static_cast<uInt>(out.size());
-  deflate(&s, Z_FINISH);
-  out.resize(s.total_out);
-  deflateEnd(&s);
-  return out;
+  const Data gzip = *gzipDeflate(plist::bytesOf(text));
+  return std::string(gzip.begin(), gzip.end());
 }
 
 TEST(CollectorBody, GzipBombsTruncationAndTrailingBytesAreRefusedBeforeParsing) {
