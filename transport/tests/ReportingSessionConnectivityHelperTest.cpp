@@ -115,8 +115,7 @@ TEST_F(ConnectivityHelperTest, LargeChunkedBodyArrivesWholeAndInOrder) {
   ASSERT_TRUE(done->waitFor(1));
   const auto call = done->calls()[0];
   EXPECT_FALSE(call.error.has_value());
-  EXPECT_EQ(call.data.size(), body.size());
-  EXPECT_TRUE(text(call.data) == body) << "the chunks were not joined in order";
+  EXPECT_TRUE(text(call.data) == body) << call.data.size() << " of " << body.size() << " bytes, or not in order";
   EXPECT_GE(logs.count("didReceiveData: received "), 2u) << "expected the body in several deliveries";
 }
 
