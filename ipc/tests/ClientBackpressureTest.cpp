@@ -87,7 +87,8 @@ class ClientBackpressure : public ::testing::Test {
     if (connection) {
       writer = std::make_unique<EventWriter>(*connection);
     }
-    return writer && capture.waitFor(connection->description() + ": peer does not read (");
+    return writer && capture.waitFor(connection->description() + ": peer does not read (") &&
+           writer->sent.load() < kHeldBackEvents;
   }
 
   log::LogCapture capture;
@@ -101,7 +102,6 @@ class ClientBackpressure : public ::testing::Test {
 
 TEST_F(ClientBackpressure, OneWayEventsToADaemonThatStopsReadingWaitAtTheMarkAndAllArriveOnceItReads) {
   ASSERT_TRUE(writerHeldBack());
-  EXPECT_LT(writer->sent.load(), kHeldBackEvents) << "the writer was not held back";
   const std::size_t frame = encodeCall("event", std::nullopt, Dictionary{{"n", 0}, {"pad", Value(eventArgsPad())}}).size();
   EXPECT_GT(connection->queuedBytes(), kPause);
   EXPECT_LE(connection->queuedBytes(), kPause + frame + 16);
@@ -145,7 +145,6 @@ class ClientBackpressureRelease : public ClientBackpressure, public ::testing::W
 
 TEST_P(ClientBackpressureRelease, QueueBlocksNeverWaitAndTheEndOfTheConnectionReleasesAWaitingWriterAtOnce) {
   ASSERT_TRUE(writerHeldBack());
-  ASSERT_LT(writer->sent.load(), kHeldBackEvents);
   // Over the mark, nothing read: a block of the connection's own queue still
   // gets its frame queued (past the mark) and goes on.
   Counter fromQueue;

@@ -28,7 +28,7 @@ Data paddedCall(std::uint64_t n, std::size_t pad) {
   return encodeCall("echo", n, Dictionary{{"n", static_cast<long long>(n)}, {"pad", Value(Data(pad, 0x61))}});
 }
 
-// Sets the limits for one test, puts the defaults back afterwards and captures the log.
+// Each test lowers the limits it reaches; the defaults come back afterwards. Captures the log.
 class Flood : public ::testing::Test {
  protected:
   void SetUp() override { ASSERT_EQ(queuedBytesOfAllConnections(), 0u) << "an earlier test left bytes queued"; }
@@ -79,8 +79,7 @@ int floodUntilHeldBack(RawPeer& peer, std::size_t pad, int maxCalls) {
 }
 
 TEST_F(Flood, APeerThatDoesNotReadIsThrottledAndServedInFullOnceItReads) {
-  setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = 64u << 20,
-                  .allConnections = 1u << 30});
+  setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10});
   RawPeer flooder;
   constexpr std::size_t kPad = 2000;
   constexpr int kMax = 50000;  // 100 MB of calls: far beyond what a throttled connection takes
@@ -111,8 +110,7 @@ TEST_F(Flood, SeveralFloodersStayUnderTheLimitForAllTheSlowestIsClosedFirstAndOt
   // 640 KiB, which closes the one that has waited longest: not the one whose
   // replies crossed the limit, and not the newer one that holds as much.
   constexpr std::size_t kLimit = 640u << 10;
-  setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = 64u << 20,
-                  .allConnections = kLimit});
+  setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .allConnections = kLimit});
   RawPeer normal;
   std::vector<std::unique_ptr<RawPeer>> flooders;
   constexpr std::size_t kPad = 1000;
@@ -154,8 +152,7 @@ TEST_F(Flood, SeveralFloodersStayUnderTheLimitForAllTheSlowestIsClosedFirstAndOt
 TEST_F(Flood, CallsLeftUnansweredHoldBackFurtherCallsUntilHalfAreAnswered) {
   // An object that answers later (as a flush does) keeps its replies; the
   // peer reads everything, so only the unanswered calls can hold it back.
-  setQueueLimits({.pauseReadingAt = 1u << 20, .resumeReadingAt = 256u << 10, .perConnection = 64u << 20,
-                  .allConnections = 1u << 30, .callsInFlight = 64});
+  setQueueLimits({.callsInFlight = 64});
   RawPeer peer;
   std::mutex held;
   std::vector<std::shared_ptr<Reply>> unanswered;
@@ -210,8 +207,7 @@ TEST_F(Flood, MessagesTheDaemonSendsToAPeerThatNeverReadsCloseItAtTheConnectionL
   // Calls from this side are not held back by reading; the limit per
   // connection ends them.
   constexpr std::size_t kPerConnection = 2u << 20;
-  setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = kPerConnection,
-                  .allConnections = 1u << 30});
+  setQueueLimits({.pauseReadingAt = 256u << 10, .resumeReadingAt = 64u << 10, .perConnection = kPerConnection});
   RawPeer peer;
   RawPeer bystander;
   // Sends from the daemon's end never wait for the peer, past the mark or not.

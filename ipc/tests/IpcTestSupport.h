@@ -221,13 +221,13 @@ struct ConnectedPair {
   }
 };
 
-// The outcome of one Connection::call with a completion.
-inline std::future<SocketConnection::WaitedReply> callLater(Connection& connection, const std::string& op, Dictionary args) {
-  auto promise = std::make_shared<std::promise<SocketConnection::WaitedReply>>();
-  connection.call(op, std::move(args), [promise](std::optional<Dictionary> a, std::optional<Error> e) {
-    promise->set_value({std::move(a), std::move(e)});
+// The outcome of one Connection::call with a completion, as an Answer.
+inline auto callLater(Connection& connection, const std::string& op, Dictionary args) {
+  auto answer = std::make_shared<Answer<SocketConnection::WaitedReply>>();
+  connection.call(op, std::move(args), [answer](std::optional<Dictionary> a, std::optional<Error> e) {
+    answer->set({std::move(a), std::move(e)});
   });
-  return promise->get_future();
+  return answer;
 }
 
 inline Data bytesOfText(const std::string& s) { return Data(s.begin(), s.end()); }
