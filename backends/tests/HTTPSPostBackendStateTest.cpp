@@ -123,9 +123,7 @@ TEST_F(HTTPSRecordTest, EnvelopeWithoutClientIdentifierHoldsOnlyPostTime) {
 }
 
 TEST_F(HTTPSRecordTest, PrintableCopyOnlyWhenConsentIsRespectedOrLoggingIsForced) {
-  auto client = enablingClient(server.url("/post"));
-  client.erase("override_dnu");
-  auto b = backend(profileWith({client}));
+  auto b = immediate(server.url("/post"), {{"override_dnu", nullptr}});
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   ASSERT_EQ(b->dnuType(), 0);
   std::optional<std::string> pretty;
@@ -165,30 +163,27 @@ TEST_F(HTTPSStateTest, FrameworkVersionGateComparesMajorMiddleMinor) {
 TEST_F(HTTPSStateTest, EachRefusalDisablesWithItsOwnLine) {
   struct Case {
     const char* name;
-    std::function<void(Dictionary&)> change;
+    Dictionary change;
     const char* line;
   };
   Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(false));
-  const std::vector<Case> cases = {
-      {"no consent", [](Dictionary& c) { c.erase("override_dnu"); },
+  const Case cases[] = {
+      {"no consent", {{"override_dnu", nullptr}},
        "HTTPSPostBackend(updateBackendState): reporting disabled by DNU: 0."},
-      {"no locale list", [](Dictionary& c) { c.erase("locale_whitelist"); },
+      {"no locale list", {{"locale_whitelist", nullptr}},
        "HTTPSPostBackend(updateBackendState): (GB) isn't in country code list"},
-      {"other country", [](Dictionary& c) { c.set("locale_whitelist", Array{Value("fr")}); },
+      {"other country", {{"locale_whitelist", Array{Value("fr")}}},
        "HTTPSPostBackend(updateBackendState): (GB) isn't in country code list"},
-      {"device whitelist", [](Dictionary& c) { c.set("device_whitelist", Array{Value("Other")}); },
+      {"device whitelist", {{"device_whitelist", Array{Value("Other")}}},
        "HTTPSPostBackend(updateBackendState): (TestFamily) isn't in device whitelist"},
-      {"device blacklist", [](Dictionary& c) { c.set("device_blacklist", Array{Value("board9")}); },
+      {"device blacklist", {{"device_blacklist", Array{Value("board9")}}},
        "HTTPSPostBackend(updateBackendState): (Board9,1) is in device blacklist"},
-      {"no filters", [](Dictionary& c) { c.erase("filters"); },
-       "HTTPSPostBackend(updateBackendState): filters are required."},
-      {"no threshold", [](Dictionary& c) { c.erase("sampling_threshold"); }, nullptr},
+      {"no filters", {{"filters", nullptr}}, "HTTPSPostBackend(updateBackendState): filters are required."},
+      {"no threshold", {{"sampling_threshold", nullptr}}, nullptr},
   };
   for (const auto& c : cases) {
     logs.clear();
-    auto client = enablingClient("https://x/");
-    c.change(client);
-    auto b = backend(profileWith({client}));
+    auto b = immediate("https://x/", c.change);
     EXPECT_EQ(b->state(), kBackendStateDisabled) << c.name;
     if (c.line) {
       EXPECT_TRUE(logs.contains(c.line)) << c.name;
@@ -359,21 +354,15 @@ class OverrideSamplingTest : public HTTPSBackendTest, public ::testing::WithPara
 
 TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
   const OverrideRow& row = GetParam();
-  auto client = enablingClient(server.url("/post"));
-  client.erase("sampling_threshold");
-  if (row.threshold) {
-    client.set("sampling_threshold", *row.threshold);
-  }
+  Dictionary changes{{"sampling_threshold", row.threshold ? Value(*row.threshold) : Value()},
+                     {"override_sampling", row.override ? Value(*row.override) : Value()}};
   if (row.perCountryGB) {
     // Another country's entry first: only the device's own applies.
     const Value gb(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", *row.perCountryGB}});
-    client.set("per_country_sampling_thresholds",
-               Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}), gb});
+    changes.set("per_country_sampling_thresholds",
+                Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}), gb});
   }
-  if (row.override) {
-    client.set("override_sampling", *row.override);
-  }
-  auto b = backend(profileWith({client}));
+  auto b = immediate(server.url("/post"), changes);
   b->setSamplingFactor(row.factor);
   b->updateState();
   EXPECT_EQ(b->state(), row.state);
