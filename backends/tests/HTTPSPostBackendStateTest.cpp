@@ -259,16 +259,26 @@ TEST_F(HTTPSStateTest, WrongTypesInEveryProfileKeyAreLoggedAndNeverCrash) {
   EXPECT_FALSE(HTTPSPostBackend::initWithName("httpsPost", profileWith({}), std::nullopt));
 }
 
-TEST_F(HTTPSStateTest, NegativeAndStringThresholdsKeepTheBackendWorking) {
-  auto b = batching(server.url("/post"), {{"event_threshold", -3}});
-  ASSERT_EQ(b->eventThreshold(), -3);
-  EXPECT_TRUE(logs.contains("resetBackendStateWithClient: event_threshold -3 is negative"));
-  // Each batched event flushes what came before it.
-  b->sendMessage(Value(Dictionary{{"n", 1}}), at(1001), 1, 1, 0);
-  b->sendMessage(Value(Dictionary{{"n", 2}}), at(1002), 1, 1, 0);
-  ASSERT_TRUE(server.waitForRequests(1));
-  EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 1u);
-  EXPECT_EQ(b->batchedEventCount(), 1u);
+// A threshold below zero, or a number written as a string (logged and read
+// as absent, 0), makes each batched event flush what came before it.
+TEST_F(HTTPSStateTest, NegativeAndStringThresholdsFlushBeforeEachBatchedEvent) {
+  const std::tuple<Value, std::int32_t, const char*> rows[] = {
+      {Value(-3), -3, "resetBackendStateWithClient: event_threshold -3 is negative"},
+      {Value("10"), 0, "\"event_threshold\" holds a string, not a number; ignored"}};
+  for (const auto& [value, threshold, line] : rows) {
+    SCOPED_TRACE(line);
+    const std::size_t before = server.requestCount();
+    auto b = batching(server.url("/post"), {{"event_threshold", value}});
+    ASSERT_EQ(b->eventThreshold(), threshold);
+    EXPECT_TRUE(logs.contains(line));
+    b->sendMessage(clientEvent(1), at(1001), 1, 1, 0);
+    b->sendMessage(clientEvent(2), at(1002), 1, 1, 0);
+    ASSERT_TRUE(server.waitForRequests(before + 1));
+    const auto events = envelopeOf(server.requests()[before])["events"];
+    ASSERT_EQ(events.size(), 1u);
+    EXPECT_EQ(events[0]["n"], 1);
+    EXPECT_EQ(b->batchedEventCount(), 1u);
+  }
 }
 
 TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndUserInfo) {
