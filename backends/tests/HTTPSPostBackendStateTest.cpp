@@ -76,10 +76,6 @@ TEST_F(HTTPSRecordTest, SessionIdentifierFormDependsOnComponentTypeAndInternalFl
 
   b->setSelfVersion("2.5.3");
   EXPECT_EQ(b->newEventDictfromPayload(Value(Dictionary{}), at(1001), 1, 1, 1).get("_reportVers"), Value("2.5.3"));
-  // A non-finite event time becomes -1.
-  b->setStartTimestamp(timeval{std::numeric_limits<time_t>::max(), 0});
-  const auto record = b->newEventDictfromPayload(Value(Dictionary{}), at(1), 1, 1, 1);
-  EXPECT_TRUE(std::isfinite(record.get("_clientTS").doubleValue()));
 }
 
 // What the batch writer keeps, escapes and drops, and the envelope's key
