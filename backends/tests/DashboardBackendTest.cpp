@@ -175,7 +175,6 @@ TEST_F(DashboardBackendTest, AddressBackendSetsTheReliableAndNotFromProfileFlags
 TEST_F(DashboardBackendTest, ProfileWithoutReliableSendsOnceAndNeverBinds) {
   server.setPolicy([](const auto&, std::size_t) { return UdpTestServer::Decision{.acknowledge = true}; });
   auto b = backend();
-  EXPECT_FALSE(b->reliableUDP());
   EXPECT_EQ(b->boundPort(), 0);
   EXPECT_FALSE(b->hasReadSource());
   send(*b, Value(Dictionary{}), at(1, 0), 1, 2, 7);
