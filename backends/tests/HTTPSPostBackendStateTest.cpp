@@ -76,10 +76,6 @@ TEST_F(HTTPSRecordTest, SessionIdentifierFormDependsOnComponentTypeAndInternalFl
 
   b->setSelfVersion("2.5.3");
   EXPECT_EQ(b->newEventDictfromPayload(Value(Dictionary{}), at(1001), 1, 1, 1).get("_reportVers"), Value("2.5.3"));
-  // A non-finite event time becomes -1.
-  b->setStartTimestamp(timeval{std::numeric_limits<time_t>::max(), 0});
-  const auto record = b->newEventDictfromPayload(Value(Dictionary{}), at(1), 1, 1, 1);
-  EXPECT_TRUE(std::isfinite(record.get("_clientTS").doubleValue()));
 }
 
 // What the batch writer keeps, escapes and drops, and the envelope's key
@@ -123,9 +119,7 @@ TEST_F(HTTPSRecordTest, EnvelopeWithoutClientIdentifierHoldsOnlyPostTime) {
 }
 
 TEST_F(HTTPSRecordTest, PrintableCopyOnlyWhenConsentIsRespectedOrLoggingIsForced) {
-  auto client = enablingClient(server.url("/post"));
-  client.erase("override_dnu");
-  auto b = backend(profileWith({client}));
+  auto b = immediate(server.url("/post"), {{"override_dnu", nullptr}});
   ASSERT_EQ(b->state(), kBackendStateEnabled);
   ASSERT_EQ(b->dnuType(), 0);
   std::optional<std::string> pretty;
@@ -165,34 +159,28 @@ TEST_F(HTTPSStateTest, FrameworkVersionGateComparesMajorMiddleMinor) {
 TEST_F(HTTPSStateTest, EachRefusalDisablesWithItsOwnLine) {
   struct Case {
     const char* name;
-    std::function<void(Dictionary&)> change;
+    Dictionary change;
     const char* line;
   };
   Defaults(kConsentDefaultsDomain).setObject(kConsentDefaultsKey, Value(false));
-  const std::vector<Case> cases = {
-      {"no consent", [](Dictionary& c) { c.erase("override_dnu"); },
+  const Case cases[] = {
+      {"no consent", {{"override_dnu", nullptr}},
        "HTTPSPostBackend(updateBackendState): reporting disabled by DNU: 0."},
-      {"no locale list", [](Dictionary& c) { c.erase("locale_whitelist"); },
+      {"no locale list", {{"locale_whitelist", nullptr}},
        "HTTPSPostBackend(updateBackendState): (GB) isn't in country code list"},
-      {"other country", [](Dictionary& c) { c.set("locale_whitelist", Array{Value("fr")}); },
+      {"other country", {{"locale_whitelist", Array{Value("fr")}}},
        "HTTPSPostBackend(updateBackendState): (GB) isn't in country code list"},
-      {"device whitelist", [](Dictionary& c) { c.set("device_whitelist", Array{Value("Other")}); },
+      {"device whitelist", {{"device_whitelist", Array{Value("Other")}}},
        "HTTPSPostBackend(updateBackendState): (TestFamily) isn't in device whitelist"},
-      {"device blacklist", [](Dictionary& c) { c.set("device_blacklist", Array{Value("board9")}); },
+      {"device blacklist", {{"device_blacklist", Array{Value("board9")}}},
        "HTTPSPostBackend(updateBackendState): (Board9,1) is in device blacklist"},
-      {"no filters", [](Dictionary& c) { c.erase("filters"); },
-       "HTTPSPostBackend(updateBackendState): filters are required."},
-      {"no threshold", [](Dictionary& c) { c.erase("sampling_threshold"); }, nullptr},
+      {"no filters", {{"filters", nullptr}}, "HTTPSPostBackend(updateBackendState): filters are required."},
   };
   for (const auto& c : cases) {
     logs.clear();
-    auto client = enablingClient("https://x/");
-    c.change(client);
-    auto b = backend(profileWith({client}));
+    auto b = immediate("https://x/", c.change);
     EXPECT_EQ(b->state(), kBackendStateDisabled) << c.name;
-    if (c.line) {
-      EXPECT_TRUE(logs.contains(c.line)) << c.name;
-    }
+    EXPECT_TRUE(logs.contains(c.line)) << c.name;
   }
 }
 
@@ -267,16 +255,26 @@ TEST_F(HTTPSStateTest, WrongTypesInEveryProfileKeyAreLoggedAndNeverCrash) {
   EXPECT_FALSE(HTTPSPostBackend::initWithName("httpsPost", profileWith({}), std::nullopt));
 }
 
-TEST_F(HTTPSStateTest, NegativeAndStringThresholdsKeepTheBackendWorking) {
-  auto b = batching(server.url("/post"), {{"event_threshold", -3}});
-  ASSERT_EQ(b->eventThreshold(), -3);
-  EXPECT_TRUE(logs.contains("resetBackendStateWithClient: event_threshold -3 is negative"));
-  // Each batched event flushes what came before it.
-  b->sendMessage(Value(Dictionary{{"n", 1}}), at(1001), 1, 1, 0);
-  b->sendMessage(Value(Dictionary{{"n", 2}}), at(1002), 1, 1, 0);
-  ASSERT_TRUE(server.waitForRequests(1));
-  EXPECT_EQ(envelopeOf(server.requests()[0])["events"].size(), 1u);
-  EXPECT_EQ(b->batchedEventCount(), 1u);
+// A threshold below zero, or a number written as a string (logged and read
+// as absent, 0), makes each batched event flush what came before it.
+TEST_F(HTTPSStateTest, NegativeAndStringThresholdsFlushBeforeEachBatchedEvent) {
+  const std::tuple<Value, std::int32_t, const char*> rows[] = {
+      {Value(-3), -3, "resetBackendStateWithClient: event_threshold -3 is negative"},
+      {Value("10"), 0, "\"event_threshold\" holds a string, not a number; ignored"}};
+  for (const auto& [value, threshold, line] : rows) {
+    SCOPED_TRACE(line);
+    const std::size_t before = server.requestCount();
+    auto b = batching(server.url("/post"), {{"event_threshold", value}});
+    ASSERT_EQ(b->eventThreshold(), threshold);
+    EXPECT_TRUE(logs.contains(line));
+    b->sendMessage(clientEvent(1), at(1001), 1, 1, 0);
+    b->sendMessage(clientEvent(2), at(1002), 1, 1, 0);
+    ASSERT_TRUE(server.waitForRequests(before + 1));
+    const auto events = envelopeOf(server.requests()[before])["events"];
+    ASSERT_EQ(events.size(), 1u);
+    EXPECT_EQ(events[0]["n"], 1);
+    EXPECT_EQ(b->batchedEventCount(), 1u);
+  }
 }
 
 TEST_F(HTTPSStateTest, FiltersRemoveOrHashTopLevelEntriesOfRecordsSharedDataAndUserInfo) {
@@ -359,21 +357,15 @@ class OverrideSamplingTest : public HTTPSBackendTest, public ::testing::WithPara
 
 TEST_P(OverrideSamplingTest, ReportsTheOverrideOnlyWhenItDecided) {
   const OverrideRow& row = GetParam();
-  auto client = enablingClient(server.url("/post"));
-  client.erase("sampling_threshold");
-  if (row.threshold) {
-    client.set("sampling_threshold", *row.threshold);
-  }
+  Dictionary changes{{"sampling_threshold", row.threshold ? Value(*row.threshold) : Value()},
+                     {"override_sampling", row.override ? Value(*row.override) : Value()}};
   if (row.perCountryGB) {
     // Another country's entry first: only the device's own applies.
     const Value gb(Dictionary{{"country", Array{Value("FR"), Value("GB")}}, {"threshold", *row.perCountryGB}});
-    client.set("per_country_sampling_thresholds",
-               Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}), gb});
+    changes.set("per_country_sampling_thresholds",
+                Array{Value(Dictionary{{"country", Array{Value("US")}}, {"threshold", 0.0}}), gb});
   }
-  if (row.override) {
-    client.set("override_sampling", *row.override);
-  }
-  auto b = backend(profileWith({client}));
+  auto b = immediate(server.url("/post"), changes);
   b->setSamplingFactor(row.factor);
   b->updateState();
   EXPECT_EQ(b->state(), row.state);

@@ -113,7 +113,7 @@ inline Value userInfo(const std::string& client = "demo", const std::string& ser
 }
 
 // One client entry that enables everything for `demo`/`cli` in GB, with
-// `changes` set over it.
+// `changes` set over it (a nil change removes the key).
 inline Dictionary enablingClient(const std::string& postURL, const Dictionary& changes = {}) {
   Dictionary client{{"client", "demo"},
                     {"service", "cli"},
@@ -124,7 +124,11 @@ inline Dictionary enablingClient(const std::string& postURL, const Dictionary& c
                     {"event_threshold", 49},
                     {"post_url", postURL}};
   for (const auto& [key, value] : changes) {
-    client.set(key, value);
+    if (value.isNil()) {
+      client.erase(key);
+    } else {
+      client.set(key, value);
+    }
   }
   return client;
 }
