@@ -70,12 +70,13 @@ class StorebagCacheTest : public ::testing::Test {
   StorebagCache cache_;
 };
 
-TEST_F(StorebagCacheTest, FailedFetchIsNotRetriedWithin900Seconds) {
-  results_ = {FetchResult{}, FetchResult{section("second"), 600, "2.0"}};
-
+// (That the failure line ends with the fetch's cause is the end-to-end start test's.)
+TEST_F(StorebagCacheTest, FailedFetchIsNotRetriedWithin900SecondsAndItsCauseIsNotRepeatedForTheNextOne) {
+  results_ = {FetchResult{}, FetchResult{}, FetchResult{section("third"), 600, "2.0"}};
+  cause_ = "HTTP status 404 from https://bags.example/ambrel?version=8.0";
   EXPECT_TRUE(cache_.storebagForClientType(5, 1).isNil());
-  EXPECT_TRUE(logs_.has(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 5"));
   EXPECT_EQ(*entry("ambrel")["StorebagFetchState"].string(), "Fetch Failure");
+  cause_.clear();
 
   advance(899);
   EXPECT_TRUE(cache_.storebagForClientType(5, 2).isNil());
@@ -84,22 +85,14 @@ TEST_F(StorebagCacheTest, FailedFetchIsNotRetriedWithin900Seconds) {
                         "attempts"));
   EXPECT_EQ(fetchedTypes_.size(), 1u);
 
-  advance(1);  // 900 seconds: the wait is over
-  EXPECT_EQ(cache_.storebagForClientType(5, 3), section("second"));
-  EXPECT_EQ(fetchedTypes_.size(), 2u);
-  EXPECT_EQ(entry("ambrel"), recorded(section("second"), "2.0", "Fetch Successful", 600));
-}
-
-// (That the failure line ends with the fetch's cause is the end-to-end start test's.)
-TEST_F(StorebagCacheTest, TheCauseOfAFailureIsNotRepeatedForTheNextOne) {
-  results_ = {FetchResult{}, FetchResult{}};
-  cause_ = "HTTP status 404 from https://bags.example/ambrel?version=8.0";
-  EXPECT_TRUE(cache_.storebagForClientType(5, 1).isNil());
   logs_.clear();
-  cause_.clear();
-  advance(900);
-  EXPECT_TRUE(cache_.storebagForClientType(5, 2).isNil());
+  advance(1);  // 900 seconds: the wait is over; the second failure has no cause of its own
+  EXPECT_TRUE(cache_.storebagForClientType(5, 3).isNil());
   EXPECT_TRUE(logs_.has(Level::Error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 5"));
+  advance(900);  // and is waited for in turn
+  EXPECT_EQ(cache_.storebagForClientType(5, 4), section("third"));
+  EXPECT_EQ(fetchedTypes_.size(), 3u);
+  EXPECT_EQ(entry("ambrel"), recorded(section("third"), "2.0", "Fetch Successful", 600));
 }
 
 TEST_F(StorebagCacheTest, DropForgetsEntriesAndTheWaitAfterAFailure) {
@@ -174,31 +167,24 @@ TEST_F(StorebagCacheTest, UnchangedStorebagKeepsOlderDataAndCountsAsSuccess) {
   EXPECT_EQ(fetchedTypes_.size(), 2u);
 }
 
-TEST_F(StorebagCacheTest, NewerDiskCacheForcesFetchWithinMaxAge) {
-  results_ = {FetchResult{section("a"), 3600, "1"}, FetchResult{section("b"), 3600, "2"}};
-  cache_.storebagForClientType(5, 1);
-  const Date fetched = now_;
-  advance(10);
-  diskDates_["ambrel"] = fetched;  // same second as the fetch: not newer
-  EXPECT_EQ(cache_.storebagForClientType(5, 2), section("a"));
-  EXPECT_EQ(fetchedTypes_.size(), 1u);
-
-  diskDates_["ambrel"] = Date{fetched.secondsSince1970 + 5};
-  EXPECT_EQ(cache_.storebagForClientType(5, 3), section("b"));
-  EXPECT_EQ(fetchedTypes_.size(), 2u);
-  EXPECT_TRUE(logs_.has(Level::Default,
-                        "storebagForSession: Override maxAge as disk cache for storebag 'ambrel' was updated: "
-                        "modification time '2023-11-14 22:13:25 +0000' is greater than last fetch time "
-                        "'2023-11-14 22:13:20 +0000"));
-}
-
-TEST_F(StorebagCacheTest, NewerDiskCacheOverridesTheWaitAfterAFailure) {
-  results_ = {FetchResult{}, FetchResult{section("a"), 60, "1"}};
+TEST_F(StorebagCacheTest, NewerDiskCacheForcesAFetchWithinTheWaitAfterAFailureAndWithinTheMaxAge) {
+  results_ = {FetchResult{}, FetchResult{section("a"), 3600, "1"}, FetchResult{section("b"), 3600, "2"}};
   cache_.storebagForClientType(5, 1);
   advance(30);
   diskDates_["ambrel"] = now_;
   EXPECT_EQ(cache_.storebagForClientType(5, 2), section("a"));
+  const Date fetched = now_;
+  advance(10);  // the disk cache dated the fetch's own second: not newer
+  EXPECT_EQ(cache_.storebagForClientType(5, 3), section("a"));
   EXPECT_EQ(fetchedTypes_.size(), 2u);
+
+  diskDates_["ambrel"] = Date{fetched.secondsSince1970 + 5};
+  EXPECT_EQ(cache_.storebagForClientType(5, 4), section("b"));
+  EXPECT_EQ(fetchedTypes_.size(), 3u);
+  EXPECT_TRUE(logs_.has(Level::Default,
+                        "storebagForSession: Override maxAge as disk cache for storebag 'ambrel' was updated: "
+                        "modification time '2023-11-14 22:13:55 +0000' is greater than last fetch time "
+                        "'2023-11-14 22:13:50 +0000"));
 }
 
 TEST_F(StorebagCacheTest, ClientTypeWithoutStorebagIsRejectedWithoutFetch) {

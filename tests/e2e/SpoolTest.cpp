@@ -358,9 +358,7 @@ TEST_P(AccountingFloodTest, EveryAcceptedEventIsDeliveredSpooledOrDroppedWithARe
   EXPECT_EQ(unaccounted(snapshot), 0) << counts;
   EXPECT_EQ(get(BackendCount::inBatch) + get(BackendCount::inFlight) + get(BackendCount::inSpool), 0u) << counts;
   // The collector took what was counted delivered.
-  for (int i = 0; i < 100 && reader->recordsTaken() < get(BackendCount::delivered); ++i) {
-    std::this_thread::sleep_for(100ms);
-  }
+  reader->waitForRecords(get(BackendCount::delivered), 10s);
   EXPECT_EQ(reader->recordsTaken(), get(BackendCount::delivered)) << counts;
   if (spool) {
     // What found no post slot or no answer waited in the spool.
