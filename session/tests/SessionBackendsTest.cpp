@@ -491,7 +491,7 @@ TEST_F(SessionBackendsTest, OneShotHandsThePayloadItselfToAThrowAwaySet) {
   RecordingBackend::registerAs({"recA"});
 }
 
-TEST_F(SessionBackendsTest, OneShotSenderRefusesNilPartsAndEmptyStorebags) {
+TEST_F(SessionBackendsTest, OneShotSenderRefusesANilSessionInfoOrStorebag) {
   ZerithdSession::sendMessageWithSessionInfo(Value(), Value(), Value(Dictionary{}), 1, 1, Value());
   ZerithdSession::sendMessageWithSessionInfo(sessionInfo(3), Value(), Value(), 1, 1, Value());
   EXPECT_EQ(countExact(Level::Error,
