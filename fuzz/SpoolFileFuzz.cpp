@@ -24,15 +24,23 @@
 
 namespace {
 
+// One folder per process, removed when the process exits (a crash leaves it
+// next to the input that made it). The path is never destroyed, so that it
+// outlives the exit handler that removes the folder.
 const std::filesystem::path& scratchFolder() {
-  static const std::filesystem::path folder = [] {
+  static const std::filesystem::path* const folder = [] {
     std::string tmpl = (std::filesystem::temp_directory_path() / "zerith-spool-fuzz-XXXXXX").string();
     if (!::mkdtemp(tmpl.data())) {
       std::abort();
     }
-    return std::filesystem::path(tmpl);
+    return new std::filesystem::path(tmpl);
   }();
-  return folder;
+  static const int removedAtExit = std::atexit([] {
+    std::error_code ec;
+    std::filesystem::remove_all(*folder, ec);
+  });
+  (void)removedAtExit;
+  return *folder;
 }
 
 }  // namespace

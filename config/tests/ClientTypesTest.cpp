@@ -91,13 +91,18 @@ void writeReleaseType(const test::TempRoot& root, const char* releaseType) {
 TEST(InternalBuildDeathTest, OnlyTheExactTextInternalCountsAndTheFlagIsKeptWhenTheDeviceFileChanges) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   for (const auto& [releaseType, internal] : {std::pair{"Internal", true}, std::pair{"internal", false}}) {
+    // The root goes before the exit, which unwinds nothing.
     EXPECT_EXIT(
         {
-          test::TempRoot root;
-          writeReleaseType(root, releaseType);
-          const bool resolved = userDefaultsEnvironment() == (internal ? kEnvironmentInternal : kEnvironmentSeed);
-          writeReleaseType(root, internal ? "Customer" : "Internal");
-          std::exit(resolved && isInternalBuild() == internal ? 0 : 1);
+          bool passed = false;
+          {
+            test::TempRoot root;
+            writeReleaseType(root, releaseType);
+            const bool resolved = userDefaultsEnvironment() == (internal ? kEnvironmentInternal : kEnvironmentSeed);
+            writeReleaseType(root, internal ? "Customer" : "Internal");
+            passed = resolved && isInternalBuild() == internal;
+          }
+          std::exit(passed ? 0 : 1);
         },
         ::testing::ExitedWithCode(0), "")
         << releaseType;
