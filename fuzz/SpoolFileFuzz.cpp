@@ -25,8 +25,8 @@
 namespace {
 
 // One folder per process, removed when the process exits (a crash leaves it
-// next to the input that made it). The path is never destroyed, so that it
-// outlives the exit handler that removes the folder.
+// behind, with the spool files it was reading). The path is never destroyed,
+// so that it outlives the exit handler that removes the folder.
 const std::filesystem::path& scratchFolder() {
   static const std::filesystem::path* const folder = [] {
     std::string tmpl = (std::filesystem::temp_directory_path() / "zerith-spool-fuzz-XXXXXX").string();
