@@ -11,36 +11,9 @@
 
 namespace zerith::file {
 
-std::optional<Data> readAll(const std::filesystem::path& path, std::size_t limit) {
-  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (!fd) {
-    return std::nullopt;
-  }
-  struct stat st {};
-  if (::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) || static_cast<std::uint64_t>(st.st_size) > limit) {
-    return std::nullopt;
-  }
-  Data out;
-  out.reserve(static_cast<std::size_t>(st.st_size));
-  std::uint8_t buf[65536];
-  for (;;) {
-    const ssize_t n = ::read(fd.get(), buf, sizeof buf);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return std::nullopt;
-    }
-    if (n == 0) break;
-    if (out.size() + static_cast<std::size_t>(n) > limit) {
-      return std::nullopt;
-    }
-    out.insert(out.end(), buf, buf + n);
-  }
-  return out;
-}
-
-RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t limit) {
+RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t limit, Links links) {
   RegularFileRead result;
-  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | (links == Links::followed ? 0 : O_NOFOLLOW)));
   if (!fd || ::fstat(fd.get(), &result.status) != 0) {
     result.error = errno;
     result.why = errno == ELOOP ? "a symbolic link, which is not followed" : std::strerror(errno);
@@ -55,10 +28,14 @@ RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t l
     result.why = fmt::format("{} bytes, more than the {} read", size, limit);
     return result;
   }
-  Data bytes(static_cast<std::size_t>(size));
-  std::size_t got = 0;
-  while (got < bytes.size()) {
-    const ssize_t n = ::read(fd.get(), bytes.data() + got, bytes.size() - got);
+  // Up to the end, not the size seen: files of /proc and /sys give more
+  // than their size says (or less), and one that grows past the limit is
+  // refused.
+  Data bytes;
+  bytes.reserve(static_cast<std::size_t>(size));
+  std::uint8_t buf[65536];
+  for (;;) {
+    const ssize_t n = ::read(fd.get(), buf, sizeof buf);
     if (n < 0 && errno == EINTR) {
       continue;
     }
@@ -68,13 +45,20 @@ RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t l
       return result;
     }
     if (n == 0) {
-      break;  // shorter than it was: what is there
+      break;
     }
-    got += static_cast<std::size_t>(n);
+    if (bytes.size() + static_cast<std::size_t>(n) > limit) {
+      result.why = fmt::format("more than the {} bytes read", limit);
+      return result;
+    }
+    bytes.insert(bytes.end(), buf, buf + n);
   }
-  bytes.resize(got);
   result.bytes = std::move(bytes);
   return result;
+}
+
+std::optional<Data> readAll(const std::filesystem::path& path, std::size_t limit) {
+  return readRegularFile(path, limit, Links::followed).bytes;
 }
 
 bool writeAtomically(const std::filesystem::path& path, std::span<const std::uint8_t> bytes,

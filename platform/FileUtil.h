@@ -48,12 +48,12 @@ class UniqueFd {
   int fd_ = -1;
 };
 
-// The whole file, or nullopt when it cannot be read or is larger than `limit`.
-std::optional<Data> readAll(const std::filesystem::path& path, std::size_t limit);
+// Whether the last part of a path may be a symbolic link.
+enum class Links { followed, notFollowed };
 
-// A file of a folder that another user may write (the daemon's spool and
-// caches, read by the operator's tools): no symbolic link followed, no FIFO
-// waited on, a regular file of at most `limit` bytes. `bytes` when it was
+// A regular file of at most `limit` bytes, no FIFO waited on. A file of a
+// folder that another user may write (the daemon's spool and caches, read by
+// the operator's tools) is read with links not followed. `bytes` when it was
 // read; otherwise `error` (an errno; 0 for a file that is not regular or too
 // large) and `why`, for a person. `status` is the file's when it was opened.
 struct RegularFileRead {
@@ -62,7 +62,12 @@ struct RegularFileRead {
   std::string why;
   struct stat status {};
 };
-RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t limit);
+RegularFileRead readRegularFile(const std::filesystem::path& path, std::size_t limit,
+                                Links links = Links::notFollowed);
+
+// The whole regular file, links followed, or nullopt when it cannot be read
+// or is larger than `limit`.
+std::optional<Data> readAll(const std::filesystem::path& path, std::size_t limit);
 
 // Temporary file in the same folder, fsync, rename over `path`, fsync the
 // folder. The temporary file is removed on failure.
