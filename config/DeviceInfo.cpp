@@ -13,6 +13,8 @@
 #include <mutex>
 #include <string>
 
+#include <fmt/format.h>
+
 #include "platform/Crypto.h"
 #include "platform/Defaults.h"
 #include "platform/FileUtil.h"
@@ -349,6 +351,23 @@ long timeZoneOffsetSeconds() {
 
 bool diagnosticsSubmissionAllowed() {
   return Defaults(kConsentDefaultsDomain).objectForKey(kConsentDefaultsKey).boolValue();
+}
+
+std::optional<std::string> deviceFileProblem() {
+  const fs::path path = paths::deviceFile();
+  std::error_code ec;
+  if (!fs::exists(path, ec)) {
+    return std::nullopt;
+  }
+  const file::RegularFileRead read = file::readRegularFile(path, kDeviceFileLimits.maxBytes, file::Links::followed);
+  std::string why = read.why;
+  if (!read.bytes) {
+    return fmt::format("the device file {} cannot be read: {}", path.string(), why);
+  }
+  if (!device::parseDeviceFile(*read.bytes, &why)) {
+    return fmt::format("the device file {} is not used: {}", path.string(), why);
+  }
+  return std::nullopt;
 }
 
 namespace device {

@@ -79,6 +79,10 @@ static_assert(kConsentDomain == kConsentDefaultsDomain);
 inline constexpr std::string_view kConsentDefaultsKey = defaultsSetting("DiagnosticsSubmissionAllowed", kConsentDomain).key;
 bool diagnosticsSubmissionAllowed();
 
+// What keeps the device file from being used, read as the facts read it
+// (`zerithd --check`); nullopt when there is none or it is used.
+std::optional<std::string> deviceFileProblem();
+
 // The parsers behind the facts, for tests and the fuzz target.
 namespace device {
 

@@ -38,7 +38,6 @@ extern "C" void __gcov_dump(void);
 #include "ipc/Listener.h"
 #include "platform/DefaultsKeys.h"
 #include "platform/Executors.h"
-#include "platform/FileUtil.h"
 #include "platform/Log.h"
 #include "platform/ThreadPools.h"
 #include "platform/Paths.h"
@@ -242,15 +241,8 @@ int ZerithdDaemon::check(std::ostream& out) const {
   for (const std::string& problem : ipc::EntitlementPolicy().problems()) {
     problems.push_back("entitlements policy: " + problem);
   }
-  std::error_code ec;
-  if (std::filesystem::exists(paths::deviceFile(), ec)) {
-    const file::RegularFileRead read = file::readRegularFile(paths::deviceFile(), 256u << 10);
-    std::string why = read.why;
-    if (read.bytes && !device::parseDeviceFile(*read.bytes, &why)) {
-      problems.push_back(fmt::format("the device file {} is not used: {}", paths::deviceFile().string(), why));
-    } else if (!read.bytes) {
-      problems.push_back(fmt::format("the device file {} cannot be read: {}", paths::deviceFile().string(), why));
-    }
+  if (auto problem = deviceFileProblem()) {
+    problems.push_back(std::move(*problem));
   }
   if (options_.caFile && !URLSession::setExtraCAFile(options_.caFile->string())) {
     problems.push_back(fmt::format("no CA certificate can be loaded from {}", options_.caFile->string()));

@@ -88,7 +88,10 @@ TEST_F(E2eTest, CheckNamesWhatTheDaemonWouldFindWrongWithoutStarting) {
 
   (void)signedStorebag(Value(Dictionary{}));  // installs the public key
   fs::remove(root / "/etc/zerithd/entitlements.d/10-broken.plist");
+  // A device file that is a link is followed, as the facts follow it.
+  root.write("/etc/zerithd/board.plist", plist::encodeXml(Value(Dictionary{{"ProductType", "Board9,1"}})));
   fs::remove(root / "/etc/zerithd/device.plist");
+  fs::create_symlink(root / "/etc/zerithd/board.plist", root / "/etc/zerithd/device.plist");
   Defaults("com.velmar.zerith").removeObject("uploadsAtOnce");
   const CommandResult clean = check();
   EXPECT_EQ(clean.status, 0);
